@@ -1,0 +1,47 @@
+# Compiler settings shared by every target, and the helpers that make them.
+
+add_library(quarn_options INTERFACE)
+target_compile_options(quarn_options INTERFACE -Wall -Wextra -Wpedantic)
+if(QUARN_WERROR)
+  target_compile_options(quarn_options INTERFACE -Werror)
+endif()
+if(QUARN_SANITIZE)
+  target_compile_options(quarn_options INTERFACE -fsanitize=${QUARN_SANITIZE} -fno-omit-frame-pointer
+                                                 -fno-sanitize-recover=all)
+  target_link_options(quarn_options INTERFACE -fsanitize=${QUARN_SANITIZE})
+else()
+  target_compile_definitions(quarn_options INTERFACE $<$<CONFIG:Release>:_FORTIFY_SOURCE=2>)
+  target_compile_options(quarn_options INTERFACE -fstack-protector-strong)
+  target_link_options(quarn_options INTERFACE -Wl,-z,relro,-z,now -Wl,--as-needed)
+endif()
+
+# One unit of the daemon: a static library of its sources.
+function(quarn_unit name)
+  cmake_parse_arguments(ARG "" "" "SOURCES;LIBS" ${ARGN})
+  add_library(${name} STATIC ${ARG_SOURCES})
+  target_include_directories(${name} PUBLIC ${PROJECT_SOURCE_DIR}/daemon)
+  target_link_libraries(${name} PUBLIC quarn_options quarn_common ${ARG_LIBS})
+endfunction()
+
+# A program that lies in build/bin.
+function(quarn_program name)
+  cmake_parse_arguments(ARG "" "" "SOURCES;LIBS" ${ARGN})
+  add_executable(${name} ${ARG_SOURCES})
+  target_link_libraries(${name} PRIVATE quarn_options ${ARG_LIBS})
+  set_target_properties(${name} PROPERTIES RUNTIME_OUTPUT_DIRECTORY "${QUARN_BIN_DIR}")
+endfunction()
+
+# A GoogleTest program that runs on the scripted platform; every case is a test of its own.
+# TIMEOUT is that of one case, in seconds.
+function(quarn_unit_test name)
+  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;LIBS" ${ARGN})
+  add_executable(${name} ${ARG_SOURCES})
+  target_link_libraries(${name} PRIVATE quarn_options ${ARG_LIBS} quarn_test_support)
+  target_precompile_headers(${name} REUSE_FROM quarn_test_support)
+  if(NOT ARG_TIMEOUT)
+    set(ARG_TIMEOUT 60)
+  endif()
+  # One CTest entry a program: a process start per case would cost more than the cases.
+  add_test(NAME ${name} COMMAND ${name})
+  set_tests_properties(${name} PROPERTIES TIMEOUT ${ARG_TIMEOUT} LABELS unit)
+endfunction()

@@ -1,0 +1,39 @@
+/**
+ * @file quarn_d_handler.h
+ * @brief What each method does.
+ *
+ * Main thread only. Each handler returns the status that becomes the method's
+ * reply and takes ownership of @p record (a client_cb_data); outcomes follow
+ * as callbacks to the client.
+ */
+#ifndef QUARN_D_HANDLER_H
+#define QUARN_D_HANDLER_H
+
+#include <string>
+#include <vector>
+
+/** Write the automatic-backup setting. @return 0 */
+int quarnd_backup_enable(int on);
+/** The present time, milliseconds since the Unix epoch. @return 0 */
+int quarnd_get_last_backed_up_time(unsigned long long *timestamp);
+/** Fetch (client 0) or build (client 1) the application list. */
+int quarnd_get_app_list(int client, void *record);
+/** Queue a manual backup. @return 0 */
+int quarnd_manual_backup(void *record);
+/** Cancel manual backups. @return 0 */
+int quarnd_manual_backup_cancel(void *record);
+
+/** Back one package up now; waits in a nested loop. @return 0, or 1: unknown package */
+int quarnd_backup_app_data(const char *pkg_id, void *record);
+/** Restore one package now; waits in a nested loop. @return 0, or 1: unknown package */
+int quarnd_restore_app_data(const char *pkg_id, void *record);
+/** Pack one package into /tmp. @param client_uid user that shall own the archive */
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid);
+
+/** Restore mode on or off. @return 0 done, 1 bad client, 36 refused */
+int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
+                          void *record);
+/** Replace the candidate list by a JSON array of package ids. @return its length */
+int init_package_list_to_be_restored(const char *pkg_list_json);
+
+#endif

@@ -1,0 +1,26 @@
+/**
+ * @file quarn_d_lifecycle.h
+ * @brief How the process ends: terminate requests, their timer, the exit code.
+ *
+ * Main thread only.
+ */
+#ifndef QUARN_D_LIFECYCLE_H
+#define QUARN_D_LIFECYCLE_H
+
+/** Exit status of the process: 0, or -1 when a restart was requested. */
+extern int quarn_exit_code;
+
+/**
+ * Ask the process to end. Dropped while the daemon is not idle.
+ * @param delay   seconds; 0.0 ends at once, another value replaces a pending request
+ * @param restart end with -1, so that the service manager starts the daemon again
+ */
+void request_quarn_terminate(double delay, bool restart);
+
+/** Drop a pending terminate timer. */
+void cancel_quarn_terminate();
+
+/** Timer callback of a delayed request; returns 0 (do not repeat). */
+unsigned char terminate_cb(void *data);
+
+#endif

@@ -1,0 +1,215 @@
+/**
+ * @file quarn_d_utils.h
+ * @brief Files, archives, packages, the cloud session and the small platform services.
+ *
+ * Every function logs its failures and reports them by its result only.
+ * Paths are absolute. Whatever lies below a package root is reached without
+ * following a symbolic link that an application could have made.
+ */
+#ifndef QUARN_D_UTILS_H
+#define QUARN_D_UTILS_H
+
+#include <glib.h>
+#include <json-c/json.h>
+#include <sys/stat.h>
+#include <unzip.h>
+#include <zip.h>
+
+#include <cstdint>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "backup_transport.h"
+#include "platform_package_manager.h"
+#include "quarn_common.h"
+
+/* ---- file.cpp: any thread ------------------------------------------------ */
+
+/** True for a regular file; a link is neither file nor directory. */
+bool file_exist(const char *path);
+/** True for a directory. */
+bool is_directory(const char *path);
+/** True when a regular file lies anywhere below @p dir. */
+bool file_exist_in_directory(const char *dir);
+/** The negation of file_exist_in_directory(). */
+bool is_empty_directory(const char *dir);
+/** Size in bytes, -1 on failure. */
+int get_file_size(const char *path);
+/** Read a whole file; @p buffer is malloc'd, NUL-terminated and the caller's. */
+bool read_data_from_file(const char *path, char **buffer);
+/** CRC-32 (IEEE 802.3) of the content; 0 on failure. */
+std::uint32_t get_file_crc(const char *path);
+/** Remove a regular file. */
+bool delete_file(const char *path);
+/** Remove a directory with everything in it; links are refused and stay. */
+bool delete_directory_util(const char *dir);
+/** Empty a directory, and remove it too when @p remove_directory is set. */
+bool clear_directory(const char *dir, bool remove_directory);
+/** Empty a directory but for the entry whose full path is @p keep. */
+bool clear_shared_data_dir_except_temp_backup(const char *dir, const char *keep);
+/** Free bytes of the file system, those reserved for the super-user included; 0 on failure. */
+std::uint64_t get_dir_available_size(const char *path);
+/** Make the parent directory of a file, with its ancestors. */
+bool create_directory_of_file(const char *file);
+/** Replace a file's content. @return 0, 1 for empty data or path, 36 when writing failed */
+int write_string_to_file(std::string data, std::string path);
+/** Copy a regular file's content. */
+bool copy_file(const char *src, const char *dst);
+
+/* ---- file_info_table.cpp: one table, one thread -------------------------- */
+
+/** Table of the modes, owners, labels and links of one archive. */
+struct file_info_table_h {
+  json_object *root = nullptr;          /**< the document; owns everything below */
+  json_object *symbolic_list = nullptr; /**< "quarn_symbolic_info", borrowed */
+};
+
+/** Make an empty table; *@p table is null on failure. Released with release_file_info_table(). */
+void ready_file_info_table(file_info_table_h **table);
+/** Release a table; null is accepted. */
+void release_file_info_table(file_info_table_h *table);
+/** Attributes of one entry; @p label is malloc'd, null when it could not be read. */
+bool get_file_info_from_file(const char *path, const struct stat &stat, int *permission,
+                             unsigned int *uid, unsigned int *gid, char **label);
+/** Add a directory or a regular file. *@p error becomes 36 on failure, else stays. */
+void add_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
+                            const struct stat &stat, int *error);
+/** Add a symbolic link. *@p error becomes 36 on failure, else stays. */
+void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
+                                     const struct stat &stat, int *error);
+/** Write the table's JSON text and release its root. @return as write_string_to_file() */
+int save_file_info_table(file_info_table_h *table, const char *path);
+
+/* ---- path_rules.cpp: rules of the calling thread ------------------------- */
+
+extern thread_local std::vector<std::string> backup_include_list;
+extern thread_local std::vector<std::string> backup_exclude_list;
+extern thread_local bool xml_has_include_field;
+
+/** Forget the calling thread's rules: everything is backed up. */
+void reset_backup_path_info();
+/** Load a package's rules file, if it has one, in place of the thread's rules. */
+void parse_backup_path_xml(const char *pkg_id, const char *pkg_type, const char *root);
+/** Append @p path when something lies there. */
+void add_to_path_info_list(const char *path, std::vector<std::string> *list);
+/** True when @p parent ends with "/" and @p path begins with it. */
+bool is_child_file(const char *parent, const char *path);
+/** Whether the thread's rules take the file or link at @p path. */
+bool is_backup_file(const char *path);
+/** Bytes that an archive would take from @p dir; 26214401 for an unreadable directory. */
+std::uint64_t get_dir_backup_size(const char *dir, const char *pkg_id, const char *root);
+
+/* ---- zip_writer.cpp, zip_reader.cpp -------------------------------------- */
+
+/**
+ * Held while a package's data is packed, unpacked or put back, so that an
+ * archive never mixes two states. Any thread; held for the length of one
+ * archive only, never while waiting for an event.
+ */
+extern std::mutex package_data_mutex;
+
+/**
+ * Pack one package's data. Takes package_data_mutex. The rules of the calling
+ * thread apply.
+ * @param[out] error set on failure only: 31 archive not opened, 36 any entry failed
+ */
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error);
+/** Walk one directory into the archive. @return true when anything was recorded */
+bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
+                           file_info_table_h *table, int *error);
+/** Add one file's bytes as one entry. */
+bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error);
+/** Add the table's text as the last entry. */
+void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const char *pkg_id,
+                                   const char *root, int *error);
+
+/** Unpack an archive below @p destination. @return 0, 31 or 14 */
+int unzip_data(const char *pkg_id, const char *destination, const char *zip_path);
+/** Write the archive's current entry below @p destination. */
+bool extract_file_from_zip(const char *pkg_id, const char *destination, unzFile archive,
+                           const char *name);
+
+/* ---- package.cpp: any thread --------------------------------------------- */
+
+/** Packages whose installation completed since the list was last cleared. */
+extern std::vector<std::string> install_complete_pkgs;
+extern std::mutex installed_check_mutex;
+
+/** True when an id may name a file or folder: not empty, not "." or "..", no "/", no NUL. */
+bool is_safe_path_component(const std::string &text);
+/** True when the application's API version is at least @p version, compared as bytes. */
+bool app_support_api_version(const char *appid, const char *version);
+/** True when the application takes part in backup. */
+bool backup_enabled_app(const char *appid);
+/** True when the package is in install_complete_pkgs. */
+bool already_installed_package(const char *pkgid);
+/** True when the package lies on external storage. */
+bool app_data_storage_is_external(const char *pkgid);
+/** Package id and version of an application, malloc'd. @return 0 or 42 */
+int get_pkg_info(const char *appid, char **pkgid, char **version);
+/** Root path of a package, malloc'd; null on failure. */
+char *get_app_root_path(const char *pkgid);
+/** The same into a string. @return 0 or 36 */
+int get_string_app_root_path(const char *pkgid, std::string &root);
+
+/* ---- device_info.cpp: any thread ----------------------------------------- */
+
+/** Model name and serial number (IMEI), malloc'd; null where unknown. */
+void get_device_info(char **model, char **serial);
+/** Milliseconds since the Unix epoch. */
+std::int64_t _get_current_timestamp();
+
+/* ---- account.cpp: main thread -------------------------------------------- */
+
+/** True when a user is signed in. */
+bool server_util_is_account_exist();
+
+/* ---- cloud_session.cpp ---------------------------------------------------- */
+
+/**
+ * True when the transport is ready; starts it when needed and waits up to 60
+ * seconds: the main thread in a nested loop, other threads on a condition.
+ */
+bool cloud_initialized();
+/** The transport handle; null before cloud_initialized() was true. Any thread. */
+backup_trans_handle_h cloud_handler();
+
+/* ---- nested_loop.cpp: main thread ----------------------------------------- */
+
+/** Run @p loop until it is quit; quit_nested_loops() ends it as well. */
+void run_nested_loop(GMainLoop *loop);
+/** Quit every nested loop, the innermost first, and refuse further ones. */
+void quit_nested_loops();
+
+/* ---- power.cpp: any thread ------------------------------------------------ */
+
+/**
+ * Take (true) or release (false) the CPU lock. Every taker counts: the device
+ * lock is released with the last of them.
+ */
+void request_power_lock(bool lock);
+/** True when nobody holds the CPU lock and no request is about to. */
+bool is_idle_status();
+/** Tells of requests that are queued and have not taken the lock yet. Set once at start. */
+void set_pending_request_probe(bool (*probe)());
+
+/* ---- boot_cleanup.cpp: backup worker -------------------------------------- */
+
+/** Delete archives that an interrupted run left behind; once per process. */
+void boot_cleanup_backup_items();
+/** One package of that sweep. */
+bool boot_foreach_package_info_callback(package_info_h info, void *user_data);
+
+/* ---- icon.cpp: main thread ------------------------------------------------- */
+
+/** Show a package's icon, or hide it now (delay 0.0) or after @p delay seconds. */
+void appear_app_icon(const char *pkg_id, bool show, double delay);
+/** Cancel the first pending hide of a package. */
+void delete_icon_hide_delay_timer(const char *pkg_id);
+/** Drop all pending hides and their timers. */
+void init_icon_hide_delay_timer_list();
+/** Empty install_complete_pkgs. */
+void init_install_complete_pkgs_list();
+
+#endif

@@ -1,0 +1,41 @@
+/**
+ * @file safe_path.h
+ * @brief Reaching files below an application's root without following its links.
+ *
+ * A symbolic link in a path is followed only when root owns both the link and
+ * the directory it lies in, and nobody else may write that directory: such a
+ * link is the device maker's, any other could be an application's. All
+ * functions set errno on failure and log nothing. Any thread.
+ */
+#ifndef QUARN_D_UTILS_SAFE_PATH_H
+#define QUARN_D_UTILS_SAFE_PATH_H
+
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <string>
+
+#include "quarn_d_utils/handles.h"
+
+/**
+ * Open an absolute path. The last component is never followed when it is a
+ * link (ELOOP, or with O_PATH the link itself). O_CLOEXEC is added.
+ */
+UniqueFd safe_open(const char *path, int flags, mode_t mode = 0);
+
+/** The parent of @p path, as an O_PATH directory; @p name receives the last component. */
+UniqueFd safe_open_parent(const char *path, std::string *name);
+
+/** lstat() of @p path. @return 0 or -1 */
+int safe_lstat(const char *path, struct stat *status);
+
+/** Open a directory for reading; null on failure. */
+DirPtr safe_opendir(const char *path);
+
+/** Make @p path and its missing ancestors. @return 0 or -1 */
+int safe_mkdir_with_parents(const char *path, mode_t mode);
+
+/** The name by which this process's services reach what @p fd holds: "/proc/PID/fd/N". */
+std::string fd_path(int fd);
+
+#endif

@@ -1,0 +1,47 @@
+/**
+ * @file quarn_dbus_client.h
+ * @brief Calls back to clients, and published signals.
+ *
+ * Any thread: every call blocks its caller until the client has answered or
+ * the time-out has passed. Failures are logged and end in #QUARN_FAILED.
+ */
+#ifndef QUARN_DBUS_CLIENT_H
+#define QUARN_DBUS_CLIENT_H
+
+#include <gio/gio.h>
+
+#include <cstdint>
+#include <string>
+
+/**
+ * One pending client request. The dispatcher makes it; the sender of the
+ * request's last callback deletes it.
+ */
+struct client_cb_data {
+  std::uint32_t req_id = 0; /**< chosen by the client, echoed in every callback */
+  std::string sender;       /**< the client's unique bus name */
+};
+
+/** The connection that the bus-acquired callback was given; null before. */
+extern GDBusConnection *quarn_dbus_connection;
+
+/** "restore_enable_cb"; the record is deleted when @p msg is "restore_stop". */
+int quarn_dbus_restore_enable_cb(int err, const char *msg, void *record);
+/** "get_app_list_cb"; the record is deleted. */
+int quarn_dbus_get_app_list_cb(int err, const char *msg, void *record);
+/** "manual_backup_status"; the record is deleted unless @p status is 2 (in progress). */
+int quarn_dbus_manual_backup_status(int err, int status, void *record);
+/** "manual_backup_cancel_result"; the record is deleted. */
+int quarn_dbus_manual_backup_cancel_result(int err, void *record);
+/** "app_data_backup_complete"; the record is deleted. */
+int quarn_dbus_app_backup_complete(int err, const char *msg, void *record);
+/** "app_data_restore_complete"; the record is deleted. */
+int quarn_dbus_app_restore_complete(int err, const char *msg, void *record);
+
+/**
+ * Broadcast a signal with one text.
+ * @return 0, or -1 when it could not be emitted
+ */
+int quarnd_dbus_publish(const char *signal_name, const char *value);
+
+#endif
