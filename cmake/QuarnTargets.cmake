@@ -1,7 +1,8 @@
 # Compiler settings shared by every target, and the helpers that make them.
 
 add_library(quarn_options INTERFACE)
-target_compile_options(quarn_options INTERFACE -Wall -Wextra -Wpedantic)
+# -pthread everywhere: some libraries ask for it, and the precompiled header must agree.
+target_compile_options(quarn_options INTERFACE -Wall -Wextra -Wpedantic -pthread)
 if(QUARN_WERROR)
   target_compile_options(quarn_options INTERFACE -Werror)
 endif()

@@ -35,6 +35,15 @@ DirPtr safe_opendir(const char *path);
 /** Make @p path and its missing ancestors. @return 0 or -1 */
 int safe_mkdir_with_parents(const char *path, mode_t mode);
 
+/**
+ * Open a relative path below the directory @p dir: no link is followed and
+ * nothing outside is reached; ".." and absolute names fail with EINVAL.
+ */
+UniqueFd safe_open_below(int dir, const char *path, int flags, mode_t mode = 0);
+
+/** Make a relative path below @p dir, ancestors too; the directory itself (O_PATH). */
+UniqueFd safe_mkdir_below(int dir, const char *path, mode_t mode);
+
 /** The name by which this process's services reach what @p fd holds: "/proc/PID/fd/N". */
 std::string fd_path(int fd);
 

@@ -1,0 +1,221 @@
+#include "quarn_d_utils/safe_path.h"
+
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/syscall.h>
+
+#include <atomic>
+#include <cerrno>
+#include <climits>
+#include <cstring>
+#include <vector>
+
+namespace {
+
+constexpr int kMaxLinks = 40;  // the kernel's own limit
+
+std::atomic<bool> openat2_missing{false};
+
+int open_without_links(int dir, const char *path, int flags, mode_t mode, std::uint64_t resolve) {
+  struct open_how how = {};
+  how.flags = static_cast<std::uint64_t>(flags | O_NOFOLLOW | O_CLOEXEC);
+  if ((flags & O_CREAT) != 0) how.mode = mode;
+  how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | resolve;
+  return static_cast<int>(syscall(SYS_openat2, dir, path, &how, sizeof(how)));
+}
+
+/** True when the kernel, or a filter around this process, does not offer openat2(). */
+bool no_openat2(int error) {
+  if (error == ENOSYS) openat2_missing = true;
+  return error == ENOSYS || error == EPERM;
+}
+
+void push_components(std::vector<std::string> *stack, const std::string &path) {
+  std::size_t end = path.size();
+  while (end > 0) {
+    const std::size_t slash = path.rfind('/', end - 1);
+    const std::size_t begin = slash == std::string::npos ? 0 : slash + 1;
+    if (begin < end) stack->push_back(path.substr(begin, end - begin));
+    end = slash == std::string::npos ? 0 : slash;
+  }
+}
+
+/** True when nobody but root could have put the link where it is. */
+bool is_trusted_link(const struct stat &link, int dir) {
+  struct stat holder = {};
+  if (fstat(dir, &holder) != 0) return false;
+  return link.st_uid == 0 && holder.st_uid == 0 && (holder.st_mode & (S_IWGRP | S_IWOTH)) == 0;
+}
+
+UniqueFd fail(int error) {
+  errno = error;
+  return {};
+}
+
+enum class Missing { kFails, kIsMade };
+
+/** Walk to the directory @p path, following trusted links only. */
+UniqueFd walk_to_directory(const std::string &path, Missing missing, mode_t mode) {
+  UniqueFd current(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  std::vector<std::string> rest;  // the next component is the last of it
+  push_components(&rest, path);
+  int links = 0;
+  while (current && !rest.empty()) {
+    const std::string name = std::move(rest.back());
+    rest.pop_back();
+    if (name == ".") continue;
+    UniqueFd next(openat(current.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    if (!next && errno == ENOENT && missing == Missing::kIsMade) {
+      if (mkdirat(current.get(), name.c_str(), mode) != 0 && errno != EEXIST) return {};
+      next.reset(openat(current.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    }
+    if (!next) return {};
+    struct stat status = {};
+    if (fstat(next.get(), &status) != 0) return {};
+    if (S_ISLNK(status.st_mode)) {
+      if (++links > kMaxLinks || !is_trusted_link(status, current.get())) return fail(ELOOP);
+      char target[PATH_MAX];
+      const ssize_t length = readlinkat(next.get(), "", target, sizeof(target));
+      if (length < 0) return {};
+      if (static_cast<std::size_t>(length) == sizeof(target)) return fail(ENAMETOOLONG);
+      const std::string text(target, static_cast<std::size_t>(length));
+      push_components(&rest, text);
+      if (!text.empty() && text[0] == '/') {
+        current.reset(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+      }
+      continue;
+    }
+    if (!S_ISDIR(status.st_mode)) return fail(ENOTDIR);
+    current = std::move(next);
+  }
+  return current;
+}
+
+/** Split an absolute path; the name is neither empty nor "." nor "..". */
+bool split_path(const char *path, std::string *parent, std::string *name) {
+  if (path == nullptr || path[0] != '/') {
+    errno = EINVAL;
+    return false;
+  }
+  std::size_t end = std::strlen(path);
+  while (end > 1 && path[end - 1] == '/') --end;
+  std::size_t begin = end;
+  while (begin > 0 && path[begin - 1] != '/') --begin;
+  name->assign(path + begin, end - begin);
+  parent->assign(path, begin > 1 ? begin - 1 : 1);
+  if (name->empty() || *name == "." || *name == "..") {
+    errno = EINVAL;
+    return false;
+  }
+  return true;
+}
+
+bool is_plain_relative(const char *path) {
+  if (path == nullptr || path[0] == '\0' || path[0] == '/') return false;
+  std::vector<std::string> names;
+  push_components(&names, path);
+  for (const auto &name : names) {
+    if (name == "..") return false;
+  }
+  return !names.empty();
+}
+
+/** The parent of a relative path below @p dir, by one open per component. */
+UniqueFd walk_below(int dir, const char *path, Missing missing, mode_t mode, std::string *last) {
+  std::vector<std::string> rest;
+  push_components(&rest, path);
+  UniqueFd current(openat(dir, ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  while (current && !rest.empty()) {
+    const std::string name = std::move(rest.back());
+    rest.pop_back();
+    if (name == ".") continue;
+    if (rest.empty() && last != nullptr) {
+      *last = name;
+      return current;
+    }
+    const int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+    UniqueFd next(openat(current.get(), name.c_str(), flags));
+    if (!next && errno == ENOENT && missing == Missing::kIsMade) {
+      if (mkdirat(current.get(), name.c_str(), mode) != 0 && errno != EEXIST) return {};
+      next.reset(openat(current.get(), name.c_str(), flags));
+    }
+    current = std::move(next);
+  }
+  if (current && last != nullptr) return fail(EINVAL);
+  return current;
+}
+
+}  // namespace
+
+UniqueFd safe_open(const char *path, int flags, mode_t mode) {
+  if (path == nullptr || path[0] != '/') return fail(EINVAL);
+  if (!openat2_missing) {
+    UniqueFd fd(open_without_links(AT_FDCWD, path, flags, mode, 0));
+    if (fd || (errno != ELOOP && !no_openat2(errno))) return fd;
+  }
+  std::string parent;
+  std::string name;
+  if (!split_path(path, &parent, &name)) {
+    // "/" itself, or a path that ends in "." or "..": a directory in any case
+    const UniqueFd dir = walk_to_directory(path, Missing::kFails, 0);
+    if (!dir) return {};
+    return UniqueFd(openat(dir.get(), ".", flags | O_CLOEXEC, mode));
+  }
+  const UniqueFd dir = walk_to_directory(parent, Missing::kFails, 0);
+  if (!dir) return {};
+  return UniqueFd(openat(dir.get(), name.c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode));
+}
+
+UniqueFd safe_open_parent(const char *path, std::string *name) {
+  std::string parent;
+  if (!split_path(path, &parent, name)) return {};
+  if (!openat2_missing) {
+    UniqueFd fd(open_without_links(AT_FDCWD, parent.c_str(), O_PATH | O_DIRECTORY, 0, 0));
+    // ENOTDIR: the parent itself may be a link that is to be followed
+    if (fd || (errno != ELOOP && errno != ENOTDIR && !no_openat2(errno))) return fd;
+  }
+  return walk_to_directory(parent, Missing::kFails, 0);
+}
+
+int safe_lstat(const char *path, struct stat *status) {
+  const UniqueFd fd = safe_open(path, O_PATH);
+  if (!fd) return -1;
+  return fstat(fd.get(), status);
+}
+
+DirPtr safe_opendir(const char *path) {
+  UniqueFd fd = safe_open(path, O_RDONLY | O_DIRECTORY | O_NONBLOCK);
+  if (!fd) return nullptr;
+  DirPtr dir(fdopendir(fd.get()));
+  if (dir != nullptr) fd.release();
+  return dir;
+}
+
+int safe_mkdir_with_parents(const char *path, mode_t mode) {
+  if (path == nullptr || path[0] != '/') {
+    errno = EINVAL;
+    return -1;
+  }
+  return walk_to_directory(path, Missing::kIsMade, mode) ? 0 : -1;
+}
+
+UniqueFd safe_open_below(int dir, const char *path, int flags, mode_t mode) {
+  if (!is_plain_relative(path)) return fail(EINVAL);
+  if (!openat2_missing) {
+    UniqueFd fd(open_without_links(dir, path, flags, mode, RESOLVE_BENEATH));
+    if (fd || !no_openat2(errno)) return fd;
+  }
+  std::string name;
+  const UniqueFd parent = walk_below(dir, path, Missing::kFails, 0, &name);
+  if (!parent) return {};
+  return UniqueFd(openat(parent.get(), name.c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode));
+}
+
+UniqueFd safe_mkdir_below(int dir, const char *path, mode_t mode) {
+  if (!is_plain_relative(path)) return fail(EINVAL);
+  return walk_below(dir, path, Missing::kIsMade, mode, nullptr);
+}
+
+std::string fd_path(int fd) {
+  return "/proc/" + std::to_string(getpid()) + "/fd/" + std::to_string(fd);
+}
