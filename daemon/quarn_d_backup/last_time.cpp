@@ -1,0 +1,38 @@
+#include "platform_settings.h"
+#include "quarn_common.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr std::uint64_t kUnknownTime = ~std::uint64_t{0};
+constexpr double kTimeLimit = 18446744073709551616.0;  // the first that 64 bits do not hold
+
+void store_last_backup_time(std::uint64_t time) {
+  if (vconf_set_dbl(kLastTimeKey, static_cast<double>(time)) != VCONF_OK) {
+    LOGE("cannot set last backup time to vconf");
+    return;
+  }
+  LOGI("last backup time setted to %llu", static_cast<unsigned long long>(time));
+}
+
+}  // namespace
+
+void init_last_backup_time() { store_last_backup_time(0); }
+
+void set_last_backup_time() {
+  store_last_backup_time(static_cast<std::uint64_t>(_get_current_timestamp()));
+}
+
+std::uint64_t get_last_backup_time() {
+  double value = 0;
+  // written so that a stored NaN fails it as well
+  if (vconf_get_dbl(kLastTimeKey, &value) != VCONF_OK || !(value >= 0 && value < kTimeLimit)) {
+    LOGE("cannot read last backup time from vconf");
+    return kUnknownTime;
+  }
+  const auto time = static_cast<std::uint64_t>(value);
+  LOGI("last backup time is %llu", static_cast<unsigned long long>(time));
+  return time;
+}

@@ -1,0 +1,47 @@
+/**
+ * @file run_private.h
+ * @brief What the sources of the backup engine share among themselves.
+ */
+#ifndef QUARN_D_BACKUP_RUN_PRIVATE_H
+#define QUARN_D_BACKUP_RUN_PRIVATE_H
+
+#include <cstdint>
+#include <string>
+
+#include "quarn_d_backup/quarn_d_backup.h"
+
+/** A further reference, for a record that outlives its call. */
+BackupContextPtr share_backup_context(backup_context *ctx);
+
+/* ---- context.cpp ---- */
+
+/** Name of the staged list among the staged archives; no package can have it. */
+inline constexpr char kStagedListLease[] = "/app_list";
+
+/** True when @p ctx holds the right to a package's staged archive. */
+bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id);
+/** Where a package's archive is staged. */
+std::string staged_archive_path(const std::string &root_path, const std::string &pkg_id);
+/** Delete a staged file if it is there; a run and its callbacks may both come to it. */
+void delete_staged_file(const std::string &path);
+/** Make the staging directory; false when what lies there is not ours alone. */
+bool prepare_staging_directory();
+
+/* ---- progress.cpp ---- */
+
+/** Tell the sink, if there is one. */
+void report_progress(const backup_context *ctx, backup_stage stage, const char *package = "",
+                     backup_outcome outcome = backup_outcome::none, std::uint64_t size = 0,
+                     std::uint64_t limit = 0);
+
+/* ---- changes.cpp ---- */
+
+/** Load the current package's rules and test its data against space and cap. @return 0 or 34 */
+int check_current_backup_size(backup_context *ctx);
+
+/* ---- cloud.cpp ---- */
+
+/** Forget what per-application requests uploaded; a run starts to look at the packages. */
+void forget_single_uploads();
+
+#endif
