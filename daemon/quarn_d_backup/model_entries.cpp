@@ -1,0 +1,171 @@
+#include "quarn_d_backup/model_entries.h"
+
+#include <cstring>
+#include <memory>
+
+#include "quarn_d_utils/handles.h"
+
+namespace {
+
+constexpr char kModelListKey[] = "model_list";
+constexpr char kEntryPlaceholder[] = "null";
+
+using TokenerPtr = Handle<json_tokener, &json_tokener_free>;
+
+/** Steps over JSON values without recursion, however deep they are. */
+class value_scanner {
+ public:
+  explicit value_scanner(std::string_view text) : text_(text) {}
+
+  std::size_t position() const { return position_; }
+
+  void skip_space() {
+    while (position_ < text_.size() && std::strchr(" \t\r\n", text_[position_]) != nullptr) {
+      ++position_;
+    }
+  }
+
+  bool take(char c) {
+    skip_space();
+    if (position_ >= text_.size() || text_[position_] != c) return false;
+    ++position_;
+    return true;
+  }
+
+  bool at(char c) {
+    skip_space();
+    return position_ < text_.size() && text_[position_] == c;
+  }
+
+  /** One value; @p value receives its text. */
+  bool take_value(std::string_view *value) {
+    skip_space();
+    const std::size_t begin = position_;
+    std::string closing;
+    do {
+      if (position_ >= text_.size()) return false;
+      const char c = text_[position_];
+      if (c == '"') {
+        if (!skip_string()) return false;
+        continue;
+      }
+      if (c == '{' || c == '[') {
+        closing.push_back(c == '{' ? '}' : ']');
+      } else if (c == '}' || c == ']') {
+        if (closing.empty() || closing.back() != c) return false;
+        closing.pop_back();
+      } else if (closing.empty()) {
+        skip_word();
+        continue;
+      }
+      ++position_;
+    } while (!closing.empty());
+    *value = text_.substr(begin, position_ - begin);
+    return !value->empty();
+  }
+
+ private:
+  bool skip_string() {
+    for (++position_; position_ < text_.size(); ++position_) {
+      if (text_[position_] == '\\') {
+        ++position_;
+      } else if (text_[position_] == '"') {
+        ++position_;
+        return true;
+      }
+    }
+    return false;
+  }
+
+  void skip_word() {
+    const std::size_t end = text_.find_first_of(",:]}[{\" \t\r\n", position_);
+    position_ = end == std::string_view::npos ? text_.size() : end;
+  }
+
+  std::string_view text_;
+  std::size_t position_ = 0;
+};
+
+bool is_model_list_key(std::string_view key) {
+  if (key.find('\\') == std::string_view::npos) {
+    return key == std::string("\"") + kModelListKey + "\"";
+  }
+  const JsonPtr name(parse_whole_json(key, 1, nullptr));
+  return json_object_is_type(name.get(), json_type_string) != 0 &&
+         std::strcmp(json_object_get_string(name.get()), kModelListKey) == 0;
+}
+
+bool split_array(std::string_view array, std::vector<std::string_view> *elements) {
+  value_scanner scanner(array);
+  if (!scanner.take('[') || scanner.at(']')) return false;
+  do {
+    std::string_view element;
+    if (!scanner.take_value(&element)) return false;
+    elements->push_back(element);
+  } while (scanner.take(','));
+  return scanner.take(']');
+}
+
+/** The last value under the key, as a parser would have it. */
+std::string_view find_model_list(std::string_view text) {
+  value_scanner scanner(text);
+  std::string_view found;
+  if (!scanner.take('{') || scanner.at('}')) return {};
+  do {
+    std::string_view key;
+    std::string_view value;
+    if (!scanner.at('"') || !scanner.take_value(&key) || !scanner.take(':') ||
+        !scanner.take_value(&value)) {
+      return {};
+    }
+    if (is_model_list_key(key)) found = value;
+  } while (scanner.take(','));
+  return found;
+}
+
+}  // namespace
+
+model_list_text take_model_list_apart(std::string_view text) {
+  model_list_text result;
+  const std::string_view array = find_model_list(text);
+  if (array.empty() || !split_array(array, &result.entries)) {
+    result.entries.clear();
+    result.frame = text;
+    return result;
+  }
+  const char *copied = text.data();
+  for (const std::string_view &entry : result.entries) {
+    result.frame.append(copied, entry.data());
+    result.frame += kEntryPlaceholder;
+    copied = entry.data() + entry.size();
+  }
+  result.frame.append(copied, text.data() + text.size());
+  return result;
+}
+
+json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep) {
+  const TokenerPtr tokener(json_tokener_new_ex(depth));
+  if (!tokener) return nullptr;
+  json_tokener_set_flags(tokener.get(), JSON_TOKENER_STRICT);
+  // with its terminator, so that a number at the end is complete
+  const std::string whole(text);
+  JsonPtr value(
+      json_tokener_parse_ex(tokener.get(), whole.c_str(), static_cast<int>(whole.size() + 1)));
+  const json_tokener_error error = json_tokener_get_error(tokener.get());
+  if (too_deep != nullptr) *too_deep = error == json_tokener_error_depth;
+  if (error != json_tokener_success) return nullptr;
+  return value.release();
+}
+
+json_object *new_json_from_text(std::string_view text) {
+  json_object *value = json_object_new_object();
+  char *copy = strndup(text.data(), text.size());
+  if (value == nullptr || copy == nullptr) {
+    std::free(copy);
+    json_object_put(value);
+    return nullptr;
+  }
+  json_object_set_serializer(value, json_object_userdata_to_json_string, copy,
+                             json_object_free_userdata);
+  return value;
+}

@@ -1,0 +1,43 @@
+/**
+ * @file model_entries.h
+ * @brief Finding the device entries in the text of an application list.
+ *
+ * A list is shared by all devices of an account. What other devices wrote is
+ * carried over as text: numbers beyond 64 bits, doubled keys and the like
+ * would not survive being read and written again.
+ */
+#ifndef QUARN_D_BACKUP_MODEL_ENTRIES_H
+#define QUARN_D_BACKUP_MODEL_ENTRIES_H
+
+#include <json-c/json.h>
+
+#include <string>
+#include <string_view>
+#include <vector>
+
+/** A list's text, taken apart. */
+struct model_list_text {
+  /** The text with null in place of each entry. */
+  std::string frame;
+  /** The entries in order; views into the text that was taken apart. */
+  std::vector<std::string_view> entries;
+};
+
+/**
+ * Take a list's text apart. Nothing is checked beyond what tells one value
+ * from the next: parse the frame and the entries afterwards. A text without
+ * entries is all frame.
+ */
+model_list_text take_model_list_apart(std::string_view text);
+
+/**
+ * Parse exactly one JSON value.
+ * @param[out] too_deep the value is nested deeper than @p depth; may be null
+ * @return null when the text is anything else
+ */
+json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep);
+
+/** A value that is written as @p text, which must be JSON. */
+json_object *new_json_from_text(std::string_view text);
+
+#endif
