@@ -1,0 +1,156 @@
+#include <malloc.h>
+#include <pthread.h>
+
+#include <algorithm>
+#include <condition_variable>
+#include <mutex>
+
+#include "backup_transport.h"
+#include "quarn_common.h"
+#include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_client.h"
+#include "quarn_log.h"
+
+std::atomic<bool> manual_backup_canceled{false};
+std::atomic<bool> g_is_backing_up{false};
+
+namespace {
+
+constexpr std::size_t kKeepNothing = 0;
+
+// The worker has no end and may be anywhere when the process exits: what it
+// waits on and reads is never destroyed.
+std::mutex &backup_req_list_mutex = *new std::mutex;
+std::vector<void *> &backup_req_list = *new std::vector<void *>;
+std::vector<void *> &cancelled_clients = *new std::vector<void *>;  // with the list's mutex
+std::mutex &backup_req_cond_mutex = *new std::mutex;
+std::condition_variable &backup_req_cond = *new std::condition_variable;
+
+/** Entries in both lists: what the worker waits for. The two mutexes are never held together. */
+std::atomic<std::size_t> waiting_entries{0};
+/** Requests that were made and are not finished. */
+std::atomic<int> outstanding_requests{0};
+
+std::atomic<int (*)()> wifi_probe{nullptr};
+
+enum class Taken { kNothing, kRequest };
+
+Taken take_request(void **client) {
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  if (backup_req_list.empty()) return Taken::kNothing;
+  *client = backup_req_list.front();
+  backup_req_list.erase(backup_req_list.begin());
+  --waiting_entries;
+  return Taken::kRequest;
+}
+
+/** Clients whose reservation was cancelled learn it here, not on the main thread. */
+void answer_cancelled_clients() {
+  std::vector<void *> clients;
+  {
+    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    clients.swap(cancelled_clients);
+    waiting_entries -= clients.size();
+  }
+  for (void *client : clients) {
+    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
+    --outstanding_requests;
+  }
+}
+
+bool can_reach_cloud() {
+  if (backup_wifi_connected() != 0 && cloud_initialized()) return true;
+  LOGE("cloud couldn't be initialized.(wifi:%d)", backup_wifi_connected());
+  return false;
+}
+
+void run_request(void *client) {
+  if (client == nullptr) {
+    if (!can_reach_cloud()) return;
+    LOGI("now auto backup start!");
+    do_backup(false, nullptr);
+    return;
+  }
+  if (!can_reach_cloud()) {
+    quarn_dbus_manual_backup_status(QUARN_NO_SESSION, QUARN_BACKUP_FAILED, client);
+    return;
+  }
+  LOGI("now manual backup start!");
+  do_backup(true, client);
+}
+
+void *backup_req_dispatch_thread(void *) {
+  for (;;) {
+    LOGI("backup_req_dispatch_thread");
+    boot_cleanup_backup_items();
+    answer_cancelled_clients();
+    void *client = nullptr;
+    if (take_request(&client) == Taken::kRequest) {
+      request_power_lock(true);
+      g_is_backing_up = true;
+      run_request(client);
+      g_is_backing_up = false;
+      request_power_lock(false);
+      --outstanding_requests;
+      malloc_trim(kKeepNothing);
+    }
+    std::unique_lock<std::mutex> lock(backup_req_cond_mutex);
+    backup_req_cond.wait(lock, [] { return waiting_entries != 0; });
+  }
+}
+
+void wake_worker() {
+  const std::lock_guard<std::mutex> lock(backup_req_cond_mutex);
+  backup_req_cond.notify_one();
+}
+
+}  // namespace
+
+void init_backup_req_dispatch_thread() {
+  LOGI("init_backup_req_dispatch_thread");
+  pthread_t worker = {};
+  const int ret = pthread_create(&worker, nullptr, backup_req_dispatch_thread, nullptr);
+  if (ret != 0) {
+    LOGE("pthread_create() failed %d", ret);
+    return;
+  }
+  pthread_detach(worker);
+}
+
+void request_backup(void *client) {
+  ++outstanding_requests;
+  {
+    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    backup_req_list.push_back(client);
+    ++waiting_entries;
+  }
+  wake_worker();
+}
+
+void cancel_backup(void *) {
+  const backup_trans_handle_h handle = cloud_handler();
+  LOGI("request cancel to handler(0x%x)",
+       static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(handle)));
+  backup_trans_cancel_request(handle);
+  {
+    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    const auto manual = std::stable_partition(backup_req_list.begin(), backup_req_list.end(),
+                                              [](void *client) { return client == nullptr; });
+    for (auto client = manual; client != backup_req_list.end(); ++client) {
+      LOGI("reservation for manual backup is canceled");
+      cancelled_clients.push_back(*client);
+    }
+    backup_req_list.erase(manual, backup_req_list.end());
+  }
+  wake_worker();
+}
+
+bool backup_request_outstanding() { return outstanding_requests != 0; }
+
+void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
+
+int backup_wifi_connected() {
+  const auto probe = wifi_probe.load();
+  return probe != nullptr ? probe() : 0;
+}

@@ -1,0 +1,233 @@
+#include <ctime>
+
+#include "backup_transport.h"
+#include "quarn_common.h"
+#include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_client.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr timespec kPollInterval = {0, 10'000'000};
+constexpr int kRoundsPerMinute = 6000;
+
+void pause_once() { nanosleep(&kPollInterval, nullptr); }
+
+void abandon(backup_context *ctx, std::int32_t result) {
+  ctx->result = result;
+  ctx->abandoned = true;
+}
+
+bool stop_when_cancelled(backup_context *ctx) {
+  if (!ctx->is_manual || !manual_backup_canceled) return false;
+  LOGI("manual backup cancelled");
+  abandon(ctx, QUARN_CANCELLED);
+  return true;
+}
+
+enum class Transfers { kLeave, kCancel };
+
+bool stop_without_wifi(backup_context *ctx, Transfers transfers) {
+  if (backup_wifi_connected() != 0) return false;
+  LOGE("WIFI disconnected");
+  if (transfers == Transfers::kCancel) backup_trans_cancel_request(cloud_handler());
+  abandon(ctx, QUARN_TRANSFER_FAILED);
+  return true;
+}
+
+bool must_stop(backup_context *ctx, Transfers transfers) {
+  return stop_when_cancelled(ctx) || stop_without_wifi(ctx, transfers);
+}
+
+/**
+ * Poll while @p pending; @p log_minute is told of every full minute.
+ * @return false when the run was abandoned meanwhile
+ */
+template <typename Pending, typename LogMinute>
+bool wait_while(backup_context *ctx, Pending pending, LogMinute log_minute) {
+  pause_once();
+  for (int rounds = 1; pending(); ++rounds) {
+    if (must_stop(ctx, Transfers::kCancel)) return false;
+    if (rounds % kRoundsPerMinute == 0) log_minute(rounds / kRoundsPerMinute);
+    pause_once();
+  }
+  return true;
+}
+
+bool check_app_list(backup_context *ctx) {
+  LOGI("=== checking app list from cloud ===");
+  report_progress(ctx, backup_stage::checking);
+  const int ret = get_app_list_from_cloud(ctx);
+  if (ret != QUARN_OK) {
+    ctx->result = ret;
+    return false;
+  }
+  const bool answered = wait_while(
+      ctx, [ctx] { return ctx->app_list_downloading.load(); },
+      [](int minutes) { LOGI("[%d min] waiting for app list download completion...", minutes); });
+  if (!answered) return false;
+  if (!ctx->app_list_checked) {
+    ctx->result = QUARN_LIST_CHECK_FAILED;
+    return false;
+  }
+  return true;
+}
+
+bool make_items(backup_context *ctx) {
+  LOGI("=== make backup items ===");
+  report_progress(ctx, backup_stage::archiving);
+  const int ret = make_backup_items(ctx);
+  if (ret != QUARN_OK) {
+    ctx->result = ret;
+    return false;
+  }
+  return !must_stop(ctx, Transfers::kLeave);
+}
+
+bool upload_items(backup_context *ctx) {
+  LOGI("=== upload all app data ===");
+  ctx->uploads_total = static_cast<std::int32_t>(ctx->upload_list.size());
+  report_progress(ctx, backup_stage::uploading);
+  for (const pkg_information &package : ctx->upload_list) {
+    ++ctx->uploads_requested;
+    upload_app_data(ctx, package.pkg_id.c_str(), package.root_path.c_str(),
+                    package.version.c_str());
+  }
+  if (ctx->upload_remain > 0) {
+    LOGI("waiting for upload completion of app data.(remain num = %d)", ctx->upload_remain.load());
+  } else {
+    LOGI("no app data to upload");
+  }
+  return wait_while(
+      ctx, [ctx] { return ctx->upload_remain > 0; },
+      [ctx](int minutes) {
+        LOGI("[%d min] waiting for upload completion of app data.(remain num = %d)", minutes,
+             ctx->upload_remain.load());
+      });
+}
+
+bool upload_list_of_items(backup_context *ctx) {
+  if (ctx->result != QUARN_OK) return false;
+  LOGI("=== upload app list ===");
+  report_progress(ctx, backup_stage::listing);
+  upload_app_list(ctx);
+  LOGI("waiting for upload completion of app list...");
+  const bool answered = wait_while(
+      ctx, [ctx] { return ctx->app_list_uploading.load(); },
+      [](int minutes) { LOGI("[%d min] waiting for upload completion of app list...", minutes); });
+  return answered && ctx->result == QUARN_OK;
+}
+
+bool cleanup_pending(const backup_context *ctx) {
+  return ctx->serial_clean_pending != 0 || ctx->pkg_delete_pending != 0 ||
+         ctx->version_list_pending != 0 || ctx->version_delete_pending != 0;
+}
+
+void clean_up_cloud(backup_context *ctx) {
+  LOGI("=== start : clean up cloud ===");
+  report_progress(ctx, backup_stage::cleaning);
+  delete_other_backup_items_in_cloud(ctx);
+  delete_other_pkg_version_in_cloud(ctx);
+  for (int rounds = 1; cleanup_pending(ctx); ++rounds) {
+    pause_once();
+    if (rounds % kRoundsPerMinute == 0) {
+      LOGI("[%d min] waiting for clean up cloud completion...", rounds / kRoundsPerMinute);
+    }
+    if (must_stop(ctx, Transfers::kCancel)) return;
+  }
+  if (ctx->cleanup_result != QUARN_OK) {
+    LOGE("=== failed : clean up cloud ===");
+  } else {
+    LOGI("=== success : clean up cloud ===");
+  }
+}
+
+/** The stages in order, to the first that fails. */
+void run_stages(backup_context *ctx) {
+  if (backup_context_init(ctx) != QUARN_OK) return;
+  if (backup_wifi_connected() == 0) {
+    LOGE("WIFI disconnected");
+    ctx->result = QUARN_TRANSFER_FAILED;
+    return;
+  }
+  if (check_app_list(ctx) && make_items(ctx) && upload_items(ctx) && upload_list_of_items(ctx)) {
+    clean_up_cloud(ctx);
+  }
+}
+
+/** Delete the archives that were never sent, and let others stage theirs. */
+void drop_unsent_archives(backup_context *ctx) {
+  for (std::size_t i = ctx->uploads_requested; i < ctx->upload_list.size(); ++i) {
+    const pkg_information &package = ctx->upload_list[i];
+    if (!holds_staged_archive(ctx, package.pkg_id)) continue;
+    delete_staged_file(staged_archive_path(package.root_path, package.pkg_id));
+    release_staged_archive(ctx, package.pkg_id);
+  }
+}
+
+void report_to_client(backup_context *ctx, int status) {
+  quarn_dbus_manual_backup_status(ctx->result, status, ctx->client);
+  ctx->client = nullptr;  // the final status deletes the record
+}
+
+void finish_manual_backup(backup_context *ctx) {
+  int status = QUARN_BACKUP_FAILED;
+  if (manual_backup_canceled) {
+    ctx->result = QUARN_CANCELLED;
+  } else if (ctx->result == QUARN_OK) {
+    set_last_backup_time();
+    LOGI("manual backup successful!");
+    report_to_client(ctx, QUARN_BACKUP_SUCCEEDED);
+    return;
+  }
+  if (ctx->result == QUARN_CANCELLED) status = QUARN_BACKUP_CANCELLED;
+  LOGE("manual backup couldn't be completed... cause=%d", ctx->result.load());
+  report_to_client(ctx, status);
+}
+
+void finish_auto_backup(backup_context *ctx) {
+  if (ctx->result == QUARN_OK) {
+    set_last_backup_time();
+    LOGI("auto backup successful!");
+  } else {
+    LOGE("auto backup couldn't be completed... cause=%d", ctx->result.load());
+  }
+}
+
+}  // namespace
+
+void do_backup(bool is_manual, void *client) {
+  const BackupContextPtr ctx(new backup_context);
+  if (is_manual && manual_backup_canceled) {
+    LOGE("manual backup was cancelled");
+    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
+    return;
+  }
+  ctx->is_manual = is_manual;
+  ctx->client = client;
+  run_stages(ctx.get());
+  finish_backup(ctx.get());
+}
+
+void finish_backup(backup_context *ctx) {
+  // before the client is told: its answer may take long
+  drop_unsent_archives(ctx);
+  if (ctx->is_manual) {
+    finish_manual_backup(ctx);
+  } else {
+    finish_auto_backup(ctx);
+  }
+  delete_backup_items(ctx);
+  ctx->finished = true;
+  report_progress(ctx, backup_stage::finished);
+}
+
+void delete_backup_items(backup_context *ctx) {
+  drop_unsent_archives(ctx);
+  for (const pkg_information &package : ctx->upload_list) {
+    if (!holds_staged_archive(ctx, package.pkg_id)) continue;
+    delete_staged_file(staged_archive_path(package.root_path, package.pkg_id));
+  }
+  if (holds_staged_archive(ctx, kStagedListLease)) delete_staged_file(kLocalAppListPath);
+}
