@@ -11,6 +11,11 @@
 #include "platform_alarm.h"
 #include "platform_connection.h"
 
+/** The name under which the daemon registers with the alarm service and is woken by it. */
+inline constexpr char kAlarmOwner[] = "quarn";
+/** No alarm. */
+inline constexpr alarm_id_t kNoAlarm = 0;
+
 /** The connection manager's handle; null before init_backup_resource(). */
 extern connection_h g_connection;
 /** The pending condition alarm, 0 when none. */
