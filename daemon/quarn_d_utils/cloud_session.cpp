@@ -1,0 +1,174 @@
+#include "quarn_d_utils/cloud_session.h"
+
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <condition_variable>
+
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_log.h"
+
+std::atomic<bool> cloud_init_done{false};
+std::atomic<backup_trans_handle_h> _g_handle{nullptr};
+unsigned int cloud_init_timeout_seconds = 60;
+
+namespace {
+
+using AttemptId = std::uintptr_t;
+constexpr AttemptId kNoAttempt = 0;
+
+/** One call of cloud_initialized(); it lives on that caller's stack. */
+struct wait_record {
+  AttemptId attempt = kNoAttempt;
+  GMainLoop *loop = nullptr; /**< main thread only */
+  guint timeout_source = 0;  /**< main thread only */
+  bool answered = false;
+  bool waiting = false; /**< the nested loop runs */
+};
+
+// Guards what follows, and the flags of the records in the list. The library
+// is handed the number of an attempt, not a record, so an answer that comes
+// late or never leaves nothing behind.
+std::mutex session_mutex;
+std::condition_variable session_answered;
+std::vector<wait_record *> wait_records;
+AttemptId last_attempt = kNoAttempt;
+AttemptId running_attempt = kNoAttempt; /**< started, not answered, not timed out */
+
+/** Under session_mutex: the next call starts anew. */
+void end_attempt(AttemptId attempt) {
+  if (running_attempt == attempt) running_attempt = kNoAttempt;
+}
+
+void wake(wait_record *record) {
+  record->answered = true;
+  if (record->waiting) {
+    g_main_loop_quit(record->loop);
+    record->waiting = false;
+  }
+}
+
+/** An attempt has its answer; a transport that is ready answers every attempt. */
+void answer(AttemptId attempt) {
+  const std::lock_guard<std::mutex> lock(session_mutex);
+  end_attempt(attempt);
+  for (wait_record *record : wait_records) {
+    if (record->attempt == attempt || cloud_init_done) wake(record);
+  }
+  session_answered.notify_all();
+}
+
+void __backup_trans_init_resp_cb(backup_trans_error_code err, void *user_data) {
+  if (err == BACKUP_TRANS_ERROR_NONE) {
+    LOGI("backup_trans_init successful!");
+    // A second attempt may have been started before the first was answered.
+    if (_g_handle == nullptr) _g_handle = backup_trans_create_handle();
+    const backup_trans_handle_h handle = _g_handle;
+    if (handle == nullptr) {
+      LOGE("cannot get cloud handler");
+    } else {
+      LOGI("_g_handle is 0x%x",
+           static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(handle)));
+    }
+    // Only now: other threads take the handle as soon as the flag is set.
+    cloud_init_done = handle != nullptr;
+  } else {
+    LOGE("backup_trans_init error : %d", err);
+  }
+  answer(reinterpret_cast<AttemptId>(user_data));
+}
+
+void log_timeout() {
+  LOGE("cloud init couldn't be completed over %d seconds",
+       static_cast<int>(cloud_init_timeout_seconds));
+}
+
+gboolean _waiting_timeout(gpointer user_data) {
+  auto *record = static_cast<wait_record *>(user_data);
+  log_timeout();
+  const std::lock_guard<std::mutex> lock(session_mutex);
+  record->timeout_source = 0;
+  if (record->waiting) {
+    g_main_loop_quit(record->loop);
+    record->waiting = false;
+  }
+  return G_SOURCE_REMOVE;
+}
+
+/** The thread that runs the main loop is the process's first. */
+bool on_main_thread() { return gettid() == getpid(); }
+
+void wait_in_nested_loop(wait_record *record) {
+  const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+  {
+    const std::lock_guard<std::mutex> lock(session_mutex);
+    if (record->answered) return;
+    record->loop = loop.get();
+    record->waiting = true;
+    record->timeout_source =
+        g_timeout_add_seconds(cloud_init_timeout_seconds, _waiting_timeout, record);
+  }
+  run_nested_loop(loop.get());
+
+  const std::lock_guard<std::mutex> lock(session_mutex);
+  record->waiting = false;
+  if (record->timeout_source != 0) g_source_remove(record->timeout_source);
+}
+
+void wait_on_condition(wait_record *record) {
+  std::unique_lock<std::mutex> lock(session_mutex);
+  const auto timeout = std::chrono::seconds(cloud_init_timeout_seconds);
+  if (!session_answered.wait_for(lock, timeout, [record] { return record->answered; })) {
+    log_timeout();
+  }
+}
+
+/** Join the attempt that is running. @return true when the caller is to make a new one */
+bool join_attempt(wait_record *record) {
+  const std::lock_guard<std::mutex> lock(session_mutex);
+  if (cloud_init_done) {
+    // Answered since the caller looked.
+    record->answered = true;
+    return false;
+  }
+  const bool is_new = running_attempt == kNoAttempt;
+  if (is_new) running_attempt = ++last_attempt;
+  record->attempt = running_attempt;
+  wait_records.push_back(record);
+  return is_new;
+}
+
+void leave_attempt(wait_record *record) {
+  const std::lock_guard<std::mutex> lock(session_mutex);
+  wait_records.erase(std::remove(wait_records.begin(), wait_records.end(), record),
+                     wait_records.end());
+  if (!record->answered) end_attempt(record->attempt);
+}
+
+}  // namespace
+
+bool cloud_initialized() {
+  if (cloud_init_done) return true;
+  LOGI("try to init cloud");
+
+  wait_record record;
+  if (join_attempt(&record)) {
+    const int ret =
+        backup_trans_init(reinterpret_cast<void *>(record.attempt), __backup_trans_init_resp_cb);
+    if (ret != BACKUP_TRANS_ERROR_NONE) {
+      LOGE("backup_trans_init error : %d", ret);
+      answer(record.attempt);
+    }
+  }
+  if (on_main_thread()) {
+    wait_in_nested_loop(&record);
+  } else {
+    wait_on_condition(&record);
+  }
+  leave_attempt(&record);
+  return cloud_init_done;
+}
+
+backup_trans_handle_h cloud_handler() { return _g_handle; }
