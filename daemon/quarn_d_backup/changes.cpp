@@ -156,6 +156,7 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
     return QUARN_UNCHANGED;
   }
   LOGI("app data of (%s) was changed, so will be backed up", ctx->cur_pkg_id.c_str());
+  ctx->bytes_to_upload += staged_file_size(archive_path);
   if (!ctx->single_package) add_to_app_data_upload_list(ctx);
   report_package(ctx, backup_outcome::none);
   return QUARN_OK;

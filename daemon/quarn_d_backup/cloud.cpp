@@ -8,13 +8,11 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kRequestedListPrefix[] = "/tmp/quarn/app_list_request_";
-constexpr char kRequestedListSuffix[] = ".txt";
+constexpr char kWaitedForSuffix[] = ".waited_for.";
 constexpr char kArchiveSuffix[] = ".zip";
 // Some forty thousand packages; a longer one would not fit the daemon's memory.
 constexpr std::uint64_t kMaxAppListSize = 4 * 1024 * 1024;
@@ -92,13 +90,8 @@ void set_result_once(backup_context *ctx, std::int32_t code) {
   ctx->result.compare_exchange_strong(expected, code);
 }
 
-std::uint64_t staged_size(const std::string &path) {
-  struct stat status = {};
-  return safe_lstat(path.c_str(), &status) == 0 ? static_cast<std::uint64_t>(status.st_size) : 0;
-}
-
 bool read_app_list_file(const std::string &path, CString *text) {
-  if (staged_size(path) <= kMaxAppListSize && read_data_from_file(path.c_str(), out(*text))) {
+  if (staged_file_size(path) <= kMaxAppListSize && read_data_from_file(path.c_str(), out(*text))) {
     return true;
   }
   LOGE("cannot read app list file...");
@@ -384,7 +377,8 @@ int download_app_list_info_from_cloud(char **text) {
   *text = nullptr;
   if (!prepare_staging_directory()) return QUARN_LIST_CHECK_FAILED;
   // a run may have its own list staged at this very moment
-  const std::string path = kRequestedListPrefix + std::to_string(++requests) + kRequestedListSuffix;
+  const std::string path =
+      std::string(kLocalAppListPath) + kWaitedForSuffix + std::to_string(++requests);
   int ret = backup_trans_download_file_ors(cloud_handler(), kCloudAppListPath, path.c_str(),
                                            BACKUP_TRANS_OPTION_NONE);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
@@ -412,11 +406,10 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   record->local_path = staged_archive_path(root_path, pkg_id);
   record->remote_path =
       version_folder(ctx->serial_number, pkg_id, version) + "/" + pkg_id + kArchiveSuffix;
-  record->size = staged_size(record->local_path);
+  record->size = staged_file_size(record->local_path);
   if (ctx->single_package) {
     note_single_upload(ctx->serial_number, pkg_id, version);
     ++ctx->uploads_total;
-    ctx->bytes_to_upload += record->size;
   }
   LOGI("request upload for (%s)", pkg_id);
   ++ctx->upload_remain;

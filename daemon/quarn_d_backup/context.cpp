@@ -158,6 +158,11 @@ void delete_staged_file(const std::string &path) {
   if (file_exist(path.c_str())) delete_file(path.c_str());
 }
 
+std::uint64_t staged_file_size(const std::string &path) {
+  struct stat status = {};
+  return safe_lstat(path.c_str(), &status) == 0 ? static_cast<std::uint64_t>(status.st_size) : 0;
+}
+
 bool prepare_staging_directory() {
   struct stat status = {};
   const bool made = safe_mkdir_with_parents(kStagingDirectory, kPrivateDirectory) == 0;

@@ -11,6 +11,8 @@ namespace {
 
 constexpr timespec kPollInterval = {0, 10'000'000};
 constexpr int kRoundsPerMinute = 6000;
+// Each keeps its file open until it is answered.
+constexpr int kMaxRequestedUploads = 256;
 
 void pause_once() { nanosleep(&kPollInterval, nullptr); }
 
@@ -85,11 +87,25 @@ bool make_items(backup_context *ctx) {
   return !must_stop(ctx, Transfers::kLeave);
 }
 
+/** Wait until at most @p count uploads are to be answered. */
+bool wait_for_uploads(backup_context *ctx, int count) {
+  return wait_while(
+      ctx, [ctx, count] { return ctx->upload_remain > count; },
+      [ctx](int minutes) {
+        LOGI("[%d min] waiting for upload completion of app data.(remain num = %d)", minutes,
+             ctx->upload_remain.load());
+      });
+}
+
 bool upload_items(backup_context *ctx) {
   LOGI("=== upload all app data ===");
   ctx->uploads_total = static_cast<std::int32_t>(ctx->upload_list.size());
   report_progress(ctx, backup_stage::uploading);
   for (const pkg_information &package : ctx->upload_list) {
+    if (ctx->upload_remain >= kMaxRequestedUploads &&
+        !wait_for_uploads(ctx, kMaxRequestedUploads - 1)) {
+      return false;
+    }
     ++ctx->uploads_requested;
     upload_app_data(ctx, package.pkg_id.c_str(), package.root_path.c_str(),
                     package.version.c_str());
@@ -99,12 +115,7 @@ bool upload_items(backup_context *ctx) {
   } else {
     LOGI("no app data to upload");
   }
-  return wait_while(
-      ctx, [ctx] { return ctx->upload_remain > 0; },
-      [ctx](int minutes) {
-        LOGI("[%d min] waiting for upload completion of app data.(remain num = %d)", minutes,
-             ctx->upload_remain.load());
-      });
+  return wait_for_uploads(ctx, 0);
 }
 
 bool upload_list_of_items(backup_context *ctx) {

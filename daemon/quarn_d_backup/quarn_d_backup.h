@@ -197,6 +197,9 @@ bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id);
 /** Give it back; nothing happens when @p ctx does not hold it. Any thread. */
 void release_staged_archive(backup_context *ctx, const std::string &pkg_id);
 
+/** Make the directory of staged lists; false when what lies there is not ours alone. */
+bool prepare_staging_directory();
+
 /* ---- pipeline.cpp: worker --------------------------------------------------- */
 
 /** One complete run. */

@@ -24,8 +24,8 @@ bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id);
 std::string staged_archive_path(const std::string &root_path, const std::string &pkg_id);
 /** Delete a staged file if it is there; a run and its callbacks may both come to it. */
 void delete_staged_file(const std::string &path);
-/** Make the staging directory; false when what lies there is not ours alone. */
-bool prepare_staging_directory();
+/** Bytes of a staged file, 0 when there is none. */
+std::uint64_t staged_file_size(const std::string &path);
 
 /* ---- progress.cpp ---- */
 
