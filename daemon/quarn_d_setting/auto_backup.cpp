@@ -40,6 +40,8 @@ void request_auto_backup() {
 
 int _alarm_timer_expired_cb(alarm_id_t alarm_id, void *) {
   _alarm_id = kNoAlarm;
+  forget_alarm(alarm_id);
+  tell_setting_observer();
   // Unsigned: a last backup in the future, or one that cannot be read, is due.
   const std::uint64_t term =
       static_cast<std::uint64_t>(_get_current_timestamp()) - get_last_backup_time();
@@ -52,6 +54,9 @@ int _alarm_timer_expired_cb(alarm_id_t alarm_id, void *) {
   }
 
   if (is_idle_status()) {
+    // A process that lived until its own alarm has no other one pending: without a new one nothing
+    // would start the daemon again, and automatic backup would have ended for good.
+    if (auto_backup_enabled && !any_alarm_known()) add_periodic_alarm();
     LOGI("terminate quarn");
     request_quarn_terminate(kAtOnce, false);
   } else {
@@ -127,6 +132,7 @@ void set_auto_backup(int on) {
     }
   }
   LOGI("now auto backup state is %d", auto_backup_enabled);
+  tell_setting_observer();
 }
 
 void monitor_auto_backup_status() {

@@ -28,6 +28,7 @@ int last_display_state = kNoDisplayState;
 void _connection_type_changed_cb(connection_type_e type, void *) {
   g_connection_type = type;
   if (auto_backup_enabled) check_backup_condition();
+  tell_setting_observer();
 }
 
 /** Read the charger's state. @return RUNTIME_INFO_ERROR_NONE, or a logged error */
@@ -65,6 +66,7 @@ void _screen_changed_cb(device_callback_e type, void *, void *) {
   lcd_off = state == DISPLAY_STATE_SCREEN_OFF ? 1 : 0;
   if (state != last_display_state) check_backup_condition();
   last_display_state = state;
+  tell_setting_observer();
 }
 
 }  // namespace

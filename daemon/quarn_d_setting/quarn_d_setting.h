@@ -8,6 +8,8 @@
 #ifndef QUARN_D_SETTING_H
 #define QUARN_D_SETTING_H
 
+#include <cstdint>
+
 #include "platform_alarm.h"
 #include "platform_connection.h"
 
@@ -54,5 +56,18 @@ void monitor_auto_backup_status();
 void remove_condition_alarm();
 /** Add a one-shot alarm @p seconds from now. @return the service's result */
 int add_backup_alarm(int seconds, alarm_id_t *id);
+/** An alarm fell due or was removed. */
+void forget_alarm(alarm_id_t id);
+/** Whether an alarm that this process added is still pending. */
+bool any_alarm_known();
+/** When the condition alarm is due, milliseconds since the Unix epoch; 0 when none is pending. */
+std::int64_t condition_alarm_due();
+/** When the first pending alarm of this process is due, likewise. */
+std::int64_t next_alarm_due();
+
+/** Who is told that a condition, an alarm or the setting may have changed; set once at start. */
+void set_setting_observer(void (*observer)());
+/** Tell it. */
+void tell_setting_observer();
 
 #endif

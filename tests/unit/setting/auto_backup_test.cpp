@@ -182,6 +182,47 @@ TEST_F(ExpiryTest, ADueBackupIsRequestedForNobodyAndKeepsTheDaemon) {
   EXPECT_EQ(_alarm_id, 0);
 }
 
+TEST_F(ExpiryTest, AnIdleProcessWithoutAnotherAlarmLeavesOneForTheNextDay) {
+  set_auto_backup(1);
+  last_backup_was(kHourMs);
+  for (alarm_id_t id = 1; id <= last_alarm; ++id) forget_alarm(id);
+  expire();
+  ASSERT_EQ(alarms.size(), 1U);
+  EXPECT_EQ(alarms.begin()->second, kTwelveHours);
+  expect_terminated_once();
+}
+
+TEST_F(ExpiryTest, AnIdleProcessWithAnAlarmPendingAddsNone) {
+  set_auto_backup(1);
+  last_backup_was(kHourMs);
+  alarm_id_t pending = 0;
+  add_backup_alarm(kTwelveHours, &pending);
+  EXPECT_CALL(platform, alarmmgr_add_alarm).Times(0);
+  expire();
+  expect_terminated_once();
+}
+
+TEST_F(ExpiryTest, WithAutoBackupOffNoAlarmFollows) {
+  last_backup_was(kHourMs);
+  EXPECT_CALL(platform, alarmmgr_add_alarm).Times(0);
+  expire();
+  expect_terminated_once();
+}
+
+TEST_F(SettingTest, KnowsWhenItsAlarmsAreDue) {
+  EXPECT_EQ(next_alarm_due(), 0);
+  const std::int64_t before = _get_current_timestamp();
+  alarm_id_t id = 0;
+  add_backup_alarm(kTwelveHours, &id);
+  EXPECT_GE(next_alarm_due(), before + kTwelveHours * 1000LL);
+  EXPECT_EQ(condition_alarm_due(), 0);
+  add_backup_alarm(60, &_alarm_id);
+  EXPECT_GE(condition_alarm_due(), before + 60000);
+  EXPECT_EQ(next_alarm_due(), condition_alarm_due());
+  remove_condition_alarm();
+  EXPECT_EQ(condition_alarm_due(), 0);
+}
+
 TEST_F(ExpiryTest, WhileABackupRunsNoneIsRequestedAndATwelveHourAlarmIsAdded) {
   set_auto_backup(1);
   satisfy_conditions();

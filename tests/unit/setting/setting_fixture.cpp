@@ -101,6 +101,7 @@ SettingTest::SettingTest() {
 }
 
 SettingTest::~SettingTest() {
+  for (alarm_id_t id = 0; id <= last_alarm; ++id) forget_alarm(id);
   // The unit's state is the process's: leave it as it was found.
   ::testing::Mock::VerifyAndClearExpectations(&platform);
   ::testing::Mock::VerifyAndClearExpectations(&transport);
