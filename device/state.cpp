@@ -1,0 +1,342 @@
+#include <fcntl.h>
+#include <glib.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <iostream>
+#include <random>
+
+#include "device.h"
+#include "state/alarms.h"
+#include "state/facts.h"
+#include "state/state_file.h"
+#include "state/values.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr char kDefaultModel[] = "Orvane Embedded";
+constexpr char kDefaultAccount[] = "user";
+constexpr char kCloudFile[] = "cloud.conf";
+constexpr char kCloudGroup[] = "cloud";
+constexpr mode_t kPrivateFile = 0600;
+
+[[noreturn]] void wrong_use() { throw Failure("", DEVICE_USAGE); }
+
+/** An IMEI: 14 digits of the device's own and their check digit. */
+std::string new_serial() {
+  constexpr int kDigits = 14;
+  std::random_device source;
+  std::string digits = "35";
+  while (digits.size() < kDigits) digits += static_cast<char>('0' + source() % 10);
+  int sum = 0;
+  for (int i = 0; i < kDigits; ++i) {
+    const int digit = digits[i] - '0';
+    const int twice = digit * 2;
+    sum += i % 2 == 0 ? digit : twice / 10 + twice % 10;
+  }
+  return digits + static_cast<char>('0' + (10 - sum % 10) % 10);
+}
+
+std::string file_url(const std::string &path) {
+  const embedded::GText url(g_filename_to_uri(path.c_str(), nullptr, nullptr));
+  if (url == nullptr) throw Failure("no URL can name " + path);
+  return url.get();
+}
+
+bool is_one_of(const std::string &value, std::initializer_list<const char *> allowed) {
+  return std::any_of(allowed.begin(), allowed.end(), [&](const char *one) { return value == one; });
+}
+
+/** A text that names something: printable, one line. */
+bool is_text(const std::string &value) {
+  return !value.empty() && g_utf8_validate(value.c_str(), -1, nullptr) != FALSE &&
+         std::none_of(value.begin(), value.end(),
+                      [](char c) { return static_cast<unsigned char>(c) < 0x20; });
+}
+
+bool is_loopback(const std::string &host) {
+  return host == "localhost" || host == "127.0.0.1" || host == "::1" || host == "[::1]";
+}
+
+void check_url(const std::string &url) {
+  GError *error = nullptr;
+  GUri *uri = g_uri_parse(url.c_str(), G_URI_FLAGS_NONE, &error);
+  if (uri == nullptr) {
+    const std::string text = error->message;
+    g_error_free(error);
+    throw Failure("\"" + url + "\" is no cloud URL: " + text);
+  }
+  const std::string scheme = g_uri_get_scheme(uri);
+  const std::string host = g_uri_get_host(uri) == nullptr ? "" : g_uri_get_host(uri);
+  const std::string path = g_uri_get_path(uri);
+  const bool has_user = g_uri_get_userinfo(uri) != nullptr;
+  g_uri_unref(uri);
+  if (has_user) throw Failure("a cloud URL holds no user or password: use --user");
+  if (scheme == "file") {
+    if (!host.empty() || path.empty() || path[0] != '/') {
+      throw Failure("a folder is named file:///PATH");
+    }
+    return;
+  }
+  const bool encrypted = scheme == "webdav+https" || scheme == "s3+https";
+  const bool plain = scheme == "webdav+http" || scheme == "s3+http";
+  if (!encrypted && !plain) {
+    throw Failure("\"" + scheme + "\" is no kind of cloud: use file, webdav+https or s3+https");
+  }
+  if (host.empty()) throw Failure("\"" + url + "\" names no host");
+  if (plain && !is_loopback(host)) throw Failure("plain http is for this machine only: use https");
+}
+
+void write_cloud(const std::string &device, const std::string &url, const std::string &user,
+                 const std::string &password) {
+  check_url(url);
+  const embedded::KeyFilePtr file(g_key_file_new());
+  g_key_file_set_string(file.get(), kCloudGroup, "url", url.c_str());
+  if (!user.empty()) {
+    g_key_file_set_string(file.get(), kCloudGroup, "user", user.c_str());
+    g_key_file_set_string(file.get(), kCloudGroup, "password", password.c_str());
+  }
+  gsize length = 0;
+  const embedded::GText text(g_key_file_to_data(file.get(), &length, nullptr));
+  if (!embedded::write_state_text(device, kCloudFile, std::string(text.get(), length),
+                                  kPrivateFile)) {
+    throw Failure("cannot write the cloud's configuration: " + reason());
+  }
+}
+
+std::string read_line(std::istream &in) {
+  std::string line;
+  std::getline(in, line);
+  if (!line.empty() && line.back() == '\r') line.pop_back();
+  return line;
+}
+
+void set_cloud(const std::string &device, const Arguments &arguments) {
+  std::string user;
+  std::string password_file;
+  for (std::size_t i = 3; i < arguments.size(); i += 2) {
+    if (i + 1 >= arguments.size()) wrong_use();
+    if (arguments[i] == "--user") {
+      user = arguments[i + 1];
+    } else if (arguments[i] == "--password-file") {
+      password_file = arguments[i + 1];
+    } else {
+      wrong_use();
+    }
+  }
+  if (user.empty() && !password_file.empty()) wrong_use();
+  std::string password;
+  if (!user.empty() && !password_file.empty()) {
+    std::ifstream file(password_file);
+    if (!file) throw Failure("cannot read " + password_file + ": " + reason());
+    password = read_line(file);
+  } else if (!user.empty()) {
+    password = read_line(std::cin);
+  }
+  if (!user.empty() && password.empty()) throw Failure("no password was given");
+  write_cloud(device, arguments[2], user, password);
+}
+
+void set_fact(const std::string &device, const char *key, const std::string &value) {
+  if (!embedded::set_fact(device, key, value)) {
+    throw Failure(std::string("cannot write ") + key + ": " + reason());
+  }
+}
+
+std::string json_text(const std::string &text) {
+  std::string quoted = "\"";
+  for (const char c : text) {
+    char escape[8];
+    if (c == '"' || c == '\\') {
+      quoted += '\\';
+      quoted += c;
+    } else if (static_cast<unsigned char>(c) < 0x20) {
+      std::snprintf(escape, sizeof escape, "\\u%04x", c);
+      quoted += escape;
+    } else {
+      quoted += c;
+    }
+  }
+  return quoted + "\"";
+}
+
+std::string local_time(std::int64_t ms) {
+  const std::time_t seconds = ms / 1000;
+  std::tm parts{};
+  localtime_r(&seconds, &parts);
+  char text[40];
+  std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S", &parts);
+  return text;
+}
+
+}  // namespace
+
+int verb_create(const Arguments &arguments) {
+  if (arguments.empty() || arguments[0].empty() || arguments[0][0] == '-') wrong_use();
+  std::string model = kDefaultModel;
+  std::string serial;
+  std::string account = kDefaultAccount;
+  std::string cloud;
+  for (std::size_t i = 1; i < arguments.size(); ++i) {
+    if (arguments[i] == "--no-account") {
+      account.clear();
+      continue;
+    }
+    if (i + 1 >= arguments.size()) wrong_use();
+    const std::string &value = arguments[i + 1];
+    if (!is_text(value)) throw Failure("empty or unprintable " + arguments[i]);
+    if (arguments[i] == "--model") {
+      model = value;
+    } else if (arguments[i] == "--serial") {
+      serial = value;
+    } else if (arguments[i] == "--account") {
+      account = value;
+    } else if (arguments[i] == "--cloud") {
+      cloud = value;
+    } else {
+      wrong_use();
+    }
+    ++i;
+  }
+  if (serial.find('/') != std::string::npos || serial == "." || serial == "..") {
+    throw Failure("a serial number names a folder in the cloud: no slash, no dots alone");
+  }
+  if (!cloud.empty()) check_url(cloud);
+
+  const fs::path dir = fs::absolute(arguments[0]);
+  std::error_code error;
+  if (fs::exists(dir, error) && !(fs::is_directory(dir, error) && fs::is_empty(dir, error))) {
+    throw Failure(arguments[0] + " is there already and not empty");
+  }
+  for (const char *folder : {"root/opt/usr/apps", "root/tmp", "run", "log", "cloud",
+                             "state/packages", "state/apps", "state/.tmp"}) {
+    fs::create_directories(dir / folder, error);
+    if (error) throw Failure("cannot make " + (dir / folder).string() + ": " + error.message());
+  }
+  const std::string device = fs::canonical(dir).string();
+  chmod((device + "/root/tmp").c_str(), 01777);
+  chmod((device + "/cloud").c_str(), 0700);
+
+  set_fact(device, embedded::kModel, model);
+  set_fact(device, embedded::kSerial, serial.empty() ? new_serial() : serial);
+  set_fact(device, embedded::kAccount, account);
+  set_fact(device, embedded::kModem, "on");
+  set_fact(device, embedded::kNetwork, "wifi");
+  set_fact(device, embedded::kCharger, "off");
+  set_fact(device, embedded::kDisplay, "on");
+  write_cloud(device, cloud.empty() ? file_url(device + "/cloud") : cloud, "", "");
+  return DEVICE_OK;
+}
+
+int verb_set(const Arguments &arguments) {
+  if (arguments.size() < 3) wrong_use();
+  const std::string device = open_device(arguments[0]);
+  const std::string &key = arguments[1];
+  const std::string &value = arguments[2];
+  if (key == "cloud") {
+    set_cloud(device, arguments);
+    return DEVICE_OK;
+  }
+  if (arguments.size() != 3) wrong_use();
+  const auto set_if = [&](const char *name, std::initializer_list<const char *> allowed) {
+    if (!is_one_of(value, allowed)) throw Failure("\"" + value + "\" is no state of the " + key);
+    set_fact(device, name, value);
+  };
+  if (key == "network") {
+    set_if(embedded::kNetwork, {"wifi", "cellular", "none"});
+  } else if (key == "charger") {
+    set_if(embedded::kCharger, {"on", "off"});
+  } else if (key == "display") {
+    set_if(embedded::kDisplay, {"on", "dim", "off"});
+  } else if (key == "modem") {
+    set_if(embedded::kModem, {"on", "off"});
+  } else if (key == "account") {
+    if (!is_text(value)) throw Failure("empty or unprintable account name");
+    set_fact(device, embedded::kAccount, value == "none" ? "" : value);
+  } else {
+    throw Failure("no key \"" + key + "\"; see quarn-device set --help");
+  }
+  return DEVICE_OK;
+}
+
+int verb_setting(const Arguments &arguments) {
+  if (arguments.size() != 2 && arguments.size() != 3) wrong_use();
+  const std::string device = open_device(arguments[0]);
+  if (!embedded::is_value_key(arguments[1])) {
+    throw Failure("\"" + arguments[1] + "\" is no key of a setting");
+  }
+  if (arguments.size() == 3) {
+    if (!embedded::set_value(device, arguments[1], arguments[2])) {
+      throw Failure("cannot write the setting: " + reason());
+    }
+    return DEVICE_OK;
+  }
+  std::string value;
+  if (!embedded::get_value(device, arguments[1], &value)) {
+    throw Failure("no setting \"" + arguments[1] + "\"");
+  }
+  std::cout << value << "\n";
+  return DEVICE_OK;
+}
+
+int verb_alarms(const Arguments &arguments) {
+  const bool json = arguments.size() == 2 && arguments[1] == "--json";
+  if (arguments.empty() || (arguments.size() != 1 && !json)) wrong_use();
+  std::vector<embedded::Alarm> alarms;
+  if (!embedded::list_alarms(open_device(arguments[0]), &alarms)) {
+    throw Failure("cannot read the alarms");
+  }
+  if (json) {
+    std::cout << "[";
+    for (std::size_t i = 0; i < alarms.size(); ++i) {
+      std::cout << (i == 0 ? "" : ",") << "{\"id\":" << alarms[i].id
+                << ",\"owner\":" << json_text(alarms[i].owner) << ",\"due_ms\":" << alarms[i].due_ms
+                << "}";
+    }
+    std::cout << "]\n";
+    return DEVICE_OK;
+  }
+  for (const embedded::Alarm &alarm : alarms) {
+    std::printf("%6d  %-10s %s\n", alarm.id, alarm.owner.c_str(), local_time(alarm.due_ms).c_str());
+  }
+  return DEVICE_OK;
+}
+
+int verb_fire(const Arguments &arguments) {
+  if (arguments.size() != 2) wrong_use();
+  const std::string device = open_device(arguments[0]);
+  gint64 id = 0;
+  if (!g_ascii_string_to_signed(arguments[1].c_str(), 10, 1, G_MAXINT, &id, nullptr)) {
+    throw Failure("\"" + arguments[1] + "\" is no alarm's id");
+  }
+  if (!is_started(device)) throw Failure("the device is not started");
+  if (!embedded::fire_alarm(device, static_cast<int>(id), embedded::now_ms())) {
+    throw Failure("no alarm " + arguments[1]);
+  }
+  start_daemon(device);
+  return DEVICE_OK;
+}
+
+int verb_log(const Arguments &arguments) {
+  const bool follow = arguments.size() == 2 && arguments[1] == "--follow";
+  if (arguments.empty() || (arguments.size() != 1 && !follow)) wrong_use();
+  const std::string path = open_device(arguments[0]) + "/log/quarnd.log";
+  if (follow) {
+    execlp("tail", "tail", "-n", "+1", "-F", path.c_str(), nullptr);
+    throw Failure("cannot run tail: " + reason());
+  }
+  std::ifstream file(path);
+  if (!file) {
+    if (errno == ENOENT) return DEVICE_OK;  // nothing was logged yet
+    throw Failure("cannot read " + path + ": " + reason());
+  }
+  if (file.peek() != std::ifstream::traits_type::eof()) std::cout << file.rdbuf();
+  return DEVICE_OK;
+}

@@ -1,0 +1,90 @@
+#include "state/labels.h"
+
+#include <sys/xattr.h>
+
+#include <algorithm>
+#include <cerrno>
+
+namespace embedded {
+namespace {
+
+struct Attribute {
+  const char *kernel;
+  const char *user;
+};
+
+Attribute attribute_of(LabelKind kind) {
+  switch (kind) {
+    case LabelKind::kExec:
+      return {"security.SMACK64EXEC", "user.quarn.SMACK64EXEC"};
+    case LabelKind::kMmap:
+      return {"security.SMACK64MMAP", "user.quarn.SMACK64MMAP"};
+    case LabelKind::kAccess:
+      break;
+  }
+  return {"security.SMACK64", "user.quarn.SMACK64"};
+}
+
+int read_attribute(const char *path, Links links, const char *name, std::string *label) {
+  char value[kMaxLabel + 1];
+  const ssize_t length = links == Links::kFollow ? getxattr(path, name, value, sizeof value)
+                                                 : lgetxattr(path, name, value, sizeof value);
+  if (length < 0) return -1;
+  label->assign(value, static_cast<size_t>(length));
+  label->resize(std::min(label->find('\0'), label->size()));
+  return 0;
+}
+
+int write_attribute(const char *path, Links links, const char *name, const std::string &label) {
+  return links == Links::kFollow ? setxattr(path, name, label.data(), label.size(), 0)
+                                 : lsetxattr(path, name, label.data(), label.size(), 0);
+}
+
+bool has_no_attribute() { return errno == ENODATA || errno == ENOTSUP || errno == EPERM; }
+
+}  // namespace
+
+bool is_label(const std::string &label) {
+  return !label.empty() && label.size() <= kMaxLabel && label.front() != '-' &&
+         std::all_of(label.begin(), label.end(), [](char c) {
+           return c > ' ' && c <= '~' && c != '/' && c != '"' && c != '\'' && c != '\\';
+         });
+}
+
+int read_label(const char *path, Links links, LabelKind kind, std::string *label) {
+  const Attribute attribute = attribute_of(kind);
+  if (read_attribute(path, links, attribute.kernel, label) == 0) return 0;
+  if (!has_no_attribute()) return -1;
+  if (read_attribute(path, links, attribute.user, label) == 0) return 0;
+  if (!has_no_attribute()) return -1;
+  if (kind != LabelKind::kAccess) {
+    errno = ENODATA;
+    return -1;
+  }
+  *label = kFloorLabel;
+  return 0;
+}
+
+int write_label(const char *path, Links links, LabelKind kind, const std::string &label) {
+  if (!is_label(label)) {
+    errno = EINVAL;
+    return -1;
+  }
+  const Attribute attribute = attribute_of(kind);
+  if (write_attribute(path, links, attribute.kernel, label) == 0) return 0;
+  if (errno != EPERM && errno != ENOTSUP) return -1;
+
+  std::string present;
+  if (read_attribute(path, links, attribute.kernel, &present) == 0) {
+    // A label that the kernel guards would hide the one written beside it.
+    if (present == label) return 0;
+    errno = EPERM;
+    return -1;
+  }
+  if (write_attribute(path, links, attribute.user, label) == 0) return 0;
+  // What cannot have the attribute has the floor label, and may be given that one.
+  if (errno == EPERM && kind == LabelKind::kAccess && label == kFloorLabel) return 0;
+  return -1;
+}
+
+}  // namespace embedded

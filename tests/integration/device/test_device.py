@@ -1,0 +1,219 @@
+"""quarn-device: the verbs, and what a device keeps."""
+import json
+import os
+import stat
+import subprocess
+import sys
+import unittest
+
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+
+TOOL = os.path.join(BIN_DIR, "quarn-device")
+
+
+def label(path, follow=False):
+    for name in ("security.SMACK64", "user.quarn.SMACK64"):
+        try:
+            return os.getxattr(path, name, follow_symlinks=follow).decode()
+        except OSError:
+            continue
+    return "_"
+
+
+class Create(TestCase):
+    def test_makes_the_folders_and_the_default_cloud(self):
+        device = self.new_device()
+        for folder in ("root/opt/usr/apps", "root/tmp", "run", "log", "cloud", "state"):
+            self.assertTrue(os.path.isdir(os.path.join(device.path, folder)), folder)
+        config = os.path.join(device.path, "state/cloud.conf")
+        self.assertEqual(stat.S_IMODE(os.stat(config).st_mode), 0o600)
+        with open(config) as file:
+            self.assertIn("url=file://%s/cloud" % device.path, file.read())
+
+    def test_refuses_a_directory_that_is_not_empty(self):
+        os.makedirs(self.path("full"))
+        open(self.path("full", "file"), "w").close()
+        result = subprocess.run([TOOL, "create", self.path("full")], capture_output=True, text=True)
+        self.assertEqual(result.returncode, 1)
+        self.assertEqual(result.stderr.count("\n"), 1)
+        self.assertEqual(os.listdir(self.path("full")), ["file"])
+
+    def test_every_failure_is_one_line_and_a_status(self):
+        device = self.new_device()
+        for arguments in (["nonsense"], [], ["start", self.path("none")],
+                          ["install", device.path, self.path("none")],
+                          ["remove", device.path, "org.example.none"],
+                          ["set", device.path, "network", "smoke-signals"],
+                          ["set", device.path, "weather", "fine"],
+                          ["set", device.path, "cloud", "ftp://host/"],
+                          ["set", device.path, "cloud", "webdav+http://example.org/"],
+                          ["set", device.path, "cloud", "webdav+https://u:p@example.org/"],
+                          ["setting", device.path, "db/none"], ["fire", device.path, "1"],
+                          ["fire", device.path, "x"], ["exec", device.path, "--", "true"],
+                          ["exec", device.path, "true"]):
+            result = subprocess.run([TOOL, *arguments], capture_output=True, text=True,
+                                    stdin=subprocess.DEVNULL)
+            self.assertNotEqual(result.returncode, 0, arguments)
+            if arguments:
+                self.assertEqual(result.stderr.count("\n"), 1, (arguments, result.stderr))
+
+    def test_every_verb_has_help(self):
+        for verb in ("create", "start", "stop", "exec", "install", "remove", "list", "set",
+                     "setting", "alarms", "fire", "log"):
+            result = subprocess.run([TOOL, verb, "--help"], capture_output=True, text=True)
+            self.assertEqual(result.returncode, 0)
+            self.assertIn("usage: quarn-device " + verb, result.stdout)
+
+
+class Life(TestCase):
+    def test_start_and_stop_are_idempotent_and_leave_no_process(self):
+        device = self.new_device()
+        device.start()
+        device.start()
+        device.exec("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus", "--object-path",
+                    "/", "--method", "org.freedesktop.DBus.GetId")
+        device.stop()
+        device.stop()
+        marker = device.path.encode()
+        for entry in os.listdir("/proc"):
+            if not entry.isdigit() or int(entry) == os.getpid():
+                continue
+            try:
+                with open("/proc/%s/cmdline" % entry, "rb") as file:
+                    self.assertNotIn(marker, file.read())
+            except OSError:
+                continue
+
+    def test_exec_sees_the_devices_own_apps_and_tmp(self):
+        device = self.new_device()
+        device.start()
+        device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {"data/x": b"x"}))
+        device.exec("sh", "-c", "echo made > /tmp/made && cat /opt/usr/apps/org.example.a/data/x")
+        with open(os.path.join(device.path, "root/tmp/made")) as file:
+            self.assertEqual(file.read(), "made\n")
+        self.assertFalse(os.path.exists("/tmp/made"))
+
+    def test_exec_passes_the_exit_status_on(self):
+        device = self.new_device()
+        device.start()
+        self.assertEqual(device.exec("sh", "-c", "exit 23", check=False).returncode, 23)
+        self.assertEqual(device.exec("no-such-command", check=False).returncode, 127)
+
+    def test_exec_keeps_the_current_directory_and_arguments_below_tmp(self):
+        device = self.new_device()
+        device.start()
+        script = self.path("script")
+        with open(script, "w") as file:
+            file.write("#!/bin/sh\npwd\n")
+        os.chmod(script, 0o755)
+        self.assertEqual(device.exec(script, cwd=self.directory).stdout.strip(), self.directory)
+
+    def test_stop_leaves_nothing_of_the_hosts_tmp_in_the_devices(self):
+        device = self.new_device()
+        device.start()
+        device.exec("true", cwd=self.directory)
+        device.stop()
+        self.assertEqual(os.listdir(os.path.join(device.path, "root/tmp")), [])
+
+    def test_stop_ends_what_exec_started(self):
+        device = self.new_device()
+        device.start()
+        child = subprocess.Popen([TOOL, "exec", device.path, "--", "sleep", "1000"])
+        wait_until(lambda: os.readlink("/proc/%d/exe" % child.pid).endswith("sleep")
+                   or os.path.basename(os.readlink("/proc/%d/exe" % child.pid)) == "coreutils",
+                   "sleep runs")
+        device.stop()
+        self.assertNotEqual(child.wait(timeout=20), 0)
+
+    def test_two_devices_run_at_once(self):
+        first, second = self.new_device(), self.new_device()
+        for device, name in ((first, "org.example.one"), (second, "org.example.two")):
+            device.start()
+            device.install(make_source(self.path(name), name, "1.0.0", {}))
+        self.assertEqual(first.exec("ls", "/opt/usr/apps").stdout, "org.example.one\n")
+        self.assertEqual(second.exec("ls", "/opt/usr/apps").stdout, "org.example.two\n")
+
+
+class Packages(TestCase):
+    def test_install_sets_owner_mode_and_label_and_makes_the_data_folders(self):
+        device = self.new_device()
+        device.install(make_source(self.path("src"), "org.example.a", "1.0.0",
+                                   {"data/x": (b"x", 0o4751), "data/link": ("->", "/nowhere"),
+                                    "res/r": b"r"}))
+        for folder in ("data", "shared/data", "shared/trusted"):
+            self.assertTrue(os.path.isdir(device.app_path("org.example.a", folder)))
+        path = device.app_path("org.example.a", "data/x")
+        status = os.stat(path)
+        self.assertEqual((status.st_uid, status.st_gid), (5000, 5000))
+        self.assertEqual(stat.S_IMODE(status.st_mode), 0o4751)
+        self.assertEqual(label(path), "org.example.a")
+        link = device.app_path("org.example.a", "data/link")
+        self.assertEqual(os.readlink(link), "/nowhere")
+        self.assertEqual(os.lstat(link).st_uid, 5000)
+
+    def test_list_json_has_every_member(self):
+        device = self.new_device()
+        device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {}, preload=True,
+                                   storage="external", type="wgt"))
+        self.assertEqual(device.packages(),
+                         [{"id": "org.example.a", "version": "1.0.0", "type": "wgt",
+                           "preload": True, "storage": "external",
+                           "root": "/opt/usr/apps/org.example.a", "hidden": False}])
+
+    def test_an_update_keeps_the_applications_data(self):
+        device = self.new_device()
+        device.install(make_source(self.path("v1"), "org.example.a", "1.0.0",
+                                   {"data/x": b"one", "res/old": b""}))
+        with open(device.app_path("org.example.a", "data/x"), "wb") as file:
+            file.write(b"the user's own")
+        device.install(make_source(self.path("v2"), "org.example.a", "2.0.0",
+                                   {"data/x": b"two", "data/new": b"new", "res/new": b""}))
+        with open(device.app_path("org.example.a", "data/x"), "rb") as file:
+            self.assertEqual(file.read(), b"the user's own")
+        self.assertTrue(os.path.exists(device.app_path("org.example.a", "data/new")))
+        self.assertEqual(os.listdir(device.app_path("org.example.a", "res")), ["new"])
+        self.assertEqual(device.packages()[0]["version"], "2.0.0")
+
+    def test_ids_and_versions_that_leave_their_folder_are_refused(self):
+        device = self.new_device()
+        for number, (package, version) in enumerate((("../x", "1"), ("a/b", "1"), ("", "1"),
+                                                     ("..", "1"), ("ok", "../1"), ("ok", ""))):
+            source = make_source(self.path("s%d" % number), package, version, {})
+            self.assertEqual(device.call("install", source, check=False).returncode, 1)
+        self.assertEqual(device.packages(), [])
+
+    def test_remove_takes_everything_away(self):
+        device = self.new_device()
+        device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {"data/x": b"x"}))
+        device.remove("org.example.a")
+        self.assertEqual(device.packages(), [])
+        self.assertFalse(os.path.exists(device.app_path("org.example.a")))
+
+
+class State(TestCase):
+    def test_settings_survive(self):
+        device = self.new_device()
+        device.setting("db/private/quarn/backup_status", "1")
+        device.start()
+        device.stop()
+        self.assertEqual(device.setting("db/private/quarn/backup_status"), "1")
+
+    def test_a_cloud_password_comes_from_standard_input_and_stays_private(self):
+        device = self.new_device()
+        device.call("set", "cloud", "webdav+https://cloud.example.org/dav", "--user", "ada",
+                    input="secret word\n")
+        path = os.path.join(device.path, "state/cloud.conf")
+        self.assertEqual(stat.S_IMODE(os.stat(path).st_mode), 0o600)
+        with open(path) as file:
+            text = file.read()
+        self.assertIn("user=ada", text)
+        self.assertIn("password=secret word", text)
+
+    def test_alarms_json_is_an_array(self):
+        device = self.new_device()
+        self.assertEqual(json.loads(device.call("alarms", "--json").stdout), [])
+
+
+if __name__ == "__main__":
+    unittest.main()
