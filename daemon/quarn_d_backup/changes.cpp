@@ -10,7 +10,7 @@
 namespace {
 
 constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
-constexpr int kMaxBackupMegabytes = kMaxBackupSize / (1024 * 1024);
+constexpr int kMaxBackupMegabytes = kMaxBackupSize >> 20;
 constexpr char kIndexSeparator = '/';  // in no id and no version
 
 std::string crc_index_key(const std::string &pkg_id, const std::string &version) {

@@ -15,7 +15,7 @@ namespace {
 constexpr char kWaitedForSuffix[] = ".waited_for.";
 constexpr char kArchiveSuffix[] = ".zip";
 // Some forty thousand packages; a longer one would not fit the daemon's memory.
-constexpr std::uint64_t kMaxAppListSize = 4 * 1024 * 1024;
+constexpr std::uint64_t kMaxAppListSize = std::uint64_t{4} << 20;
 
 /** A transfer of the application list. */
 struct app_list_transfer {
@@ -234,7 +234,7 @@ void request_folder_deletion(backup_context *ctx, const cleanup_kind &kind,
   const int ret = backup_trans_delete_folder_ors_async(cloud_handler(), folder.c_str(), held.get(),
                                                        kind.delete_callback);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
-    held.release();
+    static_cast<void>(held.release());
     return;
   }
   LOGE("backup_trans_delete_folder_ors_async failed... %d", ret);
@@ -476,8 +476,8 @@ void delete_other_pkg_version_in_cloud(backup_context *ctx) {
   }
 }
 
-void delete_other_version_in_cloud(backup_context *ctx, std::string serial, std::string pkg_id,
-                                   std::string version) {
+void delete_other_version_in_cloud(backup_context *ctx, const std::string &serial,
+                                   const std::string &pkg_id, const std::string &version) {
   auto record = std::make_unique<cleanup_listing>();
   record->ctx = share_backup_context(ctx);
   record->folder = package_folder(serial, pkg_id) + "/";

@@ -254,8 +254,8 @@ int upload_app_list(backup_context *ctx);
 void delete_other_backup_items_in_cloud(backup_context *ctx);
 /** Delete the other versions of every package that was uploaded. */
 void delete_other_pkg_version_in_cloud(backup_context *ctx);
-void delete_other_version_in_cloud(backup_context *ctx, std::string serial, std::string pkg_id,
-                                   std::string version);
+void delete_other_version_in_cloud(backup_context *ctx, const std::string &serial,
+                                   const std::string &pkg_id, const std::string &version);
 
 /* ---- changes.cpp --------------------------------------------------------------- */
 
