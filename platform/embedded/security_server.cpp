@@ -24,6 +24,8 @@ namespace {
 using embedded::LabelKind;
 using embedded::Links;
 
+constexpr char kProc[] = "/proc/";
+
 std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
 /**
@@ -57,7 +59,9 @@ bool relabel_tree(int fd, const std::string &label) {
 }
 
 bool relabel(const std::string &path, const std::string &label) {
-  const int fd = open(path.c_str(), O_PATH | O_NOFOLLOW | O_DIRECTORY | O_CLOEXEC);
+  // A descriptor's name leads to what the caller holds; any other link is not followed.
+  const int follow = path.compare(0, sizeof(kProc) - 1, kProc) == 0 ? 0 : O_NOFOLLOW;
+  const int fd = open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC | follow);
   if (fd < 0) return false;
   const bool done = relabel_tree(fd, label);
   close(fd);

@@ -33,6 +33,10 @@ int security_server_label_access(const char *path, const char *label);
 int security_server_perm_begin(security_server_perm_h *handle);
 /**
  * Ask that the directory @p path and everything under it take a label.
+ *
+ * The daemon names the directory as above, by a descriptor that it holds until
+ * after the commit; the service follows that name, and no link below it.
+ *
  * @param path_type #SECURITY_SERVER_PATH_ANY_LABEL, which takes one more
  *                  argument: const char *label
  */
