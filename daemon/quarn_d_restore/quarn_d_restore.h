@@ -7,6 +7,7 @@
 
 #include <glib.h>
 #include <json-c/json.h>
+#include <sys/stat.h>
 
 #include <string>
 #include <vector>
@@ -29,6 +30,7 @@ struct pkg_restore_context {
   std::string root;
   bool backup_enabled = true;
   void *client = nullptr; /**< client_cb_data of a waiting request */
+  bool abandoned = false; /**< the waiting request is gone; the engine deletes the context */
 };
 
 /** Restore candidates still expected, in the order given. */
@@ -41,38 +43,140 @@ extern std::string serial_num_user_select;
 extern void *g_restore_cb_data;
 
 /* ---- attributes.cpp ---- */
+
+/**
+ * Look one path up in a file-info table. @p path begins with @p root and "/".
+ * @param[out] label points into the table
+ * @return 0, 19 without a table, 31 when the entry or a member of it is missing
+ */
 int get_file_info_from_backup(json_object *table, const char *pkgid, const char *root,
                               const char *path, int *mode, unsigned int *uid, unsigned int *gid,
                               char **label);
+/** Give a directory or regular file its mode, the application owner and its label. @return 1, 0 */
 int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table);
+/**
+ * The same for an object that is open already (O_PATH is enough), so that what
+ * is changed is what was looked at; @p path names it in messages and the table.
+ */
+int restore_object_info(int fd, const struct stat &status, const char *path, const char *pkgid,
+                        const char *root, json_object *table);
+/** True for the labels that a restore may write itself. @p path is for messages. */
 int is_known_exception_label(const char *path, const char *label, const char *pkgid);
+/** chmod() of an open object; a link has no mode of its own. @return 0, or -1 with errno */
+int change_object_mode(int fd, const struct stat &status, mode_t mode);
+/** chown() of an open object, a link itself included. @return 0, or -1 with errno */
+int change_object_owner(int fd, uid_t uid, gid_t gid);
 
 /* ---- walk.cpp ---- */
+
+/** Modes, owners and labels of the whole package from the unpacked table. @return 1, 0 */
 int restore_app_info(const char *pkgid, const char *root);
+/** One directory of it and everything below. @return 1 when every entry was restored, else 0 */
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table);
+/** Make the links that the table lists. @return 1 */
 int restore_symlnk(const char *pkgid, const char *root, json_object *table);
+/** Empty the three data directories but for the snapshot. */
 void clear_app_dir(const char *pkgid, const char *root);
 
-/* ---- snapshot.cpp ---- */
+/* ---- snapshot.cpp: the caller holds package_data_mutex, where not told otherwise ---- */
+
+/** Copy the package's data aside. @return 0, 36, or what writing the table gave */
 int temp_backup_initial_app_data(const char *pkgid, const char *root);
+/** Copy what lies below @p dir into the snapshot @p temp_dir. @return 1, 0 when anything failed */
 int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
                        file_info_table_h *table);
+/** Put the snapshot back and remove it; may be repeated when it was interrupted. @return 0 */
 int rollback_to_initial_app_data(const char *pkgid, const char *root);
+/** Copy what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
 int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
+/** Remove the snapshot, its table first: from then on the present data counts. */
+void discard_snapshot(const char *pkgid, const char *root);
+/**
+ * Undo what a daemon that died in a restore of the package left: a complete
+ * snapshot is put back, an incomplete one removed. Takes package_data_mutex.
+ * @return true when data was put back
+ */
+bool recover_interrupted_restore(const char *pkgid, const char *root);
+/** The same for every installed package. */
+void recover_interrupted_restores();
+
+/** Told the name of each step of a restore; null but in tests. */
+extern void (*restore_step_hook)(const char *step);
+inline void restore_step(const char *step) {
+  if (restore_step_hook != nullptr) restore_step_hook(step);
+}
 
 /* ---- pipeline.cpp ---- */
+
+/**
+ * Restore one installed package: from the cloud later, by a download, or from
+ * the phone-transfer companion at once.
+ * @return 0, 42 when the download was refused, from the companion the unpacking's result
+ */
 int restore_app_data(const char *appid, pkg_restore_context *ctx);
+/**
+ * Count one download as done. With none left the restore ends: a waiting
+ * request's loop is quit, any other context is deleted and its icon shown.
+ */
 void check_package_restore_complete(pkg_restore_context *ctx);
 
+/* ---- report.cpp ---- */
+
+enum class restore_stage { downloading, snapshot, unpacking, attributes, finished };
+
+/** What became of a package; none while it is not settled. */
+enum class restore_outcome {
+  none,
+  restored,
+  rolled_back, /**< the data is as it was before */
+  failed,      /**< nothing was changed; from the companion, the data may be incomplete */
+  skipped      /**< not attempted */
+};
+
+/** One step of one package's restore; valid during the call only. */
+struct restore_progress {
+  const char *package = "";
+  restore_stage stage = restore_stage::downloading;
+  restore_outcome outcome = restore_outcome::none; /**< settled with restore_stage::finished */
+  int result = QUARN_OK;                           /**< result code, 0 while running */
+};
+using restore_progress_sink = void (*)(const restore_progress &progress);
+
+/** Follow what restores do. The sink must not block; null ends it. */
+void set_restore_progress_sink(restore_progress_sink sink);
+/** Tell the sink, if there is one, of a step or of the end of a package's restore. */
+void report_restore_step(const std::string &package, restore_stage stage);
+void report_restore_end(const std::string &package, restore_outcome outcome, int result);
+/** Keep the record of the client that switched restore mode on, in place of an earlier one. */
+void keep_restore_record(void *record);
+/**
+ * Restore mode is over: the kept client gets "restore_stop", from the main
+ * loop, as soon as no restore of an installed package is outstanding.
+ */
+void end_restore_report();
+/** True while a "restore_stop" is about to be sent. */
+bool restore_report_pending();
+/** A restore of an installed package began (1) or ended (-1). */
+void count_outstanding_restore(int change);
+
 /* ---- install_monitor.cpp ---- */
+
+/** Follow package events. @return 1 when the monitor runs, else 0 */
 int start_install_monitor();
+/** @return 1 */
 int stop_install_monitor();
+/** Take a package off the candidate list. @return 1 when it was on it, else 0 */
 int package_to_be_restored(const char *pkgid);
 /** How the engine ends restore mode; set once at start. */
 void set_restore_disable(int (*disable)());
 
 /* ---- app_list.cpp ---- */
+
+/**
+ * Answer a client's request for the application list: the cloud's, or for
+ * client 1 this device's. @return 0, or 42 when it could not be had
+ */
 int get_app_list(int client, void *invocation);
 
 #endif

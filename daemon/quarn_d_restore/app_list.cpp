@@ -1,0 +1,106 @@
+#include <memory>
+
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_dbus_client.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr int kPellixClient = 1;
+constexpr char kFailed[] = "failed";
+constexpr char kNone[] = "none";
+
+/** One request for the list in the cloud. */
+struct list_request {
+  std::string local_path;
+  std::string cloud_path;
+  void *invocation;
+};
+
+/**
+ * A file of the request's own beside the staged list: the staged one is a
+ * backup run's, which would upload what another download put in its place.
+ */
+std::string next_local_path() {
+  static unsigned int number = 0;
+  return std::string(kLocalAppListPath) + "." + std::to_string(++number);
+}
+
+void remove_list(const std::string &path) {
+  if (file_exist(path.c_str())) delete_file(path.c_str());
+}
+
+/** The downloaded list, malloc'd; null with the reason logged. */
+CString read_list(const std::string &path) {
+  if (!file_exist(path.c_str())) {
+    LOGE("there isn't app list file...");
+    return nullptr;
+  }
+  char *raw = nullptr;
+  const bool read = read_data_from_file(path.c_str(), &raw);
+  CString text(raw);
+  if (!read) {
+    LOGE("couldn't read app list...");
+    return nullptr;
+  }
+  LOGI("app list : %s", text.get());
+  return text;
+}
+
+void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char * /*unused*/) {
+  if (user_data == nullptr) LOGE("cb user_data is NULL...");
+  g_assert(user_data != nullptr);
+  const std::unique_ptr<list_request> request(static_cast<list_request *>(user_data));
+  CString text;
+  if (error != BACKUP_TRANS_ERROR_NONE) {
+    LOGE("__get_app_list_resp_cb failed...err_code[%d]", error);
+  } else {
+    LOGI("backup trans success : app list download");
+    text = read_list(request->local_path);
+  }
+  remove_list(request->local_path);
+  if (text == nullptr) {
+    quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kNone, request->invocation);
+  } else {
+    quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), request->invocation);
+  }
+  request_power_lock(false);
+}
+
+int get_pellix_list(void *invocation) {
+  const CString text(get_app_list_for_pellix());
+  if (text == nullptr) {
+    quarn_dbus_get_app_list_cb(QUARN_FAILED, kFailed, invocation);
+    return QUARN_FAILED;
+  }
+  quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), invocation);
+  return QUARN_OK;
+}
+
+}  // namespace
+
+int get_app_list(int client, void *invocation) {
+  if (client == kPellixClient) return get_pellix_list(invocation);
+  auto request = std::make_unique<list_request>();
+  request->local_path = next_local_path();
+  request->cloud_path = kCloudAppListPath;
+  request->invocation = invocation;
+  int result = BACKUP_TRANS_ERROR_LOCAL_FILE;
+  if (prepare_staging_directory()) {
+    result = backup_trans_download_file_ors_async(cloud_handler(), request->cloud_path.c_str(),
+                                                  request->local_path.c_str(), request.get(),
+                                                  __get_app_list_resp_cb, BACKUP_TRANS_OPTION_NONE);
+  }
+  if (result != BACKUP_TRANS_ERROR_NONE) {
+    LOGE("backup_trans_download_file_ors_async failed... %d", result);
+    remove_list(request->local_path);
+    quarn_dbus_get_app_list_cb(QUARN_TRANSFER_FAILED, kNone, invocation);
+    return QUARN_FAILED;
+  }
+  // Until the client has its answer the daemon is not idle.
+  request_power_lock(true);
+  static_cast<void>(request.release());
+  return QUARN_OK;
+}

@@ -1,0 +1,155 @@
+#include <fcntl.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform_security_server.h"
+#include "platform_smack.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr char kModeKey[] = "0";
+constexpr char kUidKey[] = "1";
+constexpr char kGidKey[] = "2";
+constexpr char kLabelKey[] = "3";
+
+constexpr char kDatabaseLabel[] = "wrt::db_origin";
+constexpr char kNativeSuffix[] = ".native";
+
+constexpr mode_t kPermissionBits = 07777;
+constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
+
+/** A member of the entry, null when it is missing or of another type. */
+json_object *member(json_object *entry, const char *key, json_type type) {
+  json_object *value = nullptr;
+  if (!json_object_object_get_ex(entry, key, &value)) return nullptr;
+  return json_object_is_type(value, type) ? value : nullptr;
+}
+
+}  // namespace
+
+int get_file_info_from_backup(json_object *table, const char * /*pkgid*/, const char *root,
+                              const char *path, int *mode, unsigned int *uid, unsigned int *gid,
+                              char **label) {
+  if (table == nullptr) {
+    LOGE("file info for %s not exist...", path);
+    return QUARN_NO_FILE_INFO;
+  }
+  const std::size_t prefix = std::strlen(root) + 1;
+  const char *key = std::strlen(path) > prefix ? path + prefix : "";
+  json_object *entry = nullptr;
+  if (!json_object_object_get_ex(table, key, &entry)) {
+    LOGI("cannot get file info : %s", path);
+    return QUARN_UNREADABLE;
+  }
+  json_object *value = member(entry, kModeKey, json_type_int);
+  if (value == nullptr) {
+    LOGE("cannot get permission info...");
+    return QUARN_UNREADABLE;
+  }
+  *mode = json_object_get_int(value);
+  value = member(entry, kUidKey, json_type_int);
+  if (value == nullptr) {
+    LOGE("cannot get uid info...");
+    return QUARN_UNREADABLE;
+  }
+  *uid = static_cast<unsigned int>(json_object_get_int64(value));
+  value = member(entry, kGidKey, json_type_int);
+  if (value == nullptr) {
+    LOGE("cannot get gid info...");
+    return QUARN_UNREADABLE;
+  }
+  *gid = static_cast<unsigned int>(json_object_get_int64(value));
+  value = member(entry, kLabelKey, json_type_string);
+  if (value == nullptr) {
+    LOGE("cannot get smack info...");
+    return QUARN_UNREADABLE;
+  }
+  *label = const_cast<char *>(json_object_get_string(value));
+  return QUARN_OK;
+}
+
+int change_object_mode(int fd, const struct stat &status, mode_t mode) {
+  if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode)) {
+    errno = EOPNOTSUPP;
+    return -1;
+  }
+  // The descriptor may be of the O_PATH kind, which fchmod() refuses.
+  return chmod(("/proc/self/fd/" + std::to_string(fd)).c_str(), mode & kPermissionBits);
+}
+
+int change_object_owner(int fd, uid_t uid, gid_t gid) {
+  return fchownat(fd, "", uid, gid, AT_EMPTY_PATH);
+}
+
+int restore_object_info(int fd, const struct stat &status, const char *path, const char *pkgid,
+                        const char *root, json_object *table) {
+  int stored_mode = 0;
+  unsigned int uid = 0;
+  unsigned int gid = 0;
+  char *label = nullptr;
+  if (get_file_info_from_backup(table, pkgid, root, path, &stored_mode, &uid, &gid, &label) !=
+      QUARN_OK) {
+    return 0;
+  }
+  // The set-id bits wait for the owner: the file must never run as the daemon's
+  // user, and a change of owner clears them anyway.
+  const mode_t mode = static_cast<mode_t>(stored_mode) & kPermissionBits;
+  if (change_object_mode(fd, status, mode & ~kSetIdBits) < 0) {
+    LOGE("chmod failed");
+    return 0;
+  }
+  if (change_object_owner(fd, kAppUid, kAppGid) < 0) {
+    LOGE("chown: error \n");
+    return 0;
+  }
+  if ((mode & kSetIdBits) != 0 && change_object_mode(fd, status, mode) < 0) {
+    LOGE("chmod failed");
+    return 0;
+  }
+  if (label[0] == '\0') {
+    LOGE("error : there isn't smack info of %s", path);
+    return 0;
+  }
+  const std::string object = fd_path(fd);
+  CString current;
+  int result = smack_getlabel(object.c_str(), out(current), SMACK_LABEL_ACCESS);
+  if (result != 0) {
+    LOGE("error : cannot get smack label of %s (err=%d)", path, result);
+    return 0;
+  }
+  if (current != nullptr && std::strcmp(label, current.get()) == 0) return 1;
+  if (is_known_exception_label(path, label, pkgid) == 0) {
+    LOGE("fail : unknown smack label...");
+    return 0;
+  }
+  result = security_server_label_access(object.c_str(), label);
+  if (result != SECURITY_SERVER_SUCCESS) {
+    LOGE("fail : security_server_label_access...(err=%d)", result);
+    return 0;
+  }
+  LOGI("smack label setted for %s", path);
+  return 1;
+}
+
+int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table) {
+  const UniqueFd object = safe_open(path, O_PATH | O_NOFOLLOW);
+  struct stat status = {};
+  // What cannot be opened is left without a type, so that its mode cannot be changed either.
+  if (object && fstat(object.get(), &status) != 0) status = {};
+  return restore_object_info(object.get(), status, path, pkgid, root, table);
+}
+
+int is_known_exception_label(const char *path, const char *label, const char *pkgid) {
+  const std::string native = std::string(pkgid) + kNativeSuffix;
+  if (std::strcmp(label, kDatabaseLabel) == 0 || native == label) {
+    LOGI("OK : smack label of %s is known exception label", path);
+    return 1;
+  }
+  LOGE("Critical! : smack label %s of %s is unknown exception label", label, path);
+  return 0;
+}

@@ -1,0 +1,281 @@
+#include <fcntl.h>
+
+#include <cerrno>
+#include <utility>
+
+#include "platform_security_server.h"
+#include "platform_smack.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_files.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_log.h"
+
+namespace {
+
+using Transaction = Handle<security_server_transaction, &security_server_perm_abort>;
+
+constexpr char kLinkListKey[] = "quarn_symbolic_info";
+
+/** What stays the same in the walk over one package. */
+struct walk_context {
+  const char *pkgid;
+  const char *root;
+  json_object *table;
+  restore_files files;
+};
+
+bool same_object(const struct stat &a, const struct stat &b) {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
+}
+
+int walk_directory(const walk_context &ctx, const std::string &dir, const struct stat *checked);
+
+/** One directory of the walk; what lies in it follows once its parent is closed. */
+using Found = std::vector<std::pair<std::string, struct stat>>;
+
+int restore_entry(const walk_context &ctx, int dir, const char *name, const std::string &path,
+                  Found *found) {
+  const UniqueFd object(openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  struct stat status = {};
+  const int result = object ? fstat(object.get(), &status) : -1;
+  if (result != 0) {
+    const bool vanished = errno == ENOENT;
+    LOGE("error : lstat for %d %s", result, path.c_str());
+    return vanished ? 1 : 0;
+  }
+  if (S_ISLNK(status.st_mode)) return 1;
+  if (S_ISDIR(status.st_mode)) {
+    found->emplace_back(path, status);
+    if (restore_object_info(object.get(), status, path.c_str(), ctx.pkgid, ctx.root, ctx.table)) {
+      return 1;
+    }
+    if (is_empty_directory(path.c_str())) {
+      LOGI("it is empty folder : %s", path.c_str());
+      return 1;
+    }
+    LOGE("fail to restore file info : %s", path.c_str());
+    return 0;
+  }
+  if (S_ISREG(status.st_mode)) {
+    if (restore_object_info(object.get(), status, path.c_str(), ctx.pkgid, ctx.root, ctx.table)) {
+      return 1;
+    }
+    LOGE("fail to restore file info : %s", path.c_str());
+    return 0;
+  }
+  LOGE("this is unexpected type : %s", path.c_str());
+  return 0;
+}
+
+int walk_directory(const walk_context &ctx, const std::string &dir, const struct stat *checked) {
+  int result = 1;
+  Found found;
+  {
+    const DirPtr handle = safe_opendir(dir.c_str());
+    struct stat opened = {};
+    if (handle == nullptr || fstat(dirfd(handle.get()), &opened) != 0 ||
+        (checked != nullptr && !same_object(*checked, opened))) {
+      LOGE("error : cannot open this path %s", dir.c_str());
+      return 0;
+    }
+    while (const dirent *entry = readdir(handle.get())) {
+      const std::string name = entry->d_name;
+      if (name == "." || name == "..") continue;
+      const std::string path = dir + "/" + name;
+      if (ctx.files.is_skipped(path)) continue;
+      restore_step("attributes");
+      if (!restore_entry(ctx, dirfd(handle.get()), name.c_str(), path, &found)) result = 0;
+    }
+  }
+  // One descriptor at a time, however deep the tree is.
+  for (const auto &[path, status] : found) {
+    if (!walk_directory(ctx, path, &status)) result = 0;
+  }
+  return result;
+}
+
+/** Read the table and remove its file; null with the reason logged. */
+JsonPtr take_table(const std::string &path) {
+  if (!file_exist(path.c_str())) {
+    LOGE("there isn't file-info file...");
+    return nullptr;
+  }
+  char *raw = nullptr;
+  const bool read = read_data_from_file(path.c_str(), &raw);
+  const CString text(raw);
+  if (!read) {
+    LOGE("cannot read file-info file...");
+    delete_file(path.c_str());
+    return nullptr;
+  }
+  JsonPtr table(json_tokener_parse(text.get()));
+  delete_file(path.c_str());
+  if (!json_object_is_type(table.get(), json_type_object)) {
+    LOGE("cannot read json info...");
+    return nullptr;
+  }
+  return table;
+}
+
+/** Everything below each data directory takes the directory's own label. */
+bool relabel_directories(const char *pkgid, const restore_files &files) {
+  security_server_perm_h raw = nullptr;
+  int result = security_server_perm_begin(&raw);
+  if (result != SECURITY_SERVER_SUCCESS) {
+    LOGE("fail : security_server_perm_begin...(err=%d)", result);
+    return false;
+  }
+  Transaction transaction(raw);
+  // Held until the commit: the service is told of the directories by these.
+  std::vector<UniqueFd> held;
+  for (const auto &dir : files.dirs) {
+    held.push_back(safe_open(dir.c_str(), O_PATH | O_DIRECTORY));
+    const std::string object = fd_path(held.back().get());
+    CString label;
+    result = held.back() ? smack_getlabel(object.c_str(), out(label), SMACK_LABEL_ACCESS) : -1;
+    if (result != 0 || label == nullptr) {
+      LOGE("error : cannot get smack label of %s (err=%d)", dir.c_str(), result);
+      return false;
+    }
+    result = security_server_perm_app_setup_path(transaction.get(), pkgid, object.c_str(),
+                                                 SECURITY_SERVER_PATH_ANY_LABEL, label.get());
+    if (result != SECURITY_SERVER_SUCCESS) {
+      LOGE("error : security_server_perm_app_setup_path %s (err=%d)", dir.c_str(), result);
+      return false;
+    }
+    LOGI("success : set smack label all files under %s", dir.c_str());
+  }
+  restore_step("relabel");
+  result = security_server_perm_commit(transaction.release());
+  if (result != SECURITY_SERVER_SUCCESS) {
+    LOGE("fail : security_server_perm_commit...(err=%d)", result);
+    return false;
+  }
+  return true;
+}
+
+bool restore_tree(const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  restore_step("table");
+  const JsonPtr table = take_table(files.table);
+  if (table == nullptr) return false;
+  restore_step("labels");
+  if (!relabel_directories(pkgid, files)) return false;
+  for (const auto &dir : files.dirs) {
+    if (!parse_app_dir_for_restore(dir.c_str(), pkgid, root, table.get())) {
+      LOGE("fail to restore directory : %s...", dir.c_str());
+      return false;
+    }
+  }
+  return true;
+}
+
+/** One element of the link list. */
+struct stored_link {
+  const char *name;
+  const char *target;
+  mode_t mode;
+  const char *label;
+};
+
+bool read_link(json_object *element, stored_link *link) {
+  json_object *name = nullptr;
+  json_object *target = nullptr;
+  json_object *perm = nullptr;
+  json_object *values[4] = {};
+  const char *const keys[4] = {"0", "1", "2", "3"};
+  const json_type types[4] = {json_type_int, json_type_int, json_type_int, json_type_string};
+  if (!json_object_object_get_ex(element, "real_name", &name) ||
+      !json_object_is_type(name, json_type_string) ||
+      !json_object_object_get_ex(element, "lnk", &target) ||
+      !json_object_is_type(target, json_type_string) ||
+      !json_object_object_get_ex(element, "perm", &perm)) {
+    return false;
+  }
+  for (int i = 0; i < 4; ++i) {
+    if (!json_object_object_get_ex(perm, keys[i], &values[i]) ||
+        !json_object_is_type(values[i], types[i])) {
+      return false;
+    }
+  }
+  link->name = json_object_get_string(name);
+  link->target = json_object_get_string(target);
+  link->mode = static_cast<mode_t>(json_object_get_int(values[0]));
+  link->label = json_object_get_string(values[3]);
+  return true;
+}
+
+/** True for a name that stays below the root: no leading slash, no "..". */
+bool stays_below(const std::string &name) {
+  if (name.empty() || name.front() == '/') return false;
+  const std::string framed = "/" + name + "/";
+  return framed.find("/../") == std::string::npos;
+}
+
+void make_link(const std::string &path, const stored_link &link) {
+  std::string name;
+  UniqueFd parent;
+  UniqueFd object;
+  struct stat status = {};
+  if (create_directory_of_file(path.c_str())) parent = safe_open_parent(path.c_str(), &name);
+  if (parent && symlinkat(link.target, parent.get(), name.c_str()) == 0) {
+    object.reset(openat(parent.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  }
+  if (!object || fstat(object.get(), &status) != 0 || !S_ISLNK(status.st_mode)) {
+    LOGE("error : fail to make lnk for %s -> %s", path.c_str(), link.target);
+    return;
+  }
+  if (change_object_mode(object.get(), status, link.mode) < 0) LOGE("chmod failed");
+  if (change_object_owner(object.get(), kAppUid, kAppGid) < 0) LOGE("chown: error \n");
+  if (link.label[0] == '\0') {
+    LOGE("error : there isn't smack info of %s", path.c_str());
+    return;
+  }
+  const std::string labelled = fd_path(parent.get()) + "/" + name;
+  const int result = smack_lsetlabel(labelled.c_str(), link.label, SMACK_LABEL_ACCESS);
+  if (result != 0) LOGE("fail : smack_lsetlabel for %s (err=%d)", path.c_str(), result);
+}
+
+}  // namespace
+
+void (*restore_step_hook)(const char *step) = nullptr;
+
+int restore_app_info(const char *pkgid, const char *root) {
+  if (restore_tree(pkgid, root)) return 1;
+  LOGE("app data restore failed, so will be cleared");
+  return 0;
+}
+
+int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
+                              json_object *table) {
+  const walk_context ctx{pkgid, root, table, restore_files(pkgid, root)};
+  return walk_directory(ctx, dir, nullptr);
+}
+
+int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table) {
+  json_object *list = nullptr;
+  if (!json_object_object_get_ex(table, kLinkListKey, &list) ||
+      !json_object_is_type(list, json_type_array)) {
+    return 1;
+  }
+  const std::size_t count = json_object_array_length(list);
+  for (std::size_t i = 0; i < count; ++i) {
+    stored_link link = {};
+    if (!read_link(json_object_array_get_idx(list, i), &link)) return 1;
+    if (!stays_below(link.name)) {
+      LOGE("refused : link outside of the application (%s)", link.name);
+      continue;
+    }
+    make_link(std::string(root) + "/" + link.name, link);
+  }
+  return 1;
+}
+
+void clear_app_dir(const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  LOGI("clearing app data backup directory");
+  clear_directory(files.dirs[0].c_str(), false);
+  clear_shared_data_dir_except_temp_backup(files.dirs[1].c_str(), files.snapshot.c_str());
+  clear_directory(files.dirs[2].c_str(), false);
+}
