@@ -285,16 +285,73 @@ def large(bin_dir, work, checks):
     table.show("Packages at the size cap")
 
 
+def others(bin_dir, work, runs, checks):
+    """A whole manual backup of the four trees against two general backup programs."""
+    sources = []
+    for kind in trees.TREES:
+        source = os.path.join(work, "source-" + kind)
+        trees.make_package(source, "org.example." + kind, "1.0.0", lambda root, k=kind: trees.make(k, root))
+        sources.append(source)
+    environment = dict(os.environ, RESTIC_PASSWORD="bench", BORG_UNKNOWN_UNENCRYPTED_REPO_ACCESS_IS_OK="yes",
+                       XDG_CACHE_HOME=os.path.join(work, "cache"), BORG_BASE_DIR=os.path.join(work, "borg"))
+    os.environ.update(environment)
+    table = Table("run", "quarnd CPU s", "wall s", "restic CPU s", "wall s", "borg CPU s", "wall s",
+                  "CPU / better", "wall / better")
+    results = {name: {"q": [], "r": [], "b": []} for name in ("first", "unchanged")}
+    for run in range(runs):
+        device = Device(bin_dir, os.path.join(work, "device-others-%d" % run))
+        try:
+            for source in sources:
+                device.install(source)
+            device.client("activate")
+            pid = device.daemon_pid()
+            apps = os.path.join(device.path, "root/opt/usr/apps")
+            for name in ("first", "unchanged"):
+                before = cpu_of(pid)
+                start = time.monotonic()
+                device.client("backup")
+                results[name]["q"].append((cpu_of(pid) - before, time.monotonic() - start))
+            restic = os.path.join(work, "restic-%d" % run)
+            borg = os.path.join(work, "borg-%d" % run)
+            measure(["restic", "-q", "init", "-r", restic])
+            measure(["borg", "init", "-e", "none", borg])
+            for name in ("first", "unchanged"):
+                results[name]["r"].append(measure(["restic", "-q", "-r", restic, "backup", apps]))
+                results[name]["b"].append(measure(["borg", "create", "-C", "lz4", borg + "::" + name, apps]))
+            shutil.rmtree(restic)
+            shutil.rmtree(borg)
+        finally:
+            device.stop()
+        shutil.rmtree(device.path)
+    for name, result in results.items():
+        cpu = {key: median([one[0] for one in result[key]]) for key in "qrb"}
+        wall = {key: median([one[1] for one in result[key]]) for key in "qrb"}
+        by_cpu = cpu["q"] / min(cpu["r"], cpu["b"])
+        by_wall = wall["q"] / min(wall["r"], wall["b"])
+        table.add(name, "%.2f" % cpu["q"], "%.2f" % wall["q"], "%.2f" % cpu["r"], "%.2f" % wall["r"],
+                  "%.2f" % cpu["b"], "%.2f" % wall["b"], "%.2f" % by_cpu, "%.2f" % by_wall)
+        checks.at_most("%s run: CPU / better of restic and borg" % name, by_cpu, .5)
+        checks.at_most("%s run: wall / better of restic and borg" % name, by_wall, .5)
+    table.show("A whole manual backup of the four trees to a folder, %d runs" % runs)
+
+
+def cpu_of(pid):
+    """CPU seconds of a process and its threads so far."""
+    with open("/proc/%d/stat" % pid) as file:
+        fields = file.read().rsplit(")", 1)[1].split()
+    return (int(fields[11]) + int(fields[12])) / os.sysconf("SC_CLK_TCK")
+
+
 def main():
     parser = argparse.ArgumentParser(description=__doc__)
     parser.add_argument("--bin", required=True, help="directory of the programs")
     parser.add_argument("--short", action="store_true",
                         help="few runs, and ratios may be off by half")
-    parser.add_argument("--only", choices=("archives", "fleet", "large"), action="append")
+    parser.add_argument("--only", choices=("archives", "fleet", "large", "others"), action="append")
     options = parser.parse_args()
     checks = Checks(1.5 if options.short else 1.0)
     bin_dir = os.path.abspath(options.bin)
-    wanted = options.only or ("archives", "fleet", "large")
+    wanted = options.only or ("archives", "fleet", "large", "others")
     with tempfile.TemporaryDirectory(prefix="quarn-bench-") as work:
         if "archives" in wanted:
             archives(os.path.join(bin_dir, "archive_tool"), work, 3 if options.short else 7, checks)
@@ -302,6 +359,8 @@ def main():
             fleet(bin_dir, work, (10, 100) if options.short else (10, 100, 1000), checks)
         if "large" in wanted:
             large(bin_dir, work, checks)
+        if "others" in wanted:
+            others(bin_dir, work, 3 if options.short else 7, checks)
     if checks.failed:
         print()
         for line in checks.failed:

@@ -16,13 +16,16 @@
 #include <zip.h>
 
 #include <cstdint>
+#include <map>
 #include <mutex>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "backup_transport.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/handles.h"
 
 /* ---- file.cpp: any thread ------------------------------------------------ */
 
@@ -63,6 +66,8 @@ bool copy_file(const char *src, const char *dst);
 struct file_info_table_h {
   json_object *root = nullptr;          /**< the document; owns everything below */
   json_object *symbolic_list = nullptr; /**< "quarn_symbolic_info", borrowed */
+  /** Attribute objects by permission, owner, group and label: entries with the same share one. */
+  std::map<std::tuple<int, unsigned int, unsigned int, std::string>, JsonPtr> attributes;
 };
 
 /** Make an empty table; *@p table is null on failure. Released with release_file_info_table(). */
@@ -124,9 +129,32 @@ bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error
 void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const char *pkg_id,
                                    const char *root, int *error);
 
-/** Unpack an archive below @p destination. @return 0, 31 or 14 */
+/** What became of an archive's entries. */
+struct unzip_report {
+  unsigned int extracted = 0;
+  unsigned int refused = 0; /**< hostile: nothing of them lies below the destination */
+  unsigned int failed = 0;  /**< corrupt, or not to be written; a part may lie there */
+  /** True when the destination holds everything that the archive had. */
+  bool complete() const { return refused == 0 && failed == 0; }
+};
+
+/** Most bytes and entries that an archive may unpack to: the largest backup and its table. */
+inline constexpr std::uint64_t kMaxTableSize = 32U << 20;
+inline constexpr std::uint64_t kMaxUnpackedSize = kMaxBackupSize + kMaxTableSize;
+inline constexpr std::uint64_t kMaxArchiveEntries = 100000;
+
+/**
+ * Unpack an archive below @p destination: files are created new, mode 0600,
+ * whatever lay in their place. Does not take package_data_mutex. Entries that
+ * are refused or fail are logged and left out; @p report tells how many.
+ * @return 0, 14, or 31 for an archive that cannot be opened, is empty, or
+ *         would unpack to more than the bounds above
+ */
+int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
+               unzip_report *report);
+/** The same without a report. */
 int unzip_data(const char *pkg_id, const char *destination, const char *zip_path);
-/** Write the archive's current entry below @p destination. */
+/** Write the archive's current entry, opened raw, below @p destination. */
 bool extract_file_from_zip(const char *pkg_id, const char *destination, unzFile archive,
                            const char *name);
 

@@ -191,6 +191,18 @@ DirPtr safe_opendir(const char *path) {
   return dir;
 }
 
+DirPtr safe_opendir_at(int dir, const char *name) {
+  UniqueFd fd(openat(dir, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!fd) return nullptr;
+  DirPtr opened(fdopendir(fd.get()));
+  if (opened != nullptr) fd.release();
+  return opened;
+}
+
+bool is_dot_entry(const char *name) {
+  return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
+}
+
 int safe_mkdir_with_parents(const char *path, mode_t mode) {
   if (path == nullptr || path[0] != '/') {
     errno = EINVAL;

@@ -32,6 +32,33 @@ int safe_lstat(const char *path, struct stat *status);
 /** Open a directory for reading; null on failure. */
 DirPtr safe_opendir(const char *path);
 
+/**
+ * Open the directory @p name in the directory @p dir; null when it is a link.
+ * Walks go deeper with it and stop at kMaxDirDepth: every level holds a
+ * descriptor.
+ */
+DirPtr safe_opendir_at(int dir, const char *name);
+inline constexpr int kMaxDirDepth = 400;
+
+/** True for "." and "..". */
+bool is_dot_entry(const char *name);
+
+/** A path during a walk: goes down by one name, and back when it goes out of scope. */
+class PathStep {
+ public:
+  PathStep(std::string *path, const char *name) : path_(path), length_(path->size()) {
+    path_->push_back('/');
+    path_->append(name);
+  }
+  ~PathStep() { path_->resize(length_); }
+  PathStep(const PathStep &) = delete;
+  PathStep &operator=(const PathStep &) = delete;
+
+ private:
+  std::string *path_;
+  std::size_t length_;
+};
+
 /** Make @p path and its missing ancestors. @return 0 or -1 */
 int safe_mkdir_with_parents(const char *path, mode_t mode);
 

@@ -1,0 +1,149 @@
+#include <isa-l/crc.h>
+#include <isa-l/igzip_lib.h>
+
+#include <cstdlib>
+#include <new>
+
+#include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/handles.h"
+
+namespace {
+
+// level 2 costs what level 1 costs, and makes smaller archives than zlib's level 1
+constexpr std::uint32_t kLevel = 2;
+constexpr std::size_t kPlainChunk = 256U << 10;
+constexpr std::size_t kDeflatedChunk = 64U << 10;
+
+struct DeflateMemory {
+  isal_zstream stream;
+  unsigned char level[ISAL_DEF_LVL2_DEFAULT];
+  unsigned char plain[kPlainChunk];
+  unsigned char deflated[kDeflatedChunk];
+};
+
+struct InflateMemory {
+  inflate_state state;
+  unsigned char deflated[kDeflatedChunk];
+  unsigned char plain[kPlainChunk];
+};
+
+static_assert(sizeof(DeflateMemory) <= kCodecMemory && sizeof(InflateMemory) <= kCodecMemory,
+              "the bound on the codec's memory");
+
+template <typename T>
+Handle<T, &std::free> make_memory(bool wanted) {
+  return Handle<T, &std::free>(wanted ? static_cast<T *>(std::calloc(1, sizeof(T))) : nullptr);
+}
+
+class IsalCodec : public Codec {
+ public:
+  explicit IsalCodec(CodecUse use)
+      : out_(make_memory<DeflateMemory>(use == CodecUse::kDeflate)),
+        in_(make_memory<InflateMemory>(use == CodecUse::kInflate)) {
+    if (out_ != nullptr) {
+      isal_deflate_init(&out_->stream);
+      out_->stream.level = kLevel;
+      out_->stream.level_buf = out_->level;
+      out_->stream.level_buf_size = sizeof(out_->level);
+      out_->stream.gzip_flag = IGZIP_DEFLATE;
+      out_->stream.flush = NO_FLUSH;
+    }
+    if (in_ != nullptr) isal_inflate_init(&in_->state);
+  }
+
+  bool ready() const { return out_ != nullptr || in_ != nullptr; }
+
+  CodecResult deflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) override {
+    isal_zstream &stream = out_->stream;
+    isal_deflate_reset(&stream);
+    stream.end_of_stream = 0;
+    *totals = {};
+    CodecResult result = CodecResult::kDone;
+    bool end = false;
+    start_output(&stream);
+    for (;;) {
+      if (stream.avail_in == 0 && !end) {
+        long count = source->read(out_->plain, kPlainChunk, &end);
+        if (count < 0) {
+          result = CodecResult::kSourceFailed;
+          count = 0;
+        }
+        if (count == 0) end = true;
+        totals->crc = isal_codec_crc32(totals->crc, out_->plain, static_cast<std::size_t>(count));
+        totals->plain += static_cast<std::uint64_t>(count);
+        stream.next_in = out_->plain;
+        stream.avail_in = static_cast<std::uint32_t>(count);
+        stream.end_of_stream = end ? 1 : 0;
+      }
+      if (isal_deflate(&stream) != COMP_OK) return CodecResult::kCorrupt;
+      const bool finished = stream.internal_state.state == ZSTATE_END;
+      if (stream.avail_out > 0 && !finished) continue;
+      const std::size_t made = kDeflatedChunk - stream.avail_out;
+      if (made > 0 && !sink->write(out_->deflated, made)) return CodecResult::kSinkFailed;
+      totals->deflated += made;
+      if (finished) return result;
+      start_output(&stream);
+    }
+  }
+
+  CodecResult inflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) override {
+    inflate_state &state = in_->state;
+    isal_inflate_reset(&state);
+    state.crc_flag = ISAL_DEFLATE;
+    state.avail_in = 0;
+    *totals = {};
+    bool end = false;
+    start_output(&state);
+    for (;;) {
+      if (state.avail_in == 0 && !end) {
+        const long count = source->read(in_->deflated, kDeflatedChunk, &end);
+        if (count < 0) return CodecResult::kSourceFailed;
+        if (count == 0) end = true;
+        totals->deflated += static_cast<std::uint64_t>(count);
+        state.next_in = in_->deflated;
+        state.avail_in = static_cast<std::uint32_t>(count);
+      }
+      const std::uint32_t before_in = state.avail_in;
+      const std::uint32_t before_out = state.avail_out;
+      if (isal_inflate(&state) < ISAL_DECOMP_OK) return CodecResult::kCorrupt;
+      if (before_in > 0 && state.avail_in == before_in && state.avail_out == before_out) {
+        return CodecResult::kCorrupt;
+      }
+      const bool finished = state.block_state == ISAL_BLOCK_FINISH;
+      const bool cut_off = !finished && end && state.avail_in == 0 && state.avail_out > 0;
+      if (state.avail_out > 0 && !finished && !cut_off) continue;
+      const std::size_t made = kPlainChunk - state.avail_out;
+      totals->crc = isal_codec_crc32(totals->crc, in_->plain, made);
+      totals->plain += made;
+      if (made > 0 && !sink->write(in_->plain, made)) return CodecResult::kSinkFailed;
+      if (cut_off) return CodecResult::kCorrupt;
+      if (finished) return CodecResult::kDone;
+      start_output(&state);
+    }
+  }
+
+ private:
+  void start_output(isal_zstream *stream) {
+    stream->next_out = out_->deflated;
+    stream->avail_out = kDeflatedChunk;
+  }
+  void start_output(inflate_state *state) {
+    state->next_out = in_->plain;
+    state->avail_out = kPlainChunk;
+  }
+
+  Handle<DeflateMemory, &std::free> out_;
+  Handle<InflateMemory, &std::free> in_;
+};
+
+}  // namespace
+
+std::unique_ptr<Codec> make_isal_codec(CodecUse use) {
+  std::unique_ptr<IsalCodec> codec(new (std::nothrow) IsalCodec(use));
+  if (codec == nullptr || !codec->ready()) return nullptr;
+  return codec;
+}
+
+std::uint32_t isal_codec_crc32(std::uint32_t crc, const void *data, std::size_t size) {
+  return crc32_gzip_refl(crc, static_cast<const unsigned char *>(data), size);
+}

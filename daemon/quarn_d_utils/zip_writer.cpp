@@ -1,0 +1,395 @@
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "quarn_common.h"
+#include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/working_files.h"
+#include "quarn_log.h"
+
+std::mutex package_data_mutex;
+
+namespace {
+
+constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
+constexpr int kLevel = 1;
+constexpr mode_t kArchiveMode = 0600;
+/** Name flag of the zip format: the entry's name is UTF-8. */
+constexpr uLong kUtf8Name = 1UL << 11;
+constexpr uLong kMadeByDefault = 0;
+
+/**
+ * The archive file under minizip. It keeps the last bytes in memory, because the sizes of an entry
+ * are written into its header after its data: most of those patches then cost no system call.
+ */
+class ArchiveFile {
+ public:
+  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) { buffer_.reserve(kBuffer); }
+  ArchiveFile(const ArchiveFile &) = delete;
+  ArchiveFile &operator=(const ArchiveFile &) = delete;
+
+  bool is_open() const { return static_cast<bool>(fd_); }
+
+  zlib_filefunc64_def functions() {
+    zlib_filefunc64_def table = {};
+    table.zopen64_file = [](voidpf self, const void *, int) { return self; };
+    table.zread_file = [](voidpf, voidpf, void *, uLong) -> uLong { return 0; };
+    table.zwrite_file = [](voidpf, voidpf self, const void *data, uLong size) -> uLong {
+      return of(self)->write(static_cast<const char *>(data), size) ? size : 0;
+    };
+    table.ztell64_file = [](voidpf, voidpf self) -> ZPOS64_T { return of(self)->position_; };
+    table.zseek64_file = [](voidpf, voidpf self, ZPOS64_T offset, int origin) -> long {
+      return of(self)->seek(offset, origin);
+    };
+    table.zclose_file = [](voidpf, voidpf self) -> int { return of(self)->finish() ? 0 : EOF; };
+    table.zerror_file = [](voidpf, voidpf self) -> int { return of(self)->failed_ ? 1 : 0; };
+    table.opaque = this;
+    return table;
+  }
+
+ private:
+  static constexpr std::size_t kBuffer = 128U << 10;
+
+  static ArchiveFile *of(voidpf self) { return static_cast<ArchiveFile *>(self); }
+
+  bool write(const char *data, std::size_t size) {
+    if (failed_) return false;
+    while (size > 0) {
+      std::size_t taken = 0;
+      if (position_ < start_) {
+        // behind what is in memory already: a header patch far back
+        taken = static_cast<std::size_t>(std::min<ZPOS64_T>(size, start_ - position_));
+        if (!write_at(data, taken, position_)) return false;
+      } else {
+        const std::size_t at = static_cast<std::size_t>(position_ - start_);
+        if (at >= kBuffer) {
+          if (!flush()) return false;
+          continue;
+        }
+        taken = std::min(size, kBuffer - at);
+        if (buffer_.size() < at + taken) buffer_.resize(at + taken);
+        std::memcpy(&buffer_[at], data, taken);
+      }
+      position_ += taken;
+      data += taken;
+      size -= taken;
+    }
+    return true;
+  }
+
+  long seek(ZPOS64_T offset, int origin) {
+    const ZPOS64_T end = start_ + buffer_.size();
+    const ZPOS64_T base = origin == ZLIB_FILEFUNC_SEEK_SET   ? 0
+                          : origin == ZLIB_FILEFUNC_SEEK_CUR ? position_
+                                                             : end;
+    if (base + offset > end) return -1;
+    position_ = base + offset;
+    return 0;
+  }
+
+  bool flush() {
+    if (!write_at(buffer_.data(), buffer_.size(), start_)) return false;
+    start_ += buffer_.size();
+    buffer_.clear();
+    return true;
+  }
+
+  bool finish() {
+    const bool flushed = flush();
+    return close(fd_.release()) == 0 && flushed;
+  }
+
+  bool write_at(const char *data, std::size_t size, ZPOS64_T offset) {
+    while (size > 0) {
+      const ssize_t count =
+          TEMP_FAILURE_RETRY(pwrite(fd_.get(), data, size, static_cast<off_t>(offset)));
+      if (count <= 0) {
+        failed_ = true;
+        return false;
+      }
+      data += count;
+      offset += static_cast<ZPOS64_T>(count);
+      size -= static_cast<std::size_t>(count);
+    }
+    return true;
+  }
+
+  UniqueFd fd_;
+  std::string buffer_;     // the file's bytes from start_ on
+  ZPOS64_T start_ = 0;     // bytes before it are in the file
+  ZPOS64_T position_ = 0;  // where the next write goes
+  bool failed_ = false;
+};
+
+/** The codec of the archive that this thread is writing; entries share its memory. */
+thread_local std::unique_ptr<Codec> archive_codec;
+
+/** A file's bytes, as many as it had when it was opened. */
+class FileSource : public ByteSource {
+ public:
+  FileSource(int fd, std::uint64_t size) : fd_(fd), expected_(size) {}
+
+  long read(unsigned char *data, std::size_t size, bool *end) override {
+    // one byte more than expected shows a file that grows, which must not grow the archive
+    const std::uint64_t left = expected_ - total_;
+    const std::size_t wanted = static_cast<std::size_t>(std::min<std::uint64_t>(size, left + 1));
+    std::size_t filled = 0;
+    while (filled < wanted) {
+      const ssize_t count = TEMP_FAILURE_RETRY(::read(fd_, data + filled, wanted - filled));
+      if (count < 0) return -1;
+      if (count == 0) {
+        *end = true;
+        break;
+      }
+      filled += static_cast<std::size_t>(count);
+    }
+    if (filled > left) {
+      grew_ = true;
+      *end = true;
+      filled = static_cast<std::size_t>(left);
+    }
+    total_ += filled;
+    return static_cast<long>(filled);
+  }
+
+  bool changed() const { return grew_ || total_ != expected_; }
+
+ private:
+  int fd_;
+  std::uint64_t expected_;
+  std::uint64_t total_ = 0;
+  bool grew_ = false;
+};
+
+class EntrySink : public ByteSink {
+ public:
+  explicit EntrySink(zipFile zip) : zip_(zip) {}
+  bool write(const unsigned char *data, std::size_t size) override {
+    error_ = zipWriteInFileInZip(zip_, data, static_cast<unsigned int>(size));
+    return error_ == ZIP_OK;
+  }
+  int error() const { return error_; }
+
+ private:
+  zipFile zip_;
+  int error_ = ZIP_OK;
+};
+
+bool needs_utf8_flag(const char *name) {
+  for (const char *c = name; *c != '\0'; ++c) {
+    if (static_cast<unsigned char>(*c) >= 0x80) return g_utf8_validate(name, -1, nullptr) != FALSE;
+  }
+  return false;
+}
+
+int open_entry(zipFile zip, const char *name) {
+  constexpr int kRaw = 1;
+  return zipOpenNewFileInZip4_64(zip, name, nullptr, nullptr, 0, nullptr, 0, nullptr, Z_DEFLATED,
+                                 kLevel, kRaw, -MAX_WBITS, DEF_MEM_LEVEL, Z_DEFAULT_STRATEGY,
+                                 nullptr, 0, kMadeByDefault, needs_utf8_flag(name) ? kUtf8Name : 0,
+                                 0);
+}
+
+/** One open file's bytes as the entry @p name. */
+bool add_open_file(zipFile zip, const char *path, const char *name, int fd, int *error) {
+  struct stat status {};
+  if (fstat(fd, &status) != 0 || !S_ISREG(status.st_mode)) {
+    LOGE("fopen() failed, file is NULL");
+    *error = QUARN_REFUSED;
+    return false;
+  }
+  if (archive_codec == nullptr) archive_codec = make_codec(CodecUse::kDeflate);
+  if (archive_codec == nullptr) {
+    LOGE("calloc() failed, buf is NULL");
+    *error = QUARN_REFUSED;
+    return false;
+  }
+  const int opened = open_entry(zip, name);
+  if (opened != ZIP_OK) {
+    LOGE("zipOpenNewFileInZip() failed, zip_err = [%d]", opened);
+    *error = QUARN_REFUSED;
+    return false;
+  }
+  FileSource source(fd, static_cast<std::uint64_t>(status.st_size));
+  EntrySink sink(zip);
+  CodecTotals totals;
+  const CodecResult result = archive_codec->deflate(&source, &sink, &totals);
+  bool added = result == CodecResult::kDone;
+  if (result == CodecResult::kSinkFailed) {
+    LOGE("zipWriteInFileInZip() failed, zip_err = [%d]", sink.error());
+  } else if (!added) {
+    LOGE("cannot read %s", path);
+  } else if (source.changed()) {
+    LOGE("file changed while it was archived : %s", path);
+    added = false;
+  }
+  const int closed = zipCloseFileInZipRaw64(zip, totals.plain, totals.crc);
+  if (closed != ZIP_OK && added) {
+    LOGE("zipCloseFileInZip() failed, zip_err = [%d]", closed);
+    added = false;
+  }
+  if (!added) *error = QUARN_REFUSED;
+  return added;
+}
+
+/** What a walk carries along. */
+struct Walk {
+  const std::string root;
+  const WorkingFiles working;
+  zipFile zip;
+  file_info_table_h *table;
+  int *error;
+};
+
+bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth);
+
+bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, int depth) {
+  const DirPtr dir = depth < kMaxDirDepth ? safe_opendir_at(parent, name) : nullptr;
+  if (dir == nullptr) {
+    LOGE("error : cannot open this path %s", path->c_str());
+    *walk->error = QUARN_REFUSED;
+    return false;
+  }
+  return walk_dir(walk, dir.get(), path, depth);
+}
+
+bool walk_entry(Walk *walk, int parent, const char *name, std::string *path, int depth) {
+  struct stat status {};
+  const int found = fstatat(parent, name, &status, AT_SYMLINK_NOFOLLOW);
+  if (found != 0) {
+    LOGE("error : lstat for %d %s", found, path->c_str());
+    *walk->error = QUARN_REFUSED;
+    return false;
+  }
+  if (S_ISDIR(status.st_mode)) {
+    if (!walk_subdir(walk, parent, name, path, depth + 1)) return false;
+    add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error);
+    return true;
+  }
+  if (S_ISREG(status.st_mode)) {
+    if (!is_backup_file(path->c_str())) return false;
+    add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error);
+    const UniqueFd fd(openat(parent, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    if (!fd) {
+      LOGE("fopen() failed, file is NULL");
+      *walk->error = QUARN_REFUSED;
+    } else {
+      add_open_file(walk->zip, path->c_str(), path->c_str() + walk->root.size() + 1, fd.get(),
+                    walk->error);
+    }
+    return true;
+  }
+  if (S_ISLNK(status.st_mode)) {
+    if (!is_backup_file(path->c_str())) return false;
+    add_sym_info_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status,
+                                    walk->error);
+    return true;
+  }
+  LOGE("this is unexpected type : %s", path->c_str());
+  *walk->error = QUARN_REFUSED;
+  return false;
+}
+
+bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
+  bool noted = false;
+  while (const dirent *entry = readdir(dir)) {
+    if (is_dot_entry(entry->d_name)) continue;
+    const PathStep step(path, entry->d_name);
+    if (walk->working.contain(*path)) continue;
+    if (walk_entry(walk, dirfd(dir), entry->d_name, path, depth)) noted = true;
+  }
+  return noted;
+}
+
+UniqueFd create_archive(const char *zip_path) {
+  if (file_exist(zip_path)) delete_file(zip_path);
+  return safe_open(zip_path, O_RDWR | O_CREAT | O_EXCL, kArchiveMode);
+}
+
+struct ReleaseTable {
+  void operator()(file_info_table_h *table) const { release_file_info_table(table); }
+};
+
+}  // namespace
+
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error) {
+  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  create_directory_of_file(zip_path);
+  file_info_table_h *made = nullptr;
+  ready_file_info_table(&made);
+  const std::unique_ptr<file_info_table_h, ReleaseTable> table(made);
+  if (table == nullptr) {
+    LOGE("file_info_table is NULL");
+    *error = QUARN_REFUSED;
+    return;
+  }
+  UniqueFd fd = create_archive(zip_path);
+  ArchiveFile file(std::move(fd));
+  zlib_filefunc64_def functions = file.functions();
+  zipFile zip =
+      file.is_open() ? zipOpen2_64(zip_path, APPEND_STATUS_CREATE, nullptr, &functions) : nullptr;
+  if (zip == nullptr) {
+    LOGE("zipOpen() failed, zf is NULL");
+    *error = QUARN_UNREADABLE;
+    return;
+  }
+  for (const char *dir : kDataDirs) {
+    parse_app_dir_for_zip(pkg_id, root, zip, (std::string(root) + dir).c_str(), table.get(), error);
+  }
+  insert_file_info_table_to_zip(table.get(), zip, pkg_id, root, error);
+  const int closed = zipClose(zip, nullptr);
+  archive_codec.reset();
+  if (closed != ZIP_OK) {
+    LOGE("zipClose() failed, zip_err = [%d]", closed);
+    *error = QUARN_REFUSED;
+  }
+}
+
+bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
+                           file_info_table_h *table, int *error) {
+  const DirPtr opened = safe_opendir(dir);
+  if (opened == nullptr) {
+    LOGE("error : cannot open this path %s", dir);
+    *error = QUARN_REFUSED;
+    return false;
+  }
+  Walk walk{root, WorkingFiles(pkg_id, root), zip, table, error};
+  std::string path = dir;
+  return walk_dir(&walk, opened.get(), &path, 0);
+}
+
+bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error) {
+  const UniqueFd fd = safe_open(file, O_RDONLY | O_NONBLOCK);
+  if (!fd) {
+    LOGE("fopen() failed, file is NULL");
+    *error = QUARN_REFUSED;
+    return false;
+  }
+  return add_open_file(zip, file, file + std::strlen(root) + 1, fd.get(), error);
+}
+
+void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const char *pkg_id,
+                                   const char *root, int *error) {
+  const char *document = json_object_get_string(table->root);
+  const std::string text = document == nullptr ? "" : document;
+  const std::string path = std::string(root) + "/shared/data/" + pkg_id + ".perm";
+  const int written = write_string_to_file(text, path);
+  if (written != QUARN_OK) {
+    LOGE("fail. insert_file_info_table_to_zip : %d", written);
+    *error = written;
+  }
+  if (!file_exist(path.c_str())) {
+    LOGE("fail. insert_file_info_table_to_zip : %d", QUARN_REFUSED);
+    *error = QUARN_REFUSED;
+  } else {
+    add_file_to_zip(root, zip, path.c_str(), error);
+    delete_file(path.c_str());
+  }
+  json_object_put(table->root);
+  table->root = nullptr;
+  table->symbolic_list = nullptr;
+}
