@@ -1,4 +1,6 @@
 #include <fcntl.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
@@ -19,6 +21,12 @@ constexpr char kLabelKey[] = "3";
 
 constexpr char kDatabaseLabel[] = "wrt::db_origin";
 constexpr char kNativeSuffix[] = ".native";
+
+#ifdef SYS_fchmodat2
+constexpr long kFchmodat2 = SYS_fchmodat2;
+#else
+constexpr long kFchmodat2 = 452;  // newer than some headers
+#endif
 
 constexpr mode_t kPermissionBits = 07777;
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
@@ -78,7 +86,11 @@ int change_object_mode(int fd, const struct stat &status, mode_t mode) {
     errno = EOPNOTSUPP;
     return -1;
   }
-  // The descriptor may be of the O_PATH kind, which fchmod() refuses.
+  // The descriptor may be of the O_PATH kind, which fchmod() refuses. Kernels before 6.6, and
+  // filters that do not know the call, leave the way through /proc.
+  const int result =
+      static_cast<int>(syscall(kFchmodat2, fd, "", mode & kPermissionBits, AT_EMPTY_PATH));
+  if (result == 0 || (errno != ENOSYS && errno != EPERM)) return result;
   return chmod(("/proc/self/fd/" + std::to_string(fd)).c_str(), mode & kPermissionBits);
 }
 

@@ -16,9 +16,11 @@
 namespace {
 
 constexpr mode_t kSnapshotMode = 0700;
+constexpr mode_t kCopyMode = 0600;
 constexpr mode_t kPermissionBits = 07777;
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
 constexpr char kUnfinishedTable[] = "/table";
+constexpr char kStagedArchive[] = "/staged";
 
 struct TableRelease {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
@@ -93,6 +95,39 @@ int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
     return QUARN_REFUSED;
   }
   return flush_directory(files.snapshot_table) ? QUARN_OK : QUARN_REFUSED;
+}
+
+/** Move a file, if there is one, within the package. */
+void move_file(const std::string &from, const std::string &to) {
+  if (!file_exist(from.c_str())) return;
+  std::string from_name;
+  std::string to_name;
+  const UniqueFd source = safe_open_parent(from.c_str(), &from_name);
+  const UniqueFd target = safe_open_parent(to.c_str(), &to_name);
+  if (!source || !target ||
+      renameat(source.get(), from_name.c_str(), target.get(), to_name.c_str()) != 0) {
+    LOGE("fail to move %s to %s", from.c_str(), to.c_str());
+  }
+}
+
+/** Copy a file in the kernel; false, and nothing is left, when that cannot be done. */
+bool copy_within(int from_dir, int to_dir, const char *name) {
+  const int from_flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+  const UniqueFd from(openat(from_dir, name, from_flags));
+  struct stat status = {};
+  if (!from || fstat(from.get(), &status) != 0 || !S_ISREG(status.st_mode)) return false;
+  UniqueFd to(openat(to_dir, name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kCopyMode));
+  if (!to) return false;
+  off_t left = status.st_size;
+  while (left > 0) {
+    const auto size = static_cast<std::size_t>(left);
+    const ssize_t count = copy_file_range(from.get(), nullptr, to.get(), nullptr, size, 0);
+    if (count <= 0) break;
+    left -= count;
+  }
+  if (close(to.release()) == 0 && left == 0) return true;
+  unlinkat(to_dir, name, 0);
+  return false;
 }
 
 /** Copy a file out of the snapshot; without room for a copy, the snapshot's own file serves. */
@@ -249,14 +284,15 @@ int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid,
       result = 0;
       continue;
     }
+    UniqueFd target;  // made with the first file that is copied into it
+    std::string path = current;
     while (const dirent *entry = readdir(handle.get())) {
-      const std::string name = entry->d_name;
-      if (name == "." || name == "..") continue;
-      const std::string path = current + "/" + name;
+      if (is_dot_entry(entry->d_name)) continue;
+      const PathStep step(&path, entry->d_name);
       if (files.is_archive(path) || path.compare(0, snapshot.size(), snapshot) == 0) continue;
       restore_step("snapshot-entry");
       struct stat status = {};
-      const int found = fstatat(dirfd(handle.get()), name.c_str(), &status, AT_SYMLINK_NOFOLLOW);
+      const int found = fstatat(dirfd(handle.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
       if (found != 0) {
         LOGE("error : lstat for %d %s", found, path.c_str());
         continue;
@@ -275,6 +311,11 @@ int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid,
       // A table that lies in the data would make the snapshot look complete before it is.
       if (path == files.table) continue;
       const std::string copy = snapshot + path.substr(root_length);
+      if (!target && create_directory_of_file(copy.c_str())) {
+        std::string name;
+        target = safe_open_parent(copy.c_str(), &name);
+      }
+      if (copy_within(dirfd(handle.get()), target.get(), entry->d_name)) continue;
       if (!create_directory_of_file(copy.c_str()) || !copy_file(path.c_str(), copy.c_str())) {
         LOGE("fail copy : from %s to %s", path.c_str(), copy.c_str());
         result = 0;
@@ -292,8 +333,13 @@ int rollback_to_initial_app_data(const char *pkgid, const char *root) {
   }
   restore_step("rollback");
   const JsonPtr table = read_table(files.snapshot_table);
+  // An archive that a backup run has staged is no data, and that run's to delete.
+  const std::string staged = files.snapshot + kStagedArchive;
+  move_file(staged, files.upload);
+  move_file(files.upload, staged);
   clear_app_dir(pkgid, root);
   restore_step("rollback-cleared");
+  move_file(staged, files.upload);
   parse_dir_for_rollback(files.snapshot.c_str(), pkgid, root);
   restore_app_info(pkgid, root);
   put_attributes_back(table.get(), root);

@@ -1,0 +1,242 @@
+#include <algorithm>
+#include <list>
+#include <memory>
+
+#include "quarn_d_lifecycle.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_files.h"
+#include "quarn_log.h"
+
+std::vector<std::string> pkg_list_to_be_restored;
+int current_restore_client = 0;
+std::string serial_num_user_select;
+
+namespace {
+
+constexpr int kCloudClient = 0;
+
+/** One download, from its request to its answer. */
+struct download_request {
+  std::string local_path;
+  std::string cloud_path;
+  pkg_restore_context *ctx;
+};
+using RequestPtr = std::unique_ptr<download_request>;
+
+/** Packages whose archive is on its way. */
+std::vector<std::string> running;
+/** Further restores of such a package: they use the same files, so they wait. */
+std::list<RequestPtr> waiting;
+
+bool is_running(const std::string &pkgid) {
+  return std::find(running.begin(), running.end(), pkgid) != running.end();
+}
+
+void remove_download(const std::string &path) {
+  if (file_exist(path.c_str())) delete_file(path.c_str());
+}
+
+gboolean terminate_when_idle(gpointer /*data*/) {
+  // The client that waits for the end hears of it first.
+  if (restore_report_pending()) return G_SOURCE_CONTINUE;
+  request_quarn_terminate(0.0, false);
+  return G_SOURCE_REMOVE;
+}
+
+/** 0, or a code when the archive, or only a part of it, could not be unpacked. */
+int unpack(const pkg_restore_context &ctx, const std::string &archive) {
+  unzip_report report;
+  const int result = unzip_data(ctx.pkgid.c_str(), ctx.root.c_str(), archive.c_str(), &report);
+  if (result == QUARN_OK && !report.complete()) return QUARN_UNREADABLE;
+  return result;
+}
+
+/** Replace the package's data by the archive's, or leave it as it is. */
+restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive) {
+  const char *pkgid = ctx->pkgid.c_str();
+  const char *root = ctx->root.c_str();
+  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  report_restore_step(ctx->pkgid, restore_stage::snapshot);
+  int result = temp_backup_initial_app_data(pkgid, root);
+  if (result != QUARN_OK) {
+    LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
+    ctx->result = result;
+    discard_snapshot(pkgid, root);
+    return restore_outcome::failed;
+  }
+  report_restore_step(ctx->pkgid, restore_stage::unpacking);
+  restore_step("unpack");
+  result = unpack(*ctx, archive);
+  if (result != QUARN_OK) {
+    LOGE("fail to restore app info for (%s) err : %d", pkgid, result);
+    rollback_to_initial_app_data(pkgid, root);
+    ctx->result = result;
+    return restore_outcome::rolled_back;
+  }
+  restore_step("unpacked");
+  report_restore_step(ctx->pkgid, restore_stage::attributes);
+  if (!restore_app_info(pkgid, root)) {
+    LOGE("fail to restore for (%s)", pkgid);
+    rollback_to_initial_app_data(pkgid, root);
+    ctx->result = QUARN_REFUSED;
+    return restore_outcome::rolled_back;
+  }
+  restore_step("restored");
+  discard_snapshot(pkgid, root);
+  LOGI("restore successfully completed for (%s)", pkgid);
+  return restore_outcome::restored;
+}
+
+/** Count one accepted restore; finish_restore() ends what begins here. */
+void accept_restore(pkg_restore_context *ctx) {
+  ++ctx->pending;
+  // The daemon is not idle before the last restore has ended.
+  request_power_lock(true);
+  if (!ctx->wait_for_result) count_outstanding_restore(1);
+  report_restore_step(ctx->pkgid, restore_stage::downloading);
+}
+
+void start_next(const std::string &pkgid);
+
+void finish_restore(pkg_restore_context *ctx, restore_outcome outcome) {
+  const std::string pkgid = ctx->pkgid;
+  const bool monitored = !ctx->wait_for_result;
+  report_restore_end(pkgid, outcome, ctx->result);
+  check_package_restore_complete(ctx);
+  if (monitored) count_outstanding_restore(-1);
+  start_next(pkgid);
+  request_power_lock(false);
+  if (pkg_list_to_be_restored.empty()) g_idle_add(terminate_when_idle, nullptr);
+}
+
+void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
+                                 char * /*unused*/) {
+  if (user_data == nullptr) LOGE("cb user_data is NULL...");
+  g_assert(user_data != nullptr);
+  const RequestPtr request(static_cast<download_request *>(user_data));
+  pkg_restore_context *ctx = request->ctx;
+  running.erase(std::find(running.begin(), running.end(), ctx->pkgid));
+  restore_outcome outcome = restore_outcome::failed;
+  if (error != BACKUP_TRANS_ERROR_NONE) {
+    LOGE("download app data of (%s) failed...err_code[%d]", ctx->pkgid.c_str(), error);
+    ctx->result = QUARN_TRANSFER_FAILED;
+  } else {
+    LOGI("backup trans success : download for (%s)", ctx->pkgid.c_str());
+    outcome = restore_from_archive(ctx, request->local_path);
+  }
+  remove_download(request->local_path);
+  finish_restore(ctx, outcome);
+}
+
+/** Hand the request to the transport, or tell its context that it was refused. */
+bool start_download(RequestPtr request) {
+  pkg_restore_context *ctx = request->ctx;
+  const int result = backup_trans_download_file_ors_async(
+      cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
+      __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE);
+  if (result != BACKUP_TRANS_ERROR_NONE) {
+    LOGE("backup_trans_download_file_ors_async failed... %d", result);
+    ctx->result = QUARN_LIST_CHECK_FAILED;
+    remove_download(request->local_path);
+    return false;
+  }
+  running.push_back(ctx->pkgid);
+  static_cast<void>(request.release());
+  return true;
+}
+
+void start_next(const std::string &pkgid) {
+  const auto next = std::find_if(waiting.begin(), waiting.end(), [&](const RequestPtr &request) {
+    return request->ctx->pkgid == pkgid;
+  });
+  if (next == waiting.end()) return;
+  RequestPtr request = std::move(*next);
+  waiting.erase(next);
+  pkg_restore_context *ctx = request->ctx;
+  if (!start_download(std::move(request))) finish_restore(ctx, restore_outcome::failed);
+}
+
+int restore_from_cloud(pkg_restore_context *ctx) {
+  if (!is_safe_path_component(ctx->serial) || !is_safe_path_component(ctx->pkgid) ||
+      !is_safe_path_component(ctx->version)) {
+    LOGE("refused : not a cloud path (%s, %s, %s)", ctx->serial.c_str(), ctx->pkgid.c_str(),
+         ctx->version.c_str());
+    ctx->result = QUARN_LIST_CHECK_FAILED;
+    return QUARN_FAILED;
+  }
+  auto request = std::make_unique<download_request>();
+  request->cloud_path =
+      "/" + ctx->serial + "/" + ctx->pkgid + "/" + ctx->version + "/" + ctx->pkgid + ".zip";
+  request->local_path = restore_files(ctx->pkgid, ctx->root).download;
+  request->ctx = ctx;
+  LOGI("request download for (%s)", ctx->pkgid.c_str());
+  if (is_running(ctx->pkgid)) {
+    waiting.push_back(std::move(request));
+  } else if (!start_download(std::move(request))) {
+    return QUARN_FAILED;
+  }
+  accept_restore(ctx);
+  return QUARN_OK;
+}
+
+int unpack_from_companion(pkg_restore_context *ctx, bool *restored) {
+  const char *pkgid = ctx->pkgid.c_str();
+  if (!is_safe_path_component(ctx->pkgid) || !is_safe_path_component(ctx->version)) {
+    LOGE("refused : not an archive name (%s, %s)", pkgid, ctx->version.c_str());
+    return QUARN_REFUSED;
+  }
+  const std::string archive = std::string(kAppsDir) + kPellixPackage + "/shared/data/" +
+                              ctx->pkgid + "_" + ctx->version + ".zip";
+  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  report_restore_step(ctx->pkgid, restore_stage::unpacking);
+  const int result = unpack(*ctx, archive);
+  if (result != QUARN_OK) return result;
+  report_restore_step(ctx->pkgid, restore_stage::attributes);
+  *restored = restore_app_info(pkgid, ctx->root.c_str()) != 0;
+  if (*restored) {
+    LOGI("restore completed for (%s)", pkgid);
+  } else {
+    LOGE("fail to restore for (%s)", pkgid);
+  }
+  return QUARN_OK;
+}
+
+/**
+ * The companion's archive is at hand, so everything happens at once. The
+ * pending count goes to -1: such a restore is not waited for, and its icon is
+ * not the engine's to show.
+ */
+int restore_from_companion(pkg_restore_context *ctx) {
+  bool restored = false;
+  const int result = unpack_from_companion(ctx, &restored);
+  if (result != QUARN_OK) ctx->result = result;
+  LOGI("restore_app_data for %s complete", ctx->pkgid.c_str());
+  const int reported = result == QUARN_OK && !restored ? QUARN_REFUSED : result;
+  report_restore_end(ctx->pkgid, restored ? restore_outcome::restored : restore_outcome::failed,
+                     reported);
+  check_package_restore_complete(ctx);
+  return result;
+}
+
+}  // namespace
+
+int restore_app_data(const char * /*appid*/, pkg_restore_context *ctx) {
+  recover_interrupted_restore(ctx->pkgid.c_str(), ctx->root.c_str());
+  return current_restore_client == kCloudClient ? restore_from_cloud(ctx)
+                                                : restore_from_companion(ctx);
+}
+
+void check_package_restore_complete(pkg_restore_context *ctx) {
+  if (--ctx->pending != 0) return;
+  if (ctx->abandoned) {
+    delete ctx;
+  } else if (!ctx->wait_for_result) {
+    appear_app_icon(ctx->pkgid.c_str(), true, 0.0);
+    delete ctx;
+  } else if (ctx->main_loop != nullptr) {
+    GMainLoop *loop = ctx->main_loop;
+    ctx->main_loop = nullptr;
+    g_main_loop_unref(loop);
+    g_main_loop_quit(loop);
+  }
+}

@@ -1,0 +1,105 @@
+#include <linux/capability.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <filesystem>
+
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "restore_fixture.h"
+
+using ::testing::Return;
+
+namespace {
+
+class AppListTest : public RestoreTest {
+ protected:
+  using Answers = std::vector<Outside::Answer>;
+  int ask(int client) { return get_app_list(client, make_record(9)); }
+  static Answers answered(int err, const std::string &text) {
+    return {{"get_app_list_cb", err, text, 9}};
+  }
+};
+
+TEST_F(AppListTest, PassesTheCloudsListAsItIs) {
+  ASSERT_EQ(ask(0), 0);
+  ASSERT_EQ(downloads.size(), 1U);
+  EXPECT_EQ(downloads[0].remote, "/app_list/app_list.txt");
+  EXPECT_TRUE(outside.answers.empty());
+  EXPECT_FALSE(is_idle_status());
+  const std::string local = downloads[0].local;
+  write_text(local, "{\"any\": \"text\"}");
+  answer();
+  EXPECT_EQ(outside.answers, answered(0, "{\"any\": \"text\"}"));
+  expect_info("backup trans success : app list download");
+  expect_info("app list : {\"any\": \"text\"}");
+  EXPECT_FALSE(exists(local));
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(AppListTest, StagesBesideTheListOfABackupRun) {
+  ASSERT_EQ(ask(0), 0);
+  ASSERT_EQ(ask(0), 0);
+  EXPECT_NE(downloads[0].local, kLocalAppListPath);
+  EXPECT_NE(downloads[0].local, downloads[1].local);
+  EXPECT_EQ(downloads[0].local.rfind("/tmp/quarn/", 0), 0U);
+}
+
+TEST_F(AppListTest, ADownloadErrorIsAnsweredWithOneAndNone) {
+  ASSERT_EQ(ask(0), 0);
+  answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT);
+  EXPECT_EQ(outside.answers, answered(1, "none"));
+  expect_error("__get_app_list_resp_cb failed...err_code[12]");
+}
+
+TEST_F(AppListTest, AMissingFileIsAnsweredWithOneAndNone) {
+  ASSERT_EQ(ask(0), 0);
+  answer();
+  EXPECT_EQ(outside.answers, answered(1, "none"));
+  expect_error("there isn't app list file...");
+}
+
+TEST_F(AppListTest, AnUnreadableFileIsAnsweredWithOneAndNone) {
+  ASSERT_EQ(ask(0), 0);
+  write_text(downloads[0].local, "text");
+  ASSERT_EQ(chmod(downloads[0].local.c_str(), 0), 0);
+  ASSERT_EQ(chown(downloads[0].local.c_str(), 5000, 5000), 0);
+  {
+    const WithoutCapabilities none({CAP_DAC_OVERRIDE, CAP_DAC_READ_SEARCH});
+    answer();
+  }
+  EXPECT_EQ(outside.answers, answered(1, "none"));
+  expect_error("couldn't read app list...");
+}
+
+TEST_F(AppListTest, ARefusedRequestIsAnsweredWithTwelveAndNone) {
+  transport_result = 2;
+  EXPECT_EQ(ask(0), 42);
+  EXPECT_EQ(outside.answers, answered(12, "none"));
+  expect_error("backup_trans_download_file_ors_async failed... 2");
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(AppListTest, TheCompanionGetsThisDevicesList) {
+  std::filesystem::create_directories(kCompanionDir);
+  EXPECT_EQ(ask(1), 0);
+  ASSERT_EQ(outside.answers.size(), 1U);
+  EXPECT_EQ(outside.answers[0].err, 0);
+  EXPECT_NE(outside.answers[0].msg.find("app_data_path"), std::string::npos);
+  EXPECT_TRUE(downloads.empty());
+}
+
+TEST_F(AppListTest, ACompanionsListThatCannotBeMadeIsAnsweredWithFortyTwo) {
+  ON_CALL(platform, package_manager_foreach_package_info).WillByDefault(Return(-5));
+  EXPECT_EQ(ask(1), 42);
+  EXPECT_EQ(outside.answers, answered(42, "failed"));
+}
+
+TEST_F(AppListTest, ACallbackWithoutItsRequestEndsTheProcess) {
+  ASSERT_EQ(ask(0), 0);
+  const auto callback = downloads[0].callback;
+  EXPECT_EXIT(callback(BACKUP_TRANS_ERROR_NONE, nullptr, nullptr),
+              ::testing::KilledBySignal(SIGABRT), "user_data != ");
+}
+
+}  // namespace

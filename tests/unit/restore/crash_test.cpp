@@ -1,0 +1,175 @@
+// A daemon that is killed in a restore, and the next one: old or new, never a mixture.
+#include <sys/inotify.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <filesystem>
+#include <set>
+
+#include "restore_fixture.h"
+
+namespace {
+
+int steps_left = 0;
+
+class CrashTest : public RestoreTest {
+ protected:
+  CrashTest() {
+    make_data();
+    old_tree = tree_of(root);
+    make_archive(base + "/archive.zip", new_data);
+    // what a whole restore makes of it
+    restore_here();
+    new_tree = tree_of(root);
+    EXPECT_NE(old_tree, new_tree);
+  }
+
+  void reset_data() {
+    for (const char *name : {"data", "shared/data", "shared/trusted"}) {
+      for (const auto &item : std::filesystem::directory_iterator(at(name))) {
+        std::filesystem::remove_all(item);
+      }
+    }
+    make_data();
+    ASSERT_EQ(tree_of(root), old_tree);
+  }
+  void make_data() {
+    make_old_data();
+    file("shared/data/org.example.notes_upload.zip", "staged", 0600);
+  }
+
+  void restore_here() {
+    pkg_restore_context ctx;
+    ctx.serial = kSerial;
+    ctx.pkgid = kPkg;
+    ctx.version = kVersion;
+    ctx.root = root;
+    ctx.wait_for_result = true;
+    restore_app_data("app", &ctx);
+    std::filesystem::copy_file(archive, download(),
+                               std::filesystem::copy_options::overwrite_existing);
+    answer();
+  }
+
+  /** Run @p work in a process that is killed at its @p step th step. @return false: it ended */
+  bool killed_at(int step, const std::function<void()> &work) {
+    const pid_t child = fork();
+    if (child == 0) {
+      steps_left = step;
+      restore_step_hook = [](const char *) {
+        if (--steps_left == 0) raise(SIGKILL);
+      };
+      work();
+      _exit(0);
+    }
+    int status = 0;
+    EXPECT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_FALSE(WIFEXITED(status) && WEXITSTATUS(status) != 0);
+    return WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL;
+  }
+
+  /** What the next daemon does. */
+  void recover_here() { recover_interrupted_restore(kPkg, root.c_str()); }
+
+  /** The data now, without what a killed daemon may leave for the sweep of archives. */
+  Tree tree() const {
+    Tree tree = tree_of(root);
+    tree.erase("shared/data/org.example.notes_download.zip");
+    return tree;
+  }
+
+  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
+                                       {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
+                                       {"data/added/deep/file", "added"},
+                                       {"shared/data/pictures/one.jpg", "n", 0644},
+                                       {"shared/trusted/key.bin", "new key", 0444}};
+  std::string archive = base + "/archive.zip";
+  Tree old_tree;
+  Tree new_tree;
+};
+
+TEST_F(CrashTest, KilledAtEveryStepOfARestore) {
+  std::set<bool> seen;
+  int step = 1;
+  for (;; ++step) {
+    reset_data();
+    if (!killed_at(step, [this] { restore_here(); })) break;
+    recover_here();
+    const Tree now = tree();
+    EXPECT_TRUE(now == old_tree || now == new_tree) << "killed at step " << step;
+    seen.insert(now == new_tree);
+  }
+  EXPECT_GT(step, 25) << "steps of every stage";
+  EXPECT_EQ(seen.size(), 2U) << "killed early the data is the old, killed late the new";
+}
+
+TEST_F(CrashTest, KilledAtEveryStepOfARollback) {
+  archive = base + "/broken.zip";
+  make_archive(archive, new_data, "not json");
+  int step = 1;
+  for (;; ++step) {
+    reset_data();
+    if (!killed_at(step, [this] { restore_here(); })) break;
+    recover_here();
+    EXPECT_EQ(tree(), old_tree) << "killed at step " << step;
+  }
+  EXPECT_GT(step, 30);
+}
+
+TEST_F(CrashTest, KilledAtEveryStepOfTheRecovery) {
+  int step = 1;
+  for (;; ++step) {
+    reset_data();
+    const auto interrupted = [this] {
+      restore_step_hook = [](const char *name) {
+        if (std::string(name) == "unpacked") raise(SIGKILL);
+      };
+      restore_here();
+    };
+    const pid_t child = fork();
+    if (child == 0) interrupted();
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(status));
+    if (!killed_at(step, [this] { recover_here(); })) break;
+    recover_here();
+    EXPECT_EQ(tree(), old_tree) << "killed at step " << step;
+  }
+  EXPECT_GT(step, 10);
+}
+
+TEST_F(CrashTest, KilledInTheMiddleOfTheUnpacking) {
+  std::vector<Entry> many = new_data;
+  for (int i = 0; i < 400; ++i) {
+    many.push_back({"data/many/" + std::to_string(i), std::string(2000, 'm')});
+  }
+  make_archive(archive, many);
+  for (int round = 0; round < 5; ++round) {
+    reset_data();
+    const int events = inotify_init1(IN_CLOEXEC);
+    ASSERT_GE(inotify_add_watch(events, at("data").c_str(), IN_CREATE), 0);
+    const pid_t child = fork();
+    if (child == 0) {
+      restore_here();
+      _exit(0);
+    }
+    // the first new name below "data" is the unpacking's
+    char event[1024];
+    EXPECT_GT(read(events, event, sizeof(event)), 0);
+    close(events);
+    kill(child, SIGKILL);
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    recover_here();
+    const Tree now = tree();
+    if (WIFSIGNALED(status) && now.count("data/many/399") == 0) {
+      EXPECT_EQ(now, old_tree);
+    } else {
+      EXPECT_EQ(now.count("data/many/0"), 1U) << "it was faster than the kill: all of the new";
+      EXPECT_EQ(now.at("data/settings.ini"), new_tree.at("data/settings.ini"));
+    }
+  }
+}
+
+}  // namespace

@@ -1,0 +1,227 @@
+// A restore that cannot be finished leaves the application exactly as it was.
+#include <linux/capability.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "restore_fixture.h"
+
+using ::testing::Return;
+
+namespace {
+
+class FailureTest : public RestoreTest {
+ protected:
+  FailureTest() { make_old_data(); }
+
+  /** Restore from the archive that @p prepare puts at the download's place. */
+  int restore(const std::function<void()> &prepare) {
+    before = tree_of(root);
+    pkg_restore_context ctx;
+    ctx.serial = kSerial;
+    ctx.pkgid = kPkg;
+    ctx.version = kVersion;
+    ctx.root = root;
+    ctx.wait_for_result = true;
+    EXPECT_EQ(restore_app_data("app", &ctx), 0);
+    prepare();
+    answer();
+    EXPECT_EQ(ctx.pending, 0);
+    return ctx.result;
+  }
+  int restore() {
+    return restore([this] { make_archive(download(), new_data); });
+  }
+  void expect_untouched() const { EXPECT_EQ(tree_of(root), before); }
+
+  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
+                                       {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
+                                       {"data/added/deep/file", "added"},
+                                       {"shared/data/pictures/one.jpg", "n", 0644},
+                                       {"shared/trusted/key.bin", "new key", 0444}};
+  Tree before;
+};
+
+TEST_F(FailureTest, TheSameRestoreSucceedsWhenNothingIsWrong) {
+  EXPECT_EQ(restore(), 0);
+  EXPECT_NE(tree_of(root), before);
+}
+
+TEST_F(FailureTest, SnapshotOnAFullDisk) {
+  file("shared/data/large", std::string(200000, 'l'));
+  std::unique_ptr<DiskFullAfter> limit;
+  const AtStep full("snapshot", [&] { limit = std::make_unique<DiskFullAfter>(100000); });
+  const AtStep over("snapshot-released", [&] { limit.reset(); });
+  EXPECT_EQ(restore(), 36);
+  expect_error("fail to make backup for (org.example.notes) before restore. err : 36");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, SnapshotOfAnUnreadableFile) {
+  ASSERT_EQ(chmod(at("shared/data").c_str(), 0777), 0);
+  ASSERT_EQ(chmod(at("data").c_str(), 0777), 0);
+  ASSERT_EQ(chmod(at("data/db").c_str(), 0777), 0);
+  std::unique_ptr<WithoutCapabilities> none;
+  const int result = restore([&] {
+    make_archive(download(), new_data);
+    none = std::make_unique<WithoutCapabilities>(
+        std::initializer_list<int>{CAP_DAC_OVERRIDE, CAP_DAC_READ_SEARCH});
+  });
+  none.reset();
+  EXPECT_EQ(result, 36);
+  expect_error("fail to make backup for (org.example.notes) before restore. err : 36");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, SnapshotWhoseTableCannotBeWritten) {
+  const AtStep step("snapshot-copied",
+                    [&] { std::filesystem::create_directories(snapshot() + "/table/x"); });
+  EXPECT_EQ(restore(), 36);
+  expect_error("fail. temp_backup_initial_app_data : 36");
+  expect_error("fail to make backup for (org.example.notes) before restore. err : 36");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, UnpackOfWhatIsNoArchive) {
+  EXPECT_EQ(restore([this] { write_text(download(), "not an archive"); }), 31);
+  expect_error("fail to restore app info for (org.example.notes) err : 31");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, UnpackOfAMissingArchive) {
+  EXPECT_EQ(restore([] {}), 31);
+  expect_error("fail to restore app info for (org.example.notes) err : 31");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, UnpackOfACorruptEntry) {
+  const int result = restore([this] {
+    auto entries = new_data;
+    entries.push_back({"data/noise", std::string(3000, 'a') + "marker" + std::string(3000, 'b')});
+    make_archive(download(), entries);
+    // flip bytes in the middle of the first entries' data
+    std::fstream archive(download(), std::ios::in | std::ios::out | std::ios::binary);
+    archive.seekp(50);
+    archive.write("\xff\xff\xff\xff\xff\xff", 6);
+  });
+  EXPECT_EQ(result, 31);
+  expect_error("fail to restore app info for (org.example.notes) err : 31");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, UnpackOfAnEntryThatWouldLeaveTheApplication) {
+  const int result = restore([this] {
+    auto entries = new_data;
+    entries.push_back({"../../escaped", "x"});
+    make_archive(download(), entries);
+  });
+  EXPECT_EQ(result, 31);
+  EXPECT_FALSE(exists(base + "/opt/usr/escaped"));
+  EXPECT_FALSE(exists(base + "/opt/usr/apps/escaped"));
+  expect_untouched();
+}
+
+TEST_F(FailureTest, UnpackOntoAFullDisk) {
+  std::unique_ptr<DiskFullAfter> limit;
+  const AtStep full("unpack", [&] { limit = std::make_unique<DiskFullAfter>(100000); });
+  const AtStep over("rollback", [&] { limit.reset(); });
+  const int result = restore([this] {
+    auto entries = new_data;
+    entries.push_back({"data/large", std::string(200000, 'l')});
+    make_archive(download(), entries);
+  });
+  EXPECT_EQ(result, 31);
+  expect_error("fail to restore app info for (org.example.notes) err : 31");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, TableThatIsMissing) {
+  EXPECT_EQ(restore([this] { make_plain_archive(download(), new_data); }), 36);
+  expect_error("there isn't file-info file...");
+  expect_error("fail to restore for (org.example.notes)");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, TableThatIsNotJsonOrOfAWrongType) {
+  for (const char *text : {"not json", "[]", "\"x\"", "{\"data/settings.ini\": 5}",
+                           "{\"data/settings.ini\": {\"0\": \"x\"}}", "{}"}) {
+    clear_captured_log();
+    EXPECT_EQ(restore([&] { make_archive(download(), new_data, text); }), 36) << text;
+    expect_error("fail to restore for (org.example.notes)");
+    expect_untouched();
+  }
+}
+
+TEST_F(FailureTest, TableWithMissingMembers) {
+  for (const char *member : {"0", "1", "2", "3"}) {
+    const JsonPtr whole = table(new_data);
+    json_object_object_del(json_object_object_get(whole.get(), "data/db/notes.db"), member);
+    EXPECT_EQ(
+        restore([&] { make_archive(download(), new_data, json_object_get_string(whole.get())); }),
+        36)
+        << member;
+    expect_untouched();
+  }
+}
+
+TEST_F(FailureTest, LabelThatIsUnknown) {
+  auto entries = new_data;
+  entries[2].label = "somebody.else";
+  EXPECT_EQ(restore([&] { make_archive(download(), entries); }), 36);
+  expect_error("fail : unknown smack label...");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, LabelThatIsEmpty) {
+  auto entries = new_data;
+  entries[0].label = "";
+  EXPECT_EQ(restore([&] { make_archive(download(), entries); }), 36);
+  expect_untouched();
+}
+
+TEST_F(FailureTest, SecurityServerThatRefusesAtEachStep) {
+  const struct {
+    int *result;
+    std::string message;
+    int times;  // again in the rollback
+  } cases[] = {
+      {&begin_result, "fail : security_server_perm_begin...(err=-2)", 2},
+      {&setup_result, "error : security_server_perm_app_setup_path " + at("data") + " (err=-2)", 2},
+      {&commit_result, "fail : security_server_perm_commit...(err=-2)", 2},
+      {&label_result, "fail : security_server_label_access...(err=-2)", 2},
+  };
+  for (const auto &one : cases) {
+    clear_captured_log();
+    *one.result = -2;
+    EXPECT_EQ(restore(), 36) << one.message;
+    *one.result = 0;
+    expect_error(one.message, one.times);
+    expect_error("fail to restore for (org.example.notes)");
+    expect_untouched();
+    EXPECT_EQ(transactions, 0);
+  }
+}
+
+TEST_F(FailureTest, WalkThatMeetsAFileWhichTheArchiveDoesNotKnow) {
+  file("data/newer", "made since", 0600);
+  EXPECT_EQ(restore(), 36);
+  expect_error("fail to restore file info : " + at("data/newer"));
+  expect_error("fail to restore directory : " + at("data") + "...");
+  expect_error("fail to restore for (org.example.notes)");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, WalkThatMayNotChangeOwners) {
+  std::unique_ptr<WithoutCapabilities> none;
+  const AtStep without("unpacked", [&] {
+    none = std::make_unique<WithoutCapabilities>(std::initializer_list<int>{CAP_CHOWN});
+  });
+  const AtStep with("rollback", [&] { none.reset(); });
+  EXPECT_EQ(restore(), 36);
+  expect_error("chown: error \n", 6);
+  expect_untouched();
+}
+
+}  // namespace

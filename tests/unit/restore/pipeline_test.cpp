@@ -1,0 +1,391 @@
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <filesystem>
+#include <thread>
+
+#include "restore_fixture.h"
+
+using ::testing::_;
+using ::testing::Return;
+using ::testing::StrEq;
+
+namespace {
+
+using Outcome = restore_outcome;
+using Stage = restore_stage;
+
+struct Seen {
+  std::string package;
+  Stage stage;
+  Outcome outcome;
+  int result;
+};
+std::vector<Seen> progress;
+
+class PipelineTest : public RestoreTest {
+ protected:
+  PipelineTest() {
+    progress.clear();
+    set_restore_progress_sink([](const restore_progress &step) {
+      progress.push_back({step.package, step.stage, step.outcome, step.result});
+    });
+    ON_CALL(platform, pkgmgr_client_new).WillByDefault([](auto) {
+      static char client[1];
+      return static_cast<pkgmgr_client *>(client);
+    });
+    ON_CALL(platform, pkgmgr_client_activate).WillByDefault([this](auto, auto, const char *id) {
+      shown.emplace_back(id);
+      return 0;
+    });
+  }
+  int restore(pkg_restore_context *ctx) { return restore_app_data("app", ctx); }
+  /** A context that the test keeps, as a waiting request does. */
+  std::unique_ptr<pkg_restore_context> waiting_context() const {
+    std::unique_ptr<pkg_restore_context> ctx(new_context());
+    ctx->wait_for_result = true;
+    return ctx;
+  }
+  std::vector<Stage> stages() const {
+    std::vector<Stage> all;
+    for (const auto &step : progress) all.push_back(step.stage);
+    return all;
+  }
+  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
+                                       {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
+                                       {"shared/data/pictures/one.jpg", "n", 0644},
+                                       {"shared/trusted/key.bin", "new key", 0444}};
+  std::vector<std::string> shown;
+};
+
+TEST_F(PipelineTest, AsksForTheArchiveOfTheChosenSet) {
+  auto ctx = waiting_context();
+  EXPECT_EQ(restore(ctx.get()), 0);
+  expect_info("request download for (org.example.notes)");
+  ASSERT_EQ(downloads.size(), 1U);
+  EXPECT_EQ(downloads[0].remote, "/350000000000001/org.example.notes/1.2.0/org.example.notes.zip");
+  EXPECT_EQ(downloads[0].local, download());
+  EXPECT_EQ(ctx->pending, 1);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+}
+
+TEST_F(PipelineTest, ARefusedDownloadReturnsFortyTwoSetsThirteenAndTheIconIsNotShown) {
+  auto ctx = waiting_context();
+  ctx->wait_for_result = false;
+  transport_result = 2;
+  write_text(download(), "left");
+  EXPECT_EQ(restore(ctx.get()), 42);
+  EXPECT_EQ(ctx->result, 13);
+  EXPECT_EQ(ctx->pending, 0);
+  EXPECT_FALSE(exists(download()));
+  EXPECT_TRUE(shown.empty());
+  expect_error("backup_trans_download_file_ors_async failed... 2");
+  EXPECT_TRUE(is_idle_status());
+  EXPECT_TRUE(progress.empty());
+}
+
+TEST_F(PipelineTest, NamesThatAreNoPathComponentsAreRefused) {
+  for (const auto &[serial, version] : std::vector<std::pair<std::string, std::string>>{
+           {"../x", "1"}, {"", "1"}, {"1", "a/b"}, {"1", ".."}, {"1", ""}}) {
+    auto ctx = waiting_context();
+    ctx->serial = serial;
+    ctx->version = version;
+    EXPECT_EQ(restore(ctx.get()), 42);
+    EXPECT_EQ(ctx->result, 13);
+    expect_error("refused : not a cloud path (" + serial + ", org.example.notes, " + version + ")");
+  }
+  EXPECT_TRUE(downloads.empty());
+}
+
+TEST_F(PipelineTest, RestoresEveryFileAsItWas) {
+  make_old_data();
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(ctx->pending, 0);
+  expect_info("backup trans success : download for (org.example.notes)");
+  expect_info("restore successfully completed for (org.example.notes)");
+  const Tree tree = tree_of(root);
+  EXPECT_EQ(tree.at("data/settings.ini"), "100600 5000:5000 app.data new settings");
+  EXPECT_EQ(tree.at("data/db/notes.db"), "100640 5000:5000 wrt::db_origin new notes");
+  EXPECT_EQ(tree.at("shared/trusted/key.bin"), "100444 5000:5000 app.data new key");
+  EXPECT_EQ(tree.size(), 10U) << "nothing temporary is left";
+}
+
+TEST_F(PipelineTest, RestoresIntoAFreshlyInstalledPackage) {
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(read_text(at("data/db/notes.db")), "new notes");
+  EXPECT_EQ(tree_of(root).at("data/db"), "40755 5000:5000 app.data ");
+}
+
+TEST_F(PipelineTest, ADownloadErrorLeavesTheDataUntouchedAndSetsTwelve) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  bool snapshot_taken = false;
+  const AtStep step("snapshot", [&] { snapshot_taken = true; });
+  answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT);
+  EXPECT_EQ(ctx->result, 12);
+  EXPECT_FALSE(snapshot_taken);
+  expect_error("download app data of (org.example.notes) failed...err_code[12]");
+  EXPECT_EQ(tree_of(root), before);
+}
+
+TEST_F(PipelineTest, TheDownloadIsGoneAfterEveryCallback) {
+  make_old_data();
+  for (const auto error : {BACKUP_TRANS_ERROR_NONE, BACKUP_TRANS_ERROR_NETWORK}) {
+    auto ctx = waiting_context();
+    ASSERT_EQ(restore(ctx.get()), 0);
+    write_text(download(), "not an archive");
+    answer(error);
+    EXPECT_FALSE(exists(download()));
+  }
+}
+
+TEST_F(PipelineTest, AFailedDownloadFileIsGoneAndSoIsTheLockOnTheDevice) {
+  auto ctx = waiting_context();
+  EXPECT_TRUE(is_idle_status());
+  ASSERT_EQ(restore(ctx.get()), 0);
+  EXPECT_FALSE(is_idle_status()) << "the daemon may not end during a restore";
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(PipelineTest, TheLastCallbackSchedulesTerminationWhenNoCandidateIsLeft) {
+  pkg_list_to_be_restored = {"org.example.later"};
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  run_main_context();
+  EXPECT_TRUE(outside.terminations.empty());
+
+  pkg_list_to_be_restored.clear();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_TRUE(outside.terminations.empty()) << "from the main loop, not from the callback";
+  run_main_context();
+  EXPECT_EQ(outside.terminations, (std::vector<std::pair<double, bool>>{{0.0, false}}));
+}
+
+TEST_F(PipelineTest, AnEarlierTerminationFindsTheDaemonBusyWhileAnotherRestoreIsOnItsWay) {
+  auto first = waiting_context();
+  auto second = waiting_context();
+  second->pkgid = "org.example.other";
+  second->root = base + "/opt/usr/apps/org.example.other";
+  ASSERT_EQ(restore(first.get()), 0);
+  ASSERT_EQ(restore(second.get()), 0);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_FALSE(is_idle_status());
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(PipelineTest, AMonitoredRestoreShowsTheIconAndFreesItsContext) {
+  make_old_data();
+  pkg_restore_context *ctx = new_context();
+  ASSERT_EQ(restore(ctx), 0);
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(shown, std::vector<std::string>{kPkg});
+}
+
+TEST_F(PipelineTest, AWaitingRequestGetsItsLoopQuitAndKeepsTheContext) {
+  auto ctx = waiting_context();
+  const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+  ASSERT_EQ(restore(ctx.get()), 0);
+  ctx->main_loop = g_main_loop_ref(loop.get());
+  auto then = [this] { answer(BACKUP_TRANS_ERROR_NETWORK); };
+  g_idle_add(
+      [](gpointer call) {
+        (*static_cast<decltype(then) *>(call))();
+        return static_cast<gboolean>(G_SOURCE_REMOVE);
+      },
+      &then);
+  g_main_loop_run(loop.get());
+  EXPECT_EQ(ctx->main_loop, nullptr);
+  EXPECT_EQ(ctx->result, 12);
+  EXPECT_TRUE(shown.empty());
+}
+
+TEST_F(PipelineTest, AnAbandonedContextIsFreedByTheEngine) {
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  ctx->abandoned = true;
+  static_cast<void>(ctx.release());
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_TRUE(shown.empty());
+}
+
+TEST_F(PipelineTest, OutstandingDownloadsAreCountedPerPackage) {
+  auto ctx = waiting_context();
+  ctx->pending = 2;
+  check_package_restore_complete(ctx.get());
+  EXPECT_EQ(ctx->pending, 1);
+  check_package_restore_complete(ctx.get());
+  EXPECT_EQ(ctx->pending, 0);
+}
+
+TEST_F(PipelineTest, ASecondRestoreOfThePackageWaitsForTheFirst) {
+  make_old_data();
+  auto first = waiting_context();
+  auto second = waiting_context();
+  second->version = "2.0.0";
+  auto third = waiting_context();
+  ASSERT_EQ(restore(first.get()), 0);
+  ASSERT_EQ(restore(second.get()), 0);
+  ASSERT_EQ(restore(third.get()), 0);
+  EXPECT_EQ(second->pending, 1);
+  ASSERT_EQ(downloads.size(), 1U) << "both would use the same files";
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(first->result, 0);
+  ASSERT_EQ(downloads.size(), 1U);
+  EXPECT_EQ(downloads[0].remote, "/350000000000001/org.example.notes/2.0.0/org.example.notes.zip");
+  transport_result = 11;
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(second->result, 12);
+  EXPECT_EQ(third->result, 13) << "refused when its turn came";
+  EXPECT_EQ(third->pending, 0);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(PipelineTest, AnArchiveIsNeverPackedFromAMixture) {
+  make_old_data();
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  bool held = false;
+  // from another thread: this one may hold it itself
+  const AtStep step("unpacked", [&] {
+    std::thread([&] {
+      held = !package_data_mutex.try_lock();
+      if (!held) package_data_mutex.unlock();
+    }).join();
+  });
+  answer();
+  EXPECT_TRUE(held);
+  EXPECT_TRUE(package_data_mutex.try_lock());
+  package_data_mutex.unlock();
+}
+
+TEST_F(PipelineTest, WhatADeadDaemonLeftIsPutBackBeforeThePackageIsRestoredAgain) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  file("data/settings.ini", "half of a restore");
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(tree_of(root), before);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+}
+
+TEST_F(PipelineTest, ACallbackWithoutItsRequestEndsTheProcess) {
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  const auto callback = downloads[0].callback;
+  EXPECT_EXIT(callback(BACKUP_TRANS_ERROR_NONE, nullptr, nullptr),
+              ::testing::KilledBySignal(SIGABRT), "user_data != ");
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+}
+
+TEST_F(PipelineTest, ProgressIsToldStepByStep) {
+  make_old_data();
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(stages(), (std::vector<Stage>{Stage::downloading, Stage::snapshot, Stage::unpacking,
+                                          Stage::attributes, Stage::finished}));
+  EXPECT_EQ(progress.back().package, kPkg);
+  EXPECT_EQ(progress.back().outcome, Outcome::restored);
+  EXPECT_EQ(progress.back().result, 0);
+
+  progress.clear();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  write_text(download(), "not an archive");
+  answer();
+  EXPECT_EQ(progress.back().outcome, Outcome::rolled_back);
+  EXPECT_EQ(progress.back().result, 31);
+
+  progress.clear();
+  ctx->result = 0;
+  ASSERT_EQ(restore(ctx.get()), 0);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(progress.back().outcome, Outcome::failed);
+  EXPECT_EQ(progress.back().result, 12);
+}
+
+/* ---- from the phone-transfer companion ---- */
+
+class CompanionTest : public PipelineTest {
+ protected:
+  CompanionTest() {
+    current_restore_client = 1;
+    std::filesystem::create_directories(kCompanionDir);
+  }
+  ~CompanionTest() override { std::filesystem::remove_all("/opt/usr/apps/com.velmor.pellix-efl"); }
+  static std::string archive() {
+    return std::string(kCompanionDir) + "/org.example.notes_1.2.0.zip";
+  }
+  std::unique_ptr<pkg_restore_context> context(bool wait) const {
+    auto ctx = waiting_context();
+    ctx->wait_for_result = wait;
+    return ctx;
+  }
+};
+
+TEST_F(CompanionTest, RestoresAtOnceAndKeepsTheArchive) {
+  make_old_data();
+  make_archive(archive(), new_data);
+  auto ctx = context(false);
+  EXPECT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  EXPECT_TRUE(exists(archive()));
+  EXPECT_TRUE(downloads.empty());
+  EXPECT_FALSE(exists(snapshot()));
+  expect_info("restore completed for (org.example.notes)");
+  expect_info("restore_app_data for org.example.notes complete");
+  EXPECT_EQ(ctx->pending, -1);
+  EXPECT_TRUE(shown.empty());
+  EXPECT_EQ(progress.back().outcome, Outcome::restored);
+}
+
+TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAtMinusOne) {
+  make_old_data();
+  make_archive(archive(), new_data, "not json");
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(ctx->pending, -1);
+  expect_error("fail to restore for (org.example.notes)");
+  expect_info("restore_app_data for org.example.notes complete");
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings") << "nothing is rolled back";
+  EXPECT_EQ(progress.back().outcome, Outcome::failed);
+  EXPECT_EQ(progress.back().result, 36);
+}
+
+TEST_F(CompanionTest, AMissingArchiveCarriesTheUnpackCode) {
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 31);
+  EXPECT_EQ(ctx->result, 31);
+  EXPECT_EQ(ctx->pending, -1);
+  expect_info("restore_app_data for org.example.notes complete");
+}
+
+TEST_F(CompanionTest, AVersionThatIsNoPathComponentIsRefused) {
+  auto ctx = context(true);
+  ctx->version = "../../x";
+  EXPECT_EQ(restore(ctx.get()), 36);
+  EXPECT_EQ(ctx->result, 36);
+  expect_error("refused : not an archive name (org.example.notes, ../../x)");
+}
+
+}  // namespace

@@ -1,0 +1,434 @@
+#include <linux/capability.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+
+#include "restore_fixture.h"
+
+using ::testing::_;
+using ::testing::Return;
+
+namespace {
+
+class SnapshotTest : public RestoreTest {
+ protected:
+  int take() { return temp_backup_initial_app_data(kPkg, root.c_str()); }
+  int roll_back() { return rollback_to_initial_app_data(kPkg, root.c_str()); }
+  std::string snapshot_table() const { return snapshot() + "/shared/data/org.example.notes.perm"; }
+  Tree tree() const { return tree_of(root); }
+  /** What a restore that broke off might leave. */
+  void spoil() {
+    file("data/settings.ini", "broken", 0777, "other");
+    std::filesystem::remove(at("shared/trusted/key.bin"));
+    write_text(at("data/new/half.tmp"), "half");
+    write_text(perm(), "{}");
+  }
+};
+
+TEST_F(SnapshotTest, CopiesEveryFileAndWritesTheTableLast) {
+  make_old_data();
+  bool table_there = true;
+  {
+    const AtStep step("snapshot-copied", [&] { table_there = exists(snapshot_table()); });
+    ASSERT_EQ(take(), 0);
+  }
+  EXPECT_FALSE(table_there);
+  EXPECT_EQ(read_text(snapshot() + "/data/settings.ini"), "old settings");
+  EXPECT_EQ(read_text(snapshot() + "/data/db/notes.db"), "old notes");
+  EXPECT_EQ(read_text(snapshot() + "/shared/trusted/key.bin"), "old key");
+  const JsonPtr table(json_tokener_parse(read_text(snapshot_table()).c_str()));
+  json_object *entry = nullptr;
+  ASSERT_TRUE(json_object_object_get_ex(table.get(), "data/db/notes.db", &entry));
+  EXPECT_EQ(json_object_get_int(json_object_object_get(entry, "0")), 0600);
+  EXPECT_STREQ(json_object_get_string(json_object_object_get(entry, "3")), "wrt::db_origin");
+  EXPECT_TRUE(json_object_object_get_ex(table.get(), "data/db", nullptr));
+  EXPECT_FALSE(exists(snapshot() + "/table"));
+}
+
+TEST_F(SnapshotTest, IsReadableToNobodyElse) {
+  make_old_data();
+  ASSERT_EQ(take(), 0);
+  struct stat status = {};
+  ASSERT_EQ(lstat(snapshot().c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0700U);
+  EXPECT_EQ(status.st_uid, 0U);
+}
+
+TEST_F(SnapshotTest, LeavesTheDataAlone) {
+  make_old_data();
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  discard_snapshot(kPkg, root.c_str());
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, ArchivesInTransitAndTheSnapshotItselfAreNotCopied) {
+  file("data/a", "x");
+  file("shared/data/org.example.notes_upload.zip", "up");
+  file("shared/data/org.example.notes_download.zip", "down");
+  file("shared/data/quarn_tmp_rst_dir2", "sibling");
+  ASSERT_EQ(take(), 0);
+  ASSERT_EQ(take(), 0) << "a second restore cannot copy the snapshot into itself";
+  EXPECT_EQ(tree_of(snapshot()).size(), 5U);  // data, data/a, shared, shared/data, the table
+}
+
+TEST_F(SnapshotTest, ASymbolicLinkIsUnexpectedAndNotCopied) {
+  file("data/a", "x");
+  std::filesystem::create_symlink("/etc/hostname", at("data/link"));
+  EXPECT_EQ(take(), 0);
+  expect_error("this is unexpected type : " + at("data/link"));
+  EXPECT_FALSE(exists(snapshot() + "/data/link"));
+  EXPECT_EQ(read_text(snapshot_table()).find("data/link"), std::string::npos);
+}
+
+TEST_F(SnapshotTest, AnEmptyDirectoryIsRecordedButNotRecreatedByARollback) {
+  file("data/a", "x");
+  dir("data/empty");
+  ASSERT_EQ(take(), 0);
+  EXPECT_NE(read_text(snapshot_table()).find("data\\/empty"), std::string::npos);
+  roll_back();
+  EXPECT_FALSE(exists(at("data/empty")));
+  EXPECT_EQ(read_text(at("data/a")), "x");
+}
+
+TEST_F(SnapshotTest, ATableInTheDataNeverMakesTheSnapshotLookComplete) {
+  file("shared/data/org.example.notes.perm", "{}");
+  file("data/a", "x");
+  bool looked_complete = true;
+  const AtStep step("snapshot-copied", [&] { looked_complete = exists(snapshot_table()); });
+  ASSERT_EQ(take(), 0);
+  EXPECT_FALSE(looked_complete);
+}
+
+TEST_F(SnapshotTest, AFileThatCannotBeReadFailsIt) {
+  make_old_data();
+  ASSERT_EQ(chmod(at("shared/data").c_str(), 0777), 0);
+  ASSERT_EQ(chmod(at("data").c_str(), 0777), 0);
+  ASSERT_EQ(chmod(at("data/db").c_str(), 0777), 0);
+  const Tree before = tree();
+  {
+    const WithoutCapabilities none({CAP_DAC_OVERRIDE, CAP_DAC_READ_SEARCH});
+    EXPECT_EQ(take(), 36);
+  }
+  expect_error("fail copy : from " + at("data/db/notes.db") + " to " + snapshot() +
+               "/data/db/notes.db");
+  expect_error("fail to temp backup : " + at("data"));
+  EXPECT_FALSE(exists(snapshot()));
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, AFullDiskFailsItAndSharedTrustedIsNotCopied) {
+  file("data/small", "x");
+  file("shared/data/large", std::string(200000, 'l'));
+  file("shared/trusted/key", "k");
+  const Tree before = tree();
+  bool trusted_copied = false;
+  const AtStep step(
+      "snapshot-entry", [&] { trusted_copied = exists(snapshot() + "/shared/trusted/key"); }, 3);
+  {
+    const DiskFullAfter limit(100000);
+    EXPECT_EQ(take(), 36);
+  }
+  expect_error("fail copy : from " + at("shared/data/large") + " to " + snapshot() +
+               "/shared/data/large");
+  expect_error("fail to temp backup : " + at("shared/data"));
+  EXPECT_FALSE(trusted_copied);
+  EXPECT_FALSE(exists(snapshot()));
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, ALabelThatCannotBeReadFailsIt) {
+  make_old_data();
+  ON_CALL(platform, smack_getlabel).WillByDefault(Return(-1));
+  EXPECT_EQ(take(), 36);
+  expect_error("fail to temp backup : " + at("data"));
+}
+
+TEST_F(SnapshotTest, AMissingDirectoryFailsIt) {
+  make_old_data();
+  std::filesystem::remove_all(at("shared/trusted"));
+  EXPECT_EQ(take(), 36);
+  expect_error("error : cannot open this path " + at("shared/trusted"));
+  expect_error("fail to temp backup : " + at("shared/trusted"));
+  EXPECT_FALSE(exists(snapshot()));
+}
+
+TEST_F(SnapshotTest, ATableThatCannotBeWrittenIsReportedAndTheSnapshotIsIncomplete) {
+  file("data/a", "x");
+  const AtStep step("snapshot-copied", [&] {
+    // the name of the unfinished table is taken by a directory
+    std::filesystem::create_directories(snapshot() + "/table/in/the/way");
+  });
+  EXPECT_EQ(take(), 36);
+  expect_error("fail. temp_backup_initial_app_data : 36");
+  EXPECT_EQ(read_text(snapshot() + "/data/a"), "x") << "left in place";
+  EXPECT_FALSE(exists(snapshot_table()));
+}
+
+TEST_F(SnapshotTest, AnEntryThatVanishesIsLogged) {
+  const std::string gone = file("data/a", "x");
+  const AtStep step("snapshot-entry", [&] { unlink(gone.c_str()); });
+  EXPECT_EQ(take(), 0);
+  expect_error("error : lstat for -1 " + gone);
+}
+
+TEST_F(SnapshotTest, ADirectoryThatCannotBeOpenedIsAFailure) {
+  file_info_table_h *table = nullptr;
+  ready_file_info_table(&table);
+  EXPECT_EQ(parse_dir_for_copy(at("none").c_str(), snapshot().c_str(), kPkg, root.c_str(), table),
+            0);
+  release_file_info_table(table);
+  expect_error("error : cannot open this path " + at("none"));
+  EXPECT_EQ(parse_dir_for_rollback(at("none").c_str(), kPkg, root.c_str()), 0);
+  expect_error("error : cannot open this path " + at("none"), 2);
+}
+
+/* ---- what may lie in the snapshot's place ---- */
+
+TEST_F(SnapshotTest, ALinkInItsPlaceIsRemovedAndNotFollowed) {
+  file("data/a", "x");
+  std::filesystem::create_directory(base + "/outside");
+  std::filesystem::create_directory_symlink(base + "/outside", snapshot());
+  ASSERT_EQ(take(), 0);
+  EXPECT_TRUE(std::filesystem::is_empty(base + "/outside"));
+  EXPECT_TRUE(std::filesystem::is_directory(std::filesystem::symlink_status(snapshot())));
+}
+
+TEST_F(SnapshotTest, AnApplicationsDirectoryInItsPlaceIsReplaced) {
+  file("data/a", "x");
+  file("shared/data/quarn_tmp_rst_dir/data/planted", "evil");
+  file("shared/data/quarn_tmp_rst_dir/shared/data/org.example.notes.perm", "{}");
+  ASSERT_EQ(take(), 0);
+  EXPECT_FALSE(exists(snapshot() + "/data/planted"));
+  struct stat status = {};
+  ASSERT_EQ(lstat(snapshot().c_str(), &status), 0);
+  EXPECT_EQ(status.st_uid, 0U);
+}
+
+TEST_F(SnapshotTest, WhatCannotBeRemovedFromItsPlaceIsRefused) {
+  file("data/a", "x");
+  std::filesystem::create_directories(snapshot());
+  std::filesystem::create_symlink("/nowhere", snapshot() + "/link");
+  EXPECT_EQ(take(), 36);
+  expect_error("fail to make snapshot directory : " + snapshot());
+}
+
+/* ---- rollback ---- */
+
+TEST_F(SnapshotTest, ARollbackPutsContentModesOwnersAndLabelsBack) {
+  make_old_data();
+  const std::string other = file("data/others", "x", 0640);
+  ASSERT_EQ(chown(other.c_str(), 5001, 100), 0);
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  EXPECT_EQ(roll_back(), 0);
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, ARollbackDoesNotNeedTheSecurityServer) {
+  make_old_data();
+  const Tree before = tree();
+  for (int *refusing : {&begin_result, &setup_result, &commit_result}) {
+    ASSERT_EQ(take(), 0);
+    spoil();
+    *refusing = -2;
+    label_result = -2;
+    EXPECT_EQ(roll_back(), 0);
+    *refusing = 0;
+    label_result = 0;
+    EXPECT_EQ(tree(), before);
+  }
+}
+
+TEST_F(SnapshotTest, ARollbackReachesTheDirectoriesBehindOneThatCannotBeRestored) {
+  make_old_data();
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  // a pipe in the first directory makes its walk fail
+  const AtStep step("rollback-cleared",
+                    [&] { ASSERT_EQ(mkfifo(at("data/pipe").c_str(), 0600), 0); });
+  EXPECT_EQ(roll_back(), 0);
+  expect_error("fail to restore directory : " + at("data") + "...");
+  std::filesystem::remove(at("data/pipe"));
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, ARollbackDoesNotBringALinkBack) {
+  file("data/dir/a", "x");
+  std::filesystem::create_symlink("/etc/hostname", at("data/dir/link"));
+  ASSERT_EQ(take(), 0);
+  std::filesystem::remove(at("data/dir/link"));
+  roll_back();
+  EXPECT_FALSE(exists(at("data/dir/link")));
+  EXPECT_EQ(read_text(at("data/dir/a")), "x");
+}
+
+TEST_F(SnapshotTest, AFileThatCannotBeCopiedBackIsTakenOutOfTheSnapshot) {
+  file("data/large", std::string(200000, 'l'), 0640);
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  {
+    const DiskFullAfter limit(100000);
+    EXPECT_EQ(roll_back(), 0);
+  }
+  expect_error("fail copy : from " + snapshot() + "/data/large to " + at("data/large"), 0);
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, AFileThatCannotBePutBackIsLoggedAndTheRestIsRestored) {
+  file("data/a", "x");
+  file("data/b", "y");
+  ASSERT_EQ(take(), 0);
+  const AtStep step("rollback-cleared", [&] {
+    // a directory that is not empty has taken the file's name
+    std::filesystem::create_directories(at("data/a/in/the/way"));
+  });
+  EXPECT_EQ(roll_back(), 0);
+  expect_error("fail copy : from " + snapshot() + "/data/a to " + at("data/a"));
+  EXPECT_EQ(read_text(at("data/b")), "y");
+}
+
+TEST_F(SnapshotTest, WhatIsNoFileInTheSnapshotIsUnexpected) {
+  std::filesystem::create_directories(snapshot() + "/data");
+  ASSERT_EQ(mkfifo((snapshot() + "/data/pipe").c_str(), 0600), 0);
+  EXPECT_EQ(parse_dir_for_rollback(snapshot().c_str(), kPkg, root.c_str()), 1);
+  expect_error("this is unexpected type : " + snapshot() + "/data/pipe");
+}
+
+TEST_F(SnapshotTest, AnEntryOfTheSnapshotThatVanishesIsLogged) {
+  write_text(snapshot() + "/data/a", "x");
+  const AtStep step(
+      "rollback-entry", [&] { unlink((snapshot() + "/data/a").c_str()); }, 2);
+  EXPECT_EQ(parse_dir_for_rollback(snapshot().c_str(), kPkg, root.c_str()), 1);
+  expect_error("error : lstat for -1 " + snapshot() + "/data/a");
+}
+
+TEST_F(SnapshotTest, AnArchiveIsNotCopiedBack) {
+  write_text(download(), "zip");
+  EXPECT_EQ(parse_dir_for_rollback(at("shared/data").c_str(), kPkg, root.c_str()), 1);
+  EXPECT_TRUE(captured_texts().empty());
+}
+
+TEST_F(SnapshotTest, ARollbackKeepsTheArchiveThatABackupRunHasStaged) {
+  make_old_data();
+  file("shared/data/org.example.notes_upload.zip", "staged", 0600);
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  roll_back();
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, WithoutASnapshotARollbackTouchesNothing) {
+  make_old_data();
+  const Tree before = tree();
+  EXPECT_EQ(roll_back(), 0);
+  expect_error("there isn't a snapshot of (org.example.notes) to roll back to");
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, AnApplicationsOwnSnapshotIsNeverRolledBackTo) {
+  make_old_data();
+  const Tree before = tree();
+  file("shared/data/quarn_tmp_rst_dir/data/settings.ini", "planted");
+  file("shared/data/quarn_tmp_rst_dir/shared/data/org.example.notes.perm", "{}");
+  roll_back();
+  EXPECT_EQ(read_text(at("data/settings.ini")), "old settings");
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_EQ(tree(), before) << "it is removed";
+}
+
+TEST_F(SnapshotTest, ASnapshotsTableDoesNotGiveSetIdBitsToAnotherUser) {
+  const std::string path = file("data/tool", "x");
+  ASSERT_EQ(chown(path.c_str(), 0, 0), 0);
+  ASSERT_EQ(chmod(path.c_str(), 04755), 0);
+  ASSERT_EQ(take(), 0);
+  roll_back();
+  struct stat status = {};
+  ASSERT_EQ(lstat(path.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0755U);
+}
+
+/* ---- recovery ---- */
+
+TEST_F(SnapshotTest, RecoveryPutsACompleteSnapshotBack) {
+  make_old_data();
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  EXPECT_TRUE(recover_interrupted_restore(kPkg, root.c_str()));
+  expect_info("restore of (org.example.notes) was interrupted, so its data will be put back");
+  EXPECT_EQ(tree(), before);
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+}
+
+TEST_F(SnapshotTest, RecoveryRemovesAnIncompleteSnapshot) {
+  make_old_data();
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  ASSERT_EQ(unlink(snapshot_table().c_str()), 0);
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, RecoveryRemovesALinkInTheSnapshotsPlace) {
+  std::filesystem::create_directory_symlink(base, snapshot());
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_FALSE(exists(snapshot()));
+  EXPECT_TRUE(exists(base));
+}
+
+TEST_F(SnapshotTest, RecoveryVisitsEveryInstalledPackage) {
+  make_old_data();
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  int call = 0;
+  ON_CALL(platform, package_info_get_package).WillByDefault([&](auto, char **id) {
+    *id = call == 1 ? nullptr : strdup(kPkg);
+    return call == 0 ? -5 : 0;
+  });
+  ON_CALL(platform, package_info_get_root_path).WillByDefault([&](auto, char **path) {
+    *path = call == 3 ? nullptr : strdup(root.c_str());
+    return call == 2 ? -5 : 0;
+  });
+  ON_CALL(platform, package_manager_foreach_package_info)
+      .WillByDefault([&](package_manager_package_info_cb callback, void *data) {
+        for (; call < 5; ++call) EXPECT_TRUE(callback(nullptr, data));
+        return 0;
+      });
+  recover_interrupted_restores();
+  expect_error("package_info_get_package() was failed, ret = [-5]");
+  expect_error("package_info_get_package() was failed, ret = [0]");
+  expect_error("package_info_get_root_path() was failed, ret = [-5]");
+  expect_error("package_info_get_root_path() was failed, ret = [0]");
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, ASweepThatFailsIsLogged) {
+  ON_CALL(platform, package_manager_foreach_package_info).WillByDefault(Return(-5));
+  recover_interrupted_restores();
+  expect_error("package_manager_foreach_package_info() failed -5");
+}
+
+TEST_F(SnapshotTest, DiscardingTakesTheTableAwayFirst) {
+  make_old_data();
+  ASSERT_EQ(take(), 0);
+  bool table_there = true;
+  bool copy_there = false;
+  const AtStep step("snapshot-released", [&] {
+    table_there = exists(snapshot_table());
+    copy_there = exists(snapshot() + "/data/settings.ini");
+  });
+  discard_snapshot(kPkg, root.c_str());
+  EXPECT_FALSE(table_there);
+  EXPECT_TRUE(copy_there);
+  EXPECT_FALSE(exists(snapshot()));
+}
+
+}  // namespace
