@@ -27,13 +27,30 @@ int quarnd_manual_backup_cancel(void *record);
 int quarnd_backup_app_data(const char *pkg_id, void *record);
 /** Restore one package now; waits in a nested loop. @return 0, or 1: unknown package */
 int quarnd_restore_app_data(const char *pkg_id, void *record);
-/** Pack one package into /tmp. @param client_uid user that shall own the archive */
+/**
+ * Pack one package's data as /tmp/PKGID_tmp.zip, mode 0600, in place of an earlier one.
+ * @param client_uid user that shall own the archive
+ * @return 0, 36 without a root path, or what packing gave; the archive is there with 0 only
+ */
 int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid);
 
-/** Restore mode on or off. @return 0 done, 1 bad client, 36 refused */
+/** Restore mode of the phone-transfer companion is active. */
+extern char pellix_restore_running;
+/** Restore mode was enabled by the cloud client. */
+extern char cloud_restore_running;
+
+/**
+ * Restore mode on or off. The record is kept while the mode lasts, for
+ * "restore_stop"; the records of other calls are deleted.
+ * @return 0 done, 1 bad client, 36 refused
+ */
 int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
                           void *record);
-/** Replace the candidate list by a JSON array of package ids. @return its length */
+/**
+ * Replace the candidate list by a JSON array of package ids. Anything else
+ * than an array of texts is an empty list; impossible ids are left out.
+ * @return length of the list
+ */
 int init_package_list_to_be_restored(const char *pkg_list_json);
 
 #endif

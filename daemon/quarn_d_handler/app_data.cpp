@@ -1,0 +1,339 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <memory>
+#include <utility>
+
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/platform_handles.h"
+#include "quarn_dbus_client.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr char kExportDir[] = "/tmp/";
+constexpr char kExportSuffix[] = "_tmp.zip";
+constexpr char kStagingTemplate[] = "/tmp/quarn_export_XXXXXX";
+constexpr char kStagedName[] = "/export.zip";
+constexpr mode_t kExportMode = 0600;
+
+/** The CPU lock for the length of a request. */
+class PowerLock {
+ public:
+  PowerLock() { request_power_lock(true); }
+  ~PowerLock() { request_power_lock(false); }
+  PowerLock(const PowerLock &) = delete;
+  PowerLock &operator=(const PowerLock &) = delete;
+};
+
+/** What a request needs to know of its package and the device. */
+struct package_facts {
+  std::string version;
+  std::string type;
+  std::string root;
+  std::string model;
+  std::string serial;
+};
+
+/** One of the package's texts. @return 0 or 42 */
+int read_text(package_info_h info, int (*get)(package_info_h, char **), const char *call,
+              const char *what, std::string *text) {
+  CString value;
+  const int result = get(info, out(value));
+  if (result != PACKAGE_MANAGER_ERROR_NONE) {
+    LOGE("%s() was failed, ret = [%d]", call, result);
+    return QUARN_FAILED;
+  }
+  if (value == nullptr) {
+    LOGE("%s is NULL", what);
+    return QUARN_FAILED;
+  }
+  *text = value.get();
+  return QUARN_OK;
+}
+
+int read_version(package_info_h info, package_facts *facts) {
+  return read_text(info, package_info_get_version, "package_info_get_version", "pkg_version",
+                   &facts->version);
+}
+
+int read_type(package_info_h info, package_facts *facts) {
+  return read_text(info, package_info_get_type, "package_info_get_type", "pkg_type", &facts->type);
+}
+
+int read_root_path(package_info_h info, package_facts *facts) {
+  return read_text(info, package_info_get_root_path, "package_info_get_root_path", "pkg_root_path",
+                   &facts->root);
+}
+
+/** 0 for a package that the user installed. */
+int refuse_preloaded(package_info_h info) {
+  bool preload = false;
+  const int result = package_info_is_preload_package(info, &preload);
+  if (result != PACKAGE_MANAGER_ERROR_NONE) {
+    LOGE("package_info_is_preload_package fail, err = [%d]", result);
+    return QUARN_FAILED;
+  }
+  if (preload) {
+    LOGE("we don't support preload app");
+    return QUARN_PRELOADED;
+  }
+  return QUARN_OK;
+}
+
+bool read_device(package_facts *facts) {
+  CString model;
+  CString serial;
+  get_device_info(out(model), out(serial));
+  if (model == nullptr || serial == nullptr) {
+    LOGE("cannot get device info");
+    return false;
+  }
+  facts->model = model.get();
+  facts->serial = serial.get();
+  return true;
+}
+
+/** Visit the package's applications. @return 0 or 42 */
+int visit_applications(package_info_h info, package_info_app_cb callback, void *data) {
+  const int result =
+      package_info_foreach_app_from_package(info, PACKAGE_INFO_ALLAPP, callback, data);
+  if (result == PACKAGE_MANAGER_ERROR_NONE) return QUARN_OK;
+  LOGE("package_info_foreach_app_from_package() failed : %d", result);
+  return QUARN_FAILED;
+}
+
+/** 0, or 41 when one of the package's applications does not take part in backup. */
+int refuse_disabled(const std::string &pkg_id, bool enabled) {
+  if (!enabled) {
+    LOGI("backup disabled for (%s)", pkg_id.c_str());
+    return QUARN_DISABLED;
+  }
+  LOGI("backup enabled for (%s)", pkg_id.c_str());
+  return QUARN_OK;
+}
+
+bool _check_backup_enabled(package_info_app_component_type_e /*type*/, const char *app_id,
+                           void *data) {
+  auto *ctx = static_cast<backup_context *>(data);
+  if (!backup_enabled_app(app_id)) ctx->cur_backup_enabled = false;
+  return true;
+}
+
+bool _check_restore_enabled(package_info_app_component_type_e /*type*/, const char *app_id,
+                            void *data) {
+  auto *ctx = static_cast<pkg_restore_context *>(data);
+  if (!backup_enabled_app(app_id)) ctx->backup_enabled = false;
+  return true;
+}
+
+bool _package_cb_for_backup(package_info_app_component_type_e /*type*/, const char *app_id,
+                            void *data) {
+  auto *ctx = static_cast<backup_context *>(data);
+  if (!ctx->cur_backup_enabled || ctx->first_app_taken) return true;
+  ctx->first_app_taken = true;
+  const int result = make_app_data_zip(ctx, app_id);
+  if (result != QUARN_OK) {
+    LOGE("cannot make app data zip...");
+    ctx->result = result;
+    return true;
+  }
+  upload_app_data(ctx, ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(),
+                  ctx->cur_version.c_str());
+  return true;
+}
+
+bool _package_cb_for_restore(package_info_app_component_type_e /*type*/, const char *app_id,
+                             void *data) {
+  auto *ctx = static_cast<pkg_restore_context *>(data);
+  if (!ctx->backup_enabled || ctx->restore_started) return true;
+  ctx->restore_started = true;
+  restore_app_data(app_id, ctx);
+  return true;
+}
+
+/** Wait for the answer to the upload. @return the run's result */
+int wait_for_upload(backup_context *ctx) {
+  if (ctx->upload_remain > 0) {
+    const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+    ctx->wait_loop = g_main_loop_ref(loop.get());
+    run_nested_loop(loop.get());
+    const GMainLoopPtr left(ctx->wait_loop.exchange(nullptr));
+    if (left != nullptr) {
+      // The daemon ends. The run lives on until its answer comes, if it comes.
+      ctx->abandoned = true;
+      return QUARN_CANCELLED;
+    }
+  }
+  return ctx->result;
+}
+
+int back_up(const std::string &pkg_id, package_info_h info, void *record) {
+  package_facts facts;
+  int result = refuse_preloaded(info);
+  if (result == QUARN_OK) result = read_version(info, &facts);
+  if (result == QUARN_OK) result = read_type(info, &facts);
+  if (result == QUARN_OK) result = read_root_path(info, &facts);
+  if (result == QUARN_OK && !read_device(&facts)) result = QUARN_FAILED;
+  if (result != QUARN_OK) return result;
+
+  const BackupContextPtr ctx(new backup_context);
+  ctx->single_package = true;
+  ctx->client = record;
+  ctx->cur_pkg_id = pkg_id;
+  ctx->cur_version = facts.version;
+  ctx->cur_pkg_type = facts.type;
+  ctx->cur_root_path = facts.root;
+  ctx->model_name = facts.model;
+  ctx->serial_number = facts.serial;
+  ctx->cur_backup_enabled = true;
+  result = visit_applications(info, _check_backup_enabled, ctx.get());
+  if (result == QUARN_OK) result = refuse_disabled(pkg_id, ctx->cur_backup_enabled);
+  if (result != QUARN_OK) return result;
+  result = visit_applications(info, _package_cb_for_backup, ctx.get());
+  const int uploaded = wait_for_upload(ctx.get());
+  return result != QUARN_OK ? result : uploaded;
+}
+
+/** Wait for the end of the restore, and take its context back. @return its result */
+int wait_for_restore(std::unique_ptr<pkg_restore_context> ctx) {
+  if (ctx->pending > 0) {
+    const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+    ctx->main_loop = g_main_loop_ref(loop.get());
+    run_nested_loop(loop.get());
+    const GMainLoopPtr left(std::exchange(ctx->main_loop, nullptr));
+    if (left != nullptr) {
+      // The daemon ends, and the download still has its context.
+      ctx->abandoned = true;
+      static_cast<void>(ctx.release());
+      return QUARN_CANCELLED;
+    }
+  }
+  return ctx->result;
+}
+
+int restore(const std::string &pkg_id, package_info_h info, void *record) {
+  package_facts facts;
+  int result = refuse_preloaded(info);
+  if (result == QUARN_OK) result = read_version(info, &facts);
+  if (result == QUARN_OK) result = read_root_path(info, &facts);
+  if (result == QUARN_OK) {
+    recover_interrupted_restore(pkg_id.c_str(), facts.root.c_str());
+    if (!read_device(&facts)) result = QUARN_REFUSED;
+  }
+  if (result != QUARN_OK) return result;
+
+  auto ctx = std::make_unique<pkg_restore_context>();
+  ctx->serial = facts.serial;
+  ctx->client = record;
+  ctx->wait_for_result = true;
+  ctx->pkgid = pkg_id;
+  ctx->version = facts.version;
+  ctx->root = facts.root;
+  result = visit_applications(info, _check_restore_enabled, ctx.get());
+  if (result == QUARN_OK) result = refuse_disabled(pkg_id, ctx->backup_enabled);
+  if (result != QUARN_OK) return result;
+  result = visit_applications(info, _package_cb_for_restore, ctx.get());
+  const int restored = wait_for_restore(std::move(ctx));
+  return result != QUARN_OK ? result : restored;
+}
+
+using Work = int (*)(const std::string &pkg_id, package_info_h info, void *record);
+using Answer = int (*)(int err, const char *msg, void *record);
+
+/** The frame of both requests: whatever happens, the client is told once. */
+int serve(const char *id, void *record, Work work, Answer answer) {
+  const std::string pkg_id = id == nullptr ? "" : id;
+  if (!is_safe_path_component(pkg_id)) {
+    LOGE("refused : not a package id (%s)", pkg_id.c_str());
+    answer(QUARN_BAD_ARGUMENT, pkg_id.c_str(), record);
+    return QUARN_BAD_ARGUMENT;
+  }
+  const PowerLock lock;
+  if (!cloud_initialized()) {
+    answer(QUARN_NO_SESSION, pkg_id.c_str(), record);
+    return QUARN_OK;
+  }
+  PackageInfoPtr info;
+  const int result = package_manager_get_package_info(pkg_id.c_str(), out(info));
+  if (result != PACKAGE_MANAGER_ERROR_NONE) {
+    LOGE("package_manager_get_package_info() failed : %d", result);
+    answer(QUARN_BAD_ARGUMENT, pkg_id.c_str(), record);
+    return QUARN_BAD_ARGUMENT;
+  }
+  const int outcome = work(pkg_id, info.get(), record);
+  info.reset();
+  answer(outcome, pkg_id.c_str(), record);
+  return QUARN_OK;
+}
+
+/** A folder that nobody else can put anything into; removed with what is left in it. */
+class StagingDir {
+ public:
+  StagingDir() : path_(kStagingTemplate) {
+    if (mkdtemp(path_.data()) == nullptr) path_.clear();
+  }
+  ~StagingDir() {
+    if (!path_.empty()) clear_directory(path_.c_str(), true);
+  }
+  StagingDir(const StagingDir &) = delete;
+  StagingDir &operator=(const StagingDir &) = delete;
+  const std::string &path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+/** Give the archive to the client under its public name, over whatever lies there. */
+bool hand_over(const std::string &archive, const std::string &target, uid_t client_uid) {
+  const UniqueFd file(open(archive.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  return file && fchmod(file.get(), kExportMode) == 0 &&
+         fchown(file.get(), client_uid, static_cast<gid_t>(-1)) == 0 &&
+         rename(archive.c_str(), target.c_str()) == 0;
+}
+
+}  // namespace
+
+int quarnd_backup_app_data(const char *pkg_id, void *record) {
+  LOGI("quarnd_backup_app_data");
+  return serve(pkg_id, record, back_up, quarn_dbus_app_backup_complete);
+}
+
+int quarnd_restore_app_data(const char *pkg_id, void *record) {
+  LOGI("quarnd_restore_app_data");
+  return serve(pkg_id, record, restore, quarn_dbus_app_restore_complete);
+}
+
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
+  if (pkg_id == nullptr || !is_safe_path_component(pkg_id)) {
+    LOGE("cannot get root path info of (%s)...", pkg_id == nullptr ? "" : pkg_id);
+    return QUARN_REFUSED;
+  }
+  const std::string target = std::string(kExportDir) + pkg_id + kExportSuffix;
+  if (file_exist(target.c_str())) delete_file(target.c_str());
+  std::string root;
+  if (get_string_app_root_path(pkg_id, root) != QUARN_OK) {
+    LOGE("cannot get root path info of (%s)...", pkg_id);
+    return QUARN_REFUSED;
+  }
+  reset_backup_path_info();
+  int zip_result = QUARN_OK;
+  const StagingDir staging;
+  const std::string archive = staging.path() + kStagedName;
+  if (staging.path().empty()) {
+    zip_result = QUARN_UNREADABLE;
+  } else {
+    make_zip_data(pkg_id, root.c_str(), archive.c_str(), &zip_result);
+  }
+  if (zip_result == QUARN_OK && !hand_over(archive, target, client_uid)) {
+    LOGE("fail to hand over %s : %d", target.c_str(), errno);
+    zip_result = QUARN_UNREADABLE;
+  }
+  LOGI("quarnd_make_app_data zip_result = %d", zip_result);
+  return zip_result;
+}

@@ -1,0 +1,445 @@
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <filesystem>
+
+#include "handler_fixture.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+
+using ::testing::_;
+using ::testing::Return;
+
+namespace {
+
+/** What both per-application requests have in common. */
+struct Request {
+  const char *name;
+  int (*start)(const char *pkg_id, void *record);
+  const char *callback;
+};
+const Request kBackup = {"quarnd_backup_app_data", quarnd_backup_app_data,
+                         "app_data_backup_complete"};
+const Request kRestore = {"quarnd_restore_app_data", quarnd_restore_app_data,
+                          "app_data_restore_complete"};
+
+class AppDataTest : public HandlerTest {
+ protected:
+  int back_up(const char *pkg = kPkg) { return quarnd_backup_app_data(pkg, make_record(7)); }
+  int restore(const char *pkg = kPkg) { return quarnd_restore_app_data(pkg, make_record(7)); }
+  static Answers backed_up(int err) { return {{"app_data_backup_complete", err, kPkg, 7}}; }
+  static Answers restored(int err) { return {{"app_data_restore_complete", err, kPkg, 7}}; }
+  std::string staged() const { return at("shared/data/org.example.notes_upload.zip"); }
+  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600}};
+};
+
+class BothRequests : public AppDataTest, public ::testing::WithParamInterface<Request> {
+ protected:
+  int start(const char *pkg = kPkg) { return GetParam().start(pkg, make_record(7)); }
+  Answers answered(int err, const std::string &pkg = kPkg) const {
+    return {{GetParam().callback, err, pkg, 7}};
+  }
+  void expect_no_transfer() const {
+    EXPECT_TRUE(downloads.empty());
+    EXPECT_TRUE(uploads.empty());
+    EXPECT_TRUE(is_idle_status());
+  }
+};
+
+TEST_P(BothRequests, WithoutASessionTheAnswerIsThirtyThreeBeforeAnyLookup) {
+  session.ready = false;
+  EXPECT_CALL(platform, package_manager_get_package_info).Times(0);
+  EXPECT_EQ(start(), 0);
+  EXPECT_EQ(outside.answers, answered(33));
+  expect_info(GetParam().name);
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, AnUnknownPackageIsAnsweredWithOneTwice) {
+  ON_CALL(platform, package_manager_get_package_info).WillByDefault(Return(-71));
+  EXPECT_EQ(start(), 1);
+  EXPECT_EQ(outside.answers, answered(1));
+  expect_error("package_manager_get_package_info() failed : -71");
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, AnImpossiblePackageIsUnknownWithoutTouchingThePlatform) {
+  EXPECT_CALL(platform, package_manager_get_package_info).Times(0);
+  for (const char *pkg : {"", ".", "..", "a/b", "../../etc"}) {
+    outside.answers.clear();
+    EXPECT_EQ(start(pkg), 1) << pkg;
+    EXPECT_EQ(outside.answers, answered(1, pkg));
+    expect_error("refused : not a package id (" + std::string(pkg) + ")");
+  }
+  EXPECT_EQ(start(nullptr), 1);
+  EXPECT_EQ(session.asked, 0);
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, APreloadedPackageIsAnsweredWithTwentySeven) {
+  ON_CALL(platform, package_info_is_preload_package).WillByDefault([](auto, bool *preload) {
+    *preload = true;
+    return 0;
+  });
+  EXPECT_EQ(start(), 0);
+  EXPECT_EQ(outside.answers, answered(27));
+  expect_error("we don't support preload app");
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, EveryFactThatCannotBeReadIsAnsweredWithFortyTwo) {
+  const auto none = [](auto, char **text) {
+    *text = nullptr;
+    return 0;
+  };
+  const auto version = [](auto, char **text) {
+    *text = strdup(kVersion);
+    return 0;
+  };
+  ON_CALL(platform, package_info_is_preload_package).WillByDefault(Return(-5));
+  EXPECT_EQ(start(), 0);
+  expect_error("package_info_is_preload_package fail, err = [-5]");
+  ON_CALL(platform, package_info_is_preload_package).WillByDefault([](auto, bool *preload) {
+    *preload = false;
+    return 0;
+  });
+
+  ON_CALL(platform, package_info_get_version).WillByDefault(Return(-5));
+  EXPECT_EQ(start(), 0);
+  expect_error("package_info_get_version() was failed, ret = [-5]");
+  ON_CALL(platform, package_info_get_version).WillByDefault(none);
+  EXPECT_EQ(start(), 0);
+  expect_error("pkg_version is NULL");
+  ON_CALL(platform, package_info_get_version).WillByDefault(version);
+
+  ON_CALL(platform, package_info_get_root_path).WillByDefault(Return(-5));
+  EXPECT_EQ(start(), 0);
+  expect_error("package_info_get_root_path() was failed, ret = [-5]");
+  ON_CALL(platform, package_info_get_root_path).WillByDefault(none);
+  EXPECT_EQ(start(), 0);
+  expect_error("pkg_root_path is NULL");
+
+  ASSERT_EQ(outside.answers.size(), 5U);
+  for (const auto &answer : outside.answers) EXPECT_EQ(answer.err, 42);
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, AFailedFirstVisitIsAnsweredWithFortyTwo) {
+  ON_CALL(platform, package_info_foreach_app_from_package).WillByDefault(Return(-5));
+  EXPECT_EQ(start(), 0);
+  EXPECT_EQ(outside.answers, answered(42));
+  expect_error("package_info_foreach_app_from_package() failed : -5");
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, AFailedSecondVisitIsAnsweredWithFortyTwo) {
+  int visit = 0;
+  ON_CALL(platform, package_info_foreach_app_from_package)
+      .WillByDefault([&](auto, auto, auto, void *) { return ++visit == 2 ? -5 : 0; });
+  EXPECT_EQ(start(), 0);
+  EXPECT_EQ(outside.answers, answered(42));
+  expect_error("package_info_foreach_app_from_package() failed : -5");
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, ADisabledPackageIsAnsweredWithFortyOne) {
+  opted_out = true;
+  EXPECT_EQ(start(), 0);
+  EXPECT_EQ(outside.answers, answered(41));
+  expect_info("backup disabled for (org.example.notes)");
+  EXPECT_FALSE(exists(staged())) << "nothing is zipped";
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, APackageWithoutApplicationsHasNothingToTransfer) {
+  apps.clear();
+  EXPECT_EQ(start(), 0);
+  EXPECT_EQ(outside.answers, answered(0));
+  expect_no_transfer();
+}
+
+TEST_P(BothRequests, ThePackagesHandleIsReleased) {
+  EXPECT_CALL(platform, package_info_destroy).Times(1);
+  opted_out = true;
+  EXPECT_EQ(start(), 0);
+}
+
+INSTANTIATE_TEST_SUITE_P(AppData, BothRequests, ::testing::Values(kBackup, kRestore),
+                         [](const auto &info) {
+                           return std::string(info.index == 0 ? "Backup" : "Restore");
+                         });
+
+/* ---- backup ---- */
+
+TEST_F(AppDataTest, ABackupWaitsForItsUpload) {
+  make_old_data();
+  later([this] {
+    EXPECT_TRUE(outside.answers.empty());
+    EXPECT_FALSE(is_idle_status());
+    ASSERT_EQ(uploads.size(), 1U) << "the first application only";
+    EXPECT_EQ(uploads[0].local, staged());
+    EXPECT_EQ(uploads[0].remote, "/350000000000001/org.example.notes/1.2.0/org.example.notes.zip");
+    answer_upload();
+  });
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(0));
+  expect_info("backup enabled for (org.example.notes)");
+  EXPECT_FALSE(exists(staged()));
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(AppDataTest, AnUploadThatFailsIsAnsweredWithTwelve) {
+  make_old_data();
+  later([this] { answer_upload(BACKUP_TRANS_ERROR_NETWORK); });
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(12));
+}
+
+TEST_F(AppDataTest, AnUploadThatIsRefusedIsAnsweredWithTwelveAtOnce) {
+  make_old_data();
+  upload_result = 2;
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(12));
+}
+
+TEST_F(AppDataTest, AnArchiveThatCannotBeMadeIsAnsweredWithItsCode) {
+  ON_CALL(platform, pkgmgrinfo_pkginfo_get_installed_storage).WillByDefault([](auto, auto *where) {
+    *where = PMINFO_EXTERNAL_STORAGE;
+    return 0;
+  });
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(34));
+  expect_error("cannot make app data zip...");
+}
+
+TEST_F(AppDataTest, ABackupWithoutATypeIsAnsweredWithFortyTwo) {
+  ON_CALL(platform, package_info_get_type).WillByDefault(Return(-5));
+  EXPECT_EQ(back_up(), 0);
+  expect_error("package_info_get_type() was failed, ret = [-5]");
+  ON_CALL(platform, package_info_get_type).WillByDefault([](auto, char **text) {
+    *text = nullptr;
+    return 0;
+  });
+  EXPECT_EQ(back_up(), 0);
+  expect_error("pkg_type is NULL");
+  for (const auto &answer : outside.answers) EXPECT_EQ(answer.err, 42);
+}
+
+TEST_F(AppDataTest, ABackupWithoutDeviceInformationIsAnsweredWithFortyTwo) {
+  ON_CALL(platform, tel_init).WillByDefault(Return(nullptr));
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(42));
+  expect_error("cannot get device info");
+}
+
+TEST_F(AppDataTest, ABackupIsCancelledWhenTheDaemonEnds) {
+  make_old_data();
+  outside.ending = true;
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(17));
+  answer_upload();  // comes too late, and finds everything it needs
+  EXPECT_EQ(outside.answers.size(), 1U);
+}
+
+/* ---- restore ---- */
+
+TEST_F(AppDataTest, ARestoreWaitsForItsDownloadAndIsWhole) {
+  make_old_data();
+  later([this] {
+    EXPECT_TRUE(outside.answers.empty());
+    EXPECT_FALSE(is_idle_status());
+    ASSERT_EQ(downloads.size(), 1U) << "the first application only";
+    EXPECT_EQ(downloads[0].remote,
+              "/350000000000001/org.example.notes/1.2.0/org.example.notes.zip");
+    clear_app_dir(kPkg, root.c_str());  // as freshly installed
+    make_archive(download(), new_data);
+    answer();
+  });
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(0));
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(AppDataTest, ARestoreDoesNotAskForTheType) {
+  EXPECT_CALL(platform, package_info_get_type).Times(0);
+  transport_result = 2;
+  EXPECT_EQ(restore(), 0);
+}
+
+TEST_F(AppDataTest, ADownloadThatIsRefusedIsAnsweredWithThirteenWithoutWaiting) {
+  transport_result = 2;
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(13));
+}
+
+TEST_F(AppDataTest, ADownloadThatFailsIsAnsweredWithTwelve) {
+  later([this] { answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT); });
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(12));
+}
+
+TEST_F(AppDataTest, AnArchiveThatCannotBeUnpackedIsAnsweredWithThirtyOne) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  later([this] {
+    write_text(download(), "not an archive");
+    answer();
+  });
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(31));
+  EXPECT_EQ(tree_of(root), before);
+}
+
+TEST_F(AppDataTest, AttributesThatCannotBeRestoredAreAnsweredWithThirtySix) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  later([this] {
+    make_archive(download(), new_data, "not json");
+    answer();
+  });
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(36));
+  EXPECT_EQ(tree_of(root), before);
+}
+
+TEST_F(AppDataTest, ARestoreWithoutDeviceInformationIsAnsweredWithThirtySix) {
+  ON_CALL(platform, system_info_get_platform_string).WillByDefault(Return(-1));
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(36));
+  expect_error("cannot get device info");
+}
+
+TEST_F(AppDataTest, ARestoreInTheCompanionsModeDoesNotWait) {
+  current_restore_client = 1;
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(31)) << "there is no archive of the companion's";
+  EXPECT_TRUE(downloads.empty());
+}
+
+TEST_F(AppDataTest, TwoRestoresOfOnePackageAreAnsweredOneByOne) {
+  make_old_data();
+  later([this] {
+    later([this] {
+      make_archive(download(), new_data, "not json");
+      answer();
+      write_text(download(), "not an archive");
+      answer();
+    });
+    EXPECT_EQ(restore(), 0);
+  });
+  EXPECT_EQ(restore(), 0);
+  ASSERT_EQ(outside.answers.size(), 2U);
+  EXPECT_EQ(outside.answers[0].err, 31) << "the inner request";
+  EXPECT_EQ(outside.answers[1].err, 36);
+}
+
+TEST_F(AppDataTest, ARestoreIsCancelledWhenTheDaemonEnds) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  outside.ending = true;
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(outside.answers, restored(17));
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_EQ(outside.answers.size(), 1U);
+  EXPECT_EQ(tree_of(root), before);
+}
+
+TEST_F(AppDataTest, WhatADeadDaemonLeftIsPutBackWhenTheRestoreIsRequested) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  file("data/settings.ini", "half of a restore");
+  opted_out = true;
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(tree_of(root), before);
+}
+
+/* ---- export ---- */
+
+class ExportTest : public AppDataTest {
+ protected:
+  ExportTest() { make_old_data(); }
+  ~ExportTest() override { std::filesystem::remove_all(kTarget); }
+  static constexpr char kTarget[] = "/tmp/org.example.notes_tmp.zip";
+  static constexpr unsigned int kClient = 1234;
+  int make(const char *pkg = kPkg) { return quarnd_make_app_data(pkg, kClient); }
+  void expect_exported() const {
+    struct stat status = {};
+    ASSERT_EQ(lstat(kTarget, &status), 0);
+    EXPECT_TRUE(S_ISREG(status.st_mode));
+    EXPECT_EQ(status.st_mode & 07777, 0600U);
+    EXPECT_EQ(status.st_uid, kClient);
+    EXPECT_GT(status.st_size, 0);
+  }
+  static int staging_directories() {
+    int count = 0;
+    for (const auto &item : std::filesystem::directory_iterator("/tmp")) {
+      count += item.path().filename().string().rfind("quarn_export_", 0) == 0;
+    }
+    return count;
+  }
+};
+
+TEST_F(ExportTest, PacksThePackageForTheClientAlone) {
+  const int before = staging_directories();
+  EXPECT_EQ(make(), 0);
+  expect_exported();
+  expect_info("quarnd_make_app_data zip_result = 0");
+  EXPECT_TRUE(outside.answers.empty());
+  EXPECT_TRUE(uploads.empty());
+  EXPECT_EQ(staging_directories(), before);
+}
+
+TEST_F(ExportTest, ASecondExportReplacesTheFirst) {
+  EXPECT_EQ(make(), 0);
+  struct stat first = {};
+  ASSERT_EQ(lstat(kTarget, &first), 0);
+  write_text(kTarget, "");
+  EXPECT_EQ(make(), 0);
+  expect_exported();
+}
+
+TEST_F(ExportTest, EverythingIsPackedWhateverTheRulesOfAnEarlierPackageWere) {
+  backup_exclude_list = {root + "/"};
+  EXPECT_EQ(make(), 0);
+  EXPECT_TRUE(backup_exclude_list.empty());
+}
+
+TEST_F(ExportTest, ALinkThatLiesThereIsReplacedAndNotFollowed) {
+  write_text(base + "/outside", "untouched");
+  std::filesystem::create_symlink(base + "/outside", kTarget);
+  EXPECT_EQ(make(), 0);
+  expect_exported();
+  EXPECT_EQ(read_text(base + "/outside"), "untouched");
+}
+
+TEST_F(ExportTest, WhatCannotBeReplacedMakesItFail) {
+  std::filesystem::create_directories(std::string(kTarget) + "/in/the/way");
+  EXPECT_EQ(make(), 31);
+  expect_info("quarnd_make_app_data zip_result = 31");
+}
+
+TEST_F(ExportTest, WithoutARootPathItIsRefusedAndTheEarlierArchiveIsGone) {
+  write_text(kTarget, "earlier");
+  ON_CALL(platform, package_info_get_root_path).WillByDefault(Return(-5));
+  EXPECT_EQ(make(), 36);
+  EXPECT_GE(count_logged(DLOG_ERROR, "cannot get root path info of (org.example.notes)..."), 1);
+  EXPECT_FALSE(exists(kTarget));
+}
+
+TEST_F(ExportTest, AnImpossiblePackageIsRefused) {
+  EXPECT_CALL(platform, package_manager_get_package_info).Times(0);
+  for (const char *pkg : {"", "..", "../etc/x"}) EXPECT_EQ(make(pkg), 36) << pkg;
+  EXPECT_EQ(make(nullptr), 36);
+  expect_error("cannot get root path info of (../etc/x)...");
+}
+
+TEST_F(ExportTest, AnIncompleteArchiveIsNotHandedOver) {
+  std::filesystem::remove_all(at("shared/trusted"));
+  EXPECT_EQ(make(), 36);
+  expect_info("quarnd_make_app_data zip_result = 36");
+  EXPECT_FALSE(exists(kTarget));
+}
+
+}  // namespace
