@@ -1,7 +1,6 @@
-#include <atomic>
+#include "quarn_d_utils/boot_cleanup.h"
 
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/process_start.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -10,8 +9,6 @@ namespace {
 
 constexpr char kSharedDataDir[] = "/shared/data/";
 constexpr const char *kArchiveSuffixes[] = {"_upload.zip", "_download.zip"};
-
-std::atomic<bool> boot_cleanup_done{false};
 
 timespec file_clock_now() {
   timespec now{};
@@ -32,6 +29,7 @@ bool left_by_an_earlier_process(const char *path) {
 
 }  // namespace
 
+std::atomic<bool> boot_cleanup_done{false};
 timespec quarn_process_start = file_clock_now();
 
 bool boot_foreach_package_info_callback(package_info_h info, void *) {

@@ -1,7 +1,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "log_capture.h"
@@ -189,6 +191,22 @@ TEST_F(SettingTest, AWifiMonitorThatCannotBeStoppedRunsOn) {
   EXPECT_EQ(stop_wifi_monitor(), 0);
   EXPECT_EQ(wifi_connected(), 1);
   EXPECT_EQ(count_logged(DLOG_ERROR, "connection_unset_type_changed_cb failed -5"), 1);
+}
+
+TEST_F(SettingTest, AnotherThreadMayAskForWifiWhileItChanges) {
+  start_wifi_monitor();
+  std::atomic<bool> seen{false};
+  std::thread worker([&seen] {
+    while (wifi_connected() == 0) std::this_thread::yield();
+    seen = true;
+  });
+  while (!seen) {
+    set_network(CONNECTION_TYPE_CELLULAR);
+    set_network(CONNECTION_TYPE_WIFI);
+    std::this_thread::yield();
+  }
+  worker.join();
+  EXPECT_EQ(wifi_connected(), 1);
 }
 
 TEST_F(ConditionsTest, ANetworkChangeIsOnlyCheckedWhileAutoBackupIsOn) {
