@@ -1,0 +1,45 @@
+#include "quarn_d_lifecycle.h"
+
+#include "quarn_d_loop.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_log.h"
+
+int quarn_exit_code = 0;
+
+namespace {
+
+constexpr int kRestartWanted = -1;
+/** What an Ecore timer's callback returns to be the last of it. */
+constexpr unsigned char kDoNotRepeat = 0;
+
+void *quarn_terminate_timer = nullptr;
+
+}  // namespace
+
+unsigned char terminate_cb(void *) {
+  quarn_terminate_timer = nullptr;  // Ecore deletes it with this return
+  LOGI("terminate quarn");
+  quarn_loop_quit();
+  return kDoNotRepeat;
+}
+
+void request_quarn_terminate(double delay, bool restart) {
+  if (!is_idle_status()) {
+    LOGI("Not in idle state");
+    return;
+  }
+  quarn_exit_code = restart ? kRestartWanted : 0;
+  if (delay == 0.0) {
+    LOGI("terminate quarn");
+    quarn_loop_quit();
+    return;
+  }
+  cancel_quarn_terminate();
+  quarn_terminate_timer = quarn_loop_timer_add(delay, terminate_cb, nullptr);
+}
+
+void cancel_quarn_terminate() {
+  if (quarn_terminate_timer == nullptr) return;
+  quarn_loop_timer_del(quarn_terminate_timer);
+  quarn_terminate_timer = nullptr;
+}

@@ -1,0 +1,318 @@
+#include "quarn_dbus_client.h"
+
+#include <gtest/gtest.h>
+
+#include <new>
+
+#include "log_capture.h"
+#include "private_bus.h"
+#include "quarn_common.h"
+
+namespace {
+
+using Texts = std::vector<std::string>;
+
+/** Whether the watched record was deleted. */
+const void *watched = nullptr;
+bool watched_deleted = false;
+
+}  // namespace
+
+// The record has no virtual destructor to hook into.
+void operator delete(void *memory, std::size_t) noexcept {
+  if (memory != nullptr && memory == watched) watched_deleted = true;
+  std::free(memory);
+}
+void operator delete(void *memory) noexcept {
+  if (memory != nullptr && memory == watched) watched_deleted = true;
+  std::free(memory);
+}
+void *operator new(std::size_t size) {
+  if (void *memory = std::malloc(size)) return memory;
+  throw std::bad_alloc();
+}
+
+namespace {
+
+class Callbacks : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    connection_ = connect_to_private_bus();
+    quarn_dbus_connection = connection_.get();
+    client_ = std::make_unique<ScriptedClient>();
+    clear_captured_log();
+  }
+  void TearDown() override {
+    client_.reset();
+    if (!watched_deleted) delete record_;
+    watched = nullptr;
+    quarn_dbus_connection = nullptr;
+    g_dbus_connection_close_sync(connection_.get(), nullptr, nullptr);
+  }
+
+  /** A record for @p client, watched. */
+  client_cb_data *record_for(const std::string &client) {
+    record_ = new client_cb_data{7, client};
+    watched_deleted = false;
+    watched = record_;
+    return record_;
+  }
+  client_cb_data *record() { return record_for(client_->name()); }
+  /** A client that has left the bus. */
+  static std::string left() {
+    const ScriptedClient gone;
+    return gone.name();
+  }
+
+  ConnectionHandle connection_;
+  std::unique_ptr<ScriptedClient> client_;
+  client_cb_data *record_ = nullptr;
+};
+
+TEST_F(Callbacks, RestoreEnableCarriesErrorMessageAndRequestId) {
+  client_->answer("restore_enable_cb", "(5,)");
+  EXPECT_EQ(quarn_dbus_restore_enable_cb(3, "org.example.notes", record()), 5);
+  EXPECT_EQ(client_->callbacks(), Texts{"restore_enable_cb(3, 'org.example.notes', 7)"});
+  EXPECT_EQ(
+      count_logged(DLOG_INFO, "in quarn_dbus_restore_enable_cb. err:3, msg:org.example.notes"), 1);
+}
+
+TEST_F(Callbacks, RestoreEnableKeepsTheRecordUntilRestoreStop) {
+  client_cb_data *data = record();
+  quarn_dbus_restore_enable_cb(0, "org.example.notes", data);
+  EXPECT_FALSE(watched_deleted);
+  quarn_dbus_restore_enable_cb(0, "restore_stop_now", data);
+  EXPECT_FALSE(watched_deleted);
+  quarn_dbus_restore_enable_cb(0, "restore_stop", data);
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(client_->callbacks().back(), "restore_enable_cb(0, 'restore_stop', 7)");
+}
+
+TEST_F(Callbacks, GetAppListCarriesTheListAndDeletesTheRecord) {
+  EXPECT_EQ(quarn_dbus_get_app_list_cb(0, "{}", record()), 0);
+  EXPECT_EQ(client_->callbacks(), Texts{"get_app_list_cb(0, '{}', 7)"});
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(count_logged(DLOG_INFO, "in quarn_dbus_get_app_list_cb"), 1);
+}
+
+TEST_F(Callbacks, ManualBackupStatusTwoKeepsTheRecordForLaterCalls) {
+  client_cb_data *data = record();
+  EXPECT_EQ(quarn_dbus_manual_backup_status(0, 2, data), 0);
+  EXPECT_FALSE(watched_deleted);
+  EXPECT_EQ(quarn_dbus_manual_backup_status(0, 4, data), 0);
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(client_->callbacks(),
+            (Texts{"manual_backup_status(0, 2, 7)", "manual_backup_status(0, 4, 7)"}));
+  EXPECT_EQ(count_logged(DLOG_INFO, "in quarn_dbus_manual_backup_status"), 2);
+}
+
+TEST_F(Callbacks, AnyOtherManualBackupStatusDeletesTheRecord) {
+  for (const int status : {0, 1, 3, 4, 5, 6, -1}) {
+    quarn_dbus_manual_backup_status(0, status, record());
+    EXPECT_TRUE(watched_deleted) << status;
+  }
+}
+
+TEST_F(Callbacks, ManualBackupCancelResultDeletesTheRecord) {
+  EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record()), 0);
+  EXPECT_EQ(client_->callbacks(), Texts{"manual_backup_cancel_result(0, 7)"});
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(count_logged(DLOG_INFO, "in quarn_dbus_manual_backup_cancel_result"), 1);
+}
+
+TEST_F(Callbacks, AppBackupCompleteDeletesTheRecord) {
+  EXPECT_EQ(quarn_dbus_app_backup_complete(27, "org.example.notes", record()), 0);
+  EXPECT_EQ(client_->callbacks(), Texts{"app_data_backup_complete(27, 'org.example.notes', 7)"});
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(count_logged(DLOG_INFO, "in quarn_dbus_app_backup_complete"), 1);
+}
+
+TEST_F(Callbacks, AppRestoreCompleteDeletesTheRecord) {
+  EXPECT_EQ(quarn_dbus_app_restore_complete(41, "org.example.notes", record()), 0);
+  EXPECT_EQ(client_->callbacks(), Texts{"app_data_restore_complete(41, 'org.example.notes', 7)"});
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(count_logged(DLOG_INFO, "in quarn_dbus_app_restore_complete"), 1);
+}
+
+TEST_F(Callbacks, NullRecordIsLoggedAndNothingIsSent) {
+  EXPECT_EQ(quarn_dbus_restore_enable_cb(0, "restore_stop", nullptr), 42);
+  EXPECT_EQ(quarn_dbus_get_app_list_cb(0, "", nullptr), 42);
+  EXPECT_EQ(quarn_dbus_manual_backup_status(0, 4, nullptr), 42);
+  EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, nullptr), 42);
+  EXPECT_EQ(quarn_dbus_app_backup_complete(0, "", nullptr), 42);
+  EXPECT_EQ(quarn_dbus_app_restore_complete(0, "", nullptr), 42);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "client_cb_data is NULL"), 6);
+  EXPECT_TRUE(client_->callbacks().empty());
+}
+
+bool logged_call_failure() {
+  for (const LogLine &line : captured_log()) {
+    if (line.level == DLOG_ERROR &&
+        line.text.rfind("g_dbus_connection_call_sync() Fail(", 0) == 0) {
+      return true;
+    }
+  }
+  return false;
+}
+
+TEST_F(Callbacks, ClientThatHasLeftGives42AndTheRecordIsDeleted) {
+  EXPECT_EQ(quarn_dbus_get_app_list_cb(0, "{}", record_for(left())), 42);
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_TRUE(logged_call_failure());
+}
+
+TEST_F(Callbacks, ClientThatHasLeftKeepsTheRecordOfStatusTwo) {
+  client_cb_data *data = record_for(left());
+  EXPECT_EQ(quarn_dbus_manual_backup_status(0, 2, data), 42);
+  EXPECT_FALSE(watched_deleted);
+  EXPECT_EQ(quarn_dbus_manual_backup_status(0, 5, data), 42);
+  EXPECT_TRUE(watched_deleted);
+}
+
+TEST_F(Callbacks, ClientThatHasLeftKeepsTheRecordOfARestoreMessage) {
+  client_cb_data *data = record_for(left());
+  EXPECT_EQ(quarn_dbus_restore_enable_cb(0, "org.example.notes", data), 42);
+  EXPECT_FALSE(watched_deleted);
+  EXPECT_EQ(quarn_dbus_restore_enable_cb(0, "restore_stop", data), 42);
+  EXPECT_TRUE(watched_deleted);
+}
+
+TEST_F(Callbacks, ClientThatDiesWhileAskedGives42) {
+  client_->keep_silent("get_app_list_cb");
+  client_cb_data *data = record();
+  int result = 0;
+  std::thread caller([&] { result = quarn_dbus_get_app_list_cb(0, "{}", data); });
+  ASSERT_TRUE(client_->wait_for_callbacks(1));
+  client_.reset();
+  caller.join();
+  EXPECT_EQ(result, 42);
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_TRUE(logged_call_failure());
+}
+
+TEST_F(Callbacks, ClientWithoutTheObjectGives42) {
+  const ScriptedClient bare(false);
+  EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record_for(bare.name())), 42);
+  EXPECT_TRUE(logged_call_failure());
+}
+
+TEST_F(Callbacks, ReplyThatCannotBeReadGives42) {
+  for (const char *reply : {"('text',)", "()", "(1, 2)", "(uint32 1,)"}) {
+    client_->answer("manual_backup_cancel_result", reply);
+    clear_captured_log();
+    EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record()), 42) << reply;
+    EXPECT_EQ(count_logged(DLOG_ERROR, "g_dbus_connection_call_sync 'Launch' error"), 1) << reply;
+    EXPECT_TRUE(watched_deleted);
+  }
+}
+
+TEST_F(Callbacks, WithoutAConnectionOrASenderGive42) {
+  EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record_for("")), 42);
+  EXPECT_TRUE(watched_deleted);
+  quarn_dbus_connection = nullptr;
+  EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record()), 42);
+  EXPECT_TRUE(watched_deleted);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "g_dbus_connection_call_sync 'Launch' error"), 2);
+}
+
+TEST_F(Callbacks, TextThatNoMessageCanCarryIsMadeFit) {
+  EXPECT_EQ(quarn_dbus_get_app_list_cb(0, nullptr, record()), 0);
+  EXPECT_EQ(quarn_dbus_get_app_list_cb(0, "a\xff", record()), 0);
+  EXPECT_EQ(client_->callbacks(),
+            (Texts{"get_app_list_cb(0, '', 7)", "get_app_list_cb(0, 'a\xEF\xBF\xBD', 7)"}));
+}
+
+TEST_F(Callbacks, ThreadsDoNotDisturbEachOther) {
+  std::vector<std::thread> threads;
+  std::atomic<int> delivered{0};
+  for (std::uint32_t id = 0; id < 8; ++id) {
+    threads.emplace_back([this, id, &delivered] {
+      if (quarn_dbus_manual_backup_cancel_result(0, new client_cb_data{id, client_->name()}) == 0) {
+        ++delivered;
+      }
+    });
+  }
+  for (std::thread &thread : threads) thread.join();
+  EXPECT_EQ(delivered, 8);
+  EXPECT_EQ(client_->callbacks().size(), 8u);
+}
+
+/* ---- published signals ---- */
+
+class Publish : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    connection_ = connect_to_private_bus();
+    listener_ = connect_to_private_bus();
+    quarn_dbus_connection = connection_.get();
+    subscription_ = g_dbus_connection_signal_subscribe(
+        listener_.get(), nullptr, kQuarnInterface, nullptr, nullptr, nullptr,
+        G_DBUS_SIGNAL_FLAGS_NONE, on_signal, this, nullptr);
+    // A round trip: the bus knows of the subscription afterwards.
+    g_variant_unref(g_dbus_connection_call_sync(
+        listener_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+        "GetId", nullptr, nullptr, G_DBUS_CALL_FLAGS_NONE, -1, nullptr, nullptr));
+    clear_captured_log();
+  }
+  void TearDown() override {
+    quarn_dbus_connection = nullptr;
+    g_dbus_connection_signal_unsubscribe(listener_.get(), subscription_);
+    for (GDBusConnection *connection : {connection_.get(), listener_.get()}) {
+      if (g_dbus_connection_is_closed(connection) == FALSE) {
+        g_dbus_connection_close_sync(connection, nullptr, nullptr);
+      }
+    }
+    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+    }
+  }
+  static void on_signal(GDBusConnection *, const gchar *, const gchar *path, const gchar *,
+                        const gchar *signal, GVariant *parameters, gpointer self) {
+    const GString_ printed(g_variant_print(parameters, FALSE));
+    static_cast<Publish *>(self)->signals_.push_back(std::string(path) + " " + signal +
+                                                     printed.get());
+  }
+
+  ConnectionHandle connection_;
+  ConnectionHandle listener_;
+  guint subscription_ = 0;
+  Texts signals_;
+};
+
+TEST_F(Publish, BroadcastsOnThePathOfItsName) {
+  EXPECT_EQ(quarnd_dbus_publish("backed_up", "now"), 0);
+  EXPECT_TRUE(run_until([this] { return !signals_.empty(); }));
+  EXPECT_EQ(signals_, Texts{"/backed_up backed_up('now',)"});
+  EXPECT_EQ(count_logged(DLOG_INFO, "quarnd_dbus_publish:quarn_utils_parse_key called"), 1);
+  EXPECT_EQ(count_logged(DLOG_INFO, ">>>>>>>> called"), 1);
+}
+
+TEST_F(Publish, TakesNoValueAsTheEmptyText) {
+  EXPECT_EQ(quarnd_dbus_publish("backed_up", nullptr), 0);
+  EXPECT_TRUE(run_until([this] { return !signals_.empty(); }));
+  EXPECT_EQ(signals_, Texts{"/backed_up backed_up('',)"});
+}
+
+TEST_F(Publish, RefusesWhatIsNoSignalName) {
+  for (const char *name : {static_cast<const char *>(nullptr), "", "a b", "a/b", "1"}) {
+    clear_captured_log();
+    EXPECT_EQ(quarnd_dbus_publish(name, "x"), -1);
+    EXPECT_EQ(count_logged(DLOG_ERROR, "g_dbus_connection_emit_signal() Fail(not a signal name)"),
+              1);
+  }
+}
+
+TEST_F(Publish, FailsOnAClosedConnection) {
+  g_dbus_connection_close_sync(connection_.get(), nullptr, nullptr);
+  EXPECT_EQ(quarnd_dbus_publish("backed_up", "now"), -1);
+  EXPECT_EQ(
+      count_logged(DLOG_ERROR, "g_dbus_connection_emit_signal() Fail(The connection is closed)"),
+      1);
+}
+
+TEST_F(Publish, FailsBeforeThereIsAConnection) {
+  quarn_dbus_connection = nullptr;
+  EXPECT_EQ(quarnd_dbus_publish("backed_up", "now"), -1);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "g_dbus_connection_emit_signal() Fail(not connected)"), 1);
+}
+
+}  // namespace

@@ -1,0 +1,379 @@
+#include "quarn_d_loop.h"
+
+#include <Ecore.h>
+#include <fcntl.h>
+#include <glib-unix.h>
+#include <glib.h>
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/select.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <functional>
+#include <thread>
+
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+
+namespace {
+
+constexpr double kShort = 0.02;
+constexpr int kDeadlineSeconds = 10;
+
+using Step = std::function<void()>;
+
+gboolean run_step(gpointer data) {
+  (*static_cast<Step *>(data))();
+  return G_SOURCE_REMOVE;
+}
+
+void delete_step(gpointer data) { delete static_cast<Step *>(data); }
+
+/** Run @p step once on the default context. */
+void on_main_loop(Step step, unsigned int after_ms = 0) {
+  g_timeout_add_full(G_PRIORITY_DEFAULT, after_ms, run_step, new Step(std::move(step)),
+                     delete_step);
+}
+
+unsigned char quit_loop(void *fired) {
+  ++*static_cast<int *>(fired);
+  quarn_loop_quit();
+  return 0;
+}
+
+gboolean too_late(gpointer) {
+  ADD_FAILURE() << "the loop was not quit";
+  quarn_loop_quit();
+  return G_SOURCE_REMOVE;
+}
+
+class Loop : public ::testing::Test {
+ protected:
+  void SetUp() override { quarn_loop_init(); }
+  void TearDown() override { quarn_loop_shutdown(); }
+
+  static void run() {
+    const guint deadline = g_timeout_add_seconds(kDeadlineSeconds, too_late, nullptr);
+    quarn_loop_begin();
+    g_source_remove(deadline);
+  }
+};
+
+TEST_F(Loop, RunsTimersOfBothLoops) {
+  bool glib_fired = false;
+  int ecore_fired = 0;
+  on_main_loop([&] { glib_fired = true; }, 1);
+  ASSERT_NE(quarn_loop_timer_add(kShort, quit_loop, &ecore_fired), nullptr);
+  run();
+  EXPECT_TRUE(glib_fired);
+  EXPECT_EQ(ecore_fired, 1);
+}
+
+TEST_F(Loop, DeletedTimerDoesNotFire) {
+  int deleted = 0;
+  int fired = 0;
+  void *timer = quarn_loop_timer_add(kShort / 2, quit_loop, &deleted);
+  quarn_loop_timer_add(kShort, quit_loop, &fired);
+  quarn_loop_timer_del(timer);
+  run();
+  EXPECT_EQ(deleted, 0);
+  EXPECT_EQ(fired, 1);
+}
+
+TEST_F(Loop, EcoreTimerAddedByAGLibSourceFires) {
+  int fired = 0;
+  on_main_loop([&] { quarn_loop_timer_add(kShort, quit_loop, &fired); });
+  run();
+  EXPECT_EQ(fired, 1);
+}
+
+TEST_F(Loop, QuitFromAGLibSourceEndsTheLoopWithoutAFurtherWait) {
+  on_main_loop([] { quarn_loop_quit(); });
+  run();
+}
+
+TEST_F(Loop, QuitBeforeAnyEventEndsTheNextRunOnly) {
+  on_main_loop([] { quarn_loop_quit(); });
+  run();
+  bool again = false;
+  on_main_loop([&] {
+    again = true;
+    quarn_loop_quit();
+  });
+  run();
+  EXPECT_TRUE(again);
+}
+
+TEST_F(Loop, SourceOfAnotherThreadWakesTheWaitingLoop) {
+  std::thread::id ran_on;
+  std::thread other([&] {
+    on_main_loop([&] {
+      ran_on = std::this_thread::get_id();
+      quarn_loop_quit();
+    });
+  });
+  run();
+  other.join();
+  EXPECT_EQ(ran_on, std::this_thread::get_id());
+}
+
+TEST_F(Loop, OwnsTheDefaultContextForItsWholeLife) {
+  EXPECT_TRUE(g_main_context_is_owner(nullptr));
+  bool stolen = true;
+  std::thread([&] { stolen = g_main_context_acquire(nullptr) != FALSE; }).join();
+  EXPECT_FALSE(stolen);
+  quarn_loop_shutdown();
+  EXPECT_FALSE(g_main_context_is_owner(nullptr));
+}
+
+TEST_F(Loop, KeepsEcoreFromLoadingSystemModules) {
+  EXPECT_STREQ(getenv("ECORE_NO_SYSTEM_MODULES"), "1");
+}
+
+Eina_Bool on_readable(void *data, Ecore_Fd_Handler *handler) {
+  char byte = 0;
+  *static_cast<int *>(data) +=
+      static_cast<int>(read(ecore_main_fd_handler_fd_get(handler), &byte, sizeof byte));
+  quarn_loop_quit();
+  return ECORE_CALLBACK_CANCEL;
+}
+
+TEST_F(Loop, ServesEcoresOwnDescriptors) {
+  int ends[2];
+  ASSERT_EQ(pipe2(ends, O_CLOEXEC), 0);
+  const UniqueFd reader(ends[0]);
+  const UniqueFd writer(ends[1]);
+  int bytes = 0;
+  ecore_main_fd_handler_add(reader.get(), ECORE_FD_READ, on_readable, &bytes, nullptr, nullptr);
+  on_main_loop([&] { ASSERT_EQ(write(writer.get(), "x", 1), 1); });
+  run();
+  EXPECT_EQ(bytes, 1);
+}
+
+gboolean on_far_descriptor(gint fd, GIOCondition, gpointer data) {
+  char byte = 0;
+  *static_cast<int *>(data) += static_cast<int>(read(fd, &byte, sizeof byte));
+  quarn_loop_quit();
+  return G_SOURCE_REMOVE;
+}
+
+TEST_F(Loop, ServesADescriptorThatNoFdSetHolds) {
+  constexpr int kFar = FD_SETSIZE + 100;
+  rlimit limit{};
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &limit), 0);
+  const rlimit before = limit;
+  limit.rlim_cur = std::max<rlim_t>(limit.rlim_cur, kFar + 1);
+  limit.rlim_max = std::max(limit.rlim_max, limit.rlim_cur);
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &limit), 0);
+  int ends[2];
+  ASSERT_EQ(pipe2(ends, O_CLOEXEC), 0);
+  const UniqueFd reader(ends[0]);
+  const UniqueFd writer(ends[1]);
+  const UniqueFd far(fcntl(reader.get(), F_DUPFD_CLOEXEC, kFar));
+  ASSERT_GE(far.get(), kFar);
+  int bytes = 0;
+  g_unix_fd_add(far.get(), G_IO_IN, on_far_descriptor, &bytes);
+  on_main_loop([&] { ASSERT_EQ(write(writer.get(), "x", 1), 1); });
+  run();
+  EXPECT_EQ(bytes, 1);
+  setrlimit(RLIMIT_NOFILE, &before);
+}
+
+TEST_F(Loop, DispatchedSourceMayRunANestedLoop) {
+  std::vector<int> order;
+  const GMainLoopPtr nested(g_main_loop_new(nullptr, FALSE));
+  on_main_loop([&] {
+    order.push_back(1);
+    run_nested_loop(nested.get());
+    order.push_back(3);
+    quarn_loop_quit();
+  });
+  on_main_loop(
+      [&] {
+        order.push_back(2);
+        g_main_loop_quit(nested.get());
+      },
+      10);
+  run();
+  EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
+}
+
+TEST_F(Loop, NestedLoopInsideANestedLoopUnwindsInOrder) {
+  std::vector<int> order;
+  const GMainLoopPtr outer(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr inner(g_main_loop_new(nullptr, FALSE));
+  on_main_loop([&] {
+    run_nested_loop(outer.get());
+    order.push_back(2);
+    quarn_loop_quit();
+  });
+  on_main_loop(
+      [&] {
+        run_nested_loop(inner.get());
+        order.push_back(1);
+      },
+      1);
+  // The outer one is quit first and still waits for the inner one.
+  on_main_loop([&] { g_main_loop_quit(outer.get()); }, 10);
+  on_main_loop([&] { g_main_loop_quit(inner.get()); }, 20);
+  run();
+  EXPECT_EQ(order, (std::vector<int>{1, 2}));
+}
+
+struct CountingSource {
+  GSource source;
+  int prepared;
+};
+
+gboolean count_prepare(GSource *source, gint *timeout) {
+  ++reinterpret_cast<CountingSource *>(source)->prepared;
+  *timeout = -1;
+  return FALSE;
+}
+
+gboolean never_ready(GSource *) { return FALSE; }
+gboolean never_dispatched(GSource *, GSourceFunc, gpointer) { return G_SOURCE_CONTINUE; }
+
+TEST_F(Loop, DoesNotWakeWhileIdle) {
+  static GSourceFuncs functions{count_prepare, never_ready, never_dispatched,
+                                nullptr,       nullptr,     nullptr};
+  GSource *source = g_source_new(&functions, sizeof(CountingSource));
+  auto *counting = reinterpret_cast<CountingSource *>(source);
+  counting->prepared = 0;
+  g_source_attach(source, nullptr);
+  int fired = 0;
+  quarn_loop_timer_add(0.3, quit_loop, &fired);
+  run();
+  EXPECT_EQ(fired, 1);
+  EXPECT_GE(counting->prepared, 1);
+  EXPECT_LE(counting->prepared, 10);
+  g_source_destroy(source);
+  g_source_unref(source);
+}
+
+TEST_F(Loop, ShutdownInsideTheLoopWaitsForItsEnd) {
+  bool alive_after_request = false;
+  on_main_loop([&] {
+    quarn_loop_shutdown();
+    alive_after_request = g_main_context_is_owner(nullptr) != FALSE;
+    quarn_loop_quit();
+  });
+  const guint deadline = g_timeout_add_seconds(kDeadlineSeconds, too_late, nullptr);
+  quarn_loop_begin();
+  EXPECT_TRUE(alive_after_request);
+  EXPECT_FALSE(g_main_context_is_owner(nullptr));
+  g_source_remove(deadline);
+}
+
+TEST_F(Loop, InitTwiceIsShutDownOnce) {
+  quarn_loop_init();
+  quarn_loop_shutdown();
+  EXPECT_FALSE(g_main_context_is_owner(nullptr));
+}
+
+TEST(LoopShutdown, IsHarmlessWhenNothingWasInitialised) {
+  quarn_loop_shutdown();
+  EXPECT_FALSE(g_main_context_is_owner(nullptr));
+}
+
+TEST(LoopInit, PrintsNothing) {
+  ::testing::internal::CaptureStderr();
+  quarn_loop_init();
+  quarn_loop_shutdown();
+  EXPECT_EQ(::testing::internal::GetCapturedStderr(), "");
+}
+
+/* ---- nested loops at the end of the process ---- */
+
+void end_nested_loops() {
+  quarn_loop_init();
+  const GMainLoopPtr outer(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr inner(g_main_loop_new(nullptr, FALSE));
+  on_main_loop([&] {
+    on_main_loop([&] {
+      on_main_loop([] { quit_nested_loops(); });
+      run_nested_loop(inner.get());
+      std::fputs("inner ", stderr);
+    });
+    run_nested_loop(outer.get());
+    std::fputs("outer ", stderr);
+    run_nested_loop(outer.get());
+    std::fputs("refused", stderr);
+    quarn_loop_quit();
+  });
+  quarn_loop_begin();
+  quarn_loop_shutdown();
+  std::_Exit(3);
+}
+
+TEST(QuitNestedLoopsDeathTest, EndsTheInnermostFirstAndRefusesFurtherOnes) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(end_nested_loops(), ::testing::ExitedWithCode(3), "inner outer refused");
+}
+
+/* ---- signals; each in a process of its own ---- */
+
+void print_signal(int signo) { std::fprintf(stderr, "signal %d;", signo); }
+
+void end_of(int signo) {
+  std::fprintf(stderr, "end %d on %s;", signo,
+               g_main_context_is_owner(nullptr) != FALSE ? "main" : "another thread");
+  quarn_loop_quit();
+}
+
+void end_never(int) { std::fputs("ended", stderr); }
+
+void run_until_signal(int signo) {
+  quarn_loop_init();
+  if (!quarn_loop_watch_signals(print_signal, end_of, kDeadlineSeconds * 1000)) std::_Exit(1);
+  std::signal(signo, quarn_loop_wake_from_signal);
+  on_main_loop([signo] { raise(signo); });
+  quarn_loop_begin();
+  quarn_loop_shutdown();
+  std::_Exit(4);
+}
+
+void block_under_signal() {
+  quarn_loop_init();
+  if (!quarn_loop_watch_signals(print_signal, end_never, 100)) std::_Exit(1);
+  std::signal(SIGTERM, quarn_loop_wake_from_signal);
+  raise(SIGTERM);
+  while (true) pause();
+}
+
+class SignalDeathTest : public ::testing::TestWithParam<int> {
+ protected:
+  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
+};
+
+TEST_P(SignalDeathTest, IsLoggedAndEndsOnTheMainThread) {
+  const int signo = GetParam();
+  const std::string number = std::to_string(signo);
+  EXPECT_EXIT(run_until_signal(signo), ::testing::ExitedWithCode(4),
+              "signal " + number + ";end " + number + " on main;");
+}
+
+INSTANTIATE_TEST_SUITE_P(All, SignalDeathTest, ::testing::Values(SIGINT, SIGHUP, SIGTERM, SIGQUIT));
+
+TEST(BlockedMainThreadDeathTest, EndsWithStatusZeroAfterTheGracePeriod) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(block_under_signal(), ::testing::ExitedWithCode(0), "signal 15;$");
+}
+
+void exhaust_descriptors_and_watch() {
+  const rlimit none{0, 0};
+  setrlimit(RLIMIT_NOFILE, &none);
+  const bool watched = quarn_loop_watch_signals(print_signal, end_of, 1);
+  quarn_loop_wake_from_signal(SIGTERM);
+  std::_Exit(watched ? 1 : 5);
+}
+
+TEST(WatchSignalsDeathTest, IsRefusedWithoutDescriptors) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(exhaust_descriptors_and_watch(), ::testing::ExitedWithCode(5), "");
+}
+
+}  // namespace
