@@ -7,10 +7,13 @@
 #ifndef QUARN_DBUS_SERVER_H
 #define QUARN_DBUS_SERVER_H
 
+/** The introspection document: tabs between its elements. */
+extern const char quarn_introspection_xml[];
+
 /** Own the bus name and serve the object. @return owner id, or (unsigned) -1 */
 unsigned int quarnd_dbus_init();
 
-/** Give the bus name up. */
+/** Give the bus name up, once every answer that was given is on its way. */
 void quarnd_dbus_deinit(unsigned int owner_id);
 
 #endif

@@ -1,0 +1,61 @@
+#include "platform_settings.h"
+#include "quarn_common.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_client.h"
+#include "quarn_log.h"
+
+namespace {
+
+/** Who asks for an application list. */
+enum list_client : unsigned int { CLIENT_CLOUD = 0, CLIENT_COMPANION = 1 };
+
+constexpr char kFailed[] = "failed";
+
+}  // namespace
+
+int quarnd_backup_enable(int on) {
+  vconf_set_int(kBackupStatusKey, on != 0 ? 1 : 0);
+  return QUARN_OK;
+}
+
+int quarnd_get_last_backed_up_time(unsigned long long *timestamp) {
+  LOGI("quarnd_get_last_backed_up_time");
+  *timestamp = static_cast<unsigned long long>(_get_current_timestamp());
+  return QUARN_OK;
+}
+
+int quarnd_get_app_list(int client, void *record) {
+  if (static_cast<unsigned int>(client) > CLIENT_COMPANION) {
+    quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kFailed, record);
+    return QUARN_BAD_ARGUMENT;
+  }
+  request_power_lock(true);
+  if (client == CLIENT_CLOUD && !cloud_initialized()) {
+    quarn_dbus_get_app_list_cb(QUARN_NO_SESSION, kFailed, record);
+    request_power_lock(false);
+    return QUARN_NO_SESSION;
+  }
+  LOGI("quarnd_get_app_list");
+  const int result = get_app_list(client, record);
+  request_power_lock(false);
+  return result;
+}
+
+int quarnd_manual_backup(void *record) {
+  LOGI("request for manual backup");
+  manual_backup_canceled = false;
+  quarn_dbus_manual_backup_status(QUARN_OK, QUARN_BACKUP_RUNNING, record);
+  request_backup(record);
+  return QUARN_OK;
+}
+
+int quarnd_manual_backup_cancel(void *record) {
+  LOGI("quarnd_manual_backup_cancel");
+  manual_backup_canceled = true;
+  cancel_backup(record);
+  quarn_dbus_manual_backup_cancel_result(QUARN_OK, record);
+  return QUARN_OK;
+}

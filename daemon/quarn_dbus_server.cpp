@@ -1,0 +1,446 @@
+#include "quarn_dbus_server.h"
+
+#include <gio/gio.h>
+
+#include <atomic>
+#include <memory>
+#include <string>
+
+#include "quarn_common.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_lifecycle.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_dbus_client.h"
+#include "quarn_log.h"
+
+const char quarn_introspection_xml[] =
+    "<node>"
+    "\t<interface name='org.orvane.Quarn'>"
+    "\t\t<method name='set_activation'>"
+    "\t\t\t<arg type='i' name='activation' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='backup_enable'>"
+    "\t\t\t<arg type='i' name='on' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='restore_enable'>"
+    "\t\t\t<arg type='i' name='on' direction='in'/>"
+    "\t\t\t<arg type='i' name='client' direction='in'/>"
+    "\t\t\t<arg type='s' name='serial_num' direction='in'/>"
+    "\t\t\t<arg type='s' name='pkg_list' direction='in'/>"
+    "\t\t\t<arg type='u' name='req_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='last_bu_time'>"
+    "\t\t\t<arg type='t' name='timestamp' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='get_app_list'>"
+    "\t\t\t<arg type='i' name='client' direction='in'/>"
+    "\t\t\t<arg type='u' name='req_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='auto_backup_start'>"
+    "\t\t\t<arg type='s' name='param' direction='in'/>"
+    "\t\t</method>"
+    "\t\t<method name='manual_backup_start'>"
+    "\t\t\t<arg type='u' name='req_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='manual_backup_cancel'>"
+    "\t\t\t<arg type='u' name='req_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='app_data_backup_start'>"
+    "\t\t\t<arg type='s' name='pkg_id' direction='in'/>"
+    "\t\t\t<arg type='u' name='req_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='app_data_restore_start'>"
+    "\t\t\t<arg type='s' name='pkg_id' direction='in'/>"
+    "\t\t\t<arg type='u' name='req_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t\t<method name='make_app_data'>"
+    "\t\t\t<arg type='s' name='pkg_id' direction='in'/>"
+    "\t\t\t<arg type='i' name='ret' direction='out'/>"
+    "\t\t</method>"
+    "\t</interface>"
+    "</node>";
+
+namespace {
+
+constexpr unsigned int kNoOwner = static_cast<unsigned int>(-1);
+/** The reply to a call whose arguments are missing. */
+constexpr int kArgumentsMissing = -1;
+/** Milliseconds that the bus itself may take to answer. */
+constexpr int kBusTimeout = 5000;
+
+guint registration_id = 0;
+guint filter_id = 0;
+
+/** One call, and the way its one answer goes. */
+class MethodCall {
+ public:
+  MethodCall(const char *sender, const char *interface_name, const char *method_name)
+      : sender_(sender == nullptr ? "" : sender),
+        interface_(interface_name),
+        method_(method_name) {}
+  MethodCall(const MethodCall &) = delete;
+  MethodCall &operator=(const MethodCall &) = delete;
+  virtual ~MethodCall() = default;
+
+  /** @p value is a tuple, floating; null is the empty one. */
+  virtual void reply(GVariant *value) = 0;
+  virtual void refuse(int dbus_error, const std::string &text) = 0;
+
+  void reply_int(int value) { reply(g_variant_new("(i)", value)); }
+  bool is(const char *method) const { return g_strcmp0(method_.c_str(), method) == 0; }
+  const std::string &sender() const { return sender_; }
+  const std::string &interface_name() const { return interface_; }
+  const std::string &method() const { return method_; }
+
+ private:
+  std::string sender_;
+  std::string interface_;
+  std::string method_;
+};
+
+/** A call that GDBus handed over. */
+class InvokedCall : public MethodCall {
+ public:
+  InvokedCall(const char *sender, const char *interface_name, const char *method_name,
+              GDBusMethodInvocation *invocation)
+      : MethodCall(sender, interface_name, method_name), invocation_(invocation) {}
+  void reply(GVariant *value) override {
+    g_dbus_method_invocation_return_value(invocation_, value);
+  }
+  void refuse(int dbus_error, const std::string &text) override {
+    g_dbus_method_invocation_return_error_literal(invocation_, G_DBUS_ERROR, dbus_error,
+                                                  text.c_str());
+  }
+
+ private:
+  GDBusMethodInvocation *invocation_;
+};
+
+using ConnectionPtr = Handle<GDBusConnection, &g_object_unref>;
+using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
+
+/** A call that GDBus would have answered by itself, without telling anyone. */
+class RawCall : public MethodCall {
+ public:
+  RawCall(GDBusConnection *connection, GDBusMessage *message)
+      : MethodCall(g_dbus_message_get_sender(message), g_dbus_message_get_interface(message),
+                   g_dbus_message_get_member(message)),
+        connection_(connection),
+        message_(message) {}
+  void reply(GVariant *value) override {
+    const MessagePtr answer(g_dbus_message_new_method_reply(message_));
+    if (value != nullptr) g_dbus_message_set_body(answer.get(), value);
+    send(answer.get());
+  }
+  void refuse(int dbus_error, const std::string &text) override {
+    const GErrorPtr error(g_error_new_literal(G_DBUS_ERROR, dbus_error, text.c_str()));
+    const GString_ name(g_dbus_error_encode_gerror(error.get()));
+    const MessagePtr answer(
+        g_dbus_message_new_method_error_literal(message_, name.get(), text.c_str()));
+    send(answer.get());
+  }
+
+ private:
+  void send(GDBusMessage *answer) {
+    if ((g_dbus_message_get_flags(message_) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+    GErrorPtr error;
+    if (g_dbus_connection_send_message(connection_, answer, G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
+                                       out(error)) == FALSE) {
+      LOGE("g_dbus_connection_send_message() Fail(%s)", error ? error->message : "");
+    }
+  }
+
+  GDBusConnection *connection_;
+  GDBusMessage *message_;
+};
+
+client_cb_data *make_record(const MethodCall &call, guint32 req_id) {
+  return new client_cb_data{req_id, call.sender()};
+}
+
+/** The user that a client runs as, told by the bus. */
+bool get_client_uid(GDBusConnection *connection, const std::string &sender, guint32 *uid) {
+  GErrorPtr error;
+  const GVariantPtr reply(g_dbus_connection_call_sync(
+      connection, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+      "GetConnectionUnixUser", g_variant_new("(s)", sender.c_str()), G_VARIANT_TYPE("(u)"),
+      G_DBUS_CALL_FLAGS_NONE, kBusTimeout, nullptr, out(error)));
+  if (!reply) {
+    LOGE("cannot get user of (%s) : %s", sender.c_str(), error ? error->message : "");
+    return false;
+  }
+  g_variant_get(reply.get(), "(u)", uid);
+  return true;
+}
+
+void on_set_activation(MethodCall &call, GVariant *parameters) {
+  gint32 activation = 0;
+  g_variant_get(parameters, "(i)", &activation);
+  if (activation == 0) {
+    LOGI("try to terminate quarn");
+    init_last_backup_time();
+    request_quarn_terminate(0.0, false);
+  } else {
+    LOGI("quarn activated successfully!");
+  }
+  call.reply_int(QUARN_OK);
+}
+
+void on_backup_enable(MethodCall &call, GVariant *parameters) {
+  gint32 on = 0;
+  g_variant_get(parameters, "(i)", &on);
+  call.reply_int(quarnd_backup_enable(on));
+}
+
+void on_restore_enable(MethodCall &call, GVariant *parameters) {
+  gint32 on = 0;
+  gint32 client = 0;
+  const char *serial_num = nullptr;
+  const char *pkg_list = nullptr;
+  guint32 req_id = 0;
+  g_variant_get(parameters, "(ii&s&su)", &on, &client, &serial_num, &pkg_list, &req_id);
+  call.reply_int(
+      quarnd_restore_enable(on, client, serial_num, pkg_list, make_record(call, req_id)));
+}
+
+void on_last_bu_time(MethodCall &call) {
+  unsigned long long timestamp = 0;
+  quarnd_get_last_backed_up_time(&timestamp);
+  call.reply(g_variant_new("(t)", static_cast<guint64>(timestamp)));
+}
+
+void on_get_app_list(MethodCall &call, GVariant *parameters) {
+  gint32 client = 0;
+  guint32 req_id = 0;
+  g_variant_get(parameters, "(iu)", &client, &req_id);
+  call.reply_int(quarnd_get_app_list(client, make_record(call, req_id)));
+}
+
+void on_manual_backup_start(MethodCall &call, GVariant *parameters) {
+  guint32 req_id = 0;
+  g_variant_get(parameters, "(u)", &req_id);
+  call.reply_int(quarnd_manual_backup(make_record(call, req_id)));
+}
+
+void on_manual_backup_cancel(MethodCall &call, GVariant *parameters) {
+  guint32 req_id = 0;
+  g_variant_get(parameters, "(u)", &req_id);
+  call.reply_int(quarnd_manual_backup_cancel(make_record(call, req_id)));
+}
+
+void on_app_data_backup_start(MethodCall &call, GVariant *parameters) {
+  const char *pkg_id = nullptr;
+  guint32 req_id = 0;
+  g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
+  call.reply_int(quarnd_backup_app_data(pkg_id, make_record(call, req_id)));
+}
+
+void on_app_data_restore_start(MethodCall &call, GVariant *parameters) {
+  const char *pkg_id = nullptr;
+  guint32 req_id = 0;
+  g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
+  call.reply_int(quarnd_restore_app_data(pkg_id, make_record(call, req_id)));
+}
+
+void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *parameters) {
+  const char *pkg_id = nullptr;
+  g_variant_get(parameters, "(&s)", &pkg_id);
+  guint32 uid = 0;
+  if (!get_client_uid(connection, call.sender(), &uid)) {
+    call.reply_int(QUARN_REFUSED);
+    return;
+  }
+  call.reply_int(quarnd_make_app_data(pkg_id, uid));
+}
+
+/** The one dispatcher; @p given is null when the call has no arguments. */
+void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
+  cancel_quarn_terminate();
+
+  // A reference of our own: those of the call go with its answer.
+  const GVariantPtr owned(given == nullptr ? nullptr : g_variant_ref(given));
+  GVariant *const parameters = owned.get();
+  const auto with_parameters = [&call, parameters](auto &&handler) {
+    if (parameters == nullptr) {
+      call.reply_int(kArgumentsMissing);
+    } else {
+      handler();
+    }
+  };
+
+  if (call.is("set_activation")) {
+    with_parameters([&] { on_set_activation(call, parameters); });
+  } else if (call.is("backup_enable")) {
+    with_parameters([&] { on_backup_enable(call, parameters); });
+  } else if (call.is("restore_enable")) {
+    with_parameters([&] { on_restore_enable(call, parameters); });
+  } else if (call.is("last_bu_time")) {
+    on_last_bu_time(call);
+  } else if (call.is("get_app_list")) {
+    with_parameters([&] { on_get_app_list(call, parameters); });
+  } else if (call.is("auto_backup_start")) {
+    call.reply(nullptr);  // accepted and ignored
+  } else if (call.is("manual_backup_start")) {
+    with_parameters([&] { on_manual_backup_start(call, parameters); });
+  } else if (call.is("manual_backup_cancel")) {
+    with_parameters([&] { on_manual_backup_cancel(call, parameters); });
+  } else if (call.is("app_data_backup_start")) {
+    with_parameters([&] { on_app_data_backup_start(call, parameters); });
+  } else if (call.is("app_data_restore_start")) {
+    with_parameters([&] { on_app_data_restore_start(call, parameters); });
+  } else if (call.is("make_app_data")) {
+    with_parameters([&] { on_make_app_data(call, connection, parameters); });
+  } else {
+    const GString_ text(g_strdup_printf("Method %s is not implemented on interface %s",
+                                        call.method().c_str(), call.interface_name().c_str()));
+    call.refuse(G_DBUS_ERROR_UNKNOWN_METHOD, text.get());
+  }
+}
+
+void _dbus_handle_method_call(GDBusConnection *connection, const gchar *sender, const gchar *,
+                              const gchar *interface_name, const gchar *method_name,
+                              GVariant *parameters, GDBusMethodInvocation *invocation, gpointer) {
+  InvokedCall call(sender, interface_name, method_name, invocation);
+  dispatch(connection, call, parameters);
+}
+
+constexpr GDBusInterfaceVTable kMethodTable = {_dbus_handle_method_call, nullptr, nullptr, {}};
+
+/* ---- calls that GDBus does not hand over ------------------------------------- */
+
+/** A message on its way from the bus thread to the main thread. */
+struct Passed {
+  ConnectionPtr connection;
+  MessagePtr message;
+  bool answer; /**< else GDBus answers it, and only the terminate timer is of interest */
+  std::atomic<bool> complete{false}; /**< hands all of it to the main thread */
+};
+
+gboolean on_passed(gpointer data) {
+  const auto *passed = static_cast<const Passed *>(data);
+  if (passed->complete.load(std::memory_order_acquire) && passed->answer) {
+    RawCall call(passed->connection.get(), passed->message.get());
+    dispatch(passed->connection.get(), call, nullptr);
+  } else {
+    cancel_quarn_terminate();
+  }
+  return G_SOURCE_REMOVE;
+}
+
+void delete_passed(gpointer data) { delete static_cast<Passed *>(data); }
+
+void pass_to_main_thread(GDBusConnection *connection, GDBusMessage *message, bool answer) {
+  auto passed = std::make_unique<Passed>();
+  passed->connection.reset(G_DBUS_CONNECTION(g_object_ref(connection)));
+  passed->message.reset(G_DBUS_MESSAGE(g_object_ref(message)));
+  passed->answer = answer;
+  passed->complete.store(true, std::memory_order_release);
+  // The priority of GDBus' own calls, so that all keep the order in which they came.
+  g_idle_add_full(G_PRIORITY_DEFAULT, on_passed, passed.release(), delete_passed);
+}
+
+std::string signature_of(const GDBusMethodInfo *method) {
+  std::string signature;
+  for (GDBusArgInfo **arg = method->in_args; arg != nullptr && *arg != nullptr; ++arg) {
+    signature += (*arg)->signature;
+  }
+  return signature;
+}
+
+/**
+ * GDBus refuses methods that are not in the introspection data, and calls with
+ * other arguments than those, before the dispatcher hears of them. Yet any call
+ * keeps the daemon alive, and the answers are ours. Runs on the bus thread.
+ */
+GDBusMessage *filter_calls(GDBusConnection *connection, GDBusMessage *message, gboolean incoming,
+                           gpointer user_data) {
+  if (incoming == FALSE ||
+      g_dbus_message_get_message_type(message) != G_DBUS_MESSAGE_TYPE_METHOD_CALL ||
+      g_strcmp0(g_dbus_message_get_path(message), kQuarnObjectPath) != 0 ||
+      g_strcmp0(g_dbus_message_get_interface(message), kQuarnInterface) != 0) {
+    return message;
+  }
+  const auto *node = static_cast<const GDBusNodeInfo *>(user_data);
+  const GDBusMethodInfo *method =
+      g_dbus_interface_info_lookup_method(node->interfaces[0], g_dbus_message_get_member(message));
+  const std::string given = g_dbus_message_get_signature(message);
+  if (method != nullptr && given == signature_of(method)) return message;
+  if (method != nullptr && !given.empty()) {
+    pass_to_main_thread(connection, message, false);
+    return message;
+  }
+  pass_to_main_thread(connection, message, true);
+  g_object_unref(message);
+  return nullptr;
+}
+
+void unref_node(gpointer node) { g_dbus_node_info_unref(static_cast<GDBusNodeInfo *>(node)); }
+
+/* ---- the bus name -------------------------------------------------------------- */
+
+void _dbus_on_bus_acquired(GDBusConnection *connection, const gchar *, gpointer user_data) {
+  SLOGI(">>>>>>>> called");
+  g_set_object(&quarn_dbus_connection, connection);
+  auto *node = static_cast<GDBusNodeInfo *>(user_data);
+  GErrorPtr error;
+  registration_id =
+      g_dbus_connection_register_object(connection, kQuarnObjectPath, node->interfaces[0],
+                                        &kMethodTable, nullptr, nullptr, out(error));
+  if (registration_id == 0) {
+    LOGE("g_dbus_connection_register_object() Fail(%s)", error ? error->message : "");
+  } else {
+    filter_id = g_dbus_connection_add_filter(connection, filter_calls, g_dbus_node_info_ref(node),
+                                             unref_node);
+  }
+  LOGI("g_dbus_connection_register_object() succeed");
+}
+
+void _dbus_on_name_acquired(GDBusConnection *, const gchar *name, gpointer) {
+  LOGI("Acquired the name %s", name);
+}
+
+void _dbus_on_name_lost(GDBusConnection *, const gchar *name, gpointer) {
+  LOGI("Lost the name %s", name);
+}
+
+}  // namespace
+
+unsigned int quarnd_dbus_init() {
+  GErrorPtr error;
+  GDBusNodeInfo *node = g_dbus_node_info_new_for_xml(quarn_introspection_xml, out(error));
+  if (node == nullptr) {
+    LOGE("g_dbus_node_info_new_for_xml() Fail(%s)", error ? error->message : "");
+    return kNoOwner;
+  }
+  const guint owner_id = g_bus_own_name(
+      G_BUS_TYPE_SYSTEM, kQuarnBusName, G_BUS_NAME_OWNER_FLAGS_REPLACE, _dbus_on_bus_acquired,
+      _dbus_on_name_acquired, _dbus_on_name_lost, node, unref_node);
+  if (owner_id == 0) {
+    g_dbus_node_info_unref(node);
+    LOGE("g_bus_own_name() Fail");
+  }
+  return owner_id;
+}
+
+void quarnd_dbus_deinit(unsigned int owner_id) {
+  if (quarn_dbus_connection != nullptr) {
+    // The process may end right after this; answers that were given must be on their way.
+    g_dbus_connection_flush_sync(quarn_dbus_connection, nullptr, nullptr);
+    if (filter_id != 0) g_dbus_connection_remove_filter(quarn_dbus_connection, filter_id);
+    if (registration_id != 0) {
+      g_dbus_connection_unregister_object(quarn_dbus_connection, registration_id);
+    }
+    filter_id = 0;
+    registration_id = 0;
+  }
+  if (owner_id != 0 && owner_id != kNoOwner) g_bus_unown_name(owner_id);
+}
