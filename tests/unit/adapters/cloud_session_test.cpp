@@ -23,8 +23,6 @@ using ::testing::_;
 using ::testing::NiceMock;
 using ::testing::Return;
 
-std::vector<GMainLoop *> nested_loops;
-
 /** Lengths of the time-outs that the code under test asked for, and the last one's source. */
 std::vector<guint> time_outs;
 guint last_time_out_source = 0;
@@ -32,16 +30,6 @@ guint last_time_out_source = 0;
 bool time_outs_run_out = false;
 
 }  // namespace
-
-void run_nested_loop(GMainLoop *loop) {
-  nested_loops.push_back(loop);
-  g_main_loop_run(loop);
-  nested_loops.pop_back();
-}
-
-void quit_nested_loops() {
-  for (GMainLoop *loop : nested_loops) g_main_loop_quit(loop);
-}
 
 extern "C" guint g_timeout_add_seconds(guint seconds, GSourceFunc function, gpointer data) {
   time_outs.push_back(seconds);
