@@ -1,101 +1,10 @@
 /**
  * @file handles.h
- * @brief Owners for the C handles of the libraries and the platform.
- *
- * Each alias is a std::unique_ptr that releases its handle with the function
- * that belongs to it. UniqueFd does the same for a file descriptor.
+ * @brief The owners of C handles, which the daemon shares with client code.
  */
 #ifndef QUARN_D_UTILS_HANDLES_H
 #define QUARN_D_UTILS_HANDLES_H
 
-#include <dirent.h>
-#include <gio/gio.h>
-#include <glib.h>
-#include <json-c/json.h>
-#include <unistd.h>
-
-#include <cstdio>
-#include <cstdlib>
-#include <memory>
-#include <type_traits>
-#include <utility>
-
-/** Calls @p Release on the pointer. */
-template <auto Release>
-struct Releaser {
-  template <typename T>
-  void operator()(T *handle) const {
-    static_cast<void>(Release(handle));
-  }
-};
-
-template <typename T, auto Release>
-using Handle = std::unique_ptr<T, Releaser<Release>>;
-
-using CString = Handle<char, &std::free>;
-using GString_ = Handle<char, &g_free>;
-using GErrorPtr = Handle<GError, &g_error_free>;
-using GDirPtr = Handle<GDir, &g_dir_close>;
-using GVariantPtr = Handle<GVariant, &g_variant_unref>;
-using GMainLoopPtr = Handle<GMainLoop, &g_main_loop_unref>;
-using JsonPtr = Handle<json_object, &json_object_put>;
-using FilePtr = Handle<std::FILE, &std::fclose>;
-using DirPtr = Handle<DIR, &closedir>;
-
-/** Owner of a file descriptor; -1 is none. */
-class UniqueFd {
- public:
-  UniqueFd() = default;
-  explicit UniqueFd(int fd) : fd_(fd) {}
-  UniqueFd(UniqueFd &&other) noexcept : fd_(other.release()) {}
-  UniqueFd &operator=(UniqueFd &&other) noexcept {
-    reset(other.release());
-    return *this;
-  }
-  UniqueFd(const UniqueFd &) = delete;
-  UniqueFd &operator=(const UniqueFd &) = delete;
-  ~UniqueFd() { reset(); }
-
-  int get() const { return fd_; }
-  explicit operator bool() const { return fd_ >= 0; }
-  int release() { return std::exchange(fd_, -1); }
-  void reset(int fd = -1) {
-    if (fd_ >= 0) close(fd_);
-    fd_ = fd;
-  }
-
- private:
-  int fd_ = -1;
-};
-
-/** Receives a malloc'd text through an out pointer: `get(handle, out(text))`. */
-class CStringOut {
- public:
-  explicit CStringOut(CString &owner) : owner_(owner) {}
-  ~CStringOut() { owner_.reset(raw_); }
-  CStringOut(const CStringOut &) = delete;
-  CStringOut &operator=(const CStringOut &) = delete;
-  operator char **() { return &raw_; }  // NOLINT: meant to be passed as an argument
-
- private:
-  CString &owner_;
-  char *raw_ = nullptr;
-};
-inline CStringOut out(CString &owner) { return CStringOut(owner); }
-
-/** The same for a GError. */
-class GErrorOut {
- public:
-  explicit GErrorOut(GErrorPtr &owner) : owner_(owner) {}
-  ~GErrorOut() { owner_.reset(raw_); }
-  GErrorOut(const GErrorOut &) = delete;
-  GErrorOut &operator=(const GErrorOut &) = delete;
-  operator GError **() { return &raw_; }  // NOLINT: meant to be passed as an argument
-
- private:
-  GErrorPtr &owner_;
-  GError *raw_ = nullptr;
-};
-inline GErrorOut out(GErrorPtr &owner) { return GErrorOut(owner); }
+#include "quarn_handles.h"
 
 #endif

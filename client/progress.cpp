@@ -1,0 +1,240 @@
+#include "progress.h"
+
+#include <algorithm>
+#include <cmath>
+#include <utility>
+
+#include "json_read.h"
+#include "quarn_common.h"
+#include "text.h"
+
+namespace quarn_client {
+
+namespace {
+
+constexpr char kBackup[] = "backup";
+constexpr char kUploading[] = "uploading";
+constexpr char kFinished[] = "finished";
+constexpr std::size_t kBarColumns = 24;
+constexpr int kPercent = 100;
+
+struct Words {
+  const char *word;
+  const char *text;
+};
+
+constexpr Words kStages[] = {
+    {"checking", "checking the application list in the cloud"},
+    {"archiving", "making archives"},
+    {"uploading", "uploading"},
+    {"listing", "uploading the application list"},
+    {"cleaning", "removing what is no longer needed from the cloud"},
+    {"finished", "finished"},
+    {"downloading", "downloading"},
+    {"snapshot", "keeping a copy of the present data"},
+    {"unpacking", "unpacking"},
+    {"attributes", "setting modes, owners and labels"},
+};
+
+constexpr Words kReasons[] = {
+    {"external", "its data is on external storage"},
+    {"too-large", "its data is too large"},
+    {"no-space", "not enough free space on the device"},
+    {"disabled", "the application does not allow it"},
+    {"preloaded", "preloaded packages are left out"},
+    {"unreadable", "its data could not be read"},
+    {"upload-failed", "the upload failed"},
+    {"no-archive", "the cloud holds no archive of it"},
+    {"download-failed", "the download failed"},
+    {"wifi-lost", "Wi-Fi was lost"},
+    {"cancelled", "cancelled"},
+    {"snapshot-failed", "its present data could not be copied, so nothing was changed"},
+    {"unpack-failed", "the archive could not be unpacked"},
+    {"attributes-failed", "modes, owners or labels could not be set"},
+    {"not-installed", "restore mode ended before it was installed"},
+    {"unknown", "the daemon did not say"},
+};
+
+template <std::size_t N>
+std::string words(const Words (&list)[N], const std::string &word) {
+  for (const Words &entry : list) {
+    if (word == entry.word) return entry.text;
+  }
+  return word;
+}
+
+std::uint64_t unsigned_member(json_object *object, const char *name) {
+  const auto value = json_integer(object, name);
+  return value && *value > 0 ? static_cast<std::uint64_t>(*value) : 0;
+}
+
+std::optional<std::uint64_t> optional_size(json_object *object, const char *name) {
+  const auto value = json_integer(object, name);
+  if (!value || *value < 0) return std::nullopt;
+  return static_cast<std::uint64_t>(*value);
+}
+
+double part(std::uint64_t done, std::uint64_t total) {
+  if (total == 0) return 0;
+  return std::min(1.0, static_cast<double>(done) / static_cast<double>(total));
+}
+
+}  // namespace
+
+std::optional<ProgressEvent> parse_progress(const std::string &text) {
+  const JsonPtr root = json_parse(text);
+  json_object *object = root.get();
+  ProgressEvent event;
+  event.kind = json_string(object, "kind").value_or("");
+  event.stage = json_string(object, "stage").value_or("");
+  if (event.kind.empty() || event.stage.empty()) return std::nullopt;
+  event.run = json_integer(object, "run").value_or(0);
+  event.request = json_integer(object, "request");
+  event.package = json_string(object, "package").value_or("");
+  event.index = json_integer(object, "index").value_or(0);
+  event.count = json_integer(object, "count").value_or(0);
+  event.bytes_done = unsigned_member(object, "bytes_done");
+  event.bytes_total = unsigned_member(object, "bytes_total");
+  event.outcome = json_string(object, "outcome").value_or("");
+  event.reason = json_string(object, "reason").value_or("");
+  event.size = optional_size(object, "size");
+  event.cap = optional_size(object, "cap");
+  event.result = json_integer(object, "result");
+  return event;
+}
+
+std::string stage_text(const std::string &kind, const std::string &stage) {
+  if (stage == kFinished && kind == kBackup) return "backup finished";
+  return words(kStages, stage);
+}
+
+std::string reason_text(const PackageOutcome &outcome) {
+  if (outcome.reason == "too-large" && outcome.size && outcome.cap) {
+    return size_text(*outcome.size) + " of data, at most " + size_text(*outcome.cap);
+  }
+  std::string text = words(kReasons, outcome.reason);
+  if (text.empty() && outcome.result && *outcome.result != QUARN_OK) {
+    text = quarn_result_text(static_cast<int>(*outcome.result));
+  }
+  return text;
+}
+
+const PackageOutcome *ProgressBoard::outcome_of(const std::string &package) const {
+  const auto found =
+      std::find_if(outcomes_.begin(), outcomes_.end(),
+                   [&](const PackageOutcome &known) { return known.package == package; });
+  return found == outcomes_.end() ? nullptr : &*found;
+}
+
+void ProgressBoard::set_outcome(PackageOutcome outcome) {
+  const PackageOutcome *known = outcome_of(outcome.package);
+  if (known == nullptr) {
+    outcomes_.push_back(std::move(outcome));
+  } else {
+    outcomes_[static_cast<std::size_t>(known - outcomes_.data())] = std::move(outcome);
+  }
+}
+
+std::string ProgressBoard::feed(const ProgressEvent &event) {
+  const bool new_stage = event.stage != last_.stage || event.run != last_.run;
+  if (new_stage && event.kind == kBackup) {
+    best_ = 0;
+    transfers_.clear();
+  }
+  last_ = event;
+  std::string line;
+  if (!event.package.empty() && !event.outcome.empty()) {
+    PackageOutcome outcome{event.package, event.outcome, event.reason,
+                           event.size,    event.cap,     event.result};
+    const std::string reason = reason_text(outcome);
+    line = event.package + ": " + event.outcome;
+    if (!reason.empty()) line += " (" + reason + ")";
+    set_outcome(std::move(outcome));
+  } else if (new_stage && event.kind == kBackup) {
+    line = stage_text(event.kind, event.stage);
+  }
+  if (event.stage == kUploading && !event.package.empty()) {
+    const double done = event.outcome.empty() ? part(event.bytes_done, event.bytes_total) : 1;
+    const auto found =
+        std::find_if(transfers_.begin(), transfers_.end(),
+                     [&](const Transfer &known) { return known.package == event.package; });
+    if (found == transfers_.end()) {
+      transfers_.push_back({event.package, done});
+    } else {
+      found->fraction = std::max(found->fraction, done);
+    }
+  }
+  best_ = std::clamp(std::max(best_, fraction()), 0.0, 1.0);
+  return printable(line);
+}
+
+double ProgressBoard::fraction() const {
+  if (last_.stage == kFinished) return 1;
+  const double share = part(last_.bytes_done, last_.bytes_total);
+  if (last_.kind != kBackup) {
+    const auto all = std::max<double>(static_cast<double>(expected_), 1);
+    const bool running = !last_.package.empty() && last_.outcome.empty();
+    return (static_cast<double>(outcomes_.size()) + (running ? share : 0)) / all;
+  }
+  if (last_.count <= 0) return share;
+  const auto count = static_cast<double>(last_.count);
+  if (last_.stage == kUploading) {
+    double sum = 0;
+    for (const Transfer &transfer : transfers_) sum += transfer.fraction;
+    return sum / count;
+  }
+  const double before = std::max<double>(static_cast<double>(last_.index) - 1, 0);
+  return (before + (last_.outcome.empty() ? share : 1)) / count;
+}
+
+std::string ProgressBoard::bar(std::size_t columns) const {
+  const auto filled = static_cast<std::size_t>(std::lround(best_ * kBarColumns));
+  const long percent = std::lround(std::floor(best_ * kPercent));
+  std::string line = "[" + std::string(filled, '#') + std::string(kBarColumns - filled, '-') + "]";
+  std::string number = std::to_string(percent);
+  line += std::string(number.size() < 4 ? 4 - number.size() : 0, ' ') + number + "%  ";
+  line += stage_text(last_.kind, last_.stage);
+  if (last_.index > 0 && last_.count > 0) {
+    line += " " + std::to_string(last_.index) + "/" + std::to_string(last_.count);
+  }
+  if (!last_.package.empty()) line += "  " + last_.package;
+  if (last_.bytes_total > 0) {
+    line += "  " + size_text(last_.bytes_done) + " of " + size_text(last_.bytes_total);
+  }
+  return clipped(line, columns);
+}
+
+std::string ProgressBoard::table() const {
+  if (outcomes_.empty()) return "";
+  std::vector<std::vector<std::string>> rows;
+  for (const PackageOutcome &outcome : outcomes_) {
+    rows.push_back({outcome.package, outcome.outcome, outcome.size ? size_text(*outcome.size) : "-",
+                    reason_text(outcome)});
+  }
+  return table_text({"PACKAGE", "OUTCOME", "SIZE", "WHY"}, rows);
+}
+
+json_object *ProgressBoard::to_json() const {
+  json_object *array = json_object_new_array();
+  for (const PackageOutcome &outcome : outcomes_) {
+    json_object *entry = json_object_new_object();
+    json_add(entry, "package", outcome.package);
+    json_add(entry, "outcome", outcome.outcome);
+    if (!outcome.reason.empty()) json_add(entry, "reason", outcome.reason);
+    if (outcome.size) {
+      json_object_object_add(entry, "size",
+                             json_object_new_int64(static_cast<std::int64_t>(*outcome.size)));
+    }
+    if (outcome.cap) {
+      json_object_object_add(entry, "cap",
+                             json_object_new_int64(static_cast<std::int64_t>(*outcome.cap)));
+    }
+    if (outcome.result) {
+      json_object_object_add(entry, "result", json_object_new_int64(*outcome.result));
+    }
+    json_object_array_add(array, entry);
+  }
+  return array;
+}
+
+}  // namespace quarn_client

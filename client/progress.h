@@ -1,0 +1,93 @@
+/**
+ * @file progress.h
+ * @brief The daemon's "progress" signals: read, collected and put into words.
+ *
+ * docs/progress.md describes the signal.
+ */
+#ifndef QUARN_CLIENT_PROGRESS_H
+#define QUARN_CLIENT_PROGRESS_H
+
+#include <json-c/json.h>
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace quarn_client {
+
+/** One signal; members that are missing or of another type are empty or 0. */
+struct ProgressEvent {
+  std::int64_t run = 0;
+  std::optional<std::int64_t> request; /**< id of the client request that the run serves */
+  std::string kind;                    /**< "backup" or "restore" */
+  std::string stage;
+  std::string package; /**< empty: the event is about the whole run */
+  std::int64_t index = 0;
+  std::int64_t count = 0;
+  std::uint64_t bytes_done = 0;
+  std::uint64_t bytes_total = 0;
+  std::string outcome; /**< empty while the package is being worked on */
+  std::string reason;
+  std::optional<std::uint64_t> size; /**< bytes: the archive's, or what was too large */
+  std::optional<std::uint64_t> cap;  /**< bytes that are allowed at most */
+  std::optional<std::int64_t> result;
+};
+
+/** Reads a signal's text; nothing when it is not an object with a kind and a stage. */
+std::optional<ProgressEvent> parse_progress(const std::string &text);
+
+/** What became of one package. */
+struct PackageOutcome {
+  std::string package;
+  std::string outcome;
+  std::string reason;
+  std::optional<std::uint64_t> size;
+  std::optional<std::uint64_t> cap;
+  std::optional<std::int64_t> result;
+};
+
+/** Collects the events of one run. */
+class ProgressBoard {
+ public:
+  /** @param expected packages of the run when they are known before it begins, else 0 */
+  explicit ProgressBoard(std::size_t expected = 0) : expected_(expected) {}
+
+  /** Takes one event in. @return a line worth showing where nothing can be redrawn, or empty */
+  std::string feed(const ProgressEvent &event);
+
+  /** Adds or replaces the outcome of a package. */
+  void set_outcome(PackageOutcome outcome);
+  const PackageOutcome *outcome_of(const std::string &package) const;
+  const std::vector<PackageOutcome> &outcomes() const { return outcomes_; }
+
+  /** One line of at most @p columns columns: a bar and what is going on. */
+  std::string bar(std::size_t columns) const;
+  /** Each package, what happened to it, its size and why; empty when none was reported. */
+  std::string table() const;
+  /** The same as a JSON array; the caller owns it. */
+  json_object *to_json() const;
+
+ private:
+  double fraction() const;
+
+  std::size_t expected_;
+  ProgressEvent last_;
+  double best_ = 0;
+  std::vector<PackageOutcome> outcomes_;
+  struct Transfer {
+    std::string package;
+    double fraction;
+  };
+  std::vector<Transfer> transfers_;
+};
+
+/** Words for a stage of the daemon's work; the stage itself when it is not known. */
+std::string stage_text(const std::string &kind, const std::string &stage);
+
+/** Words for why a package came out as it did. */
+std::string reason_text(const PackageOutcome &outcome);
+
+}  // namespace quarn_client
+
+#endif

@@ -1,0 +1,26 @@
+#include <clocale>
+#include <cstdio>
+#include <string>
+#include <vector>
+
+#include "arguments.h"
+#include "session.h"
+
+int main(int argc, char **argv) {
+  std::setlocale(LC_ALL, "");
+  quarn_client::Command command;
+  std::string error;
+  const std::vector<std::string> arguments(argv + (argc > 0 ? 1 : 0), argv + argc);
+  if (!quarn_client::parse_arguments(arguments, command, error)) {
+    return quarn_client::report_usage_error(command, error);
+  }
+  if (command.verb == quarn_client::Verb::help) {
+    std::fputs(command.help.c_str(), stdout);
+    return 0;
+  }
+  if (command.verb == quarn_client::Verb::version) {
+    std::puts("quarnctl " QUARN_VERSION);
+    return 0;
+  }
+  return quarn_client::run_command(command);
+}

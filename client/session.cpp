@@ -1,0 +1,630 @@
+#include "session.h"
+
+#include <glib-unix.h>
+
+#include <algorithm>
+#include <cmath>
+#include <csignal>
+#include <optional>
+#include <utility>
+
+#include "backup_sets.h"
+#include "bus_client.h"
+#include "json_read.h"
+#include "progress.h"
+#include "quarn_common.h"
+#include "quarn_handles.h"
+#include "screen.h"
+#include "text.h"
+
+namespace quarn_client {
+
+namespace {
+
+constexpr int kMsPerSecond = 1000;
+constexpr int kCloudClient = 0;
+constexpr int kOn = 1;
+constexpr int kOff = 0;
+constexpr char kRestoreStop[] = "restore_stop";
+constexpr char kBackupKind[] = "backup";
+constexpr char kRestoreKind[] = "restore";
+constexpr char kFinishedStage[] = "finished";
+constexpr char kRestoredOutcome[] = "restored";
+constexpr char kExportDirectory[] = "/tmp/";
+constexpr char kExportSuffix[] = "_tmp.zip";
+
+/** A result code as an exit code; one that is not known counts as a failure of no special kind. */
+int exit_of(int result) {
+  return result >= QUARN_OK && result <= QUARN_FAILED ? result : QUARN_FAILED;
+}
+
+std::string result_words(int result) {
+  return std::string(quarn_result_text(result)) + " (" + std::to_string(result) + ")";
+}
+
+std::string seconds_words(double seconds) {
+  char buffer[G_ASCII_DTOSTR_BUF_SIZE];
+  return std::string(g_ascii_formatd(buffer, sizeof buffer, "%g", seconds)) + " seconds";
+}
+
+class Session {
+ public:
+  explicit Session(const Command &command);
+  int run();
+
+ private:
+  /** What an answer of the daemon leads to. */
+  using Then = std::function<void(int result)>;
+
+  void begin();
+  void call_for_result(const char *method, GVariant *arguments, Then then);
+  void switch_state(const char *method, int on, const char *done);
+  void last_time();
+  void backup();
+  void cancel();
+  void app_request(const char *method, const char *what, const char *done);
+  void app_export();
+  void fetch_list(std::function<void(const BackupSets &)> then);
+  void show_list(const BackupSets &sets);
+  void show_sets(const BackupSets &sets);
+  void restore_on(const BackupSets &sets);
+  void restore_off();
+
+  void answered();
+  void take_callback(const Callback &callback);
+  void take_status(const Callback &callback);
+  void take_progress(const std::string &text);
+  void daemon_ended();
+  void fail(const BusFailure &failure);
+
+  void watch();
+  void check_watch();
+  void end_watch(bool mode_ended);
+  int watched_result() const;
+  bool has_archive(const std::string &package) const;
+
+  void interrupt();
+  void time_out();
+  void arm_timer();
+  void disarm_timer();
+
+  void show_outcomes();
+  void finish(int code, const std::string &error = "");
+  void finish_with(int result, const std::string &what, const std::string &done);
+
+  static gboolean on_interrupt(gpointer user_data);
+  static gboolean on_timeout(gpointer user_data);
+
+  const Command &command_;
+  Screen screen_;
+  GMainLoopPtr loop_;
+  std::unique_ptr<BusClient> client_;
+  ProgressBoard board_;
+  JsonPtr document_;
+  BackupSet set_; /**< restore on: the chosen set */
+  std::vector<std::string> expected_;
+  std::function<void()> on_answer_; /**< called whenever reply_ or callback_ has changed */
+  std::optional<int> reply_;
+  std::optional<Callback> callback_;
+  std::uint32_t req_id_;
+  bool called_ = false;
+  bool cancelling_ = false;
+  bool watching_ = false;
+  bool reported_ = false; /**< a progress signal of ours has come */
+  bool done_ = false;
+  bool at_once_ = false;
+  int exit_ = QUARN_FAILED;
+  guint timer_ = 0;
+};
+
+Session::Session(const Command &command)
+    : command_(command),
+      screen_(command.json),
+      loop_(g_main_loop_new(nullptr, FALSE)),
+      document_(json_object_new_object()),
+      req_id_(random_request_id()) {
+  json_add(document_.get(), "verb", command.name);
+}
+
+int Session::run() {
+  const guint sources[] = {g_unix_signal_add(SIGINT, on_interrupt, this),
+                           g_unix_signal_add(SIGTERM, on_interrupt, this),
+                           g_unix_signal_add(SIGHUP, on_interrupt, this)};
+  arm_timer();
+  client_ = std::make_unique<BusClient>(BusClient::Events{
+      [this] { begin(); }, [this](const Callback &callback) { take_callback(callback); },
+      [this](const std::string &text) { take_progress(text); }, [this] { daemon_ended(); },
+      [this](const BusFailure &failure) { fail(failure); }});
+  client_->connect();
+  if (!done_) g_main_loop_run(loop_.get());
+  if (!at_once_) client_->flush();
+  disarm_timer();
+  for (const guint source : sources) g_source_remove(source);
+  client_.reset();
+  // What was in flight ends with its cancellation, which the loop has to deliver.
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+  return exit_;
+}
+
+void Session::begin() {
+  if (done_) return;
+  called_ = true;
+  switch (command_.verb) {
+    case Verb::activate:
+      return switch_state("set_activation", kOn, "the daemon is active");
+    case Verb::deactivate:
+      return switch_state("set_activation", kOff, "the daemon ends when it is idle");
+    case Verb::auto_backup:
+      return switch_state(
+          "backup_enable", command_.switch_on ? kOn : kOff,
+          command_.switch_on ? "automatic backup is on" : "automatic backup is off");
+    case Verb::last_time:
+      return last_time();
+    case Verb::backup:
+      return backup();
+    case Verb::cancel:
+      return cancel();
+    case Verb::list:
+      return fetch_list([this](const BackupSets &sets) { show_list(sets); });
+    case Verb::sets:
+      return fetch_list([this](const BackupSets &sets) { show_sets(sets); });
+    case Verb::app_backup:
+      return app_request("app_data_backup_start", "backup", "was backed up");
+    case Verb::app_restore:
+      return app_request("app_data_restore_start", "restore", "was restored");
+    case Verb::app_export:
+      return app_export();
+    case Verb::restore_on:
+      return fetch_list([this](const BackupSets &sets) { restore_on(sets); });
+    case Verb::restore_off:
+      return restore_off();
+    case Verb::help:
+    case Verb::version:
+      break;
+  }
+  finish(EXIT_USAGE, "nothing to do");
+}
+
+void Session::call_for_result(const char *method, GVariant *arguments, Then then) {
+  client_->call(
+      method, arguments, "(i)",
+      [this, then = std::move(then)](GVariant *value) {
+        if (done_) return;
+        gint32 result = QUARN_FAILED;
+        g_variant_get(value, "(i)", &result);
+        then(result);
+      },
+      [this](const BusFailure &failure) { fail(failure); });
+}
+
+void Session::switch_state(const char *method, int on, const char *done) {
+  call_for_result(method, g_variant_new("(i)", on),
+                  [this, done](int result) { finish_with(result, command_.name, done); });
+}
+
+void Session::last_time() {
+  client_->call(
+      "last_bu_time", nullptr, "(t)",
+      [this](GVariant *value) {
+        if (done_) return;
+        guint64 ms = 0;
+        g_variant_get(value, "(t)", &ms);
+        const auto time = ms > INT64_MAX ? INT64_MAX : static_cast<std::int64_t>(ms);
+        json_object_object_add(document_.get(), "time_ms", json_object_new_uint64(ms));
+        json_add(document_.get(), "time", local_time(time));
+        finish_with(QUARN_OK, command_.name, local_time(time));
+      },
+      [this](const BusFailure &failure) { fail(failure); });
+}
+
+void Session::backup() {
+  on_answer_ = [this] {
+    // The final state may overtake the reply; the daemon is not left before it has given both.
+    if (!reply_) return;
+    if (*reply_ != QUARN_OK && !callback_) return finish_with(*reply_, "backup", "");
+    if (!callback_) return;
+    switch (callback_->status) {
+      case QUARN_BACKUP_SUCCEEDED:
+        return finish_with(QUARN_OK, "backup", "backup succeeded");
+      case QUARN_BACKUP_CANCELLED:
+        show_outcomes();
+        return finish(QUARN_CANCELLED,
+                      "backup cancelled (" + std::to_string(QUARN_CANCELLED) + ")");
+      default:
+        return finish_with(callback_->result == QUARN_OK ? QUARN_FAILED : callback_->result,
+                           "backup", "");
+    }
+  };
+  call_for_result("manual_backup_start", g_variant_new("(u)", req_id_), [this](int result) {
+    reply_ = result;
+    answered();
+  });
+}
+
+void Session::cancel() {
+  on_answer_ = [this] {
+    if (!reply_) return;
+    if (*reply_ != QUARN_OK || callback_) {
+      finish_with(*reply_ != QUARN_OK ? *reply_ : callback_->result, "cancel",
+                  "the daemon has taken the cancellation");
+    }
+  };
+  call_for_result("manual_backup_cancel", g_variant_new("(u)", req_id_), [this](int result) {
+    reply_ = result;
+    answered();
+  });
+}
+
+void Session::app_request(const char *method, const char *what, const char *done) {
+  const std::string &package = command_.packages[0];
+  json_add(document_.get(), "package", package);
+  on_answer_ = [this, what, done, package] {
+    if (!reply_ || (*reply_ == QUARN_OK && !callback_)) return;
+    const int result = callback_ ? callback_->result : *reply_;
+    finish_with(result, std::string(what) + " of " + package, package + " " + done);
+  };
+  call_for_result(method, g_variant_new("(su)", package.c_str(), req_id_), [this](int result) {
+    reply_ = result;
+    answered();
+  });
+}
+
+void Session::app_export() {
+  const std::string &package = command_.packages[0];
+  call_for_result("make_app_data", g_variant_new("(s)", package.c_str()), [this](int result) {
+    const std::string &name = command_.packages[0];
+    const std::string path = kExportDirectory + name + kExportSuffix;
+    json_add(document_.get(), "package", name);
+    if (result == QUARN_OK) json_add(document_.get(), "path", path);
+    finish_with(result, "export of " + name, path);
+  });
+}
+
+void Session::fetch_list(std::function<void(const BackupSets &)> then) {
+  on_answer_ = [this, then = std::move(then)] {
+    if (!reply_ && !callback_) return;
+    if (callback_ && callback_->result == QUARN_BAD_ARGUMENT) {
+      return finish(QUARN_BAD_ARGUMENT,
+                    "the cloud holds no application list yet, or it could not be fetched (" +
+                        std::to_string(QUARN_BAD_ARGUMENT) + ")");
+    }
+    if (callback_ && callback_->result != QUARN_OK) {
+      return finish_with(callback_->result, "getting the application list", "");
+    }
+    if (reply_ && *reply_ != QUARN_OK && !callback_) {
+      return finish_with(*reply_, "getting the application list", "");
+    }
+    if (!reply_ || !callback_) return;
+    std::string error;
+    const auto sets = parse_backup_sets(callback_->text, error);
+    if (!sets) return finish(EXIT_PROTOCOL, error);
+    if (sets->left_out > 0) {
+      json_object_object_add(document_.get(), "left_out",
+                             json_object_new_int64(static_cast<std::int64_t>(sets->left_out)));
+      screen_.error(std::to_string(sets->left_out) + " unreadable entries are left out");
+    }
+    then(*sets);
+  };
+  call_for_result("get_app_list", g_variant_new("(iu)", kCloudClient, req_id_), [this](int result) {
+    reply_ = result;
+    answered();
+  });
+}
+
+void Session::show_list(const BackupSets &sets) {
+  std::vector<std::vector<std::string>> rows;
+  for (const BackupSet &set : sets.sets) {
+    const std::string time = set.time_ms ? local_time(*set.time_ms) : "-";
+    for (const SetPackage &package : set.packages) {
+      rows.push_back({set.serial, package.id, package.version, crc_text(package.crc), time});
+    }
+  }
+  json_object_object_add(document_.get(), "devices", sets_to_json(sets));
+  screen_.text(table_text({"DEVICE", "PACKAGE", "VERSION", "CRC", "TIME"}, rows));
+  finish(QUARN_OK);
+}
+
+void Session::show_sets(const BackupSets &sets) {
+  std::vector<std::vector<std::string>> rows;
+  for (const BackupSet &set : sets.sets) {
+    rows.push_back({set.serial, set.model, set.time_ms ? local_time(*set.time_ms) : "-",
+                    std::to_string(set.packages.size())});
+  }
+  json_object_object_add(document_.get(), "sets", sets_to_json(sets));
+  screen_.text(table_text({"SERIAL", "MODEL", "TIME", "PACKAGES"}, rows));
+  finish(QUARN_OK);
+}
+
+void Session::restore_on(const BackupSets &sets) {
+  const BackupSet *set = find_set(sets, command_.serial);
+  if (set == nullptr) {
+    return finish(QUARN_BAD_ARGUMENT, "the cloud holds no backup of a device " + command_.serial +
+                                          "; quarnctl sets shows the devices");
+  }
+  set_ = *set;
+  std::vector<std::string> wanted = command_.packages;
+  if (wanted.empty()) {
+    for (const SetPackage &package : set_.packages) wanted.push_back(package.id);
+  }
+  for (const std::string &package : wanted) {
+    if (find_package(set_, package) == nullptr) {
+      return finish(QUARN_BAD_ARGUMENT,
+                    "the backup of " + set_.serial + " holds no package " + package);
+    }
+    if (std::find(expected_.begin(), expected_.end(), package) == expected_.end()) {
+      expected_.push_back(package);
+    }
+  }
+  if (expected_.empty()) {
+    return finish(QUARN_BAD_ARGUMENT, "the backup of " + set_.serial + " holds no packages");
+  }
+  const JsonPtr list(json_object_new_array());
+  for (const std::string &package : expected_) {
+    json_object_array_add(
+        list.get(), json_object_new_string_len(package.data(), static_cast<int>(package.size())));
+  }
+  json_add(document_.get(), "serial", set_.serial);
+  json_object_object_add(document_.get(), "expected", json_object_get(list.get()));
+  reply_.reset();
+  callback_.reset();
+  on_answer_ = nullptr;
+  board_ = ProgressBoard(expected_.size());
+  call_for_result("restore_enable",
+                  g_variant_new("(iissu)", kOn, kCloudClient, set_.serial.c_str(),
+                                json_text(list.get()).c_str(), req_id_),
+                  [this](int result) {
+                    if (result != QUARN_OK) return finish_with(result, "restore on", "");
+                    const std::string on = "restore mode is on for " +
+                                           std::to_string(expected_.size()) + " packages of " +
+                                           printable(set_.serial);
+                    if (!command_.watch) return finish_with(QUARN_OK, "", on);
+                    screen_.line(on);
+                    watch();
+                  });
+}
+
+void Session::restore_off() {
+  call_for_result(
+      "restore_enable", g_variant_new("(iissu)", kOff, kCloudClient, "", "[]", req_id_),
+      [this](int result) { finish_with(result, "restore off", "restore mode is off"); });
+}
+
+void Session::answered() {
+  // A copy: what it does may put another function in its place.
+  const auto on_answer = on_answer_;
+  if (on_answer) on_answer();
+}
+
+void Session::take_callback(const Callback &callback) {
+  if (done_ || callback.req_id != req_id_) return;
+  switch (callback.kind) {
+    case Callback::Kind::backup_status:
+      return take_status(callback);
+    case Callback::Kind::restore_enable:
+      if (command_.verb != Verb::restore_on || !command_.watch) return;
+      if (callback.text == kRestoreStop) return end_watch(true);
+      return screen_.line(printable(callback.text) + ": " + result_words(callback.result));
+    default:
+      callback_ = callback;
+      answered();
+  }
+}
+
+void Session::take_status(const Callback &callback) {
+  if (command_.verb != Verb::backup) return;
+  if (callback.status == QUARN_BACKUP_RUNNING) return screen_.line("backup started");
+  callback_ = callback;
+  answered();
+}
+
+void Session::take_progress(const std::string &text) {
+  if (done_ || !called_) return;
+  const auto event = parse_progress(text);
+  if (!event || (event->request && *event->request != req_id_)) return;
+  const bool is_backup = command_.verb == Verb::backup || command_.verb == Verb::app_backup;
+  const bool is_restore = command_.verb == Verb::restore_on || command_.verb == Verb::app_restore;
+  if (!(is_backup && event->kind == kBackupKind) && !(is_restore && event->kind == kRestoreKind)) {
+    return;
+  }
+  reported_ = true;
+  const std::string line = board_.feed(*event);
+  if (screen_.redraws()) {
+    screen_.bar(board_.bar(screen_.columns()));
+  } else if (!line.empty()) {
+    screen_.line(line);
+  }
+  if (!watching_) return;
+  if (event->package.empty() && event->stage == kFinishedStage) return end_watch(true);
+  check_watch();
+}
+
+void Session::watch() {
+  if (!command_.timeout_given) disarm_timer();
+  watching_ = true;
+  check_watch();
+}
+
+void Session::check_watch() {
+  const bool all = std::all_of(expected_.begin(), expected_.end(), [this](const auto &package) {
+    return board_.outcome_of(package) != nullptr;
+  });
+  if (all) end_watch(false);
+}
+
+bool Session::has_archive(const std::string &package) const {
+  const SetPackage *known = find_package(set_, package);
+  return known != nullptr && known->crc != 0;
+}
+
+int Session::watched_result() const {
+  for (const std::string &package : expected_) {
+    const PackageOutcome *outcome = board_.outcome_of(package);
+    // A package the set holds no archive of cannot come back; that is no failure.
+    if (outcome->outcome == kRestoredOutcome || !has_archive(package)) continue;
+    const auto result = outcome->result.value_or(QUARN_FAILED);
+    return result == QUARN_OK ? static_cast<int>(QUARN_FAILED) : exit_of(static_cast<int>(result));
+  }
+  return QUARN_OK;
+}
+
+void Session::end_watch(bool mode_ended) {
+  watching_ = false;
+  if (mode_ended) {
+    for (const std::string &package : expected_) {
+      if (board_.outcome_of(package) != nullptr) continue;
+      board_.set_outcome({package, "skipped", "not-installed", {}, {}, QUARN_CANCELLED});
+    }
+  }
+  const int result = watched_result();
+  show_outcomes();
+  if (result == QUARN_OK) return finish_with(QUARN_OK, "", "restore finished");
+  finish(result, "not every package was restored: " + result_words(result));
+}
+
+void Session::daemon_ended() {
+  if (done_ || !called_) return;
+  if (watching_) {
+    std::string missing;
+    for (const std::string &package : expected_) {
+      if (board_.outcome_of(package) == nullptr) missing += " " + package;
+    }
+    show_outcomes();
+    return finish(EXIT_DAEMON_ENDED,
+                  std::string("the daemon ended before it had told what became of") + missing +
+                      (reported_ ? "" : " (it reported no progress at all)"));
+  }
+  if (callback_) {
+    if (!reply_) reply_ = QUARN_OK;
+    answered();
+    if (done_) return;
+  }
+  show_outcomes();
+  finish(EXIT_DAEMON_ENDED, "the daemon ended before it had answered");
+}
+
+void Session::fail(const BusFailure &failure) {
+  if (done_) return;
+  int code = EXIT_UNREACHABLE;
+  switch (failure.kind) {
+    case BusFailure::Kind::unreachable:
+      break;
+    case BusFailure::Kind::daemon_ended:
+      code = EXIT_DAEMON_ENDED;
+      break;
+    case BusFailure::Kind::denied:
+      code = EXIT_DENIED;
+      break;
+    case BusFailure::Kind::unusable:
+      code = EXIT_PROTOCOL;
+      break;
+  }
+  show_outcomes();
+  finish(code, failure.message);
+}
+
+gboolean Session::on_interrupt(gpointer user_data) {
+  static_cast<Session *>(user_data)->interrupt();
+  return G_SOURCE_CONTINUE;
+}
+
+void Session::interrupt() {
+  if (done_) return;
+  if (command_.verb == Verb::backup && called_ && !cancelling_) {
+    cancelling_ = true;
+    screen_.line("cancelling the backup; interrupt again to leave at once");
+    // The run's own final state tells the outcome, so the answer to this is not waited for.
+    call_for_result("manual_backup_cancel", g_variant_new("(u)", random_request_id()), [](int) {});
+    return;
+  }
+  at_once_ = cancelling_;
+  if (watching_) {
+    show_outcomes();
+    return finish(EXIT_INTERRUPTED,
+                  "no longer watching; restore mode stays on (quarnctl restore off ends it)");
+  }
+  finish(EXIT_INTERRUPTED, "interrupted");
+}
+
+gboolean Session::on_timeout(gpointer user_data) {
+  auto *self = static_cast<Session *>(user_data);
+  self->timer_ = 0;
+  self->time_out();
+  return G_SOURCE_REMOVE;
+}
+
+void Session::time_out() {
+  if (done_) return;
+  std::string error = "no answer within " + seconds_words(command_.timeout);
+  if (command_.verb == Verb::backup && called_) {
+    error = "the backup has not ended within " + seconds_words(command_.timeout) +
+            "; it goes on (quarnctl cancel stops it)";
+  } else if (watching_) {
+    error = "not all packages were restored within " + seconds_words(command_.timeout) +
+            "; restore mode stays on (quarnctl restore off ends it)";
+  }
+  show_outcomes();
+  finish(EXIT_TIMED_OUT, error);
+}
+
+void Session::arm_timer() {
+  if (command_.timeout <= 0) return;
+  const double ms = std::ceil(command_.timeout * kMsPerSecond);
+  timer_ = g_timeout_add(ms >= G_MAXUINT ? G_MAXUINT : static_cast<guint>(ms), on_timeout, this);
+}
+
+void Session::disarm_timer() {
+  if (timer_ != 0) g_source_remove(timer_);
+  timer_ = 0;
+}
+
+void Session::show_outcomes() {
+  if (board_.outcomes().empty()) return;
+  json_object_object_add(document_.get(), "packages", board_.to_json());
+  screen_.text(board_.table());
+}
+
+void Session::finish_with(int result, const std::string &what, const std::string &done) {
+  if (command_.verb == Verb::backup || command_.verb == Verb::app_backup ||
+      command_.verb == Verb::app_restore) {
+    show_outcomes();
+  }
+  if (result == QUARN_OK) {
+    screen_.line(printable(done));
+    return finish(QUARN_OK);
+  }
+  finish(exit_of(result), what + " failed: " + result_words(result));
+}
+
+void Session::finish(int code, const std::string &error) {
+  if (done_) return;
+  done_ = true;
+  exit_ = code;
+  screen_.clear_bar();
+  if (!error.empty()) screen_.error(error);
+  if (command_.json) {
+    json_object_object_add(document_.get(), "exit", json_object_new_int(code));
+    json_add(document_.get(), "message", error.empty() ? quarn_result_text(QUARN_OK) : error);
+    screen_.document(json_text(document_.get()));
+  }
+  g_main_loop_quit(loop_.get());
+}
+
+}  // namespace
+
+int run_command(const Command &command) { return Session(command).run(); }
+
+int report_usage_error(const Command &command, const std::string &error) {
+  Screen screen(command.json);
+  screen.error(error);
+  if (command.json) {
+    const JsonPtr document(json_object_new_object());
+    json_add(document.get(), "verb", command.name);
+    json_object_object_add(document.get(), "exit", json_object_new_int(EXIT_USAGE));
+    json_add(document.get(), "message", error);
+    screen.document(json_text(document.get()));
+  }
+  return EXIT_USAGE;
+}
+
+}  // namespace quarn_client
