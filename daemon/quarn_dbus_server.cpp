@@ -79,6 +79,7 @@ constexpr int kBusTimeout = 5000;
 
 guint registration_id = 0;
 guint filter_id = 0;
+void (*bus_acquired_hook)(GDBusConnection *connection) = nullptr;
 
 /** One call, and the way its one answer goes. */
 class MethodCall {
@@ -402,6 +403,7 @@ void _dbus_on_bus_acquired(GDBusConnection *connection, const gchar *, gpointer 
                                              unref_node);
   }
   LOGI("g_dbus_connection_register_object() succeed");
+  if (bus_acquired_hook != nullptr) bus_acquired_hook(connection);
 }
 
 void _dbus_on_name_acquired(GDBusConnection *, const gchar *name, gpointer) {
@@ -413,6 +415,8 @@ void _dbus_on_name_lost(GDBusConnection *, const gchar *name, gpointer) {
 }
 
 }  // namespace
+
+void set_bus_acquired_hook(void (*hook)(GDBusConnection *connection)) { bus_acquired_hook = hook; }
 
 unsigned int quarnd_dbus_init() {
   GErrorPtr error;

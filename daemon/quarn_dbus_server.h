@@ -7,8 +7,13 @@
 #ifndef QUARN_DBUS_SERVER_H
 #define QUARN_DBUS_SERVER_H
 
+#include <gio/gio.h>
+
 /** The introspection document: tabs between its elements. */
 extern const char quarn_introspection_xml[];
+
+/** Who is told of the connection once the object is served; set before quarnd_dbus_init(). */
+void set_bus_acquired_hook(void (*hook)(GDBusConnection *connection));
 
 /** Own the bus name and serve the object. @return owner id, or (unsigned) -1 */
 unsigned int quarnd_dbus_init();

@@ -34,7 +34,8 @@ def app_list(device):
 
 def entry_of(device, serial):
     for entry in app_list(device)["model_list"]:
-        if entry["backup_info"]["serial_number"] == serial:
+        info = entry.get("backup_info") if isinstance(entry, dict) else None
+        if isinstance(info, dict) and info.get("serial_number") == serial:
             return entry
     raise AssertionError("no entry of " + serial)
 
@@ -50,7 +51,7 @@ class BackupStory(TestCase):
         for name, files in (("org.example.alpha", {"data/a.txt": b"alpha\n" * 100}),
                             ("org.example.beta", {"shared/data/b.bin": os.urandom(50000),
                                                   "shared/trusted/key": b"k"})):
-            self.device.install(make_source(self.path("src"), name, "1.0.0", files))
+            self.device.install(make_source(self.path("src-" + name), name, "1.0.0", files))
 
     def backup(self, device=None, expected=0):
         result = (device or self.device).quarnctl("backup", check=False)

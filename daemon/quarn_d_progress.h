@@ -1,0 +1,28 @@
+/**
+ * @file quarn_d_progress.h
+ * @brief Tells listeners on the bus what backups and restores are doing.
+ *
+ * Each step becomes one "progress" signal whose value is a JSON text;
+ * docs/progress.md lists its members. The engines only leave a record here:
+ * texts are made and sent by the main loop, so a slow bus never slows a run.
+ */
+#ifndef QUARN_D_PROGRESS_H
+#define QUARN_D_PROGRESS_H
+
+#include <string>
+
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+
+/** Follow both engines from now on. Main thread, once. */
+void quarnd_progress_init();
+
+/** The JSON text of a step. */
+std::string backup_progress_text(const backup_progress &progress);
+std::string restore_progress_text(const restore_progress &progress);
+
+/** The engines' sinks. Any thread. */
+void note_backup_progress(const backup_progress &progress);
+void note_restore_progress(const restore_progress &progress);
+
+#endif

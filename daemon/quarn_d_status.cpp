@@ -1,0 +1,176 @@
+#include "quarn_d_status.h"
+
+#include <atomic>
+#include <cstdint>
+#include <map>
+#include <string>
+
+#include "platform_device.h"
+#include "platform_settings.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_log.h"
+
+const char kStatusIntrospection[] =
+    "<node>"
+    "<interface name=\"org.orvane.Quarn.Status\">"
+    "<property name=\"AutoBackup\" type=\"b\" access=\"read\"/>"
+    "<property name=\"ChargerConnected\" type=\"b\" access=\"read\">"
+    "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"false\"/>"
+    "</property>"
+    "<property name=\"WifiConnected\" type=\"b\" access=\"read\"/>"
+    "<property name=\"ScreenOff\" type=\"b\" access=\"read\"/>"
+    "<property name=\"ConditionAlarm\" type=\"x\" access=\"read\"/>"
+    "<property name=\"NextAlarm\" type=\"x\" access=\"read\"/>"
+    "<property name=\"LastBackup\" type=\"t\" access=\"read\"/>"
+    "<property name=\"BackupRunning\" type=\"b\" access=\"read\"/>"
+    "<property name=\"RestoreMode\" type=\"b\" access=\"read\"/>"
+    "<property name=\"RestoreCandidates\" type=\"as\" access=\"read\"/>"
+    "<property name=\"SerialNumber\" type=\"s\" access=\"read\">"
+    "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"const\"/>"
+    "</property>"
+    "<property name=\"ModelName\" type=\"s\" access=\"read\">"
+    "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"const\"/>"
+    "</property>"
+    "</interface>"
+    "</node>";
+
+namespace {
+
+GDBusConnection *status_connection = nullptr;
+guint status_registration = 0;
+std::atomic<bool> refresh_queued{false};
+std::atomic<bool> served{false};
+
+std::map<std::string, GVariantPtr> &last_told() {
+  static auto *values = new std::map<std::string, GVariantPtr>;
+  return *values;
+}
+
+GVariant *last_backup() {
+  // The schedule's reader logs every call; a client that looks should not fill the log.
+  double value = 0.0;
+  if (vconf_get_dbl(kLastTimeKey, &value) != VCONF_OK || value < 0.0) value = 0.0;
+  return g_variant_new_uint64(static_cast<std::uint64_t>(value));
+}
+
+GVariant *screen_off() {
+  display_state_e state = DISPLAY_STATE_NORMAL;
+  const bool known = device_display_get_state(&state) == DEVICE_ERROR_NONE;
+  return g_variant_new_boolean(known && state == DISPLAY_STATE_SCREEN_OFF ? TRUE : FALSE);
+}
+
+GVariant *candidates() {
+  GVariantBuilder builder;
+  g_variant_builder_init(&builder, G_VARIANT_TYPE("as"));
+  for (const std::string &package : pkg_list_to_be_restored) {
+    g_variant_builder_add(&builder, "s", package.c_str());
+  }
+  return g_variant_builder_end(&builder);
+}
+
+GVariant *device_text(bool serial) {
+  CString model;
+  CString number;
+  get_device_info(out(model), out(number));
+  const CString &text = serial ? number : model;
+  return g_variant_new_string(text ? text.get() : "");
+}
+
+GVariant *flag(bool value) { return g_variant_new_boolean(value ? TRUE : FALSE); }
+
+GVariant *value_of(const std::string &property) {
+  if (property == "AutoBackup") return flag(auto_backup_enabled != 0);
+  if (property == "ChargerConnected") return flag(charger_connected() != 0);
+  if (property == "WifiConnected") return flag(wifi_connected() != 0);
+  if (property == "ScreenOff") return screen_off();
+  if (property == "ConditionAlarm") return g_variant_new_int64(condition_alarm_due());
+  if (property == "NextAlarm") return g_variant_new_int64(next_alarm_due());
+  if (property == "LastBackup") return last_backup();
+  if (property == "BackupRunning") return flag(backup_request_outstanding());
+  if (property == "RestoreMode")
+    return flag(pellix_restore_running != 0 || cloud_restore_running != 0);
+  if (property == "RestoreCandidates") return candidates();
+  if (property == "SerialNumber") return device_text(true);
+  if (property == "ModelName") return device_text(false);
+  return nullptr;
+}
+
+GVariant *get_property(GDBusConnection *, const gchar *, const gchar *, const gchar *,
+                       const gchar *property, GError **, gpointer) {
+  return value_of(property);
+}
+
+const GDBusInterfaceVTable kStatusTable = {nullptr, get_property, nullptr, {nullptr}};
+
+constexpr const char *kChanging[] = {"AutoBackup",     "WifiConnected", "ScreenOff",
+                                     "ConditionAlarm", "NextAlarm",     "LastBackup",
+                                     "BackupRunning",  "RestoreMode",   "RestoreCandidates"};
+
+void tell_changes() {
+  GVariantBuilder changed;
+  g_variant_builder_init(&changed, G_VARIANT_TYPE("a{sv}"));
+  bool any = false;
+  for (const char *property : kChanging) {
+    GVariantPtr value(g_variant_ref_sink(value_of(property)));
+    GVariantPtr &told = last_told()[property];
+    if (told && g_variant_equal(told.get(), value.get()) != FALSE) continue;
+    g_variant_builder_add(&changed, "{sv}", property, value.get());
+    told = std::move(value);
+    any = true;
+  }
+  GVariant *dictionary = g_variant_builder_end(&changed);
+  if (!any) {
+    g_variant_unref(g_variant_ref_sink(dictionary));
+    return;
+  }
+  const char *const none[] = {nullptr};
+  g_dbus_connection_emit_signal(status_connection, nullptr, kStatusObjectPath,
+                                "org.freedesktop.DBus.Properties", "PropertiesChanged",
+                                g_variant_new("(s@a{sv}^as)", kStatusInterface, dictionary, none),
+                                nullptr);
+}
+
+gboolean refresh(gpointer) {
+  refresh_queued = false;
+  if (status_connection != nullptr) tell_changes();
+  return G_SOURCE_REMOVE;
+}
+
+}  // namespace
+
+void quarnd_status_export(GDBusConnection *connection) {
+  GErrorPtr error;
+  GDBusNodeInfo *node = g_dbus_node_info_new_for_xml(kStatusIntrospection, out(error));
+  if (node == nullptr) {
+    LOGE("status object is not available: %s", error->message);
+    return;
+  }
+  status_registration =
+      g_dbus_connection_register_object(connection, kStatusObjectPath, node->interfaces[0],
+                                        &kStatusTable, nullptr, nullptr, out(error));
+  g_dbus_node_info_unref(node);
+  if (status_registration == 0) {
+    LOGE("status object is not available: %s", error->message);
+    return;
+  }
+  status_connection = connection;
+  served = true;
+}
+
+void quarnd_status_unexport() {
+  served = false;
+  if (status_connection == nullptr) return;
+  g_dbus_connection_unregister_object(status_connection, status_registration);
+  status_connection = nullptr;
+  status_registration = 0;
+  last_told().clear();
+}
+
+void quarnd_status_refresh() {
+  if (!served || refresh_queued.exchange(true)) return;
+  g_idle_add(refresh, nullptr);
+}

@@ -1,0 +1,34 @@
+/**
+ * @file quarn_d_status.h
+ * @brief A second, read-only object that tells what the daemon knows of itself.
+ *
+ * "/org/orvane/Quarn/Status" serves the interface "org.orvane.Quarn.Status":
+ * properties with change signals, nothing to call. It is beside the daemon's
+ * own object, whose one interface stays as it is.
+ */
+#ifndef QUARN_D_STATUS_H
+#define QUARN_D_STATUS_H
+
+#include <gio/gio.h>
+
+/** Path of the status object. */
+inline constexpr char kStatusObjectPath[] = "/org/orvane/Quarn/Status";
+/** Its interface. */
+inline constexpr char kStatusInterface[] = "org.orvane.Quarn.Status";
+
+/** The object's introspection document; data/org.orvane.Quarn.Status.xml is the same. */
+extern const char kStatusIntrospection[];
+
+/** Serve the object on @p connection, which the caller keeps alive. Main thread. */
+void quarnd_status_export(GDBusConnection *connection);
+
+/** Take the object back. Safe when nothing is served. Main thread. */
+void quarnd_status_unexport();
+
+/**
+ * Compare the properties with what was last told and send what changed, from
+ * the main loop. Cheap when nothing is served. Any thread.
+ */
+void quarnd_status_refresh();
+
+#endif
