@@ -413,10 +413,16 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   }
   LOGI("request upload for (%s)", pkg_id);
   ++ctx->upload_remain;
-  const int ret = backup_trans_upload_file_ors_async(
-      cloud_handler(), record->local_path.c_str(), record->remote_path.c_str(),
-      __upload_app_data_resp_cb, _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE, record.get(),
-      nullptr);
+  // all three become names in the cloud
+  const bool nameable = is_safe_path_component(ctx->serial_number) &&
+                        is_safe_path_component(record->pkg_id) &&
+                        is_safe_path_component(record->version);
+  const int ret =
+      !nameable ? BACKUP_TRANS_ERROR_ARGUMENT
+                : backup_trans_upload_file_ors_async(
+                      cloud_handler(), record->local_path.c_str(), record->remote_path.c_str(),
+                      __upload_app_data_resp_cb, _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE,
+                      record.get(), nullptr);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
     static_cast<void>(record.release());
     return;
