@@ -1,0 +1,303 @@
+#include <chrono>
+#include <thread>
+
+#include "backup_device.h"
+#include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+
+using ::testing::_;
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+using ::testing::Return;
+
+namespace {
+
+constexpr std::chrono::seconds kDeadline{20};
+constexpr std::uintptr_t kHandle = 0x1234;
+
+/** What a request found before there was a session. */
+struct {
+  std::vector<SentStatus> statuses;
+  int logged = 0;
+  bool backed_up = false;
+} without_session;
+
+/** Requests on the real worker; the test is the main loop. */
+class Dispatch : public BackupDevice {
+ protected:
+  Dispatch() {
+    ON_CALL(cloud_.transport, backup_trans_create_handle)
+        .WillByDefault(Return(reinterpret_cast<backup_trans_handle_h>(kHandle)));
+    ON_CALL(cloud_.transport, backup_trans_init)
+        .WillByDefault([this](void *data, backup_trans_init_cb callback) {
+          callback(session_ ? BACKUP_TRANS_ERROR_NONE : BACKUP_TRANS_ERROR_NOT_INITIALIZED, data);
+          return 0;
+        });
+    static bool started = false;
+    if (!std::exchange(started, true)) start_without_session();
+  }
+  ~Dispatch() override {
+    held_ = false;
+    finish();
+    cloud_.answer_all();
+  }
+
+  void start_without_session() {
+    session_ = false;
+    init_backup_req_dispatch_thread();
+    EXPECT_EQ(count_logged(DLOG_INFO, "init_backup_req_dispatch_thread"), 1);
+    request_backup(new_client(1));
+    finish();
+    without_session.statuses = sent_statuses();
+    without_session.logged = count_logged(DLOG_ERROR, "cloud couldn't be initialized.(wifi:1)");
+    without_session.backed_up = !cloud_.requests().empty();
+    session_ = true;
+    clear_sent_statuses();
+    clear_captured_log();
+  }
+
+  /** Run the main loop until it holds. */
+  template <typename Condition>
+  void run_until(Condition condition) {
+    const auto deadline = std::chrono::steady_clock::now() + kDeadline;
+    while (!condition()) {
+      ASSERT_LT(std::chrono::steady_clock::now(), deadline);
+      g_main_context_iteration(nullptr, FALSE);
+      if (!held_) cloud_.answer_next();
+      std::this_thread::yield();
+    }
+  }
+  void finish() {
+    run_until([] { return !backup_request_outstanding(); });
+  }
+  /** A manual backup that waits for its list. */
+  void run_one(std::uint32_t request) {
+    held_ = true;
+    request_backup(new_client(request));
+    run_until([this] { return cloud_.waiting() == 1; });
+  }
+  int info(const std::string &text) const { return count_logged(DLOG_INFO, text); }
+  int error(const std::string &text) const { return count_logged(DLOG_ERROR, text); }
+
+  std::atomic<bool> session_{true};
+  bool held_ = false;
+};
+
+TEST_F(Dispatch, ManualRequestWithoutASessionFailsWith33) {
+  EXPECT_THAT(without_session.statuses, ElementsAre(SentStatus{33, 5, 1}));
+  EXPECT_EQ(without_session.logged, 1);
+  EXPECT_FALSE(without_session.backed_up);
+}
+
+TEST_F(Dispatch, ManualRequestWithoutWifiFailsWith33) {
+  fake_wifi = 0;
+  request_backup(new_client(5));
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{33, 5, 5}));
+  EXPECT_EQ(error("cloud couldn't be initialized.(wifi:0)"), 1);
+  EXPECT_THAT(cloud_.requests(), IsEmpty());
+}
+
+TEST_F(Dispatch, AutomaticRequestWithoutWifiIsDroppedSilently) {
+  fake_wifi = 0;
+  request_backup(nullptr);
+  finish();
+  EXPECT_THAT(sent_statuses(), IsEmpty());
+  EXPECT_EQ(error("cloud couldn't be initialized.(wifi:0)"), 1);
+  fake_wifi = 1;
+  request_backup(nullptr);
+  finish();
+  EXPECT_EQ(info("now auto backup start!"), 1) << "the worker still serves";
+  EXPECT_EQ(info("auto backup successful!"), 1);
+}
+
+TEST_F(Dispatch, UnknownWifiIsNone) {
+  set_backup_wifi_probe(nullptr);
+  EXPECT_EQ(backup_wifi_connected(), 0);
+}
+
+TEST_F(Dispatch, TwoManualRequestsRunOneAfterTheOther) {
+  install("org.a");
+  run_one(1);
+  request_backup(new_client(2));
+  EXPECT_EQ(info("now manual backup start!"), 1);
+  held_ = false;
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{0, 4, 1}, SentStatus{0, 4, 2}));
+  EXPECT_EQ(info("now manual backup start!"), 2);
+}
+
+TEST_F(Dispatch, RequestsAreServedInTheirOrder) {
+  run_one(1);
+  request_backup(new_client(2));
+  request_backup(nullptr);
+  request_backup(new_client(3));
+  request_backup(new_client(2));
+  held_ = false;
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{0, 4, 1}, SentStatus{0, 4, 2},
+                                           SentStatus{0, 4, 3}, SentStatus{0, 4, 2}));
+  EXPECT_EQ(info("auto backup successful!"), 1);
+}
+
+TEST_F(Dispatch, CancelStopsTheRunningBackupAndDropsTheQueuedOne) {
+  run_one(1);
+  request_backup(new_client(2));
+  manual_backup_canceled = true;
+  cancel_backup(nullptr);
+  EXPECT_EQ(info("request cancel to handler(0x1234)"), 1);
+  EXPECT_EQ(cloud_.cancels, 1);
+  EXPECT_EQ(info("reservation for manual backup is canceled"), 1);
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}, SentStatus{17, 6, 2}));
+  EXPECT_EQ(info("now manual backup start!"), 1);
+}
+
+TEST_F(Dispatch, CancelDropsEveryManualReservation) {
+  run_one(1);
+  for (std::uint32_t request = 2; request < 6; ++request) request_backup(new_client(request));
+  cancel_backup(nullptr);
+  EXPECT_EQ(info("reservation for manual backup is canceled"), 4);
+  held_ = false;
+  finish();
+  EXPECT_EQ(sent_statuses().size(), 5U);
+  EXPECT_EQ(info("now manual backup start!"), 1);
+}
+
+TEST_F(Dispatch, CancelLeavesAutomaticReservations) {
+  run_one(1);
+  request_backup(nullptr);
+  cancel_backup(nullptr);
+  EXPECT_EQ(info("reservation for manual backup is canceled"), 0);
+  held_ = false;
+  finish();
+  EXPECT_EQ(info("now auto backup start!"), 1);
+}
+
+TEST_F(Dispatch, CancelWithNothingToCancelIsHarmless) {
+  cancel_backup(nullptr);
+  EXPECT_EQ(cloud_.cancels, 1);
+  EXPECT_FALSE(backup_request_outstanding());
+  EXPECT_THAT(sent_statuses(), IsEmpty());
+}
+
+TEST_F(Dispatch, NewRequestClearsACancellation) {
+  manual_backup_canceled = true;
+  request_backup(new_client(1));
+  finish();
+  EXPECT_EQ(error("manual backup was cancelled"), 1);
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}));
+  manual_backup_canceled = false;
+  request_backup(new_client(2));
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}, SentStatus{0, 4, 2}));
+}
+
+TEST_F(Dispatch, RequestIsOutstandingFromItsQueuingToItsEnd) {
+  ::testing::InSequence in_order;
+  EXPECT_CALL(platform_, device_power_request_lock(POWER_LOCK_CPU, 0)).WillOnce([](auto, auto) {
+    EXPECT_TRUE(backup_request_outstanding());
+    EXPECT_FALSE(g_is_backing_up);
+    return 0;
+  });
+  EXPECT_CALL(platform_, device_power_release_lock(POWER_LOCK_CPU)).WillOnce([](auto) {
+    EXPECT_TRUE(backup_request_outstanding());
+    EXPECT_FALSE(g_is_backing_up);
+    return 0;
+  });
+  set_status_hook([](int, int) {
+    EXPECT_TRUE(backup_request_outstanding());
+    EXPECT_TRUE(g_is_backing_up);
+  });
+  EXPECT_FALSE(backup_request_outstanding());
+  request_backup(new_client(1));
+  EXPECT_TRUE(backup_request_outstanding());
+  finish();
+  EXPECT_FALSE(g_is_backing_up);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(Dispatch, NoRequestIsLostHoweverTheyArrive) {
+  constexpr int kThreads = 4;
+  constexpr int kRequests = 25;
+  fake_wifi = 0;  // so that each ends at once
+  std::vector<std::thread> clients;
+  for (int i = 0; i < kThreads; ++i) {
+    clients.emplace_back([] {
+      for (int request = 0; request < kRequests; ++request) {
+        request_backup(request % 2 == 0 ? new_client(1) : nullptr);
+        std::this_thread::yield();
+      }
+    });
+  }
+  for (auto &client : clients) client.join();
+  finish();
+  EXPECT_EQ(error("cloud couldn't be initialized.(wifi:0)"), kThreads * kRequests);
+  EXPECT_EQ(sent_statuses().size(), std::size_t{kThreads} * 13);
+}
+
+TEST_F(Dispatch, BackupWithRealPausesUploadsEverything) {
+  const FakePackage &a = install("org.a");
+  const FakePackage &b = install("org.b");
+  request_backup(new_client(1));
+  finish();
+  EXPECT_THAT(cloud_.paths(), ElementsAre(a.object(), b.object(), kAppListInCloud));
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{0, 4, 1}));
+}
+
+// The main thread asks for the very package whose archive the worker is uploading.
+TEST_F(Dispatch, RequestForAPackageThatIsBeingUploadedWaitsForItsArchive) {
+  const FakePackage &a = install("org.a");
+  const std::string staged = a.staged();
+  held_ = true;
+  request_backup(nullptr);
+  run_until([&] { return cloud_.waiting() == 1; });
+  cloud_.answer_next();
+  run_until([&] { return cloud_.count_requests("upload " + a.object()) == 1; });
+
+  const BackupContextPtr request(new backup_context);
+  request->single_package = true;
+  request->serial_number = kSerial;
+  request->cur_pkg_id = a.id;
+  request->cur_version = a.version;
+  request->cur_pkg_type = a.type;
+  request->cur_root_path = a.root;
+  g_timeout_add(
+      1,
+      [](gpointer cloud) -> gboolean {
+        static_cast<FakeCloud *>(cloud)->answer_next();
+        return G_SOURCE_REMOVE;
+      },
+      &cloud_);
+  EXPECT_EQ(make_app_data_zip(request.get(), "org.a"), 0);
+  EXPECT_EQ(cloud_.objects.count(a.object()), 1U) << "the first upload was through";
+  EXPECT_TRUE(exists(staged));
+  upload_app_data(request.get(), a.id.c_str(), a.root.c_str(), a.version.c_str());
+  held_ = false;
+  finish();
+  run_until([&] { return request->upload_remain == 0; });
+  EXPECT_EQ(request->result, 0);
+  EXPECT_FALSE(exists(staged));
+  EXPECT_EQ(info("auto backup successful!"), 1);
+}
+
+// The worker comes to a package that the main thread is uploading.
+TEST_F(Dispatch, RunWaitsForAPackageThatARequestIsUploading) {
+  const FakePackage &a = install("org.a");
+  const BackupContextPtr request(new backup_context);
+  request->single_package = true;
+  request->serial_number = kSerial;
+  request->cur_pkg_id = a.id;
+  request->cur_version = a.version;
+  request->cur_pkg_type = a.type;
+  request->cur_root_path = a.root;
+  EXPECT_EQ(make_app_data_zip(request.get(), "org.a"), 0);
+  upload_app_data(request.get(), a.id.c_str(), a.root.c_str(), a.version.c_str());
+  request_backup(nullptr);
+  finish();
+  EXPECT_EQ(request->result, 0);
+  EXPECT_EQ(cloud_.count_requests("upload " + a.object()), 2);
+  EXPECT_EQ(info("auto backup successful!"), 1);
+}
+
+}  // namespace

@@ -1,0 +1,200 @@
+#include <fcntl.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+
+#include "backup_device.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+
+using ::testing::_;
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+using ::testing::Return;
+using ::testing::StartsWith;
+
+namespace {
+
+const std::string kCompanionRoot = "/opt/usr/apps/com.velmor.pellix-efl";
+const std::string kCompanionDir = kCompanionRoot + "/shared/data";
+
+/** /opt of its own, where that is permitted; the real one is left as it was otherwise. */
+class PrivateOpt : public ::testing::Environment {
+ public:
+  void SetUp() override {
+    std::filesystem::create_directories("/opt");
+    if (unshare(CLONE_NEWNS) != 0) return;
+    if (mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return;
+    static_cast<void>(mount("quarn", "/opt", "tmpfs", 0, nullptr));
+  }
+};
+[[maybe_unused]] ::testing::Environment *const private_opt =
+    ::testing::AddGlobalTestEnvironment(new PrivateOpt);
+
+class Pellix : public BackupDevice {
+ protected:
+  Pellix() {
+    std::filesystem::create_directories(kCompanionDir);
+    ON_CALL(platform_, smack_setlabel)
+        .WillByDefault([this](const char *path, const char *label, smack_label_type type) {
+          EXPECT_EQ(type, SMACK_LABEL_ACCESS);
+          labels_.push_back(std::filesystem::read_symlink(path).string() + " " + label);
+          return label_result_;
+        });
+  }
+  ~Pellix() override { std::filesystem::remove_all(kCompanionRoot); }
+
+  static std::string archive(const FakePackage &package) {
+    return kCompanionDir + "/" + package.id + "_" + package.version + ".zip";
+  }
+  /** The document that is answered; the empty text when there is none. */
+  std::string answered() {
+    const CString text(get_app_list_for_pellix());
+    return text ? text.get() : "";
+  }
+  static std::vector<std::string> archives_of(const std::string &text) {
+    const AppList list(text);
+    std::vector<std::string> all;
+    json_object *paths = json_object_object_get(list.model(0), "app_data_path");
+    for (std::size_t i = 0; i < json_object_array_length(paths); ++i) {
+      all.emplace_back(json_object_get_string(json_object_array_get_idx(paths, i)));
+    }
+    return all;
+  }
+  int info(const std::string &text) const { return count_logged(DLOG_INFO, text); }
+  int error(const std::string &text) const { return count_logged(DLOG_ERROR, text); }
+
+  std::vector<std::string> labels_;
+  int label_result_ = 0;
+};
+
+TEST_F(Pellix, ListNamesAnArchiveForEveryPackage) {
+  const FakePackage &a = install("org.a");
+  const FakePackage &b = install("org.b", "2.0");
+  const std::string text = answered();
+  const AppList list(text);
+  EXPECT_EQ(info("make_pellix_app_list"), 1);
+  EXPECT_EQ(info("app list is made newly"), 1);
+  EXPECT_THAT(list.package_ids(0), ElementsAre("org.a", "org.b"));
+  EXPECT_THAT(archives_of(text), ElementsAre(archive(a), archive(b)));
+  EXPECT_TRUE(exists(archive(a)));
+  EXPECT_TRUE(exists(archive(b)));
+  EXPECT_FALSE(exists(a.staged()));
+  EXPECT_THAT(cloud_.requests(), IsEmpty());
+}
+
+TEST_F(Pellix, ArchiveIsLabelledAndOpenToTheCompanion) {
+  const FakePackage &a = install("org.a");
+  answered();
+  EXPECT_THAT(labels_, ElementsAre(archive(a) + " com.velmor.pellix-efl"));
+  struct stat status = {};
+  ASSERT_EQ(stat(archive(a).c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0777U);
+}
+
+TEST_F(Pellix, LabelThatCannotBeSetIsLoggedAndTheArchiveIsNamed) {
+  const FakePackage &a = install("org.a");
+  label_result_ = -1;
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(a)));
+  EXPECT_EQ(error("smack_setlabel failed for " + archive(a)), 1);
+}
+
+TEST_F(Pellix, TwoComponentsOfAPackageYieldOneArchive) {
+  FakePackage &a = install("org.a");
+  a.apps = {{"org.a.one"}, {"org.a.two"}};
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(a)));
+  EXPECT_EQ(labels_.size(), 1U);
+}
+
+TEST_F(Pellix, DisabledPackageYieldsNoArchive) {
+  FakePackage &a = install("org.a");
+  a.apps[0].disabled = true;
+  const std::string text = answered();
+  EXPECT_THAT(archives_of(text), IsEmpty());
+  EXPECT_FALSE(exists(archive(a)));
+  EXPECT_THAT(AppList(text).packages(0), ElementsAre("org.a 1.0.0 0"));
+}
+
+TEST_F(Pellix, ExactlyTheCapIsPackedAndOneByteMoreIsNot) {
+  const FakePackage &exact = install("org.exact", "1", "");
+  write_sparse(exact.root + "/data/big", 26214400);
+  const FakePackage &over = install("org.over", "1", "");
+  write_sparse(over.root + "/data/big", 26214401);
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(exact)));
+  EXPECT_FALSE(exists(archive(over)));
+  EXPECT_EQ(info("app backup size exceed 25MB, so will not backup data"), 1);
+}
+
+TEST_F(Pellix, PackageThatCannotBePackedIsLeftOutAndItsArchiveDeleted) {
+  const FakePackage &a = install("org.a");
+  const FakePackage &b = install("org.b");
+  // labels are asked of open files
+  ON_CALL(platform_, smack_getlabel)
+      .WillByDefault([&](const char *path, char **label, smack_label_type) {
+        std::error_code none;
+        const std::string held = std::filesystem::read_symlink(path, none).string();
+        if ((none ? std::string(path) : held).rfind(b.root, 0) == 0) return -1;
+        *label = strdup("_");
+        return 0;
+      });
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(a)));
+  EXPECT_FALSE(exists(archive(b)));
+}
+
+TEST_F(Pellix, ListFileDoesNotRemain) {
+  install("org.a");
+  EXPECT_NE(answered(), "");
+  EXPECT_FALSE(exists(kCompanionDir + "/app_list.txt"));
+}
+
+TEST_F(Pellix, FailedWalkGivesNothing) {
+  install("org.a");
+  package_walk_result_ = -5;
+  EXPECT_EQ(answered(), "");
+  EXPECT_EQ(error("package_manager_foreach_package_info() failed -5"), 1);
+}
+
+TEST_F(Pellix, MissingCompanionGivesNothingAndMakesNothing) {
+  std::filesystem::remove_all(kCompanionRoot);
+  install("org.a");
+  EXPECT_EQ(answered(), "");
+  EXPECT_FALSE(exists(kCompanionRoot));
+}
+
+TEST_F(Pellix, ListThatCannotBeWrittenGivesNothing) {
+  std::filesystem::create_directories(kCompanionDir + "/app_list.txt/in the way");
+  EXPECT_EQ(answered(), "");
+}
+
+TEST_F(Pellix, PlantedLinkIsNotWrittenThrough) {
+  write_text(path("victim"), "untouched");
+  ASSERT_EQ(symlink(path("victim").c_str(), (kCompanionDir + "/app_list.txt").c_str()), 0);
+  EXPECT_EQ(answered(), "");
+  EXPECT_EQ(read_text(path("victim")), "untouched");
+}
+
+TEST_F(Pellix, PlantedPipeDoesNotStopTheDaemon) {
+  ASSERT_EQ(mkfifo((kCompanionDir + "/app_list.txt").c_str(), 0666), 0);
+  EXPECT_EQ(answered(), "");
+}
+
+TEST_F(Pellix, CloudsListPlaysNoPart) {
+  install("org.a");
+  cloud_.objects[kAppListInCloud] = "{";
+  EXPECT_EQ(AppList(answered()).info(0, "serial_number"), "");
+}
+
+TEST_F(Pellix, ProgressOfRunsIsNotDisturbed) {
+  static int calls;
+  calls = 0;
+  set_backup_progress_sink([](const backup_progress &) { ++calls; });
+  FakePackage &a = install("org.a");
+  write_sparse(a.root + "/data/big", kMaxBackupSize + 1);
+  answered();
+  EXPECT_EQ(calls, 0);
+}
+
+}  // namespace
