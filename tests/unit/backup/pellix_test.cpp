@@ -102,6 +102,17 @@ TEST_F(Pellix, LabelThatCannotBeSetIsLoggedAndTheArchiveIsNamed) {
   EXPECT_EQ(error("smack_setlabel failed for " + archive(a)), 1);
 }
 
+TEST_F(Pellix, ModeThatCannotBeSetIsLoggedAndTheArchiveIsNamed) {
+  const FakePackage &a = install("org.a");
+  // the archive is reached by what is held open: take that away
+  ON_CALL(platform_, smack_setlabel)
+      .WillByDefault([](const char *path, const char *, smack_label_type) {
+        return close(std::stoi(std::filesystem::path(path).filename().string()));
+      });
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(a)));
+  EXPECT_EQ(error("chmod failed"), 1);
+}
+
 TEST_F(Pellix, TwoComponentsOfAPackageYieldOneArchive) {
   FakePackage &a = install("org.a");
   a.apps = {{"org.a.one"}, {"org.a.two"}};
