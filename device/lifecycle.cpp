@@ -29,6 +29,7 @@
 
 #include "device.h"
 #include "state/alarms.h"
+#include "state/power.h"
 #include "state/state_file.h"
 #include "state/watch.h"
 
@@ -39,6 +40,10 @@ namespace fs = std::filesystem;
 constexpr char kAppsPath[] = "/opt/usr/apps";
 constexpr char kTmpPath[] = "/tmp";
 constexpr char kBusName[] = "org.orvane.Quarn";
+/** Owner of the alarms that start the daemon. */
+constexpr char kAlarmOwner[] = "quarn";
+/** What the daemon makes below /tmp: it is the device's own, whatever the host has there. */
+constexpr char kDaemonTmpEntry[] = "quarn";
 constexpr char kSupervisorFile[] = "run/supervisor";
 constexpr char kMountsFile[] = "run/tmp-mounts";
 /** The supervisor keeps the host's own /tmp open under this number. */
@@ -196,8 +201,14 @@ void map_apps_path(const std::string &device) {
   std::error_code error;
   fs::create_directories(fs::path(kAppsPath).parent_path(), error);
   if (fs::is_symlink(kAppsPath, error)) {
-    if (fs::read_symlink(kAppsPath, error) == target) return;
-    if (fs::exists(kAppsPath, error)) {
+    const std::string present = fs::read_symlink(kAppsPath, error).string();
+    if (present == target) return;
+    // A link that a device left behind which was not stopped is in nobody's way.
+    const std::string below = "/root/opt/usr/apps";
+    const bool of_device = present.size() > below.size() &&
+                           present.compare(present.size() - below.size(), below.size(), below) == 0;
+    if (fs::exists(kAppsPath, error) &&
+        (!of_device || is_started(present.substr(0, present.size() - below.size())))) {
       throw Failure(std::string(kAppsPath) + " is mapped to another device: stop that one first");
     }
     fs::remove(kAppsPath, error);
@@ -342,7 +353,7 @@ void wake_daemon(Running *self) {
 
 void look_at_alarms(Running *self) {
   embedded::fire_due_alarms(self->device, embedded::now_ms());
-  if (embedded::has_fired_alarms(self->device)) wake_daemon(self);
+  if (embedded::has_fired_alarms(self->device, kAlarmOwner)) wake_daemon(self);
   itimerspec when{};
   if (const auto due = embedded::next_due(self->device)) {
     when.it_value.tv_sec = *due / kMillisInSecond;
@@ -376,7 +387,9 @@ void on_owner_changed(GDBusConnection *, const gchar *, const gchar *, const gch
   const gchar *owner = nullptr;
   g_variant_get_child(parameters, 2, "&s", &owner);
   auto *self = static_cast<Running *>(data);
-  if (*owner == '\0' && embedded::has_fired_alarms(self->device)) wake_daemon(self);
+  if (*owner == '\0' && embedded::has_fired_alarms(self->device, kAlarmOwner)) {
+    wake_daemon(self);
+  }
 }
 
 void stop_daemon(Running *self) {
@@ -454,8 +467,17 @@ void stop_daemon(Running *self) {
 /* ---- what is left ------------------------------------------------------------------------------
  */
 
-/** Processes whose environment says that they run inside the device, but for our own ancestors. */
-std::set<pid_t> processes_inside(const std::string &device) {
+/** Which mount namespace a process is in, empty when it cannot be told. */
+std::string namespace_of(const std::string &pid) {
+  std::error_code error;
+  return fs::read_symlink("/proc/" + pid + "/ns/mnt", error).string();
+}
+
+/**
+ * Processes in the device's mount namespace, or whose environment says that they run inside the
+ * device, but for our own ancestors.
+ */
+std::set<pid_t> processes_inside(const std::string &device, const std::string &space) {
   std::set<pid_t> ancestors;
   for (pid_t pid = getpid(); pid > 1;) {
     ancestors.insert(pid);
@@ -473,6 +495,10 @@ std::set<pid_t> processes_inside(const std::string &device) {
   while (const dirent *entry = readdir(proc)) {
     const pid_t pid = std::atoi(entry->d_name);
     if (pid <= 0 || ancestors.count(pid) != 0) continue;
+    if (!space.empty() && namespace_of(entry->d_name) == space) {
+      if (!birth_of(pid).empty()) found.insert(pid);
+      continue;
+    }
     std::ifstream file(std::string("/proc/") + entry->d_name + "/environ", std::ios::binary);
     std::string variable;
     while (std::getline(file, variable, '\0')) {
@@ -493,9 +519,9 @@ bool wait_for_end(pid_t pid, int seconds) {
   return poll(&ended, 1, seconds * kMillisInSecond) != 0;
 }
 
-void end_leftovers(const std::string &device) {
+void end_leftovers(const std::string &device, const std::string &space) {
   for (const int signal_number : {SIGTERM, SIGKILL}) {
-    const std::set<pid_t> left = processes_inside(device);
+    const std::set<pid_t> left = processes_inside(device, space);
     for (const pid_t pid : left) kill(pid, signal_number);
     for (const pid_t pid : left) wait_for_end(pid, signal_number == SIGTERM ? 2 : kStopSeconds);
   }
@@ -586,12 +612,15 @@ int verb_start(const Arguments &arguments) {
   }
   const StartLock lock(device);
   if (is_started(device)) return DEVICE_OK;
-  end_leftovers(device);
+  if ((device + "/").compare(0, sizeof kAppsPath, std::string(kAppsPath) + "/") == 0) {
+    throw Failure(std::string("a device cannot lie below ") + kAppsPath + ", which it covers");
+  }
+  end_leftovers(device, "");
   forget_tmp_entries(device);
   const Fd told(fork_supervisor(device));
   const std::string answer = read_all(told.fd);
   if (answer.empty() || answer[0] != kReady) {
-    end_leftovers(device);
+    end_leftovers(device, "");
     throw Failure(answer.empty() ? "the device did not start; see " + device + "/log/device.log"
                                  : answer);
   }
@@ -604,14 +633,20 @@ int verb_stop(const Arguments &arguments) {
   const std::string device = open_device(arguments[0]);
   const StartLock lock(device);
   Supervisor supervisor;
+  std::string space;
+  // Held open, the namespace's number is not given to another one meanwhile.
+  Fd held;
   if (find_supervisor(device, &supervisor)) {
+    const std::string process = std::to_string(supervisor.pid);
+    held.fd = open(("/proc/" + process + "/ns/mnt").c_str(), O_RDONLY | O_CLOEXEC);
+    if (supervisor.own_namespace && held.fd >= 0) space = namespace_of(process);
     kill(supervisor.pid, SIGTERM);
     if (!wait_for_end(supervisor.pid, kStopSeconds)) {
       kill(supervisor.pid, SIGKILL);
       wait_for_end(supervisor.pid, kStopSeconds);
     }
   }
-  end_leftovers(device);
+  end_leftovers(device, space);
   unmap_apps_path(device);
   forget_tmp_entries(device);
   unlink((device + "/" + kSupervisorFile).c_str());
@@ -630,7 +665,8 @@ int verb_exec(const Arguments &arguments) {
   if (supervisor.own_namespace) {
     const std::string process = "/proc/" + std::to_string(supervisor.pid);
     const Fd space(open((process + "/ns/mnt").c_str(), O_RDONLY | O_CLOEXEC));
-    if (space.fd < 0 || setns(space.fd, CLONE_NEWNS) != 0) {
+    // A process with threads may only move with a view of the file system of its own.
+    if (space.fd < 0 || unshare(CLONE_FS) != 0 || setns(space.fd, CLONE_NEWNS) != 0) {
       throw Failure("cannot enter the device: " + reason());
     }
     const Fd mounts_lock(
@@ -639,7 +675,13 @@ int verb_exec(const Arguments &arguments) {
     const Fd host_tmp(open((process + "/fd/" + std::to_string(kHostTmpFd)).c_str(),
                            O_PATH | O_DIRECTORY | O_CLOEXEC));
     std::set<std::string> wanted{tmp_entry(here + "/"), tmp_entry(programs)};
-    for (std::size_t i = 2; i < arguments.size(); ++i) wanted.insert(tmp_entry(arguments[i]));
+    for (std::size_t i = 2; i < arguments.size(); ++i) {
+      const std::string &argument = arguments[i];
+      const auto value = argument[0] == '-' ? argument.find('=') : std::string::npos;
+      const std::string entry =
+          tmp_entry(value == std::string::npos ? argument : argument.substr(value + 1));
+      if (entry != kDaemonTmpEntry) wanted.insert(entry);
+    }
     for (const std::string &name : wanted) show_tmp_entry(device, host_tmp.fd, name);
     if (chdir(here.c_str()) != 0 && chdir("/") != 0) {
       throw Failure("cannot change the directory: " + reason());
@@ -667,6 +709,9 @@ int verb_daemon(const Arguments &arguments) {
   for (const char *installed : {QUARN_INSTALLED_DAEMON, "/usr/sbin/quarnd"}) {
     if (access(program.c_str(), X_OK) != 0) program = installed;
   }
+  if (access(program.c_str(), X_OK) != 0) {
+    throw Failure("no quarnd beside this program nor in its place of installation");
+  }
   set_environment(arguments[0]);
   // What a service manager does for a daemon that ends with a failure status.
   for (int starts = 0; starts <= kMaxRestarts; ++starts) {
@@ -679,12 +724,15 @@ int verb_daemon(const Arguments &arguments) {
       execl(program.c_str(), "quarnd", nullptr);
       std::fprintf(stderr, "quarn-device: cannot run %s: %s\n", program.c_str(),
                    std::strerror(errno));
-      _exit(0);
+      _exit(DEVICE_OK);
     }
     int status = 0;
     while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
     }
+    embedded::drop_power_locks(arguments[0], pid);
     if (!WIFEXITED(status) || WEXITSTATUS(status) == 0) break;
   }
-  return DEVICE_OK;
+  // The bus hears of this only while it waits for the daemon's name: a daemon that ended without
+  // taking it (nobody signed in, say) must not keep its callers waiting.
+  return DEVICE_FAILED;
 }

@@ -103,6 +103,8 @@ std::string open_device(const std::string &dir) {
 }
 
 int main(int argc, char **argv) {
+  // What a device keeps is read by the processes of its applications' user as well.
+  umask(022);
   const Arguments words(argv + 1, argv + argc);
   if (words.empty()) {
     print_usage(stderr);

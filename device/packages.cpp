@@ -82,7 +82,13 @@ void make_folder(const fs::path &path, const std::string &label) {
   constexpr mode_t kFolderMode = 0755;
   if (mkdir(path.c_str(), kFolderMode) == 0) {
     dress(path, kFolderMode, false, label);
-  } else if (errno != EEXIST) {
+  } else if (errno == EEXIST) {
+    // The folder above is the application's: what it has put there may be a link to anywhere.
+    struct stat present {};
+    if (lstat(path.c_str(), &present) != 0 || !S_ISDIR(present.st_mode)) {
+      throw Failure(path.string() + " is no directory");
+    }
+  } else {
     throw Failure("cannot make " + path.string() + ": " + reason());
   }
 }

@@ -2,6 +2,7 @@
 
 #include <glib.h>
 
+#include <limits>
 #include <memory>
 #include <string>
 
@@ -12,6 +13,8 @@
 namespace {
 
 constexpr std::int64_t kMillisInSecond = 1000;
+/** The longest span that is accepted, so that its end is still a time. */
+constexpr time_t kMaxSeconds = std::numeric_limits<int>::max();
 
 struct Owner {
   std::string name;
@@ -28,7 +31,7 @@ Owner &owner() {
 
 void deliver() {
   const std::string device = embedded::current_device();
-  if (owner().handler == nullptr || !embedded::has_fired_alarms(device)) return;
+  if (owner().handler == nullptr || !embedded::has_fired_alarms(device, owner().name)) return;
   for (const int id : embedded::take_fired_alarms(device, owner().name)) {
     if (owner().handler != nullptr) owner().handler(id, owner().user_data);
   }
@@ -73,8 +76,9 @@ int alarmmgr_set_cb(alarm_cb_t handler, void *user_param) {
 int alarmmgr_add_alarm(int alarm_type, time_t trigger_at_time, time_t interval,
                        const char *destination, alarm_id_t *alarm_id) {
   if (owner().name.empty()) return ERR_ALARM_NOT_INITIALIZED;
-  if (alarm_type != ALARM_TYPE_DEFAULT || trigger_at_time < 0 || interval < 0 ||
-      destination == nullptr || alarm_id == nullptr) {
+  if (alarm_type != ALARM_TYPE_DEFAULT || trigger_at_time < 0 || trigger_at_time > kMaxSeconds ||
+      interval < 0 || interval > kMaxSeconds || destination == nullptr || *destination == '\0' ||
+      alarm_id == nullptr) {
     return ERR_ALARM_INVALID_PARAM;
   }
   embedded::Alarm alarm;

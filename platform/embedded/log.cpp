@@ -6,11 +6,13 @@
 #include <sys/uio.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <mutex>
 #include <string>
 
 #include "state/state_file.h"
@@ -76,15 +78,34 @@ std::string stamp() {
   return text;
 }
 
-/** The device's log file, opened at the first message; -1 outside a device. */
-int log_file() {
-  static const int fd = [] {
+/** The log file of the device, opened at the first message to it. */
+class LogFile {
+ public:
+  void append(const std::string &line) {
     const std::string device = embedded::current_device();
-    if (device.empty()) return -1;
-    return open((device + "/log/quarnd.log").c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC,
-                kLogMode);
-  }();
-  return fd;
+    const std::lock_guard<std::mutex> lock(mutex_);
+    if (device != device_) {
+      if (fd_ >= 0) close(fd_);
+      fd_ = -1;
+      device_ = device;
+    }
+    if (fd_ < 0 && !device.empty()) {
+      fd_ = open((device + "/log/quarnd.log").c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC,
+                 kLogMode);
+    }
+    if (fd_ >= 0) static_cast<void>(!write(fd_, line.data(), line.size()));
+  }
+
+ private:
+  std::mutex mutex_;
+  std::string device_;
+  int fd_ = -1;
+};
+
+// Never destroyed: threads may log until the process is gone.
+LogFile &log_file() {
+  static auto *file = new LogFile;
+  return *file;
 }
 
 /** Under systemd standard error is the journal's stream, named by device and inode. */
@@ -144,6 +165,8 @@ bool send_to_journal(log_priority level, const char *tag, const std::string &tex
 }  // namespace
 
 extern "C" int dlog_print(log_id_t, log_priority prio, const char *tag, const char *fmt, ...) {
+  if (tag == nullptr || fmt == nullptr) return -EINVAL;
+  const int saved_errno = errno;
   va_list args;
   va_start(args, fmt);
   char *text = nullptr;
@@ -152,7 +175,10 @@ extern "C" int dlog_print(log_id_t, log_priority prio, const char *tag, const ch
   if (length < 0) return length;
   const std::string message = one_line(text);
   std::free(text);
-  if (stderr_is_journal() && send_to_journal(prio, tag, message)) return length;
+  if (stderr_is_journal() && send_to_journal(prio, tag, message)) {
+    errno = saved_errno;
+    return length;
+  }
 
   std::string line = stamp();
   line += ' ';
@@ -161,7 +187,8 @@ extern "C" int dlog_print(log_id_t, log_priority prio, const char *tag, const ch
   line += tag;
   line += '(' + std::to_string(getpid()) + "): " + message + '\n';
   // One write a line: lines of several threads or processes never mix.
-  ssize_t written = write(STDERR_FILENO, line.data(), line.size());
-  if (log_file() >= 0) written = write(log_file(), line.data(), line.size());
+  const ssize_t written = write(STDERR_FILENO, line.data(), line.size());
+  log_file().append(line);
+  errno = saved_errno;
   return static_cast<int>(written);
 }

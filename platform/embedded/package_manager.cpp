@@ -69,7 +69,9 @@ void deliver(package_manager_h manager) {
     const package_manager_event_state_e state = state_of(event.state);
     manager->callback(event.type.c_str(), event.package.c_str(), type_of(event.action), state,
                       state == PACKAGE_MANAGER_EVENT_STATE_STARTED ? kNoProgress : kDone,
-                      PACKAGE_MANAGER_ERROR_NONE, manager->user_data);
+                      state == PACKAGE_MANAGER_EVENT_STATE_FAILED ? PACKAGE_MANAGER_ERROR_IO_ERROR
+                                                                  : PACKAGE_MANAGER_ERROR_NONE,
+                      manager->user_data);
     if (!is_subscribed(manager)) return;
   }
 }

@@ -2,14 +2,20 @@
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdarg>
+#include <memory>
 #include <string>
 #include <vector>
 
+#include "fault.h"
 #include "state/labels.h"
+#include "state/packages.h"
 
 struct security_server_transaction {
   struct Relabel {
@@ -33,11 +39,13 @@ std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
  * Objects are held while they are labelled, so a link swapped in leads nowhere.
  */
 bool relabel_tree(int fd, const std::string &label) {
-  if (embedded::write_label(name_of(fd).c_str(), Links::kFollow, LabelKind::kAccess, label) != 0) {
-    return false;
-  }
   struct stat status {};
   if (fstat(fd, &status) != 0) return false;
+  const bool folder_or_file = S_ISDIR(status.st_mode) || S_ISREG(status.st_mode);
+  if (embedded::write_label(name_of(fd).c_str(), Links::kFollow, LabelKind::kAccess, label) != 0) {
+    // Where labels are user attributes, links and special files cannot have one.
+    return !folder_or_file && errno == EPERM;
+  }
   if (!S_ISDIR(status.st_mode)) return true;
   const int folder = openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   DIR *dir = folder < 0 ? nullptr : fdopendir(folder);
@@ -50,7 +58,10 @@ bool relabel_tree(int fd, const std::string &label) {
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
     const int child = openat(dirfd(dir), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC);
-    if (child < 0) continue;  // it vanished meanwhile
+    if (child < 0) {
+      done = errno == ENOENT && done;  // it vanished meanwhile
+      continue;
+    }
     done = relabel_tree(child, label) && done;
     close(child);
   }
@@ -58,10 +69,33 @@ bool relabel_tree(int fd, const std::string &label) {
   return done;
 }
 
+int open_without_links(int base, const char *path) {
+  open_how how{};
+  how.flags = O_PATH | O_DIRECTORY | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  return static_cast<int>(syscall(SYS_openat2, base, path, &how, sizeof how));
+}
+
+bool starts_with(const std::string &text, const std::string &start) {
+  return text.compare(0, start.size(), start) == 0;
+}
+
+/** The directory to relabel: no link that an application could have made is followed. */
+int open_folder(const std::string &path) {
+  // A descriptor's name leads to what the caller holds, and has checked.
+  if (starts_with(path, kProc)) return open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+  const std::string apps = embedded::package_root("");
+  if (!starts_with(path, apps)) return open_without_links(AT_FDCWD, path.c_str());
+  // The applications' own folder may be a link of the device's.
+  const int base = open(apps.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+  if (base < 0) return -1;
+  const int fd = open_without_links(base, path.c_str() + apps.size());
+  close(base);
+  return fd;
+}
+
 bool relabel(const std::string &path, const std::string &label) {
-  // A descriptor's name leads to what the caller holds; any other link is not followed.
-  const int follow = path.compare(0, sizeof(kProc) - 1, kProc) == 0 ? 0 : O_NOFOLLOW;
-  const int fd = open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC | follow);
+  const int fd = open_folder(path);
   if (fd < 0) return false;
   const bool done = relabel_tree(fd, label);
   close(fd);
@@ -71,6 +105,7 @@ bool relabel(const std::string &path, const std::string &label) {
 }  // namespace
 
 int security_server_label_access(const char *path, const char *label) {
+  RETURN_FAULT();
   if (path == nullptr || label == nullptr) return SECURITY_SERVER_ERROR_INPUT_PARAM;
   return embedded::write_label(path, Links::kFollow, LabelKind::kAccess, label) == 0
              ? SECURITY_SERVER_SUCCESS
@@ -78,6 +113,7 @@ int security_server_label_access(const char *path, const char *label) {
 }
 
 int security_server_perm_begin(security_server_perm_h *handle) {
+  RETURN_FAULT();
   if (handle == nullptr) return SECURITY_SERVER_ERROR_INPUT_PARAM;
   *handle = new security_server_transaction;
   return SECURITY_SERVER_SUCCESS;
@@ -85,6 +121,7 @@ int security_server_perm_begin(security_server_perm_h *handle) {
 
 int security_server_perm_app_setup_path(security_server_perm_h handle, const char *pkg_id,
                                         const char *path, int path_type, ...) {
+  RETURN_FAULT();
   if (handle == nullptr || pkg_id == nullptr || path == nullptr ||
       path_type != SECURITY_SERVER_PATH_ANY_LABEL) {
     return SECURITY_SERVER_ERROR_INPUT_PARAM;
@@ -100,9 +137,10 @@ int security_server_perm_app_setup_path(security_server_perm_h handle, const cha
 
 int security_server_perm_commit(security_server_perm_h handle) {
   if (handle == nullptr) return SECURITY_SERVER_ERROR_INPUT_PARAM;
+  const std::unique_ptr<security_server_transaction> transaction(handle);
+  RETURN_FAULT();
   bool done = true;
-  for (const auto &one : handle->relabels) done = relabel(one.path, one.label) && done;
-  delete handle;
+  for (const auto &one : transaction->relabels) done = relabel(one.path, one.label) && done;
   return done ? SECURITY_SERVER_SUCCESS : SECURITY_SERVER_ERROR_SERVER;
 }
 

@@ -24,6 +24,15 @@ struct Watcher {
   std::int64_t writes;
 };
 
+bool read_text(const char *key, std::string *text) {
+  return key != nullptr && embedded::get_value(embedded::current_device(), key, text);
+}
+
+int write_text(const char *key, const std::string &text) {
+  return key != nullptr && embedded::set_value(embedded::current_device(), key, text) ? VCONF_OK
+                                                                                      : VCONF_ERROR;
+}
+
 std::list<Watcher> &watchers() {
   static auto *all = new std::list<Watcher>;
   return *all;
@@ -44,7 +53,7 @@ void on_change() {
 
 int vconf_get_int(const char *key, int *value) {
   std::string text;
-  if (!embedded::get_value(embedded::current_device(), key, &text)) return VCONF_ERROR;
+  if (value == nullptr || !read_text(key, &text)) return VCONF_ERROR;
   char *end = nullptr;
   errno = 0;
   const long number = std::strtol(text.c_str(), &end, 10);
@@ -55,14 +64,11 @@ int vconf_get_int(const char *key, int *value) {
   return VCONF_OK;
 }
 
-int vconf_set_int(const char *key, int value) {
-  return embedded::set_value(embedded::current_device(), key, std::to_string(value)) ? VCONF_OK
-                                                                                     : VCONF_ERROR;
-}
+int vconf_set_int(const char *key, int value) { return write_text(key, std::to_string(value)); }
 
 int vconf_get_dbl(const char *key, double *value) {
   std::string text;
-  if (!embedded::get_value(embedded::current_device(), key, &text)) return VCONF_ERROR;
+  if (value == nullptr || !read_text(key, &text)) return VCONF_ERROR;
   gchar *end = nullptr;
   const double number = g_ascii_strtod(text.c_str(), &end);
   if (text.empty() || *end != '\0' || !std::isfinite(number)) return VCONF_ERROR;
@@ -71,13 +77,14 @@ int vconf_get_dbl(const char *key, double *value) {
 }
 
 int vconf_set_dbl(const char *key, double value) {
+  if (!std::isfinite(value)) return VCONF_ERROR;
   char text[G_ASCII_DTOSTR_BUF_SIZE];
-  g_ascii_dtostr(text, sizeof text, value);
-  return embedded::set_value(embedded::current_device(), key, text) ? VCONF_OK : VCONF_ERROR;
+  return write_text(key, g_ascii_dtostr(text, sizeof text, value));
 }
 
 int vconf_notify_key_changed(const char *key, vconf_callback_fn callback, void *user_data) {
   const std::string device = embedded::current_device();
+  if (key == nullptr || callback == nullptr || !embedded::is_value_key(key)) return VCONF_ERROR;
   static auto *watch = new std::unique_ptr<embedded::StateWatch>;
   if (!*watch)
     *watch = std::make_unique<embedded::StateWatch>(device, embedded::kValuesFile, on_change);

@@ -4,6 +4,7 @@
 #include <cstring>
 #include <string>
 
+#include "fault.h"
 #include "state/labels.h"
 
 namespace {
@@ -24,6 +25,10 @@ LabelKind kind_of(smack_label_type type) {
 }
 
 int get(const char *path, char **label, smack_label_type type, Links links) {
+  if (path == nullptr || label == nullptr) {
+    errno = EINVAL;
+    return -1;
+  }
   std::string text;
   if (embedded::read_label(path, links, kind_of(type), &text) != 0) return -1;
   *label = strdup(text.c_str());
@@ -31,7 +36,7 @@ int get(const char *path, char **label, smack_label_type type, Links links) {
 }
 
 int set(const char *path, const char *label, smack_label_type type, Links links) {
-  if (label == nullptr) {
+  if (path == nullptr || label == nullptr) {
     errno = EINVAL;
     return -1;
   }
@@ -41,17 +46,21 @@ int set(const char *path, const char *label, smack_label_type type, Links links)
 }  // namespace
 
 int smack_getlabel(const char *path, char **label, smack_label_type type) {
+  RETURN_FAULT();
   return get(path, label, type, Links::kFollow);
 }
 
 int smack_lgetlabel(const char *path, char **label, smack_label_type type) {
+  RETURN_FAULT();
   return get(path, label, type, Links::kKeep);
 }
 
 int smack_setlabel(const char *path, const char *label, smack_label_type type) {
+  RETURN_FAULT();
   return set(path, label, type, Links::kFollow);
 }
 
 int smack_lsetlabel(const char *path, const char *label, smack_label_type type) {
+  RETURN_FAULT();
   return set(path, label, type, Links::kKeep);
 }

@@ -143,9 +143,13 @@ std::optional<std::int64_t> next_due(const std::string &device) {
   return alarms.front().due_ms;
 }
 
-bool has_fired_alarms(const std::string &device) {
+bool has_fired_alarms(const std::string &device, const std::string &owner) {
   const KeyFilePtr file = read_state(device, kAlarmsFile);
-  return file != nullptr && !numbered_groups(file.get(), kFiredPrefix).empty();
+  if (file == nullptr) return false;
+  const auto fired = numbered_groups(file.get(), kFiredPrefix);
+  return std::any_of(fired.begin(), fired.end(), [&](const auto &one) {
+    return text_of(file.get(), one.second.c_str(), kOwner) == owner;
+  });
 }
 
 std::vector<int> take_fired_alarms(const std::string &device, const std::string &owner) {

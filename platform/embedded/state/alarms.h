@@ -42,8 +42,8 @@ int fire_due_alarms(const std::string &device, std::int64_t now_ms);
 /** When the next alarm falls due; none without an alarm. */
 std::optional<std::int64_t> next_due(const std::string &device);
 
-/** True while firings wait to be taken. */
-bool has_fired_alarms(const std::string &device);
+/** True while firings wait to be taken by @p owner. */
+bool has_fired_alarms(const std::string &device, const std::string &owner);
 
 /** Take the firings of @p owner off the queue, first ones first. */
 std::vector<int> take_fired_alarms(const std::string &device, const std::string &owner);

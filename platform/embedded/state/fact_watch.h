@@ -14,7 +14,7 @@
 
 namespace embedded {
 
-/** Follows one fact of the current device from construction to destruction. */
+/** Follows one fact of the current device from construction to destruction, also by a callback. */
 class FactWatch {
  public:
   /** @param changed called with the new value after each change, also one taken back at once */
@@ -35,7 +35,9 @@ class FactWatch {
     const Fact fact = read();
     if (fact.changes == seen_) return;
     seen_ = fact.changes;
-    changed_(fact.value);
+    // Called as a copy: it may end this very watch.
+    const auto changed = changed_;
+    changed(fact.value);
   }
 
   const char *key_;

@@ -29,9 +29,12 @@ void StateWatch::on_event(GFileMonitor *, GFile *, GFile *, GFileMonitorEvent ev
   switch (event) {
     case G_FILE_MONITOR_EVENT_CREATED:
     case G_FILE_MONITOR_EVENT_MOVED_IN:
-    case G_FILE_MONITOR_EVENT_RENAMED:
-      static_cast<StateWatch *>(self)->changed_();
+    case G_FILE_MONITOR_EVENT_RENAMED: {
+      // Called as a copy: it may end this very watch.
+      const auto changed = static_cast<StateWatch *>(self)->changed_;
+      changed();
       break;
+    }
     default:
       break;
   }
