@@ -1,3 +1,5 @@
+#include "quarn_d_main.h"
+
 #include <unistd.h>
 
 #include <csignal>
@@ -15,46 +17,38 @@
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
 
+#if defined(__SANITIZE_ADDRESS__)
+#include <sanitizer/lsan_interface.h>
+#endif
+
+std::int32_t quarn_started = 0;
+std::uint32_t quarn_dbus_owner_id = 0;
+
 namespace {
 
-/** A signal ends the process within a second, also one whose main thread waits for a client. */
-constexpr int kSignalGraceMs = 900;
-constexpr int kSignals[] = {SIGINT, SIGHUP, SIGTERM, SIGQUIT};
+/** Milliseconds from a signal to the end of a process whose main thread is blocked. */
+constexpr int kSignalGrace = 900;
 
-bool quarn_started = false;
-unsigned int quarn_dbus_owner_id = 0;
-
-void deinit_quarn() {
-  if (!quarn_started) return;
-  quarn_started = false;
-  deinit_backup_resource();
-  LOGI("quarnd_dbus_deinit ~");
-  quarnd_status_unexport();
-  quarnd_dbus_deinit(quarn_dbus_owner_id);
-  LOGI("ecore_shutdown ~");
-  quarn_loop_shutdown();
-}
+bool signals_watched = false;
 
 void log_signal(int signo) { LOGI("SIGNAL %d received", signo); }
 
 void end_by_signal(int) {
-  quarn_exit_code = 0;
   deinit_quarn();
+  quarn_exit_code = 0;
   quit_nested_loops();
   quarn_loop_quit();
 }
 
-/** Runs in signal context: the signal wakes the loop, which does the rest. */
-void signal_handler(int signo) { quarn_loop_wake_from_signal(signo); }
-
 void install_signal_handlers() {
-  for (const int signo : kSignals) signal(signo, signal_handler);
+  if (!signals_watched) return;
+  for (const int signo : {SIGINT, SIGHUP, SIGTERM, SIGQUIT}) signal(signo, signal_handler);
 }
 
 int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
 
-/** The upward calls of the lower floors. */
-void wire_units() {
+/** Lower floors learn how to ask the upper ones. */
+void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(backup_request_outstanding);
   set_restore_disable(disable_restore);
@@ -62,17 +56,20 @@ void wire_units() {
   quarnd_progress_init();
 }
 
+}  // namespace
+
+void signal_handler(int signo) { quarn_loop_wake_from_signal(signo); }
+
 void init_quarn() {
-  if (quarn_started) {
+  if (quarn_started != 0) {
     LOGI("Started already");
     return;
   }
-  wire_units();
+  wire_floors();
   quarn_loop_init();
-  // Ecore has put handlers of its own in place of ours.
-  install_signal_handlers();
+  install_signal_handlers();  // Ecore has installed its own
   quarn_dbus_owner_id = quarnd_dbus_init();
-  quarn_started = true;
+  quarn_started = 1;
   init_backup_resource();
   start_wifi_monitor();
 #ifdef QUARN_LIVE_SETTING
@@ -80,15 +77,24 @@ void init_quarn() {
 #endif
 }
 
-}  // namespace
+void deinit_quarn() {
+  if (quarn_started == 0) return;
+  deinit_backup_resource();
+  LOGI("quarnd_dbus_deinit ~");
+  quarnd_status_unexport();
+  quarnd_dbus_deinit(quarn_dbus_owner_id);
+  LOGI("ecore_shutdown ~");
+  quarn_loop_shutdown();
+  quarn_started = 0;
+}
 
-int main() {
+int quarn_run() {
   LOGI("Quarn Daemon start");
   if (!server_util_is_account_exist()) {
     LOGI("no signed-in. Daemon stop");
     return 0;
   }
-  quarn_loop_watch_signals(log_signal, end_by_signal, kSignalGraceMs);
+  signals_watched = quarn_loop_watch_signals(log_signal, end_by_signal, kSignalGrace);
   install_signal_handlers();
   init_quarn();
   init_backup_req_dispatch_thread();
@@ -96,7 +102,15 @@ int main() {
   quarn_loop_begin();
   deinit_quarn();
   LOGI("Good-Bye from Quarn");
-  // The worker has no end of its own: nothing may be destroyed under it.
+  return quarn_exit_code;
+}
+
+int main() {
+  const int status = quarn_run();
   std::fflush(nullptr);
-  _exit(quarn_exit_code);
+#if defined(__SANITIZE_ADDRESS__)
+  __lsan_do_leak_check();
+#endif
+  // Destructors of globals would pull them from under the backup worker.
+  _exit(status);
 }

@@ -1,0 +1,450 @@
+#include "quarn_dbus_server.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <fstream>
+#include <sstream>
+
+#include "log_capture.h"
+#include "private_bus.h"
+#include "quarn_common.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_lifecycle.h"
+#include "quarn_dbus_client.h"
+
+namespace {
+
+using Texts = std::vector<std::string>;
+
+/** What the dispatcher did, in order. */
+Texts steps;
+/** What handlers return. */
+int result = 0;
+/** Handlers are given this much to do before they return. */
+std::function<void()> inside_handler;
+
+int note(const std::string &step) {
+  steps.push_back(step);
+  if (inside_handler) inside_handler();
+  return result;
+}
+
+/** The record's content; the handler owns and, here, deletes it. */
+std::string take(void *record) {
+  const std::unique_ptr<client_cb_data> data(static_cast<client_cb_data *>(record));
+  return data->sender + "#" + std::to_string(data->req_id);
+}
+
+std::string number(long long value) { return std::to_string(value); }
+
+/* Failures of GDBus, told by the tests. */
+bool fail_parse = false;
+bool fail_own = false;
+
+}  // namespace
+
+extern "C" {
+GDBusNodeInfo *__real_g_dbus_node_info_new_for_xml(const gchar *xml, GError **error);
+GDBusNodeInfo *__wrap_g_dbus_node_info_new_for_xml(const gchar *xml, GError **error) {
+  return __real_g_dbus_node_info_new_for_xml(fail_parse ? "<node" : xml, error);
+}
+guint __real_g_bus_own_name(GBusType type, const gchar *name, GBusNameOwnerFlags flags,
+                            GBusAcquiredCallback bus, GBusNameAcquiredCallback acquired,
+                            GBusNameLostCallback lost, gpointer data, GDestroyNotify free);
+guint __wrap_g_bus_own_name(GBusType type, const gchar *name, GBusNameOwnerFlags flags,
+                            GBusAcquiredCallback bus, GBusNameAcquiredCallback acquired,
+                            GBusNameLostCallback lost, gpointer data, GDestroyNotify free) {
+  if (fail_own) return 0;
+  EXPECT_EQ(type, G_BUS_TYPE_SYSTEM);
+  EXPECT_EQ(flags, G_BUS_NAME_OWNER_FLAGS_REPLACE);
+  return __real_g_bus_own_name(type, name, flags, bus, acquired, lost, data, free);
+}
+}
+
+void init_last_backup_time() { note("init_last_backup_time"); }
+void request_quarn_terminate(double delay, bool restart) {
+  note("terminate " + number(static_cast<int>(delay)) + (restart ? " restart" : ""));
+}
+void cancel_quarn_terminate() { steps.emplace_back("cancel"); }
+int quarnd_backup_enable(int on) { return note("backup_enable " + number(on)); }
+int quarnd_get_last_backed_up_time(unsigned long long *timestamp) {
+  *timestamp = 0x8000000000000001ULL;
+  return note("last_bu_time");
+}
+int quarnd_get_app_list(int client, void *record) {
+  return note("get_app_list " + number(client) + " " + take(record));
+}
+int quarnd_manual_backup(void *record) { return note("manual_backup " + take(record)); }
+int quarnd_manual_backup_cancel(void *record) {
+  return note("manual_backup_cancel " + take(record));
+}
+int quarnd_backup_app_data(const char *pkg_id, void *record) {
+  const int value = note(std::string("backup_app_data ") + take(record));
+  // The text must have outlived whatever happened meanwhile.
+  steps.push_back(pkg_id);
+  return value;
+}
+int quarnd_restore_app_data(const char *pkg_id, void *record) {
+  return note(std::string("restore_app_data ") + pkg_id + " " + take(record));
+}
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
+  return note(std::string("make_app_data ") + pkg_id + " " + number(client_uid));
+}
+int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
+                          void *record) {
+  return note("restore_enable " + number(on) + " " + number(client) + " " + serial_num + " " +
+              pkg_list + " " + take(record));
+}
+
+namespace {
+
+bool acquired() { return count_logged(DLOG_INFO, "Acquired the name org.orvane.Quarn") > 0; }
+
+class Server : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    private_bus_address();
+    clear_captured_log();
+    owner_id_ = quarnd_dbus_init();
+    ASSERT_TRUE(run_until(acquired));
+    client_ = std::make_unique<ScriptedClient>();
+    steps.clear();
+    result = 0;
+    inside_handler = nullptr;
+  }
+  void TearDown() override {
+    client_.reset();
+    quarnd_dbus_deinit(owner_id_);
+    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+    }
+  }
+  /** Steps of a call after the cancelled timer. */
+  static Texts after_cancel() {
+    EXPECT_FALSE(steps.empty());
+    if (steps.empty()) return {};
+    EXPECT_EQ(steps.front(), "cancel");
+    return {steps.begin() + 1, steps.end()};
+  }
+  /** "SENDER#ID" as make_record() should have filled it. */
+  std::string id(unsigned int req_id) const { return client_->name() + "#" + number(req_id); }
+
+  unsigned int owner_id_ = 0;
+  std::unique_ptr<ScriptedClient> client_;
+};
+
+TEST_F(Server, StartLogsItsSteps) {
+  bool called = false;
+  for (const LogLine &line : captured_log()) {
+    called = called || (line.buffer == LOG_ID_SYSTEM && line.text == ">>>>>>>> called");
+  }
+  EXPECT_TRUE(called);
+  EXPECT_EQ(count_logged(DLOG_INFO, "g_dbus_connection_register_object() succeed"), 1);
+}
+
+TEST_F(Server, SetActivationOneRepliesZeroAndDoesNotTerminate) {
+  EXPECT_EQ(client_->call("set_activation", "(1,)").reply, "(0,)");
+  EXPECT_EQ(steps, Texts{"cancel"});
+  EXPECT_EQ(count_logged(DLOG_INFO, "quarn activated successfully!"), 1);
+}
+
+TEST_F(Server, SetActivationZeroForgetsTheLastBackupThenTerminates) {
+  EXPECT_EQ(client_->call("set_activation", "(0,)").reply, "(0,)");
+  EXPECT_EQ(after_cancel(), (Texts{"init_last_backup_time", "terminate 0"}));
+  EXPECT_EQ(count_logged(DLOG_INFO, "try to terminate quarn"), 1);
+}
+
+TEST_F(Server, BackupEnableAnswersTheHandlersResult) {
+  result = 5;
+  EXPECT_EQ(client_->call("backup_enable", "(-3,)").reply, "(5,)");
+  EXPECT_EQ(after_cancel(), Texts{"backup_enable -3"});
+}
+
+TEST_F(Server, RestoreEnablePassesAllArgumentsAndARecord) {
+  result = 36;
+  EXPECT_EQ(client_->call("restore_enable", "(1, 0, '35', '[\"a\"]', uint32 4294967295)").reply,
+            "(36,)");
+  EXPECT_EQ(after_cancel(), Texts{"restore_enable 1 0 35 [\"a\"] " + id(4294967295u)});
+}
+
+TEST_F(Server, LastBackupTimeIsASixtyFourBitUnsignedValue) {
+  const CallOutcome outcome = client_->call("last_bu_time", "()");
+  EXPECT_EQ(outcome.reply, "(9223372036854775809,)");
+  EXPECT_EQ(after_cancel(), Texts{"last_bu_time"});
+}
+
+TEST_F(Server, GetAppListPassesTheClientKind) {
+  result = 1;
+  EXPECT_EQ(client_->call("get_app_list", "(-1, uint32 9)").reply, "(1,)");
+  EXPECT_EQ(after_cancel(), Texts{"get_app_list -1 " + id(9)});
+}
+
+TEST_F(Server, AutoBackupStartIsAnsweredEmptyAndStartsNothing) {
+  EXPECT_EQ(client_->call("auto_backup_start", "('now',)").reply, "()");
+  EXPECT_EQ(steps, Texts{"cancel"});
+}
+
+TEST_F(Server, ManualBackupStartPassesARecord) {
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 11,)").reply, "(0,)");
+  EXPECT_EQ(after_cancel(), Texts{"manual_backup " + id(11)});
+}
+
+TEST_F(Server, ManualBackupCancelPassesARecord) {
+  EXPECT_EQ(client_->call("manual_backup_cancel", "(uint32 12,)").reply, "(0,)");
+  EXPECT_EQ(after_cancel(), Texts{"manual_backup_cancel " + id(12)});
+}
+
+TEST_F(Server, AppDataBackupStartPassesPackageAndRecord) {
+  result = 1;
+  EXPECT_EQ(client_->call("app_data_backup_start", "('org.example.notes', uint32 13)").reply,
+            "(1,)");
+  EXPECT_EQ(after_cancel(), (Texts{"backup_app_data " + id(13), "org.example.notes"}));
+}
+
+TEST_F(Server, AppDataRestoreStartPassesPackageAndRecord) {
+  EXPECT_EQ(client_->call("app_data_restore_start", "('org.example.notes', uint32 14)").reply,
+            "(0,)");
+  EXPECT_EQ(after_cancel(), Texts{"restore_app_data org.example.notes " + id(14)});
+}
+
+TEST_F(Server, MakeAppDataIsToldTheCallersUser) {
+  result = 36;
+  EXPECT_EQ(client_->call("make_app_data", "('org.example.notes',)").reply, "(36,)");
+  EXPECT_EQ(after_cancel(), Texts{"make_app_data org.example.notes " + number(getuid())});
+}
+
+TEST_F(Server, CallsAreServedWhileAHandlerWaitsInANestedLoop) {
+  bool first = true;
+  const auto second = std::make_shared<CallOutcome>();
+  inside_handler = [&] {
+    if (!first) return;
+    first = false;
+    client_->start_call("set_activation", "(1,)", second);
+    EXPECT_TRUE(run_until([&] { return second->finished; }));
+  };
+  EXPECT_EQ(client_->call("app_data_backup_start", "('org.example.notes', uint32 1)").reply,
+            "(0,)");
+  EXPECT_EQ(second->reply, "(0,)");
+  EXPECT_EQ(steps, (Texts{"cancel", "backup_app_data " + id(1), "cancel", "org.example.notes"}));
+}
+
+TEST_F(Server, UnknownMethodIsAnErrorAndCancelsTheTerminateTimer) {
+  const CallOutcome outcome = client_->call("fly", "('high', 3)");
+  EXPECT_EQ(outcome.reply, "");
+  EXPECT_EQ(outcome.error_name, "org.freedesktop.DBus.Error.UnknownMethod");
+  EXPECT_EQ(outcome.error_text, "Method fly is not implemented on interface org.orvane.Quarn");
+  EXPECT_EQ(steps, Texts{"cancel"});
+}
+
+TEST_F(Server, UnknownMethodWithoutArgumentsIsTheSameError) {
+  EXPECT_EQ(client_->call("fly", "()").error_text,
+            "Method fly is not implemented on interface org.orvane.Quarn");
+}
+
+TEST_F(Server, MissingArgumentsAreAnsweredMinusOneWithoutAHandler) {
+  for (const char *method : {"set_activation", "backup_enable", "restore_enable", "get_app_list",
+                             "manual_backup_start", "manual_backup_cancel", "app_data_backup_start",
+                             "app_data_restore_start", "make_app_data"}) {
+    steps.clear();
+    EXPECT_EQ(client_->call(method, "()").reply, "(-1,)") << method;
+    EXPECT_EQ(steps, Texts{"cancel"}) << method;
+  }
+}
+
+TEST_F(Server, AutoBackupStartWithoutItsArgumentIsAnsweredEmptyToo) {
+  EXPECT_EQ(client_->call("auto_backup_start", "()").reply, "()");
+  EXPECT_EQ(steps, Texts{"cancel"});
+}
+
+TEST_F(Server, OtherArgumentsThanThoseOfTheInterfaceAreRefusedAndCancelTheTimer) {
+  for (const char *arguments : {"('one',)", "(1, 2)"}) {
+    steps.clear();
+    const CallOutcome outcome = client_->call("set_activation", arguments);
+    EXPECT_EQ(outcome.error_name, "org.freedesktop.DBus.Error.InvalidArgs") << arguments;
+    EXPECT_TRUE(run_until([] { return !steps.empty(); }));
+    EXPECT_EQ(steps, Texts{"cancel"});
+  }
+}
+
+TEST_F(Server, CallThatWantsNoReplyGetsNone) {
+  GDBusMessage *message =
+      g_dbus_message_new_method_call("org.orvane.Quarn", kQuarnObjectPath, kQuarnInterface, "fly");
+  g_dbus_message_set_flags(message, G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED);
+  g_dbus_connection_send_message(client_->connection(), message, G_DBUS_SEND_MESSAGE_FLAGS_NONE,
+                                 nullptr, nullptr);
+  g_object_unref(message);
+  EXPECT_TRUE(run_until([] { return !steps.empty(); }));
+  EXPECT_EQ(steps, Texts{"cancel"});
+}
+
+TEST_F(Server, CallsAreAnsweredInTheOrderInWhichTheyCame) {
+  const auto known = std::make_shared<CallOutcome>();
+  const auto missing = std::make_shared<CallOutcome>();
+  const auto last = std::make_shared<CallOutcome>();
+  client_->start_call("backup_enable", "(1,)", known);
+  client_->start_call("fly", "()", missing);
+  client_->start_call("backup_enable", "(2,)", last);
+  EXPECT_TRUE(run_until([&] { return last->finished; }));
+  EXPECT_TRUE(known->finished);
+  EXPECT_TRUE(missing->finished);
+  EXPECT_EQ(steps, (Texts{"cancel", "backup_enable 1", "cancel", "cancel", "backup_enable 2"}));
+}
+
+TEST_F(Server, OtherInterfacesAreLeftToTheBusLibrary) {
+  const CallOutcome outcome =
+      client_->call("Introspect", "()", "org.freedesktop.DBus.Introspectable");
+  EXPECT_NE(outcome.reply.find("org.orvane.Quarn"), std::string::npos);
+  EXPECT_TRUE(steps.empty());
+  EXPECT_EQ(client_->call("fly", "()", "org.example.Other").error_name,
+            "org.freedesktop.DBus.Error.UnknownMethod");
+  EXPECT_TRUE(steps.empty());
+}
+
+TEST_F(Server, AnswersAreOnTheirWayWhenTheNameIsGivenUp) {
+  const auto outcome = std::make_shared<CallOutcome>();
+  inside_handler = nullptr;
+  client_->start_call("manual_backup_start", "(uint32 1,)", outcome);
+  EXPECT_TRUE(run_until([] { return steps.size() == 2; }));
+  quarnd_dbus_deinit(owner_id_);
+  EXPECT_TRUE(run_until([&] { return outcome->finished; }));
+  EXPECT_EQ(outcome->reply, "(0,)");
+  const CallOutcome after = client_->call("set_activation", "(1,)");
+  EXPECT_EQ(after.error_name, "org.freedesktop.DBus.Error.ServiceUnknown");
+  owner_id_ = quarnd_dbus_init();
+  clear_captured_log();
+  EXPECT_TRUE(run_until(acquired));
+}
+
+TEST_F(Server, NameThatAnotherOwnsIsLostAndLogged) {
+  quarnd_dbus_deinit(owner_id_);
+  const ConnectionHandle other = connect_to_private_bus();
+  const GVariantPtr owned(g_dbus_connection_call_sync(
+      other.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+      "RequestName", g_variant_new("(su)", kQuarnBusName, 4u), nullptr, G_DBUS_CALL_FLAGS_NONE, -1,
+      nullptr, nullptr));
+  ASSERT_TRUE(owned);
+  clear_captured_log();
+  owner_id_ = quarnd_dbus_init();
+  EXPECT_TRUE(
+      run_until([] { return count_logged(DLOG_INFO, "Lost the name org.orvane.Quarn") == 1; }));
+  g_dbus_connection_close_sync(other.get(), nullptr, nullptr);
+}
+
+TEST_F(Server, ObjectThatCannotBeRegisteredIsLoggedBeforeTheLineOfSuccess) {
+  quarnd_dbus_deinit(owner_id_);
+  // In the way: the same interface at the same path of the same connection.
+  GDBusNodeInfo *node = g_dbus_node_info_new_for_xml(quarn_introspection_xml, nullptr);
+  const GDBusInterfaceVTable table{nullptr, nullptr, nullptr, {}};
+  const guint in_the_way =
+      g_dbus_connection_register_object(quarn_dbus_connection, kQuarnObjectPath,
+                                        node->interfaces[0], &table, nullptr, nullptr, nullptr);
+  clear_captured_log();
+  owner_id_ = quarnd_dbus_init();
+  EXPECT_TRUE(run_until(acquired));
+  const Texts texts = captured_texts();
+  const std::string failed = "g_dbus_connection_register_object() Fail(";
+  const auto failure = std::find_if(texts.begin(), texts.end(), [&](const std::string &text) {
+    return text.rfind(failed, 0) == 0;
+  });
+  ASSERT_NE(failure, texts.end());
+  ASSERT_NE(failure + 1, texts.end());
+  EXPECT_EQ(*(failure + 1), "g_dbus_connection_register_object() succeed");
+  g_dbus_connection_unregister_object(quarn_dbus_connection, in_the_way);
+  g_dbus_node_info_unref(node);
+}
+
+TEST(ServerStart, UnreadableIntrospectionDataGivesMinusOne) {
+  clear_captured_log();
+  fail_parse = true;
+  EXPECT_EQ(quarnd_dbus_init(), static_cast<unsigned int>(-1));
+  fail_parse = false;
+  const Texts texts = captured_texts();
+  ASSERT_EQ(texts.size(), 1u);
+  EXPECT_EQ(texts[0].rfind("g_dbus_node_info_new_for_xml() Fail(", 0), 0u);
+  quarnd_dbus_deinit(static_cast<unsigned int>(-1));
+}
+
+TEST(ServerStart, NameThatCannotBeAskedForGivesZero) {
+  clear_captured_log();
+  fail_own = true;
+  EXPECT_EQ(quarnd_dbus_init(), 0u);
+  fail_own = false;
+  EXPECT_EQ(count_logged(DLOG_ERROR, "g_bus_own_name() Fail"), 1);
+  quarnd_dbus_deinit(0);
+}
+
+/* ---- the introspection document ---- */
+
+/** Without white space between elements, comments and the document type. */
+std::string bare(const std::string &xml) {
+  std::string text;
+  std::size_t at = 0;
+  while (at < xml.size()) {
+    if (xml.compare(at, 4, "<!--") == 0) {
+      at = xml.find("-->", at) + 3;
+    } else if (xml.compare(at, 2, "<!") == 0 || xml.compare(at, 2, "<?") == 0) {
+      at = xml.find('>', at) + 1;
+    } else {
+      const char c = xml[at++];
+      text += c == '"' ? '\'' : c;
+    }
+  }
+  std::string result;
+  for (std::size_t i = 0; i < text.size(); ++i) {
+    const bool blank = std::isspace(static_cast<unsigned char>(text[i])) != 0;
+    const bool between = result.empty() || result.back() == '>';
+    if (!(blank && between)) result += text[i];
+  }
+  return result;
+}
+
+TEST(Introspection, InstalledDocumentSaysTheSame) {
+  std::ifstream file(QUARN_INTROSPECTION_FILE);
+  ASSERT_TRUE(file) << QUARN_INTROSPECTION_FILE;
+  std::stringstream content;
+  content << file.rdbuf();
+  EXPECT_EQ(bare(content.str()), bare(quarn_introspection_xml));
+}
+
+std::string arguments(GDBusArgInfo **args) {
+  std::string text;
+  for (; args != nullptr && *args != nullptr; ++args) {
+    if (!text.empty()) text += ", ";
+    text += std::string((*args)->signature) + " " + (*args)->name;
+  }
+  return text;
+}
+
+TEST(Introspection, HasElevenMethodsInOrder) {
+  GDBusNodeInfo *node = g_dbus_node_info_new_for_xml(quarn_introspection_xml, nullptr);
+  ASSERT_NE(node, nullptr);
+  ASSERT_NE(node->interfaces[0], nullptr);
+  EXPECT_EQ(node->interfaces[1], nullptr);
+  EXPECT_STREQ(node->interfaces[0]->name, "org.orvane.Quarn");
+  Texts methods;
+  for (GDBusMethodInfo **method = node->interfaces[0]->methods; *method != nullptr; ++method) {
+    methods.push_back(std::string((*method)->name) + "(" + arguments((*method)->in_args) + ") -> " +
+                      arguments((*method)->out_args));
+  }
+  EXPECT_EQ(methods,
+            (Texts{"set_activation(i activation) -> i ret", "backup_enable(i on) -> i ret",
+                   "restore_enable(i on, i client, s serial_num, s pkg_list, u req_id) -> i ret",
+                   "last_bu_time() -> t timestamp", "get_app_list(i client, u req_id) -> i ret",
+                   "auto_backup_start(s param) -> ", "manual_backup_start(u req_id) -> i ret",
+                   "manual_backup_cancel(u req_id) -> i ret",
+                   "app_data_backup_start(s pkg_id, u req_id) -> i ret",
+                   "app_data_restore_start(s pkg_id, u req_id) -> i ret",
+                   "make_app_data(s pkg_id) -> i ret"}));
+  g_dbus_node_info_unref(node);
+}
+
+TEST(Introspection, HasTabsBetweenElements) {
+  const std::string xml = quarn_introspection_xml;
+  EXPECT_EQ(xml.find('\n'), std::string::npos);
+  EXPECT_NE(xml.find(">\t<interface"), std::string::npos);
+  EXPECT_NE(xml.find(">\t\t\t<arg"), std::string::npos);
+}
+
+}  // namespace
