@@ -134,11 +134,15 @@ TEST_P(Conformance, LocalFileThatShrinksUnderTheUploadStoresNothing) {
 TEST_P(Conformance, FullStoreIsToldAndKeepsTheOldObject) {
   const std::string old_content = bytes(1000);
   ASSERT_EQ(cloud.put("/a", old_content), 0);
+  const std::string big = cloud.file(bytes(3 << 20));
   store->fill(500000);
-  EXPECT_EQ(cloud.put("/a", bytes(3 << 20)), BACKUP_TRANS_ERROR_QUOTA);
-  EXPECT_EQ(cloud.put("/fresh/b", bytes(3 << 20)), BACKUP_TRANS_ERROR_QUOTA);
+  const AnswerPtr over = cloud.upload(big, "/a");
+  const AnswerPtr fresh = cloud.upload(big, "/fresh/b");
+  ASSERT_TRUE(cloud.settle());
+  EXPECT_EQ(over->code, BACKUP_TRANS_ERROR_QUOTA);
+  EXPECT_EQ(fresh->code, BACKUP_TRANS_ERROR_QUOTA);
   store->unfill();
-  EXPECT_EQ(store->content(), (Content{{"/a", old_content}}));
+  EXPECT_TRUE(store->content() == (Content{{"/a", old_content}}));
   EXPECT_EQ(cloud.put("/a", bytes(3 << 20)), 0);
 }
 

@@ -125,6 +125,8 @@ AnswerPtr keep(AnswerPtr answer, AnswerPtr *owned, int accepted) {
 }  // namespace
 
 Cloud::Cloud(const std::string &config) : config_path_(dir_ / "cloud.conf") {
+  // A case may go on as a user without rights.
+  chmod(dir_.path().c_str(), 0777);
   configure(config);
   setenv("QUARN_CLOUD_CONFIG", config_path_.c_str(), 1);
   AnswerPtr answer = note();
