@@ -101,7 +101,7 @@ TEST_F(Files, TheSearchGoesOnAfterAFileAndAfterFailures) {
 
 TEST_F(Files, ATreeWithoutEndIsNotSearchedToItsEnd) {
   int at = open(dir_.path().c_str(), O_PATH | O_DIRECTORY);
-  for (int level = 0; level < 500; ++level) {
+  for (int level = 0; level < 420; ++level) {
     ASSERT_EQ(mkdirat(at, "d", 0755), 0);
     const int next = openat(at, "d", O_PATH | O_DIRECTORY);
     close(at);
