@@ -21,7 +21,7 @@ constexpr mode_t kCopyMode = 0600;
 constexpr mode_t kPermissionBits = 07777;
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
 constexpr char kUnfinishedTable[] = "/table";
-constexpr char kStagedArchive[] = "/staged";
+constexpr char kKept[] = "/kept";
 
 struct TableRelease {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
@@ -34,7 +34,7 @@ using Paths = std::vector<std::string>;
 bool is_own_snapshot(const std::string &path) {
   struct stat status = {};
   return safe_lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode) &&
-         status.st_uid == geteuid() && (status.st_mode & kPermissionBits) == kSnapshotMode;
+         status.st_uid == geteuid() && (status.st_mode & ACCESSPERMS) == kSnapshotMode;
 }
 
 bool is_complete_snapshot(const restore_files &files) {
@@ -98,17 +98,39 @@ int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
   return flush_directory(files.snapshot_table) ? QUARN_OK : QUARN_REFUSED;
 }
 
-/** Move a file, if there is one, within the package. */
-void move_file(const std::string &from, const std::string &to) {
-  if (!file_exist(from.c_str())) return;
-  std::string from_name;
-  std::string to_name;
-  const UniqueFd source = safe_open_parent(from.c_str(), &from_name);
-  const UniqueFd target = safe_open_parent(to.c_str(), &to_name);
-  if (!source || !target ||
-      renameat(source.get(), from_name.c_str(), target.get(), to_name.c_str()) != 0) {
-    LOGE("fail to move %s to %s", from.c_str(), to.c_str());
+/** Move every entry of one directory that @p wanted takes into another. */
+template <typename Wanted>
+void move_entries(const std::string &from, const std::string &to, Wanted wanted) {
+  const DirPtr source = safe_opendir(from.c_str());
+  const UniqueFd target = safe_open(to.c_str(), O_PATH | O_DIRECTORY);
+  if (source == nullptr || !target) return;
+  while (const dirent *entry = readdir(source.get())) {
+    const char *name = entry->d_name;
+    if (is_dot_entry(name) || !wanted(from + "/" + name)) continue;
+    if (renameat(dirfd(source.get()), name, target.get(), name) != 0) {
+      LOGE("fail to move %s from %s to %s", name, from.c_str(), to.c_str());
+    }
   }
+}
+
+/**
+ * What no snapshot holds is not emptied by a rollback either: an archive that
+ * a backup run has staged, and what is skipped for its name.
+ */
+void set_aside(const restore_files &files) {
+  const std::string kept = files.snapshot + kKept;
+  if (safe_mkdir_with_parents(kept.c_str(), kSnapshotMode) != 0) return;
+  move_entries(files.dirs[1], kept, [&](const std::string &path) {
+    return files.is_skipped(path) && path != files.snapshot && path != files.download;
+  });
+}
+
+void bring_back(const restore_files &files) {
+  const std::string kept = files.snapshot + kKept;
+  move_entries(kept, files.dirs[1], [](const std::string &) { return true; });
+  std::string name;
+  const UniqueFd parent = safe_open_parent(kept.c_str(), &name);
+  if (parent) unlinkat(parent.get(), name.c_str(), AT_REMOVEDIR);
 }
 
 /** Copy all of a file's bytes: small ones through memory, which costs less than a set-up. */
@@ -344,13 +366,12 @@ int rollback_to_initial_app_data(const char *pkgid, const char *root) {
   }
   restore_step("rollback");
   const JsonPtr table = read_table(files.snapshot_table);
-  // An archive that a backup run has staged is no data, and that run's to delete.
-  const std::string staged = files.snapshot + kStagedArchive;
-  move_file(staged, files.upload);
-  move_file(files.upload, staged);
+  bring_back(files);  // of a rollback that was interrupted
+  set_aside(files);
+  restore_step("rollback-set-aside");
   clear_app_dir(pkgid, root);
   restore_step("rollback-cleared");
-  move_file(staged, files.upload);
+  bring_back(files);
   parse_dir_for_rollback(files.snapshot.c_str(), pkgid, root);
   restore_app_info(pkgid, root);
   put_attributes_back(table.get(), root);
@@ -361,6 +382,7 @@ int rollback_to_initial_app_data(const char *pkgid, const char *root) {
 
 int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root) {
   const restore_files files(pkgid, root);
+  const std::string kept = files.snapshot + kKept;
   Paths pending{dir};
   int result = 1;
   while (!pending.empty()) {
@@ -372,14 +394,14 @@ int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root)
       result = 0;
       continue;
     }
+    std::string path = current;
     while (const dirent *entry = readdir(handle.get())) {
-      const std::string name = entry->d_name;
-      if (name == "." || name == "..") continue;
-      const std::string path = current + "/" + name;
-      if (files.is_archive(path)) continue;
+      if (is_dot_entry(entry->d_name)) continue;
+      const PathStep step(&path, entry->d_name);
+      if (files.is_archive(path) || path == kept) continue;
       restore_step("rollback-entry");
       struct stat status = {};
-      const int found = fstatat(dirfd(handle.get()), name.c_str(), &status, AT_SYMLINK_NOFOLLOW);
+      const int found = fstatat(dirfd(handle.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
       if (found != 0) {
         LOGE("error : lstat for %d %s", found, path.c_str());
         continue;

@@ -79,13 +79,13 @@ int walk_directory(const walk_context &ctx, const std::string &dir, const struct
       LOGE("error : cannot open this path %s", dir.c_str());
       return 0;
     }
+    std::string path = dir;
     while (const dirent *entry = readdir(handle.get())) {
-      const std::string name = entry->d_name;
-      if (name == "." || name == "..") continue;
-      const std::string path = dir + "/" + name;
+      if (is_dot_entry(entry->d_name)) continue;
+      const PathStep step(&path, entry->d_name);
       if (ctx.files.is_skipped(path)) continue;
       restore_step("attributes");
-      if (!restore_entry(ctx, dirfd(handle.get()), name.c_str(), path, &found)) result = 0;
+      if (!restore_entry(ctx, dirfd(handle.get()), entry->d_name, path, &found)) result = 0;
     }
   }
   // One descriptor at a time, however deep the tree is.

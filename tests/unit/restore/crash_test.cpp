@@ -37,6 +37,8 @@ class CrashTest : public RestoreTest {
   void make_data() {
     make_old_data();
     file("shared/data/org.example.notes_upload.zip", "staged", 0600);
+    dir("shared/data/quarn_tmp_rst_dir2");
+    file("shared/data/quarn_tmp_rst_dir2/inner", "skipped for its name");
   }
 
   void restore_here() {

@@ -125,6 +125,26 @@ TEST_F(PipelineTest, RestoresIntoAFreshlyInstalledPackage) {
   EXPECT_EQ(tree_of(root).at("data/db"), "40755 5000:5000 app.data ");
 }
 
+TEST_F(PipelineTest, WhatThisDeviceArchivedComesBackWithEveryAttributeEqual) {
+  make_old_data();
+  file("data/tool", "x", 06755);
+  file("data/empty", "", 0);
+  dir("data/sticky", 01777);
+  file("data/sticky/inner", "i", 0604);
+  const Tree before = tree_of(root);
+  const std::string archive = base + "/archive.zip";
+  int error = 0;
+  make_zip_data(kPkg, root.c_str(), archive.c_str(), &error);
+  ASSERT_EQ(error, 0);
+  clear_app_dir(kPkg, root.c_str());
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  std::filesystem::copy_file(archive, download());
+  answer();
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(tree_of(root), before);
+}
+
 TEST_F(PipelineTest, ADownloadErrorLeavesTheDataUntouchedAndSetsTwelve) {
   make_old_data();
   const Tree before = tree_of(root);

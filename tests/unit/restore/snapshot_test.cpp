@@ -314,9 +314,12 @@ TEST_F(SnapshotTest, AnArchiveIsNotCopiedBack) {
   EXPECT_TRUE(captured_texts().empty());
 }
 
-TEST_F(SnapshotTest, ARollbackKeepsTheArchiveThatABackupRunHasStaged) {
+TEST_F(SnapshotTest, ARollbackKeepsWhatNoSnapshotHolds) {
   make_old_data();
-  file("shared/data/org.example.notes_upload.zip", "staged", 0600);
+  file("shared/data/org.example.notes_upload.zip", "staged by a backup run", 0600);
+  file("shared/data/quarn_tmp_rst_dir2", "skipped for its name", 0640);
+  dir("shared/data/quarn_tmp_rst_directory");
+  file("shared/data/quarn_tmp_rst_directory/inner", "as well", 0640);
   const Tree before = tree();
   ASSERT_EQ(take(), 0);
   spoil();
@@ -352,6 +355,33 @@ TEST_F(SnapshotTest, ASnapshotsTableDoesNotGiveSetIdBitsToAnotherUser) {
   struct stat status = {};
   ASSERT_EQ(lstat(path.c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777, 0755U);
+}
+
+TEST_F(SnapshotTest, AnOwnerOrLabelThatCannotBePutBackIsLogged) {
+  const std::string path = file("data/a", "x", 0640, "wrt::db_origin");
+  ASSERT_EQ(chown(path.c_str(), 5001, 5001), 0);
+  ASSERT_EQ(take(), 0);
+  std::unique_ptr<WithoutCapabilities> none;
+  const AtStep without("rollback-attributes", [&] {
+    label_result = -2;
+    ON_CALL(platform, smack_setlabel).WillByDefault(Return(-1));
+    set_label(path, "other");
+    none = std::make_unique<WithoutCapabilities>(std::initializer_list<int>{CAP_CHOWN, CAP_FOWNER});
+  });
+  roll_back();
+  none.reset();
+  expect_error("chown: error \n");
+  expect_error("fail to put label of data/a back");
+}
+
+TEST_F(SnapshotTest, ADirectoryThatPassesItsGroupOnHoldsASnapshotAsWell) {
+  make_old_data();
+  ASSERT_EQ(chmod(at("shared/data").c_str(), 02775), 0);
+  const Tree before = tree();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  roll_back();
+  EXPECT_EQ(tree(), before);
 }
 
 /* ---- recovery ---- */
