@@ -17,6 +17,7 @@ constexpr char kUploading[] = "uploading";
 constexpr char kFinished[] = "finished";
 constexpr std::size_t kBarColumns = 24;
 constexpr int kPercent = 100;
+constexpr std::size_t kPercentColumns = 4;
 
 struct Words {
   const char *word;
@@ -37,22 +38,14 @@ constexpr Words kStages[] = {
 };
 
 constexpr Words kReasons[] = {
+    {"unchanged", "the cloud holds it already"},
     {"external", "its data is on external storage"},
     {"too-large", "its data is too large"},
     {"no-space", "not enough free space on the device"},
     {"disabled", "the application does not allow it"},
-    {"preloaded", "preloaded packages are left out"},
     {"unreadable", "its data could not be read"},
     {"upload-failed", "the upload failed"},
-    {"no-archive", "the cloud holds no archive of it"},
-    {"download-failed", "the download failed"},
-    {"wifi-lost", "Wi-Fi was lost"},
-    {"cancelled", "cancelled"},
-    {"snapshot-failed", "its present data could not be copied, so nothing was changed"},
-    {"unpack-failed", "the archive could not be unpacked"},
-    {"attributes-failed", "modes, owners or labels could not be set"},
     {"not-installed", "restore mode ended before it was installed"},
-    {"unknown", "the daemon did not say"},
 };
 
 template <std::size_t N>
@@ -74,11 +67,6 @@ std::optional<std::uint64_t> optional_size(json_object *object, const char *name
   return static_cast<std::uint64_t>(*value);
 }
 
-double part(std::uint64_t done, std::uint64_t total) {
-  if (total == 0) return 0;
-  return std::min(1.0, static_cast<double>(done) / static_cast<double>(total));
-}
-
 }  // namespace
 
 std::optional<ProgressEvent> parse_progress(const std::string &text) {
@@ -89,7 +77,6 @@ std::optional<ProgressEvent> parse_progress(const std::string &text) {
   event.stage = json_string(object, "stage").value_or("");
   if (event.kind.empty() || event.stage.empty()) return std::nullopt;
   event.run = json_integer(object, "run").value_or(0);
-  event.request = json_integer(object, "request");
   event.package = json_string(object, "package").value_or("");
   event.index = json_integer(object, "index").value_or(0);
   event.count = json_integer(object, "count").value_or(0);
@@ -112,11 +99,12 @@ std::string reason_text(const PackageOutcome &outcome) {
   if (outcome.reason == "too-large" && outcome.size && outcome.cap) {
     return size_text(*outcome.size) + " of data, at most " + size_text(*outcome.cap);
   }
-  std::string text = words(kReasons, outcome.reason);
-  if (text.empty() && outcome.result && *outcome.result != QUARN_OK) {
-    text = quarn_result_text(static_cast<int>(*outcome.result));
+  if (outcome.reason == "no-space" && outcome.size && outcome.cap) {
+    return size_text(*outcome.size) + " of data, " + size_text(*outcome.cap) + " are free";
   }
-  return text;
+  if (!outcome.reason.empty()) return words(kReasons, outcome.reason);
+  if (!outcome.result || *outcome.result == QUARN_OK) return "";
+  return quarn_result_text(static_cast<int>(*outcome.result));
 }
 
 const PackageOutcome *ProgressBoard::outcome_of(const std::string &package) const {
@@ -136,11 +124,10 @@ void ProgressBoard::set_outcome(PackageOutcome outcome) {
 }
 
 std::string ProgressBoard::feed(const ProgressEvent &event) {
+  const bool is_backup = event.kind == kBackup;
+  if (is_backup && event.run != last_.run) outcomes_.clear();
   const bool new_stage = event.stage != last_.stage || event.run != last_.run;
-  if (new_stage && event.kind == kBackup) {
-    best_ = 0;
-    transfers_.clear();
-  }
+  if (new_stage && is_backup) best_.reset();
   last_ = event;
   std::string line;
   if (!event.package.empty() && !event.outcome.empty()) {
@@ -150,55 +137,42 @@ std::string ProgressBoard::feed(const ProgressEvent &event) {
     line = event.package + ": " + event.outcome;
     if (!reason.empty()) line += " (" + reason + ")";
     set_outcome(std::move(outcome));
-  } else if (new_stage && event.kind == kBackup) {
+  } else if (new_stage && is_backup) {
     line = stage_text(event.kind, event.stage);
   }
-  if (event.stage == kUploading && !event.package.empty()) {
-    const double done = event.outcome.empty() ? part(event.bytes_done, event.bytes_total) : 1;
-    const auto found =
-        std::find_if(transfers_.begin(), transfers_.end(),
-                     [&](const Transfer &known) { return known.package == event.package; });
-    if (found == transfers_.end()) {
-      transfers_.push_back({event.package, done});
-    } else {
-      found->fraction = std::max(found->fraction, done);
-    }
-  }
-  best_ = std::clamp(std::max(best_, fraction()), 0.0, 1.0);
+  const auto done = fraction();
+  if (done) best_ = std::clamp(std::max(best_.value_or(0), *done), 0.0, 1.0);
   return printable(line);
 }
 
-double ProgressBoard::fraction() const {
-  if (last_.stage == kFinished) return 1;
-  const double share = part(last_.bytes_done, last_.bytes_total);
+std::optional<double> ProgressBoard::fraction() const {
   if (last_.kind != kBackup) {
-    const auto all = std::max<double>(static_cast<double>(expected_), 1);
-    const bool running = !last_.package.empty() && last_.outcome.empty();
-    return (static_cast<double>(outcomes_.size()) + (running ? share : 0)) / all;
+    if (expected_ == 0) return std::nullopt;
+    return static_cast<double>(outcomes_.size()) / static_cast<double>(expected_);
   }
-  if (last_.count <= 0) return share;
-  const auto count = static_cast<double>(last_.count);
-  if (last_.stage == kUploading) {
-    double sum = 0;
-    for (const Transfer &transfer : transfers_) sum += transfer.fraction;
-    return sum / count;
+  if (last_.stage == kFinished) return 1;
+  if (last_.stage == kUploading && last_.bytes_total > 0) {
+    return static_cast<double>(last_.bytes_done) / static_cast<double>(last_.bytes_total);
   }
-  const double before = std::max<double>(static_cast<double>(last_.index) - 1, 0);
-  return (before + (last_.outcome.empty() ? share : 1)) / count;
+  if (last_.count <= 0) return std::nullopt;
+  return static_cast<double>(last_.index) / static_cast<double>(last_.count);
 }
 
 std::string ProgressBoard::bar(std::size_t columns) const {
-  const auto filled = static_cast<std::size_t>(std::lround(best_ * kBarColumns));
-  const long percent = std::lround(std::floor(best_ * kPercent));
-  std::string line = "[" + std::string(filled, '#') + std::string(kBarColumns - filled, '-') + "]";
-  std::string number = std::to_string(percent);
-  line += std::string(number.size() < 4 ? 4 - number.size() : 0, ' ') + number + "%  ";
+  std::string line;
+  if (best_) {
+    const auto filled = static_cast<std::size_t>(std::floor(*best_ * kBarColumns));
+    const std::string percent = std::to_string(std::lround(std::floor(*best_ * kPercent)));
+    line = "[" + std::string(filled, '#') + std::string(kBarColumns - filled, '-') + "]" +
+           std::string(kPercentColumns - percent.size(), ' ') + percent + "%  ";
+  }
   line += stage_text(last_.kind, last_.stage);
-  if (last_.index > 0 && last_.count > 0) {
-    line += " " + std::to_string(last_.index) + "/" + std::to_string(last_.count);
+  if (last_.index > 0) {
+    line += "  " + std::to_string(last_.index);
+    line += last_.count > 0 ? " of " + std::to_string(last_.count) : " done";
   }
   if (!last_.package.empty()) line += "  " + last_.package;
-  if (last_.bytes_total > 0) {
+  if (last_.stage == kUploading && last_.bytes_total > 0) {
     line += "  " + size_text(last_.bytes_done) + " of " + size_text(last_.bytes_total);
   }
   return clipped(line, columns);

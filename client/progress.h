@@ -18,13 +18,12 @@ namespace quarn_client {
 
 /** One signal; members that are missing or of another type are empty or 0. */
 struct ProgressEvent {
-  std::int64_t run = 0;
-  std::optional<std::int64_t> request; /**< id of the client request that the run serves */
-  std::string kind;                    /**< "backup" or "restore" */
+  std::int64_t run = 0; /**< tells the backups of one daemon apart */
+  std::string kind;     /**< "backup" or "restore" */
   std::string stage;
-  std::string package; /**< empty: the event is about the whole run */
-  std::int64_t index = 0;
-  std::int64_t count = 0;
+  std::string package;    /**< empty: the event is about the whole run */
+  std::int64_t index = 0; /**< packages done in this stage */
+  std::int64_t count = 0; /**< of how many; 0 while that is not known */
   std::uint64_t bytes_done = 0;
   std::uint64_t bytes_total = 0;
   std::string outcome; /**< empty while the package is being worked on */
@@ -47,7 +46,7 @@ struct PackageOutcome {
   std::optional<std::int64_t> result;
 };
 
-/** Collects the events of one run. */
+/** Collects the events of one run; a backup of another run begins anew. */
 class ProgressBoard {
  public:
   /** @param expected packages of the run when they are known before it begins, else 0 */
@@ -61,7 +60,7 @@ class ProgressBoard {
   const PackageOutcome *outcome_of(const std::string &package) const;
   const std::vector<PackageOutcome> &outcomes() const { return outcomes_; }
 
-  /** One line of at most @p columns columns: a bar and what is going on. */
+  /** One line of at most @p columns columns: what is going on, with a bar when its end is known. */
   std::string bar(std::size_t columns) const;
   /** Each package, what happened to it, its size and why; empty when none was reported. */
   std::string table() const;
@@ -69,17 +68,13 @@ class ProgressBoard {
   json_object *to_json() const;
 
  private:
-  double fraction() const;
+  /** How much of the stage is done, 0 to 1; nothing while that is not known. */
+  std::optional<double> fraction() const;
 
   std::size_t expected_;
   ProgressEvent last_;
-  double best_ = 0;
+  std::optional<double> best_; /**< a bar never runs back */
   std::vector<PackageOutcome> outcomes_;
-  struct Transfer {
-    std::string package;
-    double fraction;
-  };
-  std::vector<Transfer> transfers_;
 };
 
 /** Words for a stage of the daemon's work; the stage itself when it is not known. */

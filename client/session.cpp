@@ -28,7 +28,6 @@ constexpr int kOff = 0;
 constexpr char kRestoreStop[] = "restore_stop";
 constexpr char kBackupKind[] = "backup";
 constexpr char kRestoreKind[] = "restore";
-constexpr char kFinishedStage[] = "finished";
 constexpr char kRestoredOutcome[] = "restored";
 constexpr char kExportDirectory[] = "/tmp/";
 constexpr char kExportSuffix[] = "_tmp.zip";
@@ -74,6 +73,7 @@ class Session {
   void take_callback(const Callback &callback);
   void take_status(const Callback &callback);
   void take_progress(const std::string &text);
+  bool concerns_us(const ProgressEvent &event) const;
   void daemon_ended();
   void fail(const BusFailure &failure);
 
@@ -421,12 +421,7 @@ void Session::take_status(const Callback &callback) {
 void Session::take_progress(const std::string &text) {
   if (done_ || !called_) return;
   const auto event = parse_progress(text);
-  if (!event || (event->request && *event->request != req_id_)) return;
-  const bool is_backup = command_.verb == Verb::backup || command_.verb == Verb::app_backup;
-  const bool is_restore = command_.verb == Verb::restore_on || command_.verb == Verb::app_restore;
-  if (!(is_backup && event->kind == kBackupKind) && !(is_restore && event->kind == kRestoreKind)) {
-    return;
-  }
+  if (!event || !concerns_us(*event)) return;
   reported_ = true;
   const std::string line = board_.feed(*event);
   if (screen_.redraws()) {
@@ -434,9 +429,23 @@ void Session::take_progress(const std::string &text) {
   } else if (!line.empty()) {
     screen_.line(line);
   }
-  if (!watching_) return;
-  if (event->package.empty() && event->stage == kFinishedStage) return end_watch(true);
-  check_watch();
+  if (watching_) check_watch();
+}
+
+bool Session::concerns_us(const ProgressEvent &event) const {
+  switch (command_.verb) {
+    case Verb::backup:
+      return event.kind == kBackupKind;
+    case Verb::app_backup:
+      return event.kind == kBackupKind && event.package == command_.packages[0];
+    case Verb::app_restore:
+      return event.kind == kRestoreKind && event.package == command_.packages[0];
+    case Verb::restore_on:
+      return event.kind == kRestoreKind && command_.watch &&
+             std::find(expected_.begin(), expected_.end(), event.package) != expected_.end();
+    default:
+      return false;
+  }
 }
 
 void Session::watch() {

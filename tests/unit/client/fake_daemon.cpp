@@ -1,0 +1,287 @@
+#include "fake_daemon.h"
+
+#include <fcntl.h>
+#include <glib-unix.h>
+#include <gtest/gtest.h>
+#include <pty.h>
+#include <sys/ioctl.h>
+
+#include <cstdlib>
+#include <utility>
+
+#include "quarn_common.h"
+
+namespace {
+
+constexpr std::int64_t kDeadlineUs = 20000000;
+constexpr unsigned short kColumns = 80;
+constexpr unsigned short kRows = 25;
+
+constexpr char kDaemonXml[] =
+    "<node><interface name='org.orvane.Quarn'>"
+    "<method name='set_activation'><arg type='i' direction='in'/><arg type='i' direction='out'/>"
+    "</method>"
+    "<method name='backup_enable'><arg type='i' direction='in'/><arg type='i' direction='out'/>"
+    "</method>"
+    "<method name='restore_enable'><arg type='i' direction='in'/><arg type='i' direction='in'/>"
+    "<arg type='s' direction='in'/><arg type='s' direction='in'/><arg type='u' direction='in'/>"
+    "<arg type='i' direction='out'/></method>"
+    "<method name='last_bu_time'><arg type='t' direction='out'/></method>"
+    "<method name='get_app_list'><arg type='i' direction='in'/><arg type='u' direction='in'/>"
+    "<arg type='i' direction='out'/></method>"
+    "<method name='manual_backup_start'><arg type='u' direction='in'/>"
+    "<arg type='i' direction='out'/></method>"
+    "<method name='manual_backup_cancel'><arg type='u' direction='in'/>"
+    "<arg type='i' direction='out'/></method>"
+    "<method name='app_data_backup_start'><arg type='s' direction='in'/>"
+    "<arg type='u' direction='in'/><arg type='i' direction='out'/></method>"
+    "<method name='app_data_restore_start'><arg type='s' direction='in'/>"
+    "<arg type='u' direction='in'/><arg type='i' direction='out'/></method>"
+    "<method name='make_app_data'><arg type='s' direction='in'/><arg type='i' direction='out'/>"
+    "</method>"
+    "</interface></node>";
+
+using NodeInfo = Handle<GDBusNodeInfo, &g_dbus_node_info_unref>;
+
+GVariantPtr child(GDBusMethodInvocation *invocation, std::size_t index) {
+  return GVariantPtr(
+      g_variant_get_child_value(g_dbus_method_invocation_get_parameters(invocation), index));
+}
+
+void after_call_back(GObject *source, GAsyncResult *result, gpointer user_data) {
+  const std::unique_ptr<std::function<void()>> then(
+      static_cast<std::function<void()> *>(user_data));
+  GErrorPtr error;
+  const GVariantPtr reply(
+      g_dbus_connection_call_finish(G_DBUS_CONNECTION(source), result, out(error)));
+  ASSERT_TRUE(reply) << (error ? error->message : "");
+  gint32 answer = -1;
+  g_variant_get(reply.get(), "(i)", &answer);
+  EXPECT_EQ(answer, 0);
+  if (*then) (*then)();
+}
+
+}  // namespace
+
+PrivateBus::PrivateBus() : bus_(g_test_dbus_new(G_TEST_DBUS_NONE)) { g_test_dbus_up(bus_); }
+
+PrivateBus::~PrivateBus() {
+  stop();
+  g_object_unref(bus_);
+}
+
+void PrivateBus::stop() {
+  if (g_test_dbus_get_bus_address(bus_) != nullptr) g_test_dbus_down(bus_);
+}
+
+std::string PrivateBus::address() const { return g_test_dbus_get_bus_address(bus_); }
+
+Handle<GDBusConnection, &g_object_unref> PrivateBus::connect() const {
+  const auto flags =
+      static_cast<GDBusConnectionFlags>(G_DBUS_CONNECTION_FLAGS_AUTHENTICATION_CLIENT |
+                                        G_DBUS_CONNECTION_FLAGS_MESSAGE_BUS_CONNECTION);
+  GErrorPtr error;
+  Handle<GDBusConnection, &g_object_unref> connection(g_dbus_connection_new_for_address_sync(
+      address().c_str(), flags, nullptr, nullptr, out(error)));
+  EXPECT_TRUE(connection) << (error ? error->message : "");
+  return connection;
+}
+
+IncomingCall::IncomingCall(GDBusConnection *connection, GDBusMethodInvocation *invocation)
+    : connection_(connection),
+      invocation_(static_cast<GDBusMethodInvocation *>(g_object_ref(invocation)), &g_object_unref) {
+}
+
+std::string IncomingCall::client() const {
+  return g_dbus_method_invocation_get_sender(invocation_.get());
+}
+
+std::uint32_t IncomingCall::req_id() const {
+  const std::size_t count =
+      g_variant_n_children(g_dbus_method_invocation_get_parameters(invocation_.get()));
+  return g_variant_get_uint32(child(invocation_.get(), count - 1).get());
+}
+
+std::int32_t IncomingCall::int_argument(std::size_t index) const {
+  return g_variant_get_int32(child(invocation_.get(), index).get());
+}
+
+std::string IncomingCall::text_argument(std::size_t index) const {
+  return g_variant_get_string(child(invocation_.get(), index).get(), nullptr);
+}
+
+void IncomingCall::reply(int result) const { reply_value(g_variant_new("(i)", result)); }
+
+void IncomingCall::reply_value(GVariant *value) const {
+  g_dbus_method_invocation_return_value(invocation_.get(), value);
+}
+
+void IncomingCall::reply_error(const char *name, const char *message) const {
+  g_dbus_method_invocation_return_dbus_error(invocation_.get(), name, message);
+}
+
+void IncomingCall::reply_raw(GVariant *value) const {
+  const Handle<GDBusMessage, &g_object_unref> message(
+      g_dbus_message_new_method_reply(g_dbus_method_invocation_get_message(invocation_.get())));
+  g_dbus_message_set_body(message.get(), value);
+  g_dbus_connection_send_message(connection_, message.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE,
+                                 nullptr, nullptr);
+  g_object_unref(invocation_.get());  // as a reply would have done
+}
+
+void IncomingCall::call_back(const char *method, GVariant *arguments,
+                             std::function<void()> then) const {
+  g_dbus_connection_call(connection_, client().c_str(), kQuarnObjectPath, kQuarnInterface, method,
+                         arguments, G_VARIANT_TYPE("(i)"), G_DBUS_CALL_FLAGS_NONE, -1, nullptr,
+                         after_call_back, new std::function<void()>(std::move(then)));
+}
+
+FakeDaemon::FakeDaemon(const PrivateBus &bus) : connection_(bus.connect()) {
+  static const GDBusInterfaceVTable table = {on_call, nullptr, nullptr, {}};
+  const NodeInfo node(g_dbus_node_info_new_for_xml(kDaemonXml, nullptr));
+  object_ = g_dbus_connection_register_object(connection_.get(), kQuarnObjectPath,
+                                              node->interfaces[0], &table, this, nullptr, nullptr);
+  GErrorPtr error;
+  const GVariantPtr reply(g_dbus_connection_call_sync(
+      connection_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+      "RequestName", g_variant_new("(su)", kQuarnBusName, 0U), nullptr, G_DBUS_CALL_FLAGS_NONE, -1,
+      nullptr, out(error)));
+  EXPECT_TRUE(reply) << (error ? error->message : "");
+}
+
+FakeDaemon::~FakeDaemon() { die(); }
+
+void FakeDaemon::die() {
+  if (g_dbus_connection_is_closed(connection_.get()) == FALSE) {
+    g_dbus_connection_flush_sync(connection_.get(), nullptr, nullptr);
+    g_dbus_connection_unregister_object(connection_.get(), object_);
+    g_dbus_connection_close_sync(connection_.get(), nullptr, nullptr);
+  }
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+}
+
+void FakeDaemon::publish(const std::string &text) {
+  GErrorPtr error;
+  EXPECT_TRUE(g_dbus_connection_emit_signal(connection_.get(), nullptr, "/progress",
+                                            kQuarnInterface, "progress",
+                                            g_variant_new("(s)", text.c_str()), out(error)));
+}
+
+void FakeDaemon::on_call(GDBusConnection *connection, const char *, const char *, const char *,
+                         const char *method, GVariant *, GDBusMethodInvocation *invocation,
+                         gpointer user_data) {
+  auto *self = static_cast<FakeDaemon *>(user_data);
+  self->calls_.emplace_back(method);
+  const auto found = self->scripts_.find(method);
+  if (found == self->scripts_.end()) {
+    g_dbus_method_invocation_return_dbus_error(invocation, "org.freedesktop.DBus.Error.Failed",
+                                               "the test expects no such call");
+    return;
+  }
+  // A copy: the script may replace itself.
+  const Script script = found->second;
+  script(IncomingCall(connection, invocation));
+}
+
+bool run_until(const std::function<bool()> &condition) {
+  const std::int64_t deadline = g_get_monotonic_time() + kDeadlineUs;
+  // Something always wakes the loop in time to look at the deadline.
+  const guint tick = g_timeout_add(
+      100, [](gpointer) -> gboolean { return TRUE; }, nullptr);
+  while (!condition() && g_get_monotonic_time() < deadline) {
+    g_main_context_iteration(nullptr, TRUE);
+  }
+  g_source_remove(tick);
+  return condition();
+}
+
+QuarnctlRun::QuarnctlRun(const PrivateBus &bus, const std::vector<std::string> &arguments,
+                         bool terminal) {
+  int flags = G_SUBPROCESS_FLAGS_STDERR_PIPE;
+  if (!terminal) flags |= G_SUBPROCESS_FLAGS_STDOUT_PIPE;
+  const Handle<GSubprocessLauncher, &g_object_unref> launcher(
+      g_subprocess_launcher_new(static_cast<GSubprocessFlags>(flags)));
+  g_subprocess_launcher_setenv(launcher.get(), "DBUS_SYSTEM_BUS_ADDRESS", bus.address().c_str(),
+                               TRUE);
+  g_subprocess_launcher_setenv(launcher.get(), "TZ", "UTC", TRUE);
+  g_subprocess_launcher_setenv(launcher.get(), "TERM", "xterm", TRUE);
+  if (terminal) {
+    int master = -1;
+    int slave = -1;
+    const winsize size = {kRows, kColumns, 0, 0};
+    EXPECT_EQ(openpty(&master, &slave, nullptr, nullptr, &size), 0);
+    terminal_.reset(master);
+    fcntl(master, F_SETFL, O_NONBLOCK);
+    fcntl(master, F_SETFD, FD_CLOEXEC);
+    g_subprocess_launcher_take_stdout_fd(launcher.get(), slave);
+    terminal_source_ = g_unix_fd_add(
+        master, static_cast<GIOCondition>(G_IO_IN | G_IO_HUP | G_IO_ERR), on_terminal, this);
+  }
+  std::vector<const char *> argv{QUARNCTL};
+  for (const std::string &argument : arguments) argv.push_back(argument.c_str());
+  argv.push_back(nullptr);
+  GErrorPtr error;
+  process_.reset(g_subprocess_launcher_spawnv(launcher.get(), argv.data(), out(error)));
+  EXPECT_TRUE(process_) << (error ? error->message : "");
+  g_subprocess_communicate_utf8_async(process_.get(), nullptr, nullptr, on_end, this);
+}
+
+QuarnctlRun::~QuarnctlRun() {
+  if (!ended_) {
+    g_subprocess_force_exit(process_.get());
+    run_until([this] { return ended_; });
+  }
+  if (terminal_source_ != 0) g_source_remove(terminal_source_);
+}
+
+gboolean QuarnctlRun::on_terminal(int fd, GIOCondition, gpointer user_data) {
+  auto *self = static_cast<QuarnctlRun *>(user_data);
+  char buffer[4096];
+  const ssize_t got = read(fd, buffer, sizeof buffer);
+  if (got > 0) {
+    self->outcome_.out.append(buffer, static_cast<std::size_t>(got));
+    return G_SOURCE_CONTINUE;
+  }
+  self->terminal_source_ = 0;
+  return G_SOURCE_REMOVE;
+}
+
+void QuarnctlRun::on_end(GObject *source, GAsyncResult *result, gpointer user_data) {
+  auto *self = static_cast<QuarnctlRun *>(user_data);
+  char *stdout_text = nullptr;
+  char *stderr_text = nullptr;
+  GErrorPtr error;
+  EXPECT_TRUE(g_subprocess_communicate_utf8_finish(G_SUBPROCESS(source), result, &stdout_text,
+                                                   &stderr_text, out(error)))
+      << (error ? error->message : "");
+  const GString_ stdout_owner(stdout_text);
+  const GString_ stderr_owner(stderr_text);
+  if (stdout_text != nullptr) self->outcome_.out = stdout_text;
+  if (stderr_text != nullptr) self->outcome_.err = stderr_text;
+  GSubprocess *process = self->process_.get();
+  self->outcome_.exit = g_subprocess_get_if_exited(process) != FALSE
+                            ? g_subprocess_get_exit_status(process)
+                            : -g_subprocess_get_term_sig(process);
+  self->ended_ = true;
+}
+
+void QuarnctlRun::signal(int number) { g_subprocess_send_signal(process_.get(), number); }
+
+Outcome QuarnctlRun::wait() {
+  EXPECT_TRUE(run_until([this] { return ended_ && terminal_source_ == 0; }))
+      << "quarnctl has not ended";
+  return outcome_;
+}
+
+Outcome quarnctl(const PrivateBus &bus, const std::vector<std::string> &arguments) {
+  return QuarnctlRun(bus, arguments).wait();
+}
+
+GVariant *status_arguments(int error, int status, std::uint32_t req_id) {
+  return g_variant_new("(iiu)", error, status, req_id);
+}
+
+GVariant *text_arguments(int error, const std::string &text, std::uint32_t req_id) {
+  return g_variant_new("(isu)", error, text.c_str(), req_id);
+}
