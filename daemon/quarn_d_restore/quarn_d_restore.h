@@ -67,6 +67,15 @@ int change_object_mode(int fd, const struct stat &status, mode_t mode);
 /** chown() of an open object, a link itself included. @return 0, or -1 with errno */
 int change_object_owner(int fd, uid_t uid, gid_t gid);
 
+/* ---- table.cpp ---- */
+
+/**
+ * The table of a JSON text, the caller's; null when the text is no JSON
+ * object. Entries with equal attributes share them: what is read is not to be
+ * changed.
+ */
+json_object *parse_file_info_table(const char *text);
+
 /* ---- walk.cpp ---- */
 
 /** Modes, owners and labels of the whole package from the unpacked table. @return 1, 0 */

@@ -179,7 +179,7 @@ JsonPtr read_table(const std::string &path) {
   char *raw = nullptr;
   const bool read = read_data_from_file(path.c_str(), &raw);
   const CString text(raw);
-  return JsonPtr(read ? json_tokener_parse(text.get()) : nullptr);
+  return JsonPtr(read ? parse_file_info_table(text.get()) : nullptr);
 }
 
 /**
@@ -231,7 +231,7 @@ void put_object_back(int root, const char *key, json_object *entry) {
  */
 void put_attributes_back(json_object *table, const char *root) {
   const UniqueFd dir = safe_open(root, O_PATH | O_DIRECTORY);
-  if (!dir || !json_object_is_type(table, json_type_object)) return;
+  if (!dir || table == nullptr) return;
   json_object_object_foreach(table, key, entry) {
     restore_step("rollback-attributes");
     if (json_object_is_type(entry, json_type_object)) put_object_back(dir.get(), key, entry);

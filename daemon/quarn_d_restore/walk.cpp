@@ -109,12 +109,9 @@ JsonPtr take_table(const std::string &path) {
     delete_file(path.c_str());
     return nullptr;
   }
-  JsonPtr table(json_tokener_parse(text.get()));
+  JsonPtr table(parse_file_info_table(text.get()));
   delete_file(path.c_str());
-  if (!json_object_is_type(table.get(), json_type_object)) {
-    LOGE("cannot read json info...");
-    return nullptr;
-  }
+  if (table == nullptr) LOGE("cannot read json info...");
   return table;
 }
 
