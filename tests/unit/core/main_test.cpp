@@ -115,6 +115,9 @@ int quarnd_restore_enable(int on, int client, const char *, const char *, void *
 }
 void quit_nested_loops() { step("quit_nested_loops"); }
 
+/** The program's own. */
+int quarnd_main();
+
 namespace {
 
 class Main : public ::testing::Test {
@@ -170,6 +173,13 @@ TEST_F(Main, WithoutAnAccountNothingIsStarted) {
 TEST_F(Main, AnswersTheExitCodeOfARestartRequest) {
   in_loop = [] { quarn_exit_code = -1; };
   EXPECT_EQ(quarn_run(), -1);
+}
+
+TEST_F(Main, ProcessStatusIsZeroOr255WhenARestartIsWanted) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(quarnd_main(), ::testing::ExitedWithCode(0), "");
+  in_loop = [] { quarn_exit_code = -1; };
+  EXPECT_EXIT(quarnd_main(), ::testing::ExitedWithCode(255), "");
 }
 
 TEST_F(Main, HandlersStandAgainAfterEcoreHasReplacedThem) {
