@@ -17,7 +17,16 @@ extern int quarn_exit_code;
  */
 void request_quarn_terminate(double delay, bool restart);
 
-/** Drop a pending terminate timer. */
+/**
+ * Keep requests at once back until release_quarn_terminate(): a daemon that was
+ * started by the bus and ends before it owns its name leaves the bus waiting
+ * for it, and every caller with it.
+ */
+void hold_quarn_terminate();
+/** Carry out the request that was kept back, if there is one and the daemon is idle. */
+void release_quarn_terminate();
+
+/** Drop a pending terminate timer, and a request that is kept back. */
 void cancel_quarn_terminate();
 
 /** Timer callback of a delayed request; returns 0 (do not repeat). */

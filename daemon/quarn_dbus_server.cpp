@@ -408,10 +408,12 @@ void _dbus_on_bus_acquired(GDBusConnection *connection, const gchar *, gpointer 
 
 void _dbus_on_name_acquired(GDBusConnection *, const gchar *name, gpointer) {
   LOGI("Acquired the name %s", name);
+  release_quarn_terminate();
 }
 
 void _dbus_on_name_lost(GDBusConnection *, const gchar *name, gpointer) {
   LOGI("Lost the name %s", name);
+  release_quarn_terminate();
 }
 
 }  // namespace
@@ -425,11 +427,13 @@ unsigned int quarnd_dbus_init() {
     LOGE("g_dbus_node_info_new_for_xml() Fail(%s)", error ? error->message : "");
     return kNoOwner;
   }
+  hold_quarn_terminate();
   const guint owner_id = g_bus_own_name(
       G_BUS_TYPE_SYSTEM, kQuarnBusName, G_BUS_NAME_OWNER_FLAGS_REPLACE, _dbus_on_bus_acquired,
       _dbus_on_name_acquired, _dbus_on_name_lost, node, unref_node);
   if (owner_id == 0) {
     g_dbus_node_info_unref(node);
+    release_quarn_terminate();
     LOGE("g_bus_own_name() Fail");
   }
   return owner_id;

@@ -14,6 +14,9 @@
 
 using Arguments = std::vector<std::string>;
 
+/** Owner of the alarms that the daemon is started for. */
+inline constexpr char kAlarmOwner[] = "quarn";
+
 /** Exit codes of the tool. */
 enum device_exit : int {
   DEVICE_OK = 0,
@@ -40,9 +43,6 @@ std::string bus_address(const std::string &device);
 
 /** The text of errno. */
 std::string reason();
-
-/** Start the daemon through the device's bus; fails when the bus does not answer. */
-void start_daemon(const std::string &device);
 
 /* lifecycle.cpp */
 int verb_start(const Arguments &arguments);

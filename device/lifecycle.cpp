@@ -41,7 +41,6 @@ constexpr char kAppsPath[] = "/opt/usr/apps";
 constexpr char kTmpPath[] = "/tmp";
 constexpr char kBusName[] = "org.orvane.Quarn";
 /** Owner of the alarms that start the daemon. */
-constexpr char kAlarmOwner[] = "quarn";
 /** What the daemon makes below /tmp: it is the device's own, whatever the host has there. */
 constexpr char kDaemonTmpEntry[] = "quarn";
 constexpr char kSupervisorFile[] = "run/supervisor";
@@ -344,6 +343,15 @@ struct Running {
 };
 
 void wake_daemon(Running *self) {
+  // A daemon that runs takes the alarm by itself; one that ends without is seen by its name.
+  GVariant *reply =
+      call_bus(self->connection.get(), "NameHasOwner", g_variant_new("(s)", kBusName), nullptr);
+  gboolean running = FALSE;
+  if (reply != nullptr) {
+    g_variant_get(reply, "(b)", &running);
+    g_variant_unref(reply);
+  }
+  if (running != FALSE) return;
   // Nobody waits for the answer: a daemon that does not want to run ends by itself.
   g_dbus_connection_call(self->connection.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
                          "org.freedesktop.DBus", "StartServiceByName",
@@ -589,19 +597,6 @@ std::string bus_address(const std::string &device) {
 bool is_started(const std::string &device) {
   Supervisor supervisor;
   return find_supervisor(device, &supervisor);
-}
-
-void start_daemon(const std::string &device) {
-  const Connection connection = connect_bus(device);
-  GError *error = nullptr;
-  GVariant *reply =
-      call_bus(connection.get(), "StartServiceByName", g_variant_new("(su)", kBusName, 0U), &error);
-  if (reply == nullptr) {
-    const std::string text = error->message;
-    g_error_free(error);
-    throw Failure("the daemon could not be started: " + text);
-  }
-  g_variant_unref(reply);
 }
 
 int verb_start(const Arguments &arguments) {

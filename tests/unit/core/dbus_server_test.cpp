@@ -69,6 +69,8 @@ void request_quarn_terminate(double delay, bool restart) {
   note("terminate " + number(static_cast<int>(delay)) + (restart ? " restart" : ""));
 }
 void cancel_quarn_terminate() { steps.emplace_back("cancel"); }
+void hold_quarn_terminate() {}
+void release_quarn_terminate() {}
 int quarnd_backup_enable(int on) { return note("backup_enable " + number(on)); }
 int quarnd_get_last_backed_up_time(unsigned long long *timestamp) {
   *timestamp = 0x8000000000000001ULL;

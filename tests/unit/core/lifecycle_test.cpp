@@ -111,6 +111,34 @@ TEST_F(Lifecycle, CancelWithoutATimerDoesNothing) {
   EXPECT_EQ(quits, 0);
 }
 
+TEST_F(Lifecycle, RequestWhileTheNameIsAskedForWaitsForIt) {
+  hold_quarn_terminate();
+  request_quarn_terminate(0.0, true);
+  EXPECT_EQ(quits, 0);
+  release_quarn_terminate();
+  EXPECT_EQ(quits, 1);
+  EXPECT_EQ(quarn_exit_code, -1);
+  release_quarn_terminate();
+  EXPECT_EQ(quits, 1);
+}
+
+TEST_F(Lifecycle, RequestThatWaitedIsDroppedWhenTheDaemonIsBusyByThen) {
+  hold_quarn_terminate();
+  request_quarn_terminate(0.0, false);
+  idle = false;
+  release_quarn_terminate();
+  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(count_logged(DLOG_INFO, "Not in idle state"), 1);
+}
+
+TEST_F(Lifecycle, CallDropsARequestThatWaits) {
+  hold_quarn_terminate();
+  request_quarn_terminate(0.0, false);
+  cancel_quarn_terminate();
+  release_quarn_terminate();
+  EXPECT_EQ(quits, 0);
+}
+
 TEST_F(Lifecycle, RequestWhileBusyChangesNothingNotEvenTheExitCode) {
   request_quarn_terminate(5.0, true);
   const Timer *pending = timers[0];
