@@ -22,6 +22,7 @@ namespace quarn_client {
 namespace {
 
 constexpr int kMsPerSecond = 1000;
+constexpr guint kGraceMs = 1000;
 constexpr int kCloudClient = 0;
 constexpr int kOn = 1;
 constexpr int kOff = 0;
@@ -79,6 +80,7 @@ class Session {
 
   void watch();
   void check_watch();
+  bool all_told() const;
   void end_watch(bool mode_ended);
   int watched_result() const;
   bool has_archive(const std::string &package) const;
@@ -94,6 +96,7 @@ class Session {
 
   static gboolean on_interrupt(gpointer user_data);
   static gboolean on_timeout(gpointer user_data);
+  static gboolean on_grace_end(gpointer user_data);
 
   const Command &command_;
   Screen screen_;
@@ -115,6 +118,7 @@ class Session {
   bool at_once_ = false;
   int exit_ = QUARN_FAILED;
   guint timer_ = 0;
+  guint grace_ = 0; /**< every package is done, and the daemon's last message is still to come */
 };
 
 Session::Session(const Command &command)
@@ -139,6 +143,7 @@ int Session::run() {
   if (!done_) g_main_loop_run(loop_.get());
   if (!at_once_) client_->flush();
   disarm_timer();
+  if (grace_ != 0) g_source_remove(grace_);
   for (const guint source : sources) g_source_remove(source);
   client_.reset();
   // What was in flight ends with its cancellation, which the loop has to deliver.
@@ -454,11 +459,22 @@ void Session::watch() {
   check_watch();
 }
 
+bool Session::all_told() const {
+  return std::all_of(expected_.begin(), expected_.end(),
+                     [this](const auto &package) { return board_.outcome_of(package) != nullptr; });
+}
+
 void Session::check_watch() {
-  const bool all = std::all_of(expected_.begin(), expected_.end(), [this](const auto &package) {
-    return board_.outcome_of(package) != nullptr;
-  });
-  if (all) end_watch(false);
+  if (grace_ != 0 || !all_told()) return;
+  // The daemon says so itself when restore mode is over, which it is about to be.
+  grace_ = g_timeout_add(kGraceMs, on_grace_end, this);
+}
+
+gboolean Session::on_grace_end(gpointer user_data) {
+  auto *self = static_cast<Session *>(user_data);
+  self->grace_ = 0;
+  if (!self->done_) self->end_watch(false);
+  return G_SOURCE_REMOVE;
 }
 
 bool Session::has_archive(const std::string &package) const {
@@ -493,6 +509,7 @@ void Session::end_watch(bool mode_ended) {
 
 void Session::daemon_ended() {
   if (done_ || !called_) return;
+  if (watching_ && all_told()) return end_watch(false);
   if (watching_) {
     std::string missing;
     for (const std::string &package : expected_) {

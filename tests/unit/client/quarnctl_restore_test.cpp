@@ -61,6 +61,10 @@ class QuarnctlRestore : public ::testing::Test {
   void tell_raw(const std::string &members) {
     daemon_->publish(R"({"kind":"restore",)" + members + "}");
   }
+  /** Ends restore mode, as the daemon does when the last package is done. */
+  void stop(const IncomingCall &call) const {
+    call.call_back("restore_enable_cb", text_arguments(0, "restore_stop", req_));
+  }
   void tell_restored(const std::string &package) {
     tell(package, R"("outcome":"restored","result":0)");
   }
@@ -131,12 +135,13 @@ TEST_F(QuarnctlRestore, OffTurnsTheModeOff) {
 }
 
 TEST_F(QuarnctlRestore, WatchEndsWhenEveryPackageIsToldOf) {
-  enabled_ = [&](const IncomingCall &) {
+  enabled_ = [&](const IncomingCall &call) {
     tell_raw(R"("stage":"downloading","package":"org.example.notes")");
     tell("org.example.chess", R"("outcome":"failed","result":12)");
     tell_restored("org.example.notes");
     tell_restored("org.example.photos");
     tell("org.example.bank", R"("outcome":"skipped","result":41)");
+    stop(call);
   };
   const Outcome outcome = run({"restore", "on", "--from", kSerial, "--watch"});
   EXPECT_EQ(outcome.exit, 0) << "a package without an archive cannot come back";
@@ -157,14 +162,16 @@ TEST_F(QuarnctlRestore, WatchTakesASignalThatComesBeforeTheReply) {
     req_ = call.req_id();
     tell_restored("org.example.notes");
     call.reply(0);
+    stop(call);
   });
   EXPECT_EQ(run({"restore", "on", "--from", kSerial, "org.example.notes", "--watch"}).exit, 0);
 }
 
 TEST_F(QuarnctlRestore, WatchExitsWithTheResultOfTheFirstPackageThatFailed) {
-  enabled_ = [&](const IncomingCall &) {
+  enabled_ = [&](const IncomingCall &call) {
     tell("org.example.photos", R"("outcome":"rolled-back","result":36)");
     tell("org.example.notes", R"("outcome":"failed","result":12)");
+    stop(call);
   };
   const Outcome outcome = run(
       {"restore", "on", "--from", kSerial, "--watch", "org.example.photos", "org.example.notes"});
@@ -175,7 +182,10 @@ TEST_F(QuarnctlRestore, WatchExitsWithTheResultOfTheFirstPackageThatFailed) {
 }
 
 TEST_F(QuarnctlRestore, AFailureThatNamesNoResultExitsWith42) {
-  enabled_ = [&](const IncomingCall &) { tell("org.example.notes", R"("outcome":"failed")"); };
+  enabled_ = [&](const IncomingCall &call) {
+    tell("org.example.notes", R"("outcome":"failed")");
+    stop(call);
+  };
   EXPECT_EQ(run({"restore", "on", "--from", kSerial, "--watch", "org.example.notes"}).exit,
             QUARN_FAILED);
 }
@@ -183,7 +193,7 @@ TEST_F(QuarnctlRestore, AFailureThatNamesNoResultExitsWith42) {
 TEST_F(QuarnctlRestore, WatchEndsWithTheModeAndNamesWhatWasNotInstalled) {
   enabled_ = [&](const IncomingCall &call) {
     tell_restored("org.example.notes");
-    call.call_back("restore_enable_cb", text_arguments(0, "restore_stop", req_));
+    stop(call);
   };
   const Outcome outcome = run({"restore", "on", "--from", kSerial, "--watch"});
   EXPECT_EQ(outcome.exit, QUARN_CANCELLED);
@@ -193,10 +203,24 @@ TEST_F(QuarnctlRestore, WatchEndsWithTheModeAndNamesWhatWasNotInstalled) {
       << outcome.out;
 }
 
+TEST_F(QuarnctlRestore, WatchEndsWithoutTheDaemonsLastMessageWhenEveryPackageIsToldOf) {
+  for (const bool daemon_ends : {false, true}) {
+    if (!daemon_) SetUp();
+    enabled_ = [&, daemon_ends](const IncomingCall &) {
+      tell_restored("org.example.notes");
+      if (daemon_ends) daemon_->die();
+    };
+    EXPECT_EQ(run({"restore", "on", "--from", kSerial, "--watch", "org.example.notes"}).exit, 0);
+    daemon_.reset();
+  }
+}
+
 TEST_F(QuarnctlRestore, MessagesOfTheDaemonAreShown) {
   enabled_ = [&](const IncomingCall &call) {
-    call.call_back("restore_enable_cb", text_arguments(12, "no\u202eway", req_),
-                   [&] { tell_restored("org.example.notes"); });
+    call.call_back("restore_enable_cb", text_arguments(12, "no\u202eway", req_), [&, call] {
+      tell_restored("org.example.notes");
+      stop(call);
+    });
   };
   const Outcome outcome = run({"restore", "on", "--from", kSerial, "--watch", "org.example.notes"});
   EXPECT_NE(outcome.out.find("no\\u{202e}way: the transfer failed or Wi-Fi was lost (12)\n"),
@@ -254,6 +278,7 @@ TEST_F(QuarnctlRestore, ProgressIsABarOnATerminal) {
     req_ = call.req_id();
     call.reply(0);
     tell_restored("org.example.photos");
+    stop(call);
   });
   const Outcome outcome = QuarnctlRun(*bus_,
                                       {"restore", "on", "--from", kSerial, "--watch",
