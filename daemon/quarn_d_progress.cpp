@@ -189,6 +189,7 @@ std::string restore_progress_text(const restore_progress &progress) {
   put(root, "stage", stage_name(progress.stage));
   put(root, "package", progress.package);
   put(root, "outcome", word(progress.outcome));
+  if (progress.size != 0) put(root, "size", progress.size);
   if (progress.stage == restore_stage::finished) put(root, "result", progress.result);
   return text_of(root);
 }
@@ -213,6 +214,7 @@ void note_restore_progress(const restore_progress &progress) {
 
 void quarnd_progress_init() {
   set_backup_progress_sink(note_backup_progress);
+  set_backup_end_observer(quarnd_status_refresh);
   set_restore_progress_sink(note_restore_progress);
   set_setting_observer(quarnd_status_refresh);
 }

@@ -151,8 +151,9 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (ctx->cur_crc != 0 && ctx->cur_crc == get_previous_crc_value(ctx)) {
     LOGI("same backup for (%s) already exist in cloud!(crc : %d)", ctx->cur_pkg_id.c_str(),
          ctx->cur_crc);
+    const std::uint64_t size = staged_file_size(archive_path);
     delete_staged_file(archive_path);
-    report_package(ctx, backup_outcome::unchanged);
+    report_package(ctx, backup_outcome::unchanged, size);
     return QUARN_UNCHANGED;
   }
   LOGI("app data of (%s) was changed, so will be backed up", ctx->cur_pkg_id.c_str());

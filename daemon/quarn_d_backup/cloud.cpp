@@ -143,7 +143,7 @@ void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
     set_result_once(ctx, QUARN_TRANSFER_FAILED);
   }
   ++ctx->uploads_answered;
-  report_progress(ctx, backup_stage::uploading, record->pkg_id.c_str(), outcome);
+  report_progress(ctx, backup_stage::uploading, record->pkg_id.c_str(), outcome, record->size);
   delete_staged_file(record->local_path);
   release_staged_archive(ctx, record->pkg_id);
   if (--ctx->upload_remain == 0 && ctx->single_package) {
@@ -432,7 +432,8 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   set_result_once(ctx, QUARN_TRANSFER_FAILED);
   release_staged_archive(ctx, record->pkg_id);
   ++ctx->uploads_answered;
-  report_progress(ctx, backup_stage::uploading, pkg_id, backup_outcome::upload_failed);
+  report_progress(ctx, backup_stage::uploading, pkg_id, backup_outcome::upload_failed,
+                  record->size);
   --ctx->upload_remain;
 }
 

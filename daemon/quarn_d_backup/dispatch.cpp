@@ -34,6 +34,13 @@ std::atomic<int> outstanding_requests{0};
 
 std::atomic<int (*)()> wifi_probe{nullptr};
 
+std::atomic<backup_end_observer> end_observer{nullptr};
+
+void end_request() {
+  --outstanding_requests;
+  if (const backup_end_observer observer = end_observer) observer();
+}
+
 enum class Taken { kNothing, kRequest };
 
 Taken take_request(void **client) {
@@ -55,7 +62,7 @@ void answer_cancelled_clients() {
   }
   for (void *client : clients) {
     quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
-    --outstanding_requests;
+    end_request();
   }
 }
 
@@ -92,7 +99,7 @@ void *backup_req_dispatch_thread(void *) {
       run_request(client);
       g_is_backing_up = false;
       request_power_lock(false);
-      --outstanding_requests;
+      end_request();
       malloc_trim(kKeepNothing);
     }
     std::unique_lock<std::mutex> lock(backup_req_cond_mutex);
@@ -106,6 +113,8 @@ void wake_worker() {
 }
 
 }  // namespace
+
+void set_backup_end_observer(backup_end_observer observer) { end_observer = observer; }
 
 void init_backup_req_dispatch_thread() {
   LOGI("init_backup_req_dispatch_thread");

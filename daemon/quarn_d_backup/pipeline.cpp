@@ -178,6 +178,8 @@ void drop_unsent_archives(backup_context *ctx) {
 }
 
 void report_to_client(backup_context *ctx, int status) {
+  // before the status: with that a client stops listening
+  report_progress(ctx, backup_stage::finished);
   quarn_dbus_manual_backup_status(ctx->result, status, ctx->client);
   ctx->client = nullptr;  // the final status deletes the record
 }
@@ -204,6 +206,7 @@ void finish_auto_backup(backup_context *ctx) {
   } else {
     LOGE("auto backup couldn't be completed... cause=%d", ctx->result.load());
   }
+  report_progress(ctx, backup_stage::finished);
 }
 
 }  // namespace
@@ -231,7 +234,6 @@ void finish_backup(backup_context *ctx) {
   }
   delete_backup_items(ctx);
   ctx->finished = true;
-  report_progress(ctx, backup_stage::finished);
 }
 
 void delete_backup_items(backup_context *ctx) {

@@ -146,7 +146,7 @@ struct backup_progress {
   std::int32_t count = 0; /**< packages in this stage, 0 while unknown */
   std::uint64_t bytes_done = 0;
   std::uint64_t bytes_total = 0;
-  std::uint64_t size = 0;  /**< bytes of data, for too_large and no_space */
+  std::uint64_t size = 0;  /**< bytes: of data for too_large and no_space, else of the archive */
   std::uint64_t limit = 0; /**< what it exceeded */
   std::int32_t result = 0; /**< result of the run, for finished */
 };
@@ -159,6 +159,10 @@ using backup_progress_sink = void (*)(const backup_progress &progress);
 void set_backup_progress_sink(backup_progress_sink sink);
 
 /* ---- dispatch.cpp ----------------------------------------------------------- */
+
+using backup_end_observer = void (*)();
+/** Follow the ends of requests: called on the worker when nothing of one is left; null ends it. */
+void set_backup_end_observer(backup_end_observer observer);
 
 /** A manual backup was cancelled; cleared by the next manual request. */
 extern std::atomic<bool> manual_backup_canceled;

@@ -5,6 +5,7 @@
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 std::vector<std::string> pkg_list_to_be_restored;
@@ -30,6 +31,11 @@ std::list<RequestPtr> waiting;
 
 bool is_running(const std::string &pkgid) {
   return std::find(running.begin(), running.end(), pkgid) != running.end();
+}
+
+std::uint64_t archive_size(const std::string &path) {
+  struct stat status = {};
+  return safe_lstat(path.c_str(), &status) == 0 ? static_cast<std::uint64_t>(status.st_size) : 0;
 }
 
 void remove_download(const std::string &path) {
@@ -98,10 +104,10 @@ void accept_restore(pkg_restore_context *ctx) {
 
 void start_next(const std::string &pkgid);
 
-void finish_restore(pkg_restore_context *ctx, restore_outcome outcome) {
+void finish_restore(pkg_restore_context *ctx, restore_outcome outcome, std::uint64_t size = 0) {
   const std::string pkgid = ctx->pkgid;
   const bool monitored = !ctx->wait_for_result;
-  report_restore_end(pkgid, outcome, ctx->result);
+  report_restore_end(pkgid, outcome, ctx->result, size);
   check_package_restore_complete(ctx);
   if (monitored) count_outstanding_restore(-1);
   start_next(pkgid);
@@ -117,15 +123,17 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
   pkg_restore_context *ctx = request->ctx;
   running.erase(std::find(running.begin(), running.end(), ctx->pkgid));
   restore_outcome outcome = restore_outcome::failed;
+  std::uint64_t size = 0;
   if (error != BACKUP_TRANS_ERROR_NONE) {
     LOGE("download app data of (%s) failed...err_code[%d]", ctx->pkgid.c_str(), error);
     ctx->result = QUARN_TRANSFER_FAILED;
   } else {
     LOGI("backup trans success : download for (%s)", ctx->pkgid.c_str());
+    size = archive_size(request->local_path);
     outcome = restore_from_archive(ctx, request->local_path);
   }
   remove_download(request->local_path);
-  finish_restore(ctx, outcome);
+  finish_restore(ctx, outcome, size);
 }
 
 /** Hand the request to the transport, or tell its context that it was refused. */
@@ -179,14 +187,18 @@ int restore_from_cloud(pkg_restore_context *ctx) {
   return QUARN_OK;
 }
 
+std::string companion_archive(const pkg_restore_context &ctx) {
+  return std::string(kAppsDir) + kPellixPackage + "/shared/data/" + ctx.pkgid + "_" + ctx.version +
+         ".zip";
+}
+
 int unpack_from_companion(pkg_restore_context *ctx, bool *restored) {
   const char *pkgid = ctx->pkgid.c_str();
   if (!is_safe_path_component(ctx->pkgid) || !is_safe_path_component(ctx->version)) {
     LOGE("refused : not an archive name (%s, %s)", pkgid, ctx->version.c_str());
     return QUARN_REFUSED;
   }
-  const std::string archive = std::string(kAppsDir) + kPellixPackage + "/shared/data/" +
-                              ctx->pkgid + "_" + ctx->version + ".zip";
+  const std::string archive = companion_archive(*ctx);
   const std::lock_guard<std::mutex> lock(package_data_mutex);
   report_restore_step(ctx->pkgid, restore_stage::unpacking);
   const int result = unpack(*ctx, archive);
@@ -213,7 +225,7 @@ int restore_from_companion(pkg_restore_context *ctx) {
   LOGI("restore_app_data for %s complete", ctx->pkgid.c_str());
   const int reported = result == QUARN_OK && !restored ? QUARN_REFUSED : result;
   report_restore_end(ctx->pkgid, restored ? restore_outcome::restored : restore_outcome::failed,
-                     reported);
+                     reported, result == QUARN_OK ? archive_size(companion_archive(*ctx)) : 0);
   check_package_restore_complete(ctx);
   return result;
 }

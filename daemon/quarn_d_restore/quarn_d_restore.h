@@ -149,6 +149,7 @@ struct restore_progress {
   restore_stage stage = restore_stage::downloading;
   restore_outcome outcome = restore_outcome::none; /**< settled with restore_stage::finished */
   int result = QUARN_OK;                           /**< result code, 0 while running */
+  std::uint64_t size = 0;                          /**< bytes of the archive, 0 without one */
 };
 using restore_progress_sink = void (*)(const restore_progress &progress);
 
@@ -156,7 +157,8 @@ using restore_progress_sink = void (*)(const restore_progress &progress);
 void set_restore_progress_sink(restore_progress_sink sink);
 /** Tell the sink, if there is one, of a step or of the end of a package's restore. */
 void report_restore_step(const std::string &package, restore_stage stage);
-void report_restore_end(const std::string &package, restore_outcome outcome, int result);
+void report_restore_end(const std::string &package, restore_outcome outcome, int result,
+                        std::uint64_t size = 0);
 /** Keep the record of the client that switched restore mode on, in place of an earlier one. */
 void keep_restore_record(void *record);
 /**

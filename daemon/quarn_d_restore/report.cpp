@@ -42,12 +42,13 @@ void set_restore_progress_sink(restore_progress_sink sink) { progress_sink = sin
 
 void report_restore_step(const std::string &package, restore_stage stage) {
   if (progress_sink == nullptr) return;
-  progress_sink({package.c_str(), stage, restore_outcome::none, QUARN_OK});
+  progress_sink({package.c_str(), stage, restore_outcome::none, QUARN_OK, 0});
 }
 
-void report_restore_end(const std::string &package, restore_outcome outcome, int result) {
+void report_restore_end(const std::string &package, restore_outcome outcome, int result,
+                        std::uint64_t size) {
   if (progress_sink == nullptr) return;
-  progress_sink({package.c_str(), restore_stage::finished, outcome, result});
+  progress_sink({package.c_str(), restore_stage::finished, outcome, result, size});
 }
 
 void keep_restore_record(void *record) {

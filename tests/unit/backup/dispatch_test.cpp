@@ -111,6 +111,26 @@ TEST_F(Dispatch, AutomaticRequestWithoutWifiIsDroppedSilently) {
   EXPECT_EQ(info("auto backup successful!"), 1);
 }
 
+std::atomic<int> ends_seen{0};
+
+TEST_F(Dispatch, TheEndOfARequestIsToldWhenNothingOfItIsLeft) {
+  ends_seen = 0;
+  set_backup_end_observer([] {
+    if (!backup_request_outstanding()) ++ends_seen;
+  });
+  request_backup(nullptr);
+  finish();
+  run_until([] { return ends_seen == 1; });
+  run_one(1);
+  request_backup(new_client(2));
+  cancel_backup(nullptr);
+  held_ = false;
+  finish();
+  run_until([] { return ends_seen == 2; });
+  set_backup_end_observer(nullptr);
+  EXPECT_EQ(sent_statuses().size(), 2U);
+}
+
 TEST_F(Dispatch, UnknownWifiIsNone) {
   set_backup_wifi_probe(nullptr);
   EXPECT_EQ(backup_wifi_connected(), 0);

@@ -638,6 +638,7 @@ TEST_F(Progress, TellsStagesAndPackagesInOrder) {
   EXPECT_EQ(upload.count, 1);
   EXPECT_EQ(upload.bytes_total, cloud_.objects[a.object()].size());
   EXPECT_EQ(upload.bytes_done, upload.bytes_total);
+  EXPECT_EQ(upload.size, upload.bytes_total);
   EXPECT_EQ(seen_progress[2].index, 1);
   for (const auto &progress : seen_progress) EXPECT_EQ(progress.run, seen_progress[0].run);
   EXPECT_EQ(seen_progress.back().result, 0);
@@ -659,7 +660,7 @@ TEST_F(Progress, TellsWhyAPackageWasNotUploaded) {
   const FakePackage &unreadable = install("org.unreadable");
   std::filesystem::remove_all(unreadable.root + "/data");
   const FakePackage &refused = install("org.refused");
-  install("org.same");
+  const FakePackage &same = install("org.same");
   cloud_.refuse = [&](Op, const std::string &path) { return path == refused.object() ? 1 : 0; };
   automatic();
   EXPECT_EQ(of("org.external").outcome, backup_outcome::external);
@@ -678,6 +679,7 @@ TEST_F(Progress, TellsWhyAPackageWasNotUploaded) {
   seen_packages.clear();
   automatic();
   EXPECT_EQ(of("org.same").outcome, backup_outcome::unchanged);
+  EXPECT_EQ(of("org.same").size, cloud_.objects[same.object()].size());
 }
 
 TEST_F(Progress, TellsSizeAndFreeSpaceOfAPackageThatDoesNotFit) {
@@ -688,6 +690,21 @@ TEST_F(Progress, TellsSizeAndFreeSpaceOfAPackageThatDoesNotFit) {
   EXPECT_EQ(of("org.app").outcome, backup_outcome::no_space);
   EXPECT_EQ(of("org.app").size, size);
   EXPECT_GT(of("org.app").limit, 0U);
+}
+
+TEST_F(Progress, TheEndOfARunIsToldBeforeItsClientHearsOfIt) {
+  std::vector<backup_stage> told;
+  std::vector<int> results;
+  set_status_hook([&](int, int) {
+    told.push_back(seen_progress.back().stage);
+    results.push_back(seen_progress.back().result);
+  });
+  manual();
+  fake_wifi = 0;
+  manual();
+  set_status_hook(nullptr);
+  EXPECT_THAT(told, ElementsAre(backup_stage::finished, backup_stage::finished));
+  EXPECT_THAT(results, ElementsAre(0, 12));
 }
 
 TEST_F(Progress, NoSinkIsNotCalled) {

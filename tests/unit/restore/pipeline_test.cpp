@@ -21,6 +21,7 @@ struct Seen {
   Stage stage;
   Outcome outcome;
   int result;
+  std::uint64_t size;
 };
 std::vector<Seen> progress;
 
@@ -29,7 +30,7 @@ class PipelineTest : public RestoreTest {
   PipelineTest() {
     progress.clear();
     set_restore_progress_sink([](const restore_progress &step) {
-      progress.push_back({step.package, step.stage, step.outcome, step.result});
+      progress.push_back({step.package, step.stage, step.outcome, step.result, step.size});
     });
     ON_CALL(platform, pkgmgr_client_new).WillByDefault([](auto) {
       static char client[1];
@@ -321,9 +322,11 @@ TEST_F(PipelineTest, ProgressIsToldStepByStep) {
   auto ctx = waiting_context();
   ASSERT_EQ(restore(ctx.get()), 0);
   make_archive(download(), new_data);
+  const auto size = std::filesystem::file_size(download());
   answer();
   EXPECT_EQ(stages(), (std::vector<Stage>{Stage::downloading, Stage::snapshot, Stage::unpacking,
                                           Stage::attributes, Stage::finished}));
+  EXPECT_EQ(progress.back().size, size);
   EXPECT_EQ(progress.back().package, kPkg);
   EXPECT_EQ(progress.back().outcome, Outcome::restored);
   EXPECT_EQ(progress.back().result, 0);
@@ -341,6 +344,7 @@ TEST_F(PipelineTest, ProgressIsToldStepByStep) {
   answer(BACKUP_TRANS_ERROR_NETWORK);
   EXPECT_EQ(progress.back().outcome, Outcome::failed);
   EXPECT_EQ(progress.back().result, 12);
+  EXPECT_EQ(progress.back().size, 0U);
 }
 
 /* ---- from the phone-transfer companion ---- */
@@ -376,6 +380,7 @@ TEST_F(CompanionTest, RestoresAtOnceAndKeepsTheArchive) {
   EXPECT_EQ(ctx->pending, -1);
   EXPECT_TRUE(shown.empty());
   EXPECT_EQ(progress.back().outcome, Outcome::restored);
+  EXPECT_EQ(progress.back().size, std::filesystem::file_size(archive()));
 }
 
 TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAtMinusOne) {
