@@ -1,0 +1,186 @@
+"""quarnctl against the real daemon on an embedded device."""
+import json
+import os
+import pty
+import signal
+import subprocess
+import sys
+import unittest
+
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+from quarn_test import TestCase, make_source  # noqa: E402
+
+SERIAL = "350000000000017"
+OTHER = "350000000000025"
+NOTES = "org.example.notes"
+BANK = "org.example.bank"
+
+
+class QuarnctlTest(TestCase):
+
+    def setUp(self):
+        self.device = self.new_device(model="Orvane One", serial=SERIAL, account="ada")
+        self.device.start()
+
+    def install(self, device, package, data=True, metadata=None, **files):
+        content = {"data/file": os.urandom(3000)} if data else {}
+        device.install(make_source(self.path("src-%s-%d" % (package, data)), package, "1.0",
+                                   content, metadata=metadata))
+
+    def quarnctl(self, *arguments, device=None, status=0):
+        result = (device or self.device).quarnctl(*arguments, check=False)
+        self.assertEqual(result.returncode, status, result.stdout + result.stderr)
+        return result
+
+    def document(self, *arguments, **keywords):
+        return json.loads(self.quarnctl(*arguments, "--json", **keywords).stdout)
+
+    def test_a_backup_tells_what_became_of_each_package(self):
+        self.install(self.device, NOTES)
+        self.install(self.device, BANK, metadata={"backup": "disable"})
+        first = {entry["package"]: entry for entry in self.document("backup")["packages"]}
+        self.assertEqual(first[NOTES]["outcome"], "uploaded")
+        archive = os.path.join(self.device.cloud, SERIAL, NOTES, "1.0", NOTES + ".zip")
+        self.assertEqual(first[NOTES]["size"], os.path.getsize(archive))
+        self.assertEqual((first[BANK]["outcome"], first[BANK]["reason"]), ("skipped", "disabled"))
+        second = self.quarnctl("backup").stdout
+        self.assertIn("%s: unchanged (the cloud holds it already)\n" % NOTES, second)
+        self.assertIn("\nbackup finished\n", second)
+        self.assertTrue(second.endswith("backup succeeded\n"), second)
+
+    def test_list_and_sets_show_what_stands_in_the_cloud(self):
+        self.install(self.device, NOTES)
+        empty = self.quarnctl("list", status=1)
+        self.assertIn("holds no application list yet", empty.stderr)
+        self.quarnctl("backup")
+        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
+            entry = json.load(file)["model_list"][0]
+        device = self.document("list")["devices"][0]
+        self.assertEqual(device["serial"], SERIAL)
+        self.assertEqual(device["model"], "Orvane One")
+        self.assertEqual(device["time_ms"], entry["backup_info"]["timestamp"])
+        self.assertEqual(device["packages"], [{"package": NOTES, "version": "1.0",
+                                               "crc": entry["pkg_list"][0]["crc"]}])
+        self.assertIn(SERIAL, self.quarnctl("sets").stdout)
+
+    def test_without_wifi_the_result_is_told_in_words(self):
+        self.install(self.device, NOTES)
+        self.device.set("network", "none")
+        result = self.quarnctl("backup", status=33)
+        self.assertIn("no Wi-Fi, or no session with the cloud (33)", result.stderr)
+
+    def test_without_an_account_the_daemon_is_said_to_end_at_once(self):
+        device = self.new_device(serial=OTHER, account=None)
+        device.start()
+        result = self.quarnctl("activate", device=device, status=69)
+        self.assertIn("no cloud account is signed in", result.stderr)
+
+    def test_requests_for_one_package_exit_with_their_results(self):
+        self.install(self.device, NOTES)
+        self.install(self.device, BANK, metadata={"backup": "disable"})
+        self.quarnctl("app", "backup", NOTES)
+        path = self.device.app_path(NOTES, "data/file")
+        with open(path, "rb") as file:
+            before = file.read()
+        with open(path, "wb") as file:
+            file.write(b"spoiled")
+        self.quarnctl("app", "restore", NOTES)
+        with open(path, "rb") as file:
+            self.assertEqual(file.read(), before)
+        self.quarnctl("app", "backup", BANK, status=41)
+        self.quarnctl("app", "restore", BANK, status=41)
+        self.quarnctl("app", "backup", "org.example.none", status=1)
+        self.quarnctl("app", "export", "org.example.none", status=36)
+        exported = self.quarnctl("app", "export", NOTES).stdout.strip()
+        self.assertEqual(exported, "/tmp/%s_tmp.zip" % NOTES)
+        self.device.exec("unzip", "-tqq", exported)
+
+    def test_watching_follows_a_restore_to_its_end(self):
+        self.install(self.device, NOTES)
+        self.install(self.device, BANK, metadata={"backup": "disable"})
+        self.quarnctl("backup")
+        second = self.new_device(model="Orvane Two", serial=OTHER, account="ada",
+                                 cloud="file://" + self.device.cloud)
+        second.start()
+        self.quarnctl("restore", "on", "--from", "nobody", device=second, status=1)
+        watcher = subprocess.Popen(
+            [second.tool, "exec", second.path, "--", "quarnctl", "restore", "on", "--from", SERIAL,
+             "--watch"], stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        try:
+            self.assertIn("restore mode is on for 2 packages", watcher.stdout.readline())
+            self.install(second, BANK, data=False, metadata={"backup": "disable"})
+            self.install(second, NOTES, data=False)
+            out, err = watcher.communicate(timeout=60)
+        finally:
+            watcher.kill()
+        self.assertEqual(watcher.returncode, 0, out + err)
+        self.assertIn("%s: restored\n" % NOTES, out)
+        self.assertTrue(out.endswith("restore finished\n"), out)
+        with open(self.device.app_path(NOTES, "data/file"), "rb") as one, \
+                open(second.app_path(NOTES, "data/file"), "rb") as two:
+            self.assertEqual(one.read(), two.read())
+        second.wait_for_daemon_end()
+        self.assertNotIn("g_dbus_connection_call_sync() Fail", second.log())
+
+    def test_watching_ends_when_another_client_ends_the_mode(self):
+        self.install(self.device, NOTES)
+        self.quarnctl("backup")
+        watcher = subprocess.Popen(
+            [self.device.tool, "exec", self.device.path, "--", "quarnctl", "restore", "on",
+             "--from", SERIAL, "--watch"], stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+            text=True)
+        try:
+            self.assertIn("restore mode is on", watcher.stdout.readline())
+            self.quarnctl("restore", "off")
+            out, err = watcher.communicate(timeout=60)
+        finally:
+            watcher.kill()
+        self.assertEqual(watcher.returncode, 17, out + err)
+        self.assertIn("restore mode ended before it was installed", out)
+
+    def test_an_interrupt_cancels_the_backup(self):
+        for number in range(40):
+            self.install(self.device, "org.example.app%02d" % number)
+        source = make_source(self.path("large"), "org.example.large", "1.0",
+                             {"data/%d" % i: os.urandom(4000000) for i in range(6)})
+        self.device.install(source)
+        backup = subprocess.Popen(
+            [self.device.tool, "exec", self.device.path, "--", "quarnctl", "backup"],
+            stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True, start_new_session=True)
+        try:
+            self.assertEqual(backup.stdout.readline(), "backup started\n")
+            os.killpg(backup.pid, signal.SIGINT)
+            out, err = backup.communicate(timeout=60)
+        finally:
+            backup.kill()
+        self.assertEqual(backup.returncode, 17, out + err)
+        self.assertEqual(err, "quarnctl: backup cancelled (17)\n")
+
+    def test_a_terminal_gets_a_bar_and_a_table(self):
+        self.install(self.device, NOTES)
+        master, slave = pty.openpty()
+        environment = dict(os.environ, TERM="xterm")
+        try:
+            result = subprocess.run(
+                [self.device.tool, "exec", self.device.path, "--", "quarnctl", "backup"],
+                stdout=slave, stderr=subprocess.PIPE, env=environment, timeout=60)
+            os.close(slave)
+            shown = b""
+            while True:
+                try:
+                    part = os.read(master, 65536)
+                except OSError:
+                    break
+                if not part:
+                    break
+                shown += part
+        finally:
+            os.close(master)
+        self.assertEqual(result.returncode, 0, result.stderr)
+        self.assertIn(b"\r\x1b[K", shown)
+        self.assertIn(b"PACKAGE", shown)
+        self.assertTrue(shown.endswith(b"backup succeeded\r\n"), shown)
+
+
+if __name__ == "__main__":
+    unittest.main()
