@@ -25,7 +25,7 @@ constexpr int kMicrosecondsPerMillisecond = 1000;
 constexpr long kNanosecondsPerMillisecond = 1000000;
 constexpr int kForever = -1;
 /** The watching thread does next to nothing. */
-constexpr std::size_t kWatcherStackSize = 128 * 1024;
+constexpr std::size_t kWatcherStackSize = 131072;
 
 bool initialised = false;
 bool running = false;

@@ -118,8 +118,8 @@ class InvokedCall : public MethodCall {
     g_dbus_method_invocation_return_value(invocation_, value);
   }
   void refuse(int dbus_error, const std::string &text) override {
-    g_dbus_method_invocation_return_error_literal(invocation_, G_DBUS_ERROR, dbus_error,
-                                                  text.c_str());
+    g_dbus_method_invocation_return_error(invocation_, G_DBUS_ERROR, dbus_error, "%s",
+                                          text.c_str());
   }
 
  private:

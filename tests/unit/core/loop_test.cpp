@@ -336,6 +336,28 @@ void run_until_signal(int signo) {
   std::_Exit(4);
 }
 
+void end_with_nested_loops(int) {
+  quit_nested_loops();
+  quarn_loop_quit();
+}
+
+void signal_inside_a_nested_loop() {
+  quarn_loop_init();
+  if (!quarn_loop_watch_signals(print_signal, end_with_nested_loops, kDeadlineSeconds * 1000)) {
+    std::_Exit(1);
+  }
+  std::signal(SIGTERM, quarn_loop_wake_from_signal);
+  const GMainLoopPtr nested(g_main_loop_new(nullptr, FALSE));
+  on_main_loop([&] {
+    on_main_loop([] { raise(SIGTERM); });
+    run_nested_loop(nested.get());
+    std::fputs("unwound", stderr);
+  });
+  quarn_loop_begin();
+  quarn_loop_shutdown();
+  std::_Exit(4);
+}
+
 void block_under_signal() {
   quarn_loop_init();
   if (!quarn_loop_watch_signals(print_signal, end_never, 100)) std::_Exit(1);
@@ -357,6 +379,11 @@ TEST_P(SignalDeathTest, IsLoggedAndEndsOnTheMainThread) {
 }
 
 INSTANTIATE_TEST_SUITE_P(All, SignalDeathTest, ::testing::Values(SIGINT, SIGHUP, SIGTERM, SIGQUIT));
+
+TEST(NestedLoopDeathTest, IsLeftUnderASignal) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(signal_inside_a_nested_loop(), ::testing::ExitedWithCode(4), "signal 15;unwound");
+}
 
 TEST(BlockedMainThreadDeathTest, EndsWithStatusZeroAfterTheGracePeriod) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
