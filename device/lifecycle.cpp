@@ -4,6 +4,7 @@
 #include <gio/gio.h>
 #include <glib-unix.h>
 #include <poll.h>
+#include <pwd.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/file.h>
@@ -171,6 +172,22 @@ void bind_over(const std::string &source, const char *target) {
   }
 }
 
+/**
+ * The bus serves only users that the machine knows: inside, the applications' user is known.
+ */
+void show_app_user(const std::string &device) {
+  constexpr uid_t kAppUser = 5000;
+  constexpr char kUsers[] = "/etc/passwd";
+  if (getpwuid(kAppUser) != nullptr) return;
+  std::ifstream present(kUsers);
+  std::string users((std::istreambuf_iterator<char>(present)), {});
+  if (!users.empty() && users.back() != '\n') users += '\n';
+  const std::string id = std::to_string(kAppUser);
+  const std::string file = device + "/run/passwd";
+  write_file(file, users + "quarn-app:x:" + id + ":" + id + "::/nonexistent:/usr/sbin/nologin\n");
+  bind_over(file, kUsers);
+}
+
 /** A mount namespace of the device's own. False when this process may not make one. */
 bool enter_own_namespace(const std::string &device) {
   if (unshare(CLONE_NEWNS) != 0) {
@@ -191,6 +208,7 @@ bool enter_own_namespace(const std::string &device) {
   bind_over(device + "/root/tmp", kTmpPath);
   show_tmp_entry(device, kHostTmpFd, tmp_entry(device));
   show_tmp_entry(device, kHostTmpFd, tmp_entry(program_directory()));
+  show_app_user(device);
   return true;
 }
 
@@ -259,9 +277,9 @@ void write_bus_files(const std::string &device) {
              "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-BUS Bus Configuration 1.0//EN\"\n"
              " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
              "<busconfig>\n"
-             "  <listen>unix:path=" +
-                 xml_text(device) +
-                 "/run/bus</listen>\n"
+             "  <listen>" +
+                 xml_text(bus_address(device)) +
+                 "</listen>\n"
                  "  <auth>EXTERNAL</auth>\n"
                  "  <servicedir>" +
                  xml_text(device) +
