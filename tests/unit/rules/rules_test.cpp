@@ -1,0 +1,187 @@
+#include "rules.h"
+
+#include <gtest/gtest.h>
+#include <json-c/json.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "mock_platform.h"
+#include "quarn_common.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+class Rules : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char name[] = "/tmp/quarn-rules-XXXXXX";
+    ASSERT_NE(mkdtemp(name), nullptr);
+    root_ = name;
+    for (const char *folder : {"data/cache", "shared/data", "shared/trusted", "res"}) {
+      fs::create_directories(root_ + "/" + folder);
+    }
+    write("data/keep.db", "12345");
+    write("data/cache/tile", "123");
+  }
+  void TearDown() override { fs::remove_all(root_); }
+
+  void write(const std::string &path, const std::string &text) {
+    fs::create_directories(fs::path(root_ + "/" + path).parent_path());
+    std::ofstream(root_ + "/" + path) << text;
+  }
+  void rules(const std::string &xml) { write("res/backup.path.xml", xml); }
+  rules_report check(const std::string &type = "tpk") {
+    return check_rules("org.example.app", type, root_);
+  }
+  static const rule_entry &entry(const rules_report &report, const std::string &path) {
+    for (const rule_entry &one : report.entries) {
+      if (one.path == path) return one;
+    }
+    ADD_FAILURE() << "no entry " << path;
+    static const rule_entry none;
+    return none;
+  }
+  static std::vector<std::string> kinds(const rules_report &report) {
+    std::vector<std::string> result;
+    for (const rule_problem &problem : report.problems) result.push_back(problem.kind);
+    return result;
+  }
+
+  ::testing::NiceMock<MockPlatform> platform_;
+  std::string root_;
+};
+
+TEST_F(Rules, WithoutAFileEverythingIsIn) {
+  const rules_report report = check();
+  EXPECT_EQ(report.file, "");
+  EXPECT_TRUE(entry(report, "data/keep.db").in);
+  EXPECT_TRUE(entry(report, "data/cache/tile").in);
+  EXPECT_EQ(report.total, 8u);
+  EXPECT_EQ(rules_exit_code(report), RULES_OK);
+  EXPECT_NE(rules_text(report).find("no rules file, everything is backed up"), std::string::npos);
+}
+
+TEST_F(Rules, NamesTheElementThatDecided) {
+  rules("<backup>\n<include path=\"data/\"/>\n<exclude path=\"/data/cache/\"/>\n</backup>");
+  const rules_report report = check();
+  const rule_entry &kept = entry(report, "data/keep.db");
+  EXPECT_TRUE(kept.in);
+  EXPECT_EQ(report.elements.at(kept.element).given, "data/");
+  const rule_entry &cached = entry(report, "data/cache/tile");
+  EXPECT_FALSE(cached.in);
+  EXPECT_EQ(report.elements.at(cached.element).line, 3);
+  EXPECT_EQ(rules_exit_code(report), RULES_OK);
+}
+
+TEST_F(Rules, WarnsOfADirectoryWithoutATrailingSlash) {
+  rules("<backup><exclude path=\"data/cache\"/></backup>");
+  const rules_report report = check();
+  EXPECT_TRUE(entry(report, "data/cache/tile").in);
+  EXPECT_EQ(kinds(report), std::vector<std::string>{"no-trailing-slash"});
+  EXPECT_EQ(rules_exit_code(report), RULES_PROBLEMS);
+}
+
+TEST_F(Rules, WarnsOfElementsThatMatchNothing) {
+  rules("<backup><exclude path=\"data/gone/\"/><exclude path=\"shared/trusted/\"/></backup>");
+  EXPECT_EQ(kinds(check()), (std::vector<std::string>{"nothing-there", "matches-nothing"}));
+}
+
+TEST_F(Rules, AnIncludeThatDoesNotExistLeavesEverythingOut) {
+  rules("<backup><include path=\"data/gone\"/></backup>");
+  const rules_report report = check();
+  EXPECT_FALSE(entry(report, "data/keep.db").in);
+  EXPECT_EQ(report.total, 0u);
+  EXPECT_NE(rules_text(report).find("no include covers it"), std::string::npos);
+}
+
+TEST_F(Rules, ARootElementWithTheWrongNameIsUnusable) {
+  rules("<backups><exclude path=\"data/\"/></backups>");
+  const rules_report report = check();
+  EXPECT_EQ(kinds(report), std::vector<std::string>{"root-element"});
+  EXPECT_TRUE(entry(report, "data/keep.db").in);
+  EXPECT_EQ(rules_exit_code(report), RULES_UNUSABLE);
+}
+
+TEST_F(Rules, AMalformedFileIsUnusable) {
+  rules("<backup><exclude");
+  EXPECT_EQ(kinds(check()), std::vector<std::string>{"malformed"});
+  EXPECT_EQ(rules_exit_code(check()), RULES_UNUSABLE);
+}
+
+TEST_F(Rules, ElementsWithoutPathAndUnknownOnesAreNamed) {
+  rules("<backup><exclude/><skip path=\"data/\"/></backup>");
+  EXPECT_EQ(kinds(check()), (std::vector<std::string>{"no-path", "unknown-element"}));
+}
+
+TEST_F(Rules, OverTheCapShowsTheLargestFiles) {
+  write("data/small.bin", "x");
+  write("data/big.bin", "");
+  fs::resize_file(root_ + "/data/big.bin", kMaxBackupSize);
+  const rules_report report = check();
+  EXPECT_EQ(rules_exit_code(report), RULES_OVER_CAP);
+  const std::string text = rules_text(report);
+  EXPECT_NE(text.find("over the limit: the application would be skipped"), std::string::npos);
+  EXPECT_NE(text.find("data/big.bin", text.find("largest files")), std::string::npos);
+}
+
+TEST_F(Rules, ExactlyTheCapIsAllowed) {
+  fs::remove_all(root_ + "/data");
+  fs::create_directories(root_ + "/data");
+  write("data/big.bin", "");
+  fs::resize_file(root_ + "/data/big.bin", kMaxBackupSize);
+  EXPECT_EQ(rules_exit_code(check()), RULES_OK);
+}
+
+TEST_F(Rules, AFileAtTheOtherTypesPlaceIsNamed) {
+  rules("<backup/>");
+  EXPECT_EQ(kinds(check("wgt")), std::vector<std::string>{"wrong-place"});
+}
+
+TEST_F(Rules, ExplainsOnePath) {
+  rules("<backup><exclude path=\"data/cache/\"/></backup>");
+  int code = -1;
+  EXPECT_EQ(explain_rules(check(), "data/cache/tile", false, &code),
+            "data/cache/tile: out (exclude \"data/cache/\", line 1)\n");
+  EXPECT_EQ(code, RULES_OK);
+  EXPECT_EQ(explain_rules(check(), root_ + "/data/keep.db", false, &code),
+            "data/keep.db: in (no rule speaks of it)\n");
+  explain_rules(check(), "data/none", false, &code);
+  EXPECT_EQ(code, RULES_NO_INPUT);
+}
+
+TEST_F(Rules, JsonHoldsEveryEntryAndProblem) {
+  rules("<backup><exclude path=\"data/cache/\"/><exclude path=\"nowhere\"/></backup>");
+  json_object *document = json_tokener_parse(rules_json(check()).c_str());
+  ASSERT_NE(document, nullptr);
+  EXPECT_EQ(json_object_array_length(json_object_object_get(document, "entries")), 2u);
+  EXPECT_EQ(json_object_array_length(json_object_object_get(document, "problems")), 1u);
+  EXPECT_EQ(json_object_get_int(json_object_object_get(document, "exit")), RULES_PROBLEMS);
+  json_object_put(document);
+}
+
+TEST_F(Rules, ControlCharactersOfNamesDoNotReachTheTerminal) {
+  write("data/\033[31mred", "x");
+  const std::string text = rules_text(check());
+  EXPECT_EQ(text.find('\033'), std::string::npos);
+  EXPECT_NE(text.find("\\x1b[31mred"), std::string::npos);
+}
+
+TEST_F(Rules, CommandReadsASource) {
+  write("package.ini", "[package]\nid=org.example.app\nversion=1\ntype=tpk\n");
+  EXPECT_EQ(rules_command({"check", root_}, true), RULES_OK);
+  EXPECT_EQ(rules_command({"explain", root_, "data/keep.db"}, true), RULES_OK);
+  EXPECT_EQ(rules_command({"check"}, true), 64);
+}
+
+TEST_F(Rules, CommandRefusesWhatIsNoPackage) {
+  ON_CALL(platform_, package_manager_get_package_info)
+      .WillByDefault(::testing::Return(PACKAGE_MANAGER_ERROR_NO_SUCH_PACKAGE));
+  EXPECT_EQ(rules_command({"check", "org.example.none"}, true), RULES_NO_INPUT);
+  EXPECT_EQ(rules_command({"check", "../etc"}, true), RULES_NO_INPUT);
+}
+
+}  // namespace
