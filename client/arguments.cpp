@@ -82,6 +82,20 @@ constexpr VerbInfo kVerbs[] = {
      kListWait, 0, kAny},
     {Verb::restore_off, "restore off", "", "end the restore mode",
      "Packages that are installed from now on keep the data they come with.\n", kShortWait, 0, 0},
+    {Verb::rules_check, "rules check", "SOURCE-or-PKGID", "what an application's rules take in",
+     "For authors of applications; needs no daemon. Reads a package's source directory, or a\n"
+     "package that is installed, and tells each file in or out and by which element of its rules\n"
+     "file, the total against the limit, and what is probably a mistake.\n"
+     "\n"
+     "Exit status here: 0 nothing to complain about, 1 mistakes found, 2 over the limit, 3 the\n"
+     "rules file is ignored, 64 wrong arguments, 66 no such package or source.\n",
+     kNoLimit, 1, 1},
+    {Verb::rules_explain, "rules explain", "SOURCE-or-PKGID PATH",
+     "why one file is backed up or not",
+     "For authors of applications; needs no daemon. PATH is relative to the package's root.\n"
+     "\n"
+     "Exit status here: 0 the answer is printed, 64 wrong arguments, 66 no such package or path.\n",
+     kNoLimit, 2, 2},
 };
 
 constexpr char kCommonOptions[] =

@@ -13,6 +13,7 @@ namespace quarn_client {
 /** quarnctl's exit codes that are not results of the daemon. */
 enum exit_code : int {
   EXIT_USAGE = 64,        /**< wrong arguments */
+  EXIT_NO_INPUT = 66,     /**< rules: no such package, source or path */
   EXIT_UNREACHABLE = 69,  /**< the bus or the daemon cannot be reached */
   EXIT_DAEMON_ENDED = 70, /**< the daemon ended before it had answered */
   EXIT_TIMED_OUT = 75,    /**< no answer in time */
@@ -36,7 +37,9 @@ enum class Verb {
   app_restore,
   app_export,
   restore_on,
-  restore_off
+  restore_off,
+  rules_check,
+  rules_explain
 };
 
 /** One invocation. */
@@ -44,13 +47,13 @@ struct Command {
   Verb verb = Verb::help;
   std::string name; /**< the verb as typed, "restore on" */
   bool json = false;
-  bool watch = false;         /**< restore on: follow until the last package is done */
-  bool switch_on = false;     /**< auto: on or off */
-  double timeout = 0;         /**< seconds; 0 waits without a limit */
-  bool timeout_given = false; /**< it bounds the watching, too */
-  std::string serial;         /**< restore on: the device whose set it is */
-  std::vector<std::string> packages;
-  std::string help; /**< help: the text to print */
+  bool watch = false;                /**< restore on: follow until the last package is done */
+  bool switch_on = false;            /**< auto: on or off */
+  double timeout = 0;                /**< seconds; 0 waits without a limit */
+  bool timeout_given = false;        /**< it bounds the watching, too */
+  std::string serial;                /**< restore on: the device whose set it is */
+  std::vector<std::string> packages; /**< the operands; a path, too, for rules */
+  std::string help;                  /**< help: the text to print */
 };
 
 /**

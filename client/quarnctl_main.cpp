@@ -4,6 +4,7 @@
 #include <vector>
 
 #include "arguments.h"
+#include "rules.h"
 #include "session.h"
 
 int main(int argc, char **argv) {
@@ -21,6 +22,12 @@ int main(int argc, char **argv) {
   if (command.verb == quarn_client::Verb::version) {
     std::puts("quarnctl " QUARN_VERSION);
     return 0;
+  }
+  if (command.verb == quarn_client::Verb::rules_check) {
+    return rules_command({"check", command.packages[0]}, command.json);
+  }
+  if (command.verb == quarn_client::Verb::rules_explain) {
+    return rules_command({"explain", command.packages[0], command.packages[1]}, command.json);
   }
   return quarn_client::run_command(command);
 }

@@ -18,7 +18,9 @@
 #include "quarn_common.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/working_files.h"
 
 namespace {
 
@@ -28,7 +30,6 @@ constexpr const char *kDataDirs[] = {"data", "shared/data", "shared/trusted"};
 constexpr std::size_t kLargestShown = 10;
 constexpr int kUsageError = 64;
 
-using XmlDoc = Handle<xmlDoc, &xmlFreeDoc>;
 using XmlText = std::unique_ptr<xmlChar, void (*)(xmlChar *)>;
 
 void free_xml_text(xmlChar *text) { xmlFree(text); }
@@ -59,14 +60,18 @@ std::string joined(const std::string &root, const std::string &value) {
 
 // The daemon's loader keeps what exists; a report also needs what it dropped, and line numbers.
 void read_elements(rules_report *report) {
-  UniqueFd fd = safe_open((report->root + "/" + report->file).c_str(), O_RDONLY | O_NONBLOCK);
-  XmlDoc document;
-  if (fd) {
-    document.reset(xmlReadFd(fd.get(), nullptr, nullptr,
-                             XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING));
-  }
+  const std::string path = report->root + "/" + report->file;
+  const RulesDoc document = load_rules(path.c_str());
   if (!document) {
     report->ignored = true;
+    struct stat status {};
+    if (safe_lstat(path.c_str(), &status) == 0 &&
+        static_cast<std::size_t>(status.st_size) > kMaxRulesSize) {
+      report->problems.push_back(
+          {"too-large", 0, report->file,
+           "larger than " + std::to_string(kMaxRulesSize) + " bytes: the file is ignored"});
+      return;
+    }
     report->problems.push_back(
         {"malformed", 0, report->file, "not readable as XML: the file is ignored"});
     return;
@@ -116,14 +121,8 @@ int deciding_element(const rules_report &report, const std::string &path, bool i
   return -1;
 }
 
-bool never_archived(const rules_report &report, const std::string &path) {
-  const std::string shared = report.root + "/shared/data/";
-  return path == shared + report.package + "_upload.zip" ||
-         path == shared + report.package + "_download.zip" ||
-         begins_with(path, shared + "quarn_tmp_rst_dir");
-}
-
 void walk(rules_report *report, const std::string &folder) {
+  const WorkingFiles working(report->package, report->root);
   const DirPtr dir = safe_opendir(folder.c_str());
   if (!dir) {
     report->problems.push_back({"unreadable", 0, folder.substr(report->root.size() + 1),
@@ -137,7 +136,7 @@ void walk(rules_report *report, const std::string &folder) {
     if (name == "." || name == "..") continue;
     const std::string path = folder + "/" + name;
     struct stat status {};
-    if (never_archived(*report, path) || safe_lstat(path.c_str(), &status) != 0) continue;
+    if (working.contain(path) || safe_lstat(path.c_str(), &status) != 0) continue;
     if (S_ISDIR(status.st_mode)) {
       walk(report, path);
       continue;

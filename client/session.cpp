@@ -186,6 +186,8 @@ void Session::begin() {
       return restore_off();
     case Verb::help:
     case Verb::version:
+    case Verb::rules_check:
+    case Verb::rules_explain:
       break;
   }
   finish(EXIT_USAGE, "nothing to do");

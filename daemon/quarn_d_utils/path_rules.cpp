@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
@@ -23,11 +24,6 @@ constexpr char kRootElement[] = "backup";
 constexpr char kIncludeElement[] = "include";
 constexpr char kExcludeElement[] = "exclude";
 constexpr char kPathAttribute[] = "path";
-
-// a parsed document takes many times its text
-constexpr std::size_t kMaxRulesSize = 256U << 10;
-
-using XmlDoc = Handle<xmlDoc, &xmlFreeDoc>;
 
 struct XmlFree {
   void operator()(xmlChar *text) const { xmlFree(text); }
@@ -55,19 +51,6 @@ bool read_rules(const char *path, std::string *text) {
   }
   text->resize(done);
   return done <= kMaxRulesSize;
-}
-
-/** Parse without network, external parts or entities. */
-XmlDoc load_rules(const char *path) {
-  std::string text;
-  if (!read_rules(path, &text)) return nullptr;
-  XmlDoc doc(xmlReadMemory(text.data(), static_cast<int>(text.size()), path, nullptr,
-                           XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING));
-  // rules need no entities; whoever declares some means the parser
-  if (doc != nullptr && doc->intSubset != nullptr && doc->intSubset->children != nullptr) {
-    return nullptr;
-  }
-  return doc;
 }
 
 std::string absolute_path(const char *root, const char *value) {
@@ -109,6 +92,18 @@ std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path
 
 }  // namespace
 
+RulesDoc load_rules(const char *path) {
+  std::string text;
+  if (!read_rules(path, &text)) return nullptr;
+  RulesDoc doc(xmlReadMemory(text.data(), static_cast<int>(text.size()), path, nullptr,
+                             XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING));
+  // rules need no entities; whoever declares some means the parser
+  if (doc != nullptr && doc->intSubset != nullptr && doc->intSubset->children != nullptr) {
+    return nullptr;
+  }
+  return doc;
+}
+
 void reset_backup_path_info() {
   backup_include_list.clear();
   backup_exclude_list.clear();
@@ -122,7 +117,7 @@ void parse_backup_path_xml(const char *pkg_id, const char *pkg_type, const char 
   if (!file_exist(path.c_str())) return;
   LOGI("(%s) has xml file(for include/exlude path)", pkg_id);
 
-  const XmlDoc doc = load_rules(path.c_str());
+  const RulesDoc doc = load_rules(path.c_str());
   if (doc == nullptr) {
     LOGE("Could not load xml file.\n");
     return;

@@ -8,7 +8,7 @@ import sys
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import TestCase, make_source  # noqa: E402
+from quarn_test import BIN_DIR, TestCase, make_source  # noqa: E402
 
 SERIAL = "350000000000017"
 OTHER = "350000000000025"
@@ -62,6 +62,24 @@ class QuarnctlTest(TestCase):
         self.assertEqual(device["packages"], [{"package": NOTES, "version": "1.0",
                                                "crc": entry["pkg_list"][0]["crc"]}])
         self.assertIn(SERIAL, self.quarnctl("sets").stdout)
+
+    def test_rules_of_an_installed_package_and_of_its_source_are_checked_alike(self):
+        source = make_source(self.path("source"), NOTES, "1.0", {
+            "data/keep": b"keep", "data/cache/tile": b"tile",
+            "res/backup.path.xml": b'<backup><exclude path="data/cache/"/></backup>'})
+        self.device.install(source)
+        installed = self.quarnctl("rules", "check", NOTES)
+        self.assertEqual(installed.stderr, "")
+        self.assertIn("1 of 2 in", installed.stdout)
+        of_source = subprocess.run([os.path.join(BIN_DIR, "quarnctl"), "rules", "check", source],
+                                   stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        self.assertEqual((of_source.returncode, of_source.stdout, of_source.stderr),
+                         (0, installed.stdout, ""))
+        self.assertEqual(self.quarnctl("rules", "explain", NOTES, "data/cache/tile").stdout,
+                         'data/cache/tile: out (exclude "data/cache/", line 1)\n')
+        self.quarnctl("rules", "explain", NOTES, "data/none", status=66)
+        self.quarnctl("rules", "check", "org.example.none", status=66)
+        self.assertIsNone(self.device.daemon_pid())
 
     def test_without_wifi_the_result_is_told_in_words(self):
         self.install(self.device, NOTES)

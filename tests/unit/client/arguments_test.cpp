@@ -35,6 +35,8 @@ TEST(Arguments, EveryVerbIsKnown) {
   EXPECT_EQ(parsed({"app", "export", "a"}).verb, Verb::app_export);
   EXPECT_EQ(parsed({"restore", "on", "--from", "1"}).verb, Verb::restore_on);
   EXPECT_EQ(parsed({"restore", "off"}).verb, Verb::restore_off);
+  EXPECT_EQ(parsed({"rules", "check", "a"}).verb, Verb::rules_check);
+  EXPECT_EQ(parsed({"rules", "explain", "a", "data/b"}).verb, Verb::rules_explain);
 }
 
 TEST(Arguments, OptionsMayStandAnywhere) {

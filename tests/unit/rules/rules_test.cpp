@@ -10,6 +10,7 @@
 
 #include "mock_platform.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/rules_file.h"
 
 namespace {
 
@@ -168,6 +169,28 @@ TEST_F(Rules, ControlCharactersOfNamesDoNotReachTheTerminal) {
   const std::string text = rules_text(check());
   EXPECT_EQ(text.find('\033'), std::string::npos);
   EXPECT_NE(text.find("\\x1b[31mred"), std::string::npos);
+}
+
+TEST_F(Rules, FileOverTheDaemonsOwnLimitIsSaidToBeIgnored) {
+  const std::string element = "<backup><exclude path=\"data/cache/\"/></backup>";
+  rules(element + std::string(kMaxRulesSize - element.size(), '\n'));
+  EXPECT_FALSE(check().ignored);
+  EXPECT_FALSE(entry(check(), "data/cache/tile").in);
+  rules(element + std::string(kMaxRulesSize - element.size() + 1, '\n'));
+  const rules_report report = check();
+  EXPECT_TRUE(report.ignored);
+  EXPECT_TRUE(entry(report, "data/cache/tile").in);
+  EXPECT_EQ(kinds(report), std::vector<std::string>{"too-large"});
+  EXPECT_EQ(rules_exit_code(report), RULES_UNUSABLE);
+  EXPECT_NE(rules_text(report).find("larger than 262144 bytes"), std::string::npos);
+}
+
+TEST_F(Rules, FileThatDeclaresEntitiesIsIgnoredAsByTheDaemon) {
+  rules("<!DOCTYPE backup [<!ENTITY p \"data/cache/\">]><backup><exclude path=\"&p;\"/></backup>");
+  const rules_report report = check();
+  EXPECT_TRUE(report.ignored);
+  EXPECT_TRUE(entry(report, "data/cache/tile").in);
+  EXPECT_EQ(rules_exit_code(report), RULES_UNUSABLE);
 }
 
 TEST_F(Rules, CommandReadsASource) {
