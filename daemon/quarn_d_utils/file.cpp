@@ -409,6 +409,8 @@ bool create_directory_of_file(const char *file) {
   return true;
 }
 
+// By value, as the interface has it.
+// NOLINTNEXTLINE(performance-unnecessary-value-param)
 int write_string_to_file(std::string data, std::string path) {
   if (data.empty()) {
     LOGE("Invalid Data");
