@@ -16,6 +16,9 @@ std::mutex package_data_mutex;
 namespace {
 
 constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
+constexpr char kSnapshotDir[] = "/shared/data/quarn_tmp_rst_dir";
+constexpr char kTableDir[] = "/shared/data/";
+constexpr char kTableSuffix[] = ".perm";
 constexpr int kLevel = 1;
 constexpr mode_t kArchiveMode = 0600;
 /** Name flag of the zip format: the entry's name is UTF-8. */
@@ -310,6 +313,19 @@ UniqueFd create_archive(const char *zip_path) {
   return safe_open(zip_path, O_RDWR | O_CREAT | O_EXCL, kArchiveMode);
 }
 
+/**
+ * A complete snapshot that nobody works with: its restore was cut off, and what
+ * lies in the data directories is part of the old and part of the new.
+ */
+bool is_half_restored(const char *pkg_id, const char *root) {
+  const std::string snapshot = std::string(root) + kSnapshotDir;
+  const std::string table = snapshot + kTableDir + pkg_id + kTableSuffix;
+  struct stat status = {};
+  // An application can make neither of root's.
+  return safe_lstat(snapshot.c_str(), &status) == 0 && S_ISDIR(status.st_mode) &&
+         status.st_uid == geteuid() && file_exist(table.c_str());
+}
+
 struct ReleaseTable {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
 };
@@ -318,6 +334,11 @@ struct ReleaseTable {
 
 void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error) {
   const std::lock_guard<std::mutex> lock(package_data_mutex);
+  if (is_half_restored(pkg_id, root)) {
+    LOGE("restore of (%s) was interrupted, so its data is not packed", pkg_id);
+    *error = QUARN_REFUSED;
+    return;
+  }
   create_directory_of_file(zip_path);
   file_info_table_h *made = nullptr;
   ready_file_info_table(&made);
@@ -376,7 +397,7 @@ void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const 
                                    const char *root, int *error) {
   const char *document = json_object_get_string(table->root);
   const std::string text = document == nullptr ? "" : document;
-  const std::string path = std::string(root) + "/shared/data/" + pkg_id + ".perm";
+  const std::string path = std::string(root) + kTableDir + pkg_id + kTableSuffix;
   const int written = write_string_to_file(text, path);
   if (written != QUARN_OK) {
     LOGE("fail. insert_file_info_table_to_zip : %d", written);

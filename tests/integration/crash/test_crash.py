@@ -1,0 +1,291 @@
+"""A daemon that is killed at any moment: nothing half done stays, on the device or in the cloud."""
+import json
+import os
+import random
+import shutil
+import signal
+import subprocess
+import sys
+import time
+import unittest
+import zipfile
+
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+from quarn_test import DEADLINE, TestCase, make_source, wait_until  # noqa: E402
+
+SERIAL = "350000000000001"
+PACKAGE = "org.example.notes"
+#: Files of the package that is restored; enough for a restore to be met in its middle.
+FILES = 300
+LABELS = ("security.SMACK64", "user.quarn.SMACK64")
+
+
+def tree(root):
+    """Everything below `root`: type, content, mode, owner and labels by path."""
+    found = {}
+    for top in ("data", "shared/data", "shared/trusted"):
+        for folder, folders, names in os.walk(os.path.join(root, top)):
+            for name in folders + names:
+                path = os.path.join(folder, name)
+                status = os.lstat(path)
+                labels = {key: os.getxattr(path, key, follow_symlinks=False)
+                          for key in os.listxattr(path, follow_symlinks=False) if key in LABELS}
+                content = None
+                if name in names:
+                    with open(path, "rb") as file:
+                        content = file.read()
+                found[os.path.relpath(path, root)] = (content, status.st_mode, status.st_uid,
+                                                      status.st_gid, labels)
+    return found
+
+
+class CrashTest(TestCase):
+    def setUp(self):
+        self.device = self.new_device(serial=SERIAL, model="Orvane One")
+        self.device.start()
+        seed = int(os.environ.get("QUARN_CRASH_SEED") or time.time_ns() % 1000000)
+        self.random = random.Random(seed)
+        self.hint = "QUARN_CRASH_SEED=%d" % seed
+
+    def ask(self, *arguments):
+        """A client that waits for its answer."""
+        client = subprocess.Popen([self.device.tool, "exec", self.device.path, "--", "quarnctl",
+                                   *arguments], stdout=subprocess.PIPE, stderr=subprocess.STDOUT,
+                                  text=True)
+        self.addCleanup(client.communicate)
+        self.addCleanup(client.kill)
+        return client
+
+    def kill_daemon_when(self, happened, client):
+        """Kill the daemon as soon as `happened()`, or let it be when the client has its answer."""
+        pid = wait_until(lambda: self.device.daemon_pid() or client.poll() is not None,
+                         "the daemon runs")
+        end = time.monotonic() + DEADLINE
+        while not happened():
+            self.assertLess(time.monotonic(), end, self.hint)
+            if client.poll() is not None:
+                break
+        killed = client.poll() is None
+        if killed:
+            os.kill(pid, signal.SIGKILL)
+        output, _ = client.communicate(timeout=DEADLINE)
+        if killed:
+            self.device.wait_for_daemon_end()
+            self.assertNotEqual(client.returncode, 0, self.hint + "\n" + output)
+        return killed
+
+    def log_size(self):
+        return os.path.getsize(os.path.join(self.device.path, "log/quarnd.log"))
+
+
+class KilledBackup(CrashTest):
+    PACKAGES = ["org.example.p%d" % index for index in range(6)]
+
+    def archive(self, package):
+        return os.path.join(self.device.cloud, SERIAL, package, "1.0.0", package + ".zip")
+
+    def objects(self):
+        """What the cloud shows: its objects, without the store's own unfinished files."""
+        return [os.path.join(folder, name) for folder, _, names in os.walk(self.device.cloud)
+                for name in names if name == "app_list.txt" or name.endswith(".zip")]
+
+    def change(self, package):
+        content = self.random.randbytes(200000)
+        with open(self.device.app_path(package, "data/content"), "wb") as file:
+            file.write(content)
+        return content
+
+    def assert_objects_are_whole(self, contents):
+        """Each archive is one of those that were ever to be sent."""
+        for path in self.objects():
+            if path.endswith("app_list.txt"):
+                with open(path) as file:
+                    self.assertEqual(json.load(file)["format_ver"], 1, self.hint)
+                continue
+            with zipfile.ZipFile(path) as archive:
+                self.assertIsNone(archive.testzip(), self.hint)
+                package = os.path.basename(path)[:-len(".zip")]
+                self.assertIn(archive.read("data/content"), contents[package], self.hint)
+
+    def test_no_half_object_is_in_the_cloud_and_the_next_backup_is_whole(self):
+        contents = {package: [] for package in self.PACKAGES}
+        for package in self.PACKAGES:
+            self.device.install(make_source(self.path(package), package, "1.0.0",
+                                            {"data/content": b"first"}))
+            contents[package].append(b"first")
+        before = self.log_size() if os.path.exists(
+            os.path.join(self.device.path, "log/quarnd.log")) else 0
+        self.device.quarnctl("backup")
+        whole_run = self.log_size() - before
+        killed = 0
+        for _ in range(12):
+            for package in self.PACKAGES:
+                contents[package].append(self.change(package))
+            target = self.log_size() + self.random.randrange(whole_run)
+            client = self.ask("backup")
+            killed += self.kill_daemon_when(lambda: self.log_size() >= target, client)
+            self.assert_objects_are_whole(contents)
+        self.assertGreater(killed, 0, self.hint)
+
+        self.device.quarnctl("backup")
+        self.assert_objects_are_whole(contents)
+        found = sorted(os.path.relpath(os.path.join(folder, name), self.device.cloud)
+                       for folder, _, names in os.walk(self.device.cloud) for name in names
+                       if not name.startswith("."))
+        self.assertEqual(found, sorted([os.path.relpath(self.archive(package), self.device.cloud)
+                                        for package in self.PACKAGES] + ["app_list/app_list.txt"]))
+        for package in self.PACKAGES:
+            with zipfile.ZipFile(self.archive(package)) as archive:
+                self.assertEqual(archive.read("data/content"), contents[package][-1], self.hint)
+        left = [os.path.join(folder, name)
+                for folder, _, names in os.walk(os.path.join(self.device.path, "root"))
+                for name in names if name.endswith(("_upload.zip", ".perm", "app_list.txt"))]
+        self.assertEqual(left, [], self.hint)
+
+
+class KilledRestore(CrashTest):
+    def setUp(self):
+        super().setUp()
+        files = {}
+        for index in range(FILES):
+            top = ("data", "shared/data", "shared/trusted")[index % 3]
+            files["%s/folder%d/file%d" % (top, index % 7, index)] = (b"saved %d\n" % index * 50,
+                                                                     0o600 + index % 8)
+        self.device.install(make_source(self.path("source"), PACKAGE, "1.0.0", files))
+        self.device.install(make_source(self.path("other"), "org.example.other", "1.0.0",
+                                        {"data/other": b"other"}))
+        self.root = self.device.app_path(PACKAGE).rstrip("/")
+        self.device.quarnctl("backup")
+        self.device.remove("org.example.other")
+        self.saved = tree(self.root)
+        # Afterwards the application went on: other contents and modes, files that went.
+        for index in range(FILES):
+            top = ("data", "shared/data", "shared/trusted")[index % 3]
+            path = os.path.join(self.root, top, "folder%d" % (index % 7), "file%d" % index)
+            if index % 5 == 0:
+                os.unlink(path)
+                continue
+            with open(path, "wb") as file:
+                file.write(b"present %d\n" % index * 70)
+            os.chmod(path, 0o640 + index % 4)
+        self.present = tree(self.root)
+        self.kept = self.path("kept")
+        shutil.copytree(self.root, self.kept, symlinks=True)
+        self.device.quarnctl("app", "restore", PACKAGE)
+        self.restored = tree(self.root)
+        self.assertNotEqual(self.restored, self.present)
+        for path, entry in self.saved.items():
+            self.assertEqual(self.restored[path], entry, path)
+
+    def reset(self):
+        for top in ("data", "shared/data", "shared/trusted"):
+            shutil.rmtree(os.path.join(self.root, top))
+            shutil.copytree(os.path.join(self.kept, top), os.path.join(self.root, top),
+                            symlinks=True)
+        for path, (_, mode, uid, gid, labels) in self.present.items():
+            target = os.path.join(self.root, path)
+            os.chown(target, uid, gid)
+            os.chmod(target, mode & 0o7777)
+            for key, value in labels.items():
+                os.setxattr(target, key, value)
+        for top in ("data", "shared/data", "shared/trusted"):
+            os.chown(os.path.join(self.root, top), 5000, 5000)
+        self.assertEqual(tree(self.root), self.present)
+
+    def count(self, *path, content=None):
+        """Files below a folder of the package; those that begin with `content`, when given."""
+        number = 0
+        for folder, _, names in os.walk(os.path.join(self.root, *path)):
+            if content is None:
+                number += len(names)
+                continue
+            for name in names:
+                try:
+                    with open(os.path.join(folder, name), "rb") as file:
+                        number += file.read(len(content)) == content
+                except OSError:
+                    continue
+        return number
+
+    def moments(self):
+        """Conditions that hold from some moment of a restore on."""
+        snapshot = os.path.join(self.root, "shared/data/quarn_tmp_rst_dir")
+        table = os.path.join(snapshot, "shared/data", PACKAGE + ".perm")
+        unpacked_table = os.path.join(self.root, "shared/data", PACKAGE + ".perm")
+        yield lambda: os.path.exists(
+            os.path.join(self.root, "shared/data", PACKAGE + "_download.zip"))
+        yield lambda: os.path.exists(snapshot)
+        for share in range(3):
+            number = self.random.randrange(FILES * share // 3, FILES * (share + 1) // 3)
+            yield lambda number=number: self.count("shared/data/quarn_tmp_rst_dir") > number
+        yield lambda: os.path.exists(table)
+        for share in range(3):
+            number = self.random.randrange(FILES * share // 9, FILES * (share + 1) // 9)
+            yield lambda number=number: os.path.exists(table) and self.count(
+                "data", content=b"saved") > number
+        yield lambda: os.path.exists(unpacked_table)
+        yield lambda: os.path.exists(table) and self.random.random() < 0.02
+        start = self.log_size()
+        number = self.random.randrange(1, 4000)
+        yield lambda: self.log_size() > start + number
+
+    def leftovers(self):
+        return [path for path in tree(self.root)
+                if "quarn_tmp_rst_dir" in path or path.endswith((".zip", ".perm"))]
+
+    def test_the_tree_is_old_or_new_once_restore_mode_is_asked_for(self):
+        killed = 0
+        for moment in self.moments():
+            self.reset()
+            client = self.ask("app", "restore", PACKAGE)
+            killed += self.kill_daemon_when(moment, client)
+            # of another package
+            self.device.quarnctl("restore", "on", "--from", SERIAL, "org.example.other")
+            now = tree(self.root)
+            self.assertTrue(now in (self.present, self.restored),
+                            self.hint + "\n" + self.difference(now))
+            self.assertEqual(self.leftovers(), [], self.hint)
+            self.device.quarnctl("restore", "off")
+        self.assertGreater(killed, 0, self.hint)
+
+    def test_the_package_is_restored_when_its_restore_is_asked_for_again(self):
+        killed = 0
+        for moment in self.moments():
+            self.reset()
+            client = self.ask("app", "restore", PACKAGE)
+            killed += self.kill_daemon_when(moment, client)
+            self.device.quarnctl("app", "restore", PACKAGE)
+            now = tree(self.root)
+            self.assertTrue(now == self.restored, self.hint + "\n" + self.difference(now))
+            self.assertEqual(self.leftovers(), [], self.hint)
+        self.assertGreater(killed, 0, self.hint)
+
+    def test_a_backup_of_a_half_restored_package_leaves_its_archive_in_the_cloud(self):
+        archive = os.path.join(self.device.cloud, SERIAL, PACKAGE, "1.0.0", PACKAGE + ".zip")
+        with open(archive, "rb") as file:
+            saved = file.read()
+        self.reset()
+        table = os.path.join(self.root, "shared/data/quarn_tmp_rst_dir/shared/data",
+                             PACKAGE + ".perm")
+        client = self.ask("app", "restore", PACKAGE)
+        self.assertTrue(self.kill_daemon_when(
+            lambda: os.path.exists(table) and self.count("data", content=b"saved") > 5, client))
+        self.device.quarnctl("backup")
+        exported = self.device.quarnctl("app", "export", PACKAGE, check=False)
+        self.assertEqual(exported.returncode, 36, exported.stdout + exported.stderr)
+        with open(archive, "rb") as file:
+            self.assertEqual(file.read(), saved)
+        self.device.quarnctl("app", "restore", PACKAGE)
+        self.assertEqual(tree(self.root), self.restored)
+
+    def difference(self, now):
+        lines = []
+        for name, wanted in (("present", self.present), ("restored", self.restored)):
+            differing = sorted(path for path in set(now) | set(wanted)
+                               if now.get(path) != wanted.get(path))
+            lines.append("%d differ from %s: %s" % (len(differing), name, differing[:5]))
+        return "\n".join(lines)
+
+
+if __name__ == "__main__":
+    unittest.main()
