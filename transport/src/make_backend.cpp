@@ -1,4 +1,6 @@
 #include "backend_file.h"
+#include "backend_webdav.h"
+#include "http.h"
 #include "session.h"
 
 namespace transport {
@@ -6,7 +8,9 @@ namespace transport {
 std::shared_ptr<Backend> make_backend(const Config &config, std::string *problem) {
   std::string path = path_of_file_url(config.url);
   if (!path.empty()) return make_file_backend(std::move(path));
-  *problem = "the url names no store that is known";
+  StoreUrl url;
+  if (parse_store_url(config.url, "webdav", &url, problem)) return make_webdav_backend(url, config);
+  if (problem->empty()) *problem = "the url names no store that is known";
   return nullptr;
 }
 

@@ -1,0 +1,108 @@
+// The WebDAV backend's store, seen from behind the server.
+#include <fcntl.h>
+#include <pwd.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <unistd.h>
+
+#include "conformance.h"
+#include "dav_server.h"
+
+using namespace harness;
+
+namespace {
+
+bool prepare_process() {
+  return unshare(CLONE_NEWNS) == 0 &&
+         mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+}
+const bool prepared = prepare_process();
+
+constexpr char kKind[] = CLOUD_SERVER;
+
+std::unique_ptr<DavServer> &the_server() {
+  static std::unique_ptr<DavServer> server;
+  return server;
+}
+
+class Server : public ::testing::Environment {
+ public:
+  void SetUp() override { the_server() = std::make_unique<DavServer>(kKind); }
+  void TearDown() override { the_server().reset(); }
+};
+::testing::Environment *const server = ::testing::AddGlobalTestEnvironment(new Server);
+
+class WebdavStore : public TestStore {
+ public:
+  WebdavStore() : server_(*the_server()), name_("store" + std::to_string(++count_)) {
+    EXPECT_TRUE(prepared);
+  }
+
+  std::string config() const override { return config_for(name_); }
+  std::string other_config() override { return config_for(name_ + " other"); }
+  std::map<std::string, std::string> content() const override {
+    auto found = tree(root());
+    // A server may get to a request that made a folder after its sender was told to give up.
+    for (auto it = found.begin(); it != found.end();)
+      it = it->first.back() == '/' ? found.erase(it) : std::next(it);
+    return found;
+  }
+  void put(const std::string &path, const std::string &content) override {
+    make_folder(root());
+    for (auto slash = path.find('/', 1); slash != std::string::npos;
+         slash = path.find('/', slash + 1)) {
+      make_folder(root() + path.substr(0, slash));
+    }
+    write_file(root() + path, content, 0644);
+    give(root() + path);
+  }
+  void hold() override { server_.freeze(); }
+  void release() override { server_.thaw(); }
+
+  void fill(std::size_t bytes) override {
+    struct statvfs status {};
+    ASSERT_EQ(statvfs(server_.root().c_str(), &status), 0);
+    const int ballast = open((server_.root() + "/ballast").c_str(), O_WRONLY | O_CREAT, 0600);
+    ASSERT_EQ(
+        posix_fallocate(ballast, 0, static_cast<off_t>(status.f_bfree * status.f_bsize - bytes)),
+        0);
+    close(ballast);
+  }
+  void unfill() override { EXPECT_EQ(unlink((server_.root() + "/ballast").c_str()), 0); }
+
+  void lock_out() override { server_.accept_password("another"); }
+  void let_in() override { server_.accept_password("right"); }
+  bool lists_timestamps() const override { return false; }
+
+ private:
+  std::string root() const { return server_.root() + "/" + name_; }
+  std::string config_for(const std::string &name) const {
+    std::string path;
+    for (const char c : name) path += c == ' ' ? std::string("%20") : std::string(1, c);
+    return "[cloud]\nurl=webdav+http://127.0.0.1:" + std::to_string(server_.port()) + "/dav/" +
+           path + "\nuser=device\npassword=right\n";
+  }
+  static void give(const std::string &path) {
+    const passwd *nobody = getpwnam("nobody");
+    EXPECT_EQ(chown(path.c_str(), nobody->pw_uid, nobody->pw_gid), 0);
+  }
+  static void make_folder(const std::string &path) {
+    if (mkdir(path.c_str(), 0755) == 0) give(path);
+  }
+
+  static int count_;
+  DavServer &server_;
+  const std::string name_;
+};
+int WebdavStore::count_ = 0;
+
+INSTANTIATE_TEST_SUITE_P(Webdav, Conformance,
+                         ::testing::Values(StoreKind{kKind,
+                                                     []() -> std::unique_ptr<TestStore> {
+                                                       return std::make_unique<WebdavStore>();
+                                                     }}),
+                         [](const auto &info) { return std::string(info.param.name); });
+
+}  // namespace

@@ -1,0 +1,541 @@
+#include "http.h"
+
+// The checking macros would want the functions themselves, which are looked up at run time.
+#define CURL_DISABLE_TYPECHECK
+#include <curl/curl.h>
+#include <dlfcn.h>
+#include <glib.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <condition_variable>
+#include <cstdlib>
+#include <cstring>
+#include <deque>
+#include <list>
+#include <memory>
+#include <mutex>
+
+namespace transport {
+namespace {
+
+using Lock = std::unique_lock<std::mutex>;
+
+constexpr char kThreadName[] = "cloud-transport";
+constexpr const char *kLibraries[] = {"libcurl.so.4", "libcurl-gnutls.so.4"};
+constexpr long kConnectSeconds = 15;
+constexpr long kStallSeconds = 30;
+constexpr long kStallBytesPerSecond = 1;
+constexpr int kIdleMs = 15000;
+constexpr std::size_t kThreadStackBytes = 1024 * 1024;
+constexpr long kUploadBufferBytes = 64 * 1024;
+constexpr std::chrono::seconds kExitPatience{2};
+constexpr std::chrono::seconds kLongestRetryAfter{3600};
+
+struct Curl {
+  decltype(&::curl_global_init) global_init = nullptr;
+  decltype(&::curl_easy_init) easy_init = nullptr;
+  decltype(&::curl_easy_setopt) easy_setopt = nullptr;
+  decltype(&::curl_easy_getinfo) easy_getinfo = nullptr;
+  decltype(&::curl_easy_cleanup) easy_cleanup = nullptr;
+  decltype(&::curl_easy_strerror) easy_strerror = nullptr;
+  decltype(&::curl_slist_append) slist_append = nullptr;
+  decltype(&::curl_slist_free_all) slist_free_all = nullptr;
+  decltype(&::curl_getdate) getdate = nullptr;
+  decltype(&::curl_multi_init) multi_init = nullptr;
+  decltype(&::curl_multi_setopt) multi_setopt = nullptr;
+  decltype(&::curl_multi_add_handle) multi_add_handle = nullptr;
+  decltype(&::curl_multi_remove_handle) multi_remove_handle = nullptr;
+  decltype(&::curl_multi_perform) multi_perform = nullptr;
+  decltype(&::curl_multi_poll) multi_poll = nullptr;
+  decltype(&::curl_multi_wakeup) multi_wakeup = nullptr;
+  decltype(&::curl_multi_info_read) multi_info_read = nullptr;
+  decltype(&::curl_multi_cleanup) multi_cleanup = nullptr;
+};
+
+template <typename Function>
+bool find(void *library, const char *name, Function *function) {
+  *function = reinterpret_cast<Function>(dlsym(library, name));
+  return *function != nullptr;
+}
+
+bool load(Curl *curl) {
+  void *library = nullptr;
+  for (const char *name : kLibraries) {
+    if (library == nullptr) library = dlopen(name, RTLD_NOW | RTLD_LOCAL);
+  }
+  return library != nullptr && find(library, "curl_global_init", &curl->global_init) &&
+         find(library, "curl_easy_init", &curl->easy_init) &&
+         find(library, "curl_easy_setopt", &curl->easy_setopt) &&
+         find(library, "curl_easy_getinfo", &curl->easy_getinfo) &&
+         find(library, "curl_easy_cleanup", &curl->easy_cleanup) &&
+         find(library, "curl_easy_strerror", &curl->easy_strerror) &&
+         find(library, "curl_slist_append", &curl->slist_append) &&
+         find(library, "curl_slist_free_all", &curl->slist_free_all) &&
+         find(library, "curl_getdate", &curl->getdate) &&
+         find(library, "curl_multi_init", &curl->multi_init) &&
+         find(library, "curl_multi_setopt", &curl->multi_setopt) &&
+         find(library, "curl_multi_add_handle", &curl->multi_add_handle) &&
+         find(library, "curl_multi_remove_handle", &curl->multi_remove_handle) &&
+         find(library, "curl_multi_perform", &curl->multi_perform) &&
+         find(library, "curl_multi_poll", &curl->multi_poll) &&
+         find(library, "curl_multi_wakeup", &curl->multi_wakeup) &&
+         find(library, "curl_multi_info_read", &curl->multi_info_read) &&
+         find(library, "curl_multi_cleanup", &curl->multi_cleanup) &&
+         curl->global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
+}
+
+std::string lower(std::string text) {
+  std::transform(text.begin(), text.end(), text.begin(), [](char c) { return g_ascii_tolower(c); });
+  return text;
+}
+
+std::string trimmed(const std::string &text) {
+  static constexpr char kBlank[] = " \t\r\n";
+  const std::size_t first = text.find_first_not_of(kBlank);
+  if (first == std::string::npos) return "";
+  return text.substr(first, text.find_last_not_of(kBlank) - first + 1);
+}
+
+/** One request on its way; owned by its caller, who waits until done. */
+struct Exchange {
+  const HttpRequest *request = nullptr;
+  HttpAnswer answer;
+  CURL *easy = nullptr;
+  curl_slist *headers = nullptr;
+  uint64_t sent = 0;
+  bool local_failure = false;
+  bool too_long = false;
+  char error[CURL_ERROR_SIZE] = "";
+  // Guarded by the engine's mutex.
+  bool done = false;
+  bool unwanted = false;
+};
+using ExchangePtr = std::shared_ptr<Exchange>;
+
+std::size_t read_body(char *buffer, std::size_t size, std::size_t count, void *data) {
+  Exchange &exchange = *static_cast<Exchange *>(data);
+  const HttpRequest &request = *exchange.request;
+  const std::size_t wanted = std::min<uint64_t>(
+      size * count,
+      (request.body_fd >= 0 ? request.body_size : request.body.size()) - exchange.sent);
+  if (request.body_fd < 0) {
+    std::memcpy(buffer, request.body.data() + exchange.sent, wanted);
+    exchange.sent += wanted;
+    return wanted;
+  }
+  ssize_t got = 0;
+  do {
+    got = pread(request.body_fd, buffer, wanted, static_cast<off_t>(exchange.sent));
+  } while (got < 0 && errno == EINTR);
+  if (got < 0 || (got == 0 && wanted > 0)) {
+    exchange.local_failure = true;
+    return CURL_READFUNC_ABORT;
+  }
+  exchange.sent += static_cast<uint64_t>(got);
+  return static_cast<std::size_t>(got);
+}
+
+int seek_body(void *data, curl_off_t offset, int origin) {
+  if (origin != SEEK_SET || offset < 0) return CURL_SEEKFUNC_FAIL;
+  static_cast<Exchange *>(data)->sent = static_cast<uint64_t>(offset);
+  return CURL_SEEKFUNC_OK;
+}
+
+std::size_t take_header(char *buffer, std::size_t size, std::size_t count, void *data) {
+  Exchange &exchange = *static_cast<Exchange *>(data);
+  const std::string line(buffer, size * count);
+  if (line.compare(0, 5, "HTTP/") == 0) {
+    // The answer after a 100 is another one.
+    exchange.answer.headers.clear();
+    const std::size_t space = line.find(' ');
+    exchange.answer.status = space == std::string::npos
+                                 ? 0
+                                 : static_cast<int>(std::strtol(line.c_str() + space, nullptr, 10));
+    return line.size();
+  }
+  const std::size_t colon = line.find(':');
+  if (colon != std::string::npos)
+    exchange.answer.headers[lower(line.substr(0, colon))] = trimmed(line.substr(colon + 1));
+  return line.size();
+}
+
+std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *data) {
+  Exchange &exchange = *static_cast<Exchange *>(data);
+  const std::size_t length = size * count;
+  if (exchange.request->sink && exchange.answer.status >= 200 && exchange.answer.status <= 299) {
+    if (exchange.request->sink(buffer, length)) return length;
+    exchange.local_failure = true;
+    return 0;
+  }
+  if (exchange.answer.body.size() + length > kMaxAnswerBytes) {
+    exchange.too_long = true;
+    return 0;
+  }
+  exchange.answer.body.append(buffer, length);
+  return length;
+}
+
+class Engine {
+ public:
+  // Never destroyed: see stop_at_exit().
+  static Engine &get() {
+    static Engine *const engine = new Engine;
+    return *engine;
+  }
+
+  HttpAnswer perform(Ticket &ticket, const HttpRequest &request) {
+    auto exchange = std::make_shared<Exchange>();
+    exchange->request = &request;
+    ticket.set_waker([this, exchange] {
+      const Lock lock(mutex_);
+      exchange->unwanted = true;
+      if (multi_ != nullptr) curl_.multi_wakeup(multi_);
+    });
+    if (ticket.cancelled()) {
+      ticket.set_waker(nullptr);
+      exchange->answer.problem = cancelled();
+      return exchange->answer;
+    }
+    {
+      Lock lock(mutex_);
+      if (start()) {
+        incoming_.push_back(exchange);
+        curl_.multi_wakeup(multi_);
+        finished_.wait(lock, [&] { return exchange->done; });
+      } else {
+        exchange->answer.problem =
+            failure(BACKUP_TRANS_ERROR_NETWORK, "the HTTP library cannot be loaded");
+      }
+    }
+    ticket.set_waker(nullptr);
+    if (ticket.cancelled()) exchange->answer.problem = cancelled();
+    return std::move(exchange->answer);
+  }
+
+  std::optional<std::chrono::milliseconds> seconds_until(const std::string &date) const {
+    const time_t when = curl_.getdate == nullptr ? -1 : curl_.getdate(date.c_str(), nullptr);
+    if (when < 0) return std::nullopt;
+    return std::chrono::seconds(std::max<time_t>(0, when - time(nullptr)));
+  }
+
+ private:
+  Engine() = default;
+
+  // With the mutex held.
+  bool start() {
+    if (running_) return true;
+    if (!loaded_) {
+      loaded_ = load(&curl_);
+      if (!loaded_) return false;
+      // After the TLS library's own handler was registered, thus to run before it.
+      std::atexit([] { get().stop_at_exit(); });
+    }
+    if (stopping_) return false;
+    if (multi_ == nullptr) {
+      multi_ = curl_.multi_init();
+      if (multi_ == nullptr) return false;
+      curl_.multi_setopt(multi_, CURLMOPT_PIPELINING, CURLPIPE_MULTIPLEX);
+    }
+    pthread_attr_t attributes;
+    pthread_attr_init(&attributes);
+    pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
+    pthread_attr_setstacksize(&attributes, kThreadStackBytes);
+    sigset_t all;
+    sigset_t before;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &before);
+    pthread_t thread;
+    const int error = pthread_create(
+        &thread, &attributes,
+        [](void *engine) -> void * {
+          prctl(PR_SET_NAME, kThreadName);
+          static_cast<Engine *>(engine)->run();
+          return nullptr;
+        },
+        this);
+    pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    pthread_attr_destroy(&attributes);
+    running_ = error == 0;
+    return running_;
+  }
+
+  // Nothing may be inside the TLS library when the process takes it down.
+  void stop_at_exit() {
+    Lock lock(mutex_);
+    stopping_ = true;
+    if (!running_) return;
+    curl_.multi_wakeup(multi_);
+    finished_.wait_for(lock, kExitPatience, [this] { return !running_; });
+  }
+
+  void run() {
+    std::list<ExchangePtr> active;
+    for (;;) {
+      {
+        const Lock lock(mutex_);
+        if (stopping_) {
+          running_ = false;
+          finished_.notify_all();
+          return;
+        }
+        for (const ExchangePtr &exchange : incoming_) {
+          begin(*exchange);
+          active.push_back(exchange);
+        }
+        incoming_.clear();
+        for (auto it = active.begin(); it != active.end();) {
+          if ((*it)->unwanted) end(**it);
+          it = (*it)->done ? active.erase(it) : std::next(it);
+        }
+      }
+      int still_running = 0;
+      curl_.multi_perform(multi_, &still_running);
+      collect(&active);
+      int events = 0;
+      curl_.multi_poll(multi_, nullptr, 0, kIdleMs, &events);
+      const Lock lock(mutex_);
+      if (active.empty() && incoming_.empty() && events == 0 && idle_over()) {
+        curl_.multi_cleanup(multi_);
+        multi_ = nullptr;
+        running_ = false;
+        finished_.notify_all();
+        return;
+      }
+    }
+  }
+
+  bool idle_over() const {
+    return std::chrono::steady_clock::now() - last_end_ >= std::chrono::milliseconds(kIdleMs);
+  }
+
+  template <typename Value>
+  void set(Exchange &exchange, CURLoption option, Value value) {
+    curl_.easy_setopt(exchange.easy, option, value);
+  }
+
+  // With the mutex held, on the transport thread.
+  void begin(Exchange &exchange) {
+    const HttpRequest &request = *exchange.request;
+    exchange.easy = curl_.easy_init();
+    for (const std::string &header : request.headers)
+      exchange.headers = curl_.slist_append(exchange.headers, header.c_str());
+    set(exchange, CURLOPT_PRIVATE, &exchange);
+    set(exchange, CURLOPT_URL, request.url.c_str());
+    set(exchange, CURLOPT_PROTOCOLS_STR, "http,https");
+    set(exchange, CURLOPT_FOLLOWLOCATION, 0L);
+    set(exchange, CURLOPT_PATH_AS_IS, 1L);
+    set(exchange, CURLOPT_NOSIGNAL, 1L);
+    set(exchange, CURLOPT_QUICK_EXIT, 1L);
+    set(exchange, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
+    set(exchange, CURLOPT_PIPEWAIT, 1L);
+    set(exchange, CURLOPT_SSL_VERIFYPEER, 1L);
+    set(exchange, CURLOPT_SSL_VERIFYHOST, 2L);
+    if (!request.ca_file.empty()) set(exchange, CURLOPT_CAINFO, request.ca_file.c_str());
+    set(exchange, CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
+    set(exchange, CURLOPT_TIMEOUT, request.seconds);
+    set(exchange, CURLOPT_LOW_SPEED_LIMIT, kStallBytesPerSecond);
+    set(exchange, CURLOPT_LOW_SPEED_TIME, kStallSeconds);
+    set(exchange, CURLOPT_ERRORBUFFER, static_cast<char *>(exchange.error));
+    set(exchange, CURLOPT_HTTPHEADER, exchange.headers);
+    if (!request.user.empty()) {
+      set(exchange, CURLOPT_HTTPAUTH, static_cast<long>(CURLAUTH_BASIC));
+      set(exchange, CURLOPT_USERNAME, request.user.c_str());
+      set(exchange, CURLOPT_PASSWORD, request.password.c_str());
+    }
+    if (request.has_body) {
+      set(exchange, CURLOPT_UPLOAD, 1L);
+      set(exchange, CURLOPT_UPLOAD_BUFFERSIZE, kUploadBufferBytes);
+      set(exchange, CURLOPT_INFILESIZE_LARGE,
+          static_cast<curl_off_t>(request.body_fd >= 0 ? request.body_size : request.body.size()));
+      set(exchange, CURLOPT_READFUNCTION, &read_body);
+      set(exchange, CURLOPT_READDATA, &exchange);
+      set(exchange, CURLOPT_SEEKFUNCTION, &seek_body);
+      set(exchange, CURLOPT_SEEKDATA, &exchange);
+    }
+    if (request.method == "HEAD") set(exchange, CURLOPT_NOBODY, 1L);
+    set(exchange, CURLOPT_CUSTOMREQUEST, request.method.c_str());
+    set(exchange, CURLOPT_HEADERFUNCTION, &take_header);
+    set(exchange, CURLOPT_HEADERDATA, &exchange);
+    set(exchange, CURLOPT_WRITEFUNCTION, &take_body);
+    set(exchange, CURLOPT_WRITEDATA, &exchange);
+    curl_.multi_add_handle(multi_, exchange.easy);
+  }
+
+  // With the mutex held, on the transport thread.
+  void end(Exchange &exchange) {
+    if (exchange.done) return;
+    curl_.multi_remove_handle(multi_, exchange.easy);
+    curl_.easy_cleanup(exchange.easy);
+    curl_.slist_free_all(exchange.headers);
+    exchange.done = true;
+    last_end_ = std::chrono::steady_clock::now();
+    finished_.notify_all();
+  }
+
+  void collect(std::list<ExchangePtr> *active) {
+    int left = 0;
+    while (CURLMsg *message = curl_.multi_info_read(multi_, &left)) {
+      if (message->msg != CURLMSG_DONE) continue;
+      const CURLcode code = message->data.result;
+      char *data = nullptr;
+      curl_.easy_getinfo(message->easy_handle, CURLINFO_PRIVATE, &data);
+      Exchange &exchange = *reinterpret_cast<Exchange *>(data);
+      exchange.answer.problem = problem_of(exchange, code);
+      const Lock lock(mutex_);
+      end(exchange);
+      active->remove_if([&](const ExchangePtr &other) { return other.get() == &exchange; });
+    }
+  }
+
+  Outcome problem_of(const Exchange &exchange, CURLcode code) const {
+    if (code == CURLE_OK) return success();
+    if (exchange.local_failure)
+      return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, "the local file cannot be read or written");
+    if (exchange.too_long)
+      return failure(BACKUP_TRANS_ERROR_SERVER, "the server's answer is too long");
+    std::string text = exchange.error[0] != '\0' ? exchange.error : curl_.easy_strerror(code);
+    switch (code) {
+      case CURLE_PEER_FAILED_VERIFICATION:
+      case CURLE_SSL_CACERT_BADFILE:
+      case CURLE_SSL_ISSUER_ERROR:
+      case CURLE_SSL_PINNEDPUBKEYNOTMATCH:
+        return failure(BACKUP_TRANS_ERROR_CERTIFICATE, std::move(text));
+      case CURLE_UNSUPPORTED_PROTOCOL:
+      case CURLE_WEIRD_SERVER_REPLY:
+        return failure(BACKUP_TRANS_ERROR_SERVER, std::move(text));
+      default: {
+        Outcome lost = failure(BACKUP_TRANS_ERROR_NETWORK, std::move(text));
+        lost.transient = true;
+        return lost;
+      }
+    }
+  }
+
+  std::mutex mutex_;
+  std::condition_variable finished_;
+  Curl curl_;
+  CURLM *multi_ = nullptr;
+  bool loaded_ = false;
+  bool running_ = false;
+  bool stopping_ = false;
+  std::deque<ExchangePtr> incoming_;
+  std::chrono::steady_clock::time_point last_end_;
+};
+
+std::optional<std::chrono::milliseconds> retry_after(const HttpAnswer &answer) {
+  const std::string text = answer.header("retry-after");
+  if (text.empty()) return std::nullopt;
+  if (text.find_first_not_of("0123456789") == std::string::npos) {
+    const auto seconds = std::chrono::seconds(g_ascii_strtoull(text.c_str(), nullptr, 10));
+    return std::min<std::chrono::seconds>(seconds, kLongestRetryAfter);
+  }
+  return Engine::get().seconds_until(text);
+}
+
+}  // namespace
+
+std::string HttpAnswer::header(const std::string &name) const {
+  const auto it = headers.find(name);
+  return it == headers.end() ? "" : it->second;
+}
+
+HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request) {
+  return Engine::get().perform(ticket, request);
+}
+
+Outcome outcome_of(const HttpAnswer &answer, const char *what) {
+  if (!answer.complete()) return answer.problem;
+  if (answer.good()) return success();
+  Outcome outcome =
+      failure(BACKUP_TRANS_ERROR_SERVER,
+              std::string(what) + ": the server answered " + std::to_string(answer.status));
+  switch (answer.status) {
+    case 401:
+    case 403:
+    case 407:
+      outcome.code = BACKUP_TRANS_ERROR_AUTHENTICATION;
+      break;
+    case 404:
+    case 410:
+      outcome.code = BACKUP_TRANS_ERROR_NO_SUCH_OBJECT;
+      break;
+    case 412:
+      outcome.code = BACKUP_TRANS_ERROR_CONFLICT;
+      break;
+    case 413:
+    case 507:
+      outcome.code = BACKUP_TRANS_ERROR_QUOTA;
+      break;
+    case 408:
+      outcome.code = BACKUP_TRANS_ERROR_NETWORK;
+      outcome.transient = true;
+      break;
+    case 425:
+    case 429:
+    case 500:
+    case 502:
+    case 503:
+    case 504:
+      outcome.transient = true;
+      break;
+    default:
+      break;
+  }
+  if (outcome.transient) outcome.retry_after = retry_after(answer);
+  return outcome;
+}
+
+std::string encode_path(const std::string &path) {
+  char *text = g_uri_escape_string(path.c_str(), "/", FALSE);
+  std::string encoded = text;
+  g_free(text);
+  return encoded;
+}
+
+bool is_loopback(const std::string &host) {
+  return host == "localhost" || host == "::1" ||
+         (host.compare(0, 4, "127.") == 0 &&
+          host.find_first_not_of("0123456789.") == std::string::npos);
+}
+
+bool parse_store_url(const std::string &url, const std::string &scheme, StoreUrl *parsed,
+                     std::string *problem) {
+  const std::string prefix = scheme + "+";
+  if (url.compare(0, prefix.size(), prefix) != 0) return false;
+  GUri *uri = g_uri_parse(url.c_str() + prefix.size(), G_URI_FLAGS_NONE, nullptr);
+  const auto problem_of_uri = [&]() -> const char * {
+    if (uri == nullptr || g_uri_get_host(uri) == nullptr || *g_uri_get_host(uri) == '\0')
+      return "the url is not complete";
+    if (g_uri_get_userinfo(uri) != nullptr)
+      return "the url holds a user or password, which belong into keys of their own";
+    if (g_uri_get_query(uri) != nullptr || g_uri_get_fragment(uri) != nullptr)
+      return "the url has a query or fragment";
+    const std::string transport = g_uri_get_scheme(uri);
+    if (transport == "https" || (transport == "http" && is_loopback(g_uri_get_host(uri))))
+      return nullptr;
+    return transport == "http" ? "plain http is for this machine itself only"
+                               : "the url names no store that is known";
+  };
+  const char *found = problem_of_uri();
+  if (found != nullptr) {
+    *problem = found;
+  } else {
+    const std::string host = g_uri_get_host(uri);
+    parsed->host = host;
+    parsed->origin = std::string(g_uri_get_scheme(uri)) + "://" +
+                     (host.find(':') == std::string::npos ? host : "[" + host + "]");
+    if (g_uri_get_port(uri) > 0) parsed->origin += ":" + std::to_string(g_uri_get_port(uri));
+    parsed->path = g_uri_get_path(uri);
+    while (!parsed->path.empty() && parsed->path.back() == '/') parsed->path.pop_back();
+    parsed->base = parsed->origin + encode_path(parsed->path);
+  }
+  if (uri != nullptr) g_uri_unref(uri);
+  return found == nullptr;
+}
+
+}  // namespace transport
