@@ -144,9 +144,10 @@ void show_tmp_entry(const std::string &device, int host_tmp, const std::string &
 /** Remove the empty places where entries of the host's /tmp were shown. */
 void forget_tmp_entries(const std::string &device) {
   std::ifstream file(device + "/" + kMountsFile);
+  const fs::path places = device + "/root/tmp";
   std::string name;
   while (std::getline(file, name)) {
-    const std::string place = device + "/root/tmp/" + name;
+    const fs::path place = places / name;
     struct stat status {};
     if (lstat(place.c_str(), &status) != 0) continue;
     if (S_ISDIR(status.st_mode)) {

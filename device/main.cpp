@@ -93,7 +93,7 @@ std::string program_directory() {
 std::string open_device(const std::string &dir) {
   char *path = realpath(dir.c_str(), nullptr);
   if (path == nullptr) throw Failure("no device in " + dir + ": " + reason());
-  const std::string device = path;
+  std::string device = path;
   std::free(path);
   struct stat status {};
   if (stat((device + "/state/device.ini").c_str(), &status) != 0) {
