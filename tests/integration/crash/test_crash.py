@@ -215,12 +215,12 @@ class KilledRestore(CrashTest):
         yield lambda: os.path.exists(
             os.path.join(self.root, "shared/data", PACKAGE + "_download.zip"))
         yield lambda: os.path.exists(snapshot)
-        for share in range(3):
-            number = self.random.randrange(FILES * share // 3, FILES * (share + 1) // 3)
+        for share in range(2):
+            number = self.random.randrange(FILES * share // 2, FILES * (share + 1) // 2)
             yield lambda number=number: self.count("shared/data/quarn_tmp_rst_dir") > number
         yield lambda: os.path.exists(table)
-        for share in range(3):
-            number = self.random.randrange(FILES * share // 9, FILES * (share + 1) // 9)
+        for share in range(2):
+            number = self.random.randrange(FILES * share // 6, FILES * (share + 1) // 6)
             yield lambda number=number: os.path.exists(table) and self.count(
                 "data", content=b"saved") > number
         yield lambda: os.path.exists(unpacked_table)

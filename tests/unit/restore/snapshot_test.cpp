@@ -56,6 +56,33 @@ TEST_F(SnapshotTest, IsReadableToNobodyElse) {
   EXPECT_EQ(status.st_uid, 0U);
 }
 
+TEST_F(SnapshotTest, WhileItIsCompleteTheHalfRestoredDataIsNotPacked) {
+  make_old_data();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  std::filesystem::remove(perm());
+  const std::string archive = base + "/archive.zip";
+  int error = 0;
+  make_zip_data(kPkg, root.c_str(), archive.c_str(), &error);
+  EXPECT_EQ(error, 36);
+  EXPECT_FALSE(exists(archive));
+  expect_error("restore of (org.example.notes) was interrupted, so its data is not packed");
+  ASSERT_TRUE(recover_interrupted_restore(kPkg, root.c_str()));
+  error = 0;
+  make_zip_data(kPkg, root.c_str(), archive.c_str(), &error);
+  EXPECT_EQ(error, 0);
+  EXPECT_TRUE(exists(archive));
+}
+
+TEST_F(SnapshotTest, AnApplicationsOwnFolderOfThatNameHindersNoBackup) {
+  make_old_data();
+  dir("shared/data/quarn_tmp_rst_dir", 0700);
+  file("shared/data/quarn_tmp_rst_dir/shared/data/org.example.notes.perm", "{}");
+  int error = 0;
+  make_zip_data(kPkg, root.c_str(), (base + "/archive.zip").c_str(), &error);
+  EXPECT_EQ(error, 0);
+}
+
 TEST_F(SnapshotTest, LeavesTheDataAlone) {
   make_old_data();
   const Tree before = tree();
