@@ -19,6 +19,9 @@ MACHINE_SECONDS = 2.0
 WAITS = {"x86_64": {"7": ("0xffffffff", "0xffffffffffffffff"), "271": ("0x0",)},
          "aarch64": {"73": ("0x0",)}}
 
+TEAR_DOWN = ["connection destroy ~", "backup-transport deinit ~", "remove alarm ~",
+             "quarnd_dbus_deinit ~", "ecore_shutdown ~", "Good-Bye from Quarn"]
+
 
 def request(number):
     return GLib.Variant("(u)", (number,))
@@ -87,6 +90,10 @@ class BusTest(TestCase):
     def lines(self):
         return texts(self.device.log())
 
+    def assert_lines_in_order(self, expected):
+        """Each once, in this order; the worker's lines may be between them."""
+        self.assertEqual([line for line in self.lines() if line in expected], expected)
+
 
 class Process(BusTest):
     def test_without_an_account_it_exits_zero_and_never_owns_the_name(self):
@@ -107,12 +114,8 @@ class Process(BusTest):
         daemon = self.run_owning_daemon()
         self.assertEqual(self.client.call("set_activation", integer(0)), (0,))
         self.assertEqual(self.finished(daemon), 0)
-        lines = self.lines()
-        for line in ("try to terminate quarn", "last backup time setted to 0", "terminate quarn"):
-            self.assertIn(line, lines)
-        self.assertEqual(lines[-6:], ["connection destroy ~", "backup-transport deinit ~",
-                                      "remove alarm ~", "quarnd_dbus_deinit ~",
-                                      "ecore_shutdown ~", "Good-Bye from Quarn"])
+        self.assert_lines_in_order(["try to terminate quarn", "last backup time setted to 0",
+                                    "terminate quarn"] + TEAR_DOWN)
         self.assertIsNone(self.client.owner())
 
     def test_set_activation_one_keeps_it(self):
@@ -173,7 +176,8 @@ class Process(BusTest):
         def waits_forever():
             with open("/proc/%d/syscall" % pid) as file:
                 fields = file.read().split()
-            return fields[3] in waits.get(fields[0], ())
+            # A process that runs has no system call to show.
+            return len(fields) > 3 and fields[3] in waits.get(fields[0], ())
         wait_until(waits_forever, "the main thread waits for nothing but events")
 
 
@@ -193,11 +197,7 @@ class Signals(BusTest):
         self.assertEqual(status, 0)
         self.assertLess(seconds, SIGNAL_SECONDS + MACHINE_SECONDS)
         self.assertIsNone(self.client.owner())
-        lines = self.lines()
-        self.assertEqual(lines[lines.index("SIGNAL %d received" % number):],
-                         ["SIGNAL %d received" % number, "connection destroy ~",
-                          "backup-transport deinit ~", "remove alarm ~", "quarnd_dbus_deinit ~",
-                          "ecore_shutdown ~", "Good-Bye from Quarn"])
+        self.assert_lines_in_order(["SIGNAL %d received" % number] + TEAR_DOWN)
 
     def test_interrupt(self):
         self.check_signal(signal.SIGINT)
@@ -242,7 +242,7 @@ class Signals(BusTest):
         self.client.call("manual_backup_start", request(1))
         self.client.until(lambda: self.client.held, "the last callback, not answered")
         self.assertEqual(self.end_by(daemon, signal.SIGTERM)[0], 0)
-        self.assertEqual(self.lines()[-1], "Good-Bye from Quarn")
+        self.assert_lines_in_order(["SIGNAL 15 received"] + TEAR_DOWN)
 
 
 class Replies(BusTest):
