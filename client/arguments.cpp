@@ -31,6 +31,11 @@ struct VerbInfo {
 };
 
 constexpr VerbInfo kVerbs[] = {
+    {Verb::status, "status", "", "what the daemon and its backups are at",
+     "Automatic backup and its conditions, pending alarms, the last backup, what is running, and\n"
+     "this device's packages in the cloud's application list. A daemon that does not run is\n"
+     "started; without Wi-Fi the list is not asked for.\n",
+     kListWait, 0, 0},
     {Verb::activate, "activate", "", "start the daemon, or keep it from ending",
      "The daemon is started when it does not run; one that was about to end stays.\n", kShortWait,
      0, 0},

@@ -25,6 +25,7 @@ enum exit_code : int {
 enum class Verb {
   help,
   version,
+  status,
   activate,
   deactivate,
   backup,

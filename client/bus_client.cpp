@@ -11,6 +11,9 @@ namespace {
 
 constexpr char kBusService[] = "org.freedesktop.DBus";
 constexpr char kBusPath[] = "/org/freedesktop/DBus";
+constexpr char kPropertiesInterface[] = "org.freedesktop.DBus.Properties";
+constexpr char kStatusPath[] = "/org/orvane/Quarn/Status";
+constexpr char kStatusInterface[] = "org.orvane.Quarn.Status";
 constexpr char kProgressSignal[] = "progress";
 constexpr char kProgressPath[] = "/progress";
 // The caller has a clock of its own; the bus library's would end a long transfer.
@@ -253,11 +256,23 @@ void BusClient::on_method(GDBusConnection *, const char *sender, const char *, c
 
 void BusClient::call(const char *method, GVariant *arguments, const char *reply_type, Reply reply,
                      Failure failure) {
+  call_object(kQuarnObjectPath, kQuarnInterface, method, arguments, reply_type, std::move(reply),
+              std::move(failure));
+}
+
+void BusClient::read_status(Reply reply, Failure failure) {
+  call_object(kStatusPath, kPropertiesInterface, "GetAll", g_variant_new("(s)", kStatusInterface),
+              "(a{sv})", std::move(reply), std::move(failure));
+}
+
+void BusClient::call_object(const char *path, const char *interface, const char *method,
+                            GVariant *arguments, const char *reply_type, Reply reply,
+                            Failure failure) {
   const VariantType type(g_variant_type_new(reply_type));
   auto *pending = new PendingCall{std::move(reply), std::move(failure)};
-  g_dbus_connection_call(connection_.get(), kQuarnBusName, kQuarnObjectPath, kQuarnInterface,
-                         method, arguments, type.get(), G_DBUS_CALL_FLAGS_NONE, kNoTimeout,
-                         cancellable_.get(), on_reply, pending);
+  g_dbus_connection_call(connection_.get(), kQuarnBusName, path, interface, method, arguments,
+                         type.get(), G_DBUS_CALL_FLAGS_NONE, kNoTimeout, cancellable_.get(),
+                         on_reply, pending);
 }
 
 void BusClient::on_reply(GObject *source, GAsyncResult *result, gpointer user_data) {

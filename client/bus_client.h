@@ -75,6 +75,9 @@ class BusClient {
   void call(const char *method, GVariant *arguments, const char *reply_type, Reply reply,
             Failure failure);
 
+  /** Reads all properties of the daemon's status object; the reply is "(a{sv})". */
+  void read_status(Reply reply, Failure failure);
+
   /** Waits until everything is written: a reply that is still queued would be lost at the exit. */
   void flush();
 
@@ -95,6 +98,8 @@ class BusClient {
   static void on_reply(GObject *source, GAsyncResult *result, gpointer user_data);
 
   bool export_object();
+  void call_object(const char *path, const char *interface, const char *method, GVariant *arguments,
+                   const char *reply_type, Reply reply, Failure failure);
 
   struct PendingCall;
 

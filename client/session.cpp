@@ -15,6 +15,7 @@
 #include "quarn_common.h"
 #include "quarn_handles.h"
 #include "screen.h"
+#include "status.h"
 #include "text.h"
 
 namespace quarn_client {
@@ -22,6 +23,7 @@ namespace quarn_client {
 namespace {
 
 constexpr int kMsPerSecond = 1000;
+constexpr std::int64_t kUsPerMs = 1000;
 constexpr guint kGraceMs = 1000;
 constexpr int kCloudClient = 0;
 constexpr int kOn = 1;
@@ -47,6 +49,14 @@ std::string seconds_words(double seconds) {
   return std::string(g_ascii_formatd(buffer, sizeof buffer, "%g", seconds)) + " seconds";
 }
 
+std::string packages_table(const BackupSet &set) {
+  std::vector<std::vector<std::string>> rows;
+  for (const SetPackage &package : set.packages) {
+    rows.push_back({package.id, package.version, crc_text(package.crc)});
+  }
+  return table_text({"PACKAGE", "VERSION", "CRC"}, rows);
+}
+
 class Session {
  public:
   explicit Session(const Command &command);
@@ -64,7 +74,11 @@ class Session {
   void cancel();
   void app_request(const char *method, const char *what, const char *done);
   void app_export();
-  void fetch_list(std::function<void(const BackupSets &)> then);
+  /** @param otherwise what a list that cannot be had leads to; by default the end */
+  void fetch_list(std::function<void(const BackupSets &)> then,
+                  std::function<void(const std::string &error)> otherwise = nullptr);
+  void show_status();
+  void show_status_packages(const std::string &serial);
   void show_list(const BackupSets &sets);
   void show_sets(const BackupSets &sets);
   void restore_on(const BackupSets &sets);
@@ -156,6 +170,8 @@ void Session::begin() {
   if (done_) return;
   called_ = true;
   switch (command_.verb) {
+    case Verb::status:
+      return show_status();
     case Verb::activate:
       return switch_state("set_activation", kOn, "the daemon is active");
     case Verb::deactivate:
@@ -288,24 +304,23 @@ void Session::app_export() {
   });
 }
 
-void Session::fetch_list(std::function<void(const BackupSets &)> then) {
-  on_answer_ = [this, then = std::move(then)] {
+void Session::fetch_list(std::function<void(const BackupSets &)> then,
+                         std::function<void(const std::string &error)> otherwise) {
+  on_answer_ = [this, then = std::move(then), otherwise = std::move(otherwise)] {
     if (!reply_ && !callback_) return;
-    if (callback_ && callback_->result == QUARN_BAD_ARGUMENT) {
-      return finish(QUARN_BAD_ARGUMENT,
-                    "the cloud holds no application list yet, or it could not be fetched (" +
-                        std::to_string(QUARN_BAD_ARGUMENT) + ")");
-    }
-    if (callback_ && callback_->result != QUARN_OK) {
-      return finish_with(callback_->result, "getting the application list", "");
-    }
-    if (reply_ && *reply_ != QUARN_OK && !callback_) {
-      return finish_with(*reply_, "getting the application list", "");
+    const int result = callback_ ? callback_->result : *reply_;
+    if (result != QUARN_OK) {
+      std::string error = "getting the application list failed: " + result_words(result);
+      if (callback_ && result == QUARN_BAD_ARGUMENT) {
+        error = "the cloud holds no application list yet, or it could not be fetched (" +
+                std::to_string(result) + ")";
+      }
+      return otherwise ? otherwise(error) : finish(exit_of(result), error);
     }
     if (!reply_ || !callback_) return;
     std::string error;
     const auto sets = parse_backup_sets(callback_->text, error);
-    if (!sets) return finish(EXIT_PROTOCOL, error);
+    if (!sets) return otherwise ? otherwise(error) : finish(EXIT_PROTOCOL, error);
     if (sets->left_out > 0) {
       json_object_object_add(document_.get(), "left_out",
                              json_object_new_int64(static_cast<std::int64_t>(sets->left_out)));
@@ -317,6 +332,53 @@ void Session::fetch_list(std::function<void(const BackupSets &)> then) {
     reply_ = result;
     answered();
   });
+}
+
+void Session::show_status() {
+  client_->read_status(
+      [this](GVariant *answer) {
+        if (done_) return;
+        const DaemonStatus status = read_status(answer);
+        const std::int64_t now_ms = g_get_real_time() / kUsPerMs;
+        status_to_json(status, now_ms, document_.get());
+        screen_.text(status_text(status, now_ms));
+        // Without Wi-Fi the daemon would try for a minute to reach the cloud.
+        if (!status.wifi.value_or(false)) {
+          json_object_object_add(document_.get(), "packages", nullptr);
+          screen_.line("packages          not known without Wi-Fi");
+          return finish(QUARN_OK);
+        }
+        show_status_packages(status.serial);
+      },
+      [this](const BusFailure &failure) { fail(failure); });
+}
+
+void Session::show_status_packages(const std::string &serial) {
+  fetch_list(
+      [this, serial](const BackupSets &sets) {
+        const BackupSet *set = find_set(sets, serial);
+        BackupSets own;
+        if (set != nullptr) own.sets.push_back(*set);
+        const JsonPtr array(sets_to_json(own));
+        json_object *packages = nullptr;
+        if (set != nullptr) {
+          json_object_object_get_ex(json_object_array_get_idx(array.get(), 0), "packages",
+                                    &packages);
+        }
+        json_object_object_add(
+            document_.get(), "packages",
+            packages == nullptr ? json_object_new_array() : json_object_get(packages));
+        screen_.line("packages          " +
+                     std::to_string(set == nullptr ? 0 : set->packages.size()) +
+                     " in the cloud's list");
+        if (set != nullptr) screen_.text(packages_table(*set));
+        finish(QUARN_OK);
+      },
+      [this](const std::string &error) {
+        json_object_object_add(document_.get(), "packages", nullptr);
+        screen_.line("packages          not known: " + printable(error));
+        finish(QUARN_OK);
+      });
 }
 
 void Session::show_list(const BackupSets &sets) {

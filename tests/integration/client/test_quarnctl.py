@@ -8,7 +8,7 @@ import sys
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import BIN_DIR, TestCase, make_source  # noqa: E402
+from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
 
 SERIAL = "350000000000017"
 OTHER = "350000000000025"
@@ -80,6 +80,30 @@ class QuarnctlTest(TestCase):
         self.quarnctl("rules", "explain", NOTES, "data/none", status=66)
         self.quarnctl("rules", "check", "org.example.none", status=66)
         self.assertIsNone(self.device.daemon_pid())
+
+    def test_status_follows_the_device(self):
+        self.install(self.device, NOTES)
+        before = self.document("status")
+        self.assertEqual((before["serial"], before["model"]), (SERIAL, "Orvane One"))
+        self.assertEqual((before["auto_backup"], before["last_backup_ms"], before["packages"]),
+                         (False, None, None))
+        self.quarnctl("backup")
+        self.quarnctl("auto", "on")
+        self.device.set("charger", "on")
+        self.device.set("display", "off")
+        wait_until(lambda: self.document("status")["condition_alarm_ms"], "the alarm is armed")
+        status = self.document("status")
+        for member in ("auto_backup", "charger_connected", "wifi_connected", "screen_off"):
+            self.assertIs(status[member], True, member)
+        # The daemon and the alarm service each take the time themselves.
+        self.assertTrue(any(abs(alarm["due_ms"] - status["condition_alarm_ms"]) < 1000
+                            for alarm in self.device.alarms()))
+        self.assertEqual([entry["package"] for entry in status["packages"]], [NOTES])
+        self.assertLess(status["last_backup_age_ms"], 600000)
+        self.assertIs(status["backup_running"], False)
+        self.device.set("network", "none")
+        wait_until(lambda: self.document("status")["wifi_connected"] is False, "Wi-Fi is gone")
+        self.assertIn("not known without Wi-Fi", self.quarnctl("status").stdout)
 
     def test_without_wifi_the_result_is_told_in_words(self):
         self.install(self.device, NOTES)

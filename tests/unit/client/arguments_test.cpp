@@ -22,6 +22,7 @@ std::string error_of(const std::vector<std::string> &arguments) {
 }
 
 TEST(Arguments, EveryVerbIsKnown) {
+  EXPECT_EQ(parsed({"status"}).verb, Verb::status);
   EXPECT_EQ(parsed({"activate"}).verb, Verb::activate);
   EXPECT_EQ(parsed({"deactivate"}).verb, Verb::deactivate);
   EXPECT_EQ(parsed({"backup"}).verb, Verb::backup);
@@ -92,10 +93,10 @@ TEST(Arguments, TextThatIsNotUtf8IsRefusedBeforeTheBusWould) {
 
 TEST(Arguments, EveryVerbHasHelp) {
   const std::vector<std::vector<std::string>> verbs = {
-      {"activate"},      {"deactivate"},     {"backup"},        {"cancel"},
-      {"auto"},          {"last-time"},      {"list"},          {"sets"},
-      {"app", "backup"}, {"app", "restore"}, {"app", "export"}, {"restore", "on"},
-      {"restore", "off"}};
+      {"status"},        {"activate"},      {"deactivate"},     {"backup"},
+      {"cancel"},        {"auto"},          {"last-time"},      {"list"},
+      {"sets"},          {"app", "backup"}, {"app", "restore"}, {"app", "export"},
+      {"restore", "on"}, {"restore", "off"}};
   for (std::vector<std::string> verb : verbs) {
     const std::string name = verb.size() == 2 ? verb[0] + " " + verb[1] : verb[0];
     std::vector<std::string> other = verb;

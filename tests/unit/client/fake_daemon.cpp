@@ -155,10 +155,32 @@ void FakeDaemon::die() {
   if (g_dbus_connection_is_closed(connection_.get()) == FALSE) {
     g_dbus_connection_flush_sync(connection_.get(), nullptr, nullptr);
     g_dbus_connection_unregister_object(connection_.get(), object_);
+    if (status_filter_ != 0) g_dbus_connection_remove_filter(connection_.get(), status_filter_);
+    status_filter_ = 0;
     g_dbus_connection_close_sync(connection_.get(), nullptr, nullptr);
   }
   while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
   }
+}
+
+void FakeDaemon::serve_status(GVariant *properties) {
+  status_.reset(g_variant_ref_sink(properties));
+  status_filter_ = g_dbus_connection_add_filter(connection_.get(), answer_status, this, nullptr);
+}
+
+GDBusMessage *FakeDaemon::answer_status(GDBusConnection *connection, GDBusMessage *message,
+                                        gboolean incoming, gpointer user_data) {
+  auto *self = static_cast<FakeDaemon *>(user_data);
+  const char *path = g_dbus_message_get_path(message);
+  if (incoming == FALSE || path == nullptr || std::string(path) != "/org/orvane/Quarn/Status") {
+    return message;
+  }
+  const Handle<GDBusMessage, &g_object_unref> reply(g_dbus_message_new_method_reply(message));
+  g_dbus_message_set_body(reply.get(), g_variant_new("(@a{sv})", self->status_.get()));
+  g_dbus_connection_send_message(connection, reply.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
+                                 nullptr);
+  g_object_unref(message);
+  return nullptr;
 }
 
 void FakeDaemon::publish(const std::string &text) {

@@ -74,6 +74,8 @@ class FakeDaemon {
 
   /** Leaves the bus, as a process that dies does. */
   void die();
+  /** Serves a status object; @p properties is an a{sv}. */
+  void serve_status(GVariant *properties);
   /** Publishes a "progress" signal. */
   void publish(const std::string &text);
   GDBusConnection *connection() const { return connection_.get(); }
@@ -81,12 +83,16 @@ class FakeDaemon {
   const std::vector<std::string> &calls() const { return calls_; }
 
  private:
+  static GDBusMessage *answer_status(GDBusConnection *connection, GDBusMessage *message,
+                                     gboolean incoming, gpointer user_data);
   static void on_call(GDBusConnection *connection, const char *sender, const char *path,
                       const char *interface, const char *method, GVariant *parameters,
                       GDBusMethodInvocation *invocation, gpointer user_data);
 
   Handle<GDBusConnection, &g_object_unref> connection_;
   guint object_ = 0;
+  guint status_filter_ = 0;
+  GVariantPtr status_;
   std::map<std::string, Script> scripts_;
   std::vector<std::string> calls_;
 };
