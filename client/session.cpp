@@ -24,7 +24,7 @@ namespace {
 
 constexpr int kMsPerSecond = 1000;
 constexpr std::int64_t kUsPerMs = 1000;
-constexpr guint kGraceMs = 1000;
+constexpr guint kGraceMs = 2000;
 constexpr int kCloudClient = 0;
 constexpr int kOn = 1;
 constexpr int kOff = 0;

@@ -48,9 +48,13 @@ GVariantPtr child(GDBusMethodInvocation *invocation, std::size_t index) {
       g_variant_get_child_value(g_dbus_method_invocation_get_parameters(invocation), index));
 }
 
+/** Calls back that quarnctl has not answered yet. */
+int unanswered = 0;
+
 void after_call_back(GObject *source, GAsyncResult *result, gpointer user_data) {
   const std::unique_ptr<std::function<void()>> then(
       static_cast<std::function<void()> *>(user_data));
+  --unanswered;
   GErrorPtr error;
   const GVariantPtr reply(
       g_dbus_connection_call_finish(G_DBUS_CONNECTION(source), result, out(error)));
@@ -131,6 +135,7 @@ void IncomingCall::reply_raw(GVariant *value) const {
 
 void IncomingCall::call_back(const char *method, GVariant *arguments,
                              std::function<void()> then) const {
+  ++unanswered;
   g_dbus_connection_call(connection_, client().c_str(), kQuarnObjectPath, kQuarnInterface, method,
                          arguments, G_VARIANT_TYPE("(i)"), G_DBUS_CALL_FLAGS_NONE, -1, nullptr,
                          after_call_back, new std::function<void()>(std::move(then)));
@@ -149,7 +154,11 @@ FakeDaemon::FakeDaemon(const PrivateBus &bus) : connection_(bus.connect()) {
   EXPECT_TRUE(reply) << (error ? error->message : "");
 }
 
-FakeDaemon::~FakeDaemon() { die(); }
+FakeDaemon::~FakeDaemon() {
+  // An answer may still be on its way when quarnctl itself has ended.
+  EXPECT_TRUE(run_until([] { return unanswered == 0; }));
+  die();
+}
 
 void FakeDaemon::die() {
   if (g_dbus_connection_is_closed(connection_.get()) == FALSE) {
