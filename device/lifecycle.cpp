@@ -46,13 +46,14 @@ constexpr char kBusName[] = "org.orvane.Quarn";
 constexpr char kDaemonTmpEntry[] = "quarn";
 constexpr char kSupervisorFile[] = "run/supervisor";
 constexpr char kMountsFile[] = "run/tmp-mounts";
+constexpr char kRestartsFile[] = "run/restarts";
 /** The supervisor keeps the host's own /tmp open under this number. */
 constexpr int kHostTmpFd = 100;
 constexpr int kStopSeconds = 10;
 constexpr int kStartMilliseconds = 20000;
 constexpr int kMillisInSecond = 1000;
 constexpr char kReady = 'R';
-/** A daemon that asks for its restart gets it this often at the most. */
+/** A daemon that asks for its restart gets it this often in a row. */
 constexpr int kMaxRestarts = 5;
 
 [[noreturn]] void wrong_use() { throw Failure("", DEVICE_USAGE); }
@@ -606,6 +607,36 @@ std::string read_all(int fd) {
   return text;
 }
 
+/** Count the restarts in a row; a clean end begins a new one. */
+bool may_restart(const std::string &device, bool failed) {
+  const std::string path = device + "/" + kRestartsFile;
+  int restarts = 0;
+  std::ifstream(path) >> restarts;
+  if (!failed || restarts >= kMaxRestarts) {
+    unlink(path.c_str());
+    return false;
+  }
+  write_file(path, std::to_string(restarts + 1) + "\n");
+  return true;
+}
+
+/** Ask the bus for the daemon without waiting for it. */
+void request_daemon(const std::string &device) {
+  const Connection connection = connect_bus(device);
+  const std::unique_ptr<GDBusMessage, Unref> message(
+      g_dbus_message_new_method_call("org.freedesktop.DBus", "/org/freedesktop/DBus",
+                                     "org.freedesktop.DBus", "StartServiceByName"));
+  g_dbus_message_set_body(message.get(), g_variant_new("(su)", kBusName, 0U));
+  g_dbus_message_set_flags(message.get(), G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED);
+  g_dbus_connection_send_message(connection.get(), message.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE,
+                                 nullptr, nullptr);
+  // An answer tells that the bus has read this far: it still counts us as the daemon's start then,
+  // and one that never took its name is not started again and again.
+  GVariant *answer = call_bus(connection.get(), "GetId", nullptr, nullptr);
+  if (answer == nullptr) throw Failure("cannot ask the bus for the daemon");
+  g_variant_unref(answer);
+}
+
 }  // namespace
 
 std::string bus_address(const std::string &device) {
@@ -631,6 +662,7 @@ int verb_start(const Arguments &arguments) {
   }
   end_leftovers(device, "");
   forget_tmp_entries(device);
+  unlink((device + "/" + kRestartsFile).c_str());
   const Fd told(fork_supervisor(device));
   const std::string answer = read_all(told.fd);
   if (answer.empty() || answer[0] != kReady) {
@@ -727,25 +759,25 @@ int verb_daemon(const Arguments &arguments) {
     throw Failure("no quarnd beside this program nor in its place of installation");
   }
   set_environment(arguments[0]);
-  // What a service manager does for a daemon that ends with a failure status.
-  for (int starts = 0; starts <= kMaxRestarts; ++starts) {
-    const pid_t self = getpid();
-    const pid_t pid = fork();
-    if (pid < 0) throw Failure("cannot start the daemon: " + reason());
-    if (pid == 0) {
-      prctl(PR_SET_PDEATHSIG, SIGTERM);
-      if (getppid() != self) _exit(1);
-      execl(program.c_str(), "quarnd", nullptr);
-      std::fprintf(stderr, "quarn-device: cannot run %s: %s\n", program.c_str(),
-                   std::strerror(errno));
-      _exit(DEVICE_OK);
-    }
-    int status = 0;
-    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-    }
-    embedded::drop_power_locks(arguments[0], pid);
-    if (!WIFEXITED(status) || WEXITSTATUS(status) == 0) break;
+  const std::string &device = arguments[0];
+  const pid_t self = getpid();
+  const pid_t pid = fork();
+  if (pid < 0) throw Failure("cannot start the daemon: " + reason());
+  if (pid == 0) {
+    prctl(PR_SET_PDEATHSIG, SIGTERM);
+    if (getppid() != self) _exit(DEVICE_FAILED);
+    execl(program.c_str(), "quarnd", nullptr);
+    std::fprintf(stderr, "quarn-device: cannot run %s: %s\n", program.c_str(),
+                 std::strerror(errno));
+    _exit(DEVICE_OK);
   }
+  int status = 0;
+  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  }
+  embedded::drop_power_locks(device, pid);
+  // What a service manager does for a daemon that ends with a failure status. The bus starts it,
+  // so that a caller of this very moment does not start another one.
+  if (may_restart(device, WIFEXITED(status) && WEXITSTATUS(status) != 0)) request_daemon(device);
   // The bus hears of this only while it waits for the daemon's name: a daemon that ended without
   // taking it (nobody signed in, say) must not keep its callers waiting.
   return DEVICE_FAILED;

@@ -55,7 +55,7 @@ class FakeDaemon(TestCase):
         shutil.copy2(os.path.join(BIN_DIR, "quarn-device"), self.path("bin"))
         if script is not None:
             with open(self.path("bin", "quarnd"), "w") as file:
-                file.write("#!/bin/sh\n" + script)
+                file.write(script)
             os.chmod(self.path("bin", "quarnd"), 0o755)
         device = self.new_device()
         device.tool = self.path("bin", "quarn-device")
@@ -68,35 +68,68 @@ class FakeDaemon(TestCase):
         except FileNotFoundError:
             return 0
 
+    # Takes the bus name, as often as it is started, and ends as it is told by its count.
+    NAMED = """#!/usr/bin/python3
+import os
+import signal
+from gi.repository import Gio, GLib
+
+path = os.environ["QUARN_DEVICE_DIR"] + "/starts"
+with open(path, "a") as file:
+    file.write("x ")
+with open(path) as file:
+    count = len(file.read().split())
+loop = GLib.MainLoop()
+Gio.bus_own_name(Gio.BusType.SYSTEM, "org.orvane.Quarn", 0, None, lambda *_: loop.quit(), None)
+loop.run()
+%s
+"""
+
     def test_a_daemon_that_asks_for_its_restart_is_started_again(self):
-        device = self.device_with('echo x >> "$QUARN_DEVICE_DIR/starts"\n'
-                                  '[ $(wc -l < "$QUARN_DEVICE_DIR/starts") -ge 3 ] || exit 255\n')
-        device.exec(*START, check=False)
+        device = self.device_with(self.NAMED % "os._exit(255 if count < 3 else 0)")
+        device.exec(*START)
+        wait_until(lambda: self.starts(device) == 3, "the daemon is started again")
+        restarts = os.path.join(device.path, "run/restarts")
+        wait_until(lambda: not os.path.exists(restarts), "its clean end is noticed")
         self.assertEqual(self.starts(device), 3)
 
     def test_restarts_are_bounded(self):
-        device = self.device_with('echo x >> "$QUARN_DEVICE_DIR/starts"\nexit 255\n')
-        device.exec(*START, check=False)
+        device = self.device_with(self.NAMED % "os._exit(255)")
+        device.exec(*START)
+        restarts = os.path.join(device.path, "run/restarts")
+        wait_until(lambda: self.starts(device) == 6 and not os.path.exists(restarts),
+                   "the device gives the daemon up")
         self.assertEqual(self.starts(device), 6)
 
     def test_a_daemon_that_was_killed_is_not_started_again(self):
-        device = self.device_with('echo x >> "$QUARN_DEVICE_DIR/starts"\nkill -9 $$\n')
-        device.exec(*START, check=False)
+        device = self.device_with(self.NAMED % "os.kill(os.getpid(), signal.SIGKILL)")
+        # A count that is there goes away with an end that is no failure.
+        with open(os.path.join(device.path, "run/restarts"), "w") as file:
+            file.write("1\n")
+        device.exec(*START)
+        wait_until(lambda: not os.path.exists(os.path.join(device.path, "run/restarts"))
+                   or self.starts(device) > 1, "its end is noticed")
+        self.assertEqual(self.starts(device), 1)
+
+    def test_a_daemon_that_fails_before_it_has_its_name_is_not_started_again(self):
+        device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nexit 255\n')
+        result = device.exec(*START, check=False)
+        self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
         self.assertEqual(self.starts(device), 1)
 
     def test_a_daemon_that_ends_without_its_name_fails_its_callers_at_once(self):
-        device = self.device_with("exit 0\n")
+        device = self.device_with("#!/bin/sh\nexit 0\n")
         result = device.exec(*START, check=False)
         self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
 
     def test_a_daemon_that_dies_gives_its_power_lock_back(self):
-        device = self.device_with('printf "[cpu]\\npid=%d\\n" $$ > '
+        device = self.device_with('#!/bin/sh\nprintf "[cpu]\\npid=%d\\n" $$ > '
                                   '"$QUARN_DEVICE_DIR/state/power.ini"\nkill -9 $$\n')
         device.exec(*START, check=False)
         self.assertNotIn("pid", read(os.path.join(device.path, "state/power.ini")))
 
     def test_the_daemon_runs_in_the_device(self):
-        device = self.device_with('{ env; ls -d /tmp/inside /opt/usr/apps/org.example.a; } > '
+        device = self.device_with('#!/bin/sh\n{ env; ls -d /tmp/inside /opt/usr/apps/org.example.a; } > '
                                   '"$QUARN_DEVICE_DIR/seen"\n')
         device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {}))
         device.exec("touch", "/tmp/inside")
