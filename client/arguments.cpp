@@ -75,18 +75,26 @@ constexpr VerbInfo kVerbs[] = {
     {Verb::app_export, "app export", "PKGID", "make a package's archive on the device",
      "Prints where the archive lies, as the device names it. Nothing is sent to the cloud.\n",
      kTransferWait, 1, 1},
-    {Verb::restore_on, "restore on", "--from SERIAL [PKGID ...] [--watch]",
+    {Verb::restore_on, "restore on",
+     "--from SERIAL [PKGID ...] [--watch] | --transfer PKGID ... [--watch]",
      "restore packages as they are installed",
      "From now on the data of each named package is restored as soon as the package is installed,\n"
      "from the backup set of the device SERIAL; of all packages of that set when none is named.\n"
      "\n"
      "  --from SERIAL      the device whose backup is used, as quarnctl sets shows it\n"
+     "  --transfer         take the archives that lie in the companion's directory on this "
+     "device,\n"
+     "                     not those in the cloud; the packages must be named\n"
      "  --watch            follow until the last package is done; --timeout then bounds the whole\n"
      "\n"
      "An interrupt ends the watching, not the restore mode.\n",
      kListWait, 0, kAny},
     {Verb::restore_off, "restore off", "", "end the restore mode",
      "Packages that are installed from now on keep the data they come with.\n", kShortWait, 0, 0},
+    {Verb::transfer_list, "transfer list", "", "make archives for a phone, and list them",
+     "Makes an archive of each package in the shared data of the phone-transfer companion, which\n"
+     "must be installed, and prints where each lies, as the device names it. No cloud is used.\n",
+     kTransferWait, 0, 0},
     {Verb::rules_check, "rules check", "SOURCE-or-PKGID", "what an application's rules take in",
      "For authors of applications; needs no daemon. Reads a package's source directory, or a\n"
      "package that is installed, and tells each file in or out and by which element of its rules\n"
@@ -175,6 +183,7 @@ struct Options {
   bool help = false;
   bool version = false;
   bool watch = false;
+  bool transfer = false;
   bool from_given = false;
   bool timeout_given = false;
   double timeout = 0;
@@ -223,6 +232,8 @@ bool split_options(const std::vector<std::string> &arguments, Options &options,
       options.version = true;
     } else if (argument == "--watch") {
       options.watch = true;
+    } else if (argument == "--transfer") {
+      options.transfer = true;
     } else if (is_option(argument, "--from")) {
       if (!take_value(arguments, i, "--from", options.serial, error)) return false;
       options.from_given = true;
@@ -244,8 +255,9 @@ bool split_options(const std::vector<std::string> &arguments, Options &options,
 bool check_operands(const VerbInfo &info, const Options &options, Command &command,
                     std::string &error) {
   const bool is_restore = info.verb == Verb::restore_on;
-  if (!is_restore && (options.watch || options.from_given)) {
-    error = std::string(options.watch ? "--watch" : "--from") + " belongs to restore on";
+  if (!is_restore && (options.watch || options.from_given || options.transfer)) {
+    const char *option = options.watch ? "--watch" : options.transfer ? "--transfer" : "--from";
+    error = std::string(option) + " belongs to restore on";
     return false;
   }
   if (command.packages.size() < info.min_operands || command.packages.size() > info.max_operands) {
@@ -257,7 +269,11 @@ bool check_operands(const VerbInfo &info, const Options &options, Command &comma
     error = "an argument is empty";
     return false;
   }
-  if (is_restore && options.serial.empty()) {
+  if (options.transfer && command.packages.empty()) {
+    error = "restore on --transfer needs the packages' names";
+    return false;
+  }
+  if (is_restore && options.serial.empty() && !options.transfer) {
     error = "restore on needs --from SERIAL; quarnctl sets shows the devices";
     return false;
   }
@@ -311,6 +327,7 @@ bool parse_arguments(const std::vector<std::string> &arguments, Command &command
   command.timeout = options.timeout_given ? options.timeout : info->timeout;
   command.timeout_given = options.timeout_given;
   command.watch = options.watch;
+  command.transfer = options.transfer;
   command.serial = options.serial;
   command.packages.assign(options.words.begin() + static_cast<std::ptrdiff_t>(used),
                           options.words.end());

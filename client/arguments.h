@@ -39,6 +39,7 @@ enum class Verb {
   app_export,
   restore_on,
   restore_off,
+  transfer_list,
   rules_check,
   rules_explain
 };
@@ -49,6 +50,7 @@ struct Command {
   std::string name; /**< the verb as typed, "restore on" */
   bool json = false;
   bool watch = false;                /**< restore on: follow until the last package is done */
+  bool transfer = false;             /**< restore on: archives in the companion's directory */
   bool switch_on = false;            /**< auto: on or off */
   double timeout = 0;                /**< seconds; 0 waits without a limit */
   bool timeout_given = false;        /**< it bounds the watching, too */

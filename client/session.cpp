@@ -26,6 +26,7 @@ constexpr int kMsPerSecond = 1000;
 constexpr std::int64_t kUsPerMs = 1000;
 constexpr guint kGraceMs = 2000;
 constexpr int kCloudClient = 0;
+constexpr int kCompanionClient = 1;
 constexpr int kOn = 1;
 constexpr int kOff = 0;
 constexpr char kRestoreStop[] = "restore_stop";
@@ -82,6 +83,10 @@ class Session {
   void show_list(const BackupSets &sets);
   void show_sets(const BackupSets &sets);
   void restore_on(const BackupSets &sets);
+  void restore_transferred();
+  void expect(const std::string &package);
+  void switch_restore_on(int client);
+  void show_transfer();
   void restore_off();
 
   void answered();
@@ -119,6 +124,7 @@ class Session {
   ProgressBoard board_;
   JsonPtr document_;
   BackupSet set_; /**< restore on: the chosen set */
+  int list_client_ = kCloudClient;
   std::vector<std::string> expected_;
   std::function<void()> on_answer_; /**< called whenever reply_ or callback_ has changed */
   std::optional<int> reply_;
@@ -196,7 +202,11 @@ void Session::begin() {
       return app_request("app_data_restore_start", "restore", "was restored");
     case Verb::app_export:
       return app_export();
+    case Verb::transfer_list:
+      list_client_ = kCompanionClient;
+      return fetch_list([this](const BackupSets &) { show_transfer(); });
     case Verb::restore_on:
+      if (command_.transfer) return restore_transferred();
       return fetch_list([this](const BackupSets &sets) { restore_on(sets); });
     case Verb::restore_off:
       return restore_off();
@@ -328,7 +338,7 @@ void Session::fetch_list(std::function<void(const BackupSets &)> then,
     }
     then(*sets);
   };
-  call_for_result("get_app_list", g_variant_new("(iu)", kCloudClient, req_id_), [this](int result) {
+  call_for_result("get_app_list", g_variant_new("(iu)", list_client_, req_id_), [this](int result) {
     reply_ = result;
     answered();
   });
@@ -421,13 +431,27 @@ void Session::restore_on(const BackupSets &sets) {
       return finish(QUARN_BAD_ARGUMENT,
                     "the backup of " + set_.serial + " holds no package " + package);
     }
-    if (std::find(expected_.begin(), expected_.end(), package) == expected_.end()) {
-      expected_.push_back(package);
-    }
+    expect(package);
   }
   if (expected_.empty()) {
     return finish(QUARN_BAD_ARGUMENT, "the backup of " + set_.serial + " holds no packages");
   }
+  switch_restore_on(kCloudClient);
+}
+
+void Session::restore_transferred() {
+  set_.serial = command_.serial;
+  for (const std::string &package : command_.packages) expect(package);
+  switch_restore_on(kCompanionClient);
+}
+
+void Session::expect(const std::string &package) {
+  if (std::find(expected_.begin(), expected_.end(), package) == expected_.end()) {
+    expected_.push_back(package);
+  }
+}
+
+void Session::switch_restore_on(int client) {
   const JsonPtr list(json_object_new_array());
   for (const std::string &package : expected_) {
     json_object_array_add(
@@ -440,17 +464,36 @@ void Session::restore_on(const BackupSets &sets) {
   on_answer_ = nullptr;
   board_ = ProgressBoard(expected_.size());
   call_for_result("restore_enable",
-                  g_variant_new("(iissu)", kOn, kCloudClient, set_.serial.c_str(),
+                  g_variant_new("(iissu)", kOn, client, set_.serial.c_str(),
                                 json_text(list.get()).c_str(), req_id_),
                   [this](int result) {
                     if (result != QUARN_OK) return finish_with(result, "restore on", "");
-                    const std::string on = "restore mode is on for " +
-                                           std::to_string(expected_.size()) + " packages of " +
-                                           printable(set_.serial);
+                    const std::string on =
+                        "restore mode is on for " + std::to_string(expected_.size()) + " packages" +
+                        (command_.transfer ? std::string(" in the companion's directory")
+                                           : " of " + printable(set_.serial));
                     if (!command_.watch) return finish_with(QUARN_OK, "", on);
                     screen_.line(on);
                     watch();
                   });
+}
+
+void Session::show_transfer() {
+  const JsonPtr root = json_parse(callback_->text);
+  json_object *models = json_member(root.get(), "model_list", json_type_array);
+  json_object *own =
+      json_object_array_length(models) == 0 ? nullptr : json_object_array_get_idx(models, 0);
+  json_object *archives = json_member(own, "app_data_path", json_type_array);
+  const std::size_t count = archives == nullptr ? 0 : json_object_array_length(archives);
+  json_object *paths = json_object_new_array();
+  for (std::size_t i = 0; i < count; ++i) {
+    json_object *path = json_object_array_get_idx(archives, i);
+    if (!json_object_is_type(path, json_type_string)) continue;
+    json_object_array_add(paths, json_object_get(path));
+    screen_.line(printable(json_object_get_string(path)));
+  }
+  json_object_object_add(document_.get(), "archives", paths);
+  finish(QUARN_OK);
 }
 
 void Session::restore_off() {
@@ -542,6 +585,7 @@ gboolean Session::on_grace_end(gpointer user_data) {
 }
 
 bool Session::has_archive(const std::string &package) const {
+  if (command_.transfer) return true;
   const SetPackage *known = find_package(set_, package);
   return known != nullptr && known->crc != 0;
 }

@@ -2,6 +2,7 @@
 import json
 import os
 import pty
+import shutil
 import signal
 import subprocess
 import sys
@@ -104,6 +105,33 @@ class QuarnctlTest(TestCase):
         self.device.set("network", "none")
         wait_until(lambda: self.document("status")["wifi_connected"] is False, "Wi-Fi is gone")
         self.assertIn("not known without Wi-Fi", self.quarnctl("status").stdout)
+
+    def test_a_package_goes_from_device_to_device_without_a_cloud(self):
+        companion = "com.velmor.pellix-efl"
+        second = self.new_device(model="Orvane Two", serial=OTHER, account="ada")
+        second.start()
+        for index, device in enumerate((self.device, second)):
+            device.install(make_source(self.path("companion%d" % index), companion, "1.0",
+                                       {"shared/data/phone": b"-"}))
+        self.install(self.device, NOTES)
+        archives = self.document("transfer", "list")["archives"]
+        name = "%s_1.0.zip" % NOTES
+        self.assertIn("/opt/usr/apps/%s/shared/data/%s" % (companion, name), archives)
+        source = self.device.app_path(companion, "shared/data/" + name)
+        self.assertEqual(os.stat(source).st_mode & 0o777, 0o777)
+        shutil.copy2(source, second.app_path(companion, "shared/data/" + name))
+        self.quarnctl("restore", "on", "--transfer", "--from", SERIAL, NOTES, device=second)
+        self.install(second, NOTES, data=False)
+
+        def same():
+            try:
+                with open(self.device.app_path(NOTES, "data/file"), "rb") as one, \
+                        open(second.app_path(NOTES, "data/file"), "rb") as two:
+                    return one.read() == two.read()
+            except FileNotFoundError:
+                return False
+        wait_until(same, "the second device has the first one's data")
+        self.assertEqual(os.listdir(self.device.cloud), [])
 
     def test_without_wifi_the_result_is_told_in_words(self):
         self.install(self.device, NOTES)

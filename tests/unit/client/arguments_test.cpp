@@ -36,8 +36,16 @@ TEST(Arguments, EveryVerbIsKnown) {
   EXPECT_EQ(parsed({"app", "export", "a"}).verb, Verb::app_export);
   EXPECT_EQ(parsed({"restore", "on", "--from", "1"}).verb, Verb::restore_on);
   EXPECT_EQ(parsed({"restore", "off"}).verb, Verb::restore_off);
+  EXPECT_EQ(parsed({"transfer", "list"}).verb, Verb::transfer_list);
+  EXPECT_TRUE(parsed({"restore", "on", "--transfer", "a"}).transfer);
   EXPECT_EQ(parsed({"rules", "check", "a"}).verb, Verb::rules_check);
   EXPECT_EQ(parsed({"rules", "explain", "a", "data/b"}).verb, Verb::rules_explain);
+}
+
+TEST(Arguments, ATransferNamesItsPackages) {
+  EXPECT_EQ(error_of({"restore", "on", "--transfer"}),
+            "restore on --transfer needs the packages' names");
+  EXPECT_EQ(error_of({"restore", "off", "--transfer"}), "--transfer belongs to restore on");
 }
 
 TEST(Arguments, OptionsMayStandAnywhere) {
