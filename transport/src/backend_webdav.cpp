@@ -22,7 +22,6 @@ constexpr int kNotFound = 404;
 constexpr int kMethodNotAllowed = 405;
 constexpr int kConflict = 409;
 constexpr int kGone = 410;
-constexpr int kPreconditionFailed = 412;
 constexpr int kLocked = 423;
 constexpr int kServerError = 500;
 constexpr int kNotImplemented = 501;
