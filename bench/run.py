@@ -244,6 +244,51 @@ def fleet(bin_dir, work, counts, checks):
                            (name, per_package[index][0], per_package[index - 1][0]), ratio, 1.3)
 
 
+def installed_at_once(bin_dir, work, checks, count=100):
+    """Restore mode on a second device, and the packages of the first one installed in a row."""
+    import random
+    serial = "350000000000033"
+    first = Device(bin_dir, os.path.join(work, "device-from"), "--serial", serial)
+    second = Device(bin_dir, os.path.join(work, "device-to"), "--cloud",
+                    "file://" + os.path.join(first.path, "cloud"))
+    table = Table("packages", "from the first installation to the last restore, s", "ms a package",
+                  "peak PSS kB")
+
+    def fill(root):
+        rng = random.Random(9)
+        for index in range(8):
+            trees._write(os.path.join(root, "data/%d.txt" % index), trees._text(rng, 6000))
+
+    try:
+        bare = []
+        for index in range(count):
+            source = os.path.join(work, "full-%d" % index)
+            trees.make_package(source, "org.example.p%05d" % index, "1.0.0", fill)
+            first.install(source)
+            bare.append(os.path.join(work, "bare-%d" % index))
+            trees.make_package(bare[-1], "org.example.p%05d" % index, "1.0.0", lambda root: None)
+        first.client("backup")
+        second.client("activate")
+        watcher = subprocess.Popen([second.tool, "exec", second.path, "--", "quarnctl", "restore",
+                                    "on", "--from", serial, "--watch"],
+                                   stdout=subprocess.PIPE, text=True)
+        while "restore mode is on" not in watcher.stdout.readline():
+            if watcher.poll() is not None:
+                raise SystemExit("restore mode could not be switched on")
+        with Watch(second) as watch:
+            for source in bare:
+                second.install(source)
+            watcher.communicate(timeout=300)
+        if watcher.returncode != 0:
+            raise SystemExit("the restore ended with %d" % watcher.returncode)
+    finally:
+        first.stop()
+        second.stop()
+    table.add(count, "%.2f" % watch.wall, "%.2f" % (1000 * watch.wall / count), watch.peak)
+    checks.hard("peak PSS of the restore of %d packages" % count, watch.peak, CEILING_KB)
+    table.show("Restore of packages installed at once")
+
+
 def large(bin_dir, work, checks):
     """Packages at the size cap, and their restore on a second device."""
     table = Table("run", "s", "peak PSS kB")
@@ -282,82 +327,25 @@ def large(bin_dir, work, checks):
     table.show("Packages at the size cap")
 
 
-def others(bin_dir, work, runs, checks):
-    """A whole manual backup of the four trees against two general backup programs."""
-    sources = []
-    for kind in trees.TREES:
-        source = os.path.join(work, "source-" + kind)
-        trees.make_package(source, "org.example." + kind, "1.0.0", lambda root, k=kind: trees.make(k, root))
-        sources.append(source)
-    environment = dict(os.environ, RESTIC_PASSWORD="bench", BORG_UNKNOWN_UNENCRYPTED_REPO_ACCESS_IS_OK="yes",
-                       XDG_CACHE_HOME=os.path.join(work, "cache"), BORG_BASE_DIR=os.path.join(work, "borg"))
-    os.environ.update(environment)
-    table = Table("run", "quarnd CPU s", "wall s", "restic CPU s", "wall s", "borg CPU s", "wall s",
-                  "CPU / better", "wall / better")
-    results = {name: {"q": [], "r": [], "b": []} for name in ("first", "unchanged")}
-    for run in range(runs):
-        device = Device(bin_dir, os.path.join(work, "device-others-%d" % run))
-        try:
-            for source in sources:
-                device.install(source)
-            device.client("activate")
-            pid = device.daemon_pid()
-            apps = os.path.join(device.path, "root/opt/usr/apps")
-            for name in ("first", "unchanged"):
-                before = cpu_of(pid)
-                start = time.monotonic()
-                device.client("backup")
-                results[name]["q"].append((cpu_of(pid) - before, time.monotonic() - start))
-            restic = os.path.join(work, "restic-%d" % run)
-            borg = os.path.join(work, "borg-%d" % run)
-            measure(["restic", "-q", "init", "-r", restic])
-            measure(["borg", "init", "-e", "none", borg])
-            for name in ("first", "unchanged"):
-                results[name]["r"].append(measure(["restic", "-q", "-r", restic, "backup", apps]))
-                results[name]["b"].append(measure(["borg", "create", "-C", "lz4", borg + "::" + name, apps]))
-            shutil.rmtree(restic)
-            shutil.rmtree(borg)
-        finally:
-            device.stop()
-        shutil.rmtree(device.path)
-    for name, result in results.items():
-        cpu = {key: median([one[0] for one in result[key]]) for key in "qrb"}
-        wall = {key: median([one[1] for one in result[key]]) for key in "qrb"}
-        by_cpu = cpu["q"] / min(cpu["r"], cpu["b"])
-        by_wall = wall["q"] / min(wall["r"], wall["b"])
-        table.add(name, "%.2f" % cpu["q"], "%.2f" % wall["q"], "%.2f" % cpu["r"], "%.2f" % wall["r"],
-                  "%.2f" % cpu["b"], "%.2f" % wall["b"], "%.2f" % by_cpu, "%.2f" % by_wall)
-        checks.at_most("%s run: CPU / better of restic and borg" % name, by_cpu, .5)
-        checks.at_most("%s run: wall / better of restic and borg" % name, by_wall, .5)
-    table.show("A whole manual backup of the four trees to a folder, %d runs" % runs)
-
-
-def cpu_of(pid):
-    """CPU seconds of a process and its threads so far."""
-    with open("/proc/%d/stat" % pid) as file:
-        fields = file.read().rsplit(")", 1)[1].split()
-    return (int(fields[11]) + int(fields[12])) / os.sysconf("SC_CLK_TCK")
-
-
 def main():
     parser = argparse.ArgumentParser(description=__doc__)
     parser.add_argument("--bin", required=True, help="directory of the programs")
     parser.add_argument("--short", action="store_true",
                         help="few runs, and ratios may be off by half")
-    parser.add_argument("--only", choices=("archives", "fleet", "large", "others"), action="append")
+    parser.add_argument("--only", choices=("archives", "fleet", "installed", "large"), action="append")
     options = parser.parse_args()
     checks = Checks(1.5 if options.short else 1.0)
     bin_dir = os.path.abspath(options.bin)
-    wanted = options.only or ("archives", "fleet", "large", "others")
+    wanted = options.only or ("archives", "fleet", "installed", "large")
     with tempfile.TemporaryDirectory(prefix="quarn-bench-") as work:
         if "archives" in wanted:
             archives(os.path.join(bin_dir, "archive_tool"), work, 3 if options.short else 7, checks)
         if "fleet" in wanted:
             fleet(bin_dir, work, (10, 100) if options.short else (10, 100, 1000), checks)
+        if "installed" in wanted:
+            installed_at_once(bin_dir, work, checks)
         if "large" in wanted:
             large(bin_dir, work, checks)
-        if "others" in wanted:
-            others(bin_dir, work, 3 if options.short else 7, checks)
     if checks.failed:
         print()
         for line in checks.failed:
