@@ -1,30 +1,20 @@
 #include "backend_webdav.h"
 
-#include <glib.h>
-#include <sys/stat.h>
-
 #include <algorithm>
-#include <cerrno>
 #include <functional>
 #include <mutex>
 #include <set>
 
+#include "http_store.h"
 #include "remote_path.h"
 
 namespace transport {
 namespace {
 
-constexpr int kOk = 200;
 constexpr int kCreated = 201;
 constexpr int kMultiStatus = 207;
-constexpr int kUnauthorized = 401;
-constexpr int kNotFound = 404;
-constexpr int kMethodNotAllowed = 405;
-constexpr int kConflict = 409;
-constexpr int kGone = 410;
 constexpr int kLocked = 423;
 constexpr int kServerError = 500;
-constexpr int kNotImplemented = 501;
 constexpr int64_t kMillisecondsPerSecond = 1000;
 constexpr std::size_t kMaxKnownFolders = 4096;
 constexpr long kTidyUpSeconds = 5;
@@ -38,25 +28,6 @@ constexpr char kLockInfo[] =
     "<d:lockinfo xmlns:d=\"DAV:\"><d:lockscope><d:exclusive/></d:lockscope>"
     "<d:locktype><d:write/></d:locktype></d:lockinfo>";
 constexpr char kXmlType[] = "Content-Type: application/xml; charset=utf-8";
-
-struct ChecksumFree {
-  void operator()(GChecksum *checksum) const { g_checksum_free(checksum); }
-};
-using Checksum = std::unique_ptr<GChecksum, ChecksumFree>;
-
-Outcome no_such_object() {
-  return failure(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT, "no such object in the store");
-}
-
-Outcome again(std::string message) {
-  Outcome outcome = failure(BACKUP_TRANS_ERROR_SERVER, std::move(message));
-  outcome.transient = true;
-  return outcome;
-}
-
-bool absent(const HttpAnswer &answer) {
-  return answer.complete() && (answer.status == kNotFound || answer.status == kGone);
-}
 
 // Bytes that lie at the server under a temporary name; whatever is not moved is deleted.
 struct Uploaded {
@@ -93,30 +64,16 @@ class WebdavBackend : public Backend {
   Outcome download(Attempt &attempt, const std::string &path, LocalTarget &target,
                    Version *version) override {
     if (!target.begin()) return local_failure("cannot make a local file");
-    const Checksum checksum(g_checksum_new(G_CHECKSUM_SHA256));
-    uint64_t received = 0;
-    HttpRequest request = request_for("GET", path);
-    request.sink = [&](const char *data, std::size_t size) {
-      g_checksum_update(checksum.get(), reinterpret_cast<const guchar *>(data),
-                        static_cast<gssize>(size));
-      received += size;
-      return write_all(target.fd(), data, size);
-    };
-    const HttpAnswer answer = http_perform(attempt.ticket, request);
-    if (absent(answer) || means_folder(answer, path)) {
+    const Received received =
+        receive(attempt.ticket, request_for("GET", path), G_CHECKSUM_SHA256, &target);
+    if (is_absent(received.answer) || means_folder(received.answer, path)) {
       if (version != nullptr) version->reset();
       return no_such_object();
     }
-    if (!answer.good()) return outcome(answer, "download");
-    const std::string length = answer.header("content-length");
-    if (answer.status != kOk ||
-        (!length.empty() && g_ascii_strtoull(length.c_str(), nullptr, 10) != received))
-      return again("download: the object came incomplete");
-    if (!target.sync()) return local_failure("cannot write the local file");
-    if (!attempt.ticket.begin_commit()) return cancelled();
-    if (!target.publish()) return local_failure("cannot replace the local file");
-    if (version != nullptr) *version = g_checksum_get_string(checksum.get());
-    return success();
+    if (!received.answer.good()) return outcome(received.answer, "download");
+    const Outcome result = publish(attempt.ticket, received, target);
+    if (result.ok() && version != nullptr) *version = received.checksum;
+    return result;
   }
 
   Outcome upload(Attempt &attempt, const Upload &upload, ObjectInfo *info) override {
@@ -179,7 +136,7 @@ class WebdavBackend : public Backend {
     const HttpAnswer answer = http_perform(attempt.ticket, request_for("DELETE", folder + "/"));
     if (answer.complete() && answer.status == kMultiStatus)
       return failure(BACKUP_TRANS_ERROR_SERVER, "delete: the server kept a part of the folder");
-    if (!absent(answer) && !answer.good()) return outcome(answer, "delete");
+    if (!is_absent(answer) && !answer.good()) return outcome(answer, "delete");
     prune(attempt.ticket, parent_of(folder));
     return success();
   }
@@ -195,26 +152,11 @@ class WebdavBackend : public Backend {
     return request;
   }
 
-  static Outcome local_failure(const char *what) {
-    return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, std::string(what) + ": " + g_strerror(errno));
-  }
-
   // Somebody else's lock goes away by itself.
   static Outcome outcome(const HttpAnswer &answer, const char *what) {
     Outcome result = outcome_of(answer, what);
     if (answer.complete() && answer.status == kLocked) result.transient = true;
     return result;
-  }
-
-  static bool write_all(int fd, const char *data, std::size_t size) {
-    while (size > 0) {
-      const ssize_t written = write(fd, data, size);
-      if (written < 0 && errno == EINTR) continue;
-      if (written <= 0) return false;
-      data += written;
-      size -= static_cast<std::size_t>(written);
-    }
-    return true;
   }
 
   // Servers send whoever asks for a folder as if it were an object to its name with a slash.
@@ -233,8 +175,8 @@ class WebdavBackend : public Backend {
     if (!result.ok()) return result;
     HttpAnswer answer = put(ticket, upload, temporary);
     const bool folder_gone =
-        answer.complete() &&
-        (answer.status == kNotFound || answer.status == kConflict || answer.status == kServerError);
+        answer.complete() && (answer.status == kHttpNotFound || answer.status == kHttpConflict ||
+                              answer.status == kServerError);
     if (folder_gone && !folder.empty()) {
       // Another device may have deleted what was known; what is there does not mind.
       forget("");
@@ -270,17 +212,11 @@ class WebdavBackend : public Backend {
     return http_perform(ticket, request);
   }
 
-  static bool has_size(const HttpAnswer &answer, uint64_t size) {
-    const std::string length = answer.header("content-length");
-    // Some leave the length of an empty object out.
-    return length.empty() ? size == 0 : g_ascii_strtoull(length.c_str(), nullptr, 10) == size;
-  }
-
   Outcome move(Ticket &ticket, const Upload &upload, Uploaded *uploaded, const std::string &token) {
     if (uploaded->move_asked) {
       // The earlier answer was lost or an error, which does not tell whether it was done.
       const HttpAnswer left = http_perform(ticket, request_for("HEAD", uploaded->temporary));
-      if (absent(left)) {
+      if (is_absent(left)) {
         const HttpAnswer moved = http_perform(ticket, request_for("HEAD", upload.path));
         if (moved.good() && has_size(moved, upload.source.size())) return success();
         uploaded->settle();
@@ -294,8 +230,8 @@ class WebdavBackend : public Backend {
     uploaded->move_asked = true;
     const HttpAnswer answer = http_perform(ticket, request);
     if (answer.good() && answer.status != kMultiStatus) return success();
-    if (answer.complete() &&
-        (answer.status == kNotFound || answer.status == kConflict || answer.status == kGone)) {
+    if (answer.complete() && (answer.status == kHttpNotFound || answer.status == kHttpConflict ||
+                              answer.status == kHttpGone)) {
       // The folder was deleted, and what had been sent with it.
       forget("");
       uploaded->settle();
@@ -318,19 +254,13 @@ class WebdavBackend : public Backend {
   }
 
   Outcome compare_basis(Ticket &ticket, const Upload &upload) {
-    const Checksum checksum(g_checksum_new(G_CHECKSUM_SHA256));
-    HttpRequest request = request_for("GET", upload.path);
-    request.sink = [&](const char *data, std::size_t size) {
-      g_checksum_update(checksum.get(), reinterpret_cast<const guchar *>(data),
-                        static_cast<gssize>(size));
-      return true;
-    };
-    const HttpAnswer answer = http_perform(ticket, request);
+    const Received received =
+        receive(ticket, request_for("GET", upload.path), G_CHECKSUM_SHA256, nullptr);
     Version present;
-    if (answer.good()) {
-      present = g_checksum_get_string(checksum.get());
-    } else if (!absent(answer)) {
-      return outcome(answer, "upload");
+    if (received.answer.good()) {
+      present = received.checksum;
+    } else if (!is_absent(received.answer)) {
+      return outcome(received.answer, "upload");
     }
     if (present == *upload.basis) return success();
     return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
@@ -344,7 +274,7 @@ class WebdavBackend : public Backend {
     request.headers = {kXmlType, "Depth: infinity", "Timeout: Second-60"};
     const HttpAnswer answer = http_perform(ticket, request);
     if (answer.complete() &&
-        (answer.status == kMethodNotAllowed || answer.status == kNotImplemented))
+        (answer.status == kHttpMethodNotAllowed || answer.status == kHttpNotImplemented))
       return success();
     if (!answer.good()) return outcome(answer, "lock");
     *token = answer.header("lock-token");
@@ -368,7 +298,7 @@ class WebdavBackend : public Backend {
   Outcome ensure_folder(Ticket &ticket, const std::string &folder, Uploaded *uploaded) {
     if (is_known(folder)) return success();
     HttpAnswer answer = http_perform(ticket, request_for("MKCOL", folder + "/"));
-    if (answer.complete() && (answer.status == kConflict || answer.status == kNotFound) &&
+    if (answer.complete() && (answer.status == kHttpConflict || answer.status == kHttpNotFound) &&
         !folder.empty()) {
       const Outcome parent = ensure_folder(ticket, parent_of(folder), uploaded);
       if (!parent.ok()) return parent;
@@ -376,12 +306,12 @@ class WebdavBackend : public Backend {
     }
     // An answer that did not come does not tell that it was not made.
     if (!answer.complete() || answer.status == kCreated) uploaded->made_folder = folder;
-    if (!answer.good() && !(answer.complete() && answer.status == kMethodNotAllowed) &&
+    if (!answer.good() && !(answer.complete() && answer.status == kHttpMethodNotAllowed) &&
         !(answer.complete() && is_folder(ticket, folder))) {
       Outcome result = outcome(answer, "make a folder");
       if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) result.code = BACKUP_TRANS_ERROR_SERVER;
       // Somebody removed a parent in between.
-      if (answer.complete() && answer.status == kConflict) {
+      if (answer.complete() && answer.status == kHttpConflict) {
         forget("");
         result.transient = true;
       }
@@ -423,11 +353,12 @@ class WebdavBackend : public Backend {
     request.headers = {kXmlType, "Depth: 1"};
     if (!token.empty()) request.headers.push_back(condition(folder, token));
     const HttpAnswer answer = http_perform(ticket, request);
-    if (absent(answer) || means_object(answer)) return no_such_object();
+    if (is_absent(answer) || means_object(answer)) return no_such_object();
     if (!answer.good()) {
       const Outcome problem = outcome(answer, "list");
       // Some find an object's name with a slash too odd to say that there is nothing.
-      const bool odd = answer.complete() && !problem.transient && answer.status != kUnauthorized;
+      const bool odd =
+          answer.complete() && !problem.transient && answer.status != kHttpUnauthorized;
       if (odd && !folder.empty() && is_object(ticket, folder)) return no_such_object();
       return problem;
     }
@@ -463,7 +394,8 @@ class WebdavBackend : public Backend {
   }
 
   static bool means_object(const HttpAnswer &answer) {
-    return answer.complete() && (answer.status / 100 == 3 || answer.status == kMethodNotAllowed);
+    return answer.complete() &&
+           (answer.status / 100 == 3 || answer.status == kHttpMethodNotAllowed);
   }
 
   // Folders that hold nothing vanish, from the innermost outwards, while nobody can put

@@ -1,19 +1,14 @@
 #include <glib.h>
-#include <libxml/parser.h>
-#include <libxml/tree.h>
 
 #include <cstring>
 
 #include "backend_webdav.h"
+#include "xml_answer.h"
 
 namespace transport {
 namespace {
 
 constexpr char kDav[] = "DAV:";
-
-struct DocumentFree {
-  void operator()(xmlDoc *document) const { xmlFreeDoc(document); }
-};
 
 bool is_element(const xmlNode *node, const char *name) {
   return node->type == XML_ELEMENT_NODE && node->ns != nullptr &&
@@ -29,9 +24,7 @@ const xmlNode *child_named(const xmlNode *parent, const char *name) {
 }
 
 std::string text_of(const xmlNode *node) {
-  xmlChar *content = xmlNodeGetContent(node);
-  std::string text = content == nullptr ? "" : reinterpret_cast<const char *>(content);
-  xmlFree(content);
+  const std::string text = xml_text(node);
   const std::size_t first = text.find_first_not_of(" \t\r\n");
   if (first == std::string::npos) return "";
   return text.substr(first, text.find_last_not_of(" \t\r\n") - first + 1);
@@ -74,12 +67,8 @@ void read_properties(const xmlNode *response, DavEntry *entry) {
 
 bool parse_multistatus(const std::string &xml, const std::string &origin,
                        std::vector<DavEntry> *entries) {
-  // No server has a reason to send one, and entities are what bombs are made of.
-  if (xml.find("<!DOCTYPE") != std::string::npos) return false;
-  const std::unique_ptr<xmlDoc, DocumentFree> document(
-      xmlReadMemory(xml.data(), static_cast<int>(xml.size()), nullptr, nullptr,
-                    XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING));
-  if (!document || document->intSubset != nullptr) return false;
+  const XmlAnswer document = parse_xml(xml);
+  if (!document) return false;
   const xmlNode *root = xmlDocGetRootElement(document.get());
   if (root == nullptr || !is_element(root, "multistatus")) return false;
   for (const xmlNode *node = root->children; node != nullptr; node = node->next) {
