@@ -216,5 +216,6 @@ void quarnd_progress_init() {
   set_backup_progress_sink(note_backup_progress);
   set_backup_end_observer(quarnd_status_refresh);
   set_restore_progress_sink(note_restore_progress);
+  set_restore_mode_observer(quarnd_status_refresh);
   set_setting_observer(quarnd_status_refresh);
 }

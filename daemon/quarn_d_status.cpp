@@ -63,9 +63,13 @@ GVariant *screen_off() {
   return g_variant_new_boolean(known && state == DISPLAY_STATE_SCREEN_OFF ? TRUE : FALSE);
 }
 
+bool restore_mode() { return pellix_restore_running != 0 || cloud_restore_running != 0; }
+
 GVariant *candidates() {
   GVariantBuilder builder;
   g_variant_builder_init(&builder, G_VARIANT_TYPE("as"));
+  // The list outlives a mode that was switched off; nobody waits for it then.
+  if (!restore_mode()) return g_variant_builder_end(&builder);
   for (const std::string &package : pkg_list_to_be_restored) {
     g_variant_builder_add(&builder, "s", package.c_str());
   }
@@ -91,8 +95,7 @@ GVariant *value_of(const std::string &property) {
   if (property == "NextAlarm") return g_variant_new_int64(next_alarm_due());
   if (property == "LastBackup") return last_backup();
   if (property == "BackupRunning") return flag(backup_request_outstanding());
-  if (property == "RestoreMode")
-    return flag(pellix_restore_running != 0 || cloud_restore_running != 0);
+  if (property == "RestoreMode") return flag(restore_mode());
   if (property == "RestoreCandidates") return candidates();
   if (property == "SerialNumber") return device_text(true);
   if (property == "ModelName") return device_text(false);

@@ -114,7 +114,9 @@ int quarnd_restore_enable(int on, int client, const char *serial_num, const char
     LOGE("restore mode by pellix is already running");
     return QUARN_REFUSED;
   }
-  if (on == 0) return switch_off();
-  return switch_on(client, serial_num == nullptr ? "" : serial_num,
-                   pkg_list == nullptr ? "" : pkg_list, std::move(owned));
+  const int result = on == 0 ? switch_off()
+                             : switch_on(client, serial_num == nullptr ? "" : serial_num,
+                                         pkg_list == nullptr ? "" : pkg_list, std::move(owned));
+  note_restore_mode_change();
+  return result;
 }

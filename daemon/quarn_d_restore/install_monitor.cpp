@@ -16,6 +16,7 @@ constexpr double kIconHideDelay = 0.5;
 package_manager_h pkgmgr_h = nullptr;
 bool monitor_running = false;
 int (*restore_disable)() = nullptr;
+void (*restore_mode_observer)() = nullptr;
 
 gboolean _restore_disable_cb(gpointer /*data*/) {
   // The mode may have been switched on again with a new list meanwhile.
@@ -186,9 +187,18 @@ int package_to_be_restored(const char *pkgid) {
   const auto found =
       std::find(pkg_list_to_be_restored.begin(), pkg_list_to_be_restored.end(), pkgid);
   const bool candidate = found != pkg_list_to_be_restored.end();
-  if (candidate) pkg_list_to_be_restored.erase(found);
+  if (candidate) {
+    pkg_list_to_be_restored.erase(found);
+    note_restore_mode_change();
+  }
   if (pkg_list_to_be_restored.empty()) g_idle_add(_restore_disable_cb, nullptr);
   return candidate;
 }
 
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
+
+void set_restore_mode_observer(void (*observer)()) { restore_mode_observer = observer; }
+
+void note_restore_mode_change() {
+  if (restore_mode_observer != nullptr) restore_mode_observer();
+}

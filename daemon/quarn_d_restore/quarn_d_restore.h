@@ -182,6 +182,11 @@ int package_to_be_restored(const char *pkgid);
 /** How the engine ends restore mode; set once at start. */
 void set_restore_disable(int (*disable)());
 
+/** Who is told that restore mode or its candidates may have changed; set once at start. */
+void set_restore_mode_observer(void (*observer)());
+/** Tells that observer. Main thread. */
+void note_restore_mode_change();
+
 /* ---- app_list.cpp ---- */
 
 /**
