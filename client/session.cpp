@@ -331,7 +331,8 @@ void Session::fetch_list(std::function<void(const BackupSets &)> then,
     std::string error;
     const auto sets = parse_backup_sets(callback_->text, error);
     if (!sets) return otherwise ? otherwise(error) : finish(EXIT_PROTOCOL, error);
-    if (sets->left_out > 0) {
+    // The companion's list is of this device alone and does not name it.
+    if (sets->left_out > 0 && list_client_ == kCloudClient) {
       json_object_object_add(document_.get(), "left_out",
                              json_object_new_int64(static_cast<std::int64_t>(sets->left_out)));
       screen_.error(std::to_string(sets->left_out) + " unreadable entries are left out");

@@ -17,6 +17,15 @@ NOTES = "org.example.notes"
 BANK = "org.example.bank"
 
 
+def label_of(path):
+    for name in ("security.SMACK64", "user.quarn.SMACK64"):
+        try:
+            return os.getxattr(path, name).decode()
+        except OSError:
+            continue
+    return None
+
+
 class QuarnctlTest(TestCase):
 
     def setUp(self):
@@ -114,11 +123,16 @@ class QuarnctlTest(TestCase):
             device.install(make_source(self.path("companion%d" % index), companion, "1.0",
                                        {"shared/data/phone": b"-"}))
         self.install(self.device, NOTES)
-        archives = self.document("transfer", "list")["archives"]
+        listed = self.document("transfer", "list")
+        self.assertEqual(listed["message"], "success")
+        self.assertNotIn("left_out", listed)
+        self.assertEqual(self.quarnctl("transfer", "list").stderr, "")
+        archives = listed["archives"]
         name = "%s_1.0.zip" % NOTES
         self.assertIn("/opt/usr/apps/%s/shared/data/%s" % (companion, name), archives)
         source = self.device.app_path(companion, "shared/data/" + name)
         self.assertEqual(os.stat(source).st_mode & 0o777, 0o777)
+        self.assertEqual(label_of(source), companion)
         shutil.copy2(source, second.app_path(companion, "shared/data/" + name))
         self.quarnctl("restore", "on", "--transfer", "--from", SERIAL, NOTES, device=second)
         self.install(second, NOTES, data=False)
