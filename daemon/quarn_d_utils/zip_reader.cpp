@@ -118,7 +118,7 @@ class Unpacker {
       LOGE("fopen() failed, file is NULL %s", (destination_ + "/" + path).c_str());
       return Extracted::kFailed;
     }
-    return write(archive, info, &file, path.c_str() + slash + 1);
+    return write(archive, info, &file, path);
   }
 
  private:
@@ -187,7 +187,8 @@ class Unpacker {
     return openat(parent, name, kFlags, kFileMode);
   }
 
-  Extracted write(unzFile archive, const unz_file_info64 &info, UniqueFd *file, const char *name) {
+  Extracted write(unzFile archive, const unz_file_info64 &info, UniqueFd *file,
+                  const std::string &path) {
     EntrySource source(archive);
     FileSink sink(file->get(), info.uncompressed_size);
     CodecTotals totals;
@@ -196,8 +197,8 @@ class Unpacker {
                                    : codec_->inflate(&source, &sink, &totals);
     const bool closed = close(file->release()) == 0;
     if (sink.too_long()) {
-      unlinkat(parent_.get(), name, 0);
-      return refuse(name, "it holds more than it announces");
+      unlinkat(parent_.get(), path.c_str() + path.rfind('/') + 1, 0);
+      return refuse(path.c_str(), "it holds more than it announces");
     }
     if (result == CodecResult::kSinkFailed || !closed) {
       LOGE("fwrite() failed");
@@ -205,7 +206,7 @@ class Unpacker {
     }
     if (result != CodecResult::kDone || totals.plain != info.uncompressed_size ||
         totals.crc != info.crc) {
-      LOGE("archive entry %s is corrupt", name);
+      LOGE("archive entry %s is corrupt", path.c_str());
       return Extracted::kFailed;
     }
     return Extracted::kDone;

@@ -37,6 +37,9 @@ class ArchiveFile {
 
   bool is_open() const { return static_cast<bool>(fd_); }
 
+  /** Let the next header fit into memory. @return false when the file cannot be written */
+  bool make_room() { return !failed_ && (buffer_.size() + kHeaderRoom <= kBuffer || flush()); }
+
   zlib_filefunc64_def functions() {
     zlib_filefunc64_def table = {};
     table.zopen64_file = [](voidpf self, const void *, int) { return self; };
@@ -56,6 +59,7 @@ class ArchiveFile {
 
  private:
   static constexpr std::size_t kBuffer = 128U << 10;
+  static constexpr std::size_t kHeaderRoom = 8U << 10;  // the longest path, and the fields
 
   static ArchiveFile *of(voidpf self) { return static_cast<ArchiveFile *>(self); }
 
@@ -128,7 +132,8 @@ class ArchiveFile {
   bool failed_ = false;
 };
 
-/** The codec of the archive that this thread is writing; entries share its memory. */
+/** The archive that this thread is writing: its file, and the codec whose memory entries share. */
+thread_local ArchiveFile *archive_file = nullptr;
 thread_local std::unique_ptr<Codec> archive_codec;
 
 /** A file's bytes, as many as it had when it was opened. */
@@ -191,6 +196,8 @@ bool needs_utf8_flag(const char *name) {
 
 int open_entry(zipFile zip, const char *name) {
   constexpr int kRaw = 1;
+  // the library loses memory when it cannot write a header
+  if (archive_file != nullptr && !archive_file->make_room()) return ZIP_ERRNO;
   return zipOpenNewFileInZip4_64(zip, name, nullptr, nullptr, 0, nullptr, 0, nullptr, Z_DEFLATED,
                                  kLevel, kRaw, -MAX_WBITS, DEF_MEM_LEVEL, Z_DEFAULT_STRATEGY,
                                  nullptr, 0, kMadeByDefault, needs_utf8_flag(name) ? kUtf8Name : 0,
@@ -358,11 +365,13 @@ void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, i
     *error = QUARN_UNREADABLE;
     return;
   }
+  archive_file = &file;
   for (const char *dir : kDataDirs) {
     parse_app_dir_for_zip(pkg_id, root, zip, (std::string(root) + dir).c_str(), table.get(), error);
   }
   insert_file_info_table_to_zip(table.get(), zip, pkg_id, root, error);
   const int closed = zipClose(zip, nullptr);
+  archive_file = nullptr;
   archive_codec.reset();
   if (closed != ZIP_OK) {
     LOGE("zipClose() failed, zip_err = [%d]", closed);

@@ -2,16 +2,20 @@
 
 #include <fcntl.h>
 #include <glib.h>
+#include <isa-l/igzip_lib.h>
 #include <json-c/json.h>
 #include <libxml/tree.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 #include <unzip.h>
 #include <zip.h>
+#include <zlib.h>
 
 #include <cerrno>
 #include <cstdarg>
 #include <cstring>
+#include <new>
 
 namespace {
 
@@ -95,23 +99,32 @@ WRAP(int, zipCloseFileInZipRaw64, ZIP_ERRNO, (zipFile zip, ZPOS64_T size, uLong 
      (zip, size, crc))
 WRAP(int, unzOpenCurrentFile2, UNZ_BADZIPFILE, (unzFile zip, int *method, int *level, int raw),
      (zip, method, level, raw))
-WRAP(int, unzGetCurrentFileInfo, UNZ_BADZIPFILE,
-     (unzFile zip, unz_file_info *info, char *name, uLong name_size, void *extra, uLong extra_size,
-      char *comment, uLong comment_size),
+WRAP(int, unzGetCurrentFileInfo64, UNZ_BADZIPFILE,
+     (unzFile zip, unz_file_info64 *info, char *name, uLong name_size, void *extra,
+      uLong extra_size, char *comment, uLong comment_size),
      (zip, info, name, name_size, extra, extra_size, comment, comment_size))
-
-int __real_zipOpenNewFileInZip2_64(zipFile zip, const char *name, const zip_fileinfo *info,
-                                   const void *local, uInt local_size, const void *global,
-                                   uInt global_size, const char *comment, int method, int level,
-                                   int raw, int zip64);
-int __wrap_zipOpenNewFileInZip2_64(zipFile zip, const char *name, const zip_fileinfo *info,
-                                   const void *local, uInt local_size, const void *global,
-                                   uInt global_size, const char *comment, int method, int level,
-                                   int raw, int zip64) {
-  if (is_faulty("zipOpenNewFileInZip2_64")) return ZIP_PARAMERROR;
-  return __real_zipOpenNewFileInZip2_64(zip, name, info, local, local_size, global, global_size,
-                                        comment, method, level, raw, zip64);
-}
+WRAP(zipFile, zipOpen2_64, nullptr,
+     (const void *path, int append, zipcharpc *comment, zlib_filefunc64_def *functions),
+     (path, append, comment, functions))
+WRAP(int, zipClose, ZIP_ERRNO, (zipFile zip, const char *comment), (zip, comment))
+WRAP(int, zipOpenNewFileInZip4_64, ZIP_PARAMERROR,
+     (zipFile zip, const char *name, const zip_fileinfo *info, const void *local, uInt local_size,
+      const void *global, uInt global_size, const char *comment, int method, int level, int raw,
+      int window, int memory, int strategy, const char *password, uLong password_crc, uLong made_by,
+      uLong flags, int zip64),
+     (zip, name, info, local, local_size, global, global_size, comment, method, level, raw, window,
+      memory, strategy, password, password_crc, made_by, flags, zip64))
+WRAP(void *, mmap, MAP_FAILED, (void *at, size_t size, int access, int flags, int fd, off_t from),
+     (at, size, access, flags, fd, from))
+WRAP(int, isal_deflate, INVALID_FLUSH, (isal_zstream * stream), (stream))
+WRAP(int, deflate, Z_STREAM_ERROR, (z_stream * stream, int flush), (stream, flush))
+WRAP(int, deflateInit2_, Z_MEM_ERROR,
+     (z_stream * stream, int level, int method, int window, int memory, int strategy,
+      const char *version, int size),
+     (stream, level, method, window, memory, strategy, version, size))
+WRAP(int, inflateInit2_, Z_MEM_ERROR,
+     (z_stream * stream, int window, const char *version, int size),
+     (stream, window, version, size))
 
 int __real_openat(int dir, const char *name, int flags, ...);
 int __wrap_openat(int dir, const char *name, int flags, ...) {
@@ -144,5 +157,11 @@ int real_safe_lstat(const char *path, struct stat *status) asm("__real__Z10safe_
 int wrap_safe_lstat(const char *path, struct stat *status) asm("__wrap__Z10safe_lstatPKcP4stat");
 int wrap_safe_lstat(const char *path, struct stat *status) {
   return is_faulty("safe_lstat") ? -1 : real_safe_lstat(path, status);
+}
+
+void *real_new(std::size_t size, const std::nothrow_t &tag) asm("__real__ZnwmRKSt9nothrow_t");
+void *wrap_new(std::size_t size, const std::nothrow_t &tag) asm("__wrap__ZnwmRKSt9nothrow_t");
+void *wrap_new(std::size_t size, const std::nothrow_t &tag) {
+  return is_faulty("new") ? nullptr : real_new(size, tag);
 }
 }
