@@ -363,7 +363,7 @@ class WebdavBackend : public Backend {
       return problem;
     }
     std::vector<DavEntry> all;
-    if (answer.status != kMultiStatus || !parse_multistatus(answer.body, url_.origin, &all))
+    if (answer.status != kMultiStatus || !parse_multistatus(answer.body, url_.host, &all))
       return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's answer is not a listing");
     const std::string own = url_.path + folder;
     bool is_folder = false;

@@ -5,8 +5,11 @@
 #ifndef BACKUP_TRANSPORT_BACKEND_WEBDAV_H
 #define BACKUP_TRANSPORT_BACKEND_WEBDAV_H
 
+#include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "backend.h"
 #include "config.h"
@@ -20,15 +23,16 @@ std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url, const Config &
 struct DavEntry {
   std::string path; /**< decoded, without a trailing slash */
   bool is_collection = false;
-  uint64_t size = 0;
+  uint64_t size = 0;               /**< bytes; 0 for a collection, and when it is not told */
+  std::optional<int64_t> modified; /**< seconds since the Unix epoch by the server's clock */
 };
 
 /**
  * The resources of a multi-status document, in its order.
- * @param origin what an absolute reference must begin with to be ours
+ * @param host the server's name; absolute references to others are left out
  * @return false when it is none, or holds a document type
  */
-bool parse_multistatus(const std::string &xml, const std::string &origin,
+bool parse_multistatus(const std::string &xml, const std::string &host,
                        std::vector<DavEntry> *entries);
 
 }  // namespace transport

@@ -1,14 +1,18 @@
 #include <glib.h>
 
+#include <algorithm>
 #include <cstring>
+#include <optional>
 
 #include "backend_webdav.h"
+#include "http_date.h"
 #include "xml_answer.h"
 
 namespace transport {
 namespace {
 
 constexpr char kDav[] = "DAV:";
+constexpr guint kDecimal = 10;
 
 bool is_element(const xmlNode *node, const char *name) {
   return node->type == XML_ELEMENT_NODE && node->ns != nullptr &&
@@ -30,13 +34,25 @@ std::string text_of(const xmlNode *node) {
   return text.substr(first, text.find_last_not_of(" \t\r\n") - first + 1);
 }
 
-// "" for what is no path of this server.
-std::string path_of_href(std::string href, const std::string &origin) {
+// "host", "host:port" and "[address]:port" without what comes behind the host.
+std::string host_of(const std::string &authority) {
+  if (authority.empty() || authority[0] != '[') return authority.substr(0, authority.find(':'));
+  return authority.substr(1, authority.find(']') - 1);
+}
+
+// "" for what is no path of this server. Behind a proxy that ends the encryption a server may
+// name itself with the scheme and the port that it sees.
+std::string path_of_href(std::string href, const std::string &host) {
+  static constexpr char kBeforeAuthority[] = "://";
   if (href.empty() || href[0] != '/') {
-    if (href.size() < origin.size() ||
-        g_ascii_strncasecmp(href.c_str(), origin.c_str(), origin.size()) != 0)
+    const std::size_t scheme_end = href.find(kBeforeAuthority);
+    if (scheme_end == std::string::npos) return "";
+    const std::size_t authority = scheme_end + sizeof kBeforeAuthority - 1;
+    const std::size_t slash = std::min(href.find('/', authority), href.size());
+    if (g_ascii_strcasecmp(host_of(href.substr(authority, slash - authority)).c_str(),
+                           host.c_str()) != 0)
       return "";
-    href.erase(0, origin.size());
+    href.erase(0, slash);
   }
   char *decoded = g_uri_unescape_string(href.c_str(), nullptr);
   std::string path = decoded == nullptr ? "" : decoded;
@@ -46,26 +62,36 @@ std::string path_of_href(std::string href, const std::string &origin) {
   return path.empty() ? "/" : path;
 }
 
-void read_properties(const xmlNode *response, DavEntry *entry) {
+// "HTTP/1.1 200 OK"
+bool is_good(const xmlNode *status) {
+  const std::string line = text_of(status);
+  return line.compare(std::min(line.find(' '), line.size()), 2, " 2") == 0;
+}
+
+void read_properties(const xmlNode *response, bool slash, DavEntry *entry) {
+  // Whoever does not tell the type still ends a collection's name with a slash.
+  std::optional<bool> is_collection;
+  guint64 size = 0;
   for (const xmlNode *node = response->children; node != nullptr; node = node->next) {
     if (!is_element(node, "propstat")) continue;
     const xmlNode *status = child_named(node, "status");
     const xmlNode *properties = child_named(node, "prop");
     // Properties that it does not have come in a group with a status of their own.
-    if (properties == nullptr ||
-        (status != nullptr && text_of(status).find(" 200") == std::string::npos))
-      continue;
+    if (properties == nullptr || (status != nullptr && !is_good(status))) continue;
     if (const xmlNode *type = child_named(properties, "resourcetype"))
-      entry->is_collection = entry->is_collection || child_named(type, "collection") != nullptr;
+      is_collection = is_collection.value_or(false) || child_named(type, "collection") != nullptr;
     if (const xmlNode *length = child_named(properties, "getcontentlength"))
-      entry->size = g_ascii_strtoull(text_of(length).c_str(), nullptr, 10);
+      g_ascii_string_to_unsigned(text_of(length).c_str(), kDecimal, 0, G_MAXUINT64, &size, nullptr);
+    if (const xmlNode *time = child_named(properties, "getlastmodified"))
+      entry->modified = parse_http_date(text_of(time));
   }
-  if (entry->is_collection) entry->size = 0;
+  entry->is_collection = is_collection.value_or(slash);
+  entry->size = entry->is_collection ? 0 : size;
 }
 
 }  // namespace
 
-bool parse_multistatus(const std::string &xml, const std::string &origin,
+bool parse_multistatus(const std::string &xml, const std::string &host,
                        std::vector<DavEntry> *entries) {
   const XmlAnswer document = parse_xml(xml);
   if (!document) return false;
@@ -73,12 +99,14 @@ bool parse_multistatus(const std::string &xml, const std::string &origin,
   if (root == nullptr || !is_element(root, "multistatus")) return false;
   for (const xmlNode *node = root->children; node != nullptr; node = node->next) {
     if (!is_element(node, "response")) continue;
+    const xmlNode *status = child_named(node, "status");
     const xmlNode *href = child_named(node, "href");
-    if (href == nullptr) continue;
+    if (href == nullptr || (status != nullptr && !is_good(status))) continue;
+    const std::string reference = text_of(href);
     DavEntry entry;
-    entry.path = path_of_href(text_of(href), origin);
+    entry.path = path_of_href(reference, host);
     if (entry.path.empty()) continue;
-    read_properties(node, &entry);
+    read_properties(node, reference.back() == '/', &entry);
     entries->push_back(std::move(entry));
   }
   return true;

@@ -20,6 +20,8 @@
 #include <memory>
 #include <mutex>
 
+#include "http_date.h"
+
 namespace transport {
 namespace {
 
@@ -35,6 +37,7 @@ constexpr std::size_t kThreadStackBytes = 1024 * 1024;
 constexpr long kUploadBufferBytes = 64 * 1024;
 constexpr std::chrono::seconds kExitPatience{2};
 constexpr std::chrono::seconds kLongestRetryAfter{3600};
+constexpr guint kDecimal = 10;
 
 struct Curl {
   decltype(&::curl_global_init) global_init = nullptr;
@@ -45,7 +48,6 @@ struct Curl {
   decltype(&::curl_easy_strerror) easy_strerror = nullptr;
   decltype(&::curl_slist_append) slist_append = nullptr;
   decltype(&::curl_slist_free_all) slist_free_all = nullptr;
-  decltype(&::curl_getdate) getdate = nullptr;
   decltype(&::curl_multi_init) multi_init = nullptr;
   decltype(&::curl_multi_setopt) multi_setopt = nullptr;
   decltype(&::curl_multi_add_handle) multi_add_handle = nullptr;
@@ -76,7 +78,6 @@ bool load(Curl *curl) {
          find(library, "curl_easy_strerror", &curl->easy_strerror) &&
          find(library, "curl_slist_append", &curl->slist_append) &&
          find(library, "curl_slist_free_all", &curl->slist_free_all) &&
-         find(library, "curl_getdate", &curl->getdate) &&
          find(library, "curl_multi_init", &curl->multi_init) &&
          find(library, "curl_multi_setopt", &curl->multi_setopt) &&
          find(library, "curl_multi_add_handle", &curl->multi_add_handle) &&
@@ -215,12 +216,6 @@ class Engine {
     ticket.set_waker(nullptr);
     if (ticket.cancelled()) exchange->answer.problem = cancelled();
     return std::move(exchange->answer);
-  }
-
-  std::optional<std::chrono::milliseconds> seconds_until(const std::string &date) const {
-    const time_t when = curl_.getdate == nullptr ? -1 : curl_.getdate(date.c_str(), nullptr);
-    if (when < 0) return std::nullopt;
-    return std::chrono::seconds(std::max<time_t>(0, when - time(nullptr)));
   }
 
  private:
@@ -430,11 +425,16 @@ class Engine {
 std::optional<std::chrono::milliseconds> retry_after(const HttpAnswer &answer) {
   const std::string text = answer.header("retry-after");
   if (text.empty()) return std::nullopt;
+  int64_t seconds = 0;
   if (text.find_first_not_of("0123456789") == std::string::npos) {
-    const auto seconds = std::chrono::seconds(g_ascii_strtoull(text.c_str(), nullptr, 10));
-    return std::min<std::chrono::seconds>(seconds, kLongestRetryAfter);
+    seconds = static_cast<int64_t>(
+        std::min<guint64>(g_ascii_strtoull(text.c_str(), nullptr, kDecimal), G_MAXINT64));
+  } else {
+    const std::optional<int64_t> when = parse_http_date(text);
+    if (!when) return std::nullopt;
+    seconds = std::max<int64_t>(0, *when - time(nullptr));
   }
-  return Engine::get().seconds_until(text);
+  return std::min(std::chrono::seconds(seconds), kLongestRetryAfter);
 }
 
 }  // namespace

@@ -1,0 +1,282 @@
+#include <glib.h>
+
+#include "backend_webdav.h"
+#include "harness.h"
+
+using namespace harness;
+using transport::DavEntry;
+using transport::parse_multistatus;
+
+namespace {
+
+constexpr char kHost[] = "cloud.example.org";
+
+std::string text_of(const DavEntry &entry) {
+  return entry.path + (entry.is_collection ? " folder " : " object ") + std::to_string(entry.size) +
+         (entry.modified ? " at " + std::to_string(*entry.modified) : "");
+}
+
+std::vector<std::string> parsed(const std::string &xml, const std::string &host = kHost) {
+  std::vector<DavEntry> entries;
+  if (!parse_multistatus(xml, host, &entries)) {
+    EXPECT_TRUE(entries.empty());
+    return {"refused"};
+  }
+  std::vector<std::string> texts;
+  for (const DavEntry &entry : entries) texts.push_back(text_of(entry));
+  return texts;
+}
+
+using Texts = std::vector<std::string>;
+
+std::string document(const std::string &responses) {
+  return R"(<?xml version="1.0" encoding="utf-8"?><D:multistatus xmlns:D="DAV:">)" + responses +
+         "</D:multistatus>";
+}
+
+std::string object(const std::string &href, const std::string &properties = "<D:resourcetype/>",
+                   const std::string &status = "HTTP/1.1 200 OK") {
+  return document("<D:response><D:href>" + href + "</D:href><D:propstat><D:prop>" + properties +
+                  "</D:prop><D:status>" + status + "</D:status></D:propstat></D:response>");
+}
+
+Texts href_alone(const std::string &href, const std::string &host = kHost) {
+  return parsed(object(href), host);
+}
+
+TEST(DavXml, PrefixesDoNotMatter) {
+  for (const std::string prefix : {"D:", "d:", "a:", "lp1:", ""}) {
+    const std::string declaration =
+        prefix.empty() ? "xmlns" : "xmlns:" + prefix.substr(0, prefix.size() - 1);
+    const auto element = [&](const std::string &name, const std::string &content) {
+      return "<" + prefix + name + ">" + content + "</" + prefix + name + ">";
+    };
+    const std::string xml =
+        "<" + prefix + "multistatus " + declaration + "=\"DAV:\">" +
+        element("response",
+                element("href", "/dav/f/") +
+                    element("propstat",
+                            element("prop", element("resourcetype", element("collection", ""))) +
+                                element("status", "HTTP/1.1 200 OK"))) +
+        element("response",
+                element("href", "/dav/f/o") +
+                    element("propstat", element("prop", element("getcontentlength", "7") +
+                                                            element("resourcetype", "")) +
+                                            element("status", "HTTP/1.1 200 OK"))) +
+        "</" + prefix + "multistatus>";
+    EXPECT_EQ(parsed(xml), (Texts{"/dav/f folder 0", "/dav/f/o object 7"})) << prefix;
+  }
+}
+
+TEST(DavXml, PrefixesMayChangeFromElementToElement) {
+  EXPECT_EQ(parsed(R"(<multistatus xmlns="DAV:" xmlns:b="urn:uuid:1/">
+    <x:response xmlns:x="DAV:"><y:href xmlns:y="DAV:">
+      /dav/o
+    </y:href><propstat><prop xmlns:lp1="DAV:" xmlns:lp2="http://apache.org/dav/props/">
+      <lp2:executable>F</lp2:executable><lp1:getcontentlength b:dt="int"> 12 </lp1:getcontentlength>
+      <lp1:resourcetype/></prop><status>HTTP/1.1 200 OK</status></propstat></x:response>
+    </multistatus>)"),
+            (Texts{"/dav/o object 12"}));
+}
+
+TEST(DavXml, ElementsOfOtherNamespacesAreNotTaken) {
+  EXPECT_EQ(parsed(R"(<D:multistatus xmlns:D="DAV:" xmlns:o="other">
+    <o:response><D:href>/dav/a</D:href></o:response>
+    <D:response><o:href>/dav/b</o:href></D:response>
+    <D:response><D:href>/dav/c</D:href><D:propstat><D:prop><o:getcontentlength>9</o:getcontentlength>
+      <D:resourcetype><o:collection/></D:resourcetype></D:prop></D:propstat></D:response>
+    </D:multistatus>)"),
+            (Texts{"/dav/c object 0"}));
+  EXPECT_EQ(parsed(R"(<multistatus xmlns="other"/>)"), (Texts{"refused"}));
+  EXPECT_EQ(parsed("<multistatus/>"), (Texts{"refused"}));
+  EXPECT_EQ(parsed(R"(<D:prop xmlns:D="DAV:"/>)"), (Texts{"refused"}));
+}
+
+TEST(DavXml, PropertiesComeInAnyOrderAndNumberOfGroups) {
+  const std::string length = "<D:getcontentlength>5</D:getcontentlength>";
+  const std::string time = "<D:getlastmodified>Sun, 06 Nov 1994 08:49:37 GMT</D:getlastmodified>";
+  const std::string type = "<D:resourcetype/>";
+  for (const std::string &properties :
+       {length + time + type, type + time + length, time + type + length})
+    EXPECT_EQ(parsed(object("/o", properties)), (Texts{"/o object 5 at 784111777"}));
+  const auto group = [](const std::string &properties) {
+    return "<D:propstat><D:status>HTTP/1.1 200 OK</D:status><D:prop>" + properties +
+           "</D:prop></D:propstat>";
+  };
+  EXPECT_EQ(parsed(document("<D:response>" + group(time) + group(length) + group(type) +
+                            "<D:href>/o</D:href></D:response>")),
+            (Texts{"/o object 5 at 784111777"}));
+}
+
+TEST(DavXml, PropertiesThatTheServerDoesNotHaveCountNothing) {
+  EXPECT_EQ(parsed(document(
+                "<D:response><D:href>/o</D:href>"
+                "<D:propstat><D:prop><D:resourcetype/></D:prop><D:status>HTTP/1.1 200 OK</D:status>"
+                "</D:propstat><D:propstat><D:prop><D:getcontentlength>4</D:getcontentlength>"
+                "<D:resourcetype><D:collection/></D:resourcetype></D:prop>"
+                "<D:status>HTTP/1.1 404 Not Found</D:status></D:propstat></D:response>")),
+            (Texts{"/o object 0"}));
+  EXPECT_EQ(parsed(object("/o", "<D:getcontentlength>4</D:getcontentlength>", "HTTP/1.1 404 2")),
+            (Texts{"/o object 0"}));
+  EXPECT_EQ(parsed(object("/o", "<D:getcontentlength>4</D:getcontentlength>", "nonsense")),
+            (Texts{"/o object 0"}));
+  EXPECT_EQ(parsed(document("<D:response><D:href>/o</D:href><D:propstat/></D:response>")),
+            (Texts{"/o object 0"}));
+  EXPECT_EQ(parsed(document("<D:response><D:href>/o</D:href></D:response>")),
+            (Texts{"/o object 0"}));
+}
+
+TEST(DavXml, ResourcesWithAnErrorOfTheirOwnAreLeftOut) {
+  EXPECT_EQ(parsed(document("<D:response><D:href>/gone</D:href>"
+                            "<D:status>HTTP/1.1 404 Not Found</D:status></D:response>"
+                            "<D:response><D:href>/there</D:href>"
+                            "<D:status>HTTP/1.1 200 OK</D:status></D:response>")),
+            (Texts{"/there object 0"}));
+}
+
+TEST(DavXml, CollectionsHaveNoLength) {
+  EXPECT_EQ(parsed(object("/f",
+                          "<D:getcontentlength>4096</D:getcontentlength>"
+                          "<D:resourcetype><D:collection/></D:resourcetype>")),
+            (Texts{"/f folder 0"}));
+}
+
+TEST(DavXml, TypeThatIsNotToldIsSeenAtTheSlash) {
+  EXPECT_EQ(parsed(object("/f/", "<D:getcontentlength>9</D:getcontentlength>")),
+            (Texts{"/f folder 0"}));
+  EXPECT_EQ(parsed(object("/f", "<D:getcontentlength>9</D:getcontentlength>")),
+            (Texts{"/f object 9"}));
+  EXPECT_EQ(parsed(object("/f/", "<D:resourcetype/>")), (Texts{"/f object 0"}));
+}
+
+TEST(DavXml, LengthsThatAreNoneCountNothing) {
+  for (const char *length : {"", "-1", "0x10", "12 bytes", "1e3", "18446744073709551616"})
+    EXPECT_EQ(parsed(object("/o", std::string("<D:resourcetype/><D:getcontentlength>") + length +
+                                      "</D:getcontentlength>")),
+              (Texts{"/o object 0"}))
+        << length;
+  EXPECT_EQ(parsed(object("/o", "<D:getcontentlength>18446744073709551615</D:getcontentlength>")),
+            (Texts{"/o object 18446744073709551615"}));
+}
+
+TEST(DavXml, TimesThatAreNoneCountNothing) {
+  EXPECT_EQ(parsed(object("/o", "<D:getlastmodified>yesterday</D:getlastmodified>")),
+            (Texts{"/o object 0"}));
+}
+
+TEST(DavXml, PercentEscapesInEitherCase) {
+  EXPECT_EQ(href_alone("/d%c3%a4v/%2Fx%2fy%20z%7E~"), (Texts{"/d\xc3\xa4v//x/y z~~ object 0"}));
+  EXPECT_EQ(href_alone("/D%C3%A4v"), (Texts{"/D\xc3\xa4v object 0"}));
+  EXPECT_EQ(href_alone("/a%2541"), (Texts{"/a%41 object 0"}));
+  EXPECT_EQ(href_alone("/a&amp;b&#x41;+c"), (Texts{"/a&bA+c object 0"}));
+  for (const char *bad : {"/a%", "/a%4", "/a%zz", "/a%00b"})
+    EXPECT_EQ(href_alone(bad), Texts{}) << bad;
+}
+
+TEST(DavXml, SlashesAtTheEndGo) {
+  EXPECT_EQ(href_alone("/a/b/"), (Texts{"/a/b object 0"}));
+  EXPECT_EQ(href_alone("/a/b//"), (Texts{"/a/b object 0"}));
+  EXPECT_EQ(href_alone("/"), (Texts{"/ object 0"}));
+  EXPECT_EQ(href_alone("https://cloud.example.org/"), (Texts{"/ object 0"}));
+}
+
+TEST(DavXml, AbsoluteReferencesOfThisServer) {
+  for (const char *href : {"https://cloud.example.org/a", "https://cloud.example.org:443/a",
+                           "HTTPS://Cloud.Example.ORG/a", "http://cloud.example.org/a",
+                           "http://cloud.example.org:8080/a"})
+    EXPECT_EQ(href_alone(href), (Texts{"/a object 0"})) << href;
+  EXPECT_EQ(href_alone("http://[::1]:8080/a", "::1"), (Texts{"/a object 0"}));
+  EXPECT_EQ(href_alone("http://[::1]/a", "::1"), (Texts{"/a object 0"}));
+  for (const char *href : {"https://cloud.example.org", "https://cloud.example.org.evil/a",
+                           "https://other/a", "a", "", "./a", "https:///a", "http://[::1/a",
+                           "cloud.example.org/a", "https://u@cloud.example.org/a"})
+    EXPECT_EQ(href_alone(href), Texts{}) << href;
+}
+
+TEST(DavXml, ReferencesAreTextHoweverTheyAreWritten) {
+  EXPECT_EQ(href_alone("<![CDATA[/a b]]>"), (Texts{"/a b object 0"}));
+  EXPECT_EQ(href_alone("/a<!-- comment -->b"), (Texts{"/ab object 0"}));
+}
+
+TEST(DavXml, DocumentTypesAreRefused) {
+  const std::string rest = object("/o").substr(object("").find("?>") + 2);
+  const std::string head = R"(<?xml version="1.0"?>)";
+  EXPECT_EQ(parsed(head + rest), (Texts{"/o object 0"}));
+  EXPECT_EQ(parsed(head + "<!DOCTYPE multistatus>" + rest), (Texts{"refused"}));
+  EXPECT_EQ(parsed(head + R"(<!DOCTYPE m SYSTEM "http://127.0.0.1:9/x.dtd">)" + rest),
+            (Texts{"refused"}));
+  std::string bomb = head + R"(<!DOCTYPE m [<!ENTITY a0 "aaaaaaaaaa">)";
+  for (int i = 1; i < 12; ++i) {
+    bomb += "<!ENTITY a" + std::to_string(i) + " \"";
+    for (int k = 0; k < 10; ++k) bomb += "&a" + std::to_string(i - 1) + ";";
+    bomb += "\">";
+  }
+  EXPECT_EQ(parsed(bomb + "]>" +
+                   document("<D:response><D:href>/&a11;</D:href></D:response>")
+                       .substr(document("").find("?>") + 2)),
+            (Texts{"refused"}));
+}
+
+// What one does not see when one looks for it byte by byte.
+TEST(DavXml, DocumentTypesInOtherEncodingsAreRefused) {
+  const auto utf16 = [](const std::string &text) {
+    std::string wide = "\xff\xfe";
+    for (const char c : text) wide += std::string{c, '\0'};
+    return wide;
+  };
+  const std::string rest = object("/o").substr(object("").find("?>") + 2);
+  EXPECT_EQ(parsed(utf16(rest)), (Texts{"/o object 0"}));
+  EXPECT_EQ(parsed(utf16(R"(<!DOCTYPE m [<!ENTITY a "/etc/passwd">]>)" + rest)),
+            (Texts{"refused"}));
+}
+
+TEST(DavXml, EntitiesThatNobodyDeclaredAreRefused) {
+  EXPECT_EQ(href_alone("/&nobody;"), (Texts{"refused"}));
+}
+
+TEST(DavXml, GarbageIsRefused) {
+  const std::string good = object("/o");
+  for (const std::string &text :
+       {std::string(), std::string("\0\0\0", 3), std::string("not xml"), bytes(10000),
+        std::string("<html><body>Welcome</body></html>"), good + "<more/>", "x" + good,
+        object("/o\xff"), object(std::string("/o\0x", 4))})
+    EXPECT_EQ(parsed(text), (Texts{"refused"}));
+}
+
+TEST(DavXml, TruncatedDocumentsAreRefused) {
+  const std::string good = object("/o");
+  for (std::size_t length = 0; length < good.size(); ++length)
+    EXPECT_EQ(parsed(good.substr(0, length)), (Texts{"refused"})) << length;
+}
+
+TEST(DavXml, NestingWithoutEndIsRefused) {
+  std::string deep;
+  for (int i = 0; i < 100000; ++i) deep += "<D:response>";
+  EXPECT_EQ(parsed(R"(<D:multistatus xmlns:D="DAV:">)" + deep), (Texts{"refused"}));
+}
+
+TEST(DavXml, LargeListingsAreRead) {
+  constexpr int kEntries = 20000;
+  std::string responses;
+  for (int i = 0; i < kEntries; ++i) {
+    const std::string one = object("/dav/folder/" + std::to_string(i),
+                                   "<D:resourcetype/><D:getcontentlength>1</D:getcontentlength>");
+    const std::size_t start = one.find("<D:response>");
+    responses += one.substr(start, one.rfind("</D:multistatus>") - start);
+  }
+  const Texts texts = parsed(document(responses));
+  ASSERT_EQ(texts.size(), static_cast<std::size_t>(kEntries));
+  EXPECT_EQ(texts.back(), "/dav/folder/19999 object 1");
+}
+
+TEST(DavXml, NameMayBeAsLongAsTheAnswer) {
+  constexpr std::size_t kBytes = 15U << 20;
+  std::vector<DavEntry> entries;
+  ASSERT_TRUE(parse_multistatus(object("/" + std::string(kBytes, 'x')), kHost, &entries));
+  ASSERT_EQ(entries.size(), 1U);
+  EXPECT_EQ(entries[0].path.size(), kBytes + 1);
+}
+
+TEST(DavXml, EmptyListing) { EXPECT_EQ(parsed(document("")), Texts{}); }
+
+}  // namespace
