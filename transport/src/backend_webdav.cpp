@@ -1,35 +1,38 @@
 #include "backend_webdav.h"
 
+#include <unistd.h>
+
 #include <algorithm>
+#include <array>
+#include <cerrno>
+#include <chrono>
 #include <functional>
 #include <mutex>
 #include <set>
 
-#include "http_store.h"
+#include "dav_client.h"
 #include "remote_path.h"
 
 namespace transport {
 namespace {
 
-constexpr int kCreated = 201;
-constexpr int kMultiStatus = 207;
-constexpr int kLocked = 423;
-constexpr int kServerError = 500;
 constexpr int64_t kMillisecondsPerSecond = 1000;
 constexpr std::size_t kMaxKnownFolders = 4096;
-constexpr long kTidyUpSeconds = 5;
+// So often does a server that takes empty objects refuse one until it counts as full.
+constexpr int kRefusalsOfAFullStore = 3;
+// So often does a condition fail that should hold until it counts as a conflict.
+constexpr int kFailuresOfAConflict = 3;
+// How long a server may take to notice that nobody sends any more what it receives.
+constexpr std::chrono::milliseconds kTidyUpPauses[] = {
+    std::chrono::milliseconds(50), std::chrono::milliseconds(200), std::chrono::milliseconds(800)};
 
-constexpr char kPropfind[] =
-    "<?xml version=\"1.0\" encoding=\"utf-8\"?>"
-    "<d:propfind xmlns:d=\"DAV:\"><d:prop><d:resourcetype/><d:getcontentlength/></d:prop>"
-    "</d:propfind>";
-constexpr char kLockInfo[] =
-    "<?xml version=\"1.0\" encoding=\"utf-8\"?>"
-    "<d:lockinfo xmlns:d=\"DAV:\"><d:lockscope><d:exclusive/></d:lockscope>"
-    "<d:locktype><d:write/></d:locktype></d:lockinfo>";
-constexpr char kXmlType[] = "Content-Type: application/xml; charset=utf-8";
+// An upload cannot end with what is said of objects that are asked for.
+Outcome of_upload(Outcome outcome) {
+  if (outcome.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) outcome.code = BACKUP_TRANS_ERROR_SERVER;
+  return outcome;
+}
 
-// Bytes that lie at the server under a temporary name; whatever is not moved is deleted.
+// What an upload has done so far; what is not moved to its place is deleted.
 struct Uploaded {
   explicit Uploaded(std::function<void(const Uploaded &)> give_up) : give_up_(std::move(give_up)) {}
   Uploaded(const Uploaded &) = delete;
@@ -43,34 +46,43 @@ struct Uploaded {
   void settle() {
     temporary.clear();
     made_folder.clear();
+    answered = false;
     complete = false;
     move_asked = false;
   }
 
   std::string temporary;
   std::string made_folder;  // to go again when nothing comes to lie in it
+  bool answered = false;    // the server has come to an end with it
   bool complete = false;
   bool move_asked = false;
+  int refusals = 0;              // of content where there was room for a name
+  int failed_preconditions = 0;  // that should have held
 
  private:
   std::function<void(const Uploaded &)> give_up_;
 };
 
+// What has to be so for a move to be done.
+struct Conditions {
+  std::string header;
+  bool overwrite = true;
+};
+
 class WebdavBackend : public Backend {
  public:
-  WebdavBackend(const StoreUrl &url, const Config &config)
-      : url_(url), user_(config.user), password_(config.password), ca_file_(config.ca_file) {}
+  WebdavBackend(const StoreUrl &url, const Config &config) : client_(url, config) {}
 
   Outcome download(Attempt &attempt, const std::string &path, LocalTarget &target,
                    Version *version) override {
     if (!target.begin()) return local_failure("cannot make a local file");
     const Received received =
-        receive(attempt.ticket, request_for("GET", path), G_CHECKSUM_SHA256, &target);
-    if (is_absent(received.answer) || means_folder(received.answer, path)) {
+        receive(attempt.ticket, client_.request_for("GET", path), G_CHECKSUM_SHA256, &target);
+    if (!is_object(attempt.ticket, received.answer, path)) {
       if (version != nullptr) version->reset();
       return no_such_object();
     }
-    if (!received.answer.good()) return outcome(received.answer, "download");
+    if (!received.answer.good()) return dav_outcome(received.answer, "download");
     const Outcome result = publish(attempt.ticket, received, target);
     if (result.ok() && version != nullptr) *version = received.checksum;
     return result;
@@ -89,7 +101,7 @@ class WebdavBackend : public Backend {
       uploaded->complete = true;
     }
     const Outcome result = upload.basis == nullptr
-                               ? move(attempt.ticket, upload, uploaded.get(), "")
+                               ? move(attempt.ticket, upload, uploaded.get(), {})
                                : move_locked(attempt.ticket, upload, uploaded.get());
     if (!result.ok()) return result;
     uploaded->settle();
@@ -102,11 +114,11 @@ class WebdavBackend : public Backend {
 
   Outcome list(Attempt &attempt, const std::string &folder, int start, int count,
                ListPage *page) override {
-    std::vector<DavEntry> entries;
-    bool has_temporary = false;
-    const Outcome found = children_of(attempt.ticket, folder, "", &entries, &has_temporary);
+    DavListing listing;
+    const Outcome found = client_.list(attempt.ticket, folder, &listing);
     if (found.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) return success();
     if (!found.ok()) return found;
+    std::vector<DavEntry> &entries = listing.children;
     std::sort(entries.begin(), entries.end(),
               [](const DavEntry &a, const DavEntry &b) { return a.path < b.path; });
     const std::size_t first = std::min(entries.size(), static_cast<std::size_t>(start));
@@ -123,9 +135,8 @@ class WebdavBackend : public Backend {
   }
 
   Outcome remove_folder(Attempt &attempt, const std::string &folder) override {
-    std::vector<DavEntry> entries;
-    bool has_temporary = false;
-    Outcome result = children_of(attempt.ticket, folder, "", &entries, &has_temporary);
+    DavListing listing;
+    Outcome result = client_.list(attempt.ticket, folder, &listing);
     if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT && attempt.number > 1) {
       // An earlier attempt that failed had its effect all the same.
       prune(attempt.ticket, parent_of(folder));
@@ -133,38 +144,26 @@ class WebdavBackend : public Backend {
     }
     if (!result.ok()) return result;
     forget(folder);
-    const HttpAnswer answer = http_perform(attempt.ticket, request_for("DELETE", folder + "/"));
-    if (answer.complete() && answer.status == kMultiStatus)
+    const HttpAnswer answer = client_.send(attempt.ticket, "DELETE", folder + "/");
+    if (has_status(answer, kHttpMultiStatus))
       return failure(BACKUP_TRANS_ERROR_SERVER, "delete: the server kept a part of the folder");
-    if (!is_absent(answer) && !answer.good()) return outcome(answer, "delete");
+    if (!is_absent(answer) && !answer.good()) return dav_outcome(answer, "delete");
     prune(attempt.ticket, parent_of(folder));
     return success();
   }
 
  private:
-  HttpRequest request_for(const char *method, const std::string &path) const {
-    HttpRequest request;
-    request.method = method;
-    request.url = url_.base + encode_path(path);
-    request.user = user_;
-    request.password = password_;
-    request.ca_file = ca_file_;
-    return request;
-  }
-
-  // Somebody else's lock goes away by itself.
-  static Outcome outcome(const HttpAnswer &answer, const char *what) {
-    Outcome result = outcome_of(answer, what);
-    if (answer.complete() && answer.status == kLocked) result.transient = true;
-    return result;
-  }
-
-  // Servers send whoever asks for a folder as if it were an object to its name with a slash.
-  bool means_folder(const HttpAnswer &answer, const std::string &path) const {
-    if (!answer.complete() || answer.status / 100 != 3) return false;
-    const std::string expected = url_.base + encode_path(path) + "/";
-    const std::string location = answer.header("location");
-    return location == expected || url_.origin + location == expected;
+  // Whether the answer to a GET is an object's, or an error that does not tell.
+  bool is_object(Ticket &ticket, const HttpAnswer &answer, const std::string &path) {
+    if (is_absent(answer) || client_.means_folder(answer, path)) return false;
+    if (has_status(answer, kHttpMethodNotAllowed)) return !client_.is_folder(ticket, path);
+    if (!answer.good()) return true;
+    // Some take what comes behind an object's name for an argument of the object.
+    const std::string folder = parent_of(path);
+    if (folder.empty() || is_known(folder)) return true;
+    const bool has_folder = client_.is_folder(ticket, folder);
+    if (has_folder) remember(folder);
+    return has_folder || ticket.cancelled();
   }
 
   // Puts the bytes under a temporary name and makes sure that they all arrived.
@@ -173,27 +172,23 @@ class WebdavBackend : public Backend {
     const std::string folder = parent_of(temporary);
     Outcome result = ensure_folder(ticket, folder, uploaded);
     if (!result.ok()) return result;
-    HttpAnswer answer = put(ticket, upload, temporary);
-    const bool folder_gone =
-        answer.complete() && (answer.status == kHttpNotFound || answer.status == kHttpConflict ||
-                              answer.status == kServerError);
-    if (folder_gone && !folder.empty()) {
-      // Another device may have deleted what was known; what is there does not mind.
+    HttpAnswer answer = put(ticket, upload, uploaded);
+    const bool folder_gone = has_status(answer, kHttpNotFound) ||
+                             has_status(answer, kHttpConflict) ||
+                             has_status(answer, kHttpServerError);
+    if (folder_gone && !folder.empty() && !client_.is_folder(ticket, folder)) {
+      // Another device has deleted what was known.
       forget("");
       result = ensure_folder(ticket, folder, uploaded);
       if (!result.ok()) return result;
-      answer = put(ticket, upload, temporary);
+      answer = put(ticket, upload, uploaded);
     }
-    if (!answer.good()) {
-      result = outcome(answer, "upload");
-      if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) result.code = BACKUP_TRANS_ERROR_SERVER;
-      return result;
-    }
+    if (!answer.good()) return refused(ticket, upload, uploaded, answer);
     if (!upload.source.unchanged())
       return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, "the local file changed while it was sent");
-    answer = http_perform(ticket, request_for("HEAD", temporary));
+    answer = client_.send(ticket, "HEAD", temporary);
     if (!answer.good()) {
-      result = outcome(answer, "upload");
+      result = dav_outcome(answer, "upload");
       return result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT ? again("upload: it did not last")
                                                               : result;
     }
@@ -201,138 +196,196 @@ class WebdavBackend : public Backend {
                                                   : again("upload: it arrived incomplete");
   }
 
-  HttpAnswer put(Ticket &ticket, const Upload &upload, const std::string &path) const {
-    HttpRequest request = request_for("PUT", path);
+  HttpAnswer put(Ticket &ticket, const Upload &upload, Uploaded *uploaded) const {
+    HttpRequest request = client_.request_for("PUT", uploaded->temporary);
     request.has_body = true;
     request.body_fd = upload.source.fd();
     request.body_size = upload.source.size();
     request.headers = {
         "Content-Type: " + upload.content_type,
         "X-OC-Mtime: " + std::to_string(upload.timestamp_ms / kMillisecondsPerSecond)};
-    return http_perform(ticket, request);
+    uploaded->answered = false;
+    HttpAnswer answer = http_perform(ticket, request);
+    uploaded->answered = answer.complete();
+    return answer;
   }
 
-  Outcome move(Ticket &ticket, const Upload &upload, Uploaded *uploaded, const std::string &token) {
+  // Few servers say that their disk is full. One that takes an object without content and
+  // refuses the content again and again has no room for it.
+  Outcome refused(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+                  const HttpAnswer &answer) const {
+    const Outcome result = of_upload(dav_outcome(answer, "upload"));
+    const bool unclear =
+        has_status(answer, kHttpServerError) || has_status(answer, kHttpMethodNotAllowed);
+    if (!unclear || upload.source.size() == 0) return result;
+    HttpRequest request = client_.request_for("PUT", uploaded->temporary);
+    request.has_body = true;
+    if (!http_perform(ticket, request).good()) return result;
+    if (++uploaded->refusals < kRefusalsOfAFullStore) return again(result.message);
+    return failure(BACKUP_TRANS_ERROR_QUOTA, result.message + ", as if its disk was full");
+  }
+
+  Outcome move(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+               const Conditions &conditions) {
     if (uploaded->move_asked) {
       // The earlier answer was lost or an error, which does not tell whether it was done.
-      const HttpAnswer left = http_perform(ticket, request_for("HEAD", uploaded->temporary));
-      if (is_absent(left)) {
-        const HttpAnswer moved = http_perform(ticket, request_for("HEAD", upload.path));
-        if (moved.good() && has_size(moved, upload.source.size())) return success();
-        uploaded->settle();
-        return again("upload: it did not last");
-      }
-      if (!left.good()) return outcome(left, "upload");
+      const HttpAnswer left = client_.send(ticket, "HEAD", uploaded->temporary);
+      if (is_absent(left)) return find_moved(ticket, upload, uploaded);
+      if (!left.good()) return dav_outcome(left, "upload");
     }
-    HttpRequest request = request_for("MOVE", uploaded->temporary);
-    request.headers = {"Destination: " + url_.base + encode_path(upload.path), "Overwrite: T"};
-    if (!token.empty()) request.headers.push_back(condition(parent_of(upload.path), token));
+    HttpRequest request = client_.request_for("MOVE", uploaded->temporary);
+    request.headers = {"Destination: " + client_.url_of(upload.path),
+                       conditions.overwrite ? "Overwrite: T" : "Overwrite: F"};
+    if (!conditions.header.empty()) request.headers.push_back(conditions.header);
     uploaded->move_asked = true;
     const HttpAnswer answer = http_perform(ticket, request);
-    if (answer.good() && answer.status != kMultiStatus) return success();
-    if (answer.complete() && (answer.status == kHttpNotFound || answer.status == kHttpConflict ||
-                              answer.status == kHttpGone)) {
+    if (answer.good() && answer.status != kHttpMultiStatus) return success();
+    if (is_absent(answer) || has_status(answer, kHttpConflict)) {
       // The folder was deleted, and what had been sent with it.
       forget("");
       uploaded->settle();
       return again("upload: the folder was deleted meanwhile");
     }
-    return outcome(answer, "upload");
+    return dav_outcome(answer, "upload");
+  }
+
+  Outcome find_moved(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+    if (upload.basis != nullptr) {
+      // Another device may have replaced it since, which nobody can tell from its never having
+      // been there.
+      Version present;
+      const Outcome found = read_version(ticket, upload.path, &present, nullptr);
+      if (!found.ok()) return found;
+      return present == version_of(upload.source)
+                 ? success()
+                 : failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
+    }
+    const HttpAnswer moved = client_.send(ticket, "HEAD", upload.path);
+    if (moved.good() && has_size(moved, upload.source.size())) return success();
+    if (!moved.good() && !is_absent(moved)) return dav_outcome(moved, "upload");
+    uploaded->settle();
+    return again("upload: it did not last");
   }
 
   // The comparison and the move happen while nobody else may change the folder.
   Outcome move_locked(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
     const std::string folder = parent_of(upload.path);
     std::string token;
-    Outcome result = lock(ticket, folder, &token);
-    if (!result.ok()) return result;
-    // A move whose answer was lost has changed the object itself.
-    if (!uploaded->move_asked) result = compare_basis(ticket, upload);
-    if (result.ok()) result = move(ticket, upload, uploaded, token);
-    unlock(folder, token);
+    Outcome result = client_.lock(ticket, folder, &token);
+    if (!result.ok()) {
+      forget("");
+      return result;
+    }
+    result = move_if_unchanged(ticket, upload, uploaded, token);
+    client_.unlock(folder, token);
     return result;
   }
 
-  Outcome compare_basis(Ticket &ticket, const Upload &upload) {
-    const Received received =
-        receive(ticket, request_for("GET", upload.path), G_CHECKSUM_SHA256, nullptr);
-    Version present;
-    if (received.answer.good()) {
-      present = received.checksum;
-    } else if (!is_absent(received.answer)) {
-      return outcome(received.answer, "upload");
+  Outcome move_if_unchanged(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+                            const std::string &token) {
+    Conditions conditions;
+    // A move whose answer was lost has changed the object itself.
+    if (!uploaded->move_asked) {
+      std::string tag;
+      const Outcome compared = compare_basis(ticket, upload, &tag);
+      if (!compared.ok()) return compared;
+      // Where there is no lock, the server may be able to compare at the last moment.
+      if (token.empty() && !tag.empty() && uploaded->failed_preconditions == 0)
+        conditions.header = client_.tag_condition(upload.path, tag);
+      conditions.overwrite = upload.basis->has_value();
     }
-    if (present == *upload.basis) return success();
-    return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
+    if (!token.empty()) conditions.header = client_.lock_condition(parent_of(upload.path), token);
+    Outcome result = move(ticket, upload, uploaded, conditions);
+    if (result.code != BACKUP_TRANS_ERROR_CONFLICT || !uploaded->complete) return result;
+    // Nothing was done. Either the object is another one now, or the condition was not as it
+    // should be: a lock that ended, a tag that means nothing.
+    uploaded->move_asked = false;
+    const Outcome compared = compare_basis(ticket, upload, nullptr);
+    if (!compared.ok()) return compared;
+    if (++uploaded->failed_preconditions >= kFailuresOfAConflict) return result;
+    return again(result.message);
   }
 
-  // No token where the server does not lock: nothing better is to be had there.
-  Outcome lock(Ticket &ticket, const std::string &folder, std::string *token) {
-    HttpRequest request = request_for("LOCK", folder + "/");
-    request.has_body = true;
-    request.body = kLockInfo;
-    request.headers = {kXmlType, "Depth: infinity", "Timeout: Second-60"};
-    const HttpAnswer answer = http_perform(ticket, request);
-    if (answer.complete() &&
-        (answer.status == kHttpMethodNotAllowed || answer.status == kHttpNotImplemented))
-      return success();
-    if (!answer.good()) return outcome(answer, "lock");
-    *token = answer.header("lock-token");
+  // The version of what is there now, and its tag where that can be relied on.
+  Outcome read_version(Ticket &ticket, const std::string &path, Version *version,
+                       std::string *tag) const {
+    const Received received =
+        receive(ticket, client_.request_for("GET", path), G_CHECKSUM_SHA256, nullptr);
+    version->reset();
+    if (!received.answer.good())
+      return is_absent(received.answer) ? success() : dav_outcome(received.answer, "upload");
+    *version = received.checksum;
+    const std::string found = received.answer.header("etag");
+    const bool strong = found.size() > 2 && found.front() == '"' && found.back() == '"';
+    if (tag != nullptr && strong) *tag = found;
     return success();
   }
 
-  void unlock(const std::string &folder, const std::string &token) {
-    if (token.empty()) return;
-    HttpRequest request = request_for("UNLOCK", folder + "/");
-    request.headers = {"Lock-Token: " + token};
-    // Also after a cancellation; else others would wait until the lock ends by itself.
-    Ticket own;
-    request.seconds = kTidyUpSeconds;
-    http_perform(own, request);
+  static Version version_of(const LocalSource &source) {
+    Checksum checksum(G_CHECKSUM_SHA256);
+    std::array<char, 64 * 1024> buffer{};
+    for (off_t at = 0;;) {
+      const ssize_t got = pread(source.fd(), buffer.data(), buffer.size(), at);
+      if (got < 0 && errno == EINTR) continue;
+      if (got <= 0) return checksum.hex();
+      checksum.add(buffer.data(), static_cast<std::size_t>(got));
+      at += got;
+    }
   }
 
-  std::string condition(const std::string &folder, const std::string &token) const {
-    return "If: <" + url_.base + encode_path(folder) + "/> (" + token + ")";
+  Outcome compare_basis(Ticket &ticket, const Upload &upload, std::string *tag) const {
+    Version present;
+    const Outcome found = read_version(ticket, upload.path, &present, tag);
+    if (!found.ok() || present == *upload.basis) return found;
+    return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
   }
 
   Outcome ensure_folder(Ticket &ticket, const std::string &folder, Uploaded *uploaded) {
     if (is_known(folder)) return success();
-    HttpAnswer answer = http_perform(ticket, request_for("MKCOL", folder + "/"));
-    if (answer.complete() && (answer.status == kHttpConflict || answer.status == kHttpNotFound) &&
-        !folder.empty()) {
+    HttpAnswer answer = client_.send(ticket, "MKCOL", folder + "/");
+    if ((has_status(answer, kHttpConflict) || is_absent(answer)) && !folder.empty()) {
       const Outcome parent = ensure_folder(ticket, parent_of(folder), uploaded);
       if (!parent.ok()) return parent;
-      answer = http_perform(ticket, request_for("MKCOL", folder + "/"));
+      answer = client_.send(ticket, "MKCOL", folder + "/");
     }
     // An answer that did not come does not tell that it was not made.
-    if (!answer.complete() || answer.status == kCreated) uploaded->made_folder = folder;
-    if (!answer.good() && !(answer.complete() && answer.status == kHttpMethodNotAllowed) &&
-        !(answer.complete() && is_folder(ticket, folder))) {
-      Outcome result = outcome(answer, "make a folder");
-      if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) result.code = BACKUP_TRANS_ERROR_SERVER;
-      // Somebody removed a parent in between.
-      if (answer.complete() && answer.status == kHttpConflict) {
-        forget("");
-        result.transient = true;
-      }
-      return result;
+    if (!answer.complete() || has_status(answer, kHttpCreated)) uploaded->made_folder = folder;
+    if (!answer.complete()) return answer.problem;
+    if (!answer.good()) {
+      const Outcome there = find_folder(ticket, folder, answer);
+      if (!there.ok()) return there;
     }
-    const std::lock_guard<std::mutex> guard(mutex_);
-    if (known_.size() >= kMaxKnownFolders) known_.clear();
-    known_.insert(folder);
+    remember(folder);
     return success();
   }
 
-  // Who makes a folder at the same time as another may be answered with any error.
-  bool is_folder(Ticket &ticket, const std::string &folder) {
-    std::vector<DavEntry> entries;
-    bool has_temporary = false;
-    return children_of(ticket, folder, "", &entries, &has_temporary).ok();
+  // A folder that could not be made is there already, or somebody else made it at the same time,
+  // which may be answered with any error.
+  Outcome find_folder(Ticket &ticket, const std::string &folder, const HttpAnswer &answer) {
+    DavListing listing;
+    const Outcome found = client_.list(ticket, folder, &listing);
+    if (found.ok() || (!found.transient && found.code != BACKUP_TRANS_ERROR_NO_SUCH_OBJECT))
+      return found;
+    if (has_status(answer, kHttpMethodNotAllowed))
+      return failure(BACKUP_TRANS_ERROR_SERVER, "make a folder: there is an object in its place");
+    Outcome result = of_upload(dav_outcome(answer, "make a folder"));
+    // Somebody removed a parent in between.
+    if (has_status(answer, kHttpConflict)) {
+      forget("");
+      result.transient = true;
+    }
+    return result;
   }
 
   bool is_known(const std::string &folder) {
     const std::lock_guard<std::mutex> guard(mutex_);
     return known_.count(folder) != 0;
+  }
+
+  void remember(const std::string &folder) {
+    const std::lock_guard<std::mutex> guard(mutex_);
+    if (known_.size() >= kMaxKnownFolders) known_.clear();
+    known_.insert(folder);
   }
 
   // What is not known to be there any more: @p folder and everything in it; "" is everything.
@@ -344,98 +397,59 @@ class WebdavBackend : public Backend {
     }
   }
 
-  // Children with their paths in the store; temporary ones are only mentioned.
-  Outcome children_of(Ticket &ticket, const std::string &folder, const std::string &token,
-                      std::vector<DavEntry> *entries, bool *has_temporary) {
-    HttpRequest request = request_for("PROPFIND", folder + "/");
-    request.has_body = true;
-    request.body = kPropfind;
-    request.headers = {kXmlType, "Depth: 1"};
-    if (!token.empty()) request.headers.push_back(condition(folder, token));
-    const HttpAnswer answer = http_perform(ticket, request);
-    if (is_absent(answer) || means_object(answer)) return no_such_object();
-    if (!answer.good()) {
-      const Outcome problem = outcome(answer, "list");
-      // Some find an object's name with a slash too odd to say that there is nothing.
-      const bool odd =
-          answer.complete() && !problem.transient && answer.status != kHttpUnauthorized;
-      if (odd && !folder.empty() && is_object(ticket, folder)) return no_such_object();
-      return problem;
-    }
-    std::vector<DavEntry> all;
-    if (answer.status != kMultiStatus || !parse_multistatus(answer.body, url_.host, &all))
-      return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's answer is not a listing");
-    const std::string own = url_.path + folder;
-    bool is_folder = false;
-    for (DavEntry &entry : all) {
-      if (entry.path == own || (own.empty() && entry.path == "/")) {
-        is_folder = entry.is_collection;
-        continue;
-      }
-      if (entry.path.compare(0, own.size() + 1, own + "/") != 0) continue;
-      const std::string name = entry.path.substr(own.size() + 1);
-      if (is_temporary_name(name)) {
-        *has_temporary = true;
-        continue;
-      }
-      entry.path = folder + "/" + name;
-      if (is_object_path(entry.path.c_str()) && name.find('/') == std::string::npos)
-        entries->push_back(std::move(entry));
-    }
-    return is_folder ? success() : no_such_object();
-  }
-
-  // Also when it is below one.
-  bool is_object(Ticket &ticket, std::string path) {
-    for (; !path.empty(); path = parent_of(path)) {
-      if (http_perform(ticket, request_for("HEAD", path)).good()) return true;
-    }
-    return false;
-  }
-
-  static bool means_object(const HttpAnswer &answer) {
-    return answer.complete() &&
-           (answer.status / 100 == 3 || answer.status == kHttpMethodNotAllowed);
-  }
-
   // Folders that hold nothing vanish, from the innermost outwards, while nobody can put
   // something into them.
   void prune(Ticket &ticket, std::string folder) {
-    for (; !folder.empty(); folder = parent_of(folder)) {
-      std::string token;
-      if (!lock(ticket, folder, &token).ok() || token.empty()) return;
-      std::vector<DavEntry> entries;
-      bool has_temporary = false;
-      const Outcome found = children_of(ticket, folder, "", &entries, &has_temporary);
-      if (!found.ok() || !entries.empty() || has_temporary) {
-        unlock(folder, token);
-        return;
-      }
+    while (!folder.empty() && is_empty(ticket, folder) && prune_one(ticket, folder))
+      folder = parent_of(folder);
+  }
+
+  bool is_empty(Ticket &ticket, const std::string &folder) const {
+    DavListing listing;
+    return client_.list(ticket, folder, &listing).ok() && listing.children.empty() &&
+           !listing.has_temporary;
+  }
+
+  bool prune_one(Ticket &ticket, const std::string &folder) {
+    std::string token;
+    if (!client_.lock(ticket, folder, &token).ok() || token.empty()) return false;
+    bool gone = false;
+    if (is_empty(ticket, folder)) {
       forget(folder);
-      HttpRequest request = request_for("DELETE", folder + "/");
-      request.headers = {condition(folder, token)};
-      if (!http_perform(ticket, request).good()) {
-        unlock(folder, token);
-        return;
-      }
+      HttpRequest request = client_.request_for("DELETE", folder + "/");
+      request.headers = {client_.lock_condition(folder, token)};
+      gone = http_perform(ticket, request).good();
     }
+    // Some keep a lock on what was deleted.
+    client_.unlock(folder, token);
+    return gone;
   }
 
   // Also after a cancellation, therefore with a ticket of its own.
   void tidy_up(const Uploaded &left) {
     Ticket own;
-    if (!left.temporary.empty()) {
-      HttpRequest request = request_for("DELETE", left.temporary);
-      request.seconds = kTidyUpSeconds;
-      if (!http_perform(own, request).complete()) return;
-    }
-    prune(own, left.made_folder);
+    if (!left.temporary.empty() && !delete_temporary(own, left)) return;
+    if (!left.made_folder.empty()) prune(own, left.made_folder);
   }
 
-  const StoreUrl url_;
-  const std::string user_;
-  const std::string password_;
-  const std::string ca_file_;
+  // Returns whether the server can be spoken to.
+  bool delete_temporary(Ticket &ticket, const Uploaded &left) const {
+    HttpRequest request = client_.request_for("DELETE", left.temporary);
+    request.seconds = kTidyUpSeconds;
+    HttpAnswer answer = http_perform(ticket, request);
+    for (const std::chrono::milliseconds pause : kTidyUpPauses) {
+      // What was cut off may come to lie there after it was looked for.
+      const bool may_come = is_absent(answer) && !left.answered;
+      if (!answer.complete() || answer.good() || (is_absent(answer) && !may_come)) break;
+      ticket.pause(pause);
+      answer = http_perform(ticket, request);
+    }
+    if (answer.complete() && left.answered && !left.complete)
+      client_.delete_pieces(ticket, parent_of(left.temporary), left.temporary);
+    return answer.complete();
+  }
+
+  const DavClient client_;
   std::mutex mutex_;
   std::set<std::string> known_;  // folders that were seen or made
 };

@@ -76,9 +76,12 @@ std::string make_temporary_name() {
 }
 
 bool is_temporary_name(std::string_view name) {
-  return name.size() == kTemporaryPrefix.size() + kTemporaryRandomBytes * kHexPerByte &&
-         name.substr(0, kTemporaryPrefix.size()) == kTemporaryPrefix &&
-         name.find_first_not_of(kHexDigits, kTemporaryPrefix.size()) == std::string_view::npos;
+  constexpr std::size_t kSize = kTemporaryPrefix.size() + kTemporaryRandomBytes * kHexPerByte;
+  if (name.size() < kSize || name.substr(0, kTemporaryPrefix.size()) != kTemporaryPrefix ||
+      name.substr(0, kSize).find_first_not_of(kHexDigits, kTemporaryPrefix.size()) !=
+          std::string_view::npos)
+    return false;
+  return name.size() == kSize || name[kSize] == '.';
 }
 
 }  // namespace transport

@@ -35,7 +35,10 @@ std::string name_of(const std::string &path);
 /** A fresh name for something that is not an object yet, or no longer. */
 std::string make_temporary_name();
 
-/** Could make_temporary_name() have made it? No object has such a name. */
+/**
+ * Could make_temporary_name() have made it? No object has such a name. Servers put
+ * something behind a dot to it while they receive it.
+ */
 bool is_temporary_name(std::string_view name);
 
 }  // namespace transport

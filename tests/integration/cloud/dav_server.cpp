@@ -15,6 +15,8 @@
 
 #include <vector>
 
+#include "http.h"
+
 using namespace harness;
 
 namespace {
@@ -48,50 +50,50 @@ bool answers(int port) {
   return connected;
 }
 
-std::string apache_config(const std::string &dir, int port) {
-  std::string text;
-  for (const char *module : {"mpm_event", "authn_core", "authn_file", "authz_core", "authz_user",
-                             "auth_basic", "alias", "dav", "dav_fs"}) {
-    text += std::string("LoadModule ") + module + "_module /usr/lib/apache2/modules/mod_" + module +
-            ".so\n";
-  }
-  return text + "ServerRoot " + dir + "\nServerName localhost\nPidFile " + dir +
-         "/httpd.pid\nDefaultRuntimeDir " + dir + "\nMutex file:" + dir + " default\nErrorLog " +
-         dir + "/locks/error.log\nListen 127.0.0.1:" + std::to_string(port) +
-         "\nUser nobody\nGroup nogroup\nStartServers 1\nThreadsPerChild 25\n"
-         "MinSpareThreads 25\nMaxSpareThreads 75\nMaxRequestWorkers 100\nDavLockDB " +
-         dir + "/locks/db\nDocumentRoot " + dir + "/htdocs\nAlias /dav " + dir +
-         "/disk\n<Directory " + dir +
-         "/disk>\nDav On\nAuthType Basic\nAuthName cloud\nAuthBasicProvider file\nAuthUserFile " +
-         dir + "/htpasswd\nRequire valid-user\n</Directory>\n";
+std::string replaced(std::string text, const std::string &what, const std::string &by) {
+  for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + by.size()))
+    text.replace(at, what.size(), by);
+  return text;
 }
 
-std::string lighttpd_config(const std::string &dir, int port) {
-  return "server.modules = (\"mod_alias\",\"mod_auth\",\"mod_authn_file\",\"mod_webdav\")\n"
-         "server.bind = \"127.0.0.1\"\nserver.port = " +
-         std::to_string(port) + "\nserver.username = \"nobody\"\nserver.groupname = \"nogroup\"\n" +
-         "server.document-root = \"" + dir + "/htdocs\"\nserver.errorlog = \"" + dir +
-         "/locks/error.log\"\nserver.upload-dirs = (\"" + dir +
-         "/disk\")\nmimetype.assign = (\"\" => \"application/octet-stream\")\n"
-         "alias.url = (\"/dav\" => \"" +
-         dir +
-         "/disk\")\nauth.backend = \"htpasswd\"\n"
-         "auth.backend.htpasswd.userfile = \"" +
-         dir +
-         "/htpasswd\"\n"
-         "auth.require = (\"/dav\" => (\"method\"=>\"basic\",\"realm\"=>\"cloud\","
-         "\"require\"=>\"valid-user\"))\n"
-         "$HTTP[\"url\"] =~ \"^/dav($|/)\" {\n  webdav.activate = \"enable\"\n"
-         "  webdav.is-readonly = \"disable\"\n  webdav.sqlite-db-name = \"" +
-         dir + "/locks/db\"\n}\n";
+using Words = std::vector<std::string>;
+
+std::string loopback_name(int port) { return "127.0.0.1:" + std::to_string(port); }
+
+// The command line, given that the file of the kind's name lies filled in at @p config.
+Words command(const std::string &kind, const std::string &config, const std::string &dir, int port,
+              int control_port) {
+  if (kind == "apache") return {"/usr/sbin/apache2", "-f", config, "-DFOREGROUND"};
+  if (kind == "nginx") return {"/usr/sbin/nginx", "-c", config, "-e", dir + "/state/error.log"};
+  if (kind == "lighttpd") return {"/usr/sbin/lighttpd", "-D", "-f", config};
+  return {"/usr/bin/rclone",
+          "serve",
+          "webdav",
+          dir + "/disk",
+          "--addr",
+          loopback_name(port),
+          "--baseurl",
+          "/dav",
+          "--htpasswd",
+          dir + "/htpasswd",
+          "--config",
+          "/dev/null",
+          "--cache-dir",
+          dir + "/state/cache",
+          "--log-file",
+          dir + "/state/error.log",
+          "--rc",
+          "--rc-no-auth",
+          "--rc-addr",
+          loopback_name(control_port)};
 }
 
 }  // namespace
 
-DavServer::DavServer(const std::string &kind) {
+DavServer::DavServer(const std::string &kind, const Words &defines) : kind_(kind) {
   const passwd *nobody = getpwnam("nobody");
   chmod(base_.path().c_str(), 0755);
-  for (const char *name : {"disk", "htdocs", "locks"}) {
+  for (const char *name : {"disk", "htdocs", "state"}) {
     const std::string path = base_ / name;
     EXPECT_EQ(mkdir(path.c_str(), 0755), 0);
     if (std::string(name) == "disk") {
@@ -101,8 +103,11 @@ DavServer::DavServer(const std::string &kind) {
   }
   accept_password("right");
   port_ = free_port();
-  start(kind);
-  EXPECT_TRUE(run_until([this] { return answers(port_); })) << read_file(base_ / "locks/error.log");
+  tls_port_ = free_port();
+  start(defines);
+  EXPECT_TRUE(run_until([this] {
+    return answers(port_) && (kind_ != "rclone" || answers(tls_port_));
+  })) << read_file(base_ / "state/error.log");
 }
 
 DavServer::~DavServer() {
@@ -114,19 +119,27 @@ DavServer::~DavServer() {
   umount2(root().c_str(), MNT_DETACH);
 }
 
-void DavServer::start(const std::string &kind) {
+void DavServer::start(const Words &defines) {
   const std::string config = base_ / "server.conf";
-  const bool apache = kind == "apache";
-  write_file(config,
-             apache ? apache_config(base_.path(), port_) : lighttpd_config(base_.path(), port_));
+  if (kind_ != "rclone") {
+    std::string text = read_file(std::string(CLOUD_CONFIG_DIR) + "/" + kind_ + ".conf");
+    text = replaced(text, "@DIR@", base_.path());
+    text = replaced(text, "@PORT@", std::to_string(port_));
+    write_file(config, replaced(text, "@TLS_PORT@", std::to_string(tls_port_)), 0644);
+  }
+  Words words = command(kind_, config, base_.path(), port_, tls_port_);
+  for (const std::string &define : defines) words.push_back("-D" + define);
+  std::vector<char *> argv;
+  for (std::string &word : words) argv.push_back(word.data());
+  argv.push_back(nullptr);
+  const passwd *nobody = getpwnam("nobody");
   pid_ = fork();
   if (pid_ != 0) return;
   setpgid(0, 0);
   prctl(PR_SET_PDEATHSIG, SIGKILL);
-  if (apache)
-    execl("/usr/sbin/apache2", "apache2", "-f", config.c_str(), "-DFOREGROUND", nullptr);
-  else
-    execl("/usr/sbin/lighttpd", "lighttpd", "-D", "-f", config.c_str(), nullptr);
+  // The others become nobody themselves.
+  if (kind_ == "rclone" && (setgid(nobody->pw_gid) != 0 || setuid(nobody->pw_uid) != 0)) _exit(126);
+  execv(argv[0], argv.data());
   _exit(127);
 }
 
@@ -147,3 +160,12 @@ void DavServer::accept_password(const std::string &password) {
 void DavServer::freeze() const { EXPECT_EQ(kill(-pid_, SIGSTOP), 0); }
 
 void DavServer::thaw() const { EXPECT_EQ(kill(-pid_, SIGCONT), 0); }
+
+void DavServer::changed_behind_its_back() const {
+  if (kind_ != "rclone") return;
+  transport::Ticket ticket;
+  transport::HttpRequest request;
+  request.method = "POST";
+  request.url = "http://" + loopback_name(tls_port_) + "/vfs/forget";
+  EXPECT_TRUE(transport::http_perform(ticket, request).good());
+}

@@ -9,14 +9,18 @@
 
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "harness.h"
 
 /** A WebDAV server with its files on a small file system of its own. */
 class DavServer {
  public:
-  /** @param kind "apache" or "lighttpd" */
-  explicit DavServer(const std::string &kind);
+  /**
+   * @param kind "apache", "nginx", "lighttpd" or "rclone"
+   * @param defines switches of apache's configuration file
+   */
+  explicit DavServer(const std::string &kind, const std::vector<std::string> &defines = {});
   DavServer(const DavServer &) = delete;
   DavServer &operator=(const DavServer &) = delete;
   ~DavServer();
@@ -29,12 +33,16 @@ class DavServer {
   /** Stop the server in its tracks, and let it go on. */
   void freeze() const;
   void thaw() const;
+  /** Some remember what lies in a folder. */
+  void changed_behind_its_back() const;
 
  private:
-  void start(const std::string &kind);
+  void start(const std::vector<std::string> &defines);
 
+  const std::string kind_;
   harness::TempDir base_;
   int port_ = 0;
+  int tls_port_ = 0;  // rclone: of its remote control
   pid_t pid_ = -1;
 };
 

@@ -48,6 +48,8 @@ TEST(RemotePath, TemporaryNamesAreFreshAndNoObjects) {
   EXPECT_FALSE(is_object_path(("/a/" + name).c_str()));
   EXPECT_FALSE(is_object_path(("/" + name + "/a").c_str()));
   EXPECT_FALSE(is_temporary_name(name + "0"));
+  EXPECT_TRUE(is_temporary_name(name + ".0000000020"));
+  EXPECT_FALSE(is_object_path(("/a/" + name + ".0000000020").c_str()));
   EXPECT_FALSE(is_temporary_name(name.substr(1)));
   EXPECT_FALSE(is_temporary_name(name.substr(0, name.size() - 1) + "G"));
   EXPECT_FALSE(is_temporary_name(""));

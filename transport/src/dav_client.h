@@ -1,0 +1,103 @@
+/**
+ * @file dav_client.h
+ * @brief The requests that a WebDAV store is made of.
+ *
+ * Paths are those of the store ("/a/b"); "" is its root. Any thread.
+ */
+#ifndef BACKUP_TRANSPORT_DAV_CLIENT_H
+#define BACKUP_TRANSPORT_DAV_CLIENT_H
+
+#include <string>
+#include <vector>
+
+#include "backend_webdav.h"
+#include "config.h"
+#include "http_store.h"
+#include "outcome.h"
+#include "ticket.h"
+
+namespace transport {
+
+constexpr int kHttpCreated = 201;
+constexpr int kHttpMultiStatus = 207;
+constexpr int kHttpLocked = 423;
+constexpr int kHttpServerError = 500;
+
+/** Seconds that a request may take that clears up behind another one. */
+constexpr long kTidyUpSeconds = 5;
+
+/**
+ * How a component of a path is named on the server. Some servers never list names
+ * that begin with a dot, so a dot in front becomes "%2E", and a percent sign "%25".
+ */
+std::string stored_name(const std::string &name);
+/** The inverse of stored_name(); other names are what they are. */
+std::string name_of_stored(const std::string &stored);
+/** stored_name() of every component. */
+std::string stored_path(const std::string &path);
+
+/** Did the server answer, and with that status? */
+bool has_status(const HttpAnswer &answer, int status);
+
+/** outcome_of(); somebody else's lock goes away by itself. */
+Outcome dav_outcome(const HttpAnswer &answer, const char *what);
+
+/** What lies in a folder. */
+struct DavListing {
+  std::vector<DavEntry> children; /**< with their paths in the store */
+  bool has_temporary = false;     /**< something that is not an object yet is being sent */
+};
+
+class DavClient {
+ public:
+  DavClient(const StoreUrl &url, const Config &config)
+      : url_(url), user_(config.user), password_(config.password), ca_file_(config.ca_file) {}
+
+  std::string url_of(const std::string &path) const;
+  /** A request for an object; for a folder @p path ends with a slash. */
+  HttpRequest request_for(const char *method, const std::string &path) const;
+  HttpAnswer send(Ticket &ticket, const char *method, const std::string &path) const;
+
+  /**
+   * The children of a folder. What was left lying there by uploads that ended more
+   * than a day ago is deleted on the way, and never listed.
+   * @return #BACKUP_TRANS_ERROR_NO_SUCH_OBJECT when there is no such folder
+   */
+  Outcome list(Ticket &ticket, const std::string &folder, DavListing *listing) const;
+
+  /** Is there a folder of that name? Also false when that is not known. */
+  bool is_folder(Ticket &ticket, const std::string &folder) const;
+
+  /**
+   * Lock a folder with everything in it.
+   * @param token receives the lock's name; stays empty on a server without locks
+   */
+  Outcome lock(Ticket &ticket, const std::string &folder, std::string *token) const;
+  /** Also after a cancellation: others would wait until the lock ends by itself. */
+  void unlock(const std::string &folder, const std::string &token) const;
+  /** The header that proves a lock. */
+  std::string lock_condition(const std::string &folder, const std::string &token) const;
+  /** The header that demands that an object is still the one with that tag. */
+  std::string tag_condition(const std::string &path, const std::string &tag) const;
+
+  /** Delete everything in @p folder whose name begins with @p temporary. */
+  void delete_pieces(Ticket &ticket, const std::string &folder, const std::string &temporary) const;
+
+  /** Does the answer send whoever asked for a folder as for an object to its name with a slash? */
+  bool means_folder(const HttpAnswer &answer, const std::string &path) const;
+
+ private:
+  HttpAnswer propfind(Ticket &ticket, const std::string &folder, const char *depth) const;
+  bool is_object(Ticket &ticket, std::string path) const;
+  bool read_listing(const HttpAnswer &answer, const std::string &folder, DavListing *listing,
+                    std::vector<DavEntry> *temporary, bool *is_folder) const;
+
+  const StoreUrl url_;
+  const std::string user_;
+  const std::string password_;
+  const std::string ca_file_;
+};
+
+}  // namespace transport
+
+#endif
