@@ -65,12 +65,22 @@ bool find(void *library, const char *name, Function *function) {
   return *function != nullptr;
 }
 
+// The TLS library would otherwise take itself down when the process exits, under a thread that is
+// only just setting it up.
+void keep_tls_until_the_end(void *library) {
+  constexpr uint64_t kNoExitHandler = 0x00080000;  // OPENSSL_INIT_NO_ATEXIT of <openssl/crypto.h>
+  int (*init)(uint64_t, const void *) = nullptr;
+  if (find(library, "OPENSSL_init_crypto", &init)) init(kNoExitHandler, nullptr);
+}
+
 bool load(Curl *curl) {
   void *library = nullptr;
   for (const char *name : kLibraries) {
     if (library == nullptr) library = dlopen(name, RTLD_NOW | RTLD_LOCAL);
   }
-  return library != nullptr && find(library, "curl_global_init", &curl->global_init) &&
+  if (library == nullptr) return false;
+  keep_tls_until_the_end(library);
+  return find(library, "curl_global_init", &curl->global_init) &&
          find(library, "curl_easy_init", &curl->easy_init) &&
          find(library, "curl_easy_setopt", &curl->easy_setopt) &&
          find(library, "curl_easy_getinfo", &curl->easy_getinfo) &&
