@@ -101,7 +101,7 @@ class WebdavBackend : public Backend {
       uploaded->complete = true;
     }
     const Outcome result = upload.basis == nullptr
-                               ? move(attempt.ticket, upload, uploaded.get(), {})
+                               ? move_plainly(attempt.ticket, upload, uploaded.get())
                                : move_locked(attempt.ticket, upload, uploaded.get());
     if (!result.ok()) return result;
     uploaded->settle();
@@ -241,12 +241,40 @@ class WebdavBackend : public Backend {
     const HttpAnswer answer = http_perform(ticket, request);
     if (answer.good() && answer.status != kHttpMultiStatus) return success();
     if (is_absent(answer) || has_status(answer, kHttpConflict)) {
+      if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
       // The folder was deleted, and what had been sent with it.
       forget("");
       uploaded->settle();
       return again("upload: the folder was deleted meanwhile");
     }
     return dav_outcome(answer, "upload");
+  }
+
+  // To most servers a folder in the object's place is a thing that may be replaced with everything
+  // in it, and some put the object into it.
+  Outcome move_plainly(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+    Conditions conditions;
+    conditions.overwrite = false;
+    Outcome result = move(ticket, upload, uploaded, conditions);
+    if (result.code == BACKUP_TRANS_ERROR_CONFLICT) {
+      uploaded->move_asked = false;
+      if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+      conditions.overwrite = true;
+      return move(ticket, upload, uploaded, conditions);
+    }
+    // What lies alone in a new folder came to lie where it should.
+    const std::string &made = uploaded->made_folder;
+    if (!result.ok() || (!made.empty() && made == parent_of(upload.path))) return result;
+    const HttpAnswer moved = client_.send(ticket, "HEAD", upload.path);
+    if (moved.good() && has_size(moved, upload.source.size())) return result;
+    if (!moved.complete()) return moved.problem;
+    if (!client_.is_folder(ticket, upload.path)) return of_upload(dav_outcome(moved, "upload"));
+    client_.delete_pieces(ticket, upload.path, upload.path + "/" + name_of(uploaded->temporary));
+    return folder_in_its_place();
+  }
+
+  static Outcome folder_in_its_place() {
+    return failure(BACKUP_TRANS_ERROR_SERVER, "upload: there is a folder in its place");
   }
 
   Outcome find_moved(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {

@@ -164,7 +164,7 @@ Outcome DavClient::lock(Ticket &ticket, const std::string &folder, std::string *
   HttpRequest request = request_for("LOCK", folder + "/");
   request.has_body = true;
   request.body = kLockInfo;
-  request.headers = {kXmlType, "Depth: infinity", "Timeout: Second-60"};
+  request.headers = {kXmlType, "Depth: infinity", "Timeout: Second-30"};
   const HttpAnswer answer = http_perform(ticket, request);
   if (has_status(answer, kHttpMethodNotAllowed) || has_status(answer, kHttpNotImplemented))
     return success();

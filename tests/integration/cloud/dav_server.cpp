@@ -90,7 +90,8 @@ Words command(const std::string &kind, const std::string &config, const std::str
 
 }  // namespace
 
-DavServer::DavServer(const std::string &kind, const Words &defines) : kind_(kind) {
+DavServer::DavServer(const std::string &kind, const Words &defines, const Certify &certify)
+    : kind_(kind) {
   const passwd *nobody = getpwnam("nobody");
   chmod(base_.path().c_str(), 0755);
   for (const char *name : {"disk", "htdocs", "state"}) {
@@ -104,6 +105,7 @@ DavServer::DavServer(const std::string &kind, const Words &defines) : kind_(kind
   accept_password("right");
   port_ = free_port();
   tls_port_ = free_port();
+  if (certify) certify(base_.path());
   start(defines);
   EXPECT_TRUE(run_until([this] {
     return answers(port_) && (kind_ != "rclone" || answers(tls_port_));

@@ -7,6 +7,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -16,16 +17,24 @@
 /** A WebDAV server with its files on a small file system of its own. */
 class DavServer {
  public:
+  /** Puts cert.pem and key.pem into a folder. */
+  using Certify = std::function<void(const std::string &dir)>;
+
   /**
    * @param kind "apache", "nginx", "lighttpd" or "rclone"
    * @param defines switches of apache's configuration file
+   * @param certify for the switch TLS
    */
-  explicit DavServer(const std::string &kind, const std::vector<std::string> &defines = {});
+  explicit DavServer(const std::string &kind, const std::vector<std::string> &defines = {},
+                     const Certify &certify = nullptr);
   DavServer(const DavServer &) = delete;
   DavServer &operator=(const DavServer &) = delete;
   ~DavServer();
 
   int port() const { return port_; }
+  int tls_port() const { return tls_port_; }
+  /** Where the server keeps its logs. */
+  std::string state() const { return base_ / "state"; }
   /** Where the files of /dav/ lie. */
   std::string root() const { return base_ / "disk"; }
   /** From now on only this password is accepted. */
