@@ -14,6 +14,7 @@
 #include <cstring>
 #include <memory>
 
+#include "json_read.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/handles.h"
@@ -21,34 +22,29 @@
 #include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
+#include "text.h"
+
+using quarn_client::display_width;
+using quarn_client::json_add;
+using quarn_client::json_text;
+using quarn_client::printable;
+using quarn_client::size_text;
 
 namespace {
 
 constexpr char kTpkRules[] = "res/backup.path.xml";
 constexpr char kOtherRules[] = "res/wgt/res/backup.path.xml";
 constexpr const char *kDataDirs[] = {"data", "shared/data", "shared/trusted"};
+constexpr char kCheckVerb[] = "rules check";
+constexpr char kExplainVerb[] = "rules explain";
 constexpr std::size_t kLargestShown = 10;
+constexpr std::size_t kMaxPathColumns = 60;
+constexpr std::size_t kSizeColumns = 11;
 constexpr int kUsageError = 64;
 
 using XmlText = std::unique_ptr<xmlChar, void (*)(xmlChar *)>;
 
 void free_xml_text(xmlChar *text) { xmlFree(text); }
-
-std::string cleaned(const std::string &text) {
-  // File names are data: their control characters must not reach the terminal.
-  std::string result;
-  for (const char c : text) {
-    const auto byte = static_cast<unsigned char>(c);
-    if (byte < 0x20 || byte == 0x7f) {
-      char escape[8];
-      std::snprintf(escape, sizeof escape, "\\x%02x", byte);
-      result += escape;
-    } else {
-      result += c;
-    }
-  }
-  return result;
-}
 
 bool begins_with(const std::string &text, const std::string &start) {
   return text.compare(0, start.size(), start) == 0;
@@ -58,22 +54,35 @@ std::string joined(const std::string &root, const std::string &value) {
   return begins_with(value, "/") ? root + value : root + "/" + value;
 }
 
+bool exists(const std::string &path) {
+  struct stat status {};
+  return safe_lstat(path.c_str(), &status) == 0;
+}
+
+/** Why the daemon gets no document out of a file that is there. */
+rule_problem unusable_file(const rules_report &report, const std::string &path) {
+  struct stat status {};
+  if (!file_exist(path.c_str())) {
+    return {"unreadable", 0, report.file, "the rules file is no regular file: it is ignored"};
+  }
+  if (!safe_open(path.c_str(), O_RDONLY)) {
+    return {"unreadable", 0, report.file, "the rules file cannot be read: it is ignored"};
+  }
+  if (safe_lstat(path.c_str(), &status) == 0 &&
+      static_cast<std::size_t>(status.st_size) > kMaxRulesSize) {
+    return {"too-large", 0, report.file,
+            "larger than " + std::to_string(kMaxRulesSize) + " bytes: the file is ignored"};
+  }
+  return {"malformed", 0, report.file, "not readable as XML: the file is ignored"};
+}
+
 // The daemon's loader keeps what exists; a report also needs what it dropped, and line numbers.
 void read_elements(rules_report *report) {
   const std::string path = report->root + "/" + report->file;
   const RulesDoc document = load_rules(path.c_str());
   if (!document) {
     report->ignored = true;
-    struct stat status {};
-    if (safe_lstat(path.c_str(), &status) == 0 &&
-        static_cast<std::size_t>(status.st_size) > kMaxRulesSize) {
-      report->problems.push_back(
-          {"too-large", 0, report->file,
-           "larger than " + std::to_string(kMaxRulesSize) + " bytes: the file is ignored"});
-      return;
-    }
-    report->problems.push_back(
-        {"malformed", 0, report->file, "not readable as XML: the file is ignored"});
+    report->problems.push_back(unusable_file(*report, path));
     return;
   }
   xmlNode *root = xmlDocGetRootElement(document.get());
@@ -110,51 +119,81 @@ void read_elements(rules_report *report) {
 }
 
 // Which element decided: the first one of the daemon's order that covers the path.
-int deciding_element(const rules_report &report, const std::string &path, bool in) {
-  for (std::size_t i = 0; i < report.elements.size(); ++i) {
-    const rule_element &element = report.elements[i];
-    if (!element.has_path || element.include != in) continue;
-    if (element.path == path || is_child_file(element.path.c_str(), path.c_str())) {
-      return static_cast<int>(i);
-    }
+int deciding_element(rules_report *report, const std::string &path, bool in) {
+  int deciding = -1;
+  for (std::size_t i = 0; i < report->elements.size(); ++i) {
+    rule_element &element = report->elements[i];
+    if (!element.has_path) continue;
+    if (element.path != path && !is_child_file(element.path.c_str(), path.c_str())) continue;
+    ++element.matches;
+    if (in) ++element.kept;
+    if (deciding < 0 && element.include == in) deciding = static_cast<int>(i);
   }
-  return -1;
+  return deciding;
 }
 
-void walk(rules_report *report, const std::string &folder) {
-  const WorkingFiles working(report->package, report->root);
-  const DirPtr dir = safe_opendir(folder.c_str());
-  if (!dir) {
-    report->problems.push_back({"unreadable", 0, folder.substr(report->root.size() + 1),
-                                "the directory cannot be read: the application would be skipped"});
+std::string relative_to(const rules_report &report, const std::string &path) {
+  return path.substr(report.root.size() + 1);
+}
+
+void note_unreadable(rules_report *report, const std::string &path) {
+  report->problems.push_back({"unreadable", 0, relative_to(*report, path),
+                              "the directory cannot be read: the application would be skipped"});
+}
+
+void note_entry(rules_report *report, const std::string &path, const struct stat &status) {
+  rule_entry entry;
+  entry.path = relative_to(*report, path);
+  if (!S_ISREG(status.st_mode) && !S_ISLNK(status.st_mode)) {
+    report->problems.push_back({"special-file", 0, entry.path,
+                                "neither file, directory nor link: its application's backup "
+                                "fails"});
     return;
   }
+  entry.link = S_ISLNK(status.st_mode);
+  entry.size = static_cast<std::uint64_t>(status.st_size);
+  entry.in = is_backup_file(path.c_str());
+  entry.element = deciding_element(report, path, entry.in);
+  report->entries.push_back(entry);
+}
+
+/** As the daemon walks, and no deeper: beyond it an application is skipped. */
+void walk(rules_report *report, const DirPtr &dir, std::string *path, int depth) {
+  const WorkingFiles working(report->package, report->root);
   std::vector<std::string> names;
-  while (const dirent *entry = readdir(dir.get())) names.emplace_back(entry->d_name);
+  while (const dirent *entry = readdir(dir.get())) {
+    if (!is_dot_entry(entry->d_name)) names.emplace_back(entry->d_name);
+  }
   std::sort(names.begin(), names.end());
   for (const std::string &name : names) {
-    if (name == "." || name == "..") continue;
-    const std::string path = folder + "/" + name;
+    const PathStep step(path, name.c_str());
     struct stat status {};
-    if (working.contain(path) || safe_lstat(path.c_str(), &status) != 0) continue;
-    if (S_ISDIR(status.st_mode)) {
-      walk(report, path);
+    if (working.contain(*path) ||
+        fstatat(dirfd(dir.get()), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
       continue;
     }
-    rule_entry entry;
-    entry.path = path.substr(report->root.size() + 1);
-    if (!S_ISREG(status.st_mode) && !S_ISLNK(status.st_mode)) {
-      report->problems.push_back({"special-file", 0, entry.path,
-                                  "neither file, directory nor link: its application's backup "
-                                  "fails"});
+    if (!S_ISDIR(status.st_mode)) {
+      note_entry(report, *path, status);
       continue;
     }
-    entry.link = S_ISLNK(status.st_mode);
-    entry.size = static_cast<std::uint64_t>(status.st_size);
-    entry.in = is_backup_file(path.c_str());
-    entry.element = deciding_element(*report, path, entry.in);
-    if (entry.element >= 0) ++report->elements[entry.element].matches;
-    report->entries.push_back(entry);
+    DirPtr child;
+    if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), name.c_str());
+    if (child) {
+      walk(report, child, path, depth + 1);
+    } else {
+      note_unreadable(report, *path);
+    }
+  }
+}
+
+void walk_data(rules_report *report, const char *name, bool installed) {
+  std::string path = report->root + "/" + name;
+  const DirPtr dir = safe_opendir(path.c_str());
+  if (dir) {
+    walk(report, dir, &path, 1);
+  } else if (installed || exists(path)) {
+    // A source need not bring all three: the installation makes them.
+    note_unreadable(report, path);
   }
 }
 
@@ -177,30 +216,28 @@ void find_mistakes(rules_report *report) {
     } else if (element.matches == 0) {
       report->problems.push_back({"matches-nothing", element.line, element.given,
                                   name + " \"" + element.given + "\" matches nothing"});
+    } else if (element.include && element.kept == 0) {
+      report->problems.push_back(
+          {"all-excluded", element.line, element.given,
+           name + " \"" + element.given + "\" has no effect: all that it covers is excluded"});
     }
   }
-}
-
-std::string human(std::uint64_t bytes) {
-  char text[32];
-  if (bytes < 1000) {
-    std::snprintf(text, sizeof text, "%llu B", static_cast<unsigned long long>(bytes));
-  } else if (bytes < 1000 * 1000) {
-    std::snprintf(text, sizeof text, "%.1f kB", static_cast<double>(bytes) / 1e3);
-  } else {
-    std::snprintf(text, sizeof text, "%.1f MB", static_cast<double>(bytes) / 1e6);
-  }
-  return text;
 }
 
 std::string why(const rules_report &report, const rule_entry &entry) {
   if (entry.element >= 0) {
     const rule_element &element = report.elements[entry.element];
-    return std::string(element.include ? "include" : "exclude") + " \"" + cleaned(element.given) +
+    return std::string(element.include ? "include" : "exclude") + " \"" + printable(element.given) +
            "\", line " + std::to_string(element.line);
   }
+  if (report.ignored) return "the rules file is ignored";
   if (entry.in) return report.file.empty() ? "no rules file" : "no rule speaks of it";
   return "no include covers it";
+}
+
+std::string size_column(const rule_entry &entry) {
+  const std::string size = size_text(entry.size);
+  return std::string(kSizeColumns - std::min(size.size(), kSizeColumns), ' ') + size;
 }
 
 std::vector<rule_entry> largest(const rules_report &report) {
@@ -213,45 +250,59 @@ std::vector<rule_entry> largest(const rules_report &report) {
   return entries;
 }
 
-void put(json_object *object, const char *key, const std::string &text) {
-  json_object_object_add(object, key,
-                         json_object_new_string_len(text.data(), static_cast<int>(text.size())));
-}
-
 void put(json_object *object, const char *key, std::uint64_t number) {
   json_object_object_add(object, key, json_object_new_uint64(number));
 }
 
-json_object *entry_json(const rules_report &report, const rule_entry &entry) {
-  json_object *object = json_object_new_object();
-  put(object, "path", entry.path);
-  put(object, "type", std::string(entry.link ? "link" : "file"));
+void add_entry(json_object *object, const rules_report &report, const rule_entry &entry) {
+  json_add(object, "path", entry.path);
+  json_add(object, "type", entry.link ? "link" : "file");
   put(object, "size", entry.size);
   json_object_object_add(object, "in", json_object_new_boolean(entry.in ? 1 : 0));
   json_object *rule = nullptr;
   if (entry.element >= 0) {
     const rule_element &element = report.elements[entry.element];
     rule = json_object_new_object();
-    put(rule, "kind", std::string(element.include ? "include" : "exclude"));
-    put(rule, "path", element.given);
+    json_add(rule, "kind", element.include ? "include" : "exclude");
+    json_add(rule, "path", element.given);
     put(rule, "line", static_cast<std::uint64_t>(element.line));
   }
   json_object_object_add(object, "rule", rule);
+}
+
+json_object *entry_json(const rules_report &report, const rule_entry &entry) {
+  json_object *object = json_object_new_object();
+  add_entry(object, report, entry);
   return object;
 }
 
-std::string line_of(json_object *object) {
-  return std::string(json_object_to_json_string_ext(object, JSON_C_TO_STRING_PLAIN)) + "\n";
+/** What an exit code of a finished check says. */
+const char *exit_text(int code) {
+  switch (code) {
+    case RULES_PROBLEMS:
+      return "mistakes were found";
+    case RULES_OVER_CAP:
+      return "over the size limit";
+    case RULES_UNUSABLE:
+      return "the rules file is ignored";
+    default:
+      return "success";
+  }
 }
 
-int fail(bool json, int code, const std::string &text) {
+/** The members with which every verb's object ends; the object's line. */
+std::string finished(json_object *object, int code, const std::string &message) {
+  put(object, "exit", static_cast<std::uint64_t>(code));
+  json_add(object, "message", message);
+  return json_text(object) + "\n";
+}
+
+int fail(const char *verb, bool json, int code, const std::string &text) {
+  std::fprintf(stderr, "quarnctl: %s\n", printable(text).c_str());
   if (json) {
     const JsonPtr object(json_object_new_object());
-    put(object.get(), "error", text);
-    put(object.get(), "exit", static_cast<std::uint64_t>(code));
-    std::fputs(line_of(object.get()).c_str(), stdout);
-  } else {
-    std::fprintf(stderr, "quarnctl: %s\n", cleaned(text).c_str());
+    json_add(object.get(), "verb", verb);
+    std::fputs(finished(object.get(), code, text).c_str(), stdout);
   }
   return code;
 }
@@ -260,6 +311,7 @@ struct package_place {
   std::string id;
   std::string type;
   std::string root;
+  bool installed;
 };
 
 // A source directory has a package.ini; anything else is the id of an installed package.
@@ -279,7 +331,7 @@ bool find_package(const std::string &name, package_place *place, std::string *pr
       *problem = ini + ": no package id";
       return false;
     }
-    *place = {id.get(), type ? type.get() : "tpk", root.get()};
+    *place = {id.get(), type ? type.get() : "tpk", root.get(), false};
     return true;
   }
   package_info_h info = nullptr;
@@ -297,33 +349,29 @@ bool find_package(const std::string &name, package_place *place, std::string *pr
     *problem = "the package manager does not know where \"" + name + "\" lies";
     return false;
   }
-  *place = {name, type.get(), root.get()};
+  *place = {name, type.get(), root.get(), true};
   return true;
 }
 
 }  // namespace
 
 rules_report check_rules(const std::string &package_id, const std::string &type,
-                         const std::string &root) {
+                         const std::string &root, bool installed) {
   rules_report report;
   report.package = package_id;
   report.root = root;
   report.cap = kMaxBackupSize;
   const std::string file = type == "tpk" ? kTpkRules : kOtherRules;
   const std::string other = type == "tpk" ? kOtherRules : kTpkRules;
-  if (file_exist((root + "/" + file).c_str())) {
+  if (exists(root + "/" + file)) {
     report.file = file;
     read_elements(&report);
-  } else if (file_exist((root + "/" + other).c_str())) {
+  } else if (exists(root + "/" + other)) {
     report.problems.push_back(
         {"wrong-place", 0, other, "a package of type \"" + type + "\" keeps its rules in " + file});
   }
   parse_backup_path_xml(package_id.c_str(), type.c_str(), root.c_str());
-  for (const char *name : kDataDirs) {
-    const std::string folder = root + "/" + name;
-    // A source need not bring all three: the installation makes them.
-    if (is_directory(folder.c_str())) walk(&report, folder);
-  }
+  for (const char *name : kDataDirs) walk_data(&report, name, installed);
   for (const rule_entry &entry : report.entries) report.total += entry.in ? entry.size : 0;
   find_mistakes(&report);
   reset_backup_path_info();
@@ -342,34 +390,32 @@ std::string rules_text(const rules_report &report) {
                               : "rules in " + report.file + "\n";
   std::size_t width = 0;
   for (const rule_entry &entry : report.entries) {
-    width = std::max(width, std::min<std::size_t>(cleaned(entry.path).size(), 60));
+    width = std::max(width, std::min(display_width(printable(entry.path)), kMaxPathColumns));
   }
   for (const rule_entry &entry : report.entries) {
-    std::string path = cleaned(entry.path);
-    if (path.size() < width) path.append(width - path.size(), ' ');
-    char size[16];
-    std::snprintf(size, sizeof size, "%10s", human(entry.size).c_str());
-    text += std::string(entry.in ? "  in   " : "  out  ") + path + size + "  " +
+    const std::string path = printable(entry.path);
+    const std::size_t columns = display_width(path);
+    text += std::string(entry.in ? "  in   " : "  out  ") + path +
+            std::string(columns < width ? width - columns : 0, ' ') + size_column(entry) + "  " +
             why(report, entry) + "\n";
   }
   const auto taken = std::count_if(report.entries.begin(), report.entries.end(),
                                    [](const rule_entry &entry) { return entry.in; });
   text += std::to_string(taken) + " of " + std::to_string(report.entries.size()) + " in, " +
-          human(report.total) + " of at most " + human(report.cap) + "\n";
+          std::to_string(report.total) + " bytes (" + size_text(report.total) + ") of at most " +
+          std::to_string(report.cap) + " (" + size_text(report.cap) + ")\n";
   if (report.total > report.cap) {
     text += "over the limit: the application would be skipped; its largest files:\n";
     for (const rule_entry &entry : largest(report)) {
-      char size[16];
-      std::snprintf(size, sizeof size, "%10s", human(entry.size).c_str());
-      text += std::string("  ") + size + "  " + cleaned(entry.path) + "\n";
+      text += " " + size_column(entry) + "  " + printable(entry.path) + "\n";
     }
   }
   for (const rule_problem &problem : report.problems) {
     text += "warning: ";
     if (problem.line > 0) text += "line " + std::to_string(problem.line) + ": ";
-    text += cleaned(problem.text);
+    text += printable(problem.text);
     if (problem.line == 0 && !problem.path.empty() && problem.path != report.file) {
-      text += ": " + cleaned(problem.path);
+      text += ": " + printable(problem.path);
     }
     text += "\n";
   }
@@ -378,8 +424,9 @@ std::string rules_text(const rules_report &report) {
 
 std::string rules_json(const rules_report &report) {
   const JsonPtr object(json_object_new_object());
-  put(object.get(), "package", report.package);
-  put(object.get(), "rules", report.file);
+  json_add(object.get(), "verb", kCheckVerb);
+  json_add(object.get(), "package", report.package);
+  json_add(object.get(), "rules", report.file);
   json_object_object_add(object.get(), "ignored", json_object_new_boolean(report.ignored ? 1 : 0));
   put(object.get(), "total", report.total);
   put(object.get(), "cap", report.cap);
@@ -400,15 +447,15 @@ std::string rules_json(const rules_report &report) {
   json_object *problems = json_object_new_array();
   for (const rule_problem &problem : report.problems) {
     json_object *item = json_object_new_object();
-    put(item, "kind", problem.kind);
+    json_add(item, "kind", problem.kind);
     put(item, "line", static_cast<std::uint64_t>(problem.line));
-    put(item, "path", problem.path);
-    put(item, "text", problem.text);
+    json_add(item, "path", problem.path);
+    json_add(item, "text", problem.text);
     json_object_array_add(problems, item);
   }
   json_object_object_add(object.get(), "problems", problems);
-  put(object.get(), "exit", static_cast<std::uint64_t>(rules_exit_code(report)));
-  return line_of(object.get());
+  const int code = rules_exit_code(report);
+  return finished(object.get(), code, exit_text(code));
 }
 
 std::string explain_rules(const rules_report &report, const std::string &path, bool json,
@@ -424,10 +471,13 @@ std::string explain_rules(const rules_report &report, const std::string &path, b
   }
   *exit_code = RULES_OK;
   if (json) {
-    const JsonPtr object(entry_json(report, *found));
-    return line_of(object.get());
+    const JsonPtr object(json_object_new_object());
+    json_add(object.get(), "verb", kExplainVerb);
+    json_add(object.get(), "package", report.package);
+    add_entry(object.get(), report, *found);
+    return finished(object.get(), RULES_OK, exit_text(RULES_OK));
   }
-  return cleaned(found->path) + ": " + (found->in ? "in" : "out") + " (" + why(report, *found) +
+  return printable(found->path) + ": " + (found->in ? "in" : "out") + " (" + why(report, *found) +
          ")\n";
 }
 
@@ -435,13 +485,15 @@ int rules_command(const std::vector<std::string> &arguments, bool json) {
   const bool check = arguments.size() == 2 && arguments[0] == "check";
   const bool explain = arguments.size() == 3 && arguments[0] == "explain";
   if (!check && !explain) {
-    return fail(json, kUsageError,
+    return fail("rules", json, kUsageError,
                 "usage: quarnctl rules check SOURCE-or-PKGID | rules explain PKGID PATH");
   }
+  const char *const verb = check ? kCheckVerb : kExplainVerb;
   package_place place;
   std::string problem;
-  if (!find_package(arguments[1], &place, &problem)) return fail(json, RULES_NO_INPUT, problem);
-  const rules_report report = check_rules(place.id, place.type, place.root);
+  if (!find_package(arguments[1], &place, &problem))
+    return fail(verb, json, RULES_NO_INPUT, problem);
+  const rules_report report = check_rules(place.id, place.type, place.root, place.installed);
   if (check) {
     std::fputs((json ? rules_json(report) : rules_text(report)).c_str(), stdout);
     return rules_exit_code(report);
@@ -449,7 +501,7 @@ int rules_command(const std::vector<std::string> &arguments, bool json) {
   int code = RULES_OK;
   const std::string text = explain_rules(report, arguments[2], json, &code);
   if (code != RULES_OK) {
-    return fail(json, code,
+    return fail(verb, json, code,
                 "\"" + arguments[2] + "\" is no file or link in the application's data");
   }
   std::fputs(text.c_str(), stdout);

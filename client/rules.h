@@ -17,7 +17,7 @@ enum rules_exit : int {
   RULES_OK = 0,
   RULES_PROBLEMS = 1, /**< mistakes were found */
   RULES_OVER_CAP = 2, /**< the application would be skipped */
-  RULES_UNUSABLE = 3, /**< the file is ignored: malformed, or another root element */
+  RULES_UNUSABLE = 3, /**< the file is ignored: no file, malformed, or another root element */
   RULES_NO_INPUT = 66 /**< no such package or source */
 };
 
@@ -28,7 +28,8 @@ struct rule_element {
   std::string given; /**< the attribute as written */
   std::string path;  /**< the absolute path it names */
   int line = 0;      /**< in the rules file, from 1 */
-  int matches = 0;   /**< entries that it decided */
+  int matches = 0;   /**< entries that it covers, whatever decided about them */
+  int kept = 0;      /**< those of them that are in */
 };
 
 /** One file or link of the application. */
@@ -66,9 +67,10 @@ struct rules_report {
  * @param package_id  its id
  * @param type        package type, "tpk" or another
  * @param root        absolute package root, or the root of its source
+ * @param installed   a source need not bring all data directories, a package has them
  */
 rules_report check_rules(const std::string &package_id, const std::string &type,
-                         const std::string &root);
+                         const std::string &root, bool installed = false);
 
 /** The exit code that belongs to a report. */
 int rules_exit_code(const rules_report &report);

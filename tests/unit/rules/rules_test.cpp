@@ -10,7 +10,9 @@
 
 #include "mock_platform.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_file.h"
+#include "quarn_d_utils/safe_path.h"
 
 namespace {
 
@@ -91,6 +93,21 @@ TEST_F(Rules, WarnsOfElementsThatMatchNothing) {
   EXPECT_EQ(kinds(check()), (std::vector<std::string>{"nothing-there", "matches-nothing"}));
 }
 
+TEST_F(Rules, AnElementMatchesWhateverAnotherOneDecided) {
+  rules(
+      "<backup><exclude path=\"data/cache/\"/><exclude path=\"data/cache/tile\"/>"
+      "<include path=\"data/\"/><include path=\"data/keep.db\"/></backup>");
+  EXPECT_TRUE(check().problems.empty());
+}
+
+TEST_F(Rules, AnIncludeOfWhatIsAllExcludedIsNamed) {
+  rules("<backup><include path=\"data/cache/\"/><exclude path=\"data/cache/tile\"/></backup>");
+  const rules_report report = check();
+  EXPECT_EQ(kinds(report), std::vector<std::string>{"all-excluded"});
+  EXPECT_EQ(report.problems[0].text,
+            "include \"data/cache/\" has no effect: all that it covers is excluded");
+}
+
 TEST_F(Rules, AnIncludeThatDoesNotExistLeavesEverythingOut) {
   rules("<backup><include path=\"data/gone\"/></backup>");
   const rules_report report = check();
@@ -113,6 +130,59 @@ TEST_F(Rules, AMalformedFileIsUnusable) {
   EXPECT_EQ(rules_exit_code(check()), RULES_UNUSABLE);
 }
 
+TEST_F(Rules, WhyOfAFileWhoseRulesAreIgnoredSaysSo) {
+  rules("<backup><exclude");
+  EXPECT_NE(rules_text(check()).find("the rules file is ignored"), std::string::npos);
+  int code = -1;
+  EXPECT_EQ(explain_rules(check(), "data/keep.db", false, &code),
+            "data/keep.db: in (the rules file is ignored)\n");
+}
+
+TEST_F(Rules, ARulesFileThatIsNoFileIsUnusable) {
+  write("rules.xml", "<backup/>");
+  fs::create_symlink("../rules.xml", root_ + "/res/backup.path.xml");
+  const rules_report link = check();
+  EXPECT_TRUE(link.ignored);
+  EXPECT_EQ(link.file, "res/backup.path.xml");
+  EXPECT_EQ(kinds(link), std::vector<std::string>{"unreadable"});
+  EXPECT_EQ(link.problems[0].text, "the rules file is no regular file: it is ignored");
+  EXPECT_EQ(rules_exit_code(link), RULES_UNUSABLE);
+  fs::remove(root_ + "/res/backup.path.xml");
+  fs::create_directory(root_ + "/res/backup.path.xml");
+  EXPECT_EQ(rules_exit_code(check()), RULES_UNUSABLE);
+}
+
+TEST_F(Rules, ADataDirectoryThatIsNoneIsUnreadable) {
+  fs::rename(root_ + "/data", root_ + "/elsewhere");
+  EXPECT_TRUE(check().problems.empty());
+  fs::create_directory_symlink("elsewhere", root_ + "/data");
+  EXPECT_EQ(kinds(check()), std::vector<std::string>{"unreadable"});
+  fs::remove(root_ + "/data");
+  write("data", "x");
+  const rules_report report = check();
+  EXPECT_EQ(kinds(report), std::vector<std::string>{"unreadable"});
+  EXPECT_EQ(report.problems[0].path, "data");
+  EXPECT_EQ(rules_exit_code(report), RULES_PROBLEMS);
+}
+
+TEST_F(Rules, AnInstalledPackageHasAllItsDataDirectories) {
+  fs::remove_all(root_ + "/shared/trusted");
+  EXPECT_TRUE(check_rules("org.example.app", "tpk", root_).problems.empty());
+  EXPECT_EQ(kinds(check_rules("org.example.app", "tpk", root_, true)),
+            std::vector<std::string>{"unreadable"});
+}
+
+TEST_F(Rules, ATreeThatIsTooDeepForTheDaemonIsUnreadable) {
+  std::string path = root_ + "/data";
+  for (int depth = 1; depth < kMaxDirDepth; ++depth) path += "/d";
+  fs::create_directories(path);
+  EXPECT_TRUE(check().problems.empty());
+  fs::create_directories(path + "/d");
+  EXPECT_EQ(kinds(check()), std::vector<std::string>{"unreadable"});
+  EXPECT_GT(get_dir_backup_size((root_ + "/data").c_str(), "org.example.app", root_.c_str()),
+            kMaxBackupSize);
+}
+
 TEST_F(Rules, ElementsWithoutPathAndUnknownOnesAreNamed) {
   rules("<backup><exclude/><skip path=\"data/\"/></backup>");
   EXPECT_EQ(kinds(check()), (std::vector<std::string>{"no-path", "unknown-element"}));
@@ -125,6 +195,8 @@ TEST_F(Rules, OverTheCapShowsTheLargestFiles) {
   const rules_report report = check();
   EXPECT_EQ(rules_exit_code(report), RULES_OVER_CAP);
   const std::string text = rules_text(report);
+  EXPECT_NE(text.find(" 26214409 bytes (25.0 MiB) of at most 26214400 (25.0 MiB)\n"),
+            std::string::npos);
   EXPECT_NE(text.find("over the limit: the application would be skipped"), std::string::npos);
   EXPECT_NE(text.find("data/big.bin", text.find("largest files")), std::string::npos);
 }
@@ -166,9 +238,51 @@ TEST_F(Rules, JsonHoldsEveryEntryAndProblem) {
 
 TEST_F(Rules, ControlCharactersOfNamesDoNotReachTheTerminal) {
   write("data/\033[31mred", "x");
+  write(
+      "data/\xc2\x9b"
+      "31mred",
+      "x");
+  write("data/\xff", "x");
   const std::string text = rules_text(check());
   EXPECT_EQ(text.find('\033'), std::string::npos);
   EXPECT_NE(text.find("\\x1b[31mred"), std::string::npos);
+  EXPECT_NE(text.find("\\u{9b}31mred"), std::string::npos);
+  EXPECT_NE(text.find("data/\\xff"), std::string::npos);
+}
+
+TEST_F(Rules, JsonIsTextWhateverAFileIsCalled) {
+  write("data/\xff", "x");
+  const std::string text = rules_json(check());
+  EXPECT_NE(text.find("\"data/\\ufffd\""), std::string::npos);
+  EXPECT_EQ(text.find('\xff'), std::string::npos);
+}
+
+TEST_F(Rules, JsonHasWhatEveryVerbHas) {
+  rules("<backup/>");
+  EXPECT_EQ(rules_json(check()).find("{\"verb\":\"rules check\",\"package\":\"org.example.app\","),
+            0u);
+  EXPECT_NE(rules_json(check()).find("\"exit\":0,\"message\":\"success\"}\n"), std::string::npos);
+  rules("<backups/>");
+  EXPECT_NE(rules_json(check()).find("\"exit\":3,\"message\":\"the rules file is ignored\"}\n"),
+            std::string::npos);
+  int code = -1;
+  EXPECT_EQ(explain_rules(check(), "data/keep.db", true, &code),
+            "{\"verb\":\"rules explain\",\"package\":\"org.example.app\",\"path\":\"data/keep.db\","
+            "\"type\":\"file\",\"size\":5,\"in\":true,\"rule\":null,\"exit\":0,"
+            "\"message\":\"success\"}\n");
+}
+
+TEST_F(Rules, ErrorsAreToldOnStandardErrorAndAsEveryVerbsJson) {
+  ON_CALL(platform_, package_manager_get_package_info)
+      .WillByDefault(::testing::Return(PACKAGE_MANAGER_ERROR_NO_SUCH_PACKAGE));
+  ::testing::internal::CaptureStdout();
+  ::testing::internal::CaptureStderr();
+  EXPECT_EQ(rules_command({"check", "none"}, true), RULES_NO_INPUT);
+  EXPECT_EQ(::testing::internal::GetCapturedStderr(),
+            "quarnctl: \"none\" is neither a package source nor an installed package\n");
+  EXPECT_EQ(::testing::internal::GetCapturedStdout(),
+            "{\"verb\":\"rules check\",\"exit\":66,\"message\":\"\\\"none\\\" is neither a package "
+            "source nor an installed package\"}\n");
 }
 
 TEST_F(Rules, FileOverTheDaemonsOwnLimitIsSaidToBeIgnored) {
