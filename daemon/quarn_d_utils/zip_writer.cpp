@@ -135,6 +135,8 @@ class ArchiveFile {
 /** The archive that this thread is writing: its file, and the codec whose memory entries share. */
 thread_local ArchiveFile *archive_file = nullptr;
 thread_local std::unique_ptr<Codec> archive_codec;
+/** Where it lies: one that is made among the data it takes in must not take in itself. */
+thread_local std::string archive_path;
 
 /** A file's bytes, as many as it had when it was opened. */
 class FileSource : public ByteSource {
@@ -309,7 +311,7 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
   while (const dirent *entry = readdir(dir)) {
     if (is_dot_entry(entry->d_name)) continue;
     const PathStep step(path, entry->d_name);
-    if (walk->working.contain(*path)) continue;
+    if (walk->working.contain(*path) || *path == archive_path) continue;
     if (walk_entry(walk, dirfd(dir), entry->d_name, path, depth)) noted = true;
   }
   return noted;
@@ -366,6 +368,7 @@ void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, i
     return;
   }
   archive_file = &file;
+  archive_path = zip_path;
   for (const char *dir : kDataDirs) {
     parse_app_dir_for_zip(pkg_id, root, zip, (std::string(root) + dir).c_str(), table.get(), error);
   }
@@ -373,6 +376,7 @@ void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, i
   const int closed = zipClose(zip, nullptr);
   archive_file = nullptr;
   archive_codec.reset();
+  archive_path.clear();
   if (closed != ZIP_OK) {
     LOGE("zipClose() failed, zip_err = [%d]", closed);
     *error = QUARN_REFUSED;

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <random>
 
 #include "backup_device.h"
 #include "quarn_d_utils/handles.h"
@@ -153,6 +154,23 @@ TEST_F(Pellix, PackageThatCannotBePackedIsLeftOutAndItsArchiveDeleted) {
       });
   EXPECT_THAT(archives_of(answered()), ElementsAre(archive(a)));
   EXPECT_FALSE(exists(archive(b)));
+}
+
+TEST_F(Pellix, CompanionsOwnArchiveDoesNotHoldItself) {
+  FakePackage &companion = install("com.velmor.pellix-efl");
+  companion.root = kCompanionRoot;
+  std::filesystem::create_directories(kCompanionRoot + "/data");
+  std::filesystem::create_directories(kCompanionRoot + "/shared/trusted");
+  // more than the writer keeps in memory, so that the archive grows while it is walked
+  std::string noise;
+  std::minstd_rand random(7);
+  while (noise.size() < 1U << 20) noise += static_cast<char>(random() >> 16);
+  write_text(kCompanionRoot + "/data/noise", noise);
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(companion)));
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(companion)));
+  const std::string bytes = read_text(archive(companion));
+  EXPECT_NE(bytes.find("data/noise"), std::string::npos);
+  EXPECT_EQ(bytes.find("com.velmor.pellix-efl_1.0.0.zip"), std::string::npos);
 }
 
 TEST_F(Pellix, ListFileDoesNotRemain) {
