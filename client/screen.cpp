@@ -15,7 +15,6 @@ namespace quarn_client {
 namespace {
 
 constexpr std::size_t kDefaultColumns = 80;
-constexpr std::size_t kLeastColumns = 40;
 constexpr std::int64_t kRedrawEveryUs = 50000;
 constexpr char kEraseLine[] = "\r\033[K";
 
@@ -32,7 +31,7 @@ std::size_t Screen::columns() const {
   winsize size = {};
   if (ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) != 0 || size.ws_col == 0) return kDefaultColumns;
   // The last column stays free: a terminal would wrap there.
-  return size.ws_col < kLeastColumns ? kLeastColumns - 1 : size.ws_col - 1U;
+  return size.ws_col - 1U;
 }
 
 void Screen::line(const std::string &text) { this->text(text + "\n"); }

@@ -79,7 +79,8 @@ std::size_t display_width(const std::string &text) {
 std::string clipped(const std::string &text, std::size_t columns) {
   std::string shown = printable(text);
   if (display_width(shown) <= columns) return shown;
-  const std::size_t room = columns > kEllipsisColumns ? columns - kEllipsisColumns : 0;
+  if (columns < kEllipsisColumns) return std::string(kEllipsis, columns);
+  const std::size_t room = columns - kEllipsisColumns;
   std::size_t used = 0;
   std::size_t at = 0;
   while (at < shown.size()) {

@@ -14,7 +14,6 @@
 namespace {
 
 constexpr std::int64_t kDeadlineUs = 20000000;
-constexpr unsigned short kColumns = 80;
 constexpr unsigned short kRows = 25;
 
 constexpr char kDaemonXml[] =
@@ -228,7 +227,8 @@ bool run_until(const std::function<bool()> &condition) {
 }
 
 QuarnctlRun::QuarnctlRun(const PrivateBus &bus, const std::vector<std::string> &arguments,
-                         bool terminal) {
+                         unsigned short columns) {
+  const bool terminal = columns != 0;
   int flags = G_SUBPROCESS_FLAGS_STDERR_PIPE;
   if (!terminal) flags |= G_SUBPROCESS_FLAGS_STDOUT_PIPE;
   const Handle<GSubprocessLauncher, &g_object_unref> launcher(
@@ -240,7 +240,7 @@ QuarnctlRun::QuarnctlRun(const PrivateBus &bus, const std::vector<std::string> &
   if (terminal) {
     int master = -1;
     int slave = -1;
-    const winsize size = {kRows, kColumns, 0, 0};
+    const winsize size = {kRows, columns, 0, 0};
     EXPECT_EQ(openpty(&master, &slave, nullptr, nullptr, &size), 0);
     terminal_.reset(master);
     fcntl(master, F_SETFL, O_NONBLOCK);

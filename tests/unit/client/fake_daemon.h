@@ -107,9 +107,9 @@ struct Outcome {
 /** A run of quarnctl against a bus. */
 class QuarnctlRun {
  public:
-  /** @param terminal give it a terminal, 80 columns wide, as standard output */
+  /** @param columns not 0: give it a terminal of this width as standard output */
   QuarnctlRun(const PrivateBus &bus, const std::vector<std::string> &arguments,
-              bool terminal = false);
+              unsigned short columns = 0);
   ~QuarnctlRun();
   QuarnctlRun(const QuarnctlRun &) = delete;
   QuarnctlRun &operator=(const QuarnctlRun &) = delete;

@@ -283,7 +283,7 @@ TEST_F(QuarnctlRestore, ProgressIsABarOnATerminal) {
   const Outcome outcome = QuarnctlRun(*bus_,
                                       {"restore", "on", "--from", kSerial, "--watch",
                                        "org.example.notes", "org.example.photos"},
-                                      true)
+                                      80)
                               .wait();
   EXPECT_EQ(outcome.exit, 0);
   EXPECT_NE(

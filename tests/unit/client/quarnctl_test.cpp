@@ -517,7 +517,7 @@ TEST_F(Quarnctl, ProgressIsABarOnATerminal) {
     call.call_back("manual_backup_status",
                    status_arguments(0, QUARN_BACKUP_SUCCEEDED, call.req_id()));
   });
-  const Outcome outcome = QuarnctlRun(bus(), {"backup"}, true).wait();
+  const Outcome outcome = QuarnctlRun(bus(), {"backup"}, 80).wait();
   EXPECT_EQ(outcome.exit, 0);
   const std::string bar =
       "\r\033[K[############------------]  50%  uploading  1 of 2  1.0 MiB of 2.0 MiB";
@@ -529,6 +529,19 @@ TEST_F(Quarnctl, ProgressIsABarOnATerminal) {
   ASSERT_GE(outcome.out.size(), end.size());
   EXPECT_EQ(outcome.out.substr(outcome.out.size() - end.size()), end);
   EXPECT_EQ(outcome.out.find("\033[2J"), std::string::npos);
+}
+
+TEST_F(Quarnctl, TheBarOfANarrowTerminalDoesNotWrap) {
+  FakeDaemon daemon(bus());
+  daemon.on("manual_backup_start", [&](const IncomingCall &call) {
+    daemon.publish(R"({"run":1,"kind":"backup","stage":"uploading","index":1,"count":2,)"
+                   R"("bytes_done":1048576,"bytes_total":2097152})");
+    call.reply(0);
+    call.call_back("manual_backup_status",
+                   status_arguments(0, QUARN_BACKUP_SUCCEEDED, call.req_id()));
+  });
+  const Outcome outcome = QuarnctlRun(bus(), {"backup"}, 20).wait();
+  EXPECT_EQ(outcome.out.find("\r\033[K[############---...\r\033[K"), 0U) << outcome.out;
 }
 
 TEST_F(Quarnctl, ProgressIsPartOfTheJsonDocument) {

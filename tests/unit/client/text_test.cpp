@@ -42,6 +42,8 @@ TEST(Clipped, ShortensToTheColumns) {
   EXPECT_EQ(clipped("abcdefgh", 8), "abcdefgh");
   EXPECT_EQ(clipped("abcdefghi", 8), "abcde...");
   EXPECT_EQ(clipped("写真写真写", 8), "写真...");
+  EXPECT_EQ(clipped("abcdefghi", 2), "..");
+  EXPECT_EQ(clipped("abcdefghi", 0), "");
 }
 
 TEST(LocalTime, IsIsoWithTheOffset) {
