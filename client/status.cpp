@@ -78,8 +78,12 @@ std::string alarm_text(const std::optional<std::int64_t> &due_ms, std::int64_t n
 std::string last_backup_text(const DaemonStatus &status, std::int64_t now_ms) {
   if (!status.last_backup_ms) return kUnknown;
   if (*status.last_backup_ms == 0) return "never";
-  return local_time(*status.last_backup_ms) + ", " +
-         duration_text(now_ms - *status.last_backup_ms) + " ago";
+  const std::string time = local_time(*status.last_backup_ms) + ", ";
+  // A clock that was set back; the daemon takes such a backup for none.
+  if (*status.last_backup_ms > now_ms) {
+    return time + duration_text(*status.last_backup_ms - now_ms) + " in the future";
+  }
+  return time + duration_text(now_ms - *status.last_backup_ms) + " ago";
 }
 
 std::string restore_text(const DaemonStatus &status) {
@@ -136,7 +140,8 @@ std::string duration_text(std::int64_t ms) {
 }
 
 std::string status_text(const DaemonStatus &status, std::int64_t now_ms) {
-  std::string device = status.model + (status.model.empty() ? "" : ", ") + status.serial;
+  const bool both = !status.model.empty() && !status.serial.empty();
+  std::string device = status.model + (both ? ", " : "") + status.serial;
   if (device.empty()) device = kUnknown;
   return line("device", printable(device)) +
          line("automatic backup", choice(status.auto_backup, "on", "off")) +

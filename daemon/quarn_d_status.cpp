@@ -6,7 +6,6 @@
 #include <string>
 
 #include "platform_device.h"
-#include "platform_settings.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
@@ -52,9 +51,9 @@ std::map<std::string, GVariantPtr> &last_told() {
 
 GVariant *last_backup() {
   // The schedule's reader logs every call; a client that looks should not fill the log.
-  double value = 0.0;
-  if (vconf_get_dbl(kLastTimeKey, &value) != VCONF_OK || value < 0.0) value = 0.0;
-  return g_variant_new_uint64(static_cast<std::uint64_t>(value));
+  std::uint64_t time = 0;
+  read_last_backup_time(&time);
+  return g_variant_new_uint64(time);
 }
 
 GVariant *screen_off() {

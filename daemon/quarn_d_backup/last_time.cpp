@@ -25,14 +25,22 @@ void set_last_backup_time() {
   store_last_backup_time(static_cast<std::uint64_t>(_get_current_timestamp()));
 }
 
-std::uint64_t get_last_backup_time() {
+bool read_last_backup_time(std::uint64_t *time) {
   double value = 0;
   // written so that a stored NaN fails it as well
   if (vconf_get_dbl(kLastTimeKey, &value) != VCONF_OK || !(value >= 0 && value < kTimeLimit)) {
+    return false;
+  }
+  *time = static_cast<std::uint64_t>(value);
+  return true;
+}
+
+std::uint64_t get_last_backup_time() {
+  std::uint64_t time = 0;
+  if (!read_last_backup_time(&time)) {
     LOGE("cannot read last backup time from vconf");
     return kUnknownTime;
   }
-  const auto time = static_cast<std::uint64_t>(value);
   LOGI("last backup time is %llu", static_cast<unsigned long long>(time));
   return time;
 }

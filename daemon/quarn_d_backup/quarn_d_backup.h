@@ -297,6 +297,8 @@ bool pellix_app_info_foreach_cb(package_info_app_component_type_e type, const ch
 void init_last_backup_time();
 /** Store the present time. */
 void set_last_backup_time();
+/** The stored time, milliseconds since the Unix epoch, without a log line; false: unreadable. */
+bool read_last_backup_time(std::uint64_t *time);
 /** The stored time, milliseconds since the Unix epoch; all ones when it cannot be read. */
 std::uint64_t get_last_backup_time();
 

@@ -43,6 +43,9 @@ TEST_F(LastTime, ValuesThatAreNoTimeReadAsAllOnes) {
   for (const double value : {-1.0, std::nan(""), 1e300, 18446744073709551616.0}) {
     settings_[kLastTimeKey] = value;
     EXPECT_EQ(get_last_backup_time(), kAllOnes) << value;
+    std::uint64_t time = 7;
+    EXPECT_FALSE(read_last_backup_time(&time)) << value;
+    EXPECT_EQ(time, 7U);
   }
 }
 

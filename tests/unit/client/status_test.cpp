@@ -85,6 +85,21 @@ TEST(Status, NoBackupIsNeverAndNoAlarmIsNone) {
             R"("backup_running":null,"restore_mode":null,"restore_candidates":[]})");
 }
 
+TEST(Status, ABackupInTheFutureIsSaidToBeOne) {
+  setenv("TZ", "UTC", 1);
+  DaemonStatus status;
+  status.last_backup_ms = kNow + kHour;
+  EXPECT_NE(status_text(status, kNow)
+                .find("last backup       2024-02-29T13:05:00+00:00, 1 h in the future\n"),
+            std::string::npos);
+}
+
+TEST(Status, ADeviceWithoutASerialNumberIsItsModelAlone) {
+  DaemonStatus status;
+  status.model = "Orvane One";
+  EXPECT_EQ(status_text(status, kNow).find("device            Orvane One\n"), 0u);
+}
+
 TEST(Status, ATimeBeyondAllTimesIsNotKnown) {
   EXPECT_FALSE(read(parsed("{'LastBackup': <uint64 18446744073709551615>}")).last_backup_ms);
 }
