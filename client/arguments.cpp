@@ -269,6 +269,10 @@ bool check_operands(const VerbInfo &info, const Options &options, Command &comma
     error = "an argument is empty";
     return false;
   }
+  if (options.transfer && options.from_given) {
+    error = "restore on takes either --from or --transfer";
+    return false;
+  }
   if (options.transfer && command.packages.empty()) {
     error = "restore on --transfer needs the packages' names";
     return false;

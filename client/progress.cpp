@@ -96,11 +96,16 @@ std::string stage_text(const std::string &kind, const std::string &stage) {
 }
 
 std::string reason_text(const PackageOutcome &outcome) {
-  if (outcome.reason == "too-large" && outcome.size && outcome.cap) {
-    return size_text(*outcome.size) + " of data, at most " + size_text(*outcome.cap);
-  }
-  if (outcome.reason == "no-space" && outcome.size && outcome.cap) {
-    return size_text(*outcome.size) + " of data, " + size_text(*outcome.cap) + " are free";
+  if (outcome.size && outcome.cap) {
+    std::string size = size_text(*outcome.size);
+    std::string cap = size_text(*outcome.cap);
+    // Where the units hide the difference the bytes show it.
+    if (size == cap) {
+      size = std::to_string(*outcome.size) + " B";
+      cap = std::to_string(*outcome.cap) + " B";
+    }
+    if (outcome.reason == "too-large") return size + " of data, at most " + cap;
+    if (outcome.reason == "no-space") return size + " of data, " + cap + " are free";
   }
   if (!outcome.reason.empty()) return words(kReasons, outcome.reason);
   if (!outcome.result || *outcome.result == QUARN_OK) return "";

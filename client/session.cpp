@@ -325,6 +325,10 @@ void Session::fetch_list(std::function<void(const BackupSets &)> then,
         error = "the cloud holds no application list yet, or it could not be fetched (" +
                 std::to_string(result) + ")";
       }
+      if (list_client_ == kCompanionClient) {
+        error = "making the archives failed: " + result_words(result) + "; is " + kPellixPackage +
+                " installed?";
+      }
       return otherwise ? otherwise(error) : finish(exit_of(result), error);
     }
     if (!reply_ || !callback_) return;

@@ -3,8 +3,9 @@
  * @brief Tells listeners on the bus what backups and restores are doing.
  *
  * Each step becomes one "progress" signal whose value is a JSON text;
- * docs/progress.md lists its members. The engines only leave a record here:
- * texts are made and sent by the main loop, so a slow bus never slows a run.
+ * docs/progress.md lists its members. The engines only leave the text here and
+ * the main loop sends it, so a slow bus never slows a run; what is left at a
+ * backup's end goes out with its last step, from the thread that reports it.
  */
 #ifndef QUARN_D_PROGRESS_H
 #define QUARN_D_PROGRESS_H

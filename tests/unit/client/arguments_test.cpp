@@ -46,6 +46,8 @@ TEST(Arguments, ATransferNamesItsPackages) {
   EXPECT_EQ(error_of({"restore", "on", "--transfer"}),
             "restore on --transfer needs the packages' names");
   EXPECT_EQ(error_of({"restore", "off", "--transfer"}), "--transfer belongs to restore on");
+  EXPECT_EQ(error_of({"restore", "on", "--transfer", "a", "--from", "1"}),
+            "restore on takes either --from or --transfer");
 }
 
 TEST(Arguments, OptionsMayStandAnywhere) {

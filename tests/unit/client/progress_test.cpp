@@ -132,6 +132,14 @@ TEST(ReasonText, TellsTheSizesThatDidNotFit) {
   EXPECT_EQ(reason_text(outcome), "2.0 MiB of data, 1.0 MiB are free");
 }
 
+TEST(ReasonText, TellsBytesWhereTheUnitsHideTheDifference) {
+  PackageOutcome outcome;
+  outcome.reason = "too-large";
+  outcome.size = 26214401;
+  outcome.cap = 26214400;
+  EXPECT_EQ(reason_text(outcome), "26214401 B of data, at most 26214400 B");
+}
+
 TEST(ReasonText, FallsBackToTheReasonItselfAndThenToTheResult) {
   PackageOutcome outcome;
   outcome.reason = "moonlight";

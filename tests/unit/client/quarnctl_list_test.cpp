@@ -101,6 +101,20 @@ TEST_F(QuarnctlList, AnAccountWithoutAListIsToldApartFromOtherFailures) {
             "quarnctl: the cloud holds no application list yet, or it could not be fetched (1)\n");
 }
 
+TEST_F(QuarnctlList, ACompanionThatMayBeMissingIsNamed) {
+  FakeDaemon daemon(*bus_);
+  daemon.on("get_app_list", [](const IncomingCall &call) {
+    EXPECT_EQ(call.int_argument(0), 1);
+    call.call_back("get_app_list_cb", text_arguments(QUARN_FAILED, "failed", call.req_id()),
+                   [call] { call.reply(QUARN_FAILED); });
+  });
+  const Outcome outcome = quarnctl(*bus_, {"transfer", "list"});
+  EXPECT_EQ(outcome.exit, QUARN_FAILED);
+  EXPECT_EQ(outcome.err,
+            "quarnctl: making the archives failed: failed (42); is com.velmor.pellix-efl "
+            "installed?\n");
+}
+
 TEST_F(QuarnctlList, ARefusalThatIsCalledBackBeforeTheReplyIsTheResult) {
   Outcome outcome = ask_refusing({"list"}, QUARN_NO_SESSION, "failed", QUARN_NO_SESSION);
   EXPECT_EQ(outcome.exit, QUARN_NO_SESSION);
