@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <json-c/json.h>
+#include <libxml/xmlschemas.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -181,6 +182,31 @@ TEST_F(Rules, ATreeThatIsTooDeepForTheDaemonIsUnreadable) {
   EXPECT_EQ(kinds(check()), std::vector<std::string>{"unreadable"});
   EXPECT_GT(get_dir_backup_size((root_ + "/data").c_str(), "org.example.app", root_.c_str()),
             kMaxBackupSize);
+}
+
+using SchemaSource = Handle<xmlSchemaParserCtxt, &xmlSchemaFreeParserCtxt>;
+using Schema = Handle<xmlSchema, &xmlSchemaFree>;
+using SchemaCheck = Handle<xmlSchemaValidCtxt, &xmlSchemaFreeValidCtxt>;
+
+TEST(RulesSchema, TakesWhatTheCheckerHasNothingAgainst) {
+  const SchemaSource source(xmlSchemaNewParserCtxt(QUARN_RULES_SCHEMA));
+  const Schema schema(xmlSchemaParse(source.get()));
+  ASSERT_TRUE(schema);
+  const auto is_valid = [&](const std::string &text) {
+    const RulesDoc document(
+        xmlReadMemory(text.data(), static_cast<int>(text.size()), "rules", nullptr, 0));
+    const SchemaCheck check(xmlSchemaNewValidCtxt(schema.get()));
+    xmlSchemaSetValidStructuredErrors(
+        check.get(), [](void *, auto *) {}, nullptr);
+    return xmlSchemaValidateDoc(check.get(), document.get()) == 0;
+  };
+  EXPECT_TRUE(is_valid("<backup/>"));
+  EXPECT_TRUE(
+      is_valid("<backup>\n<exclude path=\"data/cache/\"/><!-- text -->"
+               "<include path=\"data/\"/><exclude path=\"/data/a\"/></backup>"));
+  EXPECT_FALSE(is_valid("<Backup/>"));
+  EXPECT_FALSE(is_valid("<backup><include/></backup>"));
+  EXPECT_FALSE(is_valid("<backup><skip path=\"data/\"/></backup>"));
 }
 
 TEST_F(Rules, ElementsWithoutPathAndUnknownOnesAreNamed) {
