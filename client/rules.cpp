@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <memory>
 
 #include "json_read.h"
@@ -463,6 +464,7 @@ std::string explain_rules(const rules_report &report, const std::string &path, b
   std::string relative = path;
   if (begins_with(relative, report.root + "/")) relative.erase(0, report.root.size() + 1);
   while (begins_with(relative, "/")) relative.erase(0, 1);
+  relative = std::filesystem::path(relative).lexically_normal();  // as find prints it: "./data/a"
   const auto found = std::find_if(report.entries.begin(), report.entries.end(),
                                   [&](const rule_entry &entry) { return entry.path == relative; });
   if (found == report.entries.end()) {

@@ -248,6 +248,8 @@ TEST_F(Rules, ExplainsOnePath) {
   EXPECT_EQ(code, RULES_OK);
   EXPECT_EQ(explain_rules(check(), root_ + "/data/keep.db", false, &code),
             "data/keep.db: in (no rule speaks of it)\n");
+  EXPECT_EQ(explain_rules(check(), "./data//cache/../keep.db", false, &code),
+            "data/keep.db: in (no rule speaks of it)\n");
   explain_rules(check(), "data/none", false, &code);
   EXPECT_EQ(code, RULES_NO_INPUT);
 }
