@@ -134,7 +134,7 @@ class QuarnctlTest(TestCase):
         self.assertEqual(os.stat(source).st_mode & 0o777, 0o777)
         self.assertEqual(label_of(source), companion)
         shutil.copy2(source, second.app_path(companion, "shared/data/" + name))
-        self.quarnctl("restore", "on", "--transfer", "--from", SERIAL, NOTES, device=second)
+        self.quarnctl("restore", "on", "--transfer", NOTES, device=second)
         self.install(second, NOTES, data=False)
 
         def same():
