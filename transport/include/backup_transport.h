@@ -9,6 +9,9 @@
  *     url=file:///PATH            a folder; the embedded device's default
  *     user=NAME                   network stores only
  *     password=TEXT               network stores only
+ *     ca-file=PATH                network stores only; PEM
+ *     region=NAME                 S3 only
+ *     addressing=path|virtual     S3 only
  *
  * The file is found at $QUARN_CLOUD_CONFIG, else at /etc/quarn/cloud.conf. It
  * must be mode 0600 when it holds a password, and it is read again when it

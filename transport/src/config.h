@@ -16,7 +16,7 @@ struct Config {
   std::string user;
   std::string password;
   std::string ca_file;    /**< PEM file used instead of the system's authorities; may be empty */
-  std::string region;     /**< s3 only; empty: the usual one */
+  std::string region;     /**< s3 only; empty: "us-east-1" */
   std::string addressing; /**< s3 only: "path" or "virtual"; empty: path */
 
   bool operator==(const Config &other) const {

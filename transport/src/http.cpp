@@ -348,7 +348,10 @@ class Engine {
     set(exchange, CURLOPT_ERRORBUFFER, static_cast<char *>(exchange.error));
     set(exchange, CURLOPT_HTTPHEADER, exchange.headers);
     if (!request.user.empty()) {
-      set(exchange, CURLOPT_HTTPAUTH, static_cast<long>(CURLAUTH_BASIC));
+      if (request.signature.empty())
+        set(exchange, CURLOPT_HTTPAUTH, static_cast<long>(CURLAUTH_BASIC));
+      else
+        set(exchange, CURLOPT_AWS_SIGV4, request.signature.c_str());
       set(exchange, CURLOPT_USERNAME, request.user.c_str());
       set(exchange, CURLOPT_PASSWORD, request.password.c_str());
     }

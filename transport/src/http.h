@@ -28,6 +28,8 @@ struct HttpRequest {
   std::vector<std::string> headers; /**< "Name: value" */
   std::string user;                 /**< empty: no credentials */
   std::string password;
+  /** "provider:provider:region:service": sign with the password instead of sending it. */
+  std::string signature;
   std::string ca_file; /**< empty: the system's authorities */
 
   long seconds = 0; /**< for the whole exchange; 0: as long as something moves */
