@@ -35,6 +35,7 @@ constexpr long kStallBytesPerSecond = 1;
 constexpr int kIdleMs = 15000;
 constexpr std::size_t kThreadStackBytes = 1024 * 1024;
 constexpr long kUploadBufferBytes = 64 * 1024;
+constexpr long kNoContinueMs = 1;
 constexpr std::chrono::seconds kExitPatience{2};
 constexpr std::chrono::seconds kLongestRetryAfter{3600};
 constexpr guint kDecimal = 10;
@@ -358,6 +359,8 @@ class Engine {
     if (request.has_body) {
       set(exchange, CURLOPT_UPLOAD, 1L);
       set(exchange, CURLOPT_UPLOAD_BUFFERSIZE, kUploadBufferBytes);
+      // Small ones are not worth the wait for a go-ahead, which some servers never give.
+      if (request.body_fd < 0) set(exchange, CURLOPT_EXPECT_100_TIMEOUT_MS, kNoContinueMs);
       set(exchange, CURLOPT_INFILESIZE_LARGE,
           static_cast<curl_off_t>(request.body_fd >= 0 ? request.body_size : request.body.size()));
       set(exchange, CURLOPT_READFUNCTION, &read_body);
