@@ -1,5 +1,6 @@
 #include "s3_server.h"
 
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
@@ -45,11 +46,13 @@ class SwiftServer : public S3Server {
   void unlimit(const std::string &bucket) override {
     call("POST", bucket, {"X-Remove-Container-Meta-Quota-Bytes: x"});
   }
-  void kill_node() override {
-    for (const char *server : {"object-2", "container-2", "account-2"})
-      EXPECT_EQ(kill(pid_of(server), SIGKILL), 0);
+  void kill_nodes(int count) override {
+    for (int node = 1; node <= count; ++node) {
+      for (const char *server : {"object-", "container-", "account-"})
+        EXPECT_EQ(kill(pid_of(server + std::to_string(node)), SIGKILL), 0);
+    }
   }
-  void restart_node() override {
+  void restart_nodes() override {
     tell(SIGHUP);
     wait_ready(++starts_);
   }
@@ -65,10 +68,64 @@ class SwiftServer : public S3Server {
   int starts_ = 1;
 };
 
+class CephServer : public S3Server {
+ public:
+  CephServer() : S3Server("ceph_gateway.py") { wait_ready(1); }
+
+  std::string user() const override { return "device"; }
+  void accept_secret(const std::string &secret) override {
+    administer({"user", "modify", "--uid=device", "--access-key=device", "--secret=" + secret});
+  }
+  void limit(const std::string &bucket, uint64_t bytes) override {
+    const uint64_t used = std::stoull(bucket_header(bucket, "x-container-bytes-used"));
+    administer({"quota", "set", "--quota-scope=bucket", "--bucket=" + bucket,
+                "--max-size=" + std::to_string(used + bytes)});
+    administer({"quota", "enable", "--quota-scope=bucket", "--bucket=" + bucket});
+  }
+  void unlimit(const std::string &bucket) override {
+    administer({"quota", "disable", "--quota-scope=bucket", "--bucket=" + bucket});
+  }
+  void kill_nodes(int count) override {
+    for (int node = 0; node < count; ++node)
+      EXPECT_EQ(kill(pid_of("osd" + std::to_string(node)), SIGKILL), 0);
+  }
+  void restart_nodes() override {
+    tell(SIGHUP);
+    wait_ready(++starts_);
+  }
+  bool has_conditions() const override { return true; }
+
+ protected:
+  std::string front() const override { return "gateway"; }
+  std::vector<std::string> login() const override {
+    return {"X-Auth-User: device:swift", "X-Auth-Key: admin"};
+  }
+
+ private:
+  void administer(std::vector<std::string> words) const {
+    const std::string config = path("ceph.conf");
+    words.insert(words.begin(), {"radosgw-admin", "-c", config});
+    std::vector<char *> argv;
+    for (std::string &word : words) argv.push_back(word.data());
+    argv.push_back(nullptr);
+    const pid_t pid = fork();
+    if (pid == 0) {
+      const int null = open("/dev/null", O_WRONLY);
+      dup2(null, STDOUT_FILENO);
+      dup2(null, STDERR_FILENO);
+      execvp(argv[0], argv.data());
+      _exit(127);
+    }
+    EXPECT_EQ(wait_role(pid), 0) << words[3] << " " << words[4];
+  }
+
+  int starts_ = 1;
+};
+
 }  // namespace
 
 std::unique_ptr<S3Server> S3Server::make(const std::string &kind) {
-  EXPECT_EQ(kind, "swift");
+  if (kind == "ceph") return std::make_unique<CephServer>();
   return std::make_unique<SwiftServer>();
 }
 
@@ -95,7 +152,9 @@ void S3Server::wait_ready(int times) {
   const auto is_ready = [&] {
     std::istringstream text(read_file(dir_ / "ready"));
     int seen = 0;
-    return text >> port_ >> seen && seen == times;
+    if (!(text >> port_ >> seen) || seen != times) return false;
+    text >> tls_port_;
+    return true;
   };
   EXPECT_TRUE(run_until(is_ready, kStartPatience));
 }
@@ -105,6 +164,12 @@ pid_t S3Server::pid_of(const std::string &server) const {
 }
 
 void S3Server::tell(int signal) const { EXPECT_EQ(kill(pid_, signal), 0); }
+
+std::string S3Server::logs() const {
+  std::string all;
+  for (const auto &[name, content] : tree(dir_ / "log")) all += content;
+  return all;
+}
 
 void S3Server::freeze() const { EXPECT_EQ(kill(pid_of(front()), SIGSTOP), 0); }
 

@@ -20,6 +20,8 @@
 
 class S3Server {
  public:
+  static constexpr char kBucket[] = "devices";
+
   /** @param kind "swift" or "ceph" */
   static std::unique_ptr<S3Server> make(const std::string &kind);
   S3Server(const S3Server &) = delete;
@@ -27,19 +29,25 @@ class S3Server {
   virtual ~S3Server();
 
   int port() const { return port_; }
+  /** The same with TLS, 0 where there is none, and who signed its certificate. */
+  int tls_port() const { return tls_port_; }
+  std::string authority() const { return path("cert.pem"); }
   virtual std::string user() const = 0;
-  static constexpr char kSecret[] = "right";
+  static constexpr char kSecret[] = "never-to-be-seen-7c1f";
 
   /** From now on only this secret is accepted. */
   virtual void accept_secret(const std::string &secret) = 0;
   /** There is room for @p bytes more. */
   virtual void limit(const std::string &bucket, uint64_t bytes) = 0;
   virtual void unlimit(const std::string &bucket) = 0;
-  /** One of the servers that hold the objects dies, and comes back. */
-  virtual void kill_node() = 0;
-  virtual void restart_node() = 0;
+  /** How many of the three servers that hold the objects are dead from now on. */
+  virtual void kill_nodes(int count) = 0;
+  virtual void restart_nodes() = 0;
   /** Does it take a condition on a PUT? */
   virtual bool has_conditions() const = 0;
+
+  /** What its servers logged. */
+  std::string logs() const;
 
   /** Stop the service in its tracks, and let it go on. */
   void freeze() const;
@@ -71,8 +79,12 @@ class S3Server {
   harness::TempDir dir_;
   pid_t pid_ = -1;
   int port_ = 0;
+  int tls_port_ = 0;
   std::string storage_;
   std::string token_;
 };
+
+/** The one of this process, with its bucket. */
+S3Server &the_s3_server();
 
 #endif

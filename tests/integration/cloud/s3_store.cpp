@@ -7,7 +7,7 @@ using namespace harness;
 namespace {
 
 constexpr char kKind[] = CLOUD_SERVER;
-constexpr char kBucket[] = "devices";
+constexpr auto &kBucket = S3Server::kBucket;
 
 std::unique_ptr<S3Server> &the_server() {
   static std::unique_ptr<S3Server> server;
@@ -64,3 +64,5 @@ INSTANTIATE_TEST_SUITE_P(S3, Conformance,
                          [](const auto &info) { return std::string(info.param.name); });
 
 }  // namespace
+
+S3Server &the_s3_server() { return *the_server(); }

@@ -1,4 +1,4 @@
-#!/usr/bin/python3
+#!/usr/bin/python3 -B
 """swift_cluster.py DIR: a Swift cluster on loopback, with the S3 interface, in the foreground.
 
 Three nodes with an object, a container and an account server each, three copies of everything, a
@@ -6,7 +6,6 @@ proxy and memcached. DIR/ready holds the proxy's port and how often the proxy wa
 answers; DIR/run the process ids. The secret of user "test:device" is in DIR/secret. SIGHUP starts
 what has ended, and the proxy anew with the secret of then. SIGTERM ends everything.
 """
-import ctypes
 import os
 import pwd
 import signal
@@ -16,31 +15,15 @@ import time
 
 import swift.common.utils as utils
 
+from cloud_process import fork_into, free_ports, read, write
+
 NODES = 3
 SERVERS = ("object", "container", "account")
-PR_SET_PDEATHSIG = 1
 DIR = os.path.abspath(sys.argv[1])
 USER = pwd.getpwuid(os.getuid()).pw_name
 
 PIPELINE = ("catch_errors", "gatekeeper", "healthcheck", "cache", "listing_formats", "s3api",
             "tempauth", "bulk", "container_quotas", "slo", "proxy-server")
-
-
-def free_ports(count):
-    taken = [socket.socket() for _ in range(count)]
-    for each in taken:
-        each.bind(("127.0.0.1", 0))
-    ports = [each.getsockname()[1] for each in taken]
-    for each in taken:
-        each.close()
-    return ports
-
-
-def write(name, text):
-    temporary = os.path.join(DIR, name + ".new")
-    with open(temporary, "w") as file:
-        file.write(text)
-    os.rename(temporary, os.path.join(DIR, name))
 
 
 def storage_config(server, node, port):
@@ -63,8 +46,7 @@ use = egg:swift#{server}
 
 
 def proxy_config(port, cache_port):
-    with open(os.path.join(DIR, "secret")) as file:
-        secret = file.read().strip()
+    secret = read(f"{DIR}/secret")
     settings = {
         "cache": f"memcache_servers = 127.0.0.1:{cache_port}\n",
         "tempauth": f"user_test_admin = admin .admin\nuser_test_device = {secret} .admin\n",
@@ -102,7 +84,7 @@ class Cluster:
         self.apps = {}
         for folder in ("run", "log"):
             os.makedirs(os.path.join(DIR, folder))
-        write("swift.conf", "[swift-hash]\nswift_hash_path_suffix = a\nswift_hash_path_prefix = b\n"
+        write(f"{DIR}/swift.conf", "[swift-hash]\nswift_hash_path_suffix = a\nswift_hash_path_prefix = b\n"
               "[storage-policy:0]\nname = p0\ndefault = yes\n")
         utils.SWIFT_CONF_FILE = os.path.join(DIR, "swift.conf")
         self.make_storage(dict(zip([(node, server) for node in range(1, NODES + 1)
@@ -121,7 +103,7 @@ class Cluster:
                                  "device": f"d{node}", "weight": 100.0, "meta": ""})
                 os.makedirs(f"{DIR}/n{node}/d{node}", exist_ok=True)
                 name = f"{server}-{node}"
-                write(name + ".conf", storage_config(server, node, port))
+                write(f"{DIR}/{name}.conf", storage_config(server, node, port))
                 self.ports[name] = port
                 self.apps[name] = server + "-server"
             builder.rebalance(seed="1")
@@ -129,24 +111,13 @@ class Cluster:
 
     def start(self, name):
         if name == "proxy":
-            write("proxy.conf", proxy_config(self.proxy_port, self.cache_port))
+            write(f"{DIR}/proxy.conf", proxy_config(self.proxy_port, self.cache_port))
             self.proxy_starts += 1
-        pid = os.fork()
-        if pid == 0:
-            try:
-                self.become(name)
-            finally:
-                os._exit(1)
-        self.pids[name] = pid
-        write(f"run/{name}.pid", str(pid))
+        self.pids[name] = fork_into(f"{DIR}/log/{name}.log", lambda: self.become(name))
+        write(f"{DIR}/run/{name}.pid", str(self.pids[name]))
 
     def become(self, name):
-        ctypes.CDLL(None).prctl(PR_SET_PDEATHSIG, signal.SIGKILL)
-        log = os.open(f"{DIR}/log/{name}.log", os.O_WRONLY | os.O_CREAT | os.O_APPEND)
-        os.dup2(log, 1)
-        os.dup2(log, 2)
         signal.signal(signal.SIGHUP, signal.SIG_IGN)
-        signal.signal(signal.SIGTERM, signal.SIG_DFL)
         if name == "memcached":
             as_user = ["-u", "root"] if os.getuid() == 0 else []
             os.execvp("memcached", ["memcached", "-l", "127.0.0.1", "-p", str(self.cache_port),
@@ -176,7 +147,7 @@ class Cluster:
                 self.start(name)
         for name in self.ports:
             self.wait_for(name)
-        write("ready", f"{self.proxy_port} {self.proxy_starts}\n")
+        write(f"{DIR}/ready", f"{self.proxy_port} {self.proxy_starts}\n")
 
     def end(self, name):
         pid = self.pids.pop(name)

@@ -1,0 +1,46 @@
+"""What the launchers of the storage services share."""
+import ctypes
+import os
+import signal
+import socket
+
+PR_SET_PDEATHSIG = 1
+
+
+def free_ports(count):
+    taken = [socket.socket() for _ in range(count)]
+    for each in taken:
+        each.bind(("127.0.0.1", 0))
+    ports = [each.getsockname()[1] for each in taken]
+    for each in taken:
+        each.close()
+    return ports
+
+
+def write(path, text):
+    """Whole or not at all."""
+    with open(path + ".new", "w") as file:
+        file.write(text)
+    os.rename(path + ".new", path)
+
+
+def read(path):
+    with open(path) as file:
+        return file.read().strip()
+
+
+def fork_into(log, body):
+    """A process that does `body`, prints into `log` and ends with this one at the latest."""
+    pid = os.fork()
+    if pid:
+        return pid
+    try:
+        ctypes.CDLL(None).prctl(PR_SET_PDEATHSIG, signal.SIGKILL)
+        file = os.open(log, os.O_WRONLY | os.O_CREAT | os.O_APPEND)
+        os.dup2(file, 1)
+        os.dup2(file, 2)
+        for number in (signal.SIGHUP, signal.SIGTERM, signal.SIGINT):
+            signal.signal(number, signal.SIG_DFL)
+        body()
+    finally:
+        os._exit(1)
