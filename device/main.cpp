@@ -42,7 +42,8 @@ constexpr Verb kVerbs[] = {
      "Change what the device finds around it:\n"
      "  network wifi|cellular|none    charger on|off    display on|dim|off\n"
      "  account NAME|none             modem on|off\n"
-     "  cloud URL [--user NAME [--password-file FILE]]\n"
+     "  cloud URL [--user NAME [--password-file FILE]] [--ca-file FILE]\n"
+     "            [--region NAME] [--addressing path|virtual]\n"
      "The password of --user is read from the file, else from standard input."},
     {"setting", verb_setting, "setting DIR KEY [VALUE]", "Print or write a setting."},
     {"alarms", verb_alarms, "alarms DIR [--json]", "List the pending alarms."},

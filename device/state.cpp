@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <fstream>
 #include <iostream>
+#include <map>
 #include <random>
 
 #include "device.h"
@@ -96,15 +97,14 @@ void check_url(const std::string &url) {
   if (plain && !is_loopback(host)) throw Failure("plain http is for this machine only: use https");
 }
 
-void write_cloud(const std::string &device, const std::string &url, const std::string &user,
-                 const std::string &password) {
+using CloudKeys = std::map<std::string, std::string>;
+
+void write_cloud(const std::string &device, const std::string &url, const CloudKeys &keys) {
   check_url(url);
   const embedded::KeyFilePtr file(g_key_file_new());
   g_key_file_set_string(file.get(), kCloudGroup, "url", url.c_str());
-  if (!user.empty()) {
-    g_key_file_set_string(file.get(), kCloudGroup, "user", user.c_str());
-    g_key_file_set_string(file.get(), kCloudGroup, "password", password.c_str());
-  }
+  for (const auto &[key, value] : keys)
+    g_key_file_set_string(file.get(), kCloudGroup, key.c_str(), value.c_str());
   gsize length = 0;
   const embedded::GText text(g_key_file_to_data(file.get(), &length, nullptr));
   if (!embedded::write_state_text(device, kCloudFile, std::string(text.get(), length),
@@ -121,29 +121,37 @@ std::string read_line(std::istream &in) {
 }
 
 void set_cloud(const std::string &device, const Arguments &arguments) {
-  std::string user;
+  CloudKeys keys;
   std::string password_file;
   for (std::size_t i = 3; i < arguments.size(); i += 2) {
-    if (i + 1 >= arguments.size()) wrong_use();
-    if (arguments[i] == "--user") {
-      user = arguments[i + 1];
-    } else if (arguments[i] == "--password-file") {
+    if (i + 1 >= arguments.size() || arguments[i + 1].empty()) wrong_use();
+    const std::string &option = arguments[i];
+    if (option == "--password-file") {
       password_file = arguments[i + 1];
+    } else if (option == "--ca-file") {
+      keys["ca-file"] = fs::absolute(arguments[i + 1]).string();
+    } else if (option == "--user" || option == "--region" || option == "--addressing") {
+      keys[option.substr(2)] = arguments[i + 1];
     } else {
       wrong_use();
     }
   }
-  if (user.empty() && !password_file.empty()) wrong_use();
-  std::string password;
-  if (!user.empty() && !password_file.empty()) {
-    std::ifstream file(password_file);
-    if (!file) throw Failure("cannot read " + password_file + ": " + reason());
-    password = read_line(file);
-  } else if (!user.empty()) {
-    password = read_line(std::cin);
+  const bool has_user = keys.count("user") != 0;
+  if (!has_user && !password_file.empty()) wrong_use();
+  if (keys.count("addressing") != 0 && !is_one_of(keys["addressing"], {"path", "virtual"}))
+    wrong_use();
+  if (has_user) {
+    std::string &password = keys["password"];
+    if (password_file.empty()) {
+      password = read_line(std::cin);
+    } else {
+      std::ifstream file(password_file);
+      if (!file) throw Failure("cannot read " + password_file + ": " + reason());
+      password = read_line(file);
+    }
+    if (password.empty()) throw Failure("no password was given");
   }
-  if (!user.empty() && password.empty()) throw Failure("no password was given");
-  write_cloud(device, arguments[2], user, password);
+  write_cloud(device, arguments[2], keys);
 }
 
 void set_fact(const std::string &device, const char *key, const std::string &value) {
@@ -233,7 +241,7 @@ int verb_create(const Arguments &arguments) {
   set_fact(device, embedded::kNetwork, "wifi");
   set_fact(device, embedded::kCharger, "off");
   set_fact(device, embedded::kDisplay, "on");
-  write_cloud(device, cloud.empty() ? file_url(device + "/cloud") : cloud, "", "");
+  write_cloud(device, cloud.empty() ? file_url(device + "/cloud") : cloud, {});
   return DEVICE_OK;
 }
 

@@ -210,6 +210,23 @@ class State(TestCase):
         self.assertIn("user=ada", text)
         self.assertIn("password=secret word", text)
 
+    def test_a_cloud_may_need_more_than_a_password(self):
+        device = self.new_device()
+        device.call("set", "cloud", "s3+https://s3.example.org/fleet/one", "--user", "key",
+                    "--region", "eu-central-1", "--addressing", "virtual", "--ca-file", "own.pem",
+                    input="secret\n", cwd=self.directory)
+        with open(os.path.join(device.path, "state/cloud.conf")) as file:
+            lines = file.read().splitlines()
+        for line in ("url=s3+https://s3.example.org/fleet/one", "user=key", "password=secret",
+                     "region=eu-central-1", "addressing=virtual",
+                     "ca-file=" + os.path.join(self.directory, "own.pem")):
+            self.assertIn(line, lines)
+        for wrong in (("--addressing", "dns"), ("--region",), ("--region", ""), ("--what", "x"),
+                      ("--password-file", "x")):
+            result = device.call("set", "cloud", "s3+https://s3.example.org/fleet", *wrong,
+                                 check=False)
+            self.assertEqual(result.returncode, 64, wrong)
+
     def test_alarms_json_is_an_array(self):
         device = self.new_device()
         self.assertEqual(json.loads(device.call("alarms", "--json").stdout), [])
