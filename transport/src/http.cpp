@@ -5,9 +5,13 @@
 #include <curl/curl.h>
 #include <dlfcn.h>
 #include <glib.h>
+#include <linux/sockios.h>
+#include <netinet/in.h>
 #include <pthread.h>
 #include <signal.h>
+#include <sys/ioctl.h>
 #include <sys/prctl.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -19,20 +23,21 @@
 #include <list>
 #include <memory>
 #include <mutex>
+#include <set>
 
 #include "http_date.h"
 
 namespace transport {
 namespace {
 
+using Clock = std::chrono::steady_clock;
 using Lock = std::unique_lock<std::mutex>;
 
 constexpr char kThreadName[] = "cloud-transport";
 constexpr const char *kLibraries[] = {"libcurl.so.4", "libcurl-gnutls.so.4"};
 constexpr long kConnectSeconds = 15;
-constexpr long kStallSeconds = 30;
-constexpr long kStallBytesPerSecond = 1;
 constexpr int kIdleMs = 15000;
+constexpr int kLookMs = 1000;  // how soon to look at what the kernel holds
 constexpr std::size_t kThreadStackBytes = 1024 * 1024;
 constexpr long kUploadBufferBytes = 64 * 1024;
 constexpr long kNoContinueMs = 1;
@@ -120,6 +125,11 @@ struct Exchange {
   CURL *easy = nullptr;
   curl_slist *headers = nullptr;
   uint64_t sent = 0;
+  int64_t received = 0;       // bytes of headers and body
+  int64_t moved = 0;          // bytes sent and received when it was last looked at
+  std::optional<int> queued;  // bytes that the kernel held when nothing else had moved
+  Clock::time_point moved_at;
+  Clock::time_point began_at;
   bool local_failure = false;
   bool too_long = false;
   char error[CURL_ERROR_SIZE] = "";
@@ -161,6 +171,7 @@ int seek_body(void *data, curl_off_t offset, int origin) {
 std::size_t take_header(char *buffer, std::size_t size, std::size_t count, void *data) {
   Exchange &exchange = *static_cast<Exchange *>(data);
   const std::string line(buffer, size * count);
+  exchange.received += static_cast<int64_t>(line.size());
   if (line.compare(0, 5, "HTTP/") == 0) {
     // The answer after a 100 is another one.
     exchange.answer.headers.clear();
@@ -179,6 +190,7 @@ std::size_t take_header(char *buffer, std::size_t size, std::size_t count, void 
 std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *data) {
   Exchange &exchange = *static_cast<Exchange *>(data);
   const std::size_t length = size * count;
+  exchange.received += static_cast<int64_t>(length);
   if (exchange.request->sink && exchange.answer.status >= 200 && exchange.answer.status <= 299) {
     if (exchange.request->sink(buffer, length)) return length;
     exchange.local_failure = true;
@@ -190,6 +202,26 @@ std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *d
   }
   exchange.answer.body.append(buffer, length);
   return length;
+}
+
+// What the network has not taken yet.
+int queued_bytes(int socket) {
+  int count = 0;
+  return ioctl(socket, SIOCOUTQ, &count) == 0 ? count : 0;
+}
+
+bool has_port(int socket, long port) {
+  sockaddr_storage address{};
+  socklen_t length = sizeof address;
+  if (getsockname(socket, reinterpret_cast<sockaddr *>(&address), &length) != 0) return false;
+  return address.ss_family == AF_INET6
+             ? ntohs(reinterpret_cast<const sockaddr_in6 &>(address).sin6_port) == port
+             : ntohs(reinterpret_cast<const sockaddr_in &>(address).sin_port) == port;
+}
+
+int milliseconds_until(Clock::time_point end, Clock::time_point now) {
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(end - now).count();
+  return static_cast<int>(std::clamp<int64_t>(left, 0, kIdleMs));
 }
 
 class Engine {
@@ -227,6 +259,19 @@ class Engine {
     ticket.set_waker(nullptr);
     if (ticket.cancelled()) exchange->answer.problem = cancelled();
     return std::move(exchange->answer);
+  }
+
+  void set_clock(RetryClock *clock) {
+    const Lock lock(mutex_);
+    clock_ = clock == nullptr ? &RetryClock::system() : clock;
+  }
+
+  void wake() {
+    Lock lock(mutex_);
+    if (!running_) return;
+    const unsigned wanted = begun_rounds_ + 1;
+    curl_.multi_wakeup(multi_);
+    finished_.wait(lock, [&] { return !running_ || ended_rounds_ >= wanted; });
   }
 
  private:
@@ -282,15 +327,19 @@ class Engine {
   void run() {
     std::list<ExchangePtr> active;
     for (;;) {
+      Clock::time_point now;
       {
         const Lock lock(mutex_);
+        // From before the bytes are moved, so that none which came in time counts as missing.
+        now = clock_->now();
+        ++begun_rounds_;
         if (stopping_) {
           running_ = false;
           finished_.notify_all();
           return;
         }
         for (const ExchangePtr &exchange : incoming_) {
-          begin(*exchange);
+          begin(*exchange, now);
           active.push_back(exchange);
         }
         incoming_.clear();
@@ -302,8 +351,19 @@ class Engine {
       int still_running = 0;
       curl_.multi_perform(multi_, &still_running);
       collect(&active);
+      int patience = kIdleMs;
+      for (auto it = active.begin(); it != active.end();) {
+        const ExchangePtr exchange = *it++;
+        note_progress(*exchange, now);
+        if (overdue(*exchange, now, &patience)) give_up(exchange, &active);
+      }
+      {
+        const Lock lock(mutex_);
+        ended_rounds_ = begun_rounds_;
+        finished_.notify_all();
+      }
       int events = 0;
-      curl_.multi_poll(multi_, nullptr, 0, kIdleMs, &events);
+      curl_.multi_poll(multi_, nullptr, 0, patience, &events);
       const Lock lock(mutex_);
       if (active.empty() && incoming_.empty() && events == 0 && idle_over()) {
         curl_.multi_cleanup(multi_);
@@ -315,8 +375,58 @@ class Engine {
     }
   }
 
-  bool idle_over() const {
-    return std::chrono::steady_clock::now() - last_end_ >= std::chrono::milliseconds(kIdleMs);
+  bool idle_over() const { return Clock::now() - last_end_ >= std::chrono::milliseconds(kIdleMs); }
+
+  // The kernel takes megabytes at once, which can be minutes of a slow network.
+  int queued_of(const Exchange &exchange) const {
+    long port = 0;
+    curl_.easy_getinfo(exchange.easy, CURLINFO_LOCAL_PORT, &port);
+    const auto socket = std::find_if(sockets_.begin(), sockets_.end(),
+                                     [port](int known) { return has_port(known, port); });
+    return socket == sockets_.end() ? 0 : queued_bytes(*socket);
+  }
+
+  void note_progress(Exchange &exchange, Clock::time_point now) {
+    curl_off_t sent = 0;
+    curl_.easy_getinfo(exchange.easy, CURLINFO_SIZE_UPLOAD_T, &sent);
+    if (sent + exchange.received != exchange.moved) {
+      exchange.moved = sent + exchange.received;
+      exchange.moved_at = now;
+      exchange.queued.reset();
+    } else if (exchange.request->has_body) {
+      const int queued = queued_of(exchange);
+      if (exchange.queued && *exchange.queued != queued) exchange.moved_at = now;
+      exchange.queued = queued;
+    }
+  }
+
+  // Also tells when to look again.
+  static bool overdue(const Exchange &exchange, Clock::time_point now, int *patience) {
+    auto end = exchange.moved_at + kStallTime;
+    const std::chrono::seconds limit(exchange.request->seconds);
+    if (limit.count() > 0) end = std::min(end, exchange.began_at + limit);
+    *patience = std::min(*patience, milliseconds_until(end, now));
+    if (exchange.request->has_body && !exchange.queued) *patience = std::min(*patience, kLookMs);
+    return now >= end;
+  }
+
+  void give_up(const ExchangePtr &exchange, std::list<ExchangePtr> *active) {
+    exchange->answer.problem = failure(BACKUP_TRANS_ERROR_NETWORK, "the server went silent");
+    exchange->answer.problem.transient = true;
+    const Lock lock(mutex_);
+    end(*exchange);
+    active->remove(exchange);
+  }
+
+  static curl_socket_t open_socket(void *data, curlsocktype, curl_sockaddr *address) {
+    const int fd = socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+    if (fd >= 0) static_cast<Engine *>(data)->sockets_.insert(fd);
+    return fd;
+  }
+
+  static int close_socket(void *data, curl_socket_t fd) {
+    static_cast<Engine *>(data)->sockets_.erase(fd);
+    return close(fd);
   }
 
   template <typename Value>
@@ -325,8 +435,10 @@ class Engine {
   }
 
   // With the mutex held, on the transport thread.
-  void begin(Exchange &exchange) {
+  void begin(Exchange &exchange, Clock::time_point now) {
     const HttpRequest &request = *exchange.request;
+    exchange.began_at = now;
+    exchange.moved_at = now;
     exchange.easy = curl_.easy_init();
     for (const std::string &header : request.headers)
       exchange.headers = curl_.slist_append(exchange.headers, header.c_str());
@@ -343,9 +455,10 @@ class Engine {
     set(exchange, CURLOPT_SSL_VERIFYHOST, 2L);
     if (!request.ca_file.empty()) set(exchange, CURLOPT_CAINFO, request.ca_file.c_str());
     set(exchange, CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
-    set(exchange, CURLOPT_TIMEOUT, request.seconds);
-    set(exchange, CURLOPT_LOW_SPEED_LIMIT, kStallBytesPerSecond);
-    set(exchange, CURLOPT_LOW_SPEED_TIME, kStallSeconds);
+    set(exchange, CURLOPT_OPENSOCKETFUNCTION, &open_socket);
+    set(exchange, CURLOPT_OPENSOCKETDATA, this);
+    set(exchange, CURLOPT_CLOSESOCKETFUNCTION, &close_socket);
+    set(exchange, CURLOPT_CLOSESOCKETDATA, this);
     set(exchange, CURLOPT_ERRORBUFFER, static_cast<char *>(exchange.error));
     set(exchange, CURLOPT_HTTPHEADER, exchange.headers);
     if (!request.user.empty()) {
@@ -384,7 +497,7 @@ class Engine {
     curl_.easy_cleanup(exchange.easy);
     curl_.slist_free_all(exchange.headers);
     exchange.done = true;
-    last_end_ = std::chrono::steady_clock::now();
+    last_end_ = Clock::now();
     finished_.notify_all();
   }
 
@@ -435,7 +548,11 @@ class Engine {
   bool running_ = false;
   bool stopping_ = false;
   std::deque<ExchangePtr> incoming_;
-  std::chrono::steady_clock::time_point last_end_;
+  std::set<int> sockets_;  // the transport thread's own
+  Clock::time_point last_end_;
+  unsigned begun_rounds_ = 0;
+  unsigned ended_rounds_ = 0;
+  RetryClock *clock_ = &RetryClock::system();
 };
 
 std::optional<std::chrono::milliseconds> retry_after(const HttpAnswer &answer) {
@@ -463,6 +580,10 @@ std::string HttpAnswer::header(const std::string &name) const {
 HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request) {
   return Engine::get().perform(ticket, request);
 }
+
+void set_http_clock(RetryClock *clock) { Engine::get().set_clock(clock); }
+
+void wake_http() { Engine::get().wake(); }
 
 Outcome outcome_of(const HttpAnswer &answer, const char *what) {
   if (!answer.complete()) return answer.problem;

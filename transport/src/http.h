@@ -15,9 +15,13 @@
 #include <vector>
 
 #include "outcome.h"
+#include "retry.h"
 #include "ticket.h"
 
 namespace transport {
+
+/** An exchange in which nothing moves for so long is given up. */
+constexpr std::chrono::seconds kStallTime{30};
 
 /** Answers that are kept in memory are cut off with an error beyond this. */
 constexpr std::size_t kMaxAnswerBytes = 16 * 1024 * 1024;
@@ -32,7 +36,7 @@ struct HttpRequest {
   std::string signature;
   std::string ca_file; /**< empty: the system's authorities */
 
-  long seconds = 0; /**< for the whole exchange; 0: as long as something moves */
+  long seconds = 0; /**< for the whole exchange; 0: as long as something moves, see kStallTime */
 
   bool has_body = false;
   std::string body; /**< sent when body_fd is none */
@@ -58,6 +62,13 @@ struct HttpAnswer {
 
 /** Blocks until the answer is there or @p ticket is cancelled. Any thread. */
 HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request);
+
+/** Have another clock for stalls and limits; null: the real one. */
+void set_http_clock(RetryClock *clock);
+
+/** Have the transport thread take everything that came and look at its clock before this returns.
+ */
+void wake_http();
 
 /**
  * The outcome that an answer means for any store: transient where it is worth
