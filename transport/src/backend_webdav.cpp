@@ -56,6 +56,7 @@ struct Uploaded {
   bool answered = false;    // the server has come to an end with it
   bool complete = false;
   bool move_asked = false;
+  bool was_lost = false;         // its folder was deleted before it was moved
   int refusals = 0;              // of content where there was room for a name
   int failed_preconditions = 0;  // that should have held
 
@@ -239,15 +240,19 @@ class WebdavBackend : public Backend {
     if (!conditions.header.empty()) request.headers.push_back(conditions.header);
     uploaded->move_asked = true;
     const HttpAnswer answer = http_perform(ticket, request);
-    if (answer.good() && answer.status != kHttpMultiStatus) return success();
+    if (has_status(answer, kHttpMultiStatus))
+      return failure(BACKUP_TRANS_ERROR_SERVER, "upload: the server did not move it");
+    if (answer.good()) return success();
+    Outcome result = of_upload(dav_outcome(answer, "upload"));
     if (is_absent(answer) || has_status(answer, kHttpConflict)) {
       if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
-      // The folder was deleted, and what had been sent with it.
+      // The folder was deleted, and what had been sent with it; not again and again.
       forget("");
-      uploaded->settle();
-      return again("upload: the folder was deleted meanwhile");
+      result.transient = !uploaded->was_lost;
+      uploaded->was_lost = true;
+      uploaded->give_up();
     }
-    return dav_outcome(answer, "upload");
+    return result;
   }
 
   // To most servers a folder in the object's place is a thing that may be replaced with everything
@@ -469,7 +474,7 @@ class WebdavBackend : public Backend {
       // What was cut off may come to lie there after it was looked for.
       const bool may_come = is_absent(answer) && !left.answered;
       if (!answer.complete() || answer.good() || (is_absent(answer) && !may_come)) break;
-      ticket.pause(pause);
+      http_pause(ticket, pause);
       answer = http_perform(ticket, request);
     }
     if (answer.complete() && left.answered && !left.complete)

@@ -35,6 +35,9 @@ struct DavEntry {
 bool parse_multistatus(const std::string &xml, const std::string &host,
                        std::vector<DavEntry> *entries);
 
+/** The token of the lock that has that owner, in angle brackets; "" when there is none. */
+std::string parse_lock_token(const std::string &xml, const std::string &owner);
+
 }  // namespace transport
 
 #endif

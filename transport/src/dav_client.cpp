@@ -11,6 +11,7 @@ namespace {
 
 constexpr int64_t kLeftoverSeconds = 24L * 60 * 60;
 constexpr int kRedirection = 3;
+constexpr int kUnlockAttempts = 2;
 constexpr int kStatusClass = 100;
 constexpr char kStoredDot[] = "%2E";
 constexpr char kStoredPercent[] = "%25";
@@ -20,15 +21,24 @@ constexpr char kPropfind[] =
     "<?xml version=\"1.0\" encoding=\"utf-8\"?>"
     "<d:propfind xmlns:d=\"DAV:\"><d:prop><d:resourcetype/><d:getcontentlength/>"
     "<d:getlastmodified/></d:prop></d:propfind>";
+constexpr char kFindLocks[] =
+    "<?xml version=\"1.0\" encoding=\"utf-8\"?>"
+    "<d:propfind xmlns:d=\"DAV:\"><d:prop><d:lockdiscovery/></d:prop></d:propfind>";
 constexpr char kLockInfo[] =
     "<?xml version=\"1.0\" encoding=\"utf-8\"?>"
     "<d:lockinfo xmlns:d=\"DAV:\"><d:lockscope><d:exclusive/></d:lockscope>"
-    "<d:locktype><d:write/></d:locktype></d:lockinfo>";
+    "<d:locktype><d:write/></d:locktype><d:owner>";
+constexpr char kLockInfoEnd[] = "</d:owner></d:lockinfo>";
 constexpr char kXmlType[] = "Content-Type: application/xml; charset=utf-8";
 
 // Old enough that nobody is sending it any more, by the server's own clock.
 bool is_leftover(const DavEntry &entry, const std::optional<int64_t> &now) {
   return now && entry.modified && *now - *entry.modified > kLeftoverSeconds;
+}
+
+// There is no answer yet, or one that does not tell.
+bool outcome_is_open(const HttpAnswer &answer) {
+  return answer.status == 0 || outcome_of(answer, "").transient;
 }
 
 }  // namespace
@@ -85,12 +95,17 @@ HttpAnswer DavClient::send(Ticket &ticket, const char *method, const std::string
   return http_perform(ticket, request_for(method, path));
 }
 
-HttpAnswer DavClient::propfind(Ticket &ticket, const std::string &folder, const char *depth) const {
+HttpRequest DavClient::question(const char *body, const std::string &folder,
+                                const char *depth) const {
   HttpRequest request = request_for("PROPFIND", folder + "/");
   request.has_body = true;
-  request.body = kPropfind;
+  request.body = body;
   request.headers = {kXmlType, std::string("Depth: ") + depth};
-  return http_perform(ticket, request);
+  return request;
+}
+
+HttpAnswer DavClient::propfind(Ticket &ticket, const std::string &folder, const char *depth) const {
+  return http_perform(ticket, question(kPropfind, folder, depth));
 }
 
 bool DavClient::read_listing(const HttpAnswer &answer, const std::string &folder,
@@ -121,9 +136,7 @@ bool DavClient::read_listing(const HttpAnswer &answer, const std::string &folder
 
 Outcome DavClient::list(Ticket &ticket, const std::string &folder, DavListing *listing) const {
   const HttpAnswer answer = propfind(ticket, folder, "1");
-  const bool means_object = answer.complete() && (answer.status / kStatusClass == kRedirection ||
-                                                  answer.status == kHttpMethodNotAllowed);
-  if (is_absent(answer) || means_object) return no_such_object();
+  if (is_absent(answer)) return no_such_object();
   if (!answer.good()) {
     const Outcome problem = dav_outcome(answer, "list");
     // Some find an object's name with a slash too odd to say that there is nothing.
@@ -163,13 +176,25 @@ bool DavClient::is_object(Ticket &ticket, std::string path) const {
 Outcome DavClient::lock(Ticket &ticket, const std::string &folder, std::string *token) const {
   HttpRequest request = request_for("LOCK", folder + "/");
   request.has_body = true;
-  request.body = kLockInfo;
+  const std::string owner = make_temporary_name();
+  request.body = kLockInfo + owner + kLockInfoEnd;
   request.headers = {kXmlType, "Depth: infinity", "Timeout: Second-30"};
   const HttpAnswer answer = http_perform(ticket, request);
   if (has_status(answer, kHttpMethodNotAllowed) || has_status(answer, kHttpNotImplemented))
     return success();
-  if (!answer.good()) return dav_outcome(answer, "lock");
-  *token = answer.header("lock-token");
+  const bool done = answer.status / kStatusClass == kHttpOk / kStatusClass;
+  *token = done ? answer.header("lock-token") : "";
+  const Outcome result = done && !token->empty() ? success() : dav_outcome(answer, "lock");
+  // An answer that was lost, or an error on its way, does not tell that there is no lock now, and
+  // ours would keep us out like everybody else.
+  const bool unclear = result.transient || ticket.cancelled();
+  if (!result.ok() && unclear && !has_status(answer, kHttpLocked))
+    *token = find_lock(folder, owner);
+  if (ticket.cancelled()) {
+    unlock(folder, *token);
+    return cancelled();
+  }
+  if (!result.ok() && token->empty()) return result;
   if (answer.status != kHttpCreated) return success();
   // There was nothing, and now there is an empty object where a folder was wanted.
   HttpRequest removal = request_for("DELETE", folder);
@@ -186,7 +211,18 @@ void DavClient::unlock(const std::string &folder, const std::string &token) cons
   request.headers = {"Lock-Token: " + token};
   request.seconds = kTidyUpSeconds;
   Ticket own;
-  http_perform(own, request);
+  HttpAnswer answer;
+  for (int i = 0; i < kUnlockAttempts && outcome_is_open(answer); ++i)
+    answer = http_perform(own, request);
+}
+
+// "" when there is none.
+std::string DavClient::find_lock(const std::string &folder, const std::string &owner) const {
+  HttpRequest request = question(kFindLocks, folder, "0");
+  request.seconds = kTidyUpSeconds;
+  Ticket own;
+  const HttpAnswer answer = http_perform(own, request);
+  return has_status(answer, kHttpMultiStatus) ? parse_lock_token(answer.body, owner) : "";
 }
 
 std::string DavClient::lock_condition(const std::string &folder, const std::string &token) const {

@@ -87,6 +87,8 @@ class DavClient {
   bool means_folder(const HttpAnswer &answer, const std::string &path) const;
 
  private:
+  HttpRequest question(const char *body, const std::string &folder, const char *depth) const;
+  std::string find_lock(const std::string &folder, const std::string &owner) const;
   HttpAnswer propfind(Ticket &ticket, const std::string &folder, const char *depth) const;
   bool is_object(Ticket &ticket, std::string path) const;
   bool read_listing(const HttpAnswer &answer, const std::string &folder, DavListing *listing,

@@ -89,6 +89,19 @@ void read_properties(const xmlNode *response, bool slash, DavEntry *entry) {
   entry->size = entry->is_collection ? 0 : size;
 }
 
+std::string find_token(const xmlNode *node, const std::string &owner) {
+  const xmlNode *named = child_named(node, "owner");
+  const xmlNode *token = child_named(node, "locktoken");
+  const xmlNode *href = token == nullptr ? nullptr : child_named(token, "href");
+  if (named != nullptr && href != nullptr && text_of(named) == owner)
+    return "<" + text_of(href) + ">";
+  for (const xmlNode *child = node->children; child != nullptr; child = child->next) {
+    const std::string found = find_token(child, owner);
+    if (!found.empty()) return found;
+  }
+  return "";
+}
+
 }  // namespace
 
 bool parse_multistatus(const std::string &xml, const std::string &host,
@@ -110,6 +123,11 @@ bool parse_multistatus(const std::string &xml, const std::string &host,
     entries->push_back(std::move(entry));
   }
   return true;
+}
+
+std::string parse_lock_token(const std::string &xml, const std::string &owner) {
+  const XmlAnswer document = parse_xml(xml);
+  return document ? find_token(xmlDocGetRootElement(document.get()), owner) : "";
 }
 
 }  // namespace transport

@@ -266,6 +266,11 @@ class Engine {
     clock_ = clock == nullptr ? &RetryClock::system() : clock;
   }
 
+  RetryClock *clock() {
+    const Lock lock(mutex_);
+    return clock_;
+  }
+
   void wake() {
     Lock lock(mutex_);
     if (!running_) return;
@@ -579,6 +584,10 @@ std::string HttpAnswer::header(const std::string &name) const {
 
 HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request) {
   return Engine::get().perform(ticket, request);
+}
+
+bool http_pause(Ticket &ticket, std::chrono::milliseconds duration) {
+  return Engine::get().clock()->pause(ticket, duration);
 }
 
 void set_http_clock(RetryClock *clock) { Engine::get().set_clock(clock); }

@@ -63,7 +63,10 @@ struct HttpAnswer {
 /** Blocks until the answer is there or @p ticket is cancelled. Any thread. */
 HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request);
 
-/** Have another clock for stalls and limits; null: the real one. */
+/** Wait between two exchanges. @return false when @p ticket was cancelled before the end */
+bool http_pause(Ticket &ticket, std::chrono::milliseconds duration);
+
+/** Have another clock for stalls, limits and pauses; null: the real one. */
 void set_http_clock(RetryClock *clock);
 
 /** Have the transport thread take everything that came and look at its clock before this returns.

@@ -279,4 +279,17 @@ TEST(DavXml, NameMayBeAsLongAsTheAnswer) {
 
 TEST(DavXml, EmptyListing) { EXPECT_EQ(parsed(document("")), Texts{}); }
 
+TEST(LockToken, IsFoundByItsOwner) {
+  const std::string xml =
+      "<?xml version=\"1.0\"?><x:multistatus xmlns:x=\"DAV:\"><x:response><x:href>/f/</x:href>"
+      "<x:propstat><x:prop><x:lockdiscovery>"
+      "<x:activelock><x:owner>somebody</x:owner><x:locktoken><x:href>urn:1</x:href></x:locktoken>"
+      "</x:activelock>"
+      "<x:activelock><x:owner> me\n</x:owner><x:locktoken><x:href>urn:2</x:href></x:locktoken>"
+      "</x:activelock></x:lockdiscovery></x:prop></x:propstat></x:response></x:multistatus>";
+  EXPECT_EQ(transport::parse_lock_token(xml, "me"), "<urn:2>");
+  EXPECT_EQ(transport::parse_lock_token(xml, "you"), "");
+  EXPECT_EQ(transport::parse_lock_token("<garbage", "me"), "");
+}
+
 }  // namespace
