@@ -21,6 +21,15 @@ std::string tag_of(const std::string &content) {
   return tag;
 }
 
+// The content of the first element of that name with the prefix "d".
+std::string element_of(const std::string &xml, const std::string &name) {
+  const std::string open = "<d:" + name + ">";
+  const std::size_t begin = xml.find(open);
+  if (begin == std::string::npos) return "";
+  const std::size_t end = xml.find("</d:" + name + ">", begin);
+  return xml.substr(begin + open.size(), end - begin - open.size());
+}
+
 // "" for what is not below the root.
 std::string path_of(const std::string &decoded) {
   if (!is_within(decoded, DavModel::kRoot)) return "";
@@ -75,7 +84,7 @@ Response DavModel::serve(const Request &request) {
   const std::string &method = request.method;
   if (method == "GET" || method == "HEAD") return get(request, path);
   if (method == "PROPFIND") return list(request, path);
-  if (method == "LOCK") return lock(path);
+  if (method == "LOCK") return lock(request, path);
   if (method == "UNLOCK") return unlock(request, path);
   if (locked(request, path)) return 423;
   if (method == "PUT") return put_object(request, path);
@@ -96,10 +105,10 @@ bool DavModel::authorized(const Request &request) const {
 // Whoever names the token in a condition holds the lock.
 bool DavModel::locked(const Request &request, const std::string &path) const {
   const std::string condition = request.header("if");
-  for (const auto &[held, token] : locks_) {
+  for (const auto &[held, lock] : locks_) {
     const bool concerned =
         is_within(path, held) || (request.method == "DELETE" && is_within(held, path));
-    if (concerned && condition.find(token) == std::string::npos) return true;
+    if (concerned && condition.find(lock.token) == std::string::npos) return true;
   }
   return false;
 }
@@ -181,7 +190,13 @@ std::string DavModel::description(const std::string &path) const {
     text += "<getcontentlength>" + std::to_string(content.size()) + "</getcontentlength><getetag>" +
             tag_of(content) + "</getetag>";
   }
-  return text + "</prop><status>HTTP/1.1 200 OK</status></propstat></response>";
+  const auto held = locks_.find(path);
+  text += "<lockdiscovery>";
+  if (held != locks_.end()) {
+    text += "<activelock><owner>" + held->second.owner + "</owner><locktoken><href>" +
+            held->second.token + "</href></locktoken></activelock>";
+  }
+  return text + "</lockdiscovery></prop><status>HTTP/1.1 200 OK</status></propstat></response>";
 }
 
 Response DavModel::list(const Request &request, const std::string &path) const {
@@ -198,13 +213,13 @@ Response DavModel::list(const Request &request, const std::string &path) const {
   return {207, {{"Content-Type", "application/xml"}}, text + "</multistatus>"};
 }
 
-Response DavModel::lock(const std::string &path) {
+Response DavModel::lock(const Request &request, const std::string &path) {
   if (!path.empty() && nodes_.count(path) == 0) return 404;
   for (const auto &[held, ignored] : locks_) {
     if (is_within(path, held) || is_within(held, path)) return 423;
   }
   const std::string token = "opaquelocktoken:" + std::to_string(++tokens_);
-  locks_[path] = token;
+  locks_[path] = {token, element_of(request.body, "owner")};
   return {
       200,
       {{"Lock-Token", "<" + token + ">"}, {"Content-Type", "application/xml"}},
@@ -214,7 +229,8 @@ Response DavModel::lock(const std::string &path) {
 
 Response DavModel::unlock(const Request &request, const std::string &path) {
   const auto held = locks_.find(path);
-  if (held == locks_.end() || request.header("lock-token") != "<" + held->second + ">") return 409;
+  if (held == locks_.end() || request.header("lock-token") != "<" + held->second.token + ">")
+    return 409;
   locks_.erase(held);
   return 204;
 }

@@ -31,6 +31,10 @@ class DavModel : public front::Service {
   std::size_t locks() const;
 
  private:
+  struct Lock {
+    std::string token;
+    std::string owner;
+  };
   struct Node {
     bool is_collection = false;
     std::string content;
@@ -42,7 +46,7 @@ class DavModel : public front::Service {
   front::Response remove(const std::string &path);
   front::Response move(const front::Request &request, const std::string &path);
   front::Response list(const front::Request &request, const std::string &path) const;
-  front::Response lock(const std::string &path);
+  front::Response lock(const front::Request &request, const std::string &path);
   front::Response unlock(const front::Request &request, const std::string &path);
   bool authorized(const front::Request &request) const;
   bool locked(const front::Request &request, const std::string &path) const;
@@ -54,8 +58,8 @@ class DavModel : public front::Service {
   std::string password_ = "right";
   std::size_t room_ = static_cast<std::size_t>(-1);
   int tokens_ = 0;
-  std::map<std::string, Node> nodes_;         // without a trailing slash; "" is the root, not here
-  std::map<std::string, std::string> locks_;  // tokens by path
+  std::map<std::string, Node> nodes_;  // without a trailing slash; "" is the root, not here
+  std::map<std::string, Lock> locks_;  // by path
 };
 
 #endif

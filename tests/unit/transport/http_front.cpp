@@ -33,6 +33,8 @@ constexpr int kReceiveBufferBytes = 8 * 1024;
 // How long a fault that ends nothing is waited for before time passes once more.
 constexpr int kStallPatienceMs = 2000;
 constexpr char kHeadEnd[] = "\r\n\r\n";
+constexpr char kBadRequest[] = "HTTP/1.1 400 Bad Request\r\nConnection: close\r\n\r\n";
+constexpr char kEcho[] = "{authorization}";
 
 sockaddr_in loopback(int port) {
   sockaddr_in address{};
@@ -132,12 +134,22 @@ bool parse_head(const std::string &head, Request *request) {
   return true;
 }
 
+std::string echoed(const Request &request, std::string text) {
+  const std::size_t at = text.find(kEcho);
+  return at == std::string::npos
+             ? text
+             : text.replace(at, std::strlen(kEcho), request.header("authorization"));
+}
+
 std::string wire_text(const Request &request, Response response) {
   if (!response.raw.empty()) return response.raw;
+  response.body = echoed(request, std::move(response.body));
+  response.reason = echoed(request, std::move(response.reason));
   if (response.headers.count("Transfer-Encoding") == 0)
     response.headers.emplace("Content-Length", std::to_string(response.body.size()));
   std::string text = "HTTP/1.1 " + std::to_string(response.status) + " " + response.reason + "\r\n";
-  for (const auto &[name, value] : response.headers) text += name + ": " + value + "\r\n";
+  for (const auto &[name, value] : response.headers)
+    text += name + ": " + echoed(request, value) + "\r\n";
   text += "\r\n";
   return request.method == "HEAD" ? text : text + response.body;
 }
@@ -260,7 +272,6 @@ void Front::set_rules(std::vector<Rule> rules) {
   const Lock lock(mutex_);
   rules_.clear();
   for (Rule &rule : rules) rules_.push_back({std::move(rule)});
-  spoiled_ = 0;
 }
 
 int Front::count(std::size_t rule) const {
@@ -271,11 +282,6 @@ int Front::count(std::size_t rule) const {
 std::vector<std::string> Front::log() const {
   const Lock lock(mutex_);
   return log_;
-}
-
-std::string Front::received() const {
-  const Lock lock(mutex_);
-  return received_;
 }
 
 void Front::refuse() {
@@ -309,9 +315,14 @@ void Front::set_time(std::function<void(milliseconds)> pass) {
   pass_ = std::move(pass);
 }
 
-bool Front::wait_spoiled(int number, milliseconds patience) {
-  Lock lock(mutex_);
-  return changed_.wait_for(lock, patience, [&] { return spoiled_ >= number; });
+void Front::fall_silent() {
+  const Lock lock(mutex_);
+  silent_ = true;
+}
+
+bool Front::is_stalling() const {
+  const Lock lock(mutex_);
+  return stalling_ > 0;
 }
 
 void Front::pass(milliseconds time) {
@@ -357,6 +368,15 @@ void Front::accept_all() {
 }
 
 void Front::serve(Connection &connection) {
+  bool silent = false;
+  {
+    const Lock lock(mutex_);
+    silent = silent_;
+  }
+  if (silent) {
+    stall(connection);
+    return;
+  }
   if (!connection.greet()) return;
   while (serve_one(connection)) {
   }
@@ -369,11 +389,10 @@ Fault Front::fault_for(const Request &request, bool *takes_effect) {
     const Rule &rule = counted.rule;
     if (!rule.method.empty() && rule.method != request.method) continue;
     if (request.target.find(rule.target) == std::string::npos) continue;
+    if (!rule.header.empty() && request.header(rule.header) != rule.value) continue;
     ++counted.seen;
     if (counted.seen < rule.first || counted.seen > rule.last) continue;
     *takes_effect = rule.takes_effect;
-    ++spoiled_;
-    changed_.notify_all();
     return rule.fault;
   }
   return {};
@@ -388,9 +407,15 @@ bool Front::wait_released(const Connection &connection) {
 
 // Ends with the connection.
 void Front::stall(Connection &connection) {
+  {
+    const Lock lock(mutex_);
+    ++stalling_;
+  }
   do {
     pass(transport::kStallTime);
   } while (!connection.wait_for_end(kStallPatienceMs));
+  const Lock lock(mutex_);
+  --stalling_;
 }
 
 bool Front::serve_one(Connection &connection) {
@@ -399,6 +424,11 @@ bool Front::serve_one(Connection &connection) {
   while ((head_size = pending.find(kHeadEnd)) == std::string::npos) {
     if (pending.size() > kMaxHeadBytes || !connection.read_some(kBufferBytes, &pending))
       return false;
+    // Where HTTP is spoken, TLS is a bad request.
+    if (!g_ascii_isupper(pending[0])) {
+      connection.write_all(kBadRequest, std::strlen(kBadRequest));
+      return false;
+    }
   }
   head_size += std::strlen(kHeadEnd);
   Request request;
@@ -419,10 +449,6 @@ bool Front::serve_one(Connection &connection) {
   while (whole && pending.size() < wanted) {
     whole = connection.read_some(std::min(step, wanted - pending.size()), &pending);
     if (fault.spoil == Spoil::slow) pass(std::chrono::seconds(1));
-  }
-  {
-    const Lock lock(mutex_);
-    received_.append(pending, 0, size);
   }
   if (!whole) return false;
   if (fault.spoil == Spoil::reset_request) connection.reset();

@@ -35,6 +35,7 @@ struct Request {
   std::string header(const std::string &name) const;
 };
 
+/** "{authorization}" in it stands for what the request says there. */
 struct Response {
   Response(int status_code = 200, std::map<std::string, std::string> fields = {},
            std::string content = "")
@@ -82,8 +83,10 @@ constexpr int kForEver = std::numeric_limits<int>::max();
 
 /** The requests of a method whose target holds a text, counted from one. */
 struct Rule {
-  std::string method; /**< "" is any */
-  std::string target; /**< "" is any */
+  std::string method;      /**< "" is any */
+  std::string target;      /**< "" is any */
+  std::string header = {}; /**< "" is any; else its value is the next one */
+  std::string value = {};
   int first = 1;
   int last = kForEver;
   /** The service sees the request although its answer is never given. */
@@ -113,9 +116,6 @@ class Front {
 
   /** All requests in order, "METHOD target". */
   std::vector<std::string> log() const;
-  /** Everything that came over all connections, to look for what must not be sent. */
-  std::string received() const;
-
   /** Connections are refused, those that are there are cut. */
   void refuse();
   void accept_again();
@@ -127,8 +127,11 @@ class Front {
   /** Called where a fault takes time, instead of taking it. */
   void set_time(std::function<void(std::chrono::milliseconds)> pass);
 
-  /** Wait for @p number requests that a rule spoiled. */
-  bool wait_spoiled(int number, std::chrono::milliseconds patience);
+  /** From now on a connection is taken, and nothing is said on it. */
+  void fall_silent();
+
+  /** Does a fault hold up a connection now? */
+  bool is_stalling() const;
 
  private:
   class Connection;
@@ -157,10 +160,10 @@ class Front {
   bool listening_ = false;
   bool stopping_ = false;
   bool held_ = false;
-  int spoiled_ = 0;
+  bool silent_ = false;
+  int stalling_ = 0;
   std::vector<Counted> rules_;
   std::vector<std::string> log_;
-  std::string received_;
   std::vector<Connection *> connections_;
   std::vector<std::thread> threads_;
   std::function<void(std::chrono::milliseconds)> pass_;

@@ -1,0 +1,15 @@
+/**
+ * @file network_kinds.h
+ * @brief The network stores that the fault matrix runs over.
+ */
+#ifndef TRANSPORT_NETWORK_KINDS_H
+#define TRANSPORT_NETWORK_KINDS_H
+
+#include <memory>
+
+#include "network_store.h"
+
+std::unique_ptr<NetworkStore> make_dav_network_store();
+std::unique_ptr<NetworkStore> make_s3_network_store();
+
+#endif
