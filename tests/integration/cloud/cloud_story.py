@@ -1,0 +1,186 @@
+#!/usr/bin/python3 -B
+"""cloud_story.py KIND: one device's backup, its change and its restore on another, over a store.
+
+KIND is file, swift or ceph.
+"""
+import os
+import signal
+import subprocess
+import sys
+import unittest
+import urllib.parse
+import urllib.request
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+sys.path.insert(0, os.path.join(HERE, ".."))
+from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+
+KIND = sys.argv.pop(1)
+SECRET = "never-to-be-seen-7c1f"
+BUCKET = "fleet"
+FIRST = "350000000000001"
+SECOND = "350000000000002"
+NOTES = "org.example.notes"
+BANK = "org.example.bank"
+
+
+class FileStore:
+    """A folder."""
+
+    user = None
+
+    def __init__(self, folder):
+        self.root = os.path.join(folder, "store")
+        self.url = "file://" + self.root
+
+    def objects(self):
+        found = {}
+        for folder, _, names in os.walk(self.root):
+            for name in names:
+                path = os.path.join(folder, name)
+                with open(path, "rb") as file:
+                    found[os.path.relpath(path, self.root)] = file.read()
+        return found
+
+    def logs(self):
+        return ""
+
+    def close(self):
+        pass
+
+
+class S3Store:
+    """A bucket of a service that a launcher beside this file starts."""
+
+    LAUNCHERS = {"swift": ("swift_cluster.py", "test:device", "test:admin"),
+                 "ceph": ("ceph_gateway.py", "device", "device:swift")}
+
+    def __init__(self, folder):
+        script, self.user, self.admin = self.LAUNCHERS[KIND]
+        self.folder = os.path.join(folder, "service")
+        os.mkdir(self.folder)
+        with open(os.path.join(self.folder, "secret"), "w") as file:
+            file.write(SECRET)
+        self.process = subprocess.Popen([os.path.join(HERE, script), self.folder],
+                                        start_new_session=True)
+        ready = os.path.join(self.folder, "ready")
+        wait_until(lambda: os.path.exists(ready) or self.process.poll() is not None,
+                   "the service is ready", 120)
+        with open(ready) as file:
+            self.port = file.read().split()[0]
+        answer = self.ask("http://127.0.0.1:%s/auth/v1.0" % self.port,
+                          {"X-Auth-User": self.admin, "X-Auth-Key": "admin"})
+        self.storage = answer.headers["X-Storage-Url"]
+        self.token = {"X-Auth-Token": answer.headers["X-Auth-Token"]}
+        self.ask(self.storage + "/" + BUCKET, self.token, "PUT")
+        self.url = "s3+http://127.0.0.1:%s/%s/of%%20mine" % (self.port, BUCKET)
+
+    @staticmethod
+    def ask(url, headers, method="GET"):
+        return urllib.request.urlopen(
+            urllib.request.Request(url, headers=headers, method=method), timeout=60)
+
+    def objects(self):
+        bucket = self.storage + "/" + BUCKET
+        names = self.ask(bucket, self.token).read().decode().splitlines()
+        return {name[len("of mine/"):]:
+                self.ask(bucket + "/" + urllib.parse.quote(name), self.token).read()
+                for name in names}
+
+    def logs(self):
+        text = ""
+        for name in os.listdir(os.path.join(self.folder, "log")):
+            with open(os.path.join(self.folder, "log", name), errors="replace") as file:
+                text += file.read()
+        return text
+
+    def close(self):
+        self.process.send_signal(signal.SIGTERM)
+        self.process.wait()
+
+
+class CloudStory(TestCase):
+    def setUp(self):
+        # In the directory of the test, which its devices see.
+        self.store = (FileStore if KIND == "file" else S3Store)(self.directory)
+        self.addCleanup(self.store.close)
+
+    def device_on_store(self, serial):
+        device = self.new_device(serial=serial, account="ada")
+        if self.store.user is None:
+            device.set("cloud", self.store.url)
+        else:
+            device.call("set", "cloud", self.store.url, "--user", self.store.user,
+                        input=SECRET + "\n")
+        device.start()
+        return device
+
+    def install(self, device, package, version="1.0.0", **files):
+        source = self.path("source-%s-%s-%s" % (device.serial, package, version))
+        device.install(make_source(source, package, version,
+                                   {"data/" + name: content for name, content in files.items()}))
+
+    def backup(self, device):
+        result = device.quarnctl("backup", check=False)
+        self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
+
+    def read(self, device, package, name):
+        with open(device.app_path(package, "data/" + name), "rb") as file:
+            return file.read()
+
+    def test_backup_change_and_restore_on_another_device(self):
+        first = self.device_on_store(FIRST)
+        large = os.urandom(3000000)
+        self.install(first, NOTES, text=b"first words", large=large)
+        self.install(first, BANK, account=b"1")
+        self.backup(first)
+        notes = "%s/%s/1.0.0/%s.zip" % (FIRST, NOTES, NOTES)
+        bank = "%s/%s/1.0.0/%s.zip" % (FIRST, BANK, BANK)
+        before = self.store.objects()
+        self.assertEqual(set(before), {"app_list/app_list.txt", notes, bank})
+
+        with open(first.app_path(NOTES, "data/text"), "r+b") as file:
+            file.write(b"other words")
+        self.backup(first)
+        after = self.store.objects()
+        self.assertEqual(set(after), set(before))
+        self.assertNotEqual(after[notes], before[notes])
+        self.assertEqual(after[bank], before[bank])
+
+        self.install(first, BANK, "2.0.0")
+        self.backup(first)
+        newer = "%s/%s/2.0.0/%s.zip" % (FIRST, BANK, BANK)
+        self.assertEqual(set(self.store.objects()), {"app_list/app_list.txt", notes, newer})
+
+        second = self.device_on_store(SECOND)
+        watcher = subprocess.Popen(
+            [second.tool, "exec", second.path, "--", "quarnctl", "restore", "on", "--from", FIRST,
+             "--watch"], stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        try:
+            self.assertIn("restore mode is on for 2 packages", watcher.stdout.readline())
+            self.install(second, NOTES)
+            self.install(second, BANK, "2.0.0")
+            out, err = watcher.communicate(timeout=120)
+        finally:
+            watcher.kill()
+        self.assertEqual(watcher.returncode, 0, out + err)
+        self.assertEqual(self.read(second, NOTES, "text"), b"other words")
+        self.assertEqual(self.read(second, NOTES, "large"), large)
+        self.assertEqual(self.read(second, BANK, "account"), b"1")
+
+        self.backup(second)
+        first.remove(BANK)
+        self.backup(first)
+        self.assertEqual(set(self.store.objects()),
+                         {"app_list/app_list.txt", notes,
+                          *(name.replace(FIRST, SECOND) for name in (notes, newer))})
+
+        for device in (first, second):
+            for name in os.listdir(os.path.join(device.path, "log")):
+                with open(os.path.join(device.path, "log", name), errors="replace") as file:
+                    self.assertNotIn(SECRET, file.read(), name)
+        self.assertNotIn(SECRET, self.store.logs())
+
+
+if __name__ == "__main__":
+    unittest.main()
