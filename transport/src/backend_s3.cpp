@@ -415,6 +415,8 @@ class S3Backend : public Backend {
     const HttpAnswer kept = head(ticket, upload.path);
     if (is_absent(kept)) return again("upload: it did not last");
     if (!kept.good()) return outcome(kept, "upload");
+    const std::string found = expected_md5(kept);
+    if (!found.empty() && found != sending.md5) return again("upload: something else is there");
     return has_size(kept, upload.source.size()) ? success()
                                                 : again("upload: it arrived incomplete");
   }
