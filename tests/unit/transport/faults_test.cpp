@@ -22,7 +22,8 @@ struct Kind {
 };
 
 const std::vector<Kind> &kinds() {
-  static const std::vector<Kind> all = {{"Dav", make_dav_network_store, &FaultRow::dav}};
+  static const std::vector<Kind> all = {{"Dav", make_dav_network_store, &FaultRow::dav},
+                                        {"S3", make_s3_network_store, &FaultRow::s3}};
   return all;
 }
 
