@@ -21,7 +21,8 @@ def measure(command, cwd=None):
     """Run a command; CPU seconds of it and its children, wall seconds."""
     start = time.monotonic()
     pid = os.posix_spawnp(command[0], command, os.environ,
-                          file_actions=[(os.POSIX_SPAWN_OPEN, 1, "/dev/null", os.O_WRONLY, 0)]) \
+                          file_actions=[(os.POSIX_SPAWN_OPEN, fd, "/dev/null", os.O_WRONLY, 0)
+                                        for fd in (1, 2)]) \
         if cwd is None else None
     if pid is None:
         process = subprocess.Popen(command, cwd=cwd, stdout=subprocess.DEVNULL)
@@ -56,12 +57,26 @@ class Table:
         sys.stdout.flush()
 
 
+ARCHIVE = "archive CPU / best of zip -1 and bsdtar"
+SIZE = "archive size / zip -1"
+UNPACK = "unpack CPU / bsdtar"
+RESTORE = "whole restore CPU / (cp -a and bsdtar -x)"
+REQUIRED = {
+    ARCHIVE: {"small": 0.40, "db": 0.30, "media": 0.15, "mixed": 0.25},
+    SIZE: {"small": 1.00, "db": 1.00, "media": 1.001, "mixed": 1.00},
+    UNPACK: {"small": 0.65, "db": 0.65, "media": 0.85, "mixed": 0.65},
+    RESTORE: {"small": 0.75, "db": 0.75, "media": 0.95, "mixed": 0.75},
+}
+CALLS_PER_FILE = 9
+
+
 class Checks:
     """Ratios and ceilings that are required; a short run allows them half as much again."""
 
     def __init__(self, slack):
         self.slack = slack
         self.failed = []
+        self.ratios = []
 
     def at_most(self, what, value, limit):
         allowed = limit * self.slack
@@ -72,64 +87,204 @@ class Checks:
         if value > limit:
             self.failed.append("%s is %s, allowed %s" % (what, value, limit))
 
+    def ratio(self, what, kind, value):
+        """One of REQUIRED, for the table of all of them."""
+        limit = REQUIRED[what][kind]
+        self.ratios.append((what, kind, value, limit))
+        self.at_most("%s of %s" % (what, kind), value, limit)
 
-def archives(tool, work, runs, checks):
+    def show(self):
+        if not self.ratios:
+            return
+        table = Table("ratio", *trees.TREES)
+        for what in REQUIRED:
+            cells = {kind: "%.3f of %.3f %s" % (value, limit, "PASS" if value <= limit else "MISS")
+                     for name, kind, value, limit in self.ratios if name == what}
+            table.add(what, *(cells.get(kind, "") for kind in trees.TREES))
+        table.show("Required ratios, medians of paired runs")
+
+
+class Disk:
+    """
+    A file system of its own below `path`: ext4 with a journal, as devices have it. What other
+    processes do to the machine's disk then changes nothing; an ext4 without a journal, for one,
+    looks through every inode deleted lately before it makes a file. Where no image can be
+    mounted it is a plain directory.
+    """
+
+    def __init__(self, path, mib):
+        self.path = path
+        self.image = path + ".img"
+        os.makedirs(path)
+        with open(self.image, "wb") as file:
+            file.truncate(mib * trees.MIB)
+        self.mounted = all(
+            shutil.which(command[0]) is not None and
+            subprocess.run(command, stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL,
+                           check=False).returncode == 0
+            for command in (["mkfs.ext4", "-q", "-F", self.image],
+                            ["mount", "-o", "loop", self.image, path]))
+
+    def __enter__(self):
+        return self
+
+    def __exit__(self, *exc):
+        if self.mounted:
+            subprocess.run(["umount", self.path], check=True)
+        os.unlink(self.image)
+
+
+def label_tree(root):
+    """Label everything as an application's data are, where this process may."""
+    paths = [root] + [os.path.join(folder, name) for folder, folders, names in os.walk(root)
+                      for name in folders + names]
+    for attribute in ("security.SMACK64", "user.quarn.SMACK64"):
+        try:
+            for path in paths:
+                os.setxattr(path, attribute, b"User::App::Bench")
+            return
+        except OSError:
+            continue
+
+
+def paired(runs, variants):
+    """
+    Run each variant (name: a callable that prepares a run and gives its command and directory)
+    once a round, after one round to warm up. CPU and wall seconds by name.
+    """
+    cpu = {name: [] for name in variants}
+    wall = {name: [] for name in variants}
+    for run in range(runs + 1):
+        for name, prepare in variants.items():
+            used, took = measure(*prepare(run))
+            if run > 0:
+                cpu[name].append(used)
+                wall[name].append(took)
+    return cpu, wall
+
+
+def median_ratio(values, others):
+    return median([value / other for value, other in zip(values, others)])
+
+
+def calls_per_file(tool, root, out, files):
+    """System calls of the writer for one file; None where nothing can be traced."""
+    if shutil.which("strace") is None:
+        return None
+    log = out + ".strace"
+    done = subprocess.run(["strace", "-f", "-c", "-o", log, tool, "pack", root, PACKAGE, out],
+                          check=False)
+    if done.returncode != 0:
+        return None
+    with open(log) as file:
+        total = [line.split() for line in file if line.rstrip().endswith("total")][-1]
+    return int(total[3 if len(total) > 4 else 2]) / files
+
+
+def pack_tree(tool, work, kind, root, runs, table, checks):
+    sizes = [os.path.getsize(os.path.join(folder, name))
+             for folder, _, names in os.walk(root) for name in names]
+    ours, theirs, tars = (os.path.join(work, name) for name in ("q.zip", "z.zip", "b.zip"))
+
+    def fresh(out, command, cwd=None):
+        def prepare(_):
+            if os.path.exists(out):
+                os.unlink(out)
+            return command, cwd
+        return prepare
+
+    cpu, wall = paired(runs, {
+        "q": fresh(ours, [tool, "pack", root, PACKAGE, ours]),
+        "z": fresh(theirs, ["zip", "-q", "-1", "-r", theirs, "data", "shared"], root),
+        "b": fresh(tars, ["bsdtar", "-c", "--format", "zip", "--options",
+                          "zip:compression=deflate,zip:compression-level=1", "-f", tars,
+                          "data", "shared"], root)})
+    best = median_ratio(cpu["q"], [min(z, b) for z, b in zip(cpu["z"], cpu["b"])])
+    size = os.path.getsize(ours) / os.path.getsize(theirs)
+    table.add(kind, len(sizes), "%.1f" % (sum(sizes) / trees.MIB),
+              *("%.3f" % median(cpu[name]) for name in "qzb"), "%.2f" % best,
+              "%.2f" % median_ratio(wall["q"], wall["z"]), "%.3f" % size,
+              "%.3f" % (os.path.getsize(ours) / os.path.getsize(tars)))
+    checks.ratio(ARCHIVE, kind, best)
+    checks.ratio(SIZE, kind, size)
+    if kind == "small":
+        calls = calls_per_file(tool, root, ours + ".traced", len(sizes))
+        if calls is not None:
+            print("\nsystem calls per archived small file: %.1f, at most %d" %
+                  (calls, CALLS_PER_FILE))
+            checks.hard("system calls per archived small file", calls, CALLS_PER_FILE)
+    return ours
+
+
+def unpack_tree(tool, disk, kind, archive, runs, table, checks):
+    kept = []
+
+    def into(name, command):
+        def prepare(run):
+            target = os.path.join(disk, "%s-%d-%s" % (kind, run, name))
+            os.makedirs(target)
+            kept.append(target)  # deleted when all is measured: deleting has consequences
+            return [target if part is None else part for part in command], None
+        return prepare
+
+    cpu, wall = paired(runs, {
+        "q": into("q", [tool, "unpack", None, PACKAGE, archive]),
+        "u": into("u", ["unzip", "-q", archive, "-d", None]),
+        "b": into("b", ["bsdtar", "-x", "-f", archive, "-C", None])})
+    by_tar = median_ratio(cpu["q"], cpu["b"])
+    table.add(kind, *("%.3f" % median(cpu[name]) for name in "qub"),
+              "%.2f" % median_ratio(cpu["q"], cpu["u"]), "%.2f" % by_tar,
+              "%.2f" % median_ratio(wall["q"], wall["u"]))
+    checks.ratio(UNPACK, kind, by_tar)
+    for target in kept:
+        shutil.rmtree(target)
+
+
+def restore_tree(tool, disk, kind, root, archive, runs, table, checks):
+    script = ('mkdir "$1/copy" && cp -a "$1/data" "$1/shared" "$1/copy" && '
+              'bsdtar -x -f "$2" -C "$1"')
+
+    def on_copy(name, command):
+        def prepare(run):
+            target = os.path.join(disk, "restore-%s-%d-%s" % (kind, run, name))
+            subprocess.run(["cp", "-a", root, target], check=True)
+            subprocess.run(["sync", "-f", target], check=True)  # else a restore's own sync does it
+            return [target if part is None else part for part in command], None
+        return prepare
+
+    cpu, wall = paired(runs, {
+        "q": on_copy("q", [tool, "restore", None, PACKAGE, archive]),
+        "c": on_copy("c", ["sh", "-c", script, "sh", None, archive])})
+    ratio = median_ratio(cpu["q"], cpu["c"])
+    table.add(kind, *("%.3f" % median(cpu[name]) for name in "qc"), "%.2f" % ratio,
+              "%.2f" % median_ratio(wall["q"], wall["c"]))
+    checks.ratio(RESTORE, kind, ratio)
+    for name in os.listdir(disk):
+        if name.startswith("restore-"):
+            shutil.rmtree(os.path.join(disk, name))
+
+
+def archives(bin_dir, work, runs, checks):
     pack = Table("tree", "files", "MiB", "quarnd CPU s", "zip -1 CPU s", "bsdtar CPU s",
-                 "CPU / zip -1", "CPU / best", "wall / zip -1", "size / zip -1", "size / bsdtar")
+                 "CPU / best", "wall / zip -1", "size / zip -1", "size / bsdtar")
     unpack = Table("tree", "quarnd CPU s", "unzip CPU s", "bsdtar CPU s", "CPU / unzip",
                    "CPU / bsdtar", "wall / unzip")
-    for kind in trees.TREES:
-        root = os.path.join(work, "tree-" + kind)
-        trees.make(kind, root)
-        sizes = [os.path.getsize(os.path.join(folder, name))
-                 for folder, _, names in os.walk(root) for name in names]
-        ours, theirs, tars = (os.path.join(work, name) for name in ("q.zip", "z.zip", "b.zip"))
-        cpu = {"q": [], "z": [], "b": []}
-        wall = {"q": [], "z": [], "b": []}
-        for run in range(runs + 1):
-            for key, command, cwd, out in (
-                    ("q", [tool, "pack", root, PACKAGE, ours], None, ours),
-                    ("z", ["zip", "-q", "-1", "-r", theirs, "data", "shared"], root, theirs),
-                    ("b", ["bsdtar", "-c", "--format", "zip", "--options",
-                           "zip:compression=deflate,zip:compression-level=1", "-f", tars,
-                           "data", "shared"], root, tars)):
-                if os.path.exists(out):
-                    os.unlink(out)
-                used, took = measure(command, cwd)
-                if run > 0:
-                    cpu[key].append(used)
-                    wall[key].append(took)
-        q, z, b = (median(cpu[key]) for key in "qzb")
-        best = median([x / min(y, w) for x, y, w in zip(cpu["q"], cpu["z"], cpu["b"])])
-        size = os.path.getsize(ours) / os.path.getsize(theirs)
-        pack.add(kind, len(sizes), "%.1f" % (sum(sizes) / trees.MIB), "%.3f" % q, "%.3f" % z,
-                 "%.3f" % b, "%.2f" % (q / z), "%.2f" % best,
-                 "%.2f" % (median(wall["q"]) / median(wall["z"])), "%.3f" % size,
-                 "%.3f" % (os.path.getsize(ours) / os.path.getsize(tars)))
-        checks.at_most("archive CPU of %s / zip -1" % kind, q / z, 1.0)
-        checks.at_most("archive size of %s / zip -1" % kind, size, 1.001)
-        cpu = {"q": [], "u": [], "b": []}
-        wall = {"q": [], "u": [], "b": []}
-        for run in range(runs + 1):
-            for key, command in (("q", [tool, "unpack", None, PACKAGE, ours]),
-                                 ("u", ["unzip", "-q", ours, "-d", None]),
-                                 ("b", ["bsdtar", "-x", "-f", ours, "-C", None])):
-                target = os.path.join(work, "out-" + key)
-                shutil.rmtree(target, ignore_errors=True)
-                os.makedirs(target)
-                used, took = measure([target if part is None else part for part in command])
-                if run > 0:
-                    cpu[key].append(used)
-                    wall[key].append(took)
-                shutil.rmtree(target)
-        q, u, b = (median(cpu[key]) for key in "qub")
-        by_tar = median([x / y for x, y in zip(cpu["q"], cpu["b"])])
-        unpack.add(kind, "%.3f" % q, "%.3f" % u, "%.3f" % b, "%.2f" % (q / u), "%.2f" % by_tar,
-                   "%.2f" % (median(wall["q"]) / median(wall["u"])))
-        checks.at_most("unpack CPU of %s / unzip" % kind, q / u, 1.0)
-        shutil.rmtree(root)
+    restore = Table("tree", "quarnd CPU s", "cp -a and bsdtar -x CPU s", "CPU ratio", "wall ratio")
+    tool = os.path.join(bin_dir, "archive_tool")
+    with Disk(os.path.join(work, "disk"), 3072) as disk:
+        for kind in trees.TREES:
+            root = os.path.join(disk.path, "tree-" + kind)
+            trees.make(kind, root)
+            label_tree(root)
+            archive = pack_tree(tool, work, kind, root, runs, pack, checks)
+            unpack_tree(tool, disk.path, kind, archive, runs, unpack, checks)
+            restore_tree(os.path.join(bin_dir, "restore_tool"), disk.path, kind, root, archive,
+                         runs, restore, checks)
+            shutil.rmtree(root)
     pack.show("Archive writing, %d paired runs" % runs)
     unpack.show("Archive reading (attributes not counted), %d paired runs" % runs)
+    restore.show("Whole restores (snapshot, unpacking, attributes), %d paired runs" % runs)
+    checks.show()
 
 
 class Device:
@@ -339,7 +494,7 @@ def main():
     wanted = options.only or ("archives", "fleet", "installed", "large")
     with tempfile.TemporaryDirectory(prefix="quarn-bench-") as work:
         if "archives" in wanted:
-            archives(os.path.join(bin_dir, "archive_tool"), work, 3 if options.short else 7, checks)
+            archives(bin_dir, work, 3 if options.short else 7, checks)
         if "fleet" in wanted:
             fleet(bin_dir, work, (10, 100) if options.short else (10, 100, 1000), checks)
         if "installed" in wanted:

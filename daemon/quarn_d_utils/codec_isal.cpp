@@ -12,8 +12,12 @@ namespace {
 
 // level 2 costs what level 1 costs, and makes smaller archives than zlib's level 1
 constexpr std::uint32_t kLevel = 2;
-constexpr std::size_t kPlainChunk = 256U << 10;
-constexpr std::size_t kDeflatedChunk = 64U << 10;
+// The library stores what it cannot compress only when a block's input and output both lie within
+// one call. Blocks therefore end with their chunk, and a chunk's output fits beside it.
+constexpr std::size_t kPlainChunk = 192U << 10;
+constexpr std::size_t kDeflatedChunk = 200U << 10;
+constexpr std::size_t kInflateInput = 64U << 10;
+constexpr std::size_t kInflateOutput = 256U << 10;
 
 struct DeflateMemory {
   isal_zstream stream;
@@ -24,8 +28,8 @@ struct DeflateMemory {
 
 struct InflateMemory {
   inflate_state state;
-  unsigned char deflated[kDeflatedChunk];
-  unsigned char plain[kPlainChunk];
+  unsigned char deflated[kInflateInput];
+  unsigned char plain[kInflateOutput];
 };
 
 static_assert(sizeof(DeflateMemory) <= kCodecMemory && sizeof(InflateMemory) <= kCodecMemory,
@@ -106,30 +110,24 @@ class IsalCodec : public Codec {
     *totals = {};
     CodecResult result = CodecResult::kDone;
     bool end = false;
-    start_output(&stream);
-    for (;;) {
-      if (stream.avail_in == 0 && !end) {
-        long count = source->read(out_->plain, kPlainChunk, &end);
-        if (count < 0) {
-          result = CodecResult::kSourceFailed;
-          count = 0;
-        }
-        if (count == 0) end = true;
-        totals->crc = isal_codec_crc32(totals->crc, out_->plain, static_cast<std::size_t>(count));
-        totals->plain += static_cast<std::uint64_t>(count);
-        stream.next_in = out_->plain;
-        stream.avail_in = static_cast<std::uint32_t>(count);
-        stream.end_of_stream = end ? 1 : 0;
-      }
-      if (isal_deflate(&stream) != COMP_OK) return CodecResult::kCorrupt;
-      const bool finished = stream.internal_state.state == ZSTATE_END;
-      if (stream.avail_out > 0 && !finished) continue;
-      const std::size_t made = kDeflatedChunk - stream.avail_out;
-      if (made > 0 && !sink->write(out_->deflated, made)) return CodecResult::kSinkFailed;
-      totals->deflated += made;
-      if (finished) return result;
-      start_output(&stream);
+    while (!end) {
+      const std::size_t count = fill(source, &end, &result);
+      totals->crc = isal_codec_crc32(totals->crc, out_->plain, count);
+      totals->plain += count;
+      stream.next_in = out_->plain;
+      stream.avail_in = static_cast<std::uint32_t>(count);
+      stream.end_of_stream = end ? 1 : 0;
+      stream.flush = end ? NO_FLUSH : SYNC_FLUSH;
+      do {
+        stream.next_out = out_->deflated;
+        stream.avail_out = kDeflatedChunk;
+        if (isal_deflate(&stream) != COMP_OK) return CodecResult::kCorrupt;
+        const std::size_t made = kDeflatedChunk - stream.avail_out;
+        if (made > 0 && !sink->write(out_->deflated, made)) return CodecResult::kSinkFailed;
+        totals->deflated += made;
+      } while (stream.avail_out == 0 && stream.internal_state.state != ZSTATE_END);
     }
+    return result;
   }
 
   CodecResult inflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) override {
@@ -142,7 +140,7 @@ class IsalCodec : public Codec {
     start_output(&state);
     for (;;) {
       if (state.avail_in == 0 && !end) {
-        const long count = source->read(in_->deflated, kDeflatedChunk, &end);
+        const long count = source->read(in_->deflated, kInflateInput, &end);
         if (count < 0) return CodecResult::kSourceFailed;
         if (count == 0) end = true;
         totals->deflated += static_cast<std::uint64_t>(count);
@@ -158,7 +156,7 @@ class IsalCodec : public Codec {
       const bool finished = state.block_state == ISAL_BLOCK_FINISH;
       const bool cut_off = !finished && end && state.avail_in == 0 && state.avail_out > 0;
       if (state.avail_out > 0 && !finished && !cut_off) continue;
-      const std::size_t made = kPlainChunk - state.avail_out;
+      const std::size_t made = kInflateOutput - state.avail_out;
       totals->crc = isal_codec_crc32(totals->crc, in_->plain, made);
       totals->plain += made;
       if (made > 0 && !sink->write(in_->plain, made)) return CodecResult::kSinkFailed;
@@ -169,13 +167,20 @@ class IsalCodec : public Codec {
   }
 
  private:
-  void start_output(isal_zstream *stream) {
-    stream->next_out = out_->deflated;
-    stream->avail_out = kDeflatedChunk;
+  /** The next chunk, full unless the source ends: its bounds decide what the output is. */
+  std::size_t fill(ByteSource *source, bool *end, CodecResult *result) {
+    std::size_t filled = 0;
+    while (filled < kPlainChunk && !*end) {
+      const long count = source->read(out_->plain + filled, kPlainChunk - filled, end);
+      if (count < 0) *result = CodecResult::kSourceFailed;
+      if (count <= 0) *end = true;
+      if (count > 0) filled += static_cast<std::size_t>(count);
+    }
+    return filled;
   }
   void start_output(inflate_state *state) {
     state->next_out = in_->plain;
-    state->avail_out = kPlainChunk;
+    state->avail_out = kInflateOutput;
   }
 
   CodecMemory<DeflateMemory> out_;

@@ -1,6 +1,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -23,17 +24,124 @@ constexpr const char *kDataDirs[] = {"data/", "shared/data/", "shared/trusted/"}
 
 enum class Extracted { kDone, kRefused, kFailed };
 
-zlib_filefunc64_def archive_functions() {
-  zlib_filefunc64_def table = {};
-  fill_fopen64_filefunc(&table);
-  // The archive was opened safely beforehand; minizip gets that file whatever its name.
-  table.zopen64_file = [](voidpf file, const void *, int) { return file; };
-  return table;
-}
+/**
+ * The archive file under minizip. Two pieces of it are in memory: one of the entries and one of
+ * the directory behind them, between which minizip goes to and fro.
+ */
+class ArchiveFile {
+ public:
+  ArchiveFile(UniqueFd fd, std::uint64_t size) : fd_(std::move(fd)), size_(size) {}
+  ArchiveFile(const ArchiveFile &) = delete;
+  ArchiveFile &operator=(const ArchiveFile &) = delete;
 
+  /** The file for minizip, which never writes or closes it. */
+  zlib_filefunc64_def functions() {
+    zlib_filefunc64_def table = {};
+    table.zopen64_file = [](voidpf self, const void *, int) { return self; };
+    table.zread_file = [](voidpf, voidpf self, void *data, uLong size) -> uLong {
+      return of(self)->read(static_cast<unsigned char *>(data), size);
+    };
+    table.zwrite_file = [](voidpf, voidpf, const void *, uLong) -> uLong { return 0; };
+    table.ztell64_file = [](voidpf, voidpf self) -> ZPOS64_T { return of(self)->position_; };
+    table.zseek64_file = [](voidpf, voidpf self, ZPOS64_T offset, int origin) -> long {
+      ArchiveFile *file = of(self);
+      file->position_ = offset + (origin == ZLIB_FILEFUNC_SEEK_CUR   ? file->position_
+                                  : origin == ZLIB_FILEFUNC_SEEK_END ? file->size_
+                                                                     : 0);
+      return 0;
+    };
+    table.zclose_file = [](voidpf, voidpf) -> int { return 0; };
+    table.zerror_file = [](voidpf, voidpf self) -> int { return of(self)->failed_ ? 1 : 0; };
+    table.opaque = this;
+    return table;
+  }
+
+  /** At most @p size bytes from @p offset: 0 at the end, -1 on failure. */
+  long read_at(std::uint64_t offset, unsigned char *data, std::size_t size) {
+    for (Piece &piece : pieces_) {
+      if (offset - piece.start < piece.size) return copy(&piece, offset, data, size);
+    }
+    if (size >= kPiece) return fetch(offset, data, size);
+    Piece &piece = pieces_[last_used_ == &pieces_[0] ? 1 : 0];
+    piece.size = 0;
+    // from a whole multiple on: minizip looks for the end record step by step backwards
+    piece.start = offset - offset % kPiece;
+    const long count = fetch(piece.start, piece.data, kPiece);
+    if (count < 0) return count;
+    piece.size = static_cast<std::size_t>(count);
+    return offset - piece.start < piece.size ? copy(&piece, offset, data, size) : 0;
+  }
+
+ private:
+  static constexpr std::size_t kPiece = 64U << 10;
+  struct Piece {
+    std::uint64_t start = 0;
+    std::size_t size = 0;
+    unsigned char data[kPiece];
+  };
+
+  static ArchiveFile *of(voidpf self) { return static_cast<ArchiveFile *>(self); }
+
+  std::size_t read(unsigned char *data, std::size_t size) {
+    std::size_t done = 0;
+    while (done < size) {
+      const long count = read_at(position_, data + done, size - done);
+      if (count <= 0) break;
+      done += static_cast<std::size_t>(count);
+      position_ += static_cast<std::uint64_t>(count);
+    }
+    return done;
+  }
+
+  long copy(Piece *piece, std::uint64_t offset, unsigned char *data, std::size_t size) {
+    last_used_ = piece;
+    const auto at = static_cast<std::size_t>(offset - piece->start);
+    const std::size_t count = std::min(size, piece->size - at);
+    std::memcpy(data, piece->data + at, count);
+    return static_cast<long>(count);
+  }
+
+  long fetch(std::uint64_t offset, unsigned char *data, std::size_t size) {
+    if (offset >= size_) return 0;
+    const ssize_t count =
+        TEMP_FAILURE_RETRY(pread(fd_.get(), data, size, static_cast<off_t>(offset)));
+    if (count < 0) failed_ = true;
+    return count;
+  }
+
+  UniqueFd fd_;
+  std::uint64_t size_;
+  std::uint64_t position_ = 0;
+  bool failed_ = false;
+  Piece *last_used_ = nullptr;
+  Piece pieces_[2];
+};
+
+/** The raw bytes of the archive's current entry. */
 class EntrySource : public ByteSource {
  public:
-  explicit EntrySource(unzFile archive) : archive_(archive) {}
+  EntrySource(ArchiveFile *file, unzFile archive, std::uint64_t size)
+      : file_(file), offset_(unzGetCurrentFileZStreamPos64(archive)), left_(size) {}
+  long read(unsigned char *data, std::size_t size, bool *end) override {
+    const long count = file_->read_at(offset_, data, std::min<std::uint64_t>(size, left_));
+    if (count < 0) return -1;
+    offset_ += static_cast<std::uint64_t>(count);
+    left_ -= static_cast<std::uint64_t>(count);
+    *end = left_ == 0 || count == 0;
+    return count;
+  }
+
+ private:
+  ArchiveFile *file_;
+  std::uint64_t offset_;
+  std::uint64_t left_;
+};
+
+/** The same through minizip, which counts their checksum: for an archive that somebody else opened.
+ */
+class LibrarySource : public ByteSource {
+ public:
+  explicit LibrarySource(unzFile archive) : archive_(archive) {}
   long read(unsigned char *data, std::size_t size, bool *end) override {
     const int count = unzReadCurrentFile(archive_, data, static_cast<unsigned int>(size));
     *end = count <= 0;
@@ -94,11 +202,7 @@ class Unpacker {
         working_(pkg_id, destination),
         root_(safe_open(destination, O_PATH | O_DIRECTORY)) {}
 
-  Extracted extract(unzFile archive, const char *name) {
-    unz_file_info64 info = {};
-    if (unzGetCurrentFileInfo64(archive, &info, nullptr, 0, nullptr, 0, nullptr, 0) != UNZ_OK) {
-      return Extracted::kFailed;
-    }
+  Extracted extract(ByteSource *source, const unz_file_info64 &info, const char *name) {
     const char *why = refusal(name, info);
     if (why != nullptr) return refuse(name, why);
     const std::string path = name;
@@ -118,7 +222,7 @@ class Unpacker {
       LOGE("fopen() failed, file is NULL %s", (destination_ + "/" + path).c_str());
       return Extracted::kFailed;
     }
-    return write(archive, info, &file, path);
+    return write(source, info, &file, path);
   }
 
  private:
@@ -154,6 +258,13 @@ class Unpacker {
   /** The folder of an entry, made when missing; the last one is kept open. -1 with errno. */
   int open_parent(const std::string &folder) {
     if (parent_ && folder == parent_name_) return parent_.get();
+    UniqueFd known(root_ ? safe_open_below(root_.get(), folder.c_str(), O_RDONLY | O_DIRECTORY)
+                         : UniqueFd());
+    if (known) {
+      parent_ = std::move(known);
+      parent_name_ = folder;
+      return parent_.get();
+    }
     UniqueFd at(root_ ? fcntl(root_.get(), F_DUPFD_CLOEXEC, 0) : -1);
     for (std::size_t start = 0; at && start <= folder.size();) {
       const std::size_t end = std::min(folder.find('/', start), folder.size());
@@ -179,22 +290,24 @@ class Unpacker {
   }
 
   /** A file that nobody else has open, whatever lay under its name. */
-  static int create(int parent, const char *name) {
+  int create(int parent, const char *name) {
     constexpr int kFlags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+    // where one name was taken the next one will be, and then this saves a call
+    if (expect_taken_) expect_taken_ = unlinkat(parent, name, 0) == 0;
     const int fd = openat(parent, name, kFlags, kFileMode);
     if (fd >= 0 || errno != EEXIST) return fd;
-    if (unlinkat(parent, name, 0) != 0) return -1;  // a directory stays
+    expect_taken_ = unlinkat(parent, name, 0) == 0;
+    if (!expect_taken_) return -1;  // a directory stays
     return openat(parent, name, kFlags, kFileMode);
   }
 
-  Extracted write(unzFile archive, const unz_file_info64 &info, UniqueFd *file,
+  Extracted write(ByteSource *source, const unz_file_info64 &info, UniqueFd *file,
                   const std::string &path) {
-    EntrySource source(archive);
     FileSink sink(file->get(), info.uncompressed_size);
     CodecTotals totals;
     const CodecResult result = info.compression_method == kStored
-                                   ? copy_stored(&source, &sink, &totals)
-                                   : codec_->inflate(&source, &sink, &totals);
+                                   ? copy_stored(source, &sink, &totals)
+                                   : codec_->inflate(source, &sink, &totals);
     const bool closed = close(file->release()) == 0;
     if (sink.too_long()) {
       unlinkat(parent_.get(), path.c_str() + path.rfind('/') + 1, 0);
@@ -217,26 +330,28 @@ class Unpacker {
   UniqueFd root_;
   UniqueFd parent_;
   std::string parent_name_;
+  bool expect_taken_ = false;  // files lie where the entries go
   std::unique_ptr<Codec> codec_;
 };
 
 struct CloseArchive {
   void operator()(void *archive) const { unzClose(archive); }
 };
-using Archive = std::unique_ptr<void, CloseArchive>;
+
+struct Archive {
+  std::unique_ptr<ArchiveFile> file;
+  std::unique_ptr<void, CloseArchive> handle;  // reads the file to its end
+};
 
 Archive open_archive(const char *zip_path) {
   UniqueFd fd = safe_open(zip_path, O_RDONLY | O_NONBLOCK);
-  if (!fd) return nullptr;
   struct stat status {};
-  if (fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return nullptr;
-  std::FILE *file = fdopen(fd.get(), "rb");
-  if (file == nullptr) return nullptr;
-  fd.release();
-  zlib_filefunc64_def functions = archive_functions();
-  functions.opaque = file;
-  Archive archive(unzOpen2_64(zip_path, &functions));
-  // minizip closes the file only once it has accepted it as an archive, or has failed after opening
+  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return {};
+  Archive archive;
+  archive.file =
+      std::make_unique<ArchiveFile>(std::move(fd), static_cast<std::uint64_t>(status.st_size));
+  zlib_filefunc64_def functions = archive.file->functions();
+  archive.handle.reset(unzOpen2_64(zip_path, &functions));
   return archive;
 }
 
@@ -257,7 +372,8 @@ bool announces_too_much(unzFile archive) {
 }
 
 /** One entry, under the names and with the messages of its steps. 14 when memory is out. */
-int unpack_entry(Unpacker *unpacker, unzFile archive, CString *name, unzip_report *report) {
+int unpack_entry(Unpacker *unpacker, const Archive &from, CString *name, unzip_report *report) {
+  unzFile archive = from.handle.get();
   const int opened = unzOpenCurrentFile2(archive, nullptr, nullptr, kRaw);
   if (opened != UNZ_OK) {
     LOGE("unzOpenCurrentFile() failed, unz_err = [%d]", opened);
@@ -283,7 +399,8 @@ int unpack_entry(Unpacker *unpacker, unzFile archive, CString *name, unzip_repor
     ++report->failed;
     return QUARN_OK;
   }
-  switch (unpacker->extract(archive, name->get())) {
+  EntrySource source(from.file.get(), archive, info.compressed_size);
+  switch (unpacker->extract(&source, info, name->get())) {
     case Extracted::kDone:
       ++report->extracted;
       return QUARN_OK;
@@ -304,15 +421,15 @@ int unzip_data(const char *pkg_id, const char *destination, const char *zip_path
                unzip_report *report) {
   *report = {};
   const Archive archive = open_archive(zip_path);
-  if (archive == nullptr) {
+  if (archive.handle == nullptr) {
     LOGE("unzOpen() failed, unzf is NULL");
     return QUARN_UNREADABLE;
   }
-  if (announces_too_much(archive.get())) {
+  if (announces_too_much(archive.handle.get())) {
     LOGE("refused archive %s: it unpacks to more than a backup can hold", zip_path);
     return QUARN_UNREADABLE;
   }
-  int at = unzGoToFirstFile(archive.get());
+  int at = unzGoToFirstFile(archive.handle.get());
   if (at != UNZ_OK) {
     LOGE("unzGoToFirstFile() failed, unz_err = [%d]", at);
     return QUARN_UNREADABLE;
@@ -320,12 +437,12 @@ int unzip_data(const char *pkg_id, const char *destination, const char *zip_path
   Unpacker unpacker(pkg_id, destination);
   CString name;
   unz_global_info64 global = {};
-  unzGetGlobalInfo64(archive.get(), &global);
+  unzGetGlobalInfo64(archive.handle.get(), &global);
   std::uint64_t visited = 0;
-  for (; at == UNZ_OK; at = unzGoToNextFile(archive.get())) {
+  for (; at == UNZ_OK; at = unzGoToNextFile(archive.handle.get())) {
     ++visited;
-    const int result = unpack_entry(&unpacker, archive.get(), &name, report);
-    unzCloseCurrentFile(archive.get());
+    const int result = unpack_entry(&unpacker, archive, &name, report);
+    unzCloseCurrentFile(archive.handle.get());
     if (result != QUARN_OK) return result;
   }
   // a directory that breaks off hides entries
@@ -340,5 +457,10 @@ int unzip_data(const char *pkg_id, const char *destination, const char *zip_path
 
 bool extract_file_from_zip(const char *pkg_id, const char *destination, unzFile archive,
                            const char *name) {
-  return Unpacker(pkg_id, destination).extract(archive, name) == Extracted::kDone;
+  unz_file_info64 info = {};
+  if (unzGetCurrentFileInfo64(archive, &info, nullptr, 0, nullptr, 0, nullptr, 0) != UNZ_OK) {
+    return false;
+  }
+  LibrarySource source(archive);
+  return Unpacker(pkg_id, destination).extract(&source, info, name) == Extracted::kDone;
 }

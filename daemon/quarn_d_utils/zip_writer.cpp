@@ -31,14 +31,14 @@ constexpr uLong kMadeByDefault = 0;
  */
 class ArchiveFile {
  public:
-  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) { buffer_.reserve(kBuffer); }
+  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) {}
   ArchiveFile(const ArchiveFile &) = delete;
   ArchiveFile &operator=(const ArchiveFile &) = delete;
 
   bool is_open() const { return static_cast<bool>(fd_); }
 
   /** Let the next header fit into memory. @return false when the file cannot be written */
-  bool make_room() { return !failed_ && (buffer_.size() + kHeaderRoom <= kBuffer || flush()); }
+  bool make_room() { return !failed_ && (filled_ + kHeaderRoom <= kBuffer || flush()); }
 
   zlib_filefunc64_def functions() {
     zlib_filefunc64_def table = {};
@@ -78,8 +78,8 @@ class ArchiveFile {
           continue;
         }
         taken = std::min(size, kBuffer - at);
-        if (buffer_.size() < at + taken) buffer_.resize(at + taken);
-        std::memcpy(&buffer_[at], data, taken);
+        std::memcpy(buffer_.get() + at, data, taken);
+        filled_ = std::max(filled_, at + taken);
       }
       position_ += taken;
       data += taken;
@@ -89,7 +89,7 @@ class ArchiveFile {
   }
 
   long seek(ZPOS64_T offset, int origin) {
-    const ZPOS64_T end = start_ + buffer_.size();
+    const ZPOS64_T end = start_ + filled_;
     const ZPOS64_T base = origin == ZLIB_FILEFUNC_SEEK_SET   ? 0
                           : origin == ZLIB_FILEFUNC_SEEK_CUR ? position_
                                                              : end;
@@ -99,9 +99,9 @@ class ArchiveFile {
   }
 
   bool flush() {
-    if (!write_at(buffer_.data(), buffer_.size(), start_)) return false;
-    start_ += buffer_.size();
-    buffer_.clear();
+    if (!write_at(buffer_.get(), filled_, start_)) return false;
+    start_ += filled_;
+    filled_ = 0;
     return true;
   }
 
@@ -126,7 +126,8 @@ class ArchiveFile {
   }
 
   UniqueFd fd_;
-  std::string buffer_;     // the file's bytes from start_ on
+  const std::unique_ptr<char[]> buffer_{new char[kBuffer]};  // the file's bytes from start_ on
+  std::size_t filled_ = 0;
   ZPOS64_T start_ = 0;     // bytes before it are in the file
   ZPOS64_T position_ = 0;  // where the next write goes
   bool failed_ = false;
@@ -147,16 +148,11 @@ class FileSource : public ByteSource {
     // one byte more than expected shows a file that grows, which must not grow the archive
     const std::uint64_t left = expected_ - total_;
     const std::size_t wanted = static_cast<std::size_t>(std::min<std::uint64_t>(size, left + 1));
-    std::size_t filled = 0;
-    while (filled < wanted) {
-      const ssize_t count = TEMP_FAILURE_RETRY(::read(fd_, data + filled, wanted - filled));
-      if (count < 0) return -1;
-      if (count == 0) {
-        *end = true;
-        break;
-      }
-      filled += static_cast<std::size_t>(count);
-    }
+    const ssize_t count = TEMP_FAILURE_RETRY(::read(fd_, data, wanted));
+    if (count < 0) return -1;
+    auto filled = static_cast<std::size_t>(count);
+    // a regular file gives less than was wanted only where it ends
+    *end = filled < wanted;
     if (filled > left) {
       grew_ = true;
       *end = true;
@@ -206,14 +202,16 @@ int open_entry(zipFile zip, const char *name) {
                                  0);
 }
 
+/** Open a regular file and tell its status; none when it is anything else. */
+UniqueFd open_regular_at(int dir, const char *name, struct stat *status) {
+  UniqueFd fd(openat(dir, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (!fd || fstat(fd.get(), status) != 0 || !S_ISREG(status->st_mode)) return {};
+  return fd;
+}
+
 /** One open file's bytes as the entry @p name. */
-bool add_open_file(zipFile zip, const char *path, const char *name, int fd, int *error) {
-  struct stat status {};
-  if (fstat(fd, &status) != 0 || !S_ISREG(status.st_mode)) {
-    LOGE("fopen() failed, file is NULL");
-    *error = QUARN_REFUSED;
-    return false;
-  }
+bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
+                   const struct stat &status, int *error) {
   if (archive_codec == nullptr) archive_codec = make_codec(CodecUse::kDeflate);
   if (archive_codec == nullptr) {
     LOGE("calloc() failed, buf is NULL");
@@ -269,7 +267,33 @@ bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, in
   return walk_dir(walk, dir.get(), path, depth);
 }
 
-bool walk_entry(Walk *walk, int parent, const char *name, std::string *path, int depth) {
+/** Record a file and pack it, when it could be opened. */
+void add_regular(Walk *walk, const std::string &path, const UniqueFd &fd,
+                 const struct stat &status) {
+  add_to_file_info_table(walk->table, walk->root.c_str(), path.c_str(), status, walk->error);
+  if (fd) {
+    add_open_file(walk->zip, path.c_str(), path.c_str() + walk->root.size() + 1, fd.get(), status,
+                  walk->error);
+  } else {
+    LOGE("fopen() failed, file is NULL");
+    *walk->error = QUARN_REFUSED;
+  }
+}
+
+/** What the directory calls a regular file, and is one that can be opened: the usual case. */
+bool walk_regular(Walk *walk, int parent, const char *name, const std::string &path, bool *noted) {
+  *noted = is_backup_file(path.c_str());
+  if (!*noted) return true;
+  struct stat status {};
+  const UniqueFd fd = open_regular_at(parent, name, &status);
+  if (fd) add_regular(walk, path, fd, status);
+  return static_cast<bool>(fd);
+}
+
+bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, int depth) {
+  const char *name = entry.d_name;
+  bool noted = false;
+  if (entry.d_type == DT_REG && walk_regular(walk, parent, name, *path, &noted)) return noted;
   struct stat status {};
   const int found = fstatat(parent, name, &status, AT_SYMLINK_NOFOLLOW);
   if (found != 0) {
@@ -284,15 +308,9 @@ bool walk_entry(Walk *walk, int parent, const char *name, std::string *path, int
   }
   if (S_ISREG(status.st_mode)) {
     if (!is_backup_file(path->c_str())) return false;
-    add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error);
-    const UniqueFd fd(openat(parent, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-    if (!fd) {
-      LOGE("fopen() failed, file is NULL");
-      *walk->error = QUARN_REFUSED;
-    } else {
-      add_open_file(walk->zip, path->c_str(), path->c_str() + walk->root.size() + 1, fd.get(),
-                    walk->error);
-    }
+    struct stat opened {};
+    const UniqueFd fd = open_regular_at(parent, name, &opened);
+    add_regular(walk, *path, fd, fd ? opened : status);
     return true;
   }
   if (S_ISLNK(status.st_mode)) {
@@ -312,7 +330,7 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
     if (is_dot_entry(entry->d_name)) continue;
     const PathStep step(path, entry->d_name);
     if (walk->working.contain(*path) || *path == archive_path) continue;
-    if (walk_entry(walk, dirfd(dir), entry->d_name, path, depth)) noted = true;
+    if (walk_entry(walk, dirfd(dir), *entry, path, depth)) noted = true;
   }
   return noted;
 }
@@ -398,20 +416,21 @@ bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, co
 
 bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error) {
   const UniqueFd fd = safe_open(file, O_RDONLY | O_NONBLOCK);
-  if (!fd) {
+  struct stat status {};
+  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) {
     LOGE("fopen() failed, file is NULL");
     *error = QUARN_REFUSED;
     return false;
   }
-  return add_open_file(zip, file, file + std::strlen(root) + 1, fd.get(), error);
+  return add_open_file(zip, file, file + std::strlen(root) + 1, fd.get(), status, error);
 }
 
 void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const char *pkg_id,
                                    const char *root, int *error) {
   const char *document = json_object_get_string(table->root);
-  const std::string text = document == nullptr ? "" : document;
+  std::string text = document == nullptr ? "" : document;
   const std::string path = std::string(root) + kTableDir + pkg_id + kTableSuffix;
-  const int written = write_string_to_file(text, path);
+  const int written = write_string_to_file(std::move(text), path);
   if (written != QUARN_OK) {
     LOGE("fail. insert_file_info_table_to_zip : %d", written);
     *error = written;

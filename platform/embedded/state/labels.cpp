@@ -3,7 +3,9 @@
 #include <sys/xattr.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
+#include <cstring>
 
 namespace embedded {
 namespace {
@@ -40,6 +42,31 @@ int write_attribute(const char *path, Links links, const char *name, const std::
                                  : lsetxattr(path, name, label.data(), label.size(), 0);
 }
 
+/** Which of the two an object may have. */
+struct Present {
+  bool kernel = true;
+  bool user = true;
+};
+
+/** False once an object had no label of the kernel's: of the next ones it is asked first. */
+std::atomic<bool> expect_kernel_label{true};
+
+bool lists(const char *names, ssize_t size, const char *name) {
+  for (const char *at = names; at < names + size; at += std::strlen(at) + 1) {
+    if (std::strcmp(at, name) == 0) return true;
+  }
+  return false;
+}
+
+/** One call tells what several that fail would: objects of a device are labelled alike. */
+Present attributes_present(const char *path, Links links, const Attribute &attribute) {
+  char names[512];
+  const ssize_t size = links == Links::kFollow ? listxattr(path, names, sizeof names)
+                                               : llistxattr(path, names, sizeof names);
+  if (size < 0) return {};
+  return {lists(names, size, attribute.kernel), lists(names, size, attribute.user)};
+}
+
 bool has_no_attribute() { return errno == ENODATA || errno == ENOTSUP || errno == EPERM; }
 
 }  // namespace
@@ -53,10 +80,16 @@ bool is_label(const std::string &label) {
 
 int read_label(const char *path, Links links, LabelKind kind, std::string *label) {
   const Attribute attribute = attribute_of(kind);
-  if (read_attribute(path, links, attribute.kernel, label) == 0) return 0;
-  if (!has_no_attribute()) return -1;
-  if (read_attribute(path, links, attribute.user, label) == 0) return 0;
-  if (!has_no_attribute()) return -1;
+  const Present present =
+      expect_kernel_label ? Present{} : attributes_present(path, links, attribute);
+  const bool found = present.kernel && read_attribute(path, links, attribute.kernel, label) == 0;
+  if (!found && present.kernel && !has_no_attribute()) return -1;
+  expect_kernel_label = found;
+  if (found) return 0;
+  if (present.user) {
+    if (read_attribute(path, links, attribute.user, label) == 0) return 0;
+    if (!has_no_attribute()) return -1;
+  }
   if (kind != LabelKind::kAccess) {
     errno = ENODATA;
     return -1;

@@ -139,6 +139,24 @@ TEST_P(ZipReader, ReplacesALinkAndDoesNotFollowIt) {
   EXPECT_TRUE(std::filesystem::is_regular_file(std::filesystem::symlink_status(root_ / "data/a")));
 }
 
+TEST_P(ZipReader, ReplacesWhatIsThereAndMakesWhatIsNotInAnyOrder) {
+  root_.file("data/a", "old");
+  root_.file("data/b", "old");
+  root_.file("data/d", "old");
+  root_.dir("data/e");
+  root_.file("data/f", "old");
+  EXPECT_EQ(unpack({deflated_entry("data/a", "1"), deflated_entry("data/b", "2"),
+                    deflated_entry("data/c", "3"), deflated_entry("data/d", "4"),
+                    deflated_entry("data/e", "5"), deflated_entry("data/f", "6")}),
+            QUARN_OK);
+  expect_report(5, 0, 1);
+  EXPECT_EQ(content_of(root_ / "data/a") + content_of(root_ / "data/b") +
+                content_of(root_ / "data/c") + content_of(root_ / "data/d") +
+                content_of(root_ / "data/f"),
+            "12346");
+  EXPECT_EQ(errors("fopen() failed, file is NULL " + root_ / "data/e"), 1);
+}
+
 TEST_P(ZipReader, OfTwoEntriesOfOneNameTheLastStays) {
   EXPECT_EQ(
       unpack({deflated_entry("data/a", "the first and longer"), deflated_entry("data/a", "2")}),
@@ -486,6 +504,33 @@ TEST_P(ZipReader, WithoutMemoryForTheCodecEveryEntryFails) {
   EXPECT_EQ(errors("calloc() failed, buf is NULL"), 2);
   EXPECT_EQ(errors("extract_file_from_zip() failed data/a"), 1);
   EXPECT_THAT(files(), IsEmpty());
+}
+
+TEST_P(ZipReader, AnArchiveThatCannotBeReadIs31) {
+  const Fault fault("pread", EIO, 0, 1000);
+  EXPECT_EQ(unpack({deflated_entry("data/a", "x")}), QUARN_UNREADABLE);
+  EXPECT_THAT(captured_texts(), ElementsAre("unzOpen() failed, unzf is NULL"));
+}
+
+TEST_P(ZipReader, AnEntryThatCannotBeReadIsCorrupt) {
+  const Fault fault("pread", EIO, 4);  // the directory is read by then, and a part of the data
+  EXPECT_EQ(unpack({stored_entry("data/a", std::string(700000, 'x'))}), QUARN_OK);
+  EXPECT_EQ(fault.hits(), 1);
+  expect_report(0, 0, 1);
+  EXPECT_THAT(captured_texts(), ElementsAre("archive entry data/a is corrupt",
+                                            "extract_file_from_zip() failed data/a"));
+}
+
+TEST_P(ZipReader, EntriesOfManyDirectoriesComeInAnyOrder) {
+  std::vector<ZipEntry> entries;
+  for (int i = 0; i < 60; ++i) {
+    entries.push_back(deflated_entry(
+        "data/" + std::to_string(i % 3) + "/" + std::to_string(i % 5) + "/" + std::to_string(i),
+        std::to_string(i)));
+  }
+  EXPECT_EQ(unpack(entries), QUARN_OK);
+  expect_report(60, 0, 0);
+  for (int i = 0; i < 60; ++i) EXPECT_EQ(content_of(root_ / entries[i].name), std::to_string(i));
 }
 
 TEST_P(ZipReader, AFileThatCannotBeWrittenIsLeftInPart) {
