@@ -1,10 +1,14 @@
 #!/usr/bin/python3 -B
 """cloud_story.py KIND: one device's backup, its change and its restore on another, over a store.
 
-KIND is file, swift or ceph.
+KIND is file, webdav, swift or ceph.
 """
+import base64
+import hashlib
 import os
+import pwd
 import signal
+import socket
 import subprocess
 import sys
 import unittest
@@ -47,6 +51,65 @@ class FileStore:
 
     def close(self):
         pass
+
+
+class WebdavStore:
+    """A collection of apache's WebDAV."""
+
+    user = "device"
+
+    def __init__(self, folder):
+        self.folder = os.path.join(folder, "service")
+        self.root = os.path.join(self.folder, "disk/of ada")
+        os.chmod(folder, 0o755)
+        nobody = pwd.getpwnam("nobody")
+        for name in ("disk", "htdocs", "state"):
+            os.makedirs(os.path.join(self.folder, name))
+            os.chown(os.path.join(self.folder, name), nobody.pw_uid, nobody.pw_gid)
+        digest = base64.b64encode(hashlib.sha1(SECRET.encode()).digest()).decode()
+        self.write("htpasswd", "%s:{SHA}%s\n" % (self.user, digest))
+        with socket.socket() as listener:
+            listener.bind(("127.0.0.1", 0))
+            self.port = listener.getsockname()[1]
+        with open(os.path.join(HERE, "apache.conf")) as file:
+            text = file.read()
+        self.write("server.conf",
+                   text.replace("@DIR@", self.folder).replace("@PORT@", str(self.port)))
+        self.process = subprocess.Popen(
+            ["/usr/sbin/apache2", "-f", os.path.join(self.folder, "server.conf"), "-DFOREGROUND"],
+            start_new_session=True)
+        wait_until(self.answers, "apache answers")
+        self.url = "webdav+http://127.0.0.1:%d/dav/of%%20ada" % self.port
+
+    def answers(self):
+        with socket.socket() as client:
+            return client.connect_ex(("127.0.0.1", self.port)) == 0
+
+    def write(self, name, text):
+        with open(os.path.join(self.folder, name), "w") as file:
+            file.write(text)
+
+    def objects(self):
+        found = {}
+        for folder, folders, names in os.walk(self.root):
+            # Where apache keeps track of locks.
+            folders[:] = [name for name in folders if name != ".DAV"]
+            for name in names:
+                path = os.path.join(folder, name)
+                with open(path, "rb") as file:
+                    found[os.path.relpath(path, self.root)] = file.read()
+        return found
+
+    def logs(self):
+        text = ""
+        for name in ("error.log", "requests.log"):
+            with open(os.path.join(self.folder, "state", name), errors="replace") as file:
+                text += file.read()
+        return text
+
+    def close(self):
+        os.killpg(self.process.pid, signal.SIGKILL)
+        self.process.wait()
 
 
 class S3Store:
@@ -102,7 +165,8 @@ class S3Store:
 class CloudStory(TestCase):
     def setUp(self):
         # In the directory of the test, which its devices see.
-        self.store = (FileStore if KIND == "file" else S3Store)(self.directory)
+        kinds = {"file": FileStore, "webdav": WebdavStore}
+        self.store = kinds.get(KIND, S3Store)(self.directory)
         self.addCleanup(self.store.close)
 
     def device_on_store(self, serial):
