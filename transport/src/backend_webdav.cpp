@@ -146,6 +146,7 @@ class WebdavBackend : public Backend {
     if (!result.ok()) return result;
     forget(folder);
     const HttpAnswer answer = client_.send(attempt.ticket, "DELETE", folder + "/");
+    if (has_status(answer, kHttpLocked)) look_at_lock(attempt.ticket, folder);
     if (has_status(answer, kHttpMultiStatus))
       return failure(BACKUP_TRANS_ERROR_SERVER, "delete: the server kept a part of the folder");
     if (!is_absent(answer) && !answer.good()) return dav_outcome(answer, "delete");
@@ -197,7 +198,7 @@ class WebdavBackend : public Backend {
                                                   : again("upload: it arrived incomplete");
   }
 
-  HttpAnswer put(Ticket &ticket, const Upload &upload, Uploaded *uploaded) const {
+  HttpAnswer put(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
     HttpRequest request = client_.request_for("PUT", uploaded->temporary);
     request.has_body = true;
     request.body_fd = upload.source.fd();
@@ -208,6 +209,7 @@ class WebdavBackend : public Backend {
     uploaded->answered = false;
     HttpAnswer answer = http_perform(ticket, request);
     uploaded->answered = answer.complete();
+    if (has_status(answer, kHttpLocked)) look_at_lock(ticket, parent_of(uploaded->temporary));
     return answer;
   }
 
@@ -307,6 +309,7 @@ class WebdavBackend : public Backend {
     Outcome result = client_.lock(ticket, folder, &token);
     if (!result.ok()) {
       forget("");
+      if (result.transient) look_at_lock(ticket, folder);
       return result;
     }
     result = move_if_unchanged(ticket, upload, uploaded, token);
@@ -381,6 +384,7 @@ class WebdavBackend : public Backend {
       if (!parent.ok()) return parent;
       answer = client_.send(ticket, "MKCOL", folder + "/");
     }
+    if (has_status(answer, kHttpLocked)) look_at_lock(ticket, parent_of(folder));
     // An answer that did not come does not tell that it was not made.
     if (!answer.complete() || has_status(answer, kHttpCreated)) uploaded->made_folder = folder;
     if (!answer.complete()) return answer.problem;
@@ -408,6 +412,25 @@ class WebdavBackend : public Backend {
       result.transient = true;
     }
     return result;
+  }
+
+  // Some servers keep the lock of a device that died for ever. One that was seen for longer than it
+  // can have been held is taken away.
+  void look_at_lock(Ticket &ticket, const std::string &folder) {
+    DavLock lock;
+    if (!client_.find_foreign_lock(ticket, folder, &lock)) return;
+    {
+      const std::lock_guard<std::mutex> guard(mutex_);
+      const auto now = std::chrono::steady_clock::now();
+      if (lock.token != seen_lock_) {
+        seen_lock_ = lock.token;
+        lock_seen_at_ = now;
+        return;
+      }
+      if (now - lock_seen_at_ <= kLockDuration) return;
+      seen_lock_.clear();
+    }
+    client_.break_lock(ticket, folder, lock);
   }
 
   bool is_known(const std::string &folder) {
@@ -485,6 +508,8 @@ class WebdavBackend : public Backend {
   const DavClient client_;
   std::mutex mutex_;
   std::set<std::string> known_;  // folders that were seen or made
+  std::string seen_lock_;        // the last one that was in the way
+  std::chrono::steady_clock::time_point lock_seen_at_;
 };
 
 }  // namespace

@@ -38,6 +38,17 @@ bool parse_multistatus(const std::string &xml, const std::string &host,
 /** The token of the lock that has that owner, in angle brackets; "" when there is none. */
 std::string parse_lock_token(const std::string &xml, const std::string &owner);
 
+/** A lock that somebody holds. */
+struct DavLock {
+  std::string owner;    /**< what its holder said of himself; may be empty */
+  std::string token;    /**< in angle brackets */
+  uint64_t seconds = 0; /**< how long it lasts; 0: not told, or for ever */
+  std::string root;     /**< path of the collection that is locked, as of DavEntry; may be empty */
+};
+
+/** The first lock that a multi-status document tells of; false when there is none. */
+bool parse_lock(const std::string &xml, const std::string &host, DavLock *lock);
+
 }  // namespace transport
 
 #endif

@@ -178,7 +178,8 @@ Outcome DavClient::lock(Ticket &ticket, const std::string &folder, std::string *
   request.has_body = true;
   const std::string owner = make_temporary_name();
   request.body = kLockInfo + owner + kLockInfoEnd;
-  request.headers = {kXmlType, "Depth: infinity", "Timeout: Second-30"};
+  request.headers = {kXmlType, "Depth: infinity",
+                     "Timeout: Second-" + std::to_string(kLockDuration.count())};
   const HttpAnswer answer = http_perform(ticket, request);
   if (has_status(answer, kHttpMethodNotAllowed) || has_status(answer, kHttpNotImplemented))
     return success();
@@ -223,6 +224,23 @@ std::string DavClient::find_lock(const std::string &folder, const std::string &o
   Ticket own;
   const HttpAnswer answer = http_perform(own, request);
   return has_status(answer, kHttpMultiStatus) ? parse_lock_token(answer.body, owner) : "";
+}
+
+bool DavClient::find_foreign_lock(Ticket &ticket, const std::string &folder, DavLock *lock) const {
+  const HttpAnswer answer = http_perform(ticket, question(kFindLocks, folder, "0"));
+  if (!has_status(answer, kHttpMultiStatus) || !parse_lock(answer.body, url_.host, lock))
+    return false;
+  // Some forget who the owner is; nobody else has locks as short as ours.
+  const bool as_ours =
+      lock->seconds > 0 && lock->seconds <= static_cast<uint64_t>(kLockDuration.count());
+  return is_temporary_name(lock->owner) || (lock->owner.empty() && as_ours);
+}
+
+void DavClient::break_lock(Ticket &ticket, const std::string &folder, const DavLock &lock) const {
+  HttpRequest request = request_for("UNLOCK", folder + "/");
+  if (!lock.root.empty()) request.url = url_.origin + encode_path(lock.root) + "/";
+  request.headers = {"Lock-Token: " + lock.token};
+  http_perform(ticket, request);
 }
 
 std::string DavClient::lock_condition(const std::string &folder, const std::string &token) const {

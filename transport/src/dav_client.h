@@ -7,6 +7,7 @@
 #ifndef BACKUP_TRANSPORT_DAV_CLIENT_H
 #define BACKUP_TRANSPORT_DAV_CLIENT_H
 
+#include <chrono>
 #include <string>
 #include <vector>
 
@@ -22,6 +23,9 @@ constexpr int kHttpCreated = 201;
 constexpr int kHttpMultiStatus = 207;
 constexpr int kHttpLocked = 423;
 constexpr int kHttpServerError = 500;
+
+/** How long a lock lasts whose holder does not give it back. */
+constexpr std::chrono::seconds kLockDuration{30};
 
 /** Seconds that a request may take that clears up behind another one. */
 constexpr long kTidyUpSeconds = 5;
@@ -75,6 +79,13 @@ class DavClient {
   Outcome lock(Ticket &ticket, const std::string &folder, std::string *token) const;
   /** Also after a cancellation: others would wait until the lock ends by itself. */
   void unlock(const std::string &folder, const std::string &token) const;
+  /**
+   * The lock of one of our devices that keeps others out of a folder.
+   * @return false when there is none, or the server does not tell
+   */
+  bool find_foreign_lock(Ticket &ticket, const std::string &folder, DavLock *lock) const;
+  /** Take it from its holder. */
+  void break_lock(Ticket &ticket, const std::string &folder, const DavLock &lock) const;
   /** The header that proves a lock. */
   std::string lock_condition(const std::string &folder, const std::string &token) const;
   /** The header that demands that an object is still the one with that tag. */

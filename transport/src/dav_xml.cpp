@@ -102,6 +102,34 @@ std::string find_token(const xmlNode *node, const std::string &owner) {
   return "";
 }
 
+// The first one in the document's order, wherever it is.
+const xmlNode *find_below(const xmlNode *parent, const char *name) {
+  for (const xmlNode *node = parent->children; node != nullptr; node = node->next) {
+    if (is_element(node, name)) return node;
+    const xmlNode *found = find_below(node, name);
+    if (found != nullptr) return found;
+  }
+  return nullptr;
+}
+
+// "Second-30"
+uint64_t seconds_in(const xmlNode *parent) {
+  static constexpr char kUnit[] = "Second-";
+  const xmlNode *node = child_named(parent, "timeout");
+  const std::string text = node == nullptr ? "" : text_of(node);
+  guint64 seconds = 0;
+  if (text.compare(0, sizeof kUnit - 1, kUnit) == 0)
+    g_ascii_string_to_unsigned(text.c_str() + sizeof kUnit - 1, kDecimal, 0, G_MAXUINT64, &seconds,
+                               nullptr);
+  return seconds;
+}
+
+std::string href_in(const xmlNode *parent, const char *name) {
+  const xmlNode *node = child_named(parent, name);
+  const xmlNode *href = node == nullptr ? nullptr : child_named(node, "href");
+  return href == nullptr ? "" : text_of(href);
+}
+
 }  // namespace
 
 bool parse_multistatus(const std::string &xml, const std::string &host,
@@ -128,6 +156,20 @@ bool parse_multistatus(const std::string &xml, const std::string &host,
 std::string parse_lock_token(const std::string &xml, const std::string &owner) {
   const XmlAnswer document = parse_xml(xml);
   return document ? find_token(xmlDocGetRootElement(document.get()), owner) : "";
+}
+
+bool parse_lock(const std::string &xml, const std::string &host, DavLock *lock) {
+  const XmlAnswer document = parse_xml(xml);
+  const xmlNode *root = document ? xmlDocGetRootElement(document.get()) : nullptr;
+  const xmlNode *active = root == nullptr ? nullptr : find_below(root, "activelock");
+  if (active == nullptr) return false;
+  const xmlNode *owner = child_named(active, "owner");
+  const std::string token = href_in(active, "locktoken");
+  lock->owner = owner == nullptr ? "" : text_of(owner);
+  lock->token = "<" + token + ">";
+  lock->seconds = seconds_in(active);
+  lock->root = path_of_href(href_in(active, "lockroot"), host);
+  return !token.empty();
 }
 
 }  // namespace transport

@@ -118,7 +118,8 @@ std::string lock_for_a_while(const DavClient &client, const char *seconds) {
   request.has_body = true;
   request.body =
       "<?xml version=\"1.0\"?><d:lockinfo xmlns:d=\"DAV:\"><d:lockscope><d:exclusive/>"
-      "</d:lockscope><d:locktype><d:write/></d:locktype></d:lockinfo>";
+      "</d:lockscope><d:locktype><d:write/></"
+      "d:locktype><d:owner>.quarn-part-0123456789abcdef01234567</d:owner></d:lockinfo>";
   request.headers = {"Content-Type: application/xml", "Depth: infinity",
                      std::string("Timeout: Second-") + seconds};
   const HttpAnswer answer = http_perform(ticket, request);
@@ -129,7 +130,7 @@ std::string lock_for_a_while(const DavClient &client, const char *seconds) {
 TEST_F(WebdavCase, LockOfADeviceThatDiedIsWaitedFor) {
   ASSERT_EQ(cloud.put(kList, "one"), 0);
   ASSERT_EQ(cloud.get(kList, BACKUP_TRANS_OPTION_BASIS), "one");
-  // One of the servers looks for locks that have ended once in 64 seconds.
+  // One of the servers never ends them.
   transport::RetryLimits limits;
   limits.longest_pause = seconds(1);
   transport::set_retry_clock(nullptr, limits);

@@ -292,4 +292,47 @@ TEST(LockToken, IsFoundByItsOwner) {
   EXPECT_EQ(transport::parse_lock_token("<garbage", "me"), "");
 }
 
+using transport::DavLock;
+using transport::parse_lock;
+
+std::string lock_document(const std::string &content) {
+  return document("<D:response><D:href>/f/</D:href><D:propstat><D:prop><D:lockdiscovery>" +
+                  content + "</D:lockdiscovery></D:prop></D:propstat></D:response>");
+}
+
+TEST(DavXml, LocksAreFound) {
+  DavLock lock;
+  ASSERT_TRUE(parse_lock(
+      lock_document(
+          "<D:activelock><D:owner> "
+          "quarnd\n</D:owner><D:timeout>Second-30</D:timeout><D:locktoken><D:href>urn:uuid:1"
+          "</D:href></D:locktoken><D:lockroot><D:href>/f%20x/</D:href></D:lockroot>"
+          "</D:activelock><D:activelock><D:owner>other</D:owner></D:activelock>"),
+      kHost, &lock));
+  EXPECT_EQ(lock.owner, "quarnd");
+  EXPECT_EQ(lock.token, "<urn:uuid:1>");
+  EXPECT_EQ(lock.root, "/f x");
+  EXPECT_EQ(lock.seconds, 30U);
+}
+
+TEST(DavXml, LocksMayTellLittle) {
+  DavLock lock;
+  ASSERT_TRUE(parse_lock(
+      lock_document("<D:activelock><D:locktoken><D:href>t</D:href></D:locktoken></D:activelock>"),
+      kHost, &lock));
+  EXPECT_EQ(lock.owner, "");
+  EXPECT_EQ(lock.token, "<t>");
+  EXPECT_EQ(lock.root, "");
+  EXPECT_EQ(lock.seconds, 0U);
+}
+
+TEST(DavXml, WhatIsNoLock) {
+  DavLock lock;
+  for (const std::string &xml :
+       {lock_document(""), lock_document("<D:activelock/>"),
+        lock_document("<D:activelock><D:locktoken/></D:activelock>"), std::string("garbage"),
+        std::string(R"(<D:activelock xmlns:D="DAV:"/>)"), std::string("<!DOCTYPE m>") + "<m/>"})
+    EXPECT_FALSE(parse_lock(xml, kHost, &lock)) << xml;
+}
+
 }  // namespace
