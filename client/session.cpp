@@ -112,6 +112,8 @@ class Session {
   void show_outcomes();
   void finish(int code, const std::string &error = "");
   void finish_with(int result, const std::string &what, const std::string &done);
+  /** A failure in which the cloud may have had its part: the daemon is asked for it first. */
+  void finish_explained(int code, const std::string &error);
 
   static gboolean on_interrupt(gpointer user_data);
   static gboolean on_timeout(gpointer user_data);
@@ -135,6 +137,7 @@ class Session {
   bool watching_ = false;
   bool reported_ = false; /**< a progress signal of ours has come */
   bool done_ = false;
+  bool explaining_ = false;  // failed; the daemon is asked what the cloud's part in it was
   bool at_once_ = false;
   int exit_ = QUARN_FAILED;
   guint timer_ = 0;
@@ -328,8 +331,9 @@ void Session::fetch_list(std::function<void(const BackupSets &)> then,
       if (list_client_ == kCompanionClient) {
         error = "making the archives failed: " + result_words(result) + "; is " + kPellixPackage +
                 " installed?";
+        return finish(exit_of(result), error);
       }
-      return otherwise ? otherwise(error) : finish(exit_of(result), error);
+      return otherwise ? otherwise(error) : finish_explained(exit_of(result), error);
     }
     if (!reply_ || !callback_) return;
     std::string error;
@@ -617,11 +621,11 @@ void Session::end_watch(bool mode_ended) {
   const int result = watched_result();
   show_outcomes();
   if (result == QUARN_OK) return finish_with(QUARN_OK, "", "restore finished");
-  finish(result, "not every package was restored: " + result_words(result));
+  finish_explained(result, "not every package was restored: " + result_words(result));
 }
 
 void Session::daemon_ended() {
-  if (done_ || !called_) return;
+  if (done_ || explaining_ || !called_) return;
   if (watching_ && all_told()) return end_watch(false);
   if (watching_) {
     std::string missing;
@@ -732,7 +736,27 @@ void Session::finish_with(int result, const std::string &what, const std::string
     screen_.line(printable(done));
     return finish(QUARN_OK);
   }
-  finish(exit_of(result), what + " failed: " + result_words(result));
+  const std::string error = what + " failed: " + result_words(result);
+  const bool cloud = result == QUARN_TRANSFER_FAILED || result == QUARN_LIST_CHECK_FAILED ||
+                     result == QUARN_FAILED;
+  return cloud ? finish_explained(exit_of(result), error) : finish(exit_of(result), error);
+}
+
+void Session::finish_explained(int code, const std::string &error) {
+  if (done_ || explaining_) return;
+  explaining_ = true;
+  client_->read_status(
+      [this, code, error](GVariant *answer) {
+        if (done_) return;
+        const std::string problem = read_status(answer).cloud_problem;
+        const std::string words = cloud_problem_words(problem);
+        if (words.empty()) return finish(code, error);
+        json_add(document_.get(), "cloud_problem", problem);
+        finish(code, error + ": " + words);
+      },
+      [this, code, error](const BusFailure &) {
+        if (!done_) finish(code, error);
+      });
 }
 
 void Session::finish(int code, const std::string &error) {

@@ -1,5 +1,7 @@
 #include "status.h"
 
+#include <map>
+
 #include "json_read.h"
 #include "quarn_handles.h"
 #include "text.h"
@@ -105,6 +107,18 @@ void add_time(json_object *object, const char *name, const std::optional<std::in
 
 }  // namespace
 
+std::string cloud_problem_words(const std::string &problem) {
+  static const std::map<std::string, const char *> kWords = {
+      {"address", "there is no such store at the cloud's address"},
+      {"certificate", "the cloud's certificate is not to be trusted"},
+      {"password", "the cloud refused the user name or password"},
+      {"space", "the cloud is full"},
+      {"network", "the cloud cannot be reached"},
+      {"server", "the cloud answered with an error"}};
+  const auto found = kWords.find(problem);
+  return found == kWords.end() ? "" : found->second;
+}
+
 DaemonStatus read_status(GVariant *answer) {
   const GVariantPtr properties(g_variant_get_child_value(answer, 0));
   GVariant *all = properties.get();
@@ -121,6 +135,7 @@ DaemonStatus read_status(GVariant *answer) {
   status.restore_candidates = texts_of(all, "RestoreCandidates");
   status.serial = text_of(all, "SerialNumber");
   status.model = text_of(all, "ModelName");
+  status.cloud_problem = text_of(all, "CloudProblem");
   return status;
 }
 
@@ -143,6 +158,7 @@ std::string status_text(const DaemonStatus &status, std::int64_t now_ms) {
   const bool both = !status.model.empty() && !status.serial.empty();
   std::string device = status.model + (both ? ", " : "") + status.serial;
   if (device.empty()) device = kUnknown;
+  const std::string problem = cloud_problem_words(status.cloud_problem);
   return line("device", printable(device)) +
          line("automatic backup", choice(status.auto_backup, "on", "off")) +
          line("charger", choice(status.charger, "connected", "not connected")) +
@@ -152,7 +168,8 @@ std::string status_text(const DaemonStatus &status, std::int64_t now_ms) {
          line("next alarm", alarm_text(status.next_alarm_ms, now_ms)) +
          line("last backup", last_backup_text(status, now_ms)) +
          line("backup", choice(status.backup_running, "running", "not running")) +
-         line("restore mode", restore_text(status));
+         line("restore mode", restore_text(status)) +
+         (problem.empty() ? "" : line("cloud", problem));
 }
 
 void status_to_json(const DaemonStatus &status, std::int64_t now_ms, json_object *object) {
@@ -168,6 +185,10 @@ void status_to_json(const DaemonStatus &status, std::int64_t now_ms, json_object
   const bool known = status.last_backup_ms && *status.last_backup_ms != 0;
   json_object_object_add(object, "last_backup_age_ms",
                          known ? json_object_new_int64(now_ms - *status.last_backup_ms) : nullptr);
+  json_object_object_add(object, "cloud_problem",
+                         status.cloud_problem.empty()
+                             ? nullptr
+                             : json_object_new_string(status.cloud_problem.c_str()));
   add_flag(object, "backup_running", status.backup_running);
   add_flag(object, "restore_mode", status.restore_mode);
   json_object *candidates = json_object_new_array();

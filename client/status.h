@@ -29,6 +29,7 @@ struct DaemonStatus {
   std::vector<std::string> restore_candidates;
   std::string serial;
   std::string model;
+  std::string cloud_problem; /**< one word; empty when there is none */
 };
 
 /** Reads the answer "(a{sv})" of the status object. */
@@ -40,6 +41,9 @@ std::string status_text(const DaemonStatus &status, std::int64_t now_ms);
 /** Adds the status to a JSON object: numbers in milliseconds, null for what is not known or none.
  */
 void status_to_json(const DaemonStatus &status, std::int64_t now_ms, json_object *object);
+
+/** What a word for the cloud's problem means; empty for none and for words of a later daemon. */
+std::string cloud_problem_words(const std::string &problem);
 
 /** A length of time in its largest two units: "3 d 4 h", "12 min 5 s". */
 std::string duration_text(std::int64_t ms);

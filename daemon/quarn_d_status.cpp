@@ -28,6 +28,9 @@ const char kStatusIntrospection[] =
     "<property name=\"BackupRunning\" type=\"b\" access=\"read\"/>"
     "<property name=\"RestoreMode\" type=\"b\" access=\"read\"/>"
     "<property name=\"RestoreCandidates\" type=\"as\" access=\"read\"/>"
+    "<property name=\"CloudProblem\" type=\"s\" access=\"read\">"
+    "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"false\"/>"
+    "</property>"
     "<property name=\"SerialNumber\" type=\"s\" access=\"read\">"
     "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"const\"/>"
     "</property>"
@@ -83,6 +86,12 @@ GVariant *device_text(bool serial) {
   return g_variant_new_string(text ? text.get() : "");
 }
 
+GVariant *cloud_problem() {
+  const backup_trans_cause cause = backup_trans_last_cause();
+  return g_variant_new_string(cause == BACKUP_TRANS_CAUSE_NONE ? ""
+                                                               : backup_trans_cause_word(cause));
+}
+
 GVariant *flag(bool value) { return g_variant_new_boolean(value ? TRUE : FALSE); }
 
 GVariant *value_of(const std::string &property) {
@@ -96,6 +105,7 @@ GVariant *value_of(const std::string &property) {
   if (property == "BackupRunning") return flag(backup_request_outstanding());
   if (property == "RestoreMode") return flag(restore_mode());
   if (property == "RestoreCandidates") return candidates();
+  if (property == "CloudProblem") return cloud_problem();
   if (property == "SerialNumber") return device_text(true);
   if (property == "ModelName") return device_text(false);
   return nullptr;

@@ -21,6 +21,8 @@ inline constexpr char kAlarmOwner[] = "quarn";
 enum device_exit : int {
   DEVICE_OK = 0,
   DEVICE_FAILED = 1,
+  /** cloud-check: this and the cause's number. */
+  DEVICE_CLOUD = 10,
   DEVICE_USAGE = 64,
 };
 
@@ -44,6 +46,9 @@ std::string bus_address(const std::string &device);
 /** The text of errno. */
 std::string reason();
 
+/** The verb was called the wrong way. */
+[[noreturn]] void wrong_use();
+
 /* lifecycle.cpp */
 int verb_start(const Arguments &arguments);
 int verb_stop(const Arguments &arguments);
@@ -52,6 +57,23 @@ int verb_exec(const Arguments &arguments);
 int verb_daemon(const Arguments &arguments);
 /** True when the device's supervisor lives. */
 bool is_started(const std::string &device);
+
+/* cloud.cpp */
+struct Cloud {
+  std::string url;
+  std::string user;       /**< empty: no credentials */
+  std::string password;   /**< never shown */
+  std::string ca_file;    /**< empty: the system's authorities */
+  std::string region;     /**< s3 only; empty: the usual one */
+  std::string addressing; /**< s3 only; empty: the usual one */
+};
+/** Fails when the transport could not take the URL. */
+void check_cloud_url(const std::string &url);
+/** Replaces the device's cloud, which the daemon uses from its next request on. */
+void write_cloud(const std::string &device, const Cloud &cloud);
+/** The verb `set DIR cloud URL ...`. */
+void set_cloud(const std::string &device, const Arguments &arguments);
+int verb_cloud_check(const Arguments &arguments);
 
 /* packages.cpp */
 int verb_install(const Arguments &arguments);

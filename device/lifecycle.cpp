@@ -56,8 +56,6 @@ constexpr char kReady = 'R';
 /** A daemon that asks for its restart gets it this often in a row. */
 constexpr int kMaxRestarts = 5;
 
-[[noreturn]] void wrong_use() { throw Failure("", DEVICE_USAGE); }
-
 struct Fd {
   explicit Fd(int number = -1) : fd(number) {}
   ~Fd() {

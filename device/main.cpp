@@ -44,7 +44,12 @@ constexpr Verb kVerbs[] = {
      "  account NAME|none             modem on|off\n"
      "  cloud URL [--user NAME [--password-file FILE]] [--ca-file FILE]\n"
      "            [--region NAME] [--addressing path|virtual]\n"
-     "The password of --user is read from the file, else from standard input."},
+     "The password of --user is read from the file, else from standard input. --ca-file names\n"
+     "authorities to be trusted instead of the system's; the last two are for s3."},
+    {"cloud-check", verb_cloud_check, "cloud-check DIR [--json]",
+     "Find out whether the device's cloud can be used: an object of a few bytes is put there, "
+     "read\nback and removed. One line tells what to look at: address, certificate, password, "
+     "space,\nnetwork, server or device."},
     {"setting", verb_setting, "setting DIR KEY [VALUE]", "Print or write a setting."},
     {"alarms", verb_alarms, "alarms DIR [--json]", "List the pending alarms."},
     {"fire", verb_fire, "fire DIR ALARM-ID",
@@ -82,6 +87,8 @@ bool asks_for_help(const Arguments &arguments) {
 }  // namespace
 
 std::string reason() { return std::strerror(errno); }
+
+void wrong_use() { throw Failure("", DEVICE_USAGE); }
 
 std::string program_directory() {
   char path[PATH_MAX];

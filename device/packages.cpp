@@ -21,8 +21,6 @@ constexpr gid_t kAppGroup = 5000;
 constexpr mode_t kModeBits = 07777;
 constexpr const char *kDataFolders[] = {"data", "shared/data", "shared/trusted"};
 
-[[noreturn]] void wrong_use() { throw Failure("", DEVICE_USAGE); }
-
 /** Owner, mode and label of an installed object; a link has no mode of its own. */
 void dress(const fs::path &path, mode_t mode, bool link, const std::string &label) {
   if (lchown(path.c_str(), kAppUser, kAppGroup) != 0) {

@@ -9,7 +9,6 @@
 #include <filesystem>
 #include <fstream>
 #include <iostream>
-#include <map>
 #include <random>
 
 #include "device.h"
@@ -24,13 +23,8 @@ namespace fs = std::filesystem;
 
 constexpr char kDefaultModel[] = "Orvane Embedded";
 constexpr char kDefaultAccount[] = "user";
-constexpr char kCloudFile[] = "cloud.conf";
-constexpr char kCloudGroup[] = "cloud";
-constexpr mode_t kPrivateFile = 0600;
 constexpr std::int64_t kFireMilliseconds = 20000;
 constexpr gulong kFirePauseMicroseconds = 5000;
-
-[[noreturn]] void wrong_use() { throw Failure("", DEVICE_USAGE); }
 
 /** An IMEI: 14 digits of the device's own and their check digit. */
 std::string new_serial() {
@@ -62,96 +56,6 @@ bool is_text(const std::string &value) {
   return !value.empty() && g_utf8_validate(value.c_str(), -1, nullptr) != FALSE &&
          std::none_of(value.begin(), value.end(),
                       [](char c) { return static_cast<unsigned char>(c) < 0x20; });
-}
-
-bool is_loopback(const std::string &host) {
-  return host == "localhost" || host == "127.0.0.1" || host == "::1" || host == "[::1]";
-}
-
-void check_url(const std::string &url) {
-  GError *error = nullptr;
-  GUri *uri = g_uri_parse(url.c_str(), G_URI_FLAGS_NONE, &error);
-  if (uri == nullptr) {
-    const std::string text = error->message;
-    g_error_free(error);
-    throw Failure("\"" + url + "\" is no cloud URL: " + text);
-  }
-  const std::string scheme = g_uri_get_scheme(uri);
-  const std::string host = g_uri_get_host(uri) == nullptr ? "" : g_uri_get_host(uri);
-  const std::string path = g_uri_get_path(uri);
-  const bool has_user = g_uri_get_userinfo(uri) != nullptr;
-  g_uri_unref(uri);
-  if (has_user) throw Failure("a cloud URL holds no user or password: use --user");
-  if (scheme == "file") {
-    if (!host.empty() || path.empty() || path[0] != '/') {
-      throw Failure("a folder is named file:///PATH");
-    }
-    return;
-  }
-  const bool encrypted = scheme == "webdav+https" || scheme == "s3+https";
-  const bool plain = scheme == "webdav+http" || scheme == "s3+http";
-  if (!encrypted && !plain) {
-    throw Failure("\"" + scheme + "\" is no kind of cloud: use file, webdav+https or s3+https");
-  }
-  if (host.empty()) throw Failure("\"" + url + "\" names no host");
-  if (plain && !is_loopback(host)) throw Failure("plain http is for this machine only: use https");
-}
-
-using CloudKeys = std::map<std::string, std::string>;
-
-void write_cloud(const std::string &device, const std::string &url, const CloudKeys &keys) {
-  check_url(url);
-  const embedded::KeyFilePtr file(g_key_file_new());
-  g_key_file_set_string(file.get(), kCloudGroup, "url", url.c_str());
-  for (const auto &[key, value] : keys)
-    g_key_file_set_string(file.get(), kCloudGroup, key.c_str(), value.c_str());
-  gsize length = 0;
-  const embedded::GText text(g_key_file_to_data(file.get(), &length, nullptr));
-  if (!embedded::write_state_text(device, kCloudFile, std::string(text.get(), length),
-                                  kPrivateFile)) {
-    throw Failure("cannot write the cloud's configuration: " + reason());
-  }
-}
-
-std::string read_line(std::istream &in) {
-  std::string line;
-  std::getline(in, line);
-  if (!line.empty() && line.back() == '\r') line.pop_back();
-  return line;
-}
-
-void set_cloud(const std::string &device, const Arguments &arguments) {
-  CloudKeys keys;
-  std::string password_file;
-  for (std::size_t i = 3; i < arguments.size(); i += 2) {
-    if (i + 1 >= arguments.size() || arguments[i + 1].empty()) wrong_use();
-    const std::string &option = arguments[i];
-    if (option == "--password-file") {
-      password_file = arguments[i + 1];
-    } else if (option == "--ca-file") {
-      keys["ca-file"] = fs::absolute(arguments[i + 1]).string();
-    } else if (option == "--user" || option == "--region" || option == "--addressing") {
-      keys[option.substr(2)] = arguments[i + 1];
-    } else {
-      wrong_use();
-    }
-  }
-  const bool has_user = keys.count("user") != 0;
-  if (!has_user && !password_file.empty()) wrong_use();
-  if (keys.count("addressing") != 0 && !is_one_of(keys["addressing"], {"path", "virtual"}))
-    wrong_use();
-  if (has_user) {
-    std::string &password = keys["password"];
-    if (password_file.empty()) {
-      password = read_line(std::cin);
-    } else {
-      std::ifstream file(password_file);
-      if (!file) throw Failure("cannot read " + password_file + ": " + reason());
-      password = read_line(file);
-    }
-    if (password.empty()) throw Failure("no password was given");
-  }
-  write_cloud(device, arguments[2], keys);
 }
 
 void set_fact(const std::string &device, const char *key, const std::string &value) {
@@ -218,7 +122,7 @@ int verb_create(const Arguments &arguments) {
   if (serial.find('/') != std::string::npos || serial == "." || serial == "..") {
     throw Failure("a serial number names a folder in the cloud: no slash, no dots alone");
   }
-  if (!cloud.empty()) check_url(cloud);
+  if (!cloud.empty()) check_cloud_url(cloud);
 
   const fs::path dir = fs::absolute(arguments[0]);
   std::error_code error;
@@ -241,7 +145,7 @@ int verb_create(const Arguments &arguments) {
   set_fact(device, embedded::kNetwork, "wifi");
   set_fact(device, embedded::kCharger, "off");
   set_fact(device, embedded::kDisplay, "on");
-  write_cloud(device, cloud.empty() ? file_url(device + "/cloud") : cloud, {});
+  write_cloud(device, {cloud.empty() ? file_url(device + "/cloud") : cloud, "", "", "", "", ""});
   return DEVICE_OK;
 }
 

@@ -72,6 +72,18 @@ typedef enum {
   BACKUP_TRANS_ERROR_CERTIFICATE = 18     /**< the server is not the one it says it is */
 } backup_trans_error_code;
 
+/** What a person should look at when a store cannot be used. */
+typedef enum {
+  BACKUP_TRANS_CAUSE_NONE = 0,        /**< nothing: the store can be used */
+  BACKUP_TRANS_CAUSE_ADDRESS = 1,     /**< no such host, or nothing there that is such a store */
+  BACKUP_TRANS_CAUSE_CERTIFICATE = 2, /**< the server's certificate is not to be trusted */
+  BACKUP_TRANS_CAUSE_PASSWORD = 3,    /**< user name, password or rights */
+  BACKUP_TRANS_CAUSE_SPACE = 4,       /**< the store has no room */
+  BACKUP_TRANS_CAUSE_NETWORK = 5,     /**< not reached, or lost on the way */
+  BACKUP_TRANS_CAUSE_SERVER = 6,      /**< the store answers with errors */
+  BACKUP_TRANS_CAUSE_DEVICE = 7       /**< the configuration, or a file of this device */
+} backup_trans_cause;
+
 /** Options of a request; combine with |. */
 enum {
   BACKUP_TRANS_OPTION_NONE = 0,
@@ -117,6 +129,13 @@ typedef void (*backup_trans_child_list_cb)(backup_trans_error_code error, void *
 /** Answer to a deletion. @p info names the folder, on an error as well. */
 typedef void (*backup_trans_delete_cb)(backup_trans_error_code error, void *user_data,
                                        const backup_trans_file_info_s *info);
+
+/**
+ * Answer to a check. @p message tells what was found out, for people, with what
+ * the server said; it holds no credentials.
+ */
+typedef void (*backup_trans_check_cb)(backup_trans_error_code error, void *user_data,
+                                      backup_trans_cause cause, const char *message);
 
 /**
  * Start the library.
@@ -194,6 +213,22 @@ int backup_trans_delete_folder_ors_async(backup_trans_handle_h handle, const cha
                                          void *user_data, backup_trans_delete_cb callback);
 
 /**
+ * Find out whether the store can be used now, and what to look at if not: its
+ * top is listed, and an object of a few bytes is put into a folder of its own,
+ * read back and removed. Nothing is tried twice.
+ */
+int backup_trans_check_async(backup_trans_handle_h handle, void *user_data,
+                             backup_trans_check_cb callback);
+
+/**
+ * What kept the last request, of any handle, from being served. An object that
+ * is not there or has changed is no such thing, and what was cancelled or
+ * failed on the device does not count. #BACKUP_TRANS_CAUSE_NONE before the
+ * first request. Any thread.
+ */
+backup_trans_cause backup_trans_last_cause(void);
+
+/**
  * End everything in flight on the handle: each request's callback follows with
  * #BACKUP_TRANS_ERROR_CANCELLED within a second, unless it had already ended
  * otherwise. A NULL handle is accepted and nothing happens.
@@ -202,6 +237,9 @@ void backup_trans_cancel_request(backup_trans_handle_h handle);
 
 /** A few words for people about a result; static. */
 const char *backup_trans_error_text(backup_trans_error_code error);
+
+/** One word for a cause ("password", ...); static. */
+const char *backup_trans_cause_word(backup_trans_cause cause);
 
 #ifdef __cplusplus
 }

@@ -179,6 +179,8 @@ std::size_t take_header(char *buffer, std::size_t size, std::size_t count, void 
     exchange.answer.status = space == std::string::npos
                                  ? 0
                                  : static_cast<int>(std::strtol(line.c_str() + space, nullptr, 10));
+    const std::size_t words = space == std::string::npos ? space : line.find(' ', space + 1);
+    exchange.answer.reason = words == std::string::npos ? "" : trimmed(line.substr(words));
     return line.size();
   }
   const std::size_t colon = line.find(':');
@@ -535,11 +537,15 @@ class Engine {
       case CURLE_SSL_PINNEDPUBKEYNOTMATCH:
         return failure(BACKUP_TRANS_ERROR_CERTIFICATE, std::move(text));
       case CURLE_UNSUPPORTED_PROTOCOL:
-      case CURLE_WEIRD_SERVER_REPLY:
-        return failure(BACKUP_TRANS_ERROR_SERVER, std::move(text));
+      case CURLE_WEIRD_SERVER_REPLY: {
+        Outcome stranger = failure(BACKUP_TRANS_ERROR_SERVER, std::move(text));
+        stranger.wrong_address = true;
+        return stranger;
+      }
       default: {
         Outcome lost = failure(BACKUP_TRANS_ERROR_NETWORK, std::move(text));
         lost.transient = true;
+        lost.wrong_address = code == CURLE_COULDNT_RESOLVE_HOST || code == CURLE_SSL_CONNECT_ERROR;
         return lost;
       }
     }
@@ -575,6 +581,22 @@ std::optional<std::chrono::milliseconds> retry_after(const HttpAnswer &answer) {
   return std::min(std::chrono::seconds(seconds), kLongestRetryAfter);
 }
 
+constexpr std::size_t kMaxSaidBytes = 200;
+
+std::string printable(std::string text) {
+  if (text.size() > kMaxSaidBytes) text.resize(kMaxSaidBytes);
+  for (char &c : text) {
+    if (c < ' ' || c > '~') c = '?';
+  }
+  return text;
+}
+
+/** Moved elsewhere, not there, or there but no such store. */
+bool means_another_address(int status) {
+  return (status >= 300 && status <= 399) || status == 404 || status == 405 || status == 410 ||
+         status == 501;
+}
+
 }  // namespace
 
 std::string HttpAnswer::header(const std::string &name) const {
@@ -600,6 +622,8 @@ Outcome outcome_of(const HttpAnswer &answer, const char *what) {
   Outcome outcome =
       failure(BACKUP_TRANS_ERROR_SERVER,
               std::string(what) + ": the server answered " + std::to_string(answer.status));
+  outcome.said = printable(answer.reason);
+  outcome.wrong_address = means_another_address(answer.status);
   switch (answer.status) {
     case 401:
     case 403:

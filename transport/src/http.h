@@ -49,6 +49,7 @@ struct HttpRequest {
 
 struct HttpAnswer {
   int status = 0;                             /**< 0: there was no answer; problem tells why */
+  std::string reason;                         /**< the status in the server's words; may be empty */
   std::map<std::string, std::string> headers; /**< names in lower case */
   std::string body;
   /** Why there was no complete answer; its code is set then. */

@@ -18,6 +18,10 @@ struct Outcome {
   backup_trans_error_code code = BACKUP_TRANS_ERROR_NONE;
   /** For people; holds no credentials. */
   std::string message;
+  /** What the server itself said, made printable; empty when it said nothing. */
+  std::string said;
+  /** There is nothing at the address that such a store would be. */
+  bool wrong_address = false;
   /** Worth another attempt. */
   bool transient = false;
   /** How long the store asked to be left alone. */

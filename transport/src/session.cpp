@@ -15,6 +15,7 @@
 #include <utility>
 
 #include "backup_transport.h"
+#include "check.h"
 #include "remote_path.h"
 
 struct backup_trans_handle_s {
@@ -39,7 +40,7 @@ constexpr std::size_t kWorkerStackBytes = 1024 * 1024;
 // A worker that does not come back by then is left behind, and the callback goes ahead.
 constexpr guint kCancelPatienceMs = 500;
 
-enum class Kind { download, upload, list, remove_folder };
+enum class Kind { download, upload, list, remove_folder, check };
 
 struct Result {
   Outcome outcome;
@@ -65,6 +66,7 @@ struct Request {
   backup_trans_upload_cb upload_cb = nullptr;
   backup_trans_child_list_cb list_cb = nullptr;
   backup_trans_delete_cb delete_cb = nullptr;
+  backup_trans_check_cb check_cb = nullptr;
   bool waited_for = false;  // by a caller, instead of a callback
 
   Ticket ticket;
@@ -77,6 +79,23 @@ using RequestPtr = std::shared_ptr<Request>;
 
 backup_trans_file_info_s public_info(const ObjectInfo &info) {
   return {info.path.c_str(), info.is_file, info.size, info.timestamp_ms};
+}
+
+std::string description(const Outcome &outcome) {
+  if (outcome.ok()) return "objects can be put there, read and removed";
+  return outcome.said.empty() ? outcome.message : outcome.message + " (" + outcome.said + ")";
+}
+
+/** Does the end of a request tell of the store, and not of the device or its user? */
+bool tells_of_store(const Request &request) {
+  const backup_trans_error_code code = request.result.outcome.code;
+  return !request.ticket.cancelled() && code != BACKUP_TRANS_ERROR_CANCELLED &&
+         code != BACKUP_TRANS_ERROR_LOCAL_FILE;
+}
+
+bool was_served(const Outcome &outcome) {
+  return outcome.ok() || outcome.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT ||
+         outcome.code == BACKUP_TRANS_ERROR_CONFLICT;
 }
 
 void call_back(const Request &request) {
@@ -104,6 +123,11 @@ void call_back(const Request &request) {
     case Kind::remove_folder: {
       const backup_trans_file_info_s info = {request.path.c_str(), false, 0, 0};
       request.delete_cb(outcome.code, request.user_data, &info);
+      break;
+    }
+    case Kind::check: {
+      const std::string message = description(outcome);
+      request.check_cb(outcome.code, request.user_data, cause_of(outcome), message.c_str());
       break;
     }
   }
@@ -211,6 +235,11 @@ class Session {
     return BACKUP_TRANS_ERROR_NONE;
   }
 
+  backup_trans_cause last_cause() {
+    const Lock lock(mutex_);
+    return last_cause_;
+  }
+
   int wait_for(const RequestPtr &request) {
     Lock lock(mutex_);
     ended_.wait(lock, [&] { return request->ended || request->ticket.cancelled(); });
@@ -276,6 +305,9 @@ class Session {
     if (request->ended) return;
     request->ended = true;
     request->result = std::move(result);
+    const Outcome &outcome = request->result.outcome;
+    if (tells_of_store(*request))
+      last_cause_ = was_served(outcome) ? BACKUP_TRANS_CAUSE_NONE : cause_of(outcome);
     if (request->waited_for) {
       ended_.notify_all();
     } else {
@@ -403,6 +435,8 @@ class Session {
         });
       case Kind::remove_folder:
         return retried([&] { return request.backend->remove_folder(attempt, request.path); });
+      case Kind::check:
+        return check_store(request.ticket, *request.backend);
     }
     return failure(BACKUP_TRANS_ERROR_ARGUMENT, "no such request");
   }
@@ -454,6 +488,7 @@ class Session {
   std::list<RequestPtr> running_;
   std::deque<std::function<void()>> deliveries_;
   int workers_ = 0;
+  backup_trans_cause last_cause_ = BACKUP_TRANS_CAUSE_NONE;
 };
 
 RequestPtr new_request(Kind kind, backup_trans_handle_h handle, std::shared_ptr<Backend> backend,
@@ -585,6 +620,20 @@ int backup_trans_delete_folder_ors_async(backup_trans_handle_h handle, const cha
   return Session::get().accept(request);
 }
 
+int backup_trans_check_async(backup_trans_handle_h handle, void *user_data,
+                             backup_trans_check_cb callback) {
+  int code = BACKUP_TRANS_ERROR_NONE;
+  auto backend = Session::get().store_for(handle, &code);
+  if (!backend) return code;
+  if (callback == nullptr) return BACKUP_TRANS_ERROR_ARGUMENT;
+  const RequestPtr request =
+      transport::new_request(Kind::check, handle, std::move(backend), user_data);
+  request->check_cb = callback;
+  return Session::get().accept(request);
+}
+
+backup_trans_cause backup_trans_last_cause(void) { return Session::get().last_cause(); }
+
 void backup_trans_cancel_request(backup_trans_handle_h handle) { Session::get().cancel(handle); }
 
 const char *backup_trans_error_text(backup_trans_error_code error) {
@@ -615,6 +664,28 @@ const char *backup_trans_error_text(backup_trans_error_code error) {
       return "the server is not the one it says it is";
   }
   return "unknown error";
+}
+
+const char *backup_trans_cause_word(backup_trans_cause cause) {
+  switch (cause) {
+    case BACKUP_TRANS_CAUSE_NONE:
+      return "ok";
+    case BACKUP_TRANS_CAUSE_ADDRESS:
+      return "address";
+    case BACKUP_TRANS_CAUSE_CERTIFICATE:
+      return "certificate";
+    case BACKUP_TRANS_CAUSE_PASSWORD:
+      return "password";
+    case BACKUP_TRANS_CAUSE_SPACE:
+      return "space";
+    case BACKUP_TRANS_CAUSE_NETWORK:
+      return "network";
+    case BACKUP_TRANS_CAUSE_SERVER:
+      return "server";
+    case BACKUP_TRANS_CAUSE_DEVICE:
+      return "device";
+  }
+  return "unknown";
 }
 
 }  // extern "C"

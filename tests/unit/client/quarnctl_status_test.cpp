@@ -100,4 +100,70 @@ TEST_F(QuarnctlStatus, ADaemonWithoutAStatusObjectIsToldApart) {
   EXPECT_EQ(outcome.exit, kUnusable);
 }
 
+/** What a failure is told with when the daemon names the cloud's part in it. */
+class QuarnctlCloudProblem : public QuarnctlStatus {
+ protected:
+  Outcome fail_backup(int result, const std::string &problem, std::vector<std::string> arguments) {
+    daemon_->serve_status(g_variant_new_parsed("{'CloudProblem': <%s>}", problem.c_str()));
+    daemon_->on("manual_backup_start", [result](const IncomingCall &call) {
+      const std::uint32_t req = call.req_id();
+      call.call_back("manual_backup_status", status_arguments(result, QUARN_BACKUP_FAILED, req));
+      call.reply(0);
+    });
+    return quarnctl(*bus_, std::move(arguments));
+  }
+};
+
+TEST_F(QuarnctlCloudProblem, EachIsPutIntoWords) {
+  const std::vector<std::pair<std::string, std::string>> words = {
+      {"address", "there is no such store at the cloud's address"},
+      {"certificate", "the cloud's certificate is not to be trusted"},
+      {"password", "the cloud refused the user name or password"},
+      {"space", "the cloud is full"},
+      {"network", "the cloud cannot be reached"},
+      {"server", "the cloud answered with an error"}};
+  for (const auto &[problem, text] : words) {
+    const Outcome outcome = fail_backup(QUARN_TRANSFER_FAILED, problem, {"backup"});
+    EXPECT_EQ(outcome.exit, QUARN_TRANSFER_FAILED);
+    EXPECT_EQ(outcome.err, "quarnctl: backup failed: the transfer failed or Wi-Fi was lost (12): " +
+                               text + "\n");
+  }
+}
+
+TEST_F(QuarnctlCloudProblem, ItIsInTheDocument) {
+  const Outcome outcome = fail_backup(QUARN_LIST_CHECK_FAILED, "password", {"backup", "--json"});
+  EXPECT_EQ(outcome.exit, QUARN_LIST_CHECK_FAILED);
+  EXPECT_EQ(json_string(json_parse(outcome.out).get(), "cloud_problem"), "password");
+}
+
+TEST_F(QuarnctlCloudProblem, NoneAndUnknownOnesAddNothing) {
+  for (const char *problem : {"", "mice"}) {
+    const Outcome outcome = fail_backup(QUARN_TRANSFER_FAILED, problem, {"backup", "--json"});
+    EXPECT_EQ(outcome.err, "quarnctl: backup failed: the transfer failed or Wi-Fi was lost (12)\n");
+    EXPECT_EQ(json_string(json_parse(outcome.out).get(), "cloud_problem"), std::nullopt);
+  }
+}
+
+TEST_F(QuarnctlCloudProblem, AFailureOfAnotherKindHasNoPartOfTheClouds) {
+  const Outcome outcome = fail_backup(QUARN_NO_SESSION, "password", {"backup"});
+  EXPECT_EQ(outcome.err, "quarnctl: backup failed: no Wi-Fi, or no session with the cloud (33)\n");
+}
+
+TEST_F(QuarnctlCloudProblem, AListThatCannotBeHadIsExplained) {
+  daemon_->serve_status(g_variant_new_parsed("{'CloudProblem': <'certificate'>}"));
+  answer_list(QUARN_BAD_ARGUMENT, "none");
+  const Outcome outcome = quarnctl(*bus_, {"list"});
+  EXPECT_EQ(outcome.exit, QUARN_BAD_ARGUMENT);
+  EXPECT_EQ(outcome.err,
+            "quarnctl: the cloud holds no application list yet, or it could not be fetched (1): "
+            "the cloud's certificate is not to be trusted\n");
+}
+
+TEST_F(QuarnctlCloudProblem, TheStatusShowsIt) {
+  daemon_->serve_status(
+      g_variant_new_parsed("{'WifiConnected': <false>, 'CloudProblem': <'space'>}"));
+  EXPECT_NE(quarnctl(*bus_, {"status"}).out.find("cloud             the cloud is full\n"),
+            std::string::npos);
+}
+
 }  // namespace

@@ -82,6 +82,7 @@ TEST(Status, NoBackupIsNeverAndNoAlarmIsNone) {
             R"({"serial":"","model":"","auto_backup":null,"charger_connected":null,)"
             R"("wifi_connected":null,"screen_off":null,"condition_alarm_ms":null,)"
             R"("next_alarm_ms":null,"last_backup_ms":null,"last_backup_age_ms":null,)"
+            R"("cloud_problem":null,)"
             R"("backup_running":null,"restore_mode":null,"restore_candidates":[]})");
 }
 

@@ -70,6 +70,10 @@ int backup_trans_delete_folder_ors_async(backup_trans_handle_h handle, const cha
                                                                        user_data, callback);
 }
 
+backup_trans_cause backup_trans_last_cause(void) {
+  return MockTransport::current().backup_trans_last_cause();
+}
+
 void backup_trans_cancel_request(backup_trans_handle_h handle) {
   return MockTransport::current().backup_trans_cancel_request(handle);
 }

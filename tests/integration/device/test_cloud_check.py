@@ -1,0 +1,178 @@
+"""quarn-device cloud-check: one line that tells what to look at, and quarnctl's words for it."""
+import http.server
+import json
+import os
+import ssl
+import subprocess
+import sys
+import threading
+import unittest
+
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+from quarn_test import TestCase, make_source  # noqa: E402
+
+PASSWORD = "correct horse battery staple"
+OK_LINE = "ok: objects can be put there, read and removed\n"
+
+
+class Server:
+    """An HTTP server on loopback that gives every request one answer."""
+
+    def __init__(self, status, reason, context=None):
+        class Handler(http.server.BaseHTTPRequestHandler):
+            protocol_version = "HTTP/1.1"
+
+            def answer(self):
+                self.rfile.read(int(self.headers.get("Content-Length", 0)))
+                self.send_response(status, reason)
+                self.send_header("Content-Length", "0")
+                self.end_headers()
+
+            def __getattr__(self, name):
+                if name.startswith("do_"):
+                    return self.answer
+                raise AttributeError(name)
+
+            def log_message(self, *arguments):
+                pass
+
+        self.server = http.server.ThreadingHTTPServer(("127.0.0.1", 0), Handler)
+        self.port = self.server.server_address[1]
+        if context:
+            self.server.socket = context.wrap_socket(self.server.socket, server_side=True)
+        self.thread = threading.Thread(target=self.server.serve_forever, args=(0.02,))
+        self.thread.start()
+
+    def __enter__(self):
+        return self
+
+    def __exit__(self, *_exception):
+        self.server.shutdown()
+        self.thread.join()
+        self.server.server_close()
+
+
+class CloudCheck(TestCase):
+    def setUp(self):
+        self.device = self.new_device(serial="350000000000017", account="ada")
+
+    def set_cloud(self, url, *options):
+        self.device.call("set", "cloud", url, "--user", "ada", *options, input=PASSWORD + "\n")
+
+    def check(self, *options):
+        result = self.device.call("cloud-check", *options, check=False)
+        self.assertNotIn(PASSWORD, result.stdout + result.stderr)
+        return result.returncode, result.stdout, result.stderr
+
+    def answer_of(self, status, reason):
+        with Server(status, reason) as server:
+            self.set_cloud("webdav+http://127.0.0.1:%d/dav" % server.port)
+            return self.check()
+
+    def test_a_folder_that_can_be_used_and_holds_nothing_of_the_check_afterwards(self):
+        self.assertEqual(self.check(), (0, OK_LINE, ""))
+        self.assertEqual(os.listdir(self.device.cloud), [])
+
+    def test_a_refused_connection_is_the_network(self):
+        with Server(200, "OK") as server:
+            port = server.port
+        self.set_cloud("webdav+http://127.0.0.1:%d/" % port)
+        code, out, error = self.check()
+        self.assertEqual((code, out), (15, ""))
+        self.assertRegex(error, r"^network: Failed to connect to 127\.0\.0\.1 port %d .*\n$" % port)
+
+    def test_a_host_that_does_not_exist_is_the_address(self):
+        self.set_cloud("webdav+https://no-such-host.invalid/dav")
+        self.assertEqual(self.check(),
+                         (11, "", "address: Could not resolve host: no-such-host.invalid\n"))
+
+    def test_a_server_of_another_kind_is_the_address(self):
+        self.assertEqual(self.answer_of(501, "Not Implemented"), (
+            11, "", "address: list: the server answered 501 (Not Implemented)\n"))
+
+    def test_a_server_that_sends_elsewhere_is_the_address(self):
+        code, out, error = self.answer_of(301, "Moved Permanently")
+        self.assertEqual((code, out), (11, ""))
+        self.assertRegex(error, r"^address: .*: the server answered 301 \(Moved Permanently\)\n$")
+
+    def test_refused_credentials_are_the_password(self):
+        self.assertEqual(self.answer_of(401, "Unauthorized"), (
+            13, "", "password: list: the server answered 401 (Unauthorized)\n"))
+
+    def test_a_full_store_is_the_space(self):
+        self.assertEqual(self.answer_of(507, "Insufficient Storage"), (
+            14, "", "space: list: the server answered 507 (Insufficient Storage)\n"))
+
+    def test_a_broken_server_is_the_server_and_what_it_says_is_made_printable(self):
+        self.assertEqual(self.answer_of(500, "\x1b[31mOops"), (
+            16, "", "server: list: the server answered 500 (?[31mOops)\n"))
+
+    def tls(self):
+        certificate, key = self.path("cert.pem"), self.path("key.pem")
+        subprocess.run(["openssl", "req", "-x509", "-newkey", "rsa:2048", "-nodes", "-days", "2",
+                        "-subj", "/CN=localhost", "-addext", "subjectAltName=IP:127.0.0.1",
+                        "-keyout", key, "-out", certificate], check=True,
+                       stderr=subprocess.DEVNULL)
+        context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
+        context.load_cert_chain(certificate, key)
+        return context, certificate
+
+    def test_a_certificate_that_nobody_vouches_for_is_the_certificate(self):
+        context, _certificate = self.tls()
+        with Server(507, "Insufficient Storage", context) as server:
+            self.set_cloud("webdav+https://127.0.0.1:%d/dav" % server.port)
+            code, out, error = self.check()
+        self.assertEqual((code, out), (12, ""))
+        self.assertRegex(error, "^certificate: .*\n$")
+
+    def test_a_ca_file_vouches_for_it(self):
+        context, certificate = self.tls()
+        with Server(507, "Insufficient Storage", context) as server:
+            self.set_cloud("webdav+https://127.0.0.1:%d/dav" % server.port, "--ca-file",
+                           certificate)
+            self.assertEqual(self.check()[0], 14)
+
+    def test_a_configuration_that_cannot_be_used_is_the_device(self):
+        self.set_cloud("webdav+https://example.invalid/dav")
+        config = os.path.join(self.device.path, "state/cloud.conf")
+        os.chmod(config, 0o644)
+        self.assertEqual(self.check(), (
+            17, "", "device: %s: holds a password and is not of mode 0600\n" % config))
+
+    def test_the_document_for_programs(self):
+        code, out, error = self.check("--json")
+        self.assertEqual((code, error), (0, ""))
+        self.assertEqual(json.loads(out), {
+            "verb": "cloud-check", "cause": "ok", "error": 0,
+            "message": "objects can be put there, read and removed"})
+        with Server(401, "Unauthorized") as server:
+            self.set_cloud("webdav+http://127.0.0.1:%d/dav" % server.port)
+            code, out, error = self.check("--json")
+        self.assertEqual((code, error), (13, ""))
+        self.assertEqual(json.loads(out), {
+            "verb": "cloud-check", "cause": "password", "error": 10,
+            "message": "list: the server answered 401 (Unauthorized)"})
+
+    def test_wrong_words_are_refused(self):
+        for options in (("--jason",), ("--json", "more")):
+            self.assertEqual(self.check(*options)[0], 64)
+
+    def test_quarnctl_has_words_for_it(self):
+        self.device.set("network", "wifi")
+        with Server(401, "Unauthorized") as server:
+            self.set_cloud("webdav+http://127.0.0.1:%d/dav" % server.port)
+            self.device.start()
+            self.device.install(make_source(self.path("source"), "org.example.notes", "1.0",
+                                            {"data/file": b"text"}))
+            result = self.device.quarnctl("backup", check=False)
+            listed = self.device.quarnctl("list", check=False)
+            status = json.loads(self.device.quarnctl("status", "--json").stdout)
+        self.assertIn("the cloud refused the user name or password\n", result.stderr)
+        self.assertIn("the cloud refused the user name or password\n", listed.stderr)
+        self.assertEqual(status["cloud_problem"], "password")
+        for text in (result.stdout, result.stderr, listed.stderr, self.device.log()):
+            self.assertNotIn(PASSWORD, text)
+
+
+if __name__ == "__main__":
+    unittest.main()

@@ -1,0 +1,226 @@
+#include "check.h"
+
+#include <gmock/gmock.h>
+
+#include <map>
+#include <utility>
+
+#include "harness.h"
+#include "session.h"
+
+using namespace harness;
+using namespace transport;
+
+namespace {
+
+/** A store in memory whose steps can be made to fail. */
+class StepStore : public Backend {
+ public:
+  Outcome list(Attempt &, const std::string &, int, int, ListPage *) override {
+    steps.emplace_back("list");
+    return outcomes["list"];
+  }
+  Outcome upload(Attempt &attempt, const Upload &upload, ObjectInfo *) override {
+    steps.emplace_back("upload");
+    if (cancel_in_upload != nullptr) {
+      cancel_in_upload->cancel();
+      if (attempt.ticket.cancelled()) return cancelled();
+    }
+    if (outcomes["upload"].ok()) object = upload.path;
+    return outcomes["upload"];
+  }
+  Outcome download(Attempt &, const std::string &path, LocalTarget &target, Version *) override {
+    steps.emplace_back("download");
+    EXPECT_EQ(path, object);
+    if (!outcomes["download"].ok()) return outcomes["download"];
+    EXPECT_TRUE(target.begin());
+    EXPECT_EQ(write(target.fd(), given_back.data(), given_back.size()),
+              static_cast<ssize_t>(given_back.size()));
+    EXPECT_TRUE(target.publish());
+    return success();
+  }
+  Outcome remove_folder(Attempt &, const std::string &folder) override {
+    steps.emplace_back("remove");
+    EXPECT_EQ(object.empty() ? folder : object, object.empty() ? folder : folder + "/probe");
+    return outcomes["remove"];
+  }
+
+  std::map<std::string, Outcome> outcomes;
+  std::vector<std::string> steps;
+  std::string object;
+  std::string given_back = "this can be deleted\n";
+  Ticket *cancel_in_upload = nullptr;
+};
+
+using Steps = std::vector<std::string>;
+
+class CheckTest : public ::testing::Test {
+ protected:
+  Outcome check() { return check_store(ticket, store); }
+
+  Ticket ticket;
+  StepStore store;
+};
+
+TEST_F(CheckTest, PutsAnObjectReadsItBackAndRemovesIt) {
+  EXPECT_TRUE(check().ok());
+  EXPECT_EQ(store.steps, (Steps{"list", "upload", "download", "remove"}));
+  EXPECT_THAT(store.object, ::testing::MatchesRegex("/quarn-check-[0-9a-f-]{36}/probe"));
+}
+
+TEST_F(CheckTest, EachCheckHasAFolderOfItsOwn) {
+  ASSERT_TRUE(check().ok());
+  const std::string first = store.object;
+  ASSERT_TRUE(check().ok());
+  EXPECT_NE(store.object, first);
+}
+
+TEST_F(CheckTest, AStoreThatCannotBeListedIsNotWrittenTo) {
+  store.outcomes["list"] = failure(BACKUP_TRANS_ERROR_AUTHENTICATION, "no");
+  EXPECT_EQ(check().code, BACKUP_TRANS_ERROR_AUTHENTICATION);
+  EXPECT_EQ(store.steps, Steps{"list"});
+}
+
+TEST_F(CheckTest, WhatAFailedUploadMayHaveLeftIsRemoved) {
+  store.outcomes["upload"] = failure(BACKUP_TRANS_ERROR_QUOTA, "full");
+  EXPECT_EQ(check().message, "full");
+  EXPECT_EQ(store.steps, (Steps{"list", "upload", "remove"}));
+}
+
+TEST_F(CheckTest, AFailedDownloadIsTheResultAndTheObjectGoes) {
+  store.outcomes["download"] = failure(BACKUP_TRANS_ERROR_NETWORK, "lost");
+  store.outcomes["remove"] = failure(BACKUP_TRANS_ERROR_SERVER, "later");
+  EXPECT_EQ(check().message, "lost");
+  EXPECT_EQ(store.steps, (Steps{"list", "upload", "download", "remove"}));
+}
+
+TEST_F(CheckTest, AnotherContentIsAFailureOfTheStore) {
+  store.given_back = "something else\n";
+  const Outcome outcome = check();
+  EXPECT_EQ(outcome.code, BACKUP_TRANS_ERROR_SERVER);
+  EXPECT_EQ(outcome.message, "the store gave back something else than was put there");
+}
+
+TEST_F(CheckTest, AnObjectThatCannotBeRemovedIsAFailure) {
+  store.outcomes["remove"] = failure(BACKUP_TRANS_ERROR_AUTHENTICATION, "not yours");
+  EXPECT_EQ(check().message, "not yours");
+}
+
+TEST_F(CheckTest, ACancelledCheckAsksForNothingMore) {
+  ticket.cancel();
+  EXPECT_EQ(check().code, BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_EQ(store.steps, Steps{});
+}
+
+TEST_F(CheckTest, ACancellationReachesTheStepThatRunsAndStillTidiesUp) {
+  store.cancel_in_upload = &ticket;
+  EXPECT_EQ(check().code, BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_EQ(store.steps, (Steps{"list", "upload", "remove"}));
+}
+
+TEST(CauseTest, TellsWhatToLookAt) {
+  const std::vector<std::pair<backup_trans_error_code, const char *>> expected = {
+      {BACKUP_TRANS_ERROR_NONE, "ok"},
+      {BACKUP_TRANS_ERROR_NO_SUCH_OBJECT, "address"},
+      {BACKUP_TRANS_ERROR_CERTIFICATE, "certificate"},
+      {BACKUP_TRANS_ERROR_AUTHENTICATION, "password"},
+      {BACKUP_TRANS_ERROR_QUOTA, "space"},
+      {BACKUP_TRANS_ERROR_NETWORK, "network"},
+      {BACKUP_TRANS_ERROR_LOCAL_FILE, "device"},
+      {BACKUP_TRANS_ERROR_SERVER, "server"},
+      {BACKUP_TRANS_ERROR_CONFLICT, "server"}};
+  for (const auto &[code, word] : expected)
+    EXPECT_STREQ(backup_trans_cause_word(cause_of(failure(code, ""))), word) << code;
+  EXPECT_STREQ(backup_trans_cause_word(static_cast<backup_trans_cause>(99)), "unknown");
+}
+
+TEST(CauseTest, ANetworkFailureOfAnUnknownHostIsTheAddress) {
+  Outcome outcome = failure(BACKUP_TRANS_ERROR_NETWORK, "no such host");
+  outcome.wrong_address = true;
+  EXPECT_EQ(cause_of(outcome), BACKUP_TRANS_CAUSE_ADDRESS);
+}
+
+/* ---- through the library's interface ---- */
+
+struct Told {
+  int calls = 0;
+  backup_trans_error_code error = BACKUP_TRANS_ERROR_ARGUMENT;
+  backup_trans_cause cause = BACKUP_TRANS_CAUSE_NONE;
+  std::string message;
+};
+
+void on_checked(backup_trans_error_code error, void *data, backup_trans_cause cause,
+                const char *message) {
+  auto &told = *static_cast<Told *>(data);
+  ++told.calls;
+  told.error = error;
+  told.cause = cause;
+  told.message = message;
+}
+
+class CheckRequestTest : public ::testing::Test {
+ protected:
+  CheckRequestTest() {
+    set_backend_maker([this](const Config &, std::string *) { return store; });
+    cloud = std::make_unique<Cloud>("[cloud]\nurl=scripted\n");
+  }
+  ~CheckRequestTest() override {
+    cloud.reset();
+    set_backend_maker(nullptr);
+  }
+  Told check() {
+    Told told;
+    EXPECT_EQ(backup_trans_check_async(cloud->handle, &told, on_checked), 0);
+    EXPECT_EQ(told.calls, 0);
+    EXPECT_TRUE(run_until([&] { return told.calls > 0; }));
+    return told;
+  }
+
+  std::shared_ptr<StepStore> store = std::make_shared<StepStore>();
+  std::unique_ptr<Cloud> cloud;
+};
+
+TEST_F(CheckRequestTest, AUsableStoreIsSaidToBeSo) {
+  const Told told = check();
+  EXPECT_EQ(told.calls, 1);
+  EXPECT_EQ(told.error, BACKUP_TRANS_ERROR_NONE);
+  EXPECT_EQ(told.cause, BACKUP_TRANS_CAUSE_NONE);
+  EXPECT_EQ(told.message, "objects can be put there, read and removed");
+}
+
+TEST_F(CheckRequestTest, WhatTheServerSaidIsToldAndNothingIsTriedTwice) {
+  Outcome full = failure(BACKUP_TRANS_ERROR_QUOTA, "upload: the server answered 507");
+  full.said = "Insufficient Storage";
+  full.transient = true;
+  store->outcomes["upload"] = full;
+  const Told told = check();
+  EXPECT_EQ(told.error, BACKUP_TRANS_ERROR_QUOTA);
+  EXPECT_EQ(told.cause, BACKUP_TRANS_CAUSE_SPACE);
+  EXPECT_EQ(told.message, "upload: the server answered 507 (Insufficient Storage)");
+  EXPECT_EQ(store->steps, (Steps{"list", "upload", "remove"}));
+}
+
+TEST_F(CheckRequestTest, ARefusedCheckGetsNoCallback) {
+  EXPECT_EQ(backup_trans_check_async(cloud->handle, nullptr, nullptr), BACKUP_TRANS_ERROR_ARGUMENT);
+  EXPECT_EQ(backup_trans_check_async(nullptr, nullptr, on_checked), BACKUP_TRANS_ERROR_ARGUMENT);
+}
+
+TEST_F(CheckRequestTest, TheLastCauseIsThatOfTheLastRequestThatTellsOfTheStore) {
+  store->outcomes["list"] = failure(BACKUP_TRANS_ERROR_AUTHENTICATION, "no");
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_PASSWORD);
+  store->outcomes["list"] = failure(BACKUP_TRANS_ERROR_LOCAL_FILE, "no");
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_PASSWORD);
+  store->outcomes["list"] = failure(BACKUP_TRANS_ERROR_CONFLICT, "changed");
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_NONE);
+  store->outcomes["list"] = failure(BACKUP_TRANS_ERROR_CERTIFICATE, "no");
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_CERTIFICATE);
+  store->outcomes["list"] = success();
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_NONE);
+}
+
+}  // namespace
