@@ -53,6 +53,7 @@ int alarmmgr_init(const char *pkg_name) {
 }
 
 void alarmmgr_fini(void) {
+  embedded::wait_for_state();
   if (owner().pending != 0) g_source_remove(owner().pending);
   owner().pending = 0;
   owner().handler = nullptr;

@@ -73,7 +73,8 @@ void queue_firing(GKeyFile *file, const Alarm &alarm, std::int64_t now) {
 
 int add_alarm(const std::string &device, const Alarm &alarm) {
   int id = 0;
-  const bool added = edit_state(device, kAlarmsFile, [&](GKeyFile *file) {
+  // Whoever adds an alarm is about to go on with something else.
+  const bool added = edit_state_behind(device, kAlarmsFile, [&](GKeyFile *file) {
     id = static_cast<int>(number_of(file, kCountersGroup, kNextId, 1));
     while (id <= 0 || g_key_file_has_group(file, alarm_group(id).c_str())) {
       id = id <= 0 || id == std::numeric_limits<int>::max() ? 1 : id + 1;
@@ -107,6 +108,8 @@ bool remove_alarm(const std::string &device, const std::string &owner, int id) {
 }
 
 bool list_alarms(const std::string &device, std::vector<Alarm> *alarms) {
+  // An alarm that was added is listed, also while it is on its way to the disk.
+  const StateLock lock(device);
   const KeyFilePtr file = read_state(device, kAlarmsFile);
   if (file == nullptr) return false;
   *alarms = alarms_of(file.get());

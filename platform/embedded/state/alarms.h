@@ -24,7 +24,10 @@ struct Alarm {
   std::int64_t interval_ms = 0; /**< 0: once */
 };
 
-/** Add an alarm, whose own id is ignored. @return its id, 0 on failure */
+/**
+ * Add an alarm, whose own id is ignored; it is on its way to the disk when this
+ * returns, see wait_for_state(). @return its id, 0 on failure
+ */
 int add_alarm(const std::string &device, const Alarm &alarm);
 
 /** Remove an alarm of @p owner, with its firings that were not taken. False when there is none. */

@@ -8,6 +8,8 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <mutex>
+#include <thread>
 
 namespace embedded {
 namespace {
@@ -35,6 +37,40 @@ bool sync_folder(const std::string &folder) {
   close(fd);
   return synced;
 }
+
+/** The thread that waits for the disk in somebody's stead. */
+class Writer {
+ public:
+  // Never destroyed: a process may end while the disk is waited for.
+  static Writer &get() {
+    static auto *const writer = new Writer;
+    return *writer;
+  }
+
+  void start(const std::string &device, const std::string &file, KeyFilePtr content,
+             StateLock lock) {
+    const std::lock_guard<std::mutex> guard(mutex_);
+    join();
+    thread_ = std::thread([device, file, content = std::move(content), lock = std::move(lock)] {
+      if (!write_state(device, file, content.get())) {
+        const int reason = errno;
+        g_warning("%s: %s", state_path(device, file).c_str(), g_strerror(reason));
+      }
+    });
+  }
+  void wait() {
+    const std::lock_guard<std::mutex> guard(mutex_);
+    join();
+  }
+
+ private:
+  void join() {
+    if (thread_.joinable()) thread_.join();
+  }
+
+  std::mutex mutex_;
+  std::thread thread_;
+};
 
 }  // namespace
 
@@ -105,6 +141,19 @@ bool edit_state(const std::string &device, const std::string &file,
   const KeyFilePtr content = read_state(device, file);
   return content != nullptr && change(content.get()) && write_state(device, file, content.get());
 }
+
+bool edit_state_behind(const std::string &device, const std::string &file,
+                       const std::function<bool(GKeyFile *)> &change) {
+  wait_for_state();
+  StateLock lock(device);
+  if (!lock) return false;
+  KeyFilePtr content = read_state(device, file);
+  if (content == nullptr || !change(content.get())) return false;
+  Writer::get().start(device, file, std::move(content), std::move(lock));
+  return true;
+}
+
+void wait_for_state() { Writer::get().wait(); }
 
 std::string text_of(GKeyFile *file, const char *group, const char *key) {
   const GText text(g_key_file_get_string(file, group, key, nullptr));

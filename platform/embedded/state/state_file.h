@@ -14,6 +14,7 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <utility>
 
 namespace embedded {
 
@@ -56,6 +57,7 @@ class StateLock {
   ~StateLock();
   StateLock(const StateLock &) = delete;
   StateLock &operator=(const StateLock &) = delete;
+  StateLock(StateLock &&other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
   explicit operator bool() const { return fd_ >= 0; }
 
  private:
@@ -69,6 +71,17 @@ class StateLock {
  */
 bool edit_state(const std::string &device, const std::string &file,
                 const std::function<bool(GKeyFile *)> &change);
+
+/**
+ * The same, returning when the change is settled: the disk is waited for by a
+ * thread, which holds the lock, and by the next change of this process.
+ * @return false when the file could not be read, or was left
+ */
+bool edit_state_behind(const std::string &device, const std::string &file,
+                       const std::function<bool(GKeyFile *)> &change);
+
+/** Wait until what edit_state_behind() has settled is on the disk. */
+void wait_for_state();
 
 /** Text of a key, empty when it is missing. */
 std::string text_of(GKeyFile *file, const char *group, const char *key);

@@ -139,6 +139,15 @@ TEST_F(Alarms, DoNotArriveAfterTheEndOfTheRegistration) {
   EXPECT_TRUE(embedded::has_fired_alarms(device(), kOwner));
 }
 
+TEST_F(Alarms, AreInTheirFileWhenTheRegistrationEnds) {
+  const int id = add(kHour);
+  alarmmgr_fini();
+  const embedded::KeyFilePtr file = embedded::read_state(device(), embedded::kAlarmsFile);
+  ASSERT_NE(file, nullptr);
+  EXPECT_EQ(embedded::text_of(file.get(), ("alarm " + std::to_string(id)).c_str(), "owner"),
+            kOwner);
+}
+
 TEST_F(Alarms, NeedARegistration) {
   alarmmgr_fini();
   alarm_id_t id = 0;
