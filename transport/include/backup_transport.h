@@ -45,7 +45,7 @@ extern "C" {
 #endif
 
 /** Transfers that run at a time; what is accepted beyond that waits its turn. */
-#define BACKUP_TRANS_MAX_CONCURRENT_TRANSFERS 4
+#define BACKUP_TRANS_MAX_CONCURRENT_TRANSFERS 12
 
 /** Seconds after which a transient failure is no longer repeated. */
 #define BACKUP_TRANS_RETRY_TOTAL_SECONDS 120

@@ -141,8 +141,9 @@ TEST_F(SessionTest, OtherFailuresAreNotRepeatedAndTheirTextIsTold) {
 TEST_F(SessionTest, StuckStoreDoesNotKeepACancelledCallerWaiting) {
   backend->get_stuck();
   std::vector<AnswerPtr> answers;
-  for (int i = 0; i < 10; ++i) answers.push_back(cloud->list("/"));
-  ASSERT_TRUE(run_until([&] { return backend->running == 4; }));
+  for (int i = 0; i < 2 * BACKUP_TRANS_MAX_CONCURRENT_TRANSFERS; ++i)
+    answers.push_back(cloud->list("/"));
+  ASSERT_TRUE(run_until([&] { return backend->running == BACKUP_TRANS_MAX_CONCURRENT_TRANSFERS; }));
   std::atomic<int> waited{-1};
   std::thread waiter([&] {
     waited = backup_trans_download_file_ors(cloud->handle, "/a", cloud->dir().path().c_str(), 0);
