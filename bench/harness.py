@@ -1,0 +1,139 @@
+"""What the benchmarks share: measuring, tables, what is required, and embedded devices."""
+import os
+import statistics
+import subprocess
+import sys
+import threading
+import time
+
+#: Peak memory of the daemon, kB.
+CEILING_KB = 20480
+
+
+def measure(command, cwd=None):
+    """Run a command; CPU seconds of it and its children, wall seconds."""
+    start = time.monotonic()
+    pid = os.posix_spawnp(command[0], command, os.environ,
+                          file_actions=[(os.POSIX_SPAWN_OPEN, fd, "/dev/null", os.O_WRONLY, 0)
+                                        for fd in (1, 2)]) \
+        if cwd is None else None
+    if pid is None:
+        process = subprocess.Popen(command, cwd=cwd, stdout=subprocess.DEVNULL)
+        pid = process.pid
+    _, status, usage = os.wait4(pid, 0)
+    wall = time.monotonic() - start
+    if cwd is not None:
+        process.returncode = os.waitstatus_to_exitcode(status)
+    if os.waitstatus_to_exitcode(status) != 0:
+        raise SystemExit("%s failed with %d" % (command[0], os.waitstatus_to_exitcode(status)))
+    return usage.ru_utime + usage.ru_stime, wall
+
+
+def median(values):
+    return statistics.median(values)
+
+
+class Table:
+    def __init__(self, *columns):
+        self.rows = [columns]
+
+    def add(self, *cells):
+        self.rows.append(tuple(str(cell) for cell in cells))
+
+    def show(self, title):
+        widths = [max(len(row[i]) for row in self.rows) for i in range(len(self.rows[0]))]
+        print("\n### %s\n" % title)
+        for index, row in enumerate(self.rows):
+            print("| " + " | ".join(cell.ljust(width) for cell, width in zip(row, widths)) + " |")
+            if index == 0:
+                print("|" + "|".join("-" * (width + 2) for width in widths) + "|")
+        sys.stdout.flush()
+
+
+class Checks:
+    """Ratios and ceilings that are required; a short run allows them half as much again."""
+
+    def __init__(self, slack):
+        self.slack = slack
+        self.failed = []
+
+    def at_most(self, what, value, limit):
+        allowed = limit * self.slack
+        if value > allowed:
+            self.failed.append("%s is %.3f, allowed %.3f" % (what, value, allowed))
+
+    def hard(self, what, value, limit):
+        if value > limit:
+            self.failed.append("%s is %s, allowed %s" % (what, value, limit))
+
+
+class Device:
+    """An embedded device with the daemon's memory watched."""
+
+    def __init__(self, bin_dir, path, *create_options):
+        self.tool = os.path.join(bin_dir, "quarn-device")
+        self.path = path
+        self.run("create", *create_options)
+        self.run("start")
+
+    def run(self, verb, *arguments, **keywords):
+        return subprocess.run([self.tool, verb, self.path, *arguments], check=True,
+                              stdout=subprocess.PIPE, text=True, **keywords).stdout
+
+    def client(self, *arguments):
+        return self.run("exec", "--", "quarnctl", *arguments)
+
+    def install(self, source):
+        self.run("install", source)
+
+    def daemon_pid(self):
+        for entry in os.listdir("/proc"):
+            if not entry.isdigit():
+                continue
+            try:
+                with open("/proc/%s/comm" % entry) as file:
+                    if file.read().strip() != "quarnd":
+                        continue
+                with open("/proc/%s/environ" % entry, "rb") as file:
+                    if ("QUARN_DEVICE_DIR=" + self.path).encode() in file.read().split(b"\0"):
+                        return int(entry)
+            except OSError:
+                continue
+        return None
+
+    def stop(self):
+        self.run("stop")
+
+
+class Watch:
+    """Samples the daemon's PSS, and its CPU time, while a block runs."""
+
+    def __init__(self, device):
+        self.device = device
+        self.peak = 0
+        self.done = threading.Event()
+        self.thread = threading.Thread(target=self._sample)
+
+    def _sample(self):
+        pid = None
+        while not self.done.wait(0.003):
+            pid = pid or self.device.daemon_pid()
+            if pid is None:
+                continue
+            try:
+                with open("/proc/%d/smaps_rollup" % pid) as file:
+                    for line in file:
+                        if line.startswith("Pss:"):
+                            self.peak = max(self.peak, int(line.split()[1]))
+            except OSError:
+                pid = None
+
+    def __enter__(self):
+        self.thread.start()
+        self.start = time.monotonic()
+        return self
+
+    def __exit__(self, *exc):
+        self.wall = time.monotonic() - self.start
+        self.done.set()
+        self.thread.join()
