@@ -31,7 +31,7 @@ struct XmlFree {
 using XmlText = std::unique_ptr<xmlChar, XmlFree>;
 
 bool has_name(const xmlNode *node, const char *name) {
-  return xmlStrcmp(node->name, reinterpret_cast<const xmlChar *>(name)) == 0;
+  return std::strcmp(reinterpret_cast<const char *>(node->name), name) == 0;
 }
 
 /** The rules file's text; false when it is larger than any real one. */
