@@ -121,7 +121,9 @@ class S3:
 
 
 def rclone_environment(options):
-    return dict(os.environ, RCLONE_CONFIG="/dev/null",
+    # Nothing of the machine's own S3 setting.
+    inherited = {name: value for name, value in os.environ.items() if not name.startswith("AWS_")}
+    return dict(inherited, RCLONE_CONFIG="/dev/null",
                 **{"RCLONE_CONFIG_BENCH_" + name: value for name, value in options.items()})
 
 
