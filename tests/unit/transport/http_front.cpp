@@ -31,7 +31,7 @@ constexpr std::size_t kMaxHeadBytes = 64 * 1024;
 // Small, so that a server that reads slowly is felt by who sends.
 constexpr int kReceiveBufferBytes = 8 * 1024;
 // How long a fault that ends nothing is waited for before time passes once more.
-constexpr int kStallPatienceMs = 2000;
+constexpr int kStallPatienceMs = 5000;
 constexpr char kHeadEnd[] = "\r\n\r\n";
 constexpr char kBadRequest[] = "HTTP/1.1 400 Bad Request\r\nConnection: close\r\n\r\n";
 constexpr char kEcho[] = "{authorization}";
