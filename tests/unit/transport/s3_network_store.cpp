@@ -5,9 +5,10 @@ namespace {
 
 class S3NetworkStore : public NetworkStore {
  public:
+  S3NetworkStore() { model_.set_secret(kSecret); }
   front::Service &service() override { return model_; }
   std::string config(const std::string &origin) const override {
-    return "url=s3+" + origin + S3Model::kBucket + "\nuser=" + S3Model::kUser +
+    return "url=s3+" + origin + "/" + S3Model::kBucket + "\nuser=" + S3Model::kUser +
            "\npassword=" + kSecret + "\n";
   }
   front::Rule requests_of(Step step) const override {
@@ -28,9 +29,13 @@ class S3NetworkStore : public NetworkStore {
     return {};
   }
   front::Rule look() const override { return {"HEAD", "/f/o"}; }
-  std::map<std::string, std::string> content() const override { return model_.content(); }
+  std::map<std::string, std::string> content() const override {
+    std::map<std::string, std::string> found;
+    for (const auto &[key, content] : model_.content()) found["/" + key] = content;
+    return found;
+  }
   void put(const std::string &path, const std::string &content) override {
-    model_.put(path, content);
+    model_.put(path.substr(1), content);
   }
   std::size_t leftovers() const override { return 0; }
 

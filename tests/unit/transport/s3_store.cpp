@@ -1,13 +1,31 @@
-// Every store's cases, over S3 to a server in this process.
+// Every store's cases over S3 services that differ in what they have.
 #include "s3_front_store.h"
 
 namespace {
 
+std::unique_ptr<TestStore> make_usual() { return std::make_unique<S3FrontStore>(); }
+
+std::unique_ptr<TestStore> make_sparse() {
+  auto store = std::make_unique<S3FrontStore>();
+  S3Model::Settings &settings = store->model().settings;
+  settings.conditions = S3Model::Conditions::refused;
+  settings.deletes_many = false;
+  settings.tags_are_md5 = false;
+  settings.encodes_keys = false;
+  settings.page = 7;
+  return store;
+}
+
+std::unique_ptr<TestStore> make_bare_tags() {
+  auto store = std::make_unique<S3FrontStore>();
+  store->model().settings.conditions = S3Model::Conditions::bare_tags_only;
+  return store;
+}
+
 INSTANTIATE_TEST_SUITE_P(Store, Conformance,
-                         ::testing::Values(StoreKind{"S3",
-                                                     []() -> std::unique_ptr<TestStore> {
-                                                       return std::make_unique<S3FrontStore>();
-                                                     }}),
+                         ::testing::Values(StoreKind{"S3", make_usual},
+                                           StoreKind{"SparseS3", make_sparse},
+                                           StoreKind{"BareTagsS3", make_bare_tags}),
                          [](const auto &info) { return std::string(info.param.name); });
 
 }  // namespace
