@@ -185,11 +185,18 @@ std::string backup_progress_text(const backup_progress &progress) {
 std::string restore_progress_text(const restore_progress &progress) {
   const JsonPtr object(json_object_new_object());
   json_object *root = object.get();
+  put(root, "run", static_cast<std::uint64_t>(progress.run));
   put(root, "kind", "restore");
   put(root, "stage", stage_name(progress.stage));
   put(root, "package", progress.package);
+  put(root, "index", progress.index);
+  put(root, "count", progress.count);
+  // The archive is taken whole: there is nothing between none of it and all of it.
+  put(root, "bytes_done", progress.size);
+  put(root, "bytes_total", progress.size);
   put(root, "outcome", word(progress.outcome));
-  if (progress.size != 0) put(root, "size", progress.size);
+  if (progress.outcome != restore_outcome::none && progress.size != 0)
+    put(root, "size", progress.size);
   if (progress.stage == restore_stage::finished) put(root, "result", progress.result);
   return text_of(root);
 }

@@ -62,6 +62,7 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
     LOGI("there is no package should be restored");
     return QUARN_OK;
   }
+  begin_restore_run(pkg_list_to_be_restored.size());
   init_install_complete_pkgs_list();
   init_icon_hide_delay_timer_list();
   current_restore_client = client;

@@ -58,11 +58,12 @@ int unpack(const pkg_restore_context &ctx, const std::string &archive) {
 }
 
 /** Replace the package's data by the archive's, or leave it as it is. */
-restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive) {
+restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive,
+                                     std::uint64_t size) {
   const char *pkgid = ctx->pkgid.c_str();
   const char *root = ctx->root.c_str();
   const std::lock_guard<std::mutex> lock(package_data_mutex);
-  report_restore_step(ctx->pkgid, restore_stage::snapshot);
+  report_restore_step(ctx->pkgid, restore_stage::snapshot, size);
   int result = temp_backup_initial_app_data(pkgid, root);
   if (result != QUARN_OK) {
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
@@ -70,7 +71,7 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
     discard_snapshot(pkgid, root);
     return restore_outcome::failed;
   }
-  report_restore_step(ctx->pkgid, restore_stage::unpacking);
+  report_restore_step(ctx->pkgid, restore_stage::unpacking, size);
   restore_step("unpack");
   result = unpack(*ctx, archive);
   if (result != QUARN_OK) {
@@ -80,7 +81,7 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
     return restore_outcome::rolled_back;
   }
   restore_step("unpacked");
-  report_restore_step(ctx->pkgid, restore_stage::attributes);
+  report_restore_step(ctx->pkgid, restore_stage::attributes, size);
   if (!restore_app_info(pkgid, root)) {
     LOGE("fail to restore for (%s)", pkgid);
     rollback_to_initial_app_data(pkgid, root);
@@ -98,7 +99,11 @@ void accept_restore(pkg_restore_context *ctx) {
   ++ctx->pending;
   // The daemon is not idle before the last restore has ended.
   request_power_lock(true);
-  if (!ctx->wait_for_result) count_outstanding_restore(1);
+  if (ctx->wait_for_result) {
+    begin_requested_restore(ctx->pkgid);
+  } else {
+    count_outstanding_restore(1);
+  }
   report_restore_step(ctx->pkgid, restore_stage::downloading);
 }
 
@@ -130,7 +135,7 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
   } else {
     LOGI("backup trans success : download for (%s)", ctx->pkgid.c_str());
     size = archive_size(request->local_path);
-    outcome = restore_from_archive(ctx, request->local_path);
+    outcome = restore_from_archive(ctx, request->local_path, size);
   }
   remove_download(request->local_path);
   finish_restore(ctx, outcome, size);
@@ -200,10 +205,11 @@ int unpack_from_companion(pkg_restore_context *ctx, bool *restored) {
   }
   const std::string archive = companion_archive(*ctx);
   const std::lock_guard<std::mutex> lock(package_data_mutex);
-  report_restore_step(ctx->pkgid, restore_stage::unpacking);
+  const std::uint64_t size = archive_size(archive);
+  report_restore_step(ctx->pkgid, restore_stage::unpacking, size);
   const int result = unpack(*ctx, archive);
   if (result != QUARN_OK) return result;
-  report_restore_step(ctx->pkgid, restore_stage::attributes);
+  report_restore_step(ctx->pkgid, restore_stage::attributes, size);
   *restored = restore_app_info(pkgid, ctx->root.c_str()) != 0;
   if (*restored) {
     LOGI("restore completed for (%s)", pkgid);

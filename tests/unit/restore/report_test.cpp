@@ -72,4 +72,58 @@ TEST_F(ReportTest, WithoutASinkProgressGoesNowhere) {
   EXPECT_EQ(steps, 1);
 }
 
+struct Told {
+  std::string package;
+  unsigned run;
+  int index;
+  int count;
+  std::uint64_t size;
+};
+bool operator==(const Told &a, const Told &b) {
+  return a.package == b.package && a.run == b.run && a.index == b.index && a.count == b.count &&
+         a.size == b.size;
+}
+std::vector<Told> told;
+
+TEST_F(ReportTest, AModeIsOneRunAndARequestOneOfItsOwn) {
+  told.clear();
+  set_restore_progress_sink([](const restore_progress &step) {
+    told.push_back({step.package, step.run, step.index, step.count, step.size});
+  });
+  begin_restore_run(2);
+  report_restore_step("a", restore_stage::downloading);
+  const unsigned mode = told.back().run;
+  begin_requested_restore("x");
+  report_restore_step("x", restore_stage::downloading);
+  const unsigned request = told.back().run;
+  EXPECT_EQ(request, mode + 1);
+  report_restore_step("a", restore_stage::unpacking, 70);
+  report_restore_end("x", restore_outcome::failed, QUARN_TRANSFER_FAILED);
+  report_restore_end("a", restore_outcome::restored, QUARN_OK, 70);
+  report_restore_end("b", restore_outcome::skipped, QUARN_DISABLED);
+  EXPECT_EQ(told, (std::vector<Told>{{"a", mode, 0, 2, 0},
+                                     {"x", request, 0, 1, 0},
+                                     {"a", mode, 0, 2, 70},
+                                     {"x", request, 1, 1, 0},
+                                     {"a", mode, 1, 2, 70},
+                                     {"b", mode, 2, 2, 0}}));
+  // The request is over: its package belongs to the mode again.
+  report_restore_step("x", restore_stage::downloading);
+  EXPECT_EQ(told.back().run, mode);
+}
+
+TEST_F(ReportTest, AnotherModeIsAnotherRun) {
+  told.clear();
+  set_restore_progress_sink([](const restore_progress &step) {
+    told.push_back({step.package, step.run, step.index, step.count, step.size});
+  });
+  begin_restore_run(1);
+  report_restore_end("a", restore_outcome::restored, QUARN_OK, 1);
+  begin_restore_run(3);
+  report_restore_step("b", restore_stage::downloading);
+  EXPECT_EQ(told[1].run, told[0].run + 1);
+  EXPECT_EQ(told[1].index, 0);
+  EXPECT_EQ(told[1].count, 3);
+}
+
 }  // namespace
