@@ -167,7 +167,7 @@ void set_cloud(const std::string &device, const Arguments &arguments) {
   cloud.url = arguments[2];
   std::string password_file;
   for (std::size_t i = 3; i < arguments.size(); i += 2) {
-    if (i + 1 >= arguments.size()) wrong_use();
+    if (i + 1 >= arguments.size() || arguments[i + 1].empty()) wrong_use();
     const std::string &value = arguments[i + 1];
     if (arguments[i] == "--user") {
       cloud.user = value;

@@ -58,8 +58,8 @@ class StatusObject(TestCase):
         self.assertEqual(values, {
             "AutoBackup": False, "ChargerConnected": False, "WifiConnected": True,
             "ScreenOff": False, "ConditionAlarm": 0, "LastBackup": 0, "BackupRunning": False,
-            "RestoreMode": False, "RestoreCandidates": [], "SerialNumber": SERIAL,
-            "ModelName": "Orvane One"})
+            "RestoreMode": False, "RestoreCandidates": [], "CloudProblem": "",
+            "SerialNumber": SERIAL, "ModelName": "Orvane One"})
 
     def test_changes_of_the_device_and_the_setting_are_told(self):
         self.properties()

@@ -212,6 +212,12 @@ class State(TestCase):
 
     def test_a_cloud_may_need_more_than_a_password(self):
         device = self.new_device()
+        result = device.call("set", "cloud", "s3+https://s3.example.org/fleet", "--ca-file",
+                             "own.pem", check=False, cwd=self.directory)
+        self.assertEqual((result.returncode, result.stderr),
+                         (1, "quarn-device: cannot read own.pem: No such file or directory\n"))
+        with open(self.path("own.pem"), "w"):
+            pass
         device.call("set", "cloud", "s3+https://s3.example.org/fleet/one", "--user", "key",
                     "--region", "eu-central-1", "--addressing", "virtual", "--ca-file", "own.pem",
                     input="secret\n", cwd=self.directory)
