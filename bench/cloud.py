@@ -70,7 +70,11 @@ class Dav:
             file.write("%s:%s\n" % (USER, digest))
         self.process = subprocess.Popen(["/usr/sbin/apache2", "-X", "-f",
                                          os.path.join(self.dir, "server.conf")])
-        wait_for(lambda: answers(self.port), "the WebDAV server answers")
+        try:
+            wait_for(lambda: answers(self.port), "the WebDAV server answers")
+        except BaseException:
+            self.stop()
+            raise
 
     def config(self, port):
         return {"url": "webdav+http://127.0.0.1:%d/dav" % port, "user": USER,
@@ -100,6 +104,13 @@ class S3:
         self.process = subprocess.Popen(
             ["/usr/bin/python3", "-B", os.path.join(FIXTURES, "swift_cluster.py"), self.dir],
             stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+        try:
+            self.make_bucket()
+        except BaseException:
+            self.stop()
+            raise
+
+    def make_bucket(self):
         ready = os.path.join(self.dir, "ready")
         wait_for(lambda: os.path.exists(ready), "the S3 service answers")
         with open(ready) as file:

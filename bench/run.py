@@ -3,6 +3,7 @@ import argparse
 import os
 import random
 import shutil
+import signal
 import subprocess
 import sys
 import tempfile
@@ -144,6 +145,8 @@ def main():
                         help="few runs, and ratios may be off by half")
     parser.add_argument("--only", choices=SECTIONS, action="append")
     options = parser.parse_args()
+    # Servers, devices and mounts go also when somebody ends this.
+    signal.signal(signal.SIGTERM, lambda *_: sys.exit(128 + signal.SIGTERM))
     checks = Checks(1.5 if options.short else 1.0)
     bin_dir = os.path.abspath(options.bin)
     wanted = options.only or SECTIONS

@@ -272,6 +272,8 @@ def main():
                         help="runs of a device, as the next nights would bring them")
     parser.add_argument("--only", choices=("growth", "fleet"))
     options = parser.parse_args()
+    # Servers, devices and mounts go also when somebody ends this.
+    signal.signal(signal.SIGTERM, lambda *_: sys.exit(128 + signal.SIGTERM))
     options.bin = os.path.abspath(options.bin)
     with tempfile.TemporaryDirectory(prefix="quarn-scale-") as options.work:
         wrong = []
