@@ -82,6 +82,7 @@ TEST_F(StateFile, IsNotLostToAnotherWriter) {
     });
   }
   for (std::thread &writer : writers) writer.join();
+  embedded::wait_for_state();
   std::set<int> all;
   for (const auto &mine : ids) all.insert(mine.begin(), mine.end());
   EXPECT_EQ(all.size(), static_cast<size_t>(kWriters * kAlarms));

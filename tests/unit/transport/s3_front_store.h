@@ -11,6 +11,10 @@
 
 class S3FrontStore : public TestStore {
  public:
+  /** What the service has is settled before its first thread starts. */
+  explicit S3FrontStore(const S3Model::Settings &settings = S3Model::Settings())
+      : model_(settings) {}
+
   std::string config() const override { return config_for("my%20store"); }
   std::string other_config() override { return config_for("other"); }
   std::map<std::string, std::string> content() const override { return model_.content(kPrefix); }
@@ -24,8 +28,6 @@ class S3FrontStore : public TestStore {
   void lock_out() override { model_.set_secret("changed"); }
   void let_in() override { model_.set_secret("secret"); }
   bool lists_timestamps() const override { return false; }
-
-  S3Model &model() { return model_; }
 
  private:
   static constexpr char kPrefix[] = "my store";

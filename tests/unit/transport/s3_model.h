@@ -34,6 +34,9 @@ class S3Model : public front::Service {
     std::string sticking_code = "AccessDenied";
   };
 
+  S3Model() = default;
+  explicit S3Model(const Settings &given) : settings(given) {}
+
   front::Response serve(const front::Request &request) override;
 
   Settings settings;

@@ -6,20 +6,19 @@ namespace {
 std::unique_ptr<TestStore> make_usual() { return std::make_unique<S3FrontStore>(); }
 
 std::unique_ptr<TestStore> make_sparse() {
-  auto store = std::make_unique<S3FrontStore>();
-  S3Model::Settings &settings = store->model().settings;
+  S3Model::Settings settings;
   settings.conditions = S3Model::Conditions::refused;
   settings.deletes_many = false;
   settings.tags_are_md5 = false;
   settings.encodes_keys = false;
   settings.page = 7;
-  return store;
+  return std::make_unique<S3FrontStore>(settings);
 }
 
 std::unique_ptr<TestStore> make_bare_tags() {
-  auto store = std::make_unique<S3FrontStore>();
-  store->model().settings.conditions = S3Model::Conditions::bare_tags_only;
-  return store;
+  S3Model::Settings settings;
+  settings.conditions = S3Model::Conditions::bare_tags_only;
+  return std::make_unique<S3FrontStore>(settings);
 }
 
 INSTANTIATE_TEST_SUITE_P(Store, Conformance,
