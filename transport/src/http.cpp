@@ -298,6 +298,9 @@ class Engine {
       multi_ = curl_.multi_init();
       if (multi_ == nullptr) return false;
       curl_.multi_setopt(multi_, CURLMOPT_PIPELINING, CURLPIPE_MULTIPLEX);
+      // By itself it closes connections when few transfers are left, to make others soon after.
+      curl_.multi_setopt(multi_, CURLMOPT_MAXCONNECTS,
+                         static_cast<long>(BACKUP_TRANS_MAX_CONCURRENT_TRANSFERS));
     }
     pthread_attr_t attributes;
     pthread_attr_init(&attributes);
