@@ -58,6 +58,12 @@ std::string packages_table(const BackupSet &set) {
   return table_text({"PACKAGE", "VERSION", "CRC"}, rows);
 }
 
+/** Results that the cloud may have had its part in. */
+bool of_the_cloud(int result) {
+  return result == QUARN_TRANSFER_FAILED || result == QUARN_LIST_CHECK_FAILED ||
+         result == QUARN_FAILED;
+}
+
 class Session {
  public:
   explicit Session(const Command &command);
@@ -621,7 +627,8 @@ void Session::end_watch(bool mode_ended) {
   const int result = watched_result();
   show_outcomes();
   if (result == QUARN_OK) return finish_with(QUARN_OK, "", "restore finished");
-  finish_explained(result, "not every package was restored: " + result_words(result));
+  const std::string error = "not every package was restored: " + result_words(result);
+  return of_the_cloud(result) ? finish_explained(result, error) : finish(result, error);
 }
 
 void Session::daemon_ended() {
@@ -737,9 +744,8 @@ void Session::finish_with(int result, const std::string &what, const std::string
     return finish(QUARN_OK);
   }
   const std::string error = what + " failed: " + result_words(result);
-  const bool cloud = result == QUARN_TRANSFER_FAILED || result == QUARN_LIST_CHECK_FAILED ||
-                     result == QUARN_FAILED;
-  return cloud ? finish_explained(exit_of(result), error) : finish(exit_of(result), error);
+  return of_the_cloud(result) ? finish_explained(exit_of(result), error)
+                              : finish(exit_of(result), error);
 }
 
 void Session::finish_explained(int code, const std::string &error) {

@@ -8,7 +8,9 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <memory>
 #include <mutex>
+#include <system_error>
 #include <thread>
 
 namespace embedded {
@@ -51,12 +53,12 @@ class Writer {
              StateLock lock) {
     const std::lock_guard<std::mutex> guard(mutex_);
     join();
-    thread_ = std::thread([device, file, content = std::move(content), lock = std::move(lock)] {
-      if (!write_state(device, file, content.get())) {
-        const int reason = errno;
-        g_warning("%s: %s", state_path(device, file).c_str(), g_strerror(reason));
-      }
-    });
+    const auto job = std::make_shared<Job>(Job{device, file, std::move(content), std::move(lock)});
+    try {
+      thread_ = std::thread([job] { job->run(); });
+    } catch (const std::system_error &) {
+      job->run();  // no thread is to be had, so the caller waits
+    }
   }
   void wait() {
     const std::lock_guard<std::mutex> guard(mutex_);
@@ -64,6 +66,19 @@ class Writer {
   }
 
  private:
+  struct Job {
+    std::string device;
+    std::string file;
+    KeyFilePtr content;
+    StateLock lock;
+
+    void run() const {
+      if (write_state(device, file, content.get())) return;
+      const int reason = errno;
+      g_warning("%s: %s", state_path(device, file).c_str(), g_strerror(reason));
+    }
+  };
+
   void join() {
     if (thread_.joinable()) thread_.join();
   }
