@@ -17,6 +17,7 @@ namespace {
 
 constexpr int kMovedPermanently = 301;
 constexpr std::size_t kMaxKeysPerPage = 1000;
+constexpr std::size_t kMaxPages = 1000;                        // of one listing
 constexpr std::size_t kMaxPrefixBytes = 1024 - kMaxPathBytes;  // a key has 1024 bytes at the most
 constexpr std::size_t kHashBufferBytes = 64 * 1024;
 constexpr std::size_t kMd5Bytes = 16;
@@ -139,6 +140,25 @@ struct Sending {
 struct Present {
   Version version;
   bool is_ours = false;
+};
+
+// Where a service sends whoever reads a listing: it must not be in circles, nor for ever.
+class ListingRoute {
+ public:
+  bool leads_on(const std::string &token) {
+    if (token.empty() || token == mark_ || ++pages_ > kMaxPages) return false;
+    // Any circle comes back to a mark that is set ever later.
+    if (pages_ == next_mark_) {
+      mark_ = token;
+      next_mark_ *= 2;
+    }
+    return true;
+  }
+
+ private:
+  std::string mark_;
+  std::size_t pages_ = 0;
+  std::size_t next_mark_ = 1;
 };
 
 struct Place {
@@ -426,6 +446,7 @@ class S3Backend : public Backend {
   Outcome for_each_page(Ticket &ticket, const std::string &prefix, const char *delimiter,
                         Visit visit) {
     std::string token;
+    ListingRoute route;
     do {
       Parameters parameters = {{"encoding-type", "url"},
                                {"list-type", "2"},
@@ -439,7 +460,7 @@ class S3Backend : public Backend {
       S3Listing listing;
       if (!parse_s3_listing(answer.body, &listing))
         return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's answer is not a listing");
-      if (listing.truncated && (listing.next.empty() || listing.next == token))
+      if (listing.truncated && !route.leads_on(listing.next))
         return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's listing does not go on");
       drop_others(prefix, &listing);
       const Outcome result = visit(listing);

@@ -3,10 +3,12 @@
 #include <fcntl.h>
 #include <glib.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstdlib>
 #include <memory>
+#include <utility>
 
 #include "unique_fd.h"
 
@@ -31,11 +33,21 @@ bool same_file(const struct stat &a, const struct stat &b) {
          a.st_ctim.tv_nsec == b.st_ctim.tv_nsec;
 }
 
-std::string value_of(GKeyFile *file, const char *key) {
-  char *value = g_key_file_get_string(file, kGroup, key, nullptr);
-  std::string text = value == nullptr ? "" : value;
+bool is_plain_text(const std::string &text) {
+  return std::none_of(text.begin(), text.end(), [](char c) { return g_ascii_iscntrl(c); });
+}
+
+/** @return false when something stands there that is no line of text */
+bool read_value(GKeyFile *file, const char *key, std::string *text) {
+  if (g_key_file_has_key(file, kGroup, key, nullptr) == FALSE) return true;
+  GError *error = nullptr;
+  char *value = g_key_file_get_string(file, kGroup, key, &error);
+  // An unknown escape is an error, and what could be read until then comes along.
+  const bool whole = error == nullptr && value != nullptr;
+  if (whole) *text = value;
+  g_clear_error(&error);
   g_free(value);
-  return text;
+  return whole && is_plain_text(*text);
 }
 
 bool read_all(int fd, std::string *text) {
@@ -90,15 +102,25 @@ bool ConfigFile::read() {
     problem_ = path_ + ": not a key file";
     return false;
   }
-  config_.url = value_of(file.get(), "url");
-  config_.user = value_of(file.get(), "user");
-  config_.password = value_of(file.get(), "password");
-  config_.ca_file = value_of(file.get(), "ca-file");
-  config_.region = value_of(file.get(), "region");
-  config_.addressing = value_of(file.get(), "addressing");
+  const std::pair<const char *, std::string *> values[] = {
+      {"url", &config_.url},           {"user", &config_.user},
+      {"password", &config_.password}, {"ca-file", &config_.ca_file},
+      {"region", &config_.region},     {"addressing", &config_.addressing}};
+  for (const auto &[key, value] : values) {
+    if (read_value(file.get(), key, value)) continue;
+    config_ = {};
+    problem_ = path_ + ": " + key + " is not a line of UTF-8 text";
+    return false;
+  }
   if (!config_.password.empty() && (status.st_mode & kOthers) != 0) {
     config_ = {};
     problem_ = path_ + ": holds a password and is not of mode 0600";
+    return false;
+  }
+  // HTTP would take what follows for the password.
+  if (config_.user.find(':') != std::string::npos) {
+    config_ = {};
+    problem_ = path_ + ": user holds a colon";
     return false;
   }
   if (config_.url.empty()) {

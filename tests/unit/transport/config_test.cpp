@@ -66,6 +66,30 @@ TEST(ConfigFileTest, ProblemsNeverQuoteTheContent) {
   }
 }
 
+TEST(ConfigFileTest, ValuesAreLinesOfText) {
+  const TempDir dir;
+  const std::pair<const char *, const char *> cases[] = {
+      {"url=file:///x\npassword=\xff\xfe", "password is not a line of UTF-8 text"},
+      {"url=file:///x\npassword=a\\nb", "password is not a line of UTF-8 text"},
+      {"url=file:///x\npassword=a\x01", "password is not a line of UTF-8 text"},
+      {"url=file:///x\npassword=\\q", "password is not a line of UTF-8 text"},
+      {"url=file:///x\nuser=a\\rb", "user is not a line of UTF-8 text"},
+      {"url=file:///\\n", "url is not a line of UTF-8 text"},
+      {"url=file:///x\nuser=ada:secret", "user holds a colon"},
+  };
+  for (const auto &[text, problem] : cases) {
+    write_file(dir / "c", std::string("[cloud]\n") + text + "\n", 0600);
+    ConfigFile file(dir / "c");
+    EXPECT_FALSE(file.refresh()) << text;
+    EXPECT_EQ(file.problem(), (dir / "c") + ": " + problem);
+    EXPECT_TRUE(file.config().password.empty());
+  }
+  write_file(dir / "c", "[cloud]\nurl=file:///x\npassword= \\sp\xc3\xa4 \\\\#;=: \n", 0600);
+  ConfigFile file(dir / "c");
+  ASSERT_TRUE(file.refresh());
+  EXPECT_EQ(file.config().password, " p\xc3\xa4 \\#;=: ");
+}
+
 TEST(ConfigFileTest, AbsentAndUnreadableFilesAreNamed) {
   const TempDir dir;
   ConfigFile absent(dir / "absent");

@@ -2,6 +2,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <mutex>
 
 #include "harness.h"
@@ -600,6 +601,23 @@ TEST_F(S3BackendTest, ListingsThatAreNoneAreErrors) {
     ASSERT_TRUE(cloud->settle());
     EXPECT_EQ(list->code, BACKUP_TRANS_ERROR_SERVER) << answer.body;
     EXPECT_LE(service.count(0), 2);
+  }
+}
+
+TEST_F(S3BackendTest, ListingsThatLeadInCirclesOrNeverEndAreErrors) {
+  for (const int tokens : {1, 2, 7, 1000000}) {
+    std::atomic<int> given{0};
+    service.set_rules({editing("GET", [&, tokens](Response *response) {
+      response->body = "<ListBucketResult><IsTruncated>true</IsTruncated><NextContinuationToken>" +
+                       std::to_string(given++ % tokens) +
+                       "</NextContinuationToken></ListBucketResult>";
+    })});
+    const AnswerPtr list = cloud->list("/f");
+    const AnswerPtr removal = cloud->remove("/f");
+    ASSERT_TRUE(cloud->settle());
+    EXPECT_EQ(list->code, BACKUP_TRANS_ERROR_SERVER) << tokens;
+    EXPECT_EQ(removal->code, BACKUP_TRANS_ERROR_SERVER) << tokens;
+    EXPECT_LE(service.count(0), 2 * std::min(8 * tokens, 1001)) << tokens;
   }
 }
 
