@@ -1,12 +1,17 @@
+#include <fcntl.h>
 #include <glib.h>
 #include <json-c/json.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <termios.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
-#include <fstream>
-#include <iostream>
+#include <iterator>
 #include <memory>
 
 #include "backup_transport.h"
@@ -20,15 +25,48 @@ constexpr char kCloudFile[] = "cloud.conf";
 constexpr char kCloudGroup[] = "cloud";
 constexpr char kConfigVariable[] = "QUARN_CLOUD_CONFIG";
 constexpr char kWarningSubject[] = "cloud transport: ";
+constexpr const char *kKinds[] = {"file:///", "webdav+https://", "webdav+http://", "s3+https://",
+                                  "s3+http://"};
+constexpr char kAnyCredential[] = "any";
 constexpr mode_t kPrivateFile = 0600;
+constexpr std::size_t kMaxPasswordBytes = 4096;
 
-bool is_loopback(const std::string &host) {
-  return host == "localhost" || host == "127.0.0.1" || host == "::1" || host == "[::1]";
-}
+/* ---- the password ---- */
 
-std::string read_line(std::istream &in) {
+/** Asks whoever sits at a terminal, and keeps what is typed there off the screen. */
+class Prompt {
+ public:
+  Prompt() : shown_(isatty(STDIN_FILENO) != 0 && tcgetattr(STDIN_FILENO, &before_) == 0) {
+    if (!shown_) return;
+    termios hidden = before_;
+    // An interrupt would leave the terminal so.
+    hidden.c_lflag &= ~static_cast<tcflag_t>(ECHO | ISIG);
+    tcsetattr(STDIN_FILENO, TCSAFLUSH, &hidden);
+    std::fputs("Password: ", stderr);
+  }
+  Prompt(const Prompt &) = delete;
+  Prompt &operator=(const Prompt &) = delete;
+  ~Prompt() {
+    if (!shown_) return;
+    tcsetattr(STDIN_FILENO, TCSAFLUSH, &before_);
+    std::fputs("\n", stderr);
+  }
+
+ private:
+  termios before_{};
+  bool shown_;
+};
+
+std::string read_line(int fd, const std::string &name) {
   std::string line;
-  std::getline(in, line);
+  for (char c = 0;;) {
+    const ssize_t count = read(fd, &c, 1);
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) throw Failure("cannot read " + name + ": " + reason());
+    if (count == 0 || c == '\n') break;
+    if (line.size() == kMaxPasswordBytes) throw Failure("the password is too long");
+    line += c;
+  }
   if (!line.empty() && line.back() == '\r') line.pop_back();
   return line;
 }
@@ -36,13 +74,17 @@ std::string read_line(std::istream &in) {
 std::string read_password(const std::string &path) {
   std::string password;
   if (path.empty()) {
-    password = read_line(std::cin);
+    const Prompt prompt;
+    password = read_line(STDIN_FILENO, "standard input");
   } else {
-    std::ifstream file(path);
-    if (!file) throw Failure("cannot read " + path + ": " + reason());
-    password = read_line(file);
+    const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) throw Failure("cannot read " + path + ": " + reason());
+    password = read_line(fd, path);
+    close(fd);
   }
   if (password.empty()) throw Failure("no password was given");
+  // A text of C would end there.
+  if (password.find('\0') != std::string::npos) throw Failure("the password is no text");
   return password;
 }
 
@@ -53,10 +95,27 @@ std::string absolute(const std::string &path) {
   return found.get();
 }
 
-/* ---- the check ---- */
+std::string text_of(const Cloud &cloud) {
+  const embedded::KeyFilePtr file(g_key_file_new());
+  const auto put = [&file](const char *key, const std::string &value) {
+    if (!value.empty()) g_key_file_set_string(file.get(), kCloudGroup, key, value.c_str());
+  };
+  put("url", cloud.url);
+  put("user", cloud.user);
+  put("password", cloud.password);
+  put("ca-file", cloud.ca_file);
+  put("region", cloud.region);
+  put("addressing", cloud.addressing);
+  gsize length = 0;
+  const embedded::GText text(g_key_file_to_data(file.get(), &length, nullptr));
+  return std::string(text.get(), length);
+}
+
+/* ---- what the library says ---- */
 
 struct Check {
   GMainLoop *loop = nullptr;
+  bool with_store = false;
   backup_trans_cause cause = BACKUP_TRANS_CAUSE_DEVICE;
   backup_trans_error_code error = BACKUP_TRANS_ERROR_NOT_INITIALIZED;
   std::string message;
@@ -64,12 +123,12 @@ struct Check {
 
 /** The library warns of a configuration that it cannot use; here that is the answer. */
 GLogWriterOutput take_warning(GLogLevelFlags, const GLogField *fields, gsize count,
-                              gpointer check) {
+                              gpointer message) {
   for (gsize i = 0; i < count; ++i) {
     if (g_strcmp0(fields[i].key, "MESSAGE") != 0) continue;
     const std::string text = static_cast<const char *>(fields[i].value);
     const std::size_t colon = text.find(kWarningSubject) == 0 ? sizeof kWarningSubject - 1 : 0;
-    static_cast<Check *>(check)->message = text.substr(colon);
+    *static_cast<std::string *>(message) = text.substr(colon);
   }
   return G_LOG_WRITER_HANDLED;
 }
@@ -85,19 +144,34 @@ void on_checked(backup_trans_error_code error, void *data, backup_trans_cause ca
 
 void on_started(backup_trans_error_code error, void *data) {
   Check &check = *static_cast<Check *>(data);
-  if (error == BACKUP_TRANS_ERROR_NONE &&
+  if (error == BACKUP_TRANS_ERROR_NONE && check.with_store &&
       backup_trans_check_async(backup_trans_create_handle(), data, on_checked) ==
           BACKUP_TRANS_ERROR_NONE)
     return;
+  if (!check.with_store) check.error = error;
   g_main_loop_quit(check.loop);
 }
 
-void run(Check *check) {
-  g_log_set_writer_func(take_warning, check, nullptr);
+std::string &last_warning() {
+  // A process may set its writer once.
+  static std::string *const warning = [] {
+    auto *text = new std::string;
+    g_log_set_writer_func(take_warning, text, nullptr);
+    return text;
+  }();
+  return *warning;
+}
+
+/** Have the library look at a configuration, and try out its store where that is wanted. */
+void run(const std::string &config, Check *check) {
+  std::string &warning = last_warning();
+  warning.clear();
+  setenv(kConfigVariable, config.c_str(), 1);
   check->loop = g_main_loop_new(nullptr, FALSE);
   if (backup_trans_init(check, on_started) == BACKUP_TRANS_ERROR_NONE) g_main_loop_run(check->loop);
   g_main_loop_unref(check->loop);
   backup_trans_deinit();
+  if (check->message.empty()) check->message = warning;
 }
 
 void print_json(const Check &check) {
@@ -113,51 +187,35 @@ void print_json(const Check &check) {
 
 }  // namespace
 
+void check_cloud(const Cloud &cloud) {
+  // The URL is never quoted: there may be a password in it.
+  if (std::none_of(std::begin(kKinds), std::end(kKinds),
+                   [&](const char *kind) { return cloud.url.rfind(kind, 0) == 0; }))
+    throw Failure(
+        "that is no cloud: use file:///PATH, webdav+https://HOST/PATH or "
+        "s3+https://HOST/BUCKET/PREFIX");
+  // In memory, where nothing is left of what is refused.
+  const int fd = memfd_create(kCloudFile, MFD_CLOEXEC);
+  const std::string text = text_of(cloud);
+  if (fd < 0 || fchmod(fd, kPrivateFile) != 0 ||
+      write(fd, text.data(), text.size()) != static_cast<ssize_t>(text.size()))
+    throw Failure("cannot look at the cloud's configuration: " + reason());
+  const std::string path = "/proc/self/fd/" + std::to_string(fd);
+  Check check;
+  run(path, &check);
+  close(fd);
+  if (check.error == BACKUP_TRANS_ERROR_NONE) return;
+  const std::string place = path + ": ";
+  throw Failure(check.message.rfind(place, 0) == 0 ? check.message.substr(place.size())
+                                                   : check.message);
+}
+
 void check_cloud_url(const std::string &url) {
-  GError *error = nullptr;
-  GUri *uri = g_uri_parse(url.c_str(), G_URI_FLAGS_NONE, &error);
-  if (uri == nullptr) {
-    const std::string text = error->message;
-    g_error_free(error);
-    throw Failure("\"" + url + "\" is no cloud URL: " + text);
-  }
-  const std::string scheme = g_uri_get_scheme(uri);
-  const std::string host = g_uri_get_host(uri) == nullptr ? "" : g_uri_get_host(uri);
-  const std::string path = g_uri_get_path(uri);
-  const bool has_user = g_uri_get_userinfo(uri) != nullptr;
-  g_uri_unref(uri);
-  if (has_user) throw Failure("a cloud URL holds no user or password: use --user");
-  if (scheme == "file") {
-    if (!host.empty() || path.empty() || path[0] != '/') {
-      throw Failure("a folder is named file:///PATH");
-    }
-    return;
-  }
-  const bool encrypted = scheme == "webdav+https" || scheme == "s3+https";
-  const bool plain = scheme == "webdav+http" || scheme == "s3+http";
-  if (!encrypted && !plain) {
-    throw Failure("\"" + scheme + "\" is no kind of cloud: use file, webdav+https or s3+https");
-  }
-  if (host.empty()) throw Failure("\"" + url + "\" names no host");
-  if (plain && !is_loopback(host)) throw Failure("plain http is for this machine only: use https");
+  check_cloud({url, kAnyCredential, kAnyCredential, "", "", ""});
 }
 
 void write_cloud(const std::string &device, const Cloud &cloud) {
-  check_cloud_url(cloud.url);
-  const embedded::KeyFilePtr file(g_key_file_new());
-  const auto put = [&file](const char *key, const std::string &value) {
-    if (!value.empty()) g_key_file_set_string(file.get(), kCloudGroup, key, value.c_str());
-  };
-  put("url", cloud.url);
-  put("user", cloud.user);
-  put("password", cloud.password);
-  put("ca-file", cloud.ca_file);
-  put("region", cloud.region);
-  put("addressing", cloud.addressing);
-  gsize length = 0;
-  const embedded::GText text(g_key_file_to_data(file.get(), &length, nullptr));
-  if (!embedded::write_state_text(device, kCloudFile, std::string(text.get(), length),
-                                  kPrivateFile)) {
+  if (!embedded::write_state_text(device, kCloudFile, text_of(cloud), kPrivateFile)) {
     throw Failure("cannot write the cloud's configuration: " + reason());
   }
 }
@@ -185,18 +243,22 @@ void set_cloud(const std::string &device, const Arguments &arguments) {
     }
   }
   if (cloud.user.empty() && !password_file.empty()) wrong_use();
-  // Nobody is asked for a password for an address that is refused.
-  check_cloud_url(cloud.url);
-  if (!cloud.user.empty()) cloud.password = read_password(password_file);
+  // Nobody is asked for a password for what is refused anyway.
+  if (!cloud.user.empty()) cloud.password = kAnyCredential;
+  check_cloud(cloud);
+  if (!cloud.user.empty()) {
+    cloud.password = read_password(password_file);
+    check_cloud(cloud);
+  }
   write_cloud(device, cloud);
 }
 
 int verb_cloud_check(const Arguments &arguments) {
   const bool json = arguments.size() == 2 && arguments[1] == "--json";
   if (arguments.empty() || arguments.size() > 2 || (arguments.size() == 2 && !json)) wrong_use();
-  setenv(kConfigVariable, embedded::state_path(open_device(arguments[0]), kCloudFile).c_str(), 1);
   Check check;
-  run(&check);
+  check.with_store = true;
+  run(embedded::state_path(open_device(arguments[0]), kCloudFile), &check);
   if (json) {
     print_json(check);
   } else {

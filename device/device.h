@@ -67,7 +67,9 @@ struct Cloud {
   std::string region;     /**< s3 only; empty: the usual one */
   std::string addressing; /**< s3 only; empty: the usual one */
 };
-/** Fails when the transport could not take the URL. */
+/** Fails when the transport could not take it. */
+void check_cloud(const Cloud &cloud);
+/** The same for a URL alone, whose credentials come later. */
 void check_cloud_url(const std::string &url);
 /** Replaces the device's cloud, which the daemon uses from its next request on. */
 void write_cloud(const std::string &device, const Cloud &cloud);

@@ -378,7 +378,8 @@ class WebdavBackend : public Backend {
 
   Outcome ensure_folder(Ticket &ticket, const std::string &folder, Uploaded *uploaded) {
     if (is_known(folder)) return success();
-    HttpAnswer answer = client_.send(ticket, "MKCOL", folder + "/");
+    HttpAnswer answer =
+        folder.empty() ? client_.make_top(ticket) : client_.send(ticket, "MKCOL", folder + "/");
     if ((has_status(answer, kHttpConflict) || is_absent(answer)) && !folder.empty()) {
       const Outcome parent = ensure_folder(ticket, parent_of(folder), uploaded);
       if (!parent.ok()) return parent;
@@ -406,8 +407,10 @@ class WebdavBackend : public Backend {
     if (has_status(answer, kHttpMethodNotAllowed))
       return failure(BACKUP_TRANS_ERROR_SERVER, "make a folder: there is an object in its place");
     Outcome result = of_upload(dav_outcome(answer, "make a folder"));
+    // Nothing lies above the store that could have been made.
+    if (folder.empty() && has_status(answer, kHttpConflict)) result.wrong_address = true;
     // Somebody removed a parent in between.
-    if (has_status(answer, kHttpConflict)) {
+    if (has_status(answer, kHttpConflict) && !folder.empty()) {
       forget("");
       result.transient = true;
     }

@@ -157,6 +157,19 @@ Outcome DavClient::list(Ticket &ticket, const std::string &folder, DavListing *l
   return success();
 }
 
+HttpAnswer DavClient::make_top(Ticket &ticket) const { return make_collection(ticket, url_.path); }
+
+// By its path on the server.
+HttpAnswer DavClient::make_collection(Ticket &ticket, const std::string &path) const {
+  HttpRequest request = request_for("MKCOL", "/");
+  request.url = url_.origin + encode_path(path) + "/";
+  const HttpAnswer answer = http_perform(ticket, request);
+  const bool lacks_parent = has_status(answer, kHttpConflict) || is_absent(answer);
+  if (!lacks_parent || parent_of(path).empty() || !make_collection(ticket, parent_of(path)).good())
+    return answer;
+  return http_perform(ticket, request);
+}
+
 bool DavClient::is_folder(Ticket &ticket, const std::string &folder) const {
   DavListing listing;
   std::vector<DavEntry> temporary;

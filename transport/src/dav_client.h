@@ -69,6 +69,9 @@ class DavClient {
    */
   Outcome list(Ticket &ticket, const std::string &folder, DavListing *listing) const;
 
+  /** Make the folder that the store is, and those that it lies in where they are missing. */
+  HttpAnswer make_top(Ticket &ticket) const;
+
   /** Is there a folder of that name? Also false when that is not known. */
   bool is_folder(Ticket &ticket, const std::string &folder) const;
 
@@ -99,6 +102,7 @@ class DavClient {
 
  private:
   HttpRequest question(const char *body, const std::string &folder, const char *depth) const;
+  HttpAnswer make_collection(Ticket &ticket, const std::string &path) const;
   std::string find_lock(const std::string &folder, const std::string &owner) const;
   HttpAnswer propfind(Ticket &ticket, const std::string &folder, const char *depth) const;
   bool is_object(Ticket &ticket, std::string path) const;
