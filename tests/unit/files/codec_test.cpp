@@ -281,6 +281,76 @@ TEST(IsalCodec, HowTheSourceCutsItsBytesDoesNotShow) {
   EXPECT_TRUE(sink.text == deflated_by(kIsal, plain));
 }
 
+/** Small texts of one kind, none like another. */
+std::string note(unsigned int number) {
+  return words(1500 + number * 37 % 2000).substr(number % 700);
+}
+
+/** What @p plain becomes; what it took to inflate it is checked. */
+std::size_t deflated_size(Codec *deflater, const std::string &plain) {
+  TextSource source(plain);
+  TextSink deflated;
+  CodecTotals totals;
+  EXPECT_EQ(deflater->deflate(&source, &deflated, &totals), CodecResult::kDone);
+  EXPECT_EQ(totals.plain, plain.size());
+  EXPECT_EQ(totals.deflated, deflated.text.size());
+  EXPECT_EQ(totals.crc, crc_of(plain));
+  for (const Kind &reader : {kIsal, kZlib}) {
+    TextSource again(deflated.text);
+    TextSink inflated;
+    EXPECT_EQ(reader.make(CodecUse::kInflate)->inflate(&again, &inflated, &totals),
+              CodecResult::kDone);
+    EXPECT_TRUE(inflated.text == plain) << reader.name;
+  }
+  return deflated.text.size();
+}
+
+TEST(IsalCodec, SmallFilesOfOneKindShareACodeAndAreHardlyLarger) {
+  const auto together = make_isal_codec(CodecUse::kDeflate);
+  std::size_t shared = 0;
+  std::size_t alone = 0;
+  std::size_t other = 0;
+  for (unsigned int i = 0; i < 60; ++i) {
+    const std::size_t one = deflated_by(kIsal, note(i)).size();
+    const std::size_t size = deflated_size(together.get(), note(i));
+    shared += size;
+    alone += one;
+    if (size != one) ++other;
+  }
+  EXPECT_GT(other, 50U);
+  EXPECT_LT(shared, alone * 11 / 10);
+}
+
+TEST(IsalCodec, ASmallFileThatTheSharedCodeDoesNotSuitGetsItsOwn) {
+  const auto together = make_isal_codec(CodecUse::kDeflate);
+  deflated_size(together.get(), note(1));
+  for (int i = 0; i < 40; ++i) {
+    for (const std::string &stranger : {noise(3000), std::string(3000, '\xff')}) {
+      EXPECT_LE(deflated_size(together.get(), stranger),
+                deflated_by(kIsal, stranger).size() * 3 / 2);
+    }
+    deflated_size(together.get(), note(2));
+  }
+}
+
+TEST(IsalCodec, SmallFilesOfEverySizeAndKindInTurnComeBack) {
+  const auto together = make_isal_codec(CodecUse::kDeflate);
+  for (std::size_t size = 0; size < 5000; size += 83) {
+    deflated_size(together.get(), words(size));
+    deflated_size(together.get(), noise(size));
+    deflated_size(together.get(), std::string(size, 'a'));
+  }
+}
+
+TEST(IsalCodec, TheSharedCodeStartsAnewWithEachCodec) {
+  std::vector<std::size_t> sizes[2];
+  for (auto &run : sizes) {
+    const auto codec = make_isal_codec(CodecUse::kDeflate);
+    for (unsigned int i = 0; i < 20; ++i) run.push_back(deflated_size(codec.get(), note(i)));
+  }
+  EXPECT_EQ(sizes[0], sizes[1]);
+}
+
 TEST(IsalCodec, TakesAnyMemoryWhereItsPlacesAreTaken) {
   const std::string plain = words(300 * kKiB);
   const Fault fault("mmap", ENOMEM, 0, 1000);
