@@ -149,15 +149,12 @@ bool copy_bytes(int from, int to, off_t size) {
   return true;
 }
 
-/** Copy a file the quick way; false, and nothing is left, when that cannot be done. */
-bool copy_within(int from_dir, int to_dir, const char *name) {
-  const int from_flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
-  const UniqueFd from(openat(from_dir, name, from_flags));
-  struct stat status = {};
-  if (!from || fstat(from.get(), &status) != 0 || !S_ISREG(status.st_mode)) return false;
+/** Copy an open file the quick way; false, and nothing is left, when that cannot be done. */
+bool copy_within(const UniqueFd &from, off_t size, int to_dir, const char *name) {
+  if (!from) return false;
   UniqueFd to(openat(to_dir, name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kCopyMode));
   if (!to) return false;
-  const bool copied = copy_bytes(from.get(), to.get(), status.st_size);
+  const bool copied = copy_bytes(from.get(), to.get(), size);
   if (close(to.release()) == 0 && copied) return true;
   unlinkat(to_dir, name, 0);
   return false;
@@ -238,24 +235,6 @@ void put_attributes_back(json_object *table, const char *root) {
   }
 }
 
-/** One installed package of the sweep; always goes on. */
-bool recover_package(package_info_h info, void * /*user_data*/) {
-  CString pkgid;
-  CString root;
-  int result = package_info_get_package(info, out(pkgid));
-  if (result != PACKAGE_MANAGER_ERROR_NONE || pkgid == nullptr) {
-    LOGE("package_info_get_package() was failed, ret = [%d]", result);
-    return true;
-  }
-  result = package_info_get_root_path(info, out(root));
-  if (result != PACKAGE_MANAGER_ERROR_NONE || root == nullptr) {
-    LOGE("package_info_get_root_path() was failed, ret = [%d]", result);
-    return true;
-  }
-  recover_interrupted_restore(pkgid.get(), root.get());
-  return true;
-}
-
 }  // namespace
 
 void discard_snapshot(const char *pkgid, const char *root) {
@@ -325,7 +304,11 @@ int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid,
       if (files.is_archive(path) || path.compare(0, snapshot.size(), snapshot) == 0) continue;
       restore_step("snapshot-entry");
       struct stat status = {};
-      const int found = fstatat(dirfd(handle.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
+      UniqueFd file;  // what the directory calls a file need not be looked at twice
+      if (entry->d_type == DT_REG)
+        file = safe_open_file_at(dirfd(handle.get()), entry->d_name, &status);
+      const int found =
+          file ? 0 : fstatat(dirfd(handle.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
       if (found != 0) {
         LOGE("error : lstat for %d %s", found, path.c_str());
         continue;
@@ -335,7 +318,7 @@ int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid,
         continue;
       }
       int error = QUARN_OK;
-      add_to_file_info_table(table, root, path.c_str(), status, &error);
+      add_to_file_info_table(table, root, path.c_str(), status, &error, file.get());
       if (error != QUARN_OK) result = 0;
       if (S_ISDIR(status.st_mode)) {
         pending.push_back(path);
@@ -348,7 +331,7 @@ int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid,
         std::string name;
         target = safe_open_parent(copy.c_str(), &name);
       }
-      if (copy_within(dirfd(handle.get()), target.get(), entry->d_name)) continue;
+      if (copy_within(file, status.st_size, target.get(), entry->d_name)) continue;
       if (!create_directory_of_file(copy.c_str()) || !copy_file(path.c_str(), copy.c_str())) {
         LOGE("fail copy : from %s to %s", path.c_str(), copy.c_str());
         result = 0;
@@ -439,11 +422,4 @@ bool recover_interrupted_restore(const char *pkgid, const char *root) {
     unlink_entry(files.snapshot);
   }
   return false;
-}
-
-void recover_interrupted_restores() {
-  const int result = package_manager_foreach_package_info(recover_package, nullptr);
-  if (result != PACKAGE_MANAGER_ERROR_NONE) {
-    LOGE("package_manager_foreach_package_info() failed %d", result);
-  }
 }

@@ -34,14 +34,24 @@ int walk_directory(const walk_context &ctx, const std::string &dir, const struct
 /** One directory of the walk; what lies in it follows once its parent is closed. */
 using Found = std::vector<std::pair<std::string, struct stat>>;
 
-int restore_entry(const walk_context &ctx, int dir, const char *name, const std::string &path,
+/** What an entry is, and a descriptor to change it by; none, with errno, when it is gone. */
+UniqueFd open_entry(int dir, const dirent &entry, struct stat *status) {
+  UniqueFd object;
+  // The label of a file that is open is read without a walk to it.
+  if (entry.d_type == DT_REG) object = safe_open_file_at(dir, entry.d_name, status);
+  if (object) return object;
+  object.reset(openat(dir, entry.d_name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (object && fstat(object.get(), status) != 0) return {};
+  return object;
+}
+
+int restore_entry(const walk_context &ctx, int dir, const dirent &entry, const std::string &path,
                   Found *found) {
-  const UniqueFd object(openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
   struct stat status = {};
-  const int result = object ? fstat(object.get(), &status) : -1;
-  if (result != 0) {
+  const UniqueFd object = open_entry(dir, entry, &status);
+  if (!object) {
     const bool vanished = errno == ENOENT;
-    LOGE("error : lstat for %d %s", result, path.c_str());
+    LOGE("error : lstat for %d %s", -1, path.c_str());
     return vanished ? 1 : 0;
   }
   if (S_ISLNK(status.st_mode)) return 1;
@@ -85,7 +95,7 @@ int walk_directory(const walk_context &ctx, const std::string &dir, const struct
       const PathStep step(&path, entry->d_name);
       if (ctx.files.is_skipped(path)) continue;
       restore_step("attributes");
-      if (!restore_entry(ctx, dirfd(handle.get()), entry->d_name, path, &found)) result = 0;
+      if (!restore_entry(ctx, dirfd(handle.get()), *entry, path, &found)) result = 0;
     }
   }
   // One descriptor at a time, however deep the tree is.

@@ -245,6 +245,11 @@ bool copy_in_kernel(int from, int to, bool *copied) {
 
 }  // namespace
 
+bool is_safe_path_component(const std::string &text) {
+  return !text.empty() && text != "." && text != ".." && text.find('/') == std::string::npos &&
+         text.find('\0') == std::string::npos;
+}
+
 bool file_exist(const char *path) {
   struct stat status = {};
   return safe_lstat(path, &status) == 0 && S_ISREG(status.st_mode);

@@ -22,6 +22,7 @@ constexpr char kLabelKey[] = "3";
 
 constexpr mode_t kPermissionBits = 07777;
 constexpr std::size_t kTargetBuffer = 1024;
+constexpr int kNotOpen = -1;
 
 void add_constant(json_object *object, const char *key, json_object *value) {
   json_object_object_add_ex(object, key, value,
@@ -48,12 +49,12 @@ json_object *attribute_object(file_info_table_h *table, int permission, unsigned
 
 /** The same for one entry, whatever of it can be read. */
 json_object *attributes_of(file_info_table_h *table, const char *path, const struct stat &stat,
-                           int *error, bool *complete) {
+                           int fd, int *error, bool *complete) {
   int permission = 0;
   unsigned int uid = 0;
   unsigned int gid = 0;
   CString label;
-  *complete = get_file_info_from_file(path, stat, &permission, &uid, &gid, out(label));
+  *complete = get_file_info_from_file(path, stat, &permission, &uid, &gid, out(label), fd);
   if (label == nullptr) {
     LOGE("error : cannot get smack label of %s", path);
     *error = QUARN_REFUSED;
@@ -89,13 +90,15 @@ void release_file_info_table(file_info_table_h *table) {
 }
 
 bool get_file_info_from_file(const char *path, const struct stat &stat, int *permission,
-                             unsigned int *uid, unsigned int *gid, char **label) {
+                             unsigned int *uid, unsigned int *gid, char **label, int fd) {
   *permission = static_cast<int>(stat.st_mode & kPermissionBits);
   *uid = stat.st_uid;
   *gid = stat.st_gid;
   *label = nullptr;
+  const std::string opened = fd < 0 ? std::string() : fd_path(fd);
+  const char *object = fd < 0 ? path : opened.c_str();
   const int result = S_ISLNK(stat.st_mode) ? smack_lgetlabel(path, label, SMACK_LABEL_ACCESS)
-                                           : smack_getlabel(path, label, SMACK_LABEL_ACCESS);
+                                           : smack_getlabel(object, label, SMACK_LABEL_ACCESS);
   if (result != 0) {
     LOGE("error : cannot get smack label of %s (err=%d)", path, result);
     return false;
@@ -104,9 +107,9 @@ bool get_file_info_from_file(const char *path, const struct stat &stat, int *per
 }
 
 void add_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
-                            const struct stat &stat, int *error) {
+                            const struct stat &stat, int *error, int fd) {
   bool complete = false;
-  json_object *attributes = attributes_of(table, path, stat, error, &complete);
+  json_object *attributes = attributes_of(table, path, stat, fd, error, &complete);
   if (!complete) *error = QUARN_REFUSED;
   json_object_object_add(table->root, relative_name(root, path), attributes);
 }
@@ -128,7 +131,7 @@ void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root,
   }
   LOGI("%s -> %s", path, target);
   bool complete = false;
-  json_object *attributes = attributes_of(table, path, stat, error, &complete);
+  json_object *attributes = attributes_of(table, path, stat, kNotOpen, error, &complete);
   json_object *entry = json_object_new_object();
   add_constant(entry, kRealNameKey, json_object_new_string(relative_name(root, path)));
   add_constant(entry, kLinkKey, json_object_new_string(target));

@@ -48,11 +48,6 @@ AppRecordPtr get_app_record(const char *appid, const char **api_version) {
 
 }  // namespace
 
-bool is_safe_path_component(const std::string &text) {
-  return !text.empty() && text != "." && text != ".." && text.find('/') == std::string::npos &&
-         text.find('\0') == std::string::npos;
-}
-
 bool app_support_api_version(const char *appid, const char *version) {
   const char *api_version = nullptr;
   const AppRecordPtr app = get_app_record(appid, &api_version);

@@ -29,6 +29,8 @@
 
 /* ---- file.cpp: any thread ------------------------------------------------ */
 
+/** True when an id may name a file or folder: not empty, not "." or "..", no "/", no NUL. */
+bool is_safe_path_component(const std::string &text);
 /** True for a regular file; a link is neither file nor directory. */
 bool file_exist(const char *path);
 /** True for a directory. */
@@ -74,12 +76,19 @@ struct file_info_table_h {
 void ready_file_info_table(file_info_table_h **table);
 /** Release a table; null is accepted. */
 void release_file_info_table(file_info_table_h *table);
-/** Attributes of one entry; @p label is malloc'd, null when it could not be read. */
+/**
+ * Attributes of one entry; @p label is malloc'd, null when it could not be read.
+ * @param fd the entry's descriptor, borrowed, when it is open: its label is then the label of what
+ *           was opened, found without another walk along the path; else negative
+ */
 bool get_file_info_from_file(const char *path, const struct stat &stat, int *permission,
-                             unsigned int *uid, unsigned int *gid, char **label);
-/** Add a directory or a regular file. *@p error becomes 36 on failure, else stays. */
+                             unsigned int *uid, unsigned int *gid, char **label, int fd = -1);
+/**
+ * Add a directory or a regular file. *@p error becomes 36 on failure, else stays.
+ * @param fd as for get_file_info_from_file()
+ */
 void add_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
-                            const struct stat &stat, int *error);
+                            const struct stat &stat, int *error, int fd = -1);
 /** Add a symbolic link. *@p error becomes 36 on failure, else stays. */
 void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
                                      const struct stat &stat, int *error);
@@ -164,8 +173,6 @@ bool extract_file_from_zip(const char *pkg_id, const char *destination, unzFile 
 extern std::vector<std::string> install_complete_pkgs;
 extern std::mutex installed_check_mutex;
 
-/** True when an id may name a file or folder: not empty, not "." or "..", no "/", no NUL. */
-bool is_safe_path_component(const std::string &text);
 /** True when the application's API version is at least @p version, compared as bytes. */
 bool app_support_api_version(const char *appid, const char *version);
 /** True when the application takes part in backup. */

@@ -199,6 +199,12 @@ DirPtr safe_opendir_at(int dir, const char *name) {
   return opened;
 }
 
+UniqueFd safe_open_file_at(int dir, const char *name, struct stat *status) {
+  UniqueFd fd(openat(dir, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (!fd || fstat(fd.get(), status) != 0 || !S_ISREG(status->st_mode)) return {};
+  return fd;
+}
+
 bool is_dot_entry(const char *name) {
   return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'));
 }

@@ -40,6 +40,12 @@ DirPtr safe_opendir(const char *path);
 DirPtr safe_opendir_at(int dir, const char *name);
 inline constexpr int kMaxDirDepth = 400;
 
+/**
+ * Open the regular file @p name of the directory @p dir for reading, and tell its status; none
+ * when it cannot be opened or is anything else, a link included.
+ */
+UniqueFd safe_open_file_at(int dir, const char *name, struct stat *status);
+
 /** True for "." and "..". */
 bool is_dot_entry(const char *name);
 

@@ -202,13 +202,6 @@ int open_entry(zipFile zip, const char *name) {
                                  0);
 }
 
-/** Open a regular file and tell its status; none when it is anything else. */
-UniqueFd open_regular_at(int dir, const char *name, struct stat *status) {
-  UniqueFd fd(openat(dir, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-  if (!fd || fstat(fd.get(), status) != 0 || !S_ISREG(status->st_mode)) return {};
-  return fd;
-}
-
 /** One open file's bytes as the entry @p name. */
 bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
                    const struct stat &status, int *error) {
@@ -270,7 +263,8 @@ bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, in
 /** Record a file and pack it, when it could be opened. */
 void add_regular(Walk *walk, const std::string &path, const UniqueFd &fd,
                  const struct stat &status) {
-  add_to_file_info_table(walk->table, walk->root.c_str(), path.c_str(), status, walk->error);
+  add_to_file_info_table(walk->table, walk->root.c_str(), path.c_str(), status, walk->error,
+                         fd.get());
   if (fd) {
     add_open_file(walk->zip, path.c_str(), path.c_str() + walk->root.size() + 1, fd.get(), status,
                   walk->error);
@@ -285,7 +279,7 @@ bool walk_regular(Walk *walk, int parent, const char *name, const std::string &p
   *noted = is_backup_file(path.c_str());
   if (!*noted) return true;
   struct stat status {};
-  const UniqueFd fd = open_regular_at(parent, name, &status);
+  const UniqueFd fd = safe_open_file_at(parent, name, &status);
   if (fd) add_regular(walk, path, fd, status);
   return static_cast<bool>(fd);
 }
@@ -309,7 +303,7 @@ bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, 
   if (S_ISREG(status.st_mode)) {
     if (!is_backup_file(path->c_str())) return false;
     struct stat opened {};
-    const UniqueFd fd = open_regular_at(parent, name, &opened);
+    const UniqueFd fd = safe_open_file_at(parent, name, &opened);
     add_regular(walk, *path, fd, fd ? opened : status);
     return true;
   }

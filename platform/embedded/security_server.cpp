@@ -34,36 +34,61 @@ constexpr char kProc[] = "/proc/";
 
 std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
-/**
- * Label what @p fd holds (an O_PATH descriptor) and, when it is a directory, everything below it.
- * Objects are held while they are labelled, so a link swapped in leads nowhere.
+bool relabel_folder(int fd, const std::string &label);
+
+/** Whether an object that may have vanished meanwhile is labelled; a link itself, not its target.
  */
-bool relabel_tree(int fd, const std::string &label) {
-  struct stat status {};
-  if (fstat(fd, &status) != 0) return false;
-  const bool folder_or_file = S_ISDIR(status.st_mode) || S_ISREG(status.st_mode);
-  if (embedded::write_label(name_of(fd).c_str(), Links::kFollow, LabelKind::kAccess, label) != 0) {
-    // Where labels are user attributes, links and special files cannot have one.
-    return !folder_or_file && errno == EPERM;
+bool relabel_leaf(const std::string &path, bool is_file, const std::string &label) {
+  if (embedded::write_label(path.c_str(), Links::kKeep, LabelKind::kAccess, label) == 0 ||
+      errno == ENOENT) {
+    return true;
   }
-  if (!S_ISDIR(status.st_mode)) return true;
-  const int folder = openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-  DIR *dir = folder < 0 ? nullptr : fdopendir(folder);
+  // Where labels are user attributes, links and special files cannot have one.
+  return !is_file && errno == EPERM;
+}
+
+/** What only root may enter is not the application's: a service keeps its own things there. */
+bool is_roots_own(const struct stat &folder) {
+  return folder.st_uid == 0 && (folder.st_mode & (S_IRWXG | S_IRWXO)) == 0;
+}
+
+/** One entry of the folder that is open as @p dir; the type that a folder tells saves calls. */
+bool relabel_entry(int dir, const dirent &entry, const std::string &path,
+                   const std::string &label) {
+  if (entry.d_type != DT_DIR && entry.d_type != DT_UNKNOWN)
+    return relabel_leaf(path, entry.d_type == DT_REG, label);
+  const int fd = openat(dir, entry.d_name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+  if (fd < 0) return errno == ENOENT;
+  struct stat status {};
+  bool done = fstat(fd, &status) == 0;
+  if (done && !S_ISDIR(status.st_mode)) {
+    done = relabel_leaf(path, S_ISREG(status.st_mode), label);
+  } else if (done && !is_roots_own(status)) {
+    done = relabel_folder(fd, label);
+  }
+  close(fd);
+  return done;
+}
+
+/**
+ * Label the folder @p fd (an O_PATH descriptor) and everything below it. Folders are held while
+ * their entries are labelled, so a link swapped in leads nowhere.
+ */
+bool relabel_folder(int fd, const std::string &label) {
+  if (embedded::write_label(name_of(fd).c_str(), Links::kFollow, LabelKind::kAccess, label) != 0)
+    return false;
+  const int opened = openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  DIR *dir = opened < 0 ? nullptr : fdopendir(opened);
   if (dir == nullptr) {
-    if (folder >= 0) close(folder);
+    if (opened >= 0) close(opened);
     return false;
   }
+  const std::string folder = name_of(opened) + "/";
   bool done = true;
   while (const dirent *entry = readdir(dir)) {
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
-    const int child = openat(dirfd(dir), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC);
-    if (child < 0) {
-      done = errno == ENOENT && done;  // it vanished meanwhile
-      continue;
-    }
-    done = relabel_tree(child, label) && done;
-    close(child);
+    done = relabel_entry(opened, *entry, folder + name, label) && done;
   }
   closedir(dir);
   return done;
@@ -97,7 +122,7 @@ int open_folder(const std::string &path) {
 bool relabel(const std::string &path, const std::string &label) {
   const int fd = open_folder(path);
   if (fd < 0) return false;
-  const bool done = relabel_tree(fd, label);
+  const bool done = relabel_folder(fd, label);
   close(fd);
   return done;
 }

@@ -1,10 +1,12 @@
 #include "state/labels.h"
 
 #include <sys/xattr.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 
 namespace embedded {
@@ -27,10 +29,36 @@ Attribute attribute_of(LabelKind kind) {
   return {"security.SMACK64", "user.quarn.SMACK64"};
 }
 
+/** The descriptor of this process that @p path is the name of in /proc, or negative. */
+int descriptor_of(const char *path) {
+  constexpr char kProcesses[] = "/proc/";
+  constexpr char kDescriptors[] = "/fd/";
+  const std::size_t start = std::strlen(kProcesses);
+  if (std::strncmp(path, kProcesses, start) != 0) return -1;
+  char *end = nullptr;
+  if (std::strtol(path + start, &end, 10) != getpid()) return -1;
+  if (std::strncmp(end, kDescriptors, std::strlen(kDescriptors)) != 0) return -1;
+  const char *number = end + std::strlen(kDescriptors);
+  const long fd = std::strtol(number, &end, 10);
+  return end == number || *end != '\0' ? -1 : static_cast<int>(fd);
+}
+
+/** A call on what is open is spared the walk to it; an O_PATH descriptor does not allow one. */
+template <typename Call, typename ByPath>
+ssize_t by_descriptor(const char *path, Call call, ByPath by_path) {
+  const int fd = descriptor_of(path);
+  const ssize_t result = fd < 0 ? -1 : call(fd);
+  return fd < 0 || (result < 0 && errno == EBADF) ? by_path() : result;
+}
+
 int read_attribute(const char *path, Links links, const char *name, std::string *label) {
   char value[kMaxLabel + 1];
-  const ssize_t length = links == Links::kFollow ? getxattr(path, name, value, sizeof value)
-                                                 : lgetxattr(path, name, value, sizeof value);
+  const ssize_t length =
+      links == Links::kFollow
+          ? by_descriptor(
+                path, [&](int fd) { return fgetxattr(fd, name, value, sizeof value); },
+                [&] { return getxattr(path, name, value, sizeof value); })
+          : lgetxattr(path, name, value, sizeof value);
   if (length < 0) return -1;
   label->assign(value, static_cast<size_t>(length));
   label->resize(std::min(label->find('\0'), label->size()));
@@ -61,8 +89,11 @@ bool lists(const char *names, ssize_t size, const char *name) {
 /** One call tells what several that fail would: objects of a device are labelled alike. */
 Present attributes_present(const char *path, Links links, const Attribute &attribute) {
   char names[512];
-  const ssize_t size = links == Links::kFollow ? listxattr(path, names, sizeof names)
-                                               : llistxattr(path, names, sizeof names);
+  const ssize_t size = links == Links::kFollow
+                           ? by_descriptor(
+                                 path, [&](int fd) { return flistxattr(fd, names, sizeof names); },
+                                 [&] { return listxattr(path, names, sizeof names); })
+                           : llistxattr(path, names, sizeof names);
   if (size < 0) return {};
   return {lists(names, size, attribute.kernel), lists(names, size, attribute.user)};
 }

@@ -84,18 +84,6 @@ class PackageTest : public ::testing::Test {
   std::string metadata;
 };
 
-TEST_F(PackageTest, SafePathComponentsAreNamesOfOneEntry) {
-  EXPECT_TRUE(is_safe_path_component("org.example.notes"));
-  EXPECT_TRUE(is_safe_path_component("1.0.0"));
-  EXPECT_TRUE(is_safe_path_component("..."));
-  EXPECT_FALSE(is_safe_path_component(""));
-  EXPECT_FALSE(is_safe_path_component("."));
-  EXPECT_FALSE(is_safe_path_component(".."));
-  EXPECT_FALSE(is_safe_path_component("../etc"));
-  EXPECT_FALSE(is_safe_path_component("a/b"));
-  EXPECT_FALSE(is_safe_path_component(std::string("a\0b", 3)));
-}
-
 TEST_F(PackageTest, ApiVersionsAreComparedAsBytes) {
   expect_app_record_released();
   api_version = "2.10";

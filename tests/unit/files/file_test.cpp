@@ -27,6 +27,20 @@ unsigned int mode_of(const std::string &path) {
   return lstat(path.c_str(), &status) == 0 ? status.st_mode & 07777 : 0;
 }
 
+/* ---- names ----------------------------------------------------------------- */
+
+TEST_F(Files, SafePathComponentsAreNamesOfOneEntry) {
+  EXPECT_TRUE(is_safe_path_component("org.example.notes"));
+  EXPECT_TRUE(is_safe_path_component("1.0.0"));
+  EXPECT_TRUE(is_safe_path_component("..."));
+  EXPECT_FALSE(is_safe_path_component(""));
+  EXPECT_FALSE(is_safe_path_component("."));
+  EXPECT_FALSE(is_safe_path_component(".."));
+  EXPECT_FALSE(is_safe_path_component("../etc"));
+  EXPECT_FALSE(is_safe_path_component("a/b"));
+  EXPECT_FALSE(is_safe_path_component(std::string("a\0b", 3)));
+}
+
 /* ---- kinds ------------------------------------------------------------------ */
 
 TEST_F(Files, FileExistsForARegularFileOnly) {

@@ -1,5 +1,8 @@
 #include "state/labels.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <cstdlib>
 #include <memory>
@@ -60,6 +63,27 @@ TEST_F(Labels, OfEachKindAreTheirOwn) {
   EXPECT_EQ(get(file_), "a");
   EXPECT_EQ(get(file_, false, SMACK_LABEL_EXEC), "e");
   EXPECT_EQ(get(file_, false, SMACK_LABEL_MMAP), "m");
+}
+
+TEST_F(Labels, OfWhatIsOpenAreReadByItsDescriptorsName) {
+  EXPECT_EQ(smack_setlabel(file_.c_str(), "org.example", SMACK_LABEL_ACCESS), 0);
+  for (const int flags : {O_RDONLY, O_PATH}) {
+    const int fd = open(file_.c_str(), flags | O_CLOEXEC);
+    ASSERT_GE(fd, 0);
+    const std::string number = std::to_string(fd);
+    const std::string own = "/proc/" + std::to_string(getpid()) + "/fd/";
+    EXPECT_EQ(get(own + number), "org.example");
+    // once the first one had a label, what has none is asked differently
+    EXPECT_EQ(get(dir_.file("tree/bare", "")), "_");
+    EXPECT_EQ(get(own + number), "org.example");
+    for (const std::string &other :
+         {own, own + number + "x", own + number + "/x", own + "x", "/proc/1x/fd/" + number,
+          "/proc/" + std::to_string(getpid()) + "/fx/" + number, "/proc/x/fd/" + number}) {
+      EXPECT_EQ(get(other), other == own ? "_" : "error") << other;
+    }
+    close(fd);
+    EXPECT_EQ(get(own + number), "error");
+  }
 }
 
 TEST_F(Labels, FollowLinksOrDoNot) {

@@ -76,6 +76,21 @@ TEST_F(SecurityServer, FollowsTheNameOfADescriptor) {
   close(fd);
 }
 
+TEST_F(SecurityServer, LeavesOutWhatOnlyRootMayEnter) {
+  dir_.file("tree/data/deep/own/file", "");
+  ASSERT_EQ(chmod((dir_ / "tree/data/deep/own").c_str(), 0700), 0);
+  dir_.file("tree/data/deep/app/file", "");
+  ASSERT_EQ(chmod((dir_ / "tree/data/deep/app").c_str(), 0700), 0);
+  ASSERT_EQ(chown((dir_ / "tree/data/deep/app").c_str(), 5000, 5000), 0);
+  ASSERT_EQ(chmod((dir_ / "tree/data").c_str(), 0700), 0);  // what was asked for is labelled
+  EXPECT_EQ(relabel(dir_ / "tree/data"), SECURITY_SERVER_SUCCESS);
+  EXPECT_EQ(label("tree/data"), "new");
+  EXPECT_EQ(label("tree/data/deep/own"), "_");
+  EXPECT_EQ(label("tree/data/deep/own/file"), "_");
+  EXPECT_EQ(label("tree/data/deep/app"), "new");
+  EXPECT_EQ(label("tree/data/deep/app/file"), "new");
+}
+
 TEST_F(SecurityServer, FollowsNoLinkInAPath) {
   dir_.link("way", "tree");
   EXPECT_EQ(relabel(dir_ / "tree/data/folder"), SECURITY_SERVER_ERROR_SERVER);
