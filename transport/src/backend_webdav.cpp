@@ -517,7 +517,13 @@ class WebdavBackend : public Backend {
 
 }  // namespace
 
-std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url, const Config &config) {
+std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url, const Config &config,
+                                             std::string *problem) {
+  // HTTP would take what follows for the password; to S3 services it is a letter like others.
+  if (config.user.find(':') != std::string::npos) {
+    *problem = "the user's name holds a colon";
+    return nullptr;
+  }
   return std::make_shared<WebdavBackend>(url, config);
 }
 

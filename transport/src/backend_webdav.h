@@ -17,7 +17,9 @@
 
 namespace transport {
 
-std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url, const Config &config);
+/** Null with @p problem when nothing can be meant by the configuration. */
+std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url, const Config &config,
+                                             std::string *problem);
 
 /** One resource of a multi-status answer. */
 struct DavEntry {

@@ -117,12 +117,6 @@ bool ConfigFile::read() {
     problem_ = path_ + ": holds a password and is not of mode 0600";
     return false;
   }
-  // HTTP would take what follows for the password.
-  if (config_.user.find(':') != std::string::npos) {
-    config_ = {};
-    problem_ = path_ + ": user holds a colon";
-    return false;
-  }
   if (config_.url.empty()) {
     problem_ = path_ + ": names no url";
     return false;

@@ -242,7 +242,7 @@ class State(TestCase):
                 ("the url has a query or fragment", "webdav+https://host/dav?a", *user),
                 ("plain http is for this machine itself only", "webdav+http://host/dav", *user),
                 ("url is not a line of UTF-8 text", "webdav+https://host/\n", *user),
-                ("user holds a colon", "webdav+https://host/dav", "--user", "ada:secret"),
+                ("the user's name holds a colon", "webdav+https://host/dav", "--user", "ada:secret"),
                 ("user is not a line of UTF-8 text", "webdav+https://host/dav", "--user", "a\nb"),
                 ("the url names no bucket", "s3+https://s3.example.org/", *user),
                 (keys, "s3+https://s3.example.org/fleet"),
@@ -271,6 +271,8 @@ class State(TestCase):
         # What the library takes for this machine itself is taken.
         for url in ("webdav+http://127.0.0.2/dav", "webdav+http://[::1]:8080/dav"):
             self.assertEqual(self.set_cloud(device, url, *user), (0, "", ""))
+        self.assertEqual(self.set_cloud(device, "s3+https://host/b", "--user", "account:key"),
+                         (0, "", ""))
 
     def test_every_character_of_a_password_is_kept(self):
         device = self.new_device()
