@@ -181,10 +181,9 @@ class S3Backend : public Backend {
                    Version *version) override {
     if (!target.begin()) return local_failure("cannot make a local file");
     const std::string key = key_of(path);
-    Received received =
-        receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, &target);
+    Received received = receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, target);
     if (takes_region_from(received.answer))
-      received = receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, &target);
+      received = receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, target);
     if (is_absent_object(received.answer)) {
       if (version != nullptr) version->reset();
       return no_such_object();

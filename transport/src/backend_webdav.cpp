@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <functional>
@@ -11,10 +12,14 @@
 #include <set>
 
 #include "dav_client.h"
+#include "dav_place.h"
 #include "remote_path.h"
 
 namespace transport {
 namespace {
+
+using Found = DavPlace::Found;
+using Next = DavPlace::Next;
 
 constexpr int64_t kMillisecondsPerSecond = 1000;
 constexpr std::size_t kMaxKnownFolders = 4096;
@@ -22,17 +27,15 @@ constexpr std::size_t kMaxKnownFolders = 4096;
 constexpr int kRefusalsOfAFullStore = 3;
 // So often does a condition fail that should hold until it counts as a conflict.
 constexpr int kFailuresOfAConflict = 3;
-// How long a server may take to notice that nobody sends any more what it receives.
-constexpr std::chrono::milliseconds kTidyUpPauses[] = {
-    std::chrono::milliseconds(50), std::chrono::milliseconds(200), std::chrono::milliseconds(800)};
-
+// What an upload in place replaces is kept up to this size, to be put back.
+constexpr uint64_t kMaxKeptBytes = 1024 * 1024;
 // An upload cannot end with what is said of objects that are asked for.
 Outcome of_upload(Outcome outcome) {
   if (outcome.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) outcome.code = BACKUP_TRANS_ERROR_SERVER;
   return outcome;
 }
 
-// What an upload has done so far; what is not moved to its place is deleted.
+// What an upload has done so far; what is not moved to its place, or not whole there, is deleted.
 struct Uploaded {
   explicit Uploaded(std::function<void(const Uploaded &)> give_up) : give_up_(std::move(give_up)) {}
   Uploaded(const Uploaded &) = delete;
@@ -40,12 +43,13 @@ struct Uploaded {
   ~Uploaded() { give_up(); }
 
   void give_up() {
-    if (!temporary.empty() || !made_folder.empty()) give_up_(*this);
+    if (!temporary.empty() || !made_folder.empty() || place) give_up_(*this);
     settle();
   }
   void settle() {
     temporary.clear();
     made_folder.clear();
+    place.reset();
     answered = false;
     complete = false;
     move_asked = false;
@@ -56,9 +60,12 @@ struct Uploaded {
   bool answered = false;    // the server has come to an end with it
   bool complete = false;
   bool move_asked = false;
+  bool is_immovable = false;
   bool was_lost = false;         // its folder was deleted before it was moved
   int refusals = 0;              // of content where there was room for a name
   int failed_preconditions = 0;  // that should have held
+
+  std::optional<DavPlace> place;  // where a part of the content may lie
 
  private:
   std::function<void(const Uploaded &)> give_up_;
@@ -70,6 +77,16 @@ struct Conditions {
   bool overwrite = true;
 };
 
+// Where an upload's bytes go, and what has to be so.
+struct Destination {
+  std::string path;
+  std::string lock;       // the header that proves it; may be empty
+  std::string condition;  // on what lies there; may be empty
+};
+
+// What the server has shown of its moves.
+enum class Moving { unknown, done, refused };
+
 class WebdavBackend : public Backend {
  public:
   WebdavBackend(const StoreUrl &url, const Config &config) : client_(url, config) {}
@@ -78,7 +95,7 @@ class WebdavBackend : public Backend {
                    Version *version) override {
     if (!target.begin()) return local_failure("cannot make a local file");
     const Received received =
-        receive(attempt.ticket, client_.request_for("GET", path), G_CHECKSUM_SHA256, &target);
+        receive(attempt.ticket, client_.request_for("GET", path), G_CHECKSUM_SHA256, target);
     if (!is_object(attempt.ticket, received.answer, path)) {
       if (version != nullptr) version->reset();
       return no_such_object();
@@ -94,16 +111,11 @@ class WebdavBackend : public Backend {
       attempt.memory = std::make_shared<Uploaded>([this](const Uploaded &left) { tidy_up(left); });
     }
     const auto uploaded = std::any_cast<std::shared_ptr<Uploaded>>(attempt.memory);
-    if (!uploaded->complete) {
-      uploaded->give_up();
-      uploaded->temporary = parent_of(upload.path) + "/" + make_temporary_name();
-      const Outcome sent = send(attempt.ticket, upload, uploaded.get());
-      if (!sent.ok()) return sent;
-      uploaded->complete = true;
-    }
-    const Outcome result = upload.basis == nullptr
-                               ? move_plainly(attempt.ticket, upload, uploaded.get())
-                               : move_locked(attempt.ticket, upload, uploaded.get());
+    const bool may_move = moving_ != Moving::refused;
+    Outcome result;
+    if (may_move) result = put_and_move(attempt.ticket, upload, uploaded.get());
+    if (!may_move || uploaded->is_immovable)
+      result = put_in_place(attempt.ticket, upload, uploaded.get());
     if (!result.ok()) return result;
     uploaded->settle();
     info->path = upload.path;
@@ -168,13 +180,25 @@ class WebdavBackend : public Backend {
     return has_folder || ticket.cancelled();
   }
 
-  // Puts the bytes under a temporary name and makes sure that they all arrived.
-  Outcome send(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
-    const std::string &temporary = uploaded->temporary;
-    const std::string folder = parent_of(temporary);
+  Outcome put_and_move(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+    if (!uploaded->complete) {
+      uploaded->give_up();
+      uploaded->temporary = parent_of(upload.path) + "/" + make_temporary_name();
+      const Outcome sent = send(ticket, upload, uploaded, {uploaded->temporary, "", ""});
+      if (!sent.ok()) return sent;
+      uploaded->complete = true;
+    }
+    return upload.basis == nullptr ? move_plainly(ticket, upload, uploaded)
+                                   : move_locked(ticket, upload, uploaded);
+  }
+
+  // Puts the bytes where they are wanted and makes sure that they all arrived.
+  Outcome send(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+               const Destination &destination) {
+    const std::string folder = parent_of(destination.path);
     Outcome result = ensure_folder(ticket, folder, uploaded);
     if (!result.ok()) return result;
-    HttpAnswer answer = put(ticket, upload, uploaded);
+    HttpAnswer answer = put(ticket, upload, uploaded, destination);
     const bool folder_gone = has_status(answer, kHttpNotFound) ||
                              has_status(answer, kHttpConflict) ||
                              has_status(answer, kHttpServerError);
@@ -183,46 +207,57 @@ class WebdavBackend : public Backend {
       forget("");
       result = ensure_folder(ticket, folder, uploaded);
       if (!result.ok()) return result;
-      answer = put(ticket, upload, uploaded);
+      answer = put(ticket, upload, uploaded, destination);
     }
-    if (!answer.good()) return refused(ticket, upload, uploaded, answer);
-    if (!upload.source.unchanged())
+    if (!answer.good()) return refused(ticket, upload, uploaded, destination, answer);
+    if (!upload.source.unchanged()) {
+      if (uploaded->place) uploaded->place->spoil();
       return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, "the local file changed while it was sent");
-    answer = client_.send(ticket, "HEAD", temporary);
+    }
+    answer = client_.send(ticket, "HEAD", destination.path);
     if (!answer.good()) {
       result = dav_outcome(answer, "upload");
       return result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT ? again("upload: it did not last")
                                                               : result;
     }
-    return has_size(answer, upload.source.size()) ? success()
-                                                  : again("upload: it arrived incomplete");
+    const bool arrived = uploaded->place ? uploaded->place->arrived(ticket, answer)
+                                         : has_size(answer, upload.source.size());
+    return arrived ? success() : again("upload: it arrived incomplete");
   }
 
-  HttpAnswer put(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
-    HttpRequest request = client_.request_for("PUT", uploaded->temporary);
+  HttpAnswer put(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+                 const Destination &destination) {
+    HttpRequest request = client_.request_for("PUT", destination.path);
     request.has_body = true;
     request.body_fd = upload.source.fd();
     request.body_size = upload.source.size();
     request.headers = {
         "Content-Type: " + upload.content_type,
         "X-OC-Mtime: " + std::to_string(upload.timestamp_ms / kMillisecondsPerSecond)};
+    for (const std::string &header : {destination.lock, destination.condition}) {
+      if (!header.empty()) request.headers.push_back(header);
+    }
     uploaded->answered = false;
     HttpAnswer answer = http_perform(ticket, request);
     uploaded->answered = answer.complete();
-    if (has_status(answer, kHttpLocked)) look_at_lock(ticket, parent_of(uploaded->temporary));
+    if (uploaded->place) uploaded->place->sent(answer.complete());
+    if (has_status(answer, kHttpLocked)) look_at_lock(ticket, parent_of(destination.path));
     return answer;
   }
 
   // Few servers say that their disk is full. One that takes an object without content and
   // refuses the content again and again has no room for it.
   Outcome refused(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
-                  const HttpAnswer &answer) const {
+                  const Destination &destination, const HttpAnswer &answer) const {
     const Outcome result = of_upload(dav_outcome(answer, "upload"));
     const bool unclear =
         has_status(answer, kHttpServerError) || has_status(answer, kHttpMethodNotAllowed);
     if (!unclear || upload.source.size() == 0) return result;
+    if (uploaded->temporary.empty())
+      uploaded->temporary = parent_of(destination.path) + "/" + make_temporary_name();
     HttpRequest request = client_.request_for("PUT", uploaded->temporary);
     request.has_body = true;
+    if (!destination.lock.empty()) request.headers = {destination.lock};
     if (!http_perform(ticket, request).good()) return result;
     if (++uploaded->refusals < kRefusalsOfAFullStore) return again(result.message);
     return failure(BACKUP_TRANS_ERROR_QUOTA, result.message + ", as if its disk was full");
@@ -244,8 +279,18 @@ class WebdavBackend : public Backend {
     const HttpAnswer answer = http_perform(ticket, request);
     if (has_status(answer, kHttpMultiStatus))
       return failure(BACKUP_TRANS_ERROR_SERVER, "upload: the server did not move it");
-    if (answer.good()) return success();
+    if (answer.good()) {
+      moving_ = Moving::done;
+      return success();
+    }
     Outcome result = of_upload(dav_outcome(answer, "upload"));
+    // What has moved something before can do it.
+    if (is_unsupported(answer) && moving_ != Moving::done) {
+      if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+      moving_ = Moving::refused;
+      uploaded->is_immovable = true;
+      return result;
+    }
     if (is_absent(answer) || has_status(answer, kHttpConflict)) {
       if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
       // The folder was deleted, and what had been sent with it; not again and again.
@@ -304,7 +349,14 @@ class WebdavBackend : public Backend {
 
   // The comparison and the move happen while nobody else may change the folder.
   Outcome move_locked(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
-    const std::string folder = parent_of(upload.path);
+    return while_locked(ticket, parent_of(upload.path), [&](const std::string &token) {
+      return move_if_unchanged(ticket, upload, uploaded, token);
+    });
+  }
+
+  // The token is empty on a server without locks.
+  Outcome while_locked(Ticket &ticket, const std::string &folder,
+                       const std::function<Outcome(const std::string &token)> &step) {
     std::string token;
     Outcome result = client_.lock(ticket, folder, &token);
     if (!result.ok()) {
@@ -312,7 +364,7 @@ class WebdavBackend : public Backend {
       if (result.transient) look_at_lock(ticket, folder);
       return result;
     }
-    result = move_if_unchanged(ticket, upload, uploaded, token);
+    result = step(token);
     client_.unlock(folder, token);
     return result;
   }
@@ -333,27 +385,121 @@ class WebdavBackend : public Backend {
     if (!token.empty()) conditions.header = client_.lock_condition(parent_of(upload.path), token);
     Outcome result = move(ticket, upload, uploaded, conditions);
     if (result.code != BACKUP_TRANS_ERROR_CONFLICT || !uploaded->complete) return result;
-    // Nothing was done. Either the object is another one now, or the condition was not as it
-    // should be: a lock that ended, a tag that means nothing.
     uploaded->move_asked = false;
+    return explain_refusal(ticket, upload, uploaded, result);
+  }
+
+  // Nothing was done. Either the object is another one now, or the condition was not as it should
+  // be: a lock that ended, a tag that means nothing.
+  Outcome explain_refusal(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+                          const Outcome &result) const {
     const Outcome compared = compare_basis(ticket, upload, nullptr);
     if (!compared.ok()) return compared;
     if (++uploaded->failed_preconditions >= kFailuresOfAConflict) return result;
     return again(result.message);
   }
 
-  // The version of what is there now, and its tag where that can be relied on.
-  Outcome read_version(Ticket &ticket, const std::string &path, Version *version,
-                       std::string *tag) const {
-    const Received received =
-        receive(ticket, client_.request_for("GET", path), G_CHECKSUM_SHA256, nullptr);
+  // A server that cannot move gets the bytes where they belong. One that is cut off may keep a part
+  // of them there, which is looked for, and does not stay.
+  Outcome put_in_place(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+    drop_temporary(uploaded);
+    if (upload.basis == nullptr) return replace_plainly(ticket, upload, uploaded);
+    const std::string folder = parent_of(upload.path);
+    const Outcome result = ensure_folder(ticket, folder, uploaded);
+    if (!result.ok()) return result;
+    return while_locked(ticket, folder, [&](const std::string &token) {
+      return replace_if_unchanged(ticket, upload, uploaded, token);
+    });
+  }
+
+  void drop_temporary(Uploaded *uploaded) const {
+    Ticket own;
+    if (!uploaded->temporary.empty()) delete_temporary(own, *uploaded);
+    uploaded->temporary.clear();
+    uploaded->complete = false;
+    uploaded->move_asked = false;
+  }
+
+  Outcome replace_plainly(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+    Found found = Found::nothing;
+    const Outcome looked = look_at_earlier(ticket, upload, *uploaded, &found);
+    if (!looked.ok() || found == Found::whole) return looked;
+    // A part of it does not become what was there before.
+    if (found != Found::part) {
+      const Outcome noted = note_place(ticket, upload, uploaded);
+      if (!noted.ok()) return noted;
+    }
+    return send(ticket, upload, uploaded, {upload.path, "", ""});
+  }
+
+  Outcome replace_if_unchanged(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
+                               const std::string &token) {
+    Destination destination{upload.path, "", ""};
+    if (!token.empty()) destination.lock = client_.lock_condition(parent_of(upload.path), token);
+    Found found = Found::nothing;
+    Outcome result = look_at_earlier(ticket, upload, *uploaded, &found);
+    if (!result.ok() || found == Found::whole) return result;
+    if (found == Found::part)
+      result = uploaded->place->mend(destination.lock, Next::another_attempt);
+    if (result.ok()) result = note_place(ticket, upload, uploaded);
+    if (!result.ok()) return result;
+    std::string tag;
+    std::optional<std::string> content;
+    result = compare_basis(ticket, upload, &tag, &content);
+    if (!result.ok()) return result;
+    uploaded->place->keep(std::move(content));
+    // A condition on what the request is for is known to more servers than the lock's header.
+    if (!upload.basis->has_value())
+      destination.condition = "If-None-Match: *";
+    else if (token.empty() && !tag.empty() && uploaded->failed_preconditions == 0)
+      destination.condition = "If-Match: " + tag;
+    result = send(ticket, upload, uploaded, destination);
+    if (result.ok()) return result;
+    if (result.code == BACKUP_TRANS_ERROR_CONFLICT)
+      return explain_refusal(ticket, upload, uploaded, result);
+    // Nobody shall see a part of it once the lock is gone.
+    uploaded->place->mend(destination.lock, Next::another_attempt);
+    return result;
+  }
+
+  // What an earlier attempt that seemed to fail has brought about.
+  static Outcome look_at_earlier(Ticket &ticket, const Upload &upload, const Uploaded &uploaded,
+                                 Found *found) {
+    if (!uploaded.place) return success();
+    const Outcome looked = uploaded.place->look(ticket, found);
+    if (!looked.ok() || *found != Found::whole || upload.source.unchanged())
+      return of_upload(looked);
+    return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, "the local file changed while it was sent");
+  }
+
+  // From here on a part of the content may come to lie in the object's place.
+  Outcome note_place(Ticket &ticket, const Upload &upload, Uploaded *uploaded) const {
+    if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+    DavPlace place(client_, upload.path, upload.source);
+    const Outcome noted = place.note(ticket);
+    if (noted.ok()) uploaded->place.emplace(std::move(place));
+    return noted;
+  }
+
+  // The version of what is there now, its tag where that can be relied on, and its content where
+  // that is small.
+  Outcome read_version(Ticket &ticket, const std::string &path, Version *version, std::string *tag,
+                       std::optional<std::string> *content = nullptr) const {
+    std::string kept;
+    Checksum checksum(G_CHECKSUM_SHA256);
+    HttpRequest request = client_.request_for("GET", path);
+    request.sink = [&](const char *data, std::size_t size) {
+      checksum.add(data, size);
+      if (content != nullptr && kept.size() <= kMaxKeptBytes) kept.append(data, size);
+      return true;
+    };
+    const HttpAnswer answer = http_perform(ticket, request);
     version->reset();
-    if (!received.answer.good())
-      return is_absent(received.answer) ? success() : dav_outcome(received.answer, "upload");
-    *version = received.checksum;
-    const std::string found = received.answer.header("etag");
-    const bool strong = found.size() > 2 && found.front() == '"' && found.back() == '"';
-    if (tag != nullptr && strong) *tag = found;
+    if (content != nullptr) content->reset();
+    if (!answer.good()) return is_absent(answer) ? success() : dav_outcome(answer, "upload");
+    *version = checksum.hex();
+    if (tag != nullptr) *tag = strong_tag(answer);
+    if (content != nullptr && kept.size() <= kMaxKeptBytes) *content = std::move(kept);
     return success();
   }
 
@@ -369,9 +515,10 @@ class WebdavBackend : public Backend {
     }
   }
 
-  Outcome compare_basis(Ticket &ticket, const Upload &upload, std::string *tag) const {
+  Outcome compare_basis(Ticket &ticket, const Upload &upload, std::string *tag,
+                        std::optional<std::string> *content = nullptr) const {
     Version present;
-    const Outcome found = read_version(ticket, upload.path, &present, tag);
+    const Outcome found = read_version(ticket, upload.path, &present, tag, content);
     if (!found.ok() || present == *upload.basis) return found;
     return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
   }
@@ -488,6 +635,7 @@ class WebdavBackend : public Backend {
   void tidy_up(const Uploaded &left) {
     Ticket own;
     if (!left.temporary.empty() && !delete_temporary(own, left)) return;
+    if (left.place && !left.place->mend("", Next::nothing).ok()) return;
     if (!left.made_folder.empty()) prune(own, left.made_folder);
   }
 
@@ -509,6 +657,7 @@ class WebdavBackend : public Backend {
   }
 
   const DavClient client_;
+  std::atomic<Moving> moving_{Moving::unknown};
   std::mutex mutex_;
   std::set<std::string> known_;  // folders that were seen or made
   std::string seen_lock_;        // the last one that was in the way

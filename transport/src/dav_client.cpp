@@ -71,6 +71,15 @@ bool has_status(const HttpAnswer &answer, int status) {
   return answer.complete() && answer.status == status;
 }
 
+bool is_unsupported(const HttpAnswer &answer) {
+  return has_status(answer, kHttpMethodNotAllowed) || has_status(answer, kHttpNotImplemented);
+}
+
+std::string strong_tag(const HttpAnswer &answer) {
+  const std::string tag = answer.header("etag");
+  return tag.size() > 2 && tag.front() == '"' && tag.back() == '"' ? tag : "";
+}
+
 Outcome dav_outcome(const HttpAnswer &answer, const char *what) {
   Outcome result = outcome_of(answer, what);
   if (has_status(answer, kHttpLocked)) result.transient = true;
@@ -194,8 +203,7 @@ Outcome DavClient::lock(Ticket &ticket, const std::string &folder, std::string *
   request.headers = {kXmlType, "Depth: infinity",
                      "Timeout: Second-" + std::to_string(kLockDuration.count())};
   const HttpAnswer answer = http_perform(ticket, request);
-  if (has_status(answer, kHttpMethodNotAllowed) || has_status(answer, kHttpNotImplemented))
-    return success();
+  if (is_unsupported(answer)) return success();
   const bool done = answer.status / kStatusClass == kHttpOk / kStatusClass;
   *token = done ? answer.header("lock-token") : "";
   const Outcome result = done && !token->empty() ? success() : dav_outcome(answer, "lock");

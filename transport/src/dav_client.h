@@ -29,6 +29,9 @@ constexpr std::chrono::seconds kLockDuration{30};
 
 /** Seconds that a request may take that clears up behind another one. */
 constexpr long kTidyUpSeconds = 5;
+/** How long a server may take to notice that nobody sends any more what it receives. */
+constexpr std::chrono::milliseconds kTidyUpPauses[] = {
+    std::chrono::milliseconds(50), std::chrono::milliseconds(200), std::chrono::milliseconds(800)};
 
 /**
  * How a component of a path is named on the server. Some servers never list names
@@ -42,6 +45,12 @@ std::string stored_path(const std::string &path);
 
 /** Did the server answer, and with that status? */
 bool has_status(const HttpAnswer &answer, int status);
+
+/** Does the server not know the request's method, or not there? */
+bool is_unsupported(const HttpAnswer &answer);
+
+/** The entity tag, where it stands for the content to the byte; else "". */
+std::string strong_tag(const HttpAnswer &answer);
 
 /** outcome_of(); somebody else's lock goes away by itself. */
 Outcome dav_outcome(const HttpAnswer &answer, const char *what);

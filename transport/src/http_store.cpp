@@ -39,19 +39,20 @@ bool is_absent(const HttpAnswer &answer) {
   return answer.complete() && (answer.status == kHttpNotFound || answer.status == kHttpGone);
 }
 
-bool has_size(const HttpAnswer &answer, uint64_t size) {
-  const std::string length = answer.header("content-length");
+uint64_t told_size(const HttpAnswer &answer) {
   // Some leave the length of an empty object out.
-  return length.empty() ? size == 0 : g_ascii_strtoull(length.c_str(), nullptr, 10) == size;
+  return g_ascii_strtoull(answer.header("content-length").c_str(), nullptr, 10);
 }
 
-Received receive(Ticket &ticket, HttpRequest request, GChecksumType type, LocalTarget *target) {
+bool has_size(const HttpAnswer &answer, uint64_t size) { return told_size(answer) == size; }
+
+Received receive(Ticket &ticket, HttpRequest request, GChecksumType type, LocalTarget &target) {
   Received received;
   Checksum checksum(type);
   request.sink = [&](const char *data, std::size_t size) {
     checksum.add(data, size);
     received.size += size;
-    return target == nullptr || write_all(target->fd(), data, size);
+    return write_all(target.fd(), data, size);
   };
   received.answer = http_perform(ticket, request);
   received.checksum = checksum.hex();

@@ -38,6 +38,9 @@ Outcome local_failure(const char *what);
 /** The store says that there is nothing of that name. */
 bool is_absent(const HttpAnswer &answer);
 
+/** The length of the object that the answer to a HEAD tells of. */
+uint64_t told_size(const HttpAnswer &answer);
+
 /** Does the answer to a HEAD tell of an object of that size? */
 bool has_size(const HttpAnswer &answer, uint64_t size);
 
@@ -50,10 +53,9 @@ struct Received {
 
 /**
  * Read an object.
- * @param target receives the bytes in the file that begin() made; null when only the checksum
- *               is wanted
+ * @param target receives the bytes in the file that begin() made
  */
-Received receive(Ticket &ticket, HttpRequest request, GChecksumType type, LocalTarget *target);
+Received receive(Ticket &ticket, HttpRequest request, GChecksumType type, LocalTarget &target);
 
 /** What receive() brought, with a good answer, becomes the local file once it is complete. */
 Outcome publish(Ticket &ticket, const Received &received, LocalTarget &target);

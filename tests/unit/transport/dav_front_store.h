@@ -32,9 +32,13 @@ class DavFrontStore : public TestStore {
   void let_in() override { model_.set_password("right"); }
   bool lists_timestamps() const override { return false; }
 
- private:
+ protected:
   static constexpr char kFolder[] = "/my store";
 
+  DavModel model_;
+  front::Front front_{model_};
+
+ private:
   static std::string path_of(const std::string &stored) {
     std::string path;
     for (std::size_t at = 0; at < stored.size();) {
@@ -49,9 +53,12 @@ class DavFrontStore : public TestStore {
     return "[cloud]\nurl=webdav+http://127.0.0.1:" + std::to_string(front_.port()) + "/dav/" +
            folder + "\nuser=device\npassword=right\n";
   }
+};
 
-  DavModel model_;
-  front::Front front_{model_};
+/** The same on a server that cannot move. */
+class DavInPlaceStore : public DavFrontStore {
+ public:
+  DavInPlaceStore() { model_.refuse("MOVE", 405); }
 };
 
 #endif

@@ -45,6 +45,11 @@ void DavModel::set_password(const std::string &password) {
   password_ = password;
 }
 
+void DavModel::refuse(const std::string &method, int status) {
+  const std::lock_guard<std::mutex> guard(mutex_);
+  refused_[method] = status;
+}
+
 void DavModel::set_room(std::size_t bytes) {
   const std::lock_guard<std::mutex> guard(mutex_);
   room_ = bytes;
@@ -82,6 +87,8 @@ Response DavModel::serve(const Request &request) {
   if (!is_within(request.path, kRoot)) return 404;
   const std::string path = path_of(request.path);
   const std::string &method = request.method;
+  const auto refused = refused_.find(method);
+  if (refused != refused_.end() && refused->second != 0) return refused->second;
   if (method == "GET" || method == "HEAD") return get(request, path);
   if (method == "PROPFIND") return list(request, path);
   if (method == "LOCK") return lock(request, path);

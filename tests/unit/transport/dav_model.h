@@ -21,6 +21,8 @@ class DavModel : public front::Service {
 
   /** "right" at first. */
   void set_password(const std::string &password);
+  /** From now on the method's requests get that answer; 0: no more. */
+  void refuse(const std::string &method, int status);
   /** No object larger than this is taken. */
   void set_room(std::size_t bytes);
 
@@ -57,6 +59,7 @@ class DavModel : public front::Service {
   mutable std::mutex mutex_;
   std::string password_ = "right";
   std::size_t room_ = static_cast<std::size_t>(-1);
+  std::map<std::string, int> refused_;  // status by method
   int tokens_ = 0;
   std::map<std::string, Node> nodes_;  // without a trailing slash; "" is the root, not here
   std::map<std::string, Lock> locks_;  // by path

@@ -29,6 +29,8 @@ class DavNetworkStore : public NetworkStore {
         return {"PROPFIND", "/f/"};
       case Step::remove:
         return {"DELETE", "/f/"};
+      case Step::replace:
+        break;
     }
     return {};
   }
@@ -39,12 +41,28 @@ class DavNetworkStore : public NetworkStore {
   }
   std::size_t leftovers() const override { return model_.locks(); }
 
- private:
+ protected:
   DavModel model_;
+};
+
+class DavInPlaceNetworkStore : public DavNetworkStore {
+ public:
+  DavInPlaceNetworkStore() { model_.refuse("MOVE", 501); }
+
+  front::Rule requests_of(Step step) const override {
+    if (step == Step::put || step == Step::replace) return {"PUT", kObject};
+    return {};
+  }
+  front::Rule look() const override { return {"HEAD", kObject}; }
+  bool keeps_parts() const override { return true; }
 };
 
 }  // namespace
 
 std::unique_ptr<NetworkStore> make_dav_network_store() {
   return std::make_unique<DavNetworkStore>();
+}
+
+std::unique_ptr<NetworkStore> make_dav_in_place_store() {
+  return std::make_unique<DavInPlaceNetworkStore>();
 }

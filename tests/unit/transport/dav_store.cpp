@@ -3,11 +3,14 @@
 
 namespace {
 
+template <typename Store>
+StoreKind kind(const char *name) {
+  return {name, []() -> std::unique_ptr<TestStore> { return std::make_unique<Store>(); }};
+}
+
 INSTANTIATE_TEST_SUITE_P(Store, Conformance,
-                         ::testing::Values(StoreKind{"Dav",
-                                                     []() -> std::unique_ptr<TestStore> {
-                                                       return std::make_unique<DavFrontStore>();
-                                                     }}),
+                         ::testing::Values(kind<DavFrontStore>("Dav"),
+                                           kind<DavInPlaceStore>("DavInPlace")),
                          [](const auto &info) { return std::string(info.param.name); });
 
 }  // namespace

@@ -38,6 +38,7 @@ struct FaultRow {
   Validity validity = kValidNow;
   Expected dav{};
   Expected s3{};
+  Expected in_place{}; /**< WebDAV on a server that cannot move, and keeps what was cut off */
 };
 
 /** @param elsewhere origin of a server that nobody has a reason to talk to */

@@ -4,6 +4,7 @@
 #include "session.h"
 
 using namespace harness;
+using front::Spoil;
 using transport::Attempt;
 using transport::Backend;
 using transport::Config;
@@ -118,7 +119,7 @@ FaultWorld::FaultWorld(const FaultRow &row, Step step, std::unique_ptr<NetworkSt
   store_->put(NetworkStore::kObject, old_content());
   store_->put(kNeighbour, "neighbour");
   local_ = cloud_->file(step == Step::get ? "before" : new_content());
-  if (step == Step::lock || step == Step::unlock) {
+  if (step == Step::lock || step == Step::unlock || step == Step::replace) {
     const std::string seen = cloud_->get(NetworkStore::kObject, BACKUP_TRANS_OPTION_BASIS);
     EXPECT_TRUE(seen == old_content());
   }
@@ -151,7 +152,9 @@ void FaultWorld::spoil() {
   }
   front::Rule rule = row_.at_look ? store_->look() : store_->requests_of(step_);
   rule.last = row_.last;
-  rule.takes_effect = row_.takes_effect;
+  const Spoil spoilt = row_.fault.spoil;
+  const bool is_cut = spoilt == Spoil::reset_request || spoilt == Spoil::stall_request;
+  rule.takes_effect = row_.takes_effect || (is_cut && store_->keeps_parts());
   rule.fault = row_.fault;
   if (row_.place == Place::plain && !row_.refused_once) front_->set_rules({rule});
 }
@@ -163,6 +166,7 @@ AnswerPtr FaultWorld::start() {
     case Step::move:
     case Step::lock:
     case Step::unlock:
+    case Step::replace:
       answer_ = cloud_->upload(local_, NetworkStore::kObject);
       break;
     case Step::get:

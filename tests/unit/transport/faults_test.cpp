@@ -22,8 +22,10 @@ struct Kind {
 };
 
 const std::vector<Kind> &kinds() {
-  static const std::vector<Kind> all = {{"Dav", make_dav_network_store, &FaultRow::dav},
-                                        {"S3", make_s3_network_store, &FaultRow::s3}};
+  static const std::vector<Kind> all = {
+      {"Dav", make_dav_network_store, &FaultRow::dav},
+      {"DavInPlace", make_dav_in_place_store, &FaultRow::in_place},
+      {"S3", make_s3_network_store, &FaultRow::s3}};
   return all;
 }
 
@@ -52,8 +54,9 @@ std::string name_of(const FaultRow &row, std::size_t step) {
 bool discovering() { return std::getenv("DISCOVER_FAULTS") != nullptr; }
 
 bool makes_sense(const FaultRow &row, Step step, const Kind &kind) {
-  const bool is_first = step != Step::move && step != Step::lock && step != Step::unlock;
-  const bool concerns = !row.at_look || step == Step::put;
+  const bool is_first =
+      step == Step::put || step == Step::get || step == Step::list || step == Step::remove;
+  const bool concerns = !row.at_look || step == Step::put || step == Step::replace;
   return concerns && (is_first || (row.place == Place::plain && !row.refused_once)) &&
          !kind.make()->requests_of(step).method.empty();
 }
@@ -81,7 +84,7 @@ std::vector<Case> lasting_cases() {
   const auto rows = fault_table("");
   const auto ends = [&](const Case &one) {
     return rows[one.row].last != front::kForEver ||
-           (one.step != Step::put && one.step != Step::get);
+           (one.step != Step::put && one.step != Step::get && one.step != Step::replace);
   };
   cases.erase(std::remove_if(cases.begin(), cases.end(), ends), cases.end());
   return cases;

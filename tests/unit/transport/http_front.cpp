@@ -451,6 +451,10 @@ bool Front::serve_one(Connection &connection) {
     if (fault.spoil == Spoil::slow) pass(std::chrono::seconds(1));
   }
   if (!whole) return false;
+  if (stops_early && takes_effect && wanted > head_size) {
+    request.body = pending.substr(head_size, wanted - head_size);
+    service_.serve(request);
+  }
   if (fault.spoil == Spoil::reset_request) connection.reset();
   if (fault.spoil == Spoil::stall_request) stall(connection);
   if (stops_early) return false;

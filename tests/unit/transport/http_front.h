@@ -89,7 +89,7 @@ struct Rule {
   std::string value = {};
   int first = 1;
   int last = kForEver;
-  /** The service sees the request although its answer is never given. */
+  /** The service sees the request although its answer is never given, or what came of it. */
   bool takes_effect = false;
   Fault fault = {};
 };

@@ -10,6 +10,8 @@
 #include "network_store.h"
 
 std::unique_ptr<NetworkStore> make_dav_network_store();
+/** A server that cannot move, and keeps what it got of an upload that was cut off. */
+std::unique_ptr<NetworkStore> make_dav_in_place_store();
 std::unique_ptr<NetworkStore> make_s3_network_store();
 
 #endif

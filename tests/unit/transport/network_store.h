@@ -14,17 +14,18 @@
 
 /** Requests that a fault can hit. */
 enum class Step {
-  put,    /**< an upload's bytes */
-  move,   /**< an upload's last step, where the store has one */
-  lock,   /**< what the last steps of an upload with a basis begin with, where there are locks */
-  unlock, /**< what they end with */
-  get,    /**< a download */
-  list,   /**< a listing */
-  remove, /**< a folder's deletion */
+  put,     /**< an upload's bytes */
+  move,    /**< an upload's last step, where the store has one */
+  lock,    /**< what the last steps of an upload with a basis begin with, where there are locks */
+  unlock,  /**< what they end with */
+  get,     /**< a download */
+  list,    /**< a listing */
+  remove,  /**< a folder's deletion */
+  replace, /**< the bytes of an upload with a basis, where they go to the object's place */
 };
-constexpr std::size_t kSteps = 7;
-constexpr std::array<const char *, kSteps> kStepNames = {"put", "move", "lock",  "unlock",
-                                                         "get", "list", "remove"};
+constexpr std::size_t kSteps = 8;
+constexpr std::array<const char *, kSteps> kStepNames = {"put", "move", "lock",   "unlock",
+                                                         "get", "list", "remove", "replace"};
 
 /** A model of one server's store. */
 class NetworkStore {
@@ -44,6 +45,8 @@ class NetworkStore {
 
   virtual std::map<std::string, std::string> content() const = 0;
   virtual void put(const std::string &path, const std::string &content) = 0;
+  /** Does what came of an upload that was cut off stay? */
+  virtual bool keeps_parts() const { return false; }
   /** Locks, unfinished uploads and the like. */
   virtual std::size_t leftovers() const = 0;
 

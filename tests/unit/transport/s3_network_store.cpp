@@ -24,6 +24,7 @@ class S3NetworkStore : public NetworkStore {
       case Step::move:
       case Step::lock:
       case Step::unlock:
+      case Step::replace:
         break;
     }
     return {};
