@@ -579,7 +579,9 @@ std::optional<std::chrono::milliseconds> retry_after(const HttpAnswer &answer) {
   } else {
     const std::optional<int64_t> when = parse_http_date(text);
     if (!when) return std::nullopt;
-    seconds = std::max<int64_t>(0, *when - g_get_real_time() / G_USEC_PER_SEC);
+    // By the clock that the date is of: the device's may be another.
+    const std::optional<int64_t> now = parse_http_date(answer.header("date"));
+    seconds = std::max<int64_t>(0, *when - now.value_or(g_get_real_time() / G_USEC_PER_SEC));
   }
   return std::min(std::chrono::seconds(seconds), kLongestRetryAfter);
 }

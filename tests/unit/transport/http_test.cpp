@@ -129,6 +129,20 @@ TEST(HttpOutcome, RetryAfterAsADate) {
   EXPECT_EQ(wait_for(1000000), hours(1));
 }
 
+TEST(HttpOutcome, RetryAfterAsADateIsOfTheServersClock) {
+  const char *const now = "Sun, 06 Nov 1994 08:49:37 GMT";
+  const std::pair<const char *, seconds> cases[] = {
+      {"Sun, 06 Nov 1994 08:51:17 GMT", seconds(100)},
+      {"Sun, 06 Nov 1994 08:49:37 GMT", seconds(0)},
+      {"Sun, 06 Nov 1994 08:49:00 GMT", seconds(0)},
+      {"Mon, 07 Nov 1994 08:49:37 GMT", seconds(3600)},
+  };
+  for (const auto &[date, expected] : cases) {
+    const Outcome outcome = outcome_of(answer(429, {{"date", now}, {"retry-after", date}}), "x");
+    EXPECT_EQ(outcome.retry_after, expected) << date;
+  }
+}
+
 TEST(HttpOutcome, RetryAfterThatIsNoneIsNotHonoured) {
   for (const char *text : {"", "soon", "-5", "1.5", "5 seconds", "Mon, 99 Jan 2024 00:00:00 GMT"})
     EXPECT_FALSE(outcome_of(answer(503, {{"retry-after", text}}), "x").retry_after) << text;
