@@ -185,6 +185,13 @@ void print_json(const Check &check) {
   json_object_put(object);
 }
 
+[[noreturn]] void wrong_cloud() {
+  throw Failure(
+      "usage: quarn-device set DIR cloud URL [--user NAME [--password-file FILE]] "
+      "[--ca-file FILE] [--region NAME] [--addressing path|virtual]",
+      DEVICE_USAGE);
+}
+
 }  // namespace
 
 void check_cloud(const Cloud &cloud) {
@@ -225,7 +232,7 @@ void set_cloud(const std::string &device, const Arguments &arguments) {
   cloud.url = arguments[2];
   std::string password_file;
   for (std::size_t i = 3; i < arguments.size(); i += 2) {
-    if (i + 1 >= arguments.size() || arguments[i + 1].empty()) wrong_use();
+    if (i + 1 >= arguments.size() || arguments[i + 1].empty()) wrong_cloud();
     const std::string &value = arguments[i + 1];
     if (arguments[i] == "--user") {
       cloud.user = value;
@@ -236,13 +243,13 @@ void set_cloud(const std::string &device, const Arguments &arguments) {
     } else if (arguments[i] == "--region") {
       cloud.region = value;
     } else if (arguments[i] == "--addressing") {
-      if (value != "path" && value != "virtual") wrong_use();
+      if (value != "path" && value != "virtual") wrong_cloud();
       cloud.addressing = value;
     } else {
-      wrong_use();
+      wrong_cloud();
     }
   }
-  if (cloud.user.empty() && !password_file.empty()) wrong_use();
+  if (cloud.user.empty() && !password_file.empty()) wrong_cloud();
   // Nobody is asked for a password for what is refused anyway.
   if (!cloud.user.empty()) cloud.password = kAnyCredential;
   check_cloud(cloud);

@@ -458,7 +458,7 @@ class S3Backend : public Backend {
       if (!answer.good()) return outcome(answer, "list");
       S3Listing listing;
       if (!parse_s3_listing(answer.body, &listing))
-        return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's answer is not a listing");
+        return no_store("list: the server's answer is not a listing");
       if (listing.truncated && !route.leads_on(listing.next))
         return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's listing does not go on");
       drop_others(prefix, &listing);

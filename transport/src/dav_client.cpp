@@ -156,7 +156,7 @@ Outcome DavClient::list(Ticket &ticket, const std::string &folder, DavListing *l
   std::vector<DavEntry> temporary;
   bool is_folder = false;
   if (!read_listing(answer, folder, listing, &temporary, &is_folder))
-    return failure(BACKUP_TRANS_ERROR_SERVER, "list: the server's answer is not a listing");
+    return no_store("list: the server's answer is not a listing");
   if (!is_folder) return no_such_object();
   const std::optional<int64_t> now = parse_http_date(answer.header("date"));
   for (const DavEntry &entry : temporary) {

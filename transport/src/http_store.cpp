@@ -31,6 +31,12 @@ Outcome again(std::string message) {
   return outcome;
 }
 
+Outcome no_store(std::string message) {
+  Outcome outcome = failure(BACKUP_TRANS_ERROR_SERVER, std::move(message));
+  outcome.wrong_address = true;
+  return outcome;
+}
+
 Outcome local_failure(const char *what) {
   return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, std::string(what) + ": " + g_strerror(errno));
 }

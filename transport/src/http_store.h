@@ -32,6 +32,9 @@ Outcome no_such_object();
 /** A failure of the store that is worth another attempt. */
 Outcome again(std::string message);
 
+/** The answer of something that is no such store. */
+Outcome no_store(std::string message);
+
 /** With the text of errno. */
 Outcome local_failure(const char *what);
 

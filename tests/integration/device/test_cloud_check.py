@@ -90,6 +90,13 @@ class CloudCheck(TestCase):
         self.assertEqual(self.answer_of(501, "Not Implemented"), (
             11, "", "address: list: the server answered 501 (Not Implemented)\n"))
 
+    def test_a_page_for_people_is_the_address(self):
+        with Server(200, "OK") as server:
+            for kind in ("webdav", "s3"):
+                self.set_cloud("%s+http://127.0.0.1:%d/dav" % (kind, server.port))
+                self.assertEqual(self.check(), (
+                    11, "", "address: list: the server's answer is not a listing\n"))
+
     def test_a_server_that_sends_elsewhere_is_the_address(self):
         code, out, error = self.answer_of(301, "Moved Permanently")
         self.assertEqual((code, out), (11, ""))

@@ -335,7 +335,10 @@ class State(TestCase):
                       ("--password-file", "x")):
             result = device.call("set", "cloud", "s3+https://s3.example.org/fleet", *wrong,
                                  check=False)
-            self.assertEqual(result.returncode, 64, wrong)
+            self.assertEqual((result.returncode, result.stderr), (
+                64, "quarn-device: usage: quarn-device set DIR cloud URL "
+                "[--user NAME [--password-file FILE]] [--ca-file FILE] [--region NAME] "
+                "[--addressing path|virtual]\n"), wrong)
 
     def test_alarms_json_is_an_array(self):
         device = self.new_device()
