@@ -2,7 +2,6 @@
 #include <isa-l/igzip_lib.h>
 #include <sys/mman.h>
 
-#include <algorithm>
 #include <cstdlib>
 #include <new>
 
@@ -20,21 +19,8 @@ constexpr std::size_t kDeflatedChunk = 200U << 10;
 constexpr std::size_t kInflateInput = 64U << 10;
 constexpr std::size_t kInflateOutput = 256U << 10;
 
-// Making a code for a file takes as long as finding the matches in 2 KiB of it. Files of these
-// sizes are written in the code of an earlier one of the archive, as long as it suits them: a
-// twelfth less CPU time for 2,000 files of up to 8 KiB, and 1.7 % more to send.
-constexpr std::size_t kLeastInLearnedCode = 512;
-constexpr std::size_t kMostInLearnedCode = 4096;
-constexpr std::size_t kLeastToLearnFrom = 1024;
-constexpr std::uint32_t kLearnedLevel = 0;  // the only one that takes a code
-/** A file may come out so much larger than the one that the code was made for, in per cent. */
-constexpr std::size_t kSuitsPercent = 150;
-constexpr unsigned int kMaxRefusals = 16;
-
 struct DeflateMemory {
   isal_zstream stream;
-  isal_huff_histogram histogram;
-  isal_hufftables learned;
   unsigned char level[ISAL_DEF_LVL2_DEFAULT];
   unsigned char plain[kPlainChunk];
   unsigned char deflated[kDeflatedChunk];
@@ -118,24 +104,30 @@ class IsalCodec : public Codec {
   bool ready() const { return out_ != nullptr || in_ != nullptr; }
 
   CodecResult deflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) override {
+    isal_zstream &stream = out_->stream;
+    isal_deflate_reset(&stream);
+    stream.end_of_stream = 0;
     *totals = {};
     CodecResult result = CodecResult::kDone;
     bool end = false;
-    std::size_t count = fill(source, &end, &result);
-    if (end && count >= kLeastInLearnedCode && count <= kMostInLearnedCode)
-      return deflate_small(count, sink, totals, result);
-    start(kLevel);
-    for (;; count = fill(source, &end, &result)) {
-      count_in(count, totals);
-      out_->stream.end_of_stream = end ? 1 : 0;
-      out_->stream.flush = end ? NO_FLUSH : SYNC_FLUSH;
+    while (!end) {
+      const std::size_t count = fill(source, &end, &result);
+      totals->crc = isal_codec_crc32(totals->crc, out_->plain, count);
+      totals->plain += count;
+      stream.next_in = out_->plain;
+      stream.avail_in = static_cast<std::uint32_t>(count);
+      stream.end_of_stream = end ? 1 : 0;
+      stream.flush = end ? NO_FLUSH : SYNC_FLUSH;
       do {
-        const long made = run();
-        if (made < 0) return CodecResult::kCorrupt;
-        if (!write(sink, static_cast<std::size_t>(made), totals)) return CodecResult::kSinkFailed;
-      } while (out_->stream.avail_out == 0 && out_->stream.internal_state.state != ZSTATE_END);
-      if (end) return result;
+        stream.next_out = out_->deflated;
+        stream.avail_out = kDeflatedChunk;
+        if (isal_deflate(&stream) != COMP_OK) return CodecResult::kCorrupt;
+        const std::size_t made = kDeflatedChunk - stream.avail_out;
+        if (made > 0 && !sink->write(out_->deflated, made)) return CodecResult::kSinkFailed;
+        totals->deflated += made;
+      } while (stream.avail_out == 0 && stream.internal_state.state != ZSTATE_END);
     }
+    return result;
   }
 
   CodecResult inflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) override {
@@ -175,74 +167,6 @@ class IsalCodec : public Codec {
   }
 
  private:
-  void start(std::uint32_t level) {
-    isal_zstream &stream = out_->stream;
-    isal_deflate_reset(&stream);
-    stream.level = level;
-    if (level == kLearnedLevel)
-      isal_deflate_set_hufftables(&stream, &out_->learned, IGZIP_HUFFTABLE_CUSTOM);
-  }
-
-  void count_in(std::size_t count, CodecTotals *totals) {
-    totals->crc = isal_codec_crc32(totals->crc, out_->plain, count);
-    totals->plain += count;
-    out_->stream.next_in = out_->plain;
-    out_->stream.avail_in = static_cast<std::uint32_t>(count);
-  }
-
-  /** As much as there is room for. @return bytes made, or negative */
-  long run() {
-    isal_zstream &stream = out_->stream;
-    stream.next_out = out_->deflated;
-    stream.avail_out = kDeflatedChunk;
-    if (isal_deflate(&stream) != COMP_OK) return -1;
-    return static_cast<long>(kDeflatedChunk - stream.avail_out);
-  }
-
-  bool write(ByteSink *sink, std::size_t made, CodecTotals *totals) {
-    totals->deflated += made;
-    return made == 0 || sink->write(out_->deflated, made);
-  }
-
-  /** A whole file that lies in memory. @return bytes made, or negative */
-  long deflate_whole(std::size_t count, std::uint32_t level, CodecTotals *totals) {
-    start(level);
-    *totals = {};
-    count_in(count, totals);
-    out_->stream.end_of_stream = 1;
-    out_->stream.flush = NO_FLUSH;
-    return run();
-  }
-
-  CodecResult deflate_small(std::size_t count, ByteSink *sink, CodecTotals *totals,
-                            CodecResult result) {
-    long made = -1;
-    if (learned_count_ > 0 && pause_ == 0) {
-      made = deflate_whole(count, kLearnedLevel, totals);
-      const bool suits = made >= 0 && static_cast<std::size_t>(made) * learned_count_ * 100 <=
-                                          count * learned_made_ * kSuitsPercent;
-      refusals_ = suits ? 0 : std::min(refusals_ + 1, kMaxRefusals);
-      // Where every file is of another kind, trying is given up for longer and longer.
-      if (!suits) pause_ = 1U << refusals_;
-      if (!suits) made = -1;
-    }
-    if (made < 0) {
-      made = deflate_whole(count, kLevel, totals);
-      if (made < 0) return CodecResult::kCorrupt;
-      if (pause_ > 0) --pause_;
-      if (pause_ == 0 && count >= kLeastToLearnFrom) learn(count, static_cast<std::size_t>(made));
-    }
-    return write(sink, static_cast<std::size_t>(made), totals) ? result : CodecResult::kSinkFailed;
-  }
-
-  void learn(std::size_t count, std::size_t made) {
-    out_->histogram = {};
-    isal_update_histogram(out_->plain, static_cast<int>(count), &out_->histogram);
-    const bool learned = isal_create_hufftables(&out_->learned, &out_->histogram) == 0;
-    learned_count_ = learned ? count : 0;
-    learned_made_ = made;
-  }
-
   /** The next chunk, full unless the source ends: its bounds decide what the output is. */
   std::size_t fill(ByteSource *source, bool *end, CodecResult *result) {
     std::size_t filled = 0;
@@ -261,10 +185,6 @@ class IsalCodec : public Codec {
 
   CodecMemory<DeflateMemory> out_;
   CodecMemory<InflateMemory> in_;
-  std::size_t learned_count_ = 0;  // size of the file that the learned code is of; 0: there is none
-  std::size_t learned_made_ = 0;   // and what it became
-  unsigned int refusals_ = 0;      // by files that the learned code did not suit, in a row
-  unsigned int pause_ = 0;         // small files until the next trial
 };
 
 }  // namespace
