@@ -86,15 +86,19 @@ int change_object_mode(int fd, const struct stat &status, mode_t mode) {
     errno = EOPNOTSUPP;
     return -1;
   }
-  // The descriptor may be of the O_PATH kind, which fchmod() refuses. Kernels before 6.6, and
-  // filters that do not know the call, leave the way through /proc.
-  const int result =
-      static_cast<int>(syscall(kFchmodat2, fd, "", mode & kPermissionBits, AT_EMPTY_PATH));
+  mode &= kPermissionBits;
+  int result = fchmod(fd, mode);
+  if (result == 0 || errno != EBADF) return result;
+  // A descriptor of the O_PATH kind. Kernels before 6.6, and filters that do not know the call,
+  // leave the way through /proc.
+  result = static_cast<int>(syscall(kFchmodat2, fd, "", mode, AT_EMPTY_PATH));
   if (result == 0 || (errno != ENOSYS && errno != EPERM)) return result;
-  return chmod(("/proc/self/fd/" + std::to_string(fd)).c_str(), mode & kPermissionBits);
+  return chmod(own_fd_path(fd).c_str(), mode);
 }
 
 int change_object_owner(int fd, uid_t uid, gid_t gid) {
+  const int result = fchown(fd, uid, gid);
+  if (result == 0 || errno != EBADF) return result;
   return fchownat(fd, "", uid, gid, AT_EMPTY_PATH);
 }
 
@@ -127,9 +131,9 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
     LOGE("error : there isn't smack info of %s", path);
     return 0;
   }
-  const std::string object = fd_path(fd);
+  const std::string own = own_fd_path(fd);
   CString current;
-  int result = smack_getlabel(object.c_str(), out(current), SMACK_LABEL_ACCESS);
+  int result = smack_getlabel(own.c_str(), out(current), SMACK_LABEL_ACCESS);
   if (result != 0) {
     LOGE("error : cannot get smack label of %s (err=%d)", path, result);
     return 0;
@@ -139,7 +143,7 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
     LOGE("fail : unknown smack label...");
     return 0;
   }
-  result = security_server_label_access(object.c_str(), label);
+  result = security_server_label_access(fd_path(fd).c_str(), label);
   if (result != SECURITY_SERVER_SUCCESS) {
     LOGE("fail : security_server_label_access...(err=%d)", result);
     return 0;

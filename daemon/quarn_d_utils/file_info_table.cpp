@@ -95,7 +95,7 @@ bool get_file_info_from_file(const char *path, const struct stat &stat, int *per
   *uid = stat.st_uid;
   *gid = stat.st_gid;
   *label = nullptr;
-  const std::string opened = fd < 0 ? std::string() : fd_path(fd);
+  const std::string opened = fd < 0 ? std::string() : own_fd_path(fd);
   const char *object = fd < 0 ? path : opened.c_str();
   const int result = S_ISLNK(stat.st_mode) ? smack_lgetlabel(path, label, SMACK_LABEL_ACCESS)
                                            : smack_getlabel(object, label, SMACK_LABEL_ACCESS);

@@ -237,3 +237,5 @@ UniqueFd safe_mkdir_below(int dir, const char *path, mode_t mode) {
 std::string fd_path(int fd) {
   return "/proc/" + std::to_string(getpid()) + "/fd/" + std::to_string(fd);
 }
+
+std::string own_fd_path(int fd) { return "/proc/self/fd/" + std::to_string(fd); }

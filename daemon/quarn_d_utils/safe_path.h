@@ -79,5 +79,7 @@ UniqueFd safe_mkdir_below(int dir, const char *path, mode_t mode);
 
 /** The name by which this process's services reach what @p fd holds: "/proc/PID/fd/N". */
 std::string fd_path(int fd);
+/** The same for this process alone: "/proc/self/fd/N". */
+std::string own_fd_path(int fd);
 
 #endif

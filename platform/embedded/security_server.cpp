@@ -36,8 +36,7 @@ std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
 bool relabel_folder(int fd, const std::string &label);
 
-/** Whether an object that may have vanished meanwhile is labelled; a link itself, not its target.
- */
+/** Label an object, which may have vanished meanwhile; a link itself, not its target. */
 bool relabel_leaf(const std::string &path, bool is_file, const std::string &label) {
   if (embedded::write_label(path.c_str(), Links::kKeep, LabelKind::kAccess, label) == 0 ||
       errno == ENOENT) {

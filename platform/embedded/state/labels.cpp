@@ -31,16 +31,12 @@ Attribute attribute_of(LabelKind kind) {
 
 /** The descriptor of this process that @p path is the name of in /proc, or negative. */
 int descriptor_of(const char *path) {
-  constexpr char kProcesses[] = "/proc/";
-  constexpr char kDescriptors[] = "/fd/";
-  const std::size_t start = std::strlen(kProcesses);
-  if (std::strncmp(path, kProcesses, start) != 0) return -1;
+  constexpr char kOwnDescriptors[] = "/proc/self/fd/";
+  const std::size_t start = std::strlen(kOwnDescriptors);
+  if (std::strncmp(path, kOwnDescriptors, start) != 0) return -1;
   char *end = nullptr;
-  if (std::strtol(path + start, &end, 10) != getpid()) return -1;
-  if (std::strncmp(end, kDescriptors, std::strlen(kDescriptors)) != 0) return -1;
-  const char *number = end + std::strlen(kDescriptors);
-  const long fd = std::strtol(number, &end, 10);
-  return end == number || *end != '\0' ? -1 : static_cast<int>(fd);
+  const long fd = std::strtol(path + start, &end, 10);
+  return end == path + start || *end != '\0' ? -1 : static_cast<int>(fd);
 }
 
 /** A call on what is open is spared the walk to it; an O_PATH descriptor does not allow one. */

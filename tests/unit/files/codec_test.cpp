@@ -265,6 +265,14 @@ TEST_P(CodecTest, CountsTheChecksumOfTheStandard) {
   EXPECT_EQ(GetParam().crc32(17, "", 0), 17U);
 }
 
+TEST(IsalCodec, CountsTheArchiveLibrarysChecksumsToo) {
+  const std::string text = words(1000);
+  const auto *bytes = reinterpret_cast<const unsigned char *>(text.data());
+  const uLong first = crc32(0, bytes, 300);
+  EXPECT_EQ(crc32(first, bytes + 300, 700), crc32_z(0, bytes, 1000));
+  EXPECT_EQ(crc32(first, nullptr, 0), crc32_z(0, nullptr, 0));
+}
+
 TEST(IsalCodec, StoresWhatCannotBeCompressed) {
   // 5 bytes for each block of at most 64 KiB, and a little at the end of a chunk of three
   const std::string plain = noise(4 * kMiB);

@@ -71,15 +71,14 @@ TEST_F(Labels, OfWhatIsOpenAreReadByItsDescriptorsName) {
     const int fd = open(file_.c_str(), flags | O_CLOEXEC);
     ASSERT_GE(fd, 0);
     const std::string number = std::to_string(fd);
-    const std::string own = "/proc/" + std::to_string(getpid()) + "/fd/";
+    const std::string own = "/proc/self/fd/";
     EXPECT_EQ(get(own + number), "org.example");
     // once the first one had a label, what has none is asked differently
     EXPECT_EQ(get(dir_.file("tree/bare", "")), "_");
     EXPECT_EQ(get(own + number), "org.example");
-    for (const std::string &other :
-         {own, own + number + "x", own + number + "/x", own + "x", "/proc/1x/fd/" + number,
-          "/proc/" + std::to_string(getpid()) + "/fx/" + number, "/proc/x/fd/" + number}) {
-      EXPECT_EQ(get(other), other == own ? "_" : "error") << other;
+    EXPECT_EQ(get(own), "_");
+    for (const std::string &other : {own + number + "x", own + number + "/x", own + "x"}) {
+      EXPECT_EQ(get(other), "error") << other;
     }
     close(fd);
     EXPECT_EQ(get(own + number), "error");
