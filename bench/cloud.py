@@ -3,7 +3,6 @@ import configparser
 import os
 import pwd
 import random
-import re
 import shutil
 import signal
 import socket
@@ -13,7 +12,7 @@ import threading
 import time
 
 import trees
-from harness import CEILING_KB, Table, median
+from harness import CEILING_KB, Table, median, unshared_pss
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 FIXTURES = os.path.join(HERE, "../tests/integration/cloud")
@@ -141,12 +140,9 @@ def rclone_environment(options):
 def peak_pss(pid, done, result):
     while not done.wait(0.005):
         try:
-            with open("/proc/%d/smaps_rollup" % pid) as file:
-                match = re.search(r"^Pss: +(\d+)", file.read(), re.M)
+            result.append(unshared_pss(pid))
         except OSError:
             return
-        if match:
-            result.append(int(match.group(1)))
 
 
 def timed(command, environment):

@@ -105,8 +105,18 @@ class Device:
         self.run("stop")
 
 
+def unshared_pss(pid):
+    """
+    PSS of a process in kB if it shared no page with another one, a library's neither: that is its
+    resident set. On a device where nothing else has the same libraries loaded it is what counts.
+    """
+    with open("/proc/%d/smaps_rollup" % pid) as file:
+        # A process that has ended but was not waited for has none.
+        return next((int(line.split()[1]) for line in file if line.startswith("Rss:")), 0)
+
+
 class Watch:
-    """Samples the daemon's PSS, and its CPU time, while a block runs."""
+    """Samples the daemon's memory, as unshared_pss() counts it, while a block runs."""
 
     def __init__(self, device):
         self.device = device
@@ -121,10 +131,7 @@ class Watch:
             if pid is None:
                 continue
             try:
-                with open("/proc/%d/smaps_rollup" % pid) as file:
-                    for line in file:
-                        if line.startswith("Pss:"):
-                            self.peak = max(self.peak, int(line.split()[1]))
+                self.peak = max(self.peak, unshared_pss(pid))
             except OSError:
                 pid = None
 

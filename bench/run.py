@@ -17,7 +17,8 @@ import trees  # noqa: E402
 from archives import archives  # noqa: E402
 from harness import CEILING_KB, Checks, Device, Table, Watch  # noqa: E402
 
-SECTIONS = ("archives", "start", "fleet", "files", "list", "installed", "large", "others", "cloud")
+#: How often a short run measures what it does not find met: a busy machine is no regression.
+SHORT_ATTEMPTS = 3
 
 
 def fleet(bin_dir, work, counts, checks):
@@ -138,42 +139,62 @@ def large(bin_dir, work, checks):
     table.show("Packages at the size cap")
 
 
+#: By name: what measures it, given the programs, a directory, whether the run is short, and checks.
+SECTIONS = {
+    "archives": lambda bin_dir, work, short, checks:
+        archives(bin_dir, work, 3 if short else 7, checks),
+    "start": lambda bin_dir, work, short, checks:
+        start.start(bin_dir, work, checks, 7 if short else 15),
+    "fleet": lambda bin_dir, work, short, checks:
+        fleet(bin_dir, work, (10, 100, 300) if short else (10, 100, 1000, 5000), checks),
+    "files": lambda bin_dir, work, short, checks:
+        growth.files(bin_dir, work, checks,
+                     (10, 100, 1000) if short else (10, 100, 1000, 5000, 20000)),
+    "list": lambda bin_dir, work, short, checks:
+        growth.listed(bin_dir, work, checks, (5, 10, 25) if short else (5, 10, 25, 50)),
+    "installed": lambda bin_dir, work, short, checks: installed_at_once(bin_dir, work, checks),
+    "large": lambda bin_dir, work, short, checks: large(bin_dir, work, checks),
+    "others": lambda bin_dir, work, short, checks:
+        others.others(bin_dir, work, checks, 1 if short else 7),
+    "cloud": lambda bin_dir, work, short, checks:
+        cloud.cloud(bin_dir, work, checks, 1 if short else 7),
+}
+
+
+def measured(name, bin_dir, work, short):
+    """What of a section is not met, in the best of its attempts."""
+    failed = []
+    for attempt in range(SHORT_ATTEMPTS if short else 1):
+        checks = Checks(1.5 if short else 1.0)
+        place = os.path.join(work, "%s-%d" % (name, attempt))
+        os.makedirs(place)
+        SECTIONS[name](bin_dir, place, short, checks)
+        failed = checks.failed
+        if not failed:
+            break
+        if short:
+            print("\nnot met in attempt %d: %s" % (attempt + 1, "; ".join(failed)), flush=True)
+    return failed
+
+
 def main():
     parser = argparse.ArgumentParser(description=__doc__)
     parser.add_argument("--bin", required=True, help="directory of the programs")
     parser.add_argument("--short", action="store_true",
                         help="few runs, and ratios may be off by half")
-    parser.add_argument("--only", choices=SECTIONS, action="append")
+    parser.add_argument("--only", choices=list(SECTIONS), action="append")
     options = parser.parse_args()
     # Servers, devices and mounts go also when somebody ends this.
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(128 + signal.SIGTERM))
-    checks = Checks(1.5 if options.short else 1.0)
     bin_dir = os.path.abspath(options.bin)
-    wanted = options.only or SECTIONS
-    short = options.short
+    failed = []
     with tempfile.TemporaryDirectory(prefix="quarn-bench-") as work:
-        if "archives" in wanted:
-            archives(bin_dir, work, 3 if short else 7, checks)
-        if "start" in wanted:
-            start.start(bin_dir, work, checks, 7 if short else 15)
-        if "fleet" in wanted:
-            fleet(bin_dir, work, (10, 100) if short else (10, 100, 1000, 5000), checks)
-        if "files" in wanted:
-            growth.files(bin_dir, work, checks,
-                         (10, 100, 1000) if short else (10, 100, 1000, 5000, 20000))
-        if "list" in wanted:
-            growth.listed(bin_dir, work, checks, (5, 10) if short else (5, 10, 25, 50))
-        if "installed" in wanted:
-            installed_at_once(bin_dir, work, checks)
-        if "large" in wanted:
-            large(bin_dir, work, checks)
-        if "others" in wanted:
-            others.others(bin_dir, work, checks, 1 if short else 3)
-        if "cloud" in wanted:
-            cloud.cloud(bin_dir, work, checks, 1 if short else 3)
-    if checks.failed:
+        for name in SECTIONS:
+            if options.only is None or name in options.only:
+                failed += measured(name, bin_dir, work, options.short)
+    if failed:
         print()
-        for line in checks.failed:
+        for line in failed:
             print("not met: " + line)
         sys.exit(1)
     print("\nall required ratios met")
