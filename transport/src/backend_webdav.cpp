@@ -84,6 +84,12 @@ struct Destination {
   std::string condition;  // on what lies there; may be empty
 };
 
+// The lock on a folder; without a token where the server has none.
+struct HeldLock {
+  std::string token;
+  RetryClock::Point until;  // it lasts, unless somebody takes it away
+};
+
 // What the server has shown of its moves.
 enum class Moving { unknown, done, refused };
 
@@ -249,7 +255,7 @@ class WebdavBackend : public Backend {
   // refuses the content again and again has no room for it.
   Outcome refused(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
                   const Destination &destination, const HttpAnswer &answer) const {
-    const Outcome result = of_upload(dav_outcome(answer, "upload"));
+    const Outcome result = outcome_under(destination.lock, answer);
     const bool unclear =
         has_status(answer, kHttpServerError) || has_status(answer, kHttpMethodNotAllowed);
     if (!unclear || upload.source.size() == 0) return result;
@@ -283,7 +289,7 @@ class WebdavBackend : public Backend {
       moving_ = Moving::done;
       return success();
     }
-    Outcome result = of_upload(dav_outcome(answer, "upload"));
+    Outcome result = outcome_under(conditions.header, answer);
     // What has moved something before can do it.
     if (is_unsupported(answer) && moving_ != Moving::done) {
       if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
@@ -349,28 +355,44 @@ class WebdavBackend : public Backend {
 
   // The comparison and the move happen while nobody else may change the folder.
   Outcome move_locked(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
-    return while_locked(ticket, parent_of(upload.path), [&](const std::string &token) {
-      return move_if_unchanged(ticket, upload, uploaded, token);
+    return while_locked(ticket, parent_of(upload.path), [&](const HeldLock &lock) {
+      return move_if_unchanged(ticket, upload, uploaded, lock);
     });
   }
 
-  // The token is empty on a server without locks.
   Outcome while_locked(Ticket &ticket, const std::string &folder,
-                       const std::function<Outcome(const std::string &token)> &step) {
-    std::string token;
-    Outcome result = client_.lock(ticket, folder, &token);
+                       const std::function<Outcome(const HeldLock &lock)> &step) {
+    HeldLock lock;
+    lock.until = http_now() + kLockDuration;
+    Outcome result = client_.lock(ticket, folder, &lock.token);
     if (!result.ok()) {
       forget("");
       if (result.transient) look_at_lock(ticket, folder);
       return result;
     }
-    result = step(token);
-    client_.unlock(folder, token);
+    result = step(lock);
+    client_.unlock(folder, lock.token);
+    return result;
+  }
+
+  // Not every server looks at the proof of a lock that has ended.
+  static Outcome check_lock(const HeldLock &lock) {
+    const bool ended = !lock.token.empty() && http_now() >= lock.until;
+    return ended ? again("upload: the lock has ended") : success();
+  }
+
+  // A condition that does not hold. Where it is the proof of a lock on the folder, some say that
+  // this is what the rest depended on.
+  static Outcome outcome_under(const std::string &condition, const HttpAnswer &answer) {
+    Outcome result = of_upload(dav_outcome(answer, "upload"));
+    if (has_status(answer, kHttpFailedDependency) && !condition.empty())
+      result.code = BACKUP_TRANS_ERROR_CONFLICT;
     return result;
   }
 
   Outcome move_if_unchanged(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
-                            const std::string &token) {
+                            const HeldLock &lock) {
+    const std::string &token = lock.token;
     Conditions conditions;
     // A move whose answer was lost has changed the object itself.
     if (!uploaded->move_asked) {
@@ -383,7 +405,9 @@ class WebdavBackend : public Backend {
       conditions.overwrite = upload.basis->has_value();
     }
     if (!token.empty()) conditions.header = client_.lock_condition(parent_of(upload.path), token);
-    Outcome result = move(ticket, upload, uploaded, conditions);
+    Outcome result = check_lock(lock);
+    if (!result.ok()) return result;
+    result = move(ticket, upload, uploaded, conditions);
     if (result.code != BACKUP_TRANS_ERROR_CONFLICT || !uploaded->complete) return result;
     uploaded->move_asked = false;
     return explain_refusal(ticket, upload, uploaded, result);
@@ -407,8 +431,8 @@ class WebdavBackend : public Backend {
     const std::string folder = parent_of(upload.path);
     const Outcome result = ensure_folder(ticket, folder, uploaded);
     if (!result.ok()) return result;
-    return while_locked(ticket, folder, [&](const std::string &token) {
-      return replace_if_unchanged(ticket, upload, uploaded, token);
+    return while_locked(ticket, folder, [&](const HeldLock &lock) {
+      return replace_if_unchanged(ticket, upload, uploaded, lock);
     });
   }
 
@@ -433,7 +457,8 @@ class WebdavBackend : public Backend {
   }
 
   Outcome replace_if_unchanged(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
-                               const std::string &token) {
+                               const HeldLock &lock) {
+    const std::string &token = lock.token;
     Destination destination{upload.path, "", ""};
     if (!token.empty()) destination.lock = client_.lock_condition(parent_of(upload.path), token);
     Found found = Found::nothing;
@@ -453,6 +478,8 @@ class WebdavBackend : public Backend {
       destination.condition = "If-None-Match: *";
     else if (token.empty() && !tag.empty() && uploaded->failed_preconditions == 0)
       destination.condition = "If-Match: " + tag;
+    result = check_lock(lock);
+    if (!result.ok()) return result;
     result = send(ticket, upload, uploaded, destination);
     if (result.ok()) return result;
     if (result.code == BACKUP_TRANS_ERROR_CONFLICT)

@@ -22,6 +22,7 @@ namespace transport {
 constexpr int kHttpCreated = 201;
 constexpr int kHttpMultiStatus = 207;
 constexpr int kHttpLocked = 423;
+constexpr int kHttpFailedDependency = 424;
 constexpr int kHttpServerError = 500;
 
 /** How long a lock lasts whose holder does not give it back. */

@@ -617,6 +617,8 @@ bool http_pause(Ticket &ticket, std::chrono::milliseconds duration) {
   return Engine::get().clock()->pause(ticket, duration);
 }
 
+RetryClock::Point http_now() { return Engine::get().clock()->now(); }
+
 void set_http_clock(RetryClock *clock) { Engine::get().set_clock(clock); }
 
 void wake_http() { Engine::get().wake(); }

@@ -67,6 +67,9 @@ HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request);
 /** Wait between two exchanges. @return false when @p ticket was cancelled before the end */
 bool http_pause(Ticket &ticket, std::chrono::milliseconds duration);
 
+/** The time by which stalls, limits and pauses are measured. */
+RetryClock::Point http_now();
+
 /** Have another clock for stalls, limits and pauses; null: the real one. */
 void set_http_clock(RetryClock *clock);
 

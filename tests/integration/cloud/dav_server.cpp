@@ -5,6 +5,7 @@
 #include <glib.h>
 #include <netinet/in.h>
 #include <pwd.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
 #include <sys/prctl.h>
@@ -22,6 +23,13 @@ using namespace harness;
 namespace {
 
 constexpr char kUser[] = "device";
+
+// Its file systems are nobody else's.
+bool prepare_process() {
+  return unshare(CLONE_NEWNS) == 0 &&
+         mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
+}
+const bool prepared = prepare_process();
 
 sockaddr_in loopback(int port) {
   sockaddr_in address{};
@@ -92,6 +100,7 @@ Words command(const std::string &kind, const std::string &config, const std::str
 
 DavServer::DavServer(const std::string &kind, const Words &defines, const Certify &certify)
     : kind_(kind) {
+  EXPECT_TRUE(prepared);
   const passwd *nobody = getpwnam("nobody");
   chmod(base_.path().c_str(), 0755);
   for (const char *name : {"disk", "htdocs", "state"}) {

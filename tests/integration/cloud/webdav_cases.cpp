@@ -5,10 +5,12 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <filesystem>
 #include <sstream>
 
 #include "dav_client.h"
+#include "forwarder.h"
 #include "session.h"
 #include "webdav_store.h"
 
@@ -163,6 +165,57 @@ TEST_F(WebdavCase, LockOnAFolderThatIsGoneIsNotInTheWay) {
   client().unlock("/app_list", token);
   EXPECT_EQ(store.content(), (std::map<std::string, std::string>{{"/other", "x"}}));
   EXPECT_EQ(cloud.put(kList, "y"), 0);
+}
+
+// The lock ends in the middle of an upload: at its last step somebody takes it away.
+class EndedLock : public WebdavCase {
+ protected:
+  EndedLock() : direct(client()) {
+    EXPECT_EQ(cloud.put(kList, "one"), 0);
+    std::string config = store.config();
+    const std::string port = ":" + std::to_string(store.port()) + "/";
+    config.replace(config.find(port), port.size(), ":" + std::to_string(between.port()) + "/");
+    cloud.configure(config);
+    EXPECT_EQ(cloud.get(kList, BACKUP_TRANS_OPTION_BASIS), "one");
+  }
+
+  // The lock whose token a request shows.
+  void end_lock(const front::Request &request) {
+    const std::string condition = request.header("if");
+    const std::size_t begin = condition.find("(<") + 1;
+    direct.unlock("/app_list", condition.substr(begin, condition.find('>', begin) - begin + 1));
+    ended = true;
+  }
+  int put_directly(const std::string &content) {
+    transport::Ticket ticket;
+    HttpRequest request = direct.request_for("PUT", kList);
+    request.has_body = true;
+    request.body = content;
+    return http_perform(ticket, request).status;
+  }
+
+  const DavClient direct;
+  Forwarder between{store.port()};
+  std::atomic<bool> ended{false};
+};
+
+TEST_F(EndedLock, IsTakenAgain) {
+  between.before("MOVE", [&](const front::Request &request) { end_lock(request); });
+  EXPECT_EQ(cloud.put(kList, "two"), 0);
+  EXPECT_TRUE(ended);
+  EXPECT_EQ(cloud.get(kList), "two");
+}
+
+TEST_F(EndedLock, LosesNoListOfAnotherDevice) {
+  int status = 0;
+  between.before("MOVE", [&](const front::Request &request) {
+    end_lock(request);
+    status = put_directly("of another device");
+  });
+  const int code = cloud.put(kList, "two");
+  EXPECT_TRUE(status == 200 || status == 201 || status == 204) << status;
+  EXPECT_EQ(code, store.checks_proofs() ? BACKUP_TRANS_ERROR_CONFLICT : 0);
+  EXPECT_EQ(cloud.get(kList), code == 0 ? "two" : "of another device");
 }
 
 // A device that adds its lines to the list, again whenever another was faster:

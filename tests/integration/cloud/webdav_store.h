@@ -28,6 +28,9 @@ class WebdavStore : public TestStore {
   void let_in() override { server_.accept_password("right"); }
   bool lists_timestamps() const override { return false; }
 
+  int port() const { return server_.port(); }
+  /** Does it look at the proof of a lock where there is none? */
+  bool checks_proofs() const;
   /** The folder of the objects. */
   std::string root() const { return server_.root() + "/" + name_; }
   /** Something was changed in there past the server. */

@@ -149,6 +149,38 @@ TEST_F(InPlaceTest, ConditionThatFailsWithoutReasonIsTriedAgainAndThenLeftOut) {
   EXPECT_EQ(server.count(0), 1);
 }
 
+class LockThatEnded : public InPlaceTest, public ::testing::WithParamInterface<int> {};
+
+TEST_P(LockThatEnded, IsNotReliedOn) {
+  model.refuse("MOVE", GetParam());
+  read_as_basis("old");
+  ASSERT_EQ(cloud.put("/f/p", "x"), 0);
+  server.set_rules({after("GET", 1, [&](Response *) { clock.pass(transport::kLockDuration); })});
+  EXPECT_EQ(cloud.put(kObject, "new"), 0);
+  EXPECT_EQ(model.content(), (Content{{kObject, "new"}, {"/f/p", "x"}}));
+  EXPECT_EQ(clock.pauses().size(), 1U);
+  EXPECT_EQ(model.locks(), 0U);
+}
+
+// Before a move, and before an upload in place.
+INSTANTIATE_TEST_SUITE_P(Moves, LockThatEnded, ::testing::Values(0, 501));
+
+TEST_F(InPlaceTest, FolderWhoseLockEndedIsABrokenCondition) {
+  Fault refusal;
+  refusal.spoil = Spoil::answer;
+  refusal.answer = 424;
+  read_as_basis("old");
+  ASSERT_EQ(cloud.put("/f/p", "x"), 0);
+  server.set_rules({{"PUT", kObject, "", "", 1, 1, false, refusal}});
+  EXPECT_EQ(cloud.put(kObject, "new"), 0);
+  EXPECT_EQ(model.content().at(kObject), "new");
+  EXPECT_EQ(clock.pauses().size(), 1U);
+  // A plain one shows no proof.
+  server.set_rules({{"PUT", kObject, "", "", 1, 1, false, refusal}});
+  EXPECT_EQ(cloud.put(kObject, "newer"), BACKUP_TRANS_ERROR_SERVER);
+  EXPECT_EQ(clock.pauses().size(), 1U);
+}
+
 TEST_F(InPlaceTest, ObjectThatAnotherDevicePutWhereAPartMightLieStays) {
   ASSERT_EQ(cloud.put("/f/p", "x"), 0);
   server.set_rules({cut(60000, front::kForEver, false),
