@@ -206,6 +206,19 @@ std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *d
   return length;
 }
 
+// Some servers say what they were told.
+bool gives_away(const HttpRequest &request, const std::string &text) {
+  if (request.password.empty() || text.empty()) return false;
+  const std::string pair = request.user + ":" + request.password;
+  char *code = g_base64_encode(reinterpret_cast<const guchar *>(pair.data()), pair.size());
+  const std::string basic = code;
+  g_free(code);
+  const auto holds = [&](const std::string &secret) {
+    return text.find(secret) != std::string::npos;
+  };
+  return holds(request.password) || holds(basic) || holds("Signature=");
+}
+
 // What the network has not taken yet.
 int queued_bytes(int socket) {
   int count = 0;
@@ -520,6 +533,7 @@ class Engine {
       curl_.easy_getinfo(message->easy_handle, CURLINFO_PRIVATE, &data);
       Exchange &exchange = *reinterpret_cast<Exchange *>(data);
       exchange.answer.problem = problem_of(exchange, code);
+      if (gives_away(*exchange.request, exchange.answer.reason)) exchange.answer.reason.clear();
       const Lock lock(mutex_);
       end(exchange);
       active->remove_if([&](const ExchangePtr &other) { return other.get() == &exchange; });

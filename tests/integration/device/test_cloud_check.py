@@ -16,17 +16,25 @@ OK_LINE = "ok: objects can be put there, read and removed\n"
 
 
 class Server:
-    """An HTTP server on loopback that gives every request one answer."""
+    """An HTTP server on loopback that gives every request one answer.
 
-    def __init__(self, status, reason, context=None):
+    `seen` is called with the headers of each request before it is answered; what it returns, if
+    anything, is said instead of `reason` and `body`.
+    """
+
+    def __init__(self, status, reason, context=None, body="", seen=None):
         class Handler(http.server.BaseHTTPRequestHandler):
             protocol_version = "HTTP/1.1"
 
             def answer(self):
                 self.rfile.read(int(self.headers.get("Content-Length", 0)))
-                self.send_response(status, reason)
-                self.send_header("Content-Length", "0")
+                said = seen(self.headers) if seen else None
+                text = (said or body).encode()
+                self.send_response(status, said or reason)
+                self.send_header("Content-Length", str(len(text)))
                 self.end_headers()
+                if self.command != "HEAD":
+                    self.wfile.write(text)
 
             def __getattr__(self, name):
                 if name.startswith("do_"):
@@ -179,6 +187,127 @@ class CloudCheck(TestCase):
         self.assertEqual(status["cloud_problem"], "password")
         for text in (result.stdout, result.stderr, listed.stderr, self.device.log()):
             self.assertNotIn(PASSWORD, text)
+
+    # The same words over S3, whose services tell more.
+
+    def set_bucket(self, port, scheme="s3+http", *options):
+        self.set_cloud("%s://127.0.0.1:%d/bucket/prefix" % (scheme, port), *options)
+
+    def answer_of_service(self, status, reason, code):
+        body = "<Error><Code>%s</Code><Message>nothing of this is shown</Message></Error>" % code
+        with Server(status, reason, body=body) as server:
+            self.set_bucket(server.port)
+            return self.check()
+
+    def test_a_service_that_refuses_the_connection_is_the_network(self):
+        with Server(200, "OK") as server:
+            port = server.port
+        self.set_bucket(port)
+        code, out, error = self.check()
+        self.assertEqual((code, out), (15, ""))
+        self.assertRegex(error, r"^network: Failed to connect to 127\.0\.0\.1 port %d .*\n$" % port)
+
+    def test_a_service_that_does_not_exist_is_the_address(self):
+        self.set_cloud("s3+https://no-such-host.invalid/bucket")
+        self.assertEqual(self.check(),
+                         (11, "", "address: Could not resolve host: no-such-host.invalid\n"))
+
+    def test_a_bucket_that_does_not_exist_is_the_address(self):
+        self.assertEqual(self.answer_of_service(404, "Not Found", "NoSuchBucket"), (
+            11, "", "address: list: the server answered 404 (NoSuchBucket: there is no such "
+            "bucket) (Not Found)\n"))
+
+    def test_a_wrong_secret_is_the_password(self):
+        self.assertEqual(self.answer_of_service(403, "Forbidden", "SignatureDoesNotMatch"), (
+            13, "", "password: list: the server answered 403 (SignatureDoesNotMatch: is the secret "
+            "the right one?) (Forbidden)\n"))
+
+    def test_an_unknown_key_is_the_password(self):
+        self.assertEqual(self.answer_of_service(403, "Forbidden", "InvalidAccessKeyId"), (
+            13, "", "password: list: the server answered 403 (InvalidAccessKeyId: the access key "
+            "is not known there) (Forbidden)\n"))
+
+    def test_a_full_service_is_the_space(self):
+        self.assertEqual(self.answer_of_service(403, "Forbidden", "QuotaExceeded"), (
+            14, "", "space: list: the server answered 403 (QuotaExceeded) (Forbidden)\n"))
+
+    def test_a_broken_service_is_the_server(self):
+        self.assertEqual(self.answer_of_service(500, "Oops", "Whatever"), (
+            16, "", "server: list: the server answered 500 (Whatever) (Oops)\n"))
+
+    def test_a_services_certificate_that_nobody_vouches_for_is_the_certificate(self):
+        context, certificate = self.tls()
+        with Server(403, "Forbidden", context) as server:
+            self.set_bucket(server.port, "s3+https")
+            code, out, error = self.check()
+            self.assertEqual((code, out), (12, ""))
+            self.assertRegex(error, "^certificate: .*\n$")
+            self.set_bucket(server.port, "s3+https", "--ca-file", certificate)
+            self.assertEqual(self.check(), (
+                13, "", "password: list: the server answered 403 (Forbidden)\n"))
+
+
+def read_bytes(path):
+    try:
+        with open(path, "rb") as file:
+            return file.read().decode(errors="replace")
+    except OSError:
+        return ""
+
+
+class Secrets(TestCase):
+    """Nothing shows a password, not even when the server says what it was told."""
+
+    def setUp(self):
+        self.device = self.new_device(serial="350000000000017", account="ada")
+        self.device.set("network", "wifi")
+        self.seen = ""
+        self.told = set()
+
+    def look_at_processes(self, headers):
+        """While a request is on its way, thus also the one who asks."""
+        self.told.add(headers["Authorization"])
+        for entry in filter(str.isdigit, os.listdir("/proc")):
+            self.seen += read_bytes("/proc/%s/cmdline" % entry)
+        daemon = self.device.daemon_pid()
+        if daemon:
+            self.seen += "daemon" + read_bytes("/proc/%d/environ" % daemon)
+        return headers["Authorization"]
+
+    def note(self, result):
+        self.seen += result.stdout + result.stderr
+
+    def everything_said(self, url, status):
+        with Server(status, "No", seen=self.look_at_processes) as server:
+            self.note(self.device.call("set", "cloud", url % server.port, "--user", "ada",
+                                       input=PASSWORD + "\n"))
+            self.device.call("start", env={**os.environ, "G_MESSAGES_DEBUG": "all"})
+            self.device.install(make_source(self.path("source"), "org.example.notes", "1.0",
+                                            {"data/file": b"text"}))
+            for words in (("backup",), ("backup", "--json"), ("list",), ("status",),
+                          ("status", "--json"), ("cloud",)):
+                self.note(self.device.quarnctl(*words, check=False))
+            for words in (("cloud-check",), ("cloud-check", "--json"), ("list",), ("log",)):
+                self.note(self.device.call(*words, check=False))
+            self.device.stop()
+        for name in os.listdir(os.path.join(self.device.path, "log")):
+            self.seen += read_bytes(os.path.join(self.device.path, "log", name))
+
+    def expect_no_secret(self):
+        self.assertIn("daemon", self.seen)
+        self.assertIn("the cloud refused the user name or password\n", self.seen)
+        self.assertTrue(self.told)
+        for secret in (PASSWORD, PASSWORD.split()[0], *self.told):
+            self.assertNotIn(secret, self.seen)
+        self.assertNotIn("Signature=", self.seen)
+
+    def test_of_a_webdav_server(self):
+        self.everything_said("webdav+http://127.0.0.1:%d/dav", 401)
+        self.expect_no_secret()
+
+    def test_of_an_s3_service(self):
+        self.everything_said("s3+http://127.0.0.1:%d/bucket", 403)
+        self.expect_no_secret()
 
 
 if __name__ == "__main__":

@@ -198,7 +198,7 @@ std::vector<Tried> FaultWorld::tried() const {
 
 std::string FaultWorld::told() const {
   std::string text = answer_->message + "\n";
-  for (const Tried &one : tried()) text += one.outcome.message + "\n";
+  for (const Tried &one : tried()) text += one.outcome.message + "\n" + one.outcome.said + "\n";
   return text;
 }
 
