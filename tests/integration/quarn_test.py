@@ -59,6 +59,15 @@ def make_source(path, package, version, files, metadata=None, apps=None, **keys)
     return path
 
 
+def read_text(path):
+    """"" when there is none."""
+    try:
+        with open(path, errors="replace") as file:
+            return file.read()
+    except OSError:
+        return ""
+
+
 class Device:
     """One embedded device and the tool that handles it."""
 
@@ -118,11 +127,18 @@ class Device:
         return self.exec("quarnctl", *arguments, check=check, **keywords)
 
     def log(self):
-        try:
-            with open(os.path.join(self.path, "log/quarnd.log"), errors="replace") as file:
-                return file.read()
-        except FileNotFoundError:
-            return ""
+        return read_text(os.path.join(self.path, "log/quarnd.log"))
+
+    def logs(self):
+        folder = os.path.join(self.path, "log")
+        return "".join(read_text(os.path.join(folder, name)) for name in os.listdir(folder))
+
+    def shown_by_processes(self):
+        """Command lines of all that run now, and what the daemon was started with."""
+        text = "".join(read_text("/proc/%s/cmdline" % entry)
+                       for entry in os.listdir("/proc") if entry.isdigit())
+        daemon = self.daemon_pid()
+        return text + (read_text("/proc/%d/environ" % daemon) if daemon else "")
 
     def app_path(self, package, path=""):
         """Where a file of a package lies for those outside the device."""

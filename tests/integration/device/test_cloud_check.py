@@ -247,14 +247,6 @@ class CloudCheck(TestCase):
                 13, "", "password: list: the server answered 403 (Forbidden)\n"))
 
 
-def read_bytes(path):
-    try:
-        with open(path, "rb") as file:
-            return file.read().decode(errors="replace")
-    except OSError:
-        return ""
-
-
 class Secrets(TestCase):
     """Nothing shows a password, not even when the server says what it was told."""
 
@@ -267,11 +259,7 @@ class Secrets(TestCase):
     def look_at_processes(self, headers):
         """While a request is on its way, thus also the one who asks."""
         self.told.add(headers["Authorization"])
-        for entry in filter(str.isdigit, os.listdir("/proc")):
-            self.seen += read_bytes("/proc/%s/cmdline" % entry)
-        daemon = self.device.daemon_pid()
-        if daemon:
-            self.seen += "daemon" + read_bytes("/proc/%d/environ" % daemon)
+        self.seen += self.device.shown_by_processes()
         return headers["Authorization"]
 
     def note(self, result):
@@ -290,11 +278,10 @@ class Secrets(TestCase):
             for words in (("cloud-check",), ("cloud-check", "--json"), ("list",), ("log",)):
                 self.note(self.device.call(*words, check=False))
             self.device.stop()
-        for name in os.listdir(os.path.join(self.device.path, "log")):
-            self.seen += read_bytes(os.path.join(self.device.path, "log", name))
+        self.seen += self.device.logs()
 
     def expect_no_secret(self):
-        self.assertIn("daemon", self.seen)
+        self.assertIn("QUARN_DEVICE_DIR=" + self.device.path, self.seen)
         self.assertIn("the cloud refused the user name or password\n", self.seen)
         self.assertTrue(self.told)
         for secret in (PASSWORD, PASSWORD.split()[0], *self.told):
