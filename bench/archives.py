@@ -201,12 +201,38 @@ def restore_tree(tool, disk, kind, root, archive, runs, table, ratios):
             shutil.rmtree(os.path.join(disk, name))
 
 
+def limits(tool, disk, kind, root, archive, runs, table):
+    """What an archive cannot be faster than: the codec alone, a copy, reading the tree."""
+    speeds = []
+    for _ in range(runs):
+        text = subprocess.run([tool, "codec", root], check=True, stdout=subprocess.PIPE, text=True)
+        size, *seconds = (float(number) for number in text.stdout.split())
+        speeds.append([size / 1e6 / second for second in seconds])
+    copies = []
+
+    def copy(run):
+        target = os.path.join(disk, "limit-%s-%d" % (kind, run))
+        copies.append(target)
+        return ["cp", "-a", root, target], None
+
+    cpu, _ = paired(runs, {
+        "read": lambda _: (["sh", "-c", "find . -type f -exec cat {} + > /dev/null"], root),
+        "copy": copy,
+        "crc": lambda _: (["cat", archive], None)})
+    table.add(kind, *("%.0f" % median(column) for column in zip(*speeds)),
+              *("%.3f" % median(cpu[name]) for name in ("read", "copy", "crc")))
+    for target in copies:
+        shutil.rmtree(target)
+
+
 def archives(bin_dir, work, runs, checks):
     pack = Table("tree", "files", "MiB", "quarnd CPU s", "zip -1 CPU s", "bsdtar CPU s",
                  "CPU / best", "wall / zip -1", "size / zip -1", "size / bsdtar")
     unpack = Table("tree", "quarnd CPU s", "unzip CPU s", "bsdtar CPU s", "CPU / unzip",
                    "CPU / bsdtar", "wall / unzip")
     restore = Table("tree", "quarnd CPU s", "cp -a and bsdtar -x CPU s", "CPU ratio", "wall ratio")
+    held = Table("tree", "codec alone: deflate MB/s", "inflate MB/s", "reading the tree CPU s",
+                 "cp -a CPU s", "reading the archive CPU s")
     tool = os.path.join(bin_dir, "archive_tool")
     ratios = Ratios(checks)
     with Disk(os.path.join(work, "disk"), 3072) as disk:
@@ -218,8 +244,10 @@ def archives(bin_dir, work, runs, checks):
             unpack_tree(tool, disk.path, kind, archive, runs, unpack, ratios)
             restore_tree(os.path.join(bin_dir, "restore_tool"), disk.path, kind, root, archive,
                          runs, restore, ratios)
+            limits(tool, disk.path, kind, root, archive, runs, held)
             shutil.rmtree(root)
     pack.show("Archive writing, %d paired runs" % runs)
     unpack.show("Archive reading (attributes not counted), %d paired runs" % runs)
     restore.show("Whole restores (snapshot, unpacking, attributes), %d paired runs" % runs)
+    held.show("What these are held against")
     ratios.show()
