@@ -14,9 +14,7 @@
 namespace {
 
 constexpr char kFormatVersion[] = "format_ver";
-constexpr char kModelList[] = "model_list";
 constexpr char kBackupInfo[] = "backup_info";
-constexpr char kPkgList[] = "pkg_list";
 constexpr char kAppDataPath[] = "app_data_path";
 constexpr char kTimestamp[] = "timestamp";
 constexpr char kSerialNumber[] = "serial_number";
@@ -28,6 +26,7 @@ constexpr char kCrc[] = "crc";
 constexpr int kSupportedFormat = 1;
 // Entries that are only carried over may be deeper than what is read.
 constexpr int kEntryDepth = 256;
+constexpr int kPackageDepth = kEntryDepth - 2;  // an array of an object
 
 constexpr char kCompanionListName[] = "/shared/data/app_list.txt";
 constexpr mode_t kPrivateFile = 0600;
@@ -94,26 +93,38 @@ void create_fresh_document(backup_context *ctx) {
 
 /** What of a list's text is this device's. */
 struct own_entry {
-  JsonPtr entry;         /**< null when there is none */
-  std::size_t index = 0; /**< its place among the entries */
+  JsonPtr entry;                          /**< without its packages; null when there is none */
+  std::size_t index = 0;                  /**< its place among the entries */
+  std::vector<std::string_view> packages; /**< views into the list's text */
 };
+
+/** Parse a device's entry, its packages one by one. @return false when it is not JSON */
+bool parse_entry(std::string_view text, own_entry *parsed, bool *too_deep) {
+  list_text parts = take_list_apart(text, kPkgList);
+  parsed->entry.reset(parse_whole_json(parts.frame, kEntryDepth, too_deep));
+  // null is a value like any other, but has no object
+  if (!parsed->entry && text != "null") return false;
+  for (const std::string_view &package : parts.entries) {
+    const JsonPtr value(parse_whole_json(package, kPackageDepth, too_deep));
+    if (!value && package != "null") return false;
+  }
+  parsed->packages = std::move(parts.entries);
+  return true;
+}
 
 /**
  * Read every entry and keep the first of this device.
  * @return false when one of them is not JSON
  */
-bool find_own_entry(const model_list_text &list, const char *serial, own_entry *own,
-                    bool *too_deep) {
+bool find_own_entry(const list_text &list, const char *serial, own_entry *own, bool *too_deep) {
   for (std::size_t i = 0; i < list.entries.size(); ++i) {
-    const std::string_view text = list.entries[i];
-    JsonPtr entry(parse_whole_json(text, kEntryDepth, too_deep));
-    // null is a value like any other, but has no object
-    if (!entry && text != "null") return false;
+    own_entry read;
+    if (!parse_entry(list.entries[i], &read, too_deep)) return false;
     if (own->entry) continue;
     const char *entry_serial =
-        text_member(member(entry.get(), kBackupInfo, json_type_object), kSerialNumber);
+        text_member(member(read.entry.get(), kBackupInfo, json_type_object), kSerialNumber);
     if (entry_serial == nullptr || std::strcmp(entry_serial, serial) != 0) continue;
-    own->entry = std::move(entry);
+    *own = std::move(read);
     own->index = i;
   }
   return true;
@@ -170,7 +181,7 @@ bool create_app_list_info(backup_context *ctx) {
 
 int rebase_app_list_info(backup_context *ctx, const char *model_name, const char *serial) {
   const CString text = std::move(ctx->cloud_app_list_text);
-  const model_list_text list = take_model_list_apart(text.get());
+  const list_text list = take_list_apart(text.get(), kModelList);
 
   ctx->app_list_root.reset(generate_new_json_tokener_parser(ctx, list.frame.c_str()));
   own_entry own;
@@ -213,7 +224,7 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
   ctx->model_entry = own.entry.release();
   ctx->json_objects.push_back(ctx->model_entry);
   json_object_array_put_idx(ctx->model_list, own.index, ctx->model_entry);
-  get_previous_package_list_info(ctx, member(ctx->model_entry, kPkgList, json_type_array));
+  get_previous_package_list_info(ctx, own.packages);
   ctx->backup_info = member(ctx->model_entry, kBackupInfo, json_type_object);
   set_timestamp(ctx->backup_info);
   json_object_object_del(ctx->model_entry, kPkgList);
@@ -222,16 +233,16 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
   return QUARN_OK;
 }
 
-void get_previous_package_list_info(backup_context *ctx, json_object *pkg_list) {
+void get_previous_package_list_info(backup_context *ctx,
+                                    const std::vector<std::string_view> &packages) {
   LOGI("get_previous_package_list_info");
-  const std::size_t count =
-      json_object_is_type(pkg_list, json_type_array) != 0 ? json_object_array_length(pkg_list) : 0;
-  if (count == 0) {
+  if (packages.empty()) {
     LOGI("no previous package list in old app list");
     return;
   }
-  for (std::size_t i = 0; i < count; ++i) {
-    json_object *element = json_object_array_get_idx(pkg_list, i);
+  for (std::size_t i = 0; i < packages.size(); ++i) {
+    const JsonPtr owned(parse_whole_json(packages[i], kPackageDepth, nullptr));
+    json_object *element = owned.get();
     const char *pkg_id = text_member(element, kPkgId);
     const char *version = text_member(element, kVersion);
     if (pkg_id == nullptr || version == nullptr || !is_safe_path_component(pkg_id) ||
@@ -255,11 +266,13 @@ void get_previous_package_list_info(backup_context *ctx, json_object *pkg_list) 
 void add_pkg_info_to_app_list(backup_context *ctx, const char *pkg_id, const char *version,
                               int crc) {
   if (ctx->pkg_list == nullptr) return;
-  json_object *package = generate_new_json_object(ctx);
-  json_object_object_add(package, kPkgId, json_object_new_string(pkg_id));
-  json_object_object_add(package, kVersion, json_object_new_string(version));
-  json_object_object_add(package, kCrc, json_object_new_int(crc));
-  json_object_array_add(ctx->pkg_list, package);
+  JsonPtr package(json_object_new_object());
+  json_object_object_add(package.get(), kPkgId, json_object_new_string(pkg_id));
+  json_object_object_add(package.get(), kVersion, json_object_new_string(version));
+  json_object_object_add(package.get(), kCrc, json_object_new_int(crc));
+  // As text it takes a tenth of the memory until the run ends.
+  json_object *text = new_json_from_text(json_object_get_string(package.get()));
+  json_object_array_add(ctx->pkg_list, text != nullptr ? text : package.release());
 }
 
 bool save_app_list_to_file(backup_context *ctx) {

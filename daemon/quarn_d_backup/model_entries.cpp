@@ -7,7 +7,6 @@
 
 namespace {
 
-constexpr char kModelListKey[] = "model_list";
 constexpr char kEntryPlaceholder[] = "null";
 
 using TokenerPtr = Handle<json_tokener, &json_tokener_free>;
@@ -86,13 +85,11 @@ class value_scanner {
   std::size_t position_ = 0;
 };
 
-bool is_model_list_key(std::string_view key) {
-  if (key.find('\\') == std::string_view::npos) {
-    return key == std::string("\"") + kModelListKey + "\"";
-  }
-  const JsonPtr name(parse_whole_json(key, 1, nullptr));
+bool is_key(std::string_view text, const char *key) {
+  if (text.find('\\') == std::string_view::npos) return text == std::string("\"") + key + "\"";
+  const JsonPtr name(parse_whole_json(text, 1, nullptr));
   return json_object_is_type(name.get(), json_type_string) != 0 &&
-         std::strcmp(json_object_get_string(name.get()), kModelListKey) == 0;
+         std::strcmp(json_object_get_string(name.get()), key) == 0;
 }
 
 bool split_array(std::string_view array, std::vector<std::string_view> *elements) {
@@ -107,7 +104,7 @@ bool split_array(std::string_view array, std::vector<std::string_view> *elements
 }
 
 /** The last value under the key, as a parser would have it. */
-std::string_view find_model_list(std::string_view text) {
+std::string_view find_value(std::string_view text, const char *wanted) {
   value_scanner scanner(text);
   std::string_view found;
   if (!scanner.take('{') || scanner.at('}')) return {};
@@ -118,16 +115,16 @@ std::string_view find_model_list(std::string_view text) {
         !scanner.take_value(&value)) {
       return {};
     }
-    if (is_model_list_key(key)) found = value;
+    if (is_key(key, wanted)) found = value;
   } while (scanner.take(','));
   return found;
 }
 
 }  // namespace
 
-model_list_text take_model_list_apart(std::string_view text) {
-  model_list_text result;
-  const std::string_view array = find_model_list(text);
+list_text take_list_apart(std::string_view text, const char *key) {
+  list_text result;
+  const std::string_view array = find_value(text, key);
   if (array.empty() || !split_array(array, &result.entries)) {
     result.entries.clear();
     result.frame = text;
@@ -158,7 +155,7 @@ json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep) 
 }
 
 json_object *new_json_from_text(std::string_view text) {
-  json_object *value = json_object_new_object();
+  json_object *value = json_object_new_boolean(0);  // the smallest there is
   char *copy = strndup(text.data(), text.size());
   if (value == nullptr || copy == nullptr) {
     std::free(copy);

@@ -1,10 +1,11 @@
 /**
  * @file model_entries.h
- * @brief Finding the device entries in the text of an application list.
+ * @brief Finding the device entries in the text of an application list, and the packages in theirs.
  *
  * A list is shared by all devices of an account. What other devices wrote is
  * carried over as text: numbers beyond 64 bits, doubled keys and the like
- * would not survive being read and written again.
+ * would not survive being read and written again. One package at a time is
+ * parsed, because as parsed values a list takes ten times the memory of its text.
  */
 #ifndef QUARN_D_BACKUP_MODEL_ENTRIES_H
 #define QUARN_D_BACKUP_MODEL_ENTRIES_H
@@ -15,20 +16,23 @@
 #include <string_view>
 #include <vector>
 
-/** A list's text, taken apart. */
-struct model_list_text {
-  /** The text with null in place of each entry. */
+inline constexpr char kModelList[] = "model_list"; /**< of the document: devices */
+inline constexpr char kPkgList[] = "pkg_list";     /**< of a device: packages */
+
+/** The text of an object with an array in it, taken apart. */
+struct list_text {
+  /** The text with null in place of each entry of the array. */
   std::string frame;
   /** The entries in order; views into the text that was taken apart. */
   std::vector<std::string_view> entries;
 };
 
 /**
- * Take a list's text apart. Nothing is checked beyond what tells one value
- * from the next: parse the frame and the entries afterwards. A text without
- * entries is all frame.
+ * Take the text of an object apart, at the array under @p key. Nothing is
+ * checked beyond what tells one value from the next: parse the frame and the
+ * entries afterwards. A text without entries is all frame.
  */
-model_list_text take_model_list_apart(std::string_view text);
+list_text take_list_apart(std::string_view text, const char *key);
 
 /**
  * Parse exactly one JSON value.
@@ -37,7 +41,7 @@ model_list_text take_model_list_apart(std::string_view text);
  */
 json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep);
 
-/** A value that is written as @p text, which must be JSON. */
+/** A value that is written as @p text, which must be JSON; null when memory is out. */
 json_object *new_json_from_text(std::string_view text);
 
 #endif

@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <vector>
 
@@ -224,8 +225,9 @@ bool create_app_list_info(backup_context *ctx);
  * @return 0
  */
 int rebase_app_list_info(backup_context *ctx, const char *model_name, const char *serial);
-/** Take over the entries of this device's last list; those not understood are left out. */
-void get_previous_package_list_info(backup_context *ctx, json_object *pkg_list);
+/** Take over the entries of this device's last list, texts; those not understood are left out. */
+void get_previous_package_list_info(backup_context *ctx,
+                                    const std::vector<std::string_view> &packages);
 /** Add one package to the document, when there is one. */
 void add_pkg_info_to_app_list(backup_context *ctx, const char *pkg_id, const char *version,
                               int crc);

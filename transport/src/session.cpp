@@ -16,6 +16,7 @@
 
 #include "backup_transport.h"
 #include "check.h"
+#include "listing_pages.h"
 #include "remote_path.h"
 
 struct backup_trans_handle_s {
@@ -182,6 +183,7 @@ class Session {
     ++generation_;
     config_.reset();
     backend_.reset();
+    pages_.forget();
     cancel_all(nullptr);
   }
 
@@ -428,13 +430,13 @@ class Session {
       case Kind::upload:
         return upload(request, &attempt, result, retried);
       case Kind::list:
-        return retried([&] {
-          result->page = {};
-          return request.backend->list(attempt, request.path, request.start, request.count,
-                                       &result->page);
-        });
-      case Kind::remove_folder:
-        return retried([&] { return request.backend->remove_folder(attempt, request.path); });
+        return retried([&] { return list(request, &attempt, clock->now(), &result->page); });
+      case Kind::remove_folder: {
+        const Outcome removed =
+            retried([&] { return request.backend->remove_folder(attempt, request.path); });
+        pages_.forget();
+        return removed;
+      }
       case Kind::check:
         return check_store(request.ticket, *request.backend);
     }
@@ -471,7 +473,20 @@ class Session {
       return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object was read from another store");
     const Upload upload{request.path, request.source, request.timestamp_ms, request.content_type,
                         basis ? &basis->version : nullptr};
-    return retried([&] { return request.backend->upload(*attempt, upload, &result->info); });
+    const Outcome uploaded =
+        retried([&] { return request.backend->upload(*attempt, upload, &result->info); });
+    pages_.forget();
+    return uploaded;
+  }
+
+  Outcome list(const Request &request, Attempt *attempt, RetryClock::Point now, ListPage *page) {
+    *page = {};
+    return pages_.get(
+        {request.backend, request.path, request.start, request.count}, now,
+        [&](int start, int count, ListPage *read) {
+          return request.backend->list(*attempt, request.path, start, count, read);
+        },
+        page);
   }
 
   std::mutex mutex_;
@@ -483,6 +498,7 @@ class Session {
   std::unique_ptr<ConfigFile> config_;  // null: not initialised
   Config served_;                       // what backend_ was made for
   std::shared_ptr<Backend> backend_;
+  ListingPages pages_;
   std::list<backup_trans_handle_s> handles_;
   std::deque<RequestPtr> waiting_;
   std::list<RequestPtr> running_;

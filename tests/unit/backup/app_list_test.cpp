@@ -153,7 +153,7 @@ TEST_F(AppListDocument, EntriesOfAnyShapeAreCarriedOverUnchanged) {
     ASSERT_NE(found, std::string::npos) << entry << " in " << text;
     at = found + entry.size();
   }
-  const model_list_text again = take_model_list_apart(text);
+  const list_text again = take_list_apart(text, kModelList);
   EXPECT_EQ(again.entries.size(), entries.size() + 1);
   EXPECT_NE(again.entries.back().find("org.mine"), std::string_view::npos);
 }
