@@ -181,8 +181,9 @@ class S3Backend : public Backend {
                    Version *version) override {
     if (!target.begin()) return local_failure("cannot make a local file");
     const std::string key = key_of(path);
-    Received received = receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, target);
-    if (takes_region_from(received.answer))
+    const HttpRequest request = signed_request("GET", key);
+    Received received = receive(attempt.ticket, request, G_CHECKSUM_MD5, target);
+    if (takes_region_from(received.answer, request))
       received = receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, target);
     if (is_absent_object(received.answer)) {
       if (version != nullptr) version->reset();
@@ -296,10 +297,12 @@ class S3Backend : public Backend {
     return request;
   }
 
+  static std::string signature_in(const std::string &region) { return "aws:amz:" + region + ":s3"; }
+
   void sign(const std::string &payload, HttpRequest *request) {
     const std::lock_guard<std::mutex> guard(mutex_);
     request->headers.push_back("x-amz-content-sha256: " + payload);
-    request->signature = "aws:amz:" + region_ + ":s3";
+    request->signature = signature_in(region_);
   }
 
   HttpRequest signed_request(const char *method, const std::string &key) {
@@ -308,15 +311,15 @@ class S3Backend : public Backend {
     return request;
   }
 
-  // Whether the answer named another region, which is the one from now on.
-  bool takes_region_from(const HttpAnswer &answer) {
+  // Whether the answer named another region than the request, which is the one from now on.
+  bool takes_region_from(const HttpAnswer &answer, const HttpRequest &request) {
     if (!answer.complete() ||
         (answer.status != kMovedPermanently && answer.status != kHttpBadRequest))
       return false;
     std::string named = answer.header("x-amz-bucket-region");
     if (!is_s3_name(named)) named = parse_s3_error(answer.body).region;
     const std::lock_guard<std::mutex> guard(mutex_);
-    if (named.empty() || named == region_) return false;
+    if (named.empty() || signature_in(named) == request.signature) return false;
     region_ = named;
     return true;
   }
@@ -326,7 +329,7 @@ class S3Backend : public Backend {
     const std::vector<std::string> headers = request.headers;
     sign(payload, &request);
     HttpAnswer answer = http_perform(ticket, request);
-    if (!takes_region_from(answer)) return answer;
+    if (!takes_region_from(answer, request)) return answer;
     request.headers = headers;
     sign(payload, &request);
     return http_perform(ticket, request);
@@ -394,18 +397,21 @@ class S3Backend : public Backend {
     return perform(ticket, std::move(request), place_.is_tls ? kUnsigned : sending.sha256);
   }
 
-  std::string condition_for(const Upload &upload) const {
+  std::string condition_for(const Upload &upload, bool bare_tags) const {
     if (upload.basis == nullptr || !conditions_) return "";
     if (!upload.basis->has_value()) return "If-None-Match: *";
-    const std::string quote = bare_tags_ ? "" : "\"";
+    const std::string quote = bare_tags ? "" : "\"";
     return "If-Match: " + quote + **upload.basis + quote;
   }
 
   Outcome store(Ticket &ticket, const Upload &upload, Sending *sending) {
     sending->asked = true;
-    HttpAnswer answer = put(ticket, upload, *sending, condition_for(upload));
+    // Another request may find out at the same time what this one still has to.
+    const bool bare_tags = bare_tags_;
+    const std::string condition = condition_for(upload, bare_tags);
+    HttpAnswer answer = put(ticket, upload, *sending, condition);
     if (upload.basis != nullptr && answer.complete()) {
-      if (answer.status == kHttpNotImplemented && conditions_) {
+      if (answer.status == kHttpNotImplemented && !condition.empty()) {
         // Then there is nothing better than having looked right before.
         conditions_ = false;
         answer = put(ticket, upload, *sending, "");
@@ -415,9 +421,9 @@ class S3Backend : public Backend {
         if (!found.ok()) return found;
         // The library itself may have repeated a request whose answer was lost.
         if (present.is_ours) return success();
-        if (present.version != *upload.basis || bare_tags_ || !present.version) return conflict();
+        if (present.version != *upload.basis || bare_tags || !present.version) return conflict();
         bare_tags_ = true;
-        answer = put(ticket, upload, *sending, condition_for(upload));
+        answer = put(ticket, upload, *sending, condition_for(upload, true));
       } else if (is_absent_object(answer)) {
         return conflict();
       }

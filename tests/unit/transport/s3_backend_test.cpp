@@ -3,6 +3,8 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <mutex>
 
 #include "harness.h"
@@ -84,6 +86,28 @@ class Recording : public front::Service {
   front::Service &service_;
   mutable std::mutex mutex_;
   std::vector<front::Request> requests_;
+};
+
+// Answers the first few uploads only when all of them are there.
+class Gathering : public front::Service {
+ public:
+  Gathering(front::Service &service, int wanted) : service_(service), wanted_(wanted) {}
+  Response serve(const front::Request &request) override {
+    if (request.method == "PUT") {
+      std::unique_lock<std::mutex> lock(mutex_);
+      ++here_;
+      changed_.notify_all();
+      changed_.wait_for(lock, std::chrono::seconds(30), [this] { return here_ >= wanted_; });
+    }
+    return service_.serve(request);
+  }
+
+ private:
+  front::Service &service_;
+  const int wanted_;
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  int here_ = 0;
 };
 
 class S3BackendTest : public ::testing::Test {
@@ -561,6 +585,48 @@ TEST_F(S3BackendTest, PartOfAnObjectIsNotTheObject) {
       "GET", [](Response *response) { response->status = 206; }, 1)});
   EXPECT_EQ(cloud->get("/a"), "x");
   EXPECT_EQ(service.count(0), 2);
+}
+
+// What one upload finds out about the service the others find out as well.
+TEST_F(S3BackendTest, WhatAServiceLacksIsNoticedByAllUploadsThatRun) {
+  constexpr int kUploads = 8;
+  for (const bool with_conditions : {true, false}) {
+    S3Model odd;
+    odd.set_secret(kSecret);
+    odd.settings.region = "elsewhere";
+    odd.settings.conditions =
+        with_conditions ? S3Model::Conditions::bare_tags_only : S3Model::Conditions::refused;
+    for (int i = 0; i < kUploads; ++i) odd.put("p/" + std::to_string(i), "old");
+    Gathering gathering(odd, kUploads);
+    front::Front front(gathering);
+    Cloud fresh("[cloud]\nurl=s3+http://127.0.0.1:" + std::to_string(front.port()) +
+                "/devices/p\nuser=key\npassword=" + kSecret + "\nregion=elsewhere\n");
+    std::vector<AnswerPtr> answers;
+    for (int i = 0; i < kUploads; ++i)
+      ASSERT_EQ(fresh.get("/" + std::to_string(i), BACKUP_TRANS_OPTION_BASIS), "old");
+    for (int i = 0; i < kUploads; ++i)
+      answers.push_back(fresh.upload(fresh.file("new"), "/" + std::to_string(i)));
+    ASSERT_TRUE(fresh.settle());
+    for (const AnswerPtr &answer : answers) EXPECT_EQ(answer->code, 0) << with_conditions;
+  }
+}
+
+TEST_F(S3BackendTest, AnotherRegionIsTakenByAllUploadsThatRun) {
+  constexpr int kUploads = 8;
+  S3Model odd;
+  odd.set_secret(kSecret);
+  Gathering gathering(odd, kUploads);
+  front::Front front(gathering);
+  Cloud fresh("[cloud]\nurl=s3+http://127.0.0.1:" + std::to_string(front.port()) +
+              "/devices/p\nuser=key\npassword=" + kSecret + "\n");
+  // The first answer tells that every upload needs a connection of its own.
+  EXPECT_EQ(fresh.get("/none"), "<12>");
+  odd.settings.region = "elsewhere";
+  std::vector<AnswerPtr> answers;
+  for (int i = 0; i < kUploads; ++i)
+    answers.push_back(fresh.upload(fresh.file("new"), "/" + std::to_string(i)));
+  ASSERT_TRUE(fresh.settle());
+  for (const AnswerPtr &answer : answers) EXPECT_EQ(answer->code, 0);
 }
 
 // Listings.
