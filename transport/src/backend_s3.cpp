@@ -39,6 +39,8 @@ constexpr Meaning kMeanings[] = {
     {"AuthorizationHeaderMalformed", BACKUP_TRANS_ERROR_AUTHENTICATION, false,
      "is the region the right one?"},
     {"BadDigest", BACKUP_TRANS_ERROR_SERVER, true, "it did not arrive as it was sent"},
+    // Swift's, to a writer who was overtaken.
+    {"BrokenMPU", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
     {"ConditionalRequestConflict", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
     {"EntityTooLarge", BACKUP_TRANS_ERROR_QUOTA, false, nullptr},
     {"ExpiredToken", BACKUP_TRANS_ERROR_AUTHENTICATION, false, nullptr},

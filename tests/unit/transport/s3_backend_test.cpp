@@ -150,6 +150,20 @@ class S3BackendTest : public ::testing::Test {
   std::unique_ptr<Cloud> cloud;
 };
 
+TEST_F(S3BackendTest, WriterWhoIsOvertakenHasAConflict) {
+  model.put("p/list", "one");
+  ASSERT_EQ(cloud->get("/list", BACKUP_TRANS_OPTION_BASIS), "one");
+  service.set_rules({editing(
+      "PUT",
+      [this](Response *answer) {
+        model.put("p/list", "of another device");
+        *answer = error(409, "BrokenMPU");
+      },
+      1)});
+  EXPECT_EQ(cloud->put("/list", "two"), BACKUP_TRANS_ERROR_CONFLICT);
+  EXPECT_EQ(cloud->get("/list"), "of another device");
+}
+
 TEST_F(S3BackendTest, SecretNeverTravels) {
   EXPECT_EQ(cloud->put("/a/b", "x"), 0);
   EXPECT_EQ(cloud->get("/a/b"), "x");
@@ -235,7 +249,8 @@ TEST_F(S3BackendTest, TransientCodesAreRepeated) {
   model.put("p/a", "x");
   const std::pair<int, const char *> answers[] = {
       {400, "RequestTimeout"},     {503, "SlowDown"},         {500, "InternalError"},
-      {503, "ServiceUnavailable"}, {409, "OperationAborted"}, {400, "IncompleteBody"}};
+      {503, "ServiceUnavailable"}, {409, "OperationAborted"}, {400, "IncompleteBody"},
+      {409, "BrokenMPU"}};
   for (const auto &[status, code] : answers) {
     service.set_rules({answering("GET", error(status, code), 2)});
     EXPECT_EQ(cloud->get("/a"), "x") << code;
