@@ -7,6 +7,7 @@
 #pragma GCC visibility push(hidden)
 #include <libxml/parser.h>
 #include <libxml/tree.h>
+#include <libxml/xmlreader.h>
 #include <libxml/xmlstring.h>
 
 namespace {
@@ -31,6 +32,9 @@ void free_text(void *memory) {
 #define FORWARD(name, ...)                                  \
   static auto *const real = find<decltype(&::name)>(#name); \
   return real == nullptr ? nullptr : real(__VA_ARGS__)
+#define FORWARD_NUMBER(name, ...)                           \
+  static auto *const real = find<decltype(&::name)>(#name); \
+  return real == nullptr ? -1 : real(__VA_ARGS__)
 
 extern "C" {
 
@@ -47,10 +51,33 @@ xmlChar *xmlGetProp(const xmlNode *node, const xmlChar *name) { FORWARD(xmlGetPr
 
 xmlChar *xmlNodeGetContent(const xmlNode *node) { FORWARD(xmlNodeGetContent, node); }
 
-long xmlGetLineNo(const xmlNode *node) {
-  static auto *const real = find<decltype(&::xmlGetLineNo)>("xmlGetLineNo");
-  return real == nullptr ? -1 : real(node);
+xmlTextReaderPtr xmlReaderForMemory(const char *buffer, int size, const char *url,
+                                    const char *encoding, int options) {
+  FORWARD(xmlReaderForMemory, buffer, size, url, encoding, options);
 }
+
+xmlNodePtr xmlTextReaderCurrentNode(xmlTextReaderPtr reader) {
+  FORWARD(xmlTextReaderCurrentNode, reader);
+}
+
+xmlNodePtr xmlTextReaderExpand(xmlTextReaderPtr reader) { FORWARD(xmlTextReaderExpand, reader); }
+
+int xmlTextReaderRead(xmlTextReaderPtr reader) { FORWARD_NUMBER(xmlTextReaderRead, reader); }
+
+int xmlTextReaderNext(xmlTextReaderPtr reader) { FORWARD_NUMBER(xmlTextReaderNext, reader); }
+
+int xmlTextReaderNodeType(xmlTextReaderPtr reader) {
+  FORWARD_NUMBER(xmlTextReaderNodeType, reader);
+}
+
+int xmlTextReaderDepth(xmlTextReaderPtr reader) { FORWARD_NUMBER(xmlTextReaderDepth, reader); }
+
+void xmlFreeTextReader(xmlTextReaderPtr reader) {
+  static auto *const real = find<decltype(&::xmlFreeTextReader)>("xmlFreeTextReader");
+  if (real != nullptr) real(reader);
+}
+
+long xmlGetLineNo(const xmlNode *node) { FORWARD_NUMBER(xmlGetLineNo, node); }
 
 void xmlFreeDoc(xmlDocPtr document) {
   static auto *const real = find<decltype(&::xmlFreeDoc)>("xmlFreeDoc");

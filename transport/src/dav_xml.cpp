@@ -89,6 +89,19 @@ void read_properties(const xmlNode *response, bool slash, DavEntry *entry) {
   entry->size = entry->is_collection ? 0 : size;
 }
 
+void read_response(const xmlNode *node, const std::string &host, std::vector<DavEntry> *entries) {
+  if (!is_element(node, "response")) return;
+  const xmlNode *status = child_named(node, "status");
+  const xmlNode *href = child_named(node, "href");
+  if (href == nullptr || (status != nullptr && !is_good(status))) return;
+  const std::string reference = text_of(href);
+  DavEntry entry;
+  entry.path = path_of_href(reference, host);
+  if (entry.path.empty()) return;
+  read_properties(node, reference.back() == '/', &entry);
+  entries->push_back(std::move(entry));
+}
+
 std::string find_token(const xmlNode *node, const std::string &owner) {
   const xmlNode *named = child_named(node, "owner");
   const xmlNode *token = child_named(node, "locktoken");
@@ -134,23 +147,12 @@ std::string href_in(const xmlNode *parent, const char *name) {
 
 bool parse_multistatus(const std::string &xml, const std::string &host,
                        std::vector<DavEntry> *entries) {
-  const XmlAnswer document = parse_xml(xml);
-  if (!document) return false;
-  const xmlNode *root = xmlDocGetRootElement(document.get());
-  if (root == nullptr || !is_element(root, "multistatus")) return false;
-  for (const xmlNode *node = root->children; node != nullptr; node = node->next) {
-    if (!is_element(node, "response")) continue;
-    const xmlNode *status = child_named(node, "status");
-    const xmlNode *href = child_named(node, "href");
-    if (href == nullptr || (status != nullptr && !is_good(status))) continue;
-    const std::string reference = text_of(href);
-    DavEntry entry;
-    entry.path = path_of_href(reference, host);
-    if (entry.path.empty()) continue;
-    read_properties(node, reference.back() == '/', &entry);
-    entries->push_back(std::move(entry));
-  }
-  return true;
+  const std::size_t before = entries->size();
+  const bool whole = read_xml(
+      xml, [](const xmlNode *root) { return is_element(root, "multistatus"); },
+      [&](const xmlNode *node) { read_response(node, host, entries); });
+  if (!whole) entries->resize(before);
+  return whole;
 }
 
 std::string parse_lock_token(const std::string &xml, const std::string &owner) {

@@ -1,14 +1,50 @@
 #include "xml_answer.h"
 
 #include <libxml/parser.h>
+#include <libxml/xmlreader.h>
 
 namespace transport {
+namespace {
+
+constexpr int kOptions = XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING;
+
+struct ReaderFree {
+  void operator()(xmlTextReader *reader) const { xmlFreeTextReader(reader); }
+};
+
+// No server has a reason to send one, and entities are what bombs are made of.
+bool has_document_type(const std::string &text) {
+  return text.find("<!DOCTYPE") != std::string::npos;
+}
+
+}  // namespace
+
+bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)> &root,
+              const std::function<void(const xmlNode *)> &child) {
+  if (has_document_type(text)) return false;
+  const std::unique_ptr<xmlTextReader, ReaderFree> reader(
+      xmlReaderForMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr, kOptions));
+  if (reader == nullptr) return false;
+  int read = xmlTextReaderRead(reader.get());
+  while (read == 1) {
+    const int type = xmlTextReaderNodeType(reader.get());
+    if (type == XML_READER_TYPE_DOCUMENT_TYPE) return false;
+    const int depth = type == XML_READER_TYPE_ELEMENT ? xmlTextReaderDepth(reader.get()) : -1;
+    if (depth == 0 && !root(xmlTextReaderCurrentNode(reader.get()))) return false;
+    if (depth == 1) {
+      const xmlNode *node = xmlTextReaderExpand(reader.get());
+      if (node == nullptr) return false;
+      child(node);
+    }
+    read = depth == 1 ? xmlTextReaderNext(reader.get()) : xmlTextReaderRead(reader.get());
+  }
+  return read == 0;
+}
 
 XmlAnswer parse_xml(const std::string &text) {
-  // No server has a reason to send one, and entities are what bombs are made of.
-  if (text.find("<!DOCTYPE") != std::string::npos) return nullptr;
-  XmlAnswer document(xmlReadMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr,
-                                   XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING));
+  if (has_document_type(text)) return nullptr;
+  XmlAnswer document(
+      xmlReadMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr, kOptions));
   if (document && document->intSubset != nullptr) document.reset();
   return document;
 }

@@ -7,6 +7,7 @@
 
 #include <libxml/tree.h>
 
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -19,6 +20,15 @@ using XmlAnswer = std::unique_ptr<xmlDoc, XmlFree>;
 
 /** Null when it is no well-formed document, or has a document type. */
 XmlAnswer parse_xml(const std::string &text);
+
+/**
+ * Read a document element by element, so that a long one takes no more memory than its text.
+ * @param root called with the outermost element, without what is in it
+ * @param child called with each element right below it, with all that is in that one
+ * @return false when it is no well-formed document, has a document type, or @p root is false
+ */
+bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)> &root,
+              const std::function<void(const xmlNode *)> &child);
 
 /** Everything that @p node says, as it stands. */
 std::string xml_text(const xmlNode *node);

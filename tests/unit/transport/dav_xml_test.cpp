@@ -269,12 +269,22 @@ TEST(DavXml, LargeListingsAreRead) {
   EXPECT_EQ(texts.back(), "/dav/folder/19999 object 1");
 }
 
-TEST(DavXml, NameMayBeAsLongAsTheAnswer) {
-  constexpr std::size_t kBytes = 15U << 20;
+TEST(DavXml, NameMayBeAsLongAsTheXmlLibraryTakesATextToBe) {
+  constexpr std::size_t kBytes = 9U << 20;
   std::vector<DavEntry> entries;
   ASSERT_TRUE(parse_multistatus(object("/" + std::string(kBytes, 'x')), kHost, &entries));
   ASSERT_EQ(entries.size(), 1U);
   EXPECT_EQ(entries[0].path.size(), kBytes + 1);
+  EXPECT_EQ(href_alone("/" + std::string(15U << 20, 'x')), Texts{"refused"});
+}
+
+TEST(DavXml, WhatWasReadBeforeAnErrorIsNotKept) {
+  const std::string whole = object("/dav/folder/a");
+  const std::string responses = whole.substr(0, whole.rfind("</D:multistatus>"));
+  EXPECT_EQ(parsed(responses + "<D:response></D:multistatus>"), Texts{"refused"});
+  EXPECT_EQ(parsed(whole + "<more/>"), Texts{"refused"});
+  EXPECT_EQ(parsed(responses + "words<!-- and --><?what else?></D:multistatus>"),
+            Texts{"/dav/folder/a object 0"});
 }
 
 TEST(DavXml, EmptyListing) { EXPECT_EQ(parsed(document("")), Texts{}); }
