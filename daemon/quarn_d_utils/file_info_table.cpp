@@ -43,6 +43,12 @@ json_object *attribute_object(file_info_table_h *table, int permission, unsigned
     add_constant(shared.get(), kUidKey, json_object_new_int64(uid));
     add_constant(shared.get(), kGidKey, json_object_new_int64(gid));
     add_constant(shared.get(), kLabelKey, json_object_new_string(label));
+    // Its text is made once for all that share it.
+    char *text = strdup(json_object_get_string(shared.get()));
+    if (text != nullptr) {
+      json_object_set_serializer(shared.get(), json_object_userdata_to_json_string, text,
+                                 json_object_free_userdata);
+    }
   }
   return json_object_get(shared.get());
 }

@@ -200,7 +200,11 @@ DirPtr safe_opendir_at(int dir, const char *name) {
 }
 
 UniqueFd safe_open_file_at(int dir, const char *name, struct stat *status) {
-  UniqueFd fd(openat(dir, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  const int flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+  // To look after a file is not to use it, and each new time of access would be written to the
+  // disk.
+  UniqueFd fd(openat(dir, name, flags | O_NOATIME));
+  if (!fd && errno == EPERM) fd.reset(openat(dir, name, flags));
   if (!fd || fstat(fd.get(), status) != 0 || !S_ISREG(status->st_mode)) return {};
   return fd;
 }

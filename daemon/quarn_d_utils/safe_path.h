@@ -42,7 +42,8 @@ inline constexpr int kMaxDirDepth = 400;
 
 /**
  * Open the regular file @p name of the directory @p dir for reading, and tell its status; none
- * when it cannot be opened or is anything else, a link included.
+ * when it cannot be opened or is anything else, a link included. Its time of access stays where
+ * the process may let it.
  */
 UniqueFd safe_open_file_at(int dir, const char *name, struct stat *status);
 

@@ -36,12 +36,9 @@ std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
 bool relabel_folder(int fd, const std::string &label);
 
-/** Label an object, which may have vanished meanwhile; a link itself, not its target. */
-bool relabel_leaf(const std::string &path, bool is_file, const std::string &label) {
-  if (embedded::write_label(path.c_str(), Links::kKeep, LabelKind::kAccess, label) == 0 ||
-      errno == ENOENT) {
-    return true;
-  }
+/** Label an entry, which may have vanished meanwhile; a link itself, not its target. */
+bool relabel_leaf(int dir, const char *name, bool is_file, const std::string &label) {
+  if (embedded::write_label_at(dir, name, label) == 0 || errno == ENOENT) return true;
   // Where labels are user attributes, links and special files cannot have one.
   return !is_file && errno == EPERM;
 }
@@ -52,16 +49,15 @@ bool is_roots_own(const struct stat &folder) {
 }
 
 /** One entry of the folder that is open as @p dir; the type that a folder tells saves calls. */
-bool relabel_entry(int dir, const dirent &entry, const std::string &path,
-                   const std::string &label) {
+bool relabel_entry(int dir, const dirent &entry, const std::string &label) {
   if (entry.d_type != DT_DIR && entry.d_type != DT_UNKNOWN)
-    return relabel_leaf(path, entry.d_type == DT_REG, label);
+    return relabel_leaf(dir, entry.d_name, entry.d_type == DT_REG, label);
   const int fd = openat(dir, entry.d_name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
   if (fd < 0) return errno == ENOENT;
   struct stat status {};
   bool done = fstat(fd, &status) == 0;
   if (done && !S_ISDIR(status.st_mode)) {
-    done = relabel_leaf(path, S_ISREG(status.st_mode), label);
+    done = relabel_leaf(dir, entry.d_name, S_ISREG(status.st_mode), label);
   } else if (done && !is_roots_own(status)) {
     done = relabel_folder(fd, label);
   }
@@ -82,12 +78,11 @@ bool relabel_folder(int fd, const std::string &label) {
     if (opened >= 0) close(opened);
     return false;
   }
-  const std::string folder = name_of(opened) + "/";
   bool done = true;
   while (const dirent *entry = readdir(dir)) {
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
-    done = relabel_entry(opened, *entry, folder + name, label) && done;
+    done = relabel_entry(opened, *entry, label) && done;
   }
   closedir(dir);
   return done;

@@ -1,16 +1,34 @@
 #include "state/labels.h"
 
+#include <fcntl.h>
+#include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 
 namespace embedded {
 namespace {
+
+constexpr char kOwnDescriptors[] = "/proc/self/fd/";
+
+#ifdef SYS_setxattrat
+constexpr long kSetxattrat = SYS_setxattrat;
+#else
+constexpr long kSetxattrat = 463;  // of Linux 6.13, on every architecture; newer than some headers
+#endif
+
+/** setxattrat()'s struct xattr_args. */
+struct XattrArguments {
+  alignas(8) std::uint64_t value;
+  std::uint32_t size;
+  std::uint32_t flags;
+};
 
 struct Attribute {
   const char *kernel;
@@ -31,7 +49,6 @@ Attribute attribute_of(LabelKind kind) {
 
 /** The descriptor of this process that @p path is the name of in /proc, or negative. */
 int descriptor_of(const char *path) {
-  constexpr char kOwnDescriptors[] = "/proc/self/fd/";
   const std::size_t start = std::strlen(kOwnDescriptors);
   if (std::strncmp(path, kOwnDescriptors, start) != 0) return -1;
   char *end = nullptr;
@@ -145,6 +162,20 @@ int write_label(const char *path, Links links, LabelKind kind, const std::string
   // What cannot have the attribute has the floor label, and may be given that one.
   if (errno == EPERM && kind == LabelKind::kAccess && label == kFloorLabel) return 0;
   return -1;
+}
+
+int write_label_at(int dir, const char *name, const std::string &label) {
+  if (is_label(label)) {
+    const XattrArguments arguments = {reinterpret_cast<std::uintptr_t>(label.data()),
+                                      static_cast<std::uint32_t>(label.size()), 0};
+    const char *attribute = attribute_of(LabelKind::kAccess).kernel;
+    if (syscall(kSetxattrat, dir, name, AT_SYMLINK_NOFOLLOW, attribute, &arguments,
+                sizeof arguments) == 0) {
+      return 0;
+    }
+  }
+  const std::string path = kOwnDescriptors + std::to_string(dir) + "/" + name;
+  return write_label(path.c_str(), Links::kKeep, LabelKind::kAccess, label);
 }
 
 }  // namespace embedded

@@ -213,6 +213,50 @@ TEST_P(SafePath, StaysBelowADirectory) {
   });
 }
 
+TEST_P(SafePath, OpensRegularFilesOfADirectoryOnly) {
+  run([](const TempDir &dir) {
+    dir.file("file", "four");
+    dir.link("link", "file");
+    mkdir((dir / "folder").c_str(), 0755);
+    mkfifo((dir / "fifo").c_str(), 0600);
+    const UniqueFd parent = safe_open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
+    struct stat status = {};
+    EXPECT_TRUE(safe_open_file_at(parent.get(), "file", &status));
+    EXPECT_EQ(status.st_size, 4);
+    for (const char *name : {"link", "folder", "fifo", "none"}) {
+      EXPECT_FALSE(safe_open_file_at(parent.get(), name, &status)) << name;
+    }
+  });
+}
+
+TEST_P(SafePath, ReadsAFileWithoutANewTimeOfAccess) {
+  run([](const TempDir &dir) {
+    const std::string path = dir.file("file", "four");
+    const timespec times[2] = {{1000, 0}, {2000, 0}};  // accessed before it was written
+    ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+    const UniqueFd parent = safe_open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
+    struct stat status = {};
+    const UniqueFd file = safe_open_file_at(parent.get(), "file", &status);
+    char text[4];
+    ASSERT_EQ(read(file.get(), text, sizeof text), 4);
+    ASSERT_EQ(fstat(file.get(), &status), 0);
+    EXPECT_EQ(status.st_atim.tv_sec, 1000);
+  });
+}
+
+TEST_P(SafePath, ReadsAFileOfSomebodyElseAllTheSame) {
+  run([](const TempDir &dir) {
+    const std::string path = dir.file("file", "four");
+    ASSERT_EQ(chmod(path.c_str(), 0644), 0);
+    const UniqueFd parent = safe_open(dir.path().c_str(), O_RDONLY | O_DIRECTORY);
+    ASSERT_EQ(seteuid(kApp), 0);
+    struct stat status = {};
+    const bool opened = static_cast<bool>(safe_open_file_at(parent.get(), "file", &status));
+    ASSERT_EQ(seteuid(0), 0);
+    EXPECT_TRUE(opened);
+  });
+}
+
 TEST_P(SafePath, NamesADescriptor) {
   run([](const TempDir &dir) {
     const auto path = dir.file("file", "x");
