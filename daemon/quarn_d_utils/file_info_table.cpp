@@ -36,7 +36,15 @@ void add_constant(json_object *object, const char *key, json_object *value) {
  */
 json_object *attribute_object(file_info_table_h *table, int permission, unsigned int uid,
                               unsigned int gid, const char *label) {
-  JsonPtr &shared = table->attributes[{permission, uid, gid, label}];
+  auto &used = table->used;
+  const auto values = std::tie(permission, uid, gid);
+  if (used != table->attributes.end() && label == std::get<std::string>(used->first) &&
+      values ==
+          std::tie(std::get<0>(used->first), std::get<1>(used->first), std::get<2>(used->first))) {
+    return json_object_get(used->second.get());
+  }
+  used = table->attributes.try_emplace({permission, uid, gid, label}).first;
+  JsonPtr &shared = used->second;
   if (shared == nullptr) {
     shared.reset(json_object_new_object());
     add_constant(shared.get(), kPermissionKey, json_object_new_int(permission));
@@ -152,5 +160,6 @@ int save_file_info_table(file_info_table_h *table, const char *path) {
   table->root = nullptr;
   table->symbolic_list = nullptr;
   table->attributes.clear();
+  table->used = table->attributes.end();
   return write_string_to_file(std::move(data), path);
 }

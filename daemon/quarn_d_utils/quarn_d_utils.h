@@ -68,8 +68,10 @@ bool copy_file(const char *src, const char *dst);
 struct file_info_table_h {
   json_object *root = nullptr;          /**< the document; owns everything below */
   json_object *symbolic_list = nullptr; /**< "quarn_symbolic_info", borrowed */
+  using Attributes = std::map<std::tuple<int, unsigned int, unsigned int, std::string>, JsonPtr>;
   /** Attribute objects by permission, owner, group and label: entries with the same share one. */
-  std::map<std::tuple<int, unsigned int, unsigned int, std::string>, JsonPtr> attributes;
+  Attributes attributes;
+  Attributes::iterator used = attributes.end(); /**< the last one: the next entry's as a rule */
 };
 
 /** Make an empty table; *@p table is null on failure. Released with release_file_info_table(). */

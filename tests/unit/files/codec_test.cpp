@@ -279,6 +279,25 @@ TEST(IsalCodec, StoresWhatCannotBeCompressed) {
   EXPECT_LT(deflated_by(kIsal, plain).size(), plain.size() + plain.size() / 3000);
 }
 
+TEST(IsalCodec, TheSmallestFilesHaveTheFixedCodeAndAreHardlyLarger) {
+  constexpr unsigned char kBlockKind = 0x06;  // RFC 1951, 3.2.3: the two bits behind the first
+  constexpr unsigned char kFixed = 0x02;
+  constexpr unsigned char kOwn = 0x04;
+  const auto codec = make_isal_codec(CodecUse::kDeflate);
+  // one after the other: a small file leaves nothing behind for a larger one
+  for (const std::size_t size : {std::size_t{1536}, std::size_t{1537}, std::size_t{100}, kMiB}) {
+    const std::string plain = words(size);
+    TextSource source(plain);
+    TextSink sink;
+    CodecTotals totals;
+    ASSERT_EQ(codec->deflate(&source, &sink, &totals), CodecResult::kDone);
+    const auto kind = static_cast<unsigned char>(sink.text[0]) & kBlockKind;
+    EXPECT_EQ(kind, size <= 1536 ? kFixed : kOwn) << size;
+    EXPECT_EQ(sink.text, deflated_by(kIsal, plain)) << size;
+  }
+  EXPECT_LT(deflated_by(kIsal, noise(1536)).size(), 1536U * 107 / 100);
+}
+
 TEST(IsalCodec, HowTheSourceCutsItsBytesDoesNotShow) {
   const std::string plain = words(500 * kKiB);
   TextSource source(plain, 1000);
