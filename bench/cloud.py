@@ -8,6 +8,7 @@ import signal
 import socket
 import subprocess
 import sys
+import tempfile
 import threading
 import time
 
@@ -56,8 +57,9 @@ class Dav:
             os.makedirs(os.path.join(self.dir, name), exist_ok=True)
             os.chown(os.path.join(self.dir, name), nobody.pw_uid, nobody.pw_gid)
         # The server is not root's.
-        for path in (work, os.path.dirname(work)):
-            os.chmod(path, 0o755)
+        while work != tempfile.gettempdir():
+            os.chmod(work, 0o755)
+            work = os.path.dirname(work)
         self.port = free_port()
         with open(os.path.join(FIXTURES, "apache.conf")) as file:
             text = file.read().replace("@DIR@", self.dir).replace("@PORT@", str(self.port))

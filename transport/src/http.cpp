@@ -25,6 +25,7 @@
 #include <mutex>
 #include <set>
 
+#include "checksum.h"
 #include "http_date.h"
 
 namespace transport {
@@ -86,6 +87,7 @@ bool load(Curl *curl) {
   }
   if (library == nullptr) return false;
   keep_tls_until_the_end(library);
+  count_checksums_with(library);
   return find(library, "curl_global_init", &curl->global_init) &&
          find(library, "curl_easy_init", &curl->easy_init) &&
          find(library, "curl_easy_setopt", &curl->easy_setopt) &&
