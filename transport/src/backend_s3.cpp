@@ -347,6 +347,7 @@ class S3Backend : public Backend {
   }
 
   Outcome hash(Ticket &ticket, const LocalSource &source, Sending *sending) const {
+    prepare_http();  // what it brings along counts faster
     Checksum md5(G_CHECKSUM_MD5);
     Checksum sha256(G_CHECKSUM_SHA256);
     const std::unique_ptr<char[]> buffer(new char[kHashBufferBytes]);

@@ -288,6 +288,11 @@ class Engine {
     return clock_;
   }
 
+  void prepare() {
+    const Lock lock(mutex_);
+    load_library();
+  }
+
   void wake() {
     Lock lock(mutex_);
     if (!running_) return;
@@ -300,15 +305,18 @@ class Engine {
   Engine() = default;
 
   // With the mutex held.
+  bool load_library() {
+    if (loaded_) return true;
+    loaded_ = load(&curl_);
+    // After the TLS library's own handler was registered, thus to run before it.
+    if (loaded_) std::atexit([] { get().stop_at_exit(); });
+    return loaded_;
+  }
+
+  // With the mutex held.
   bool start() {
     if (running_) return true;
-    if (!loaded_) {
-      loaded_ = load(&curl_);
-      if (!loaded_) return false;
-      // After the TLS library's own handler was registered, thus to run before it.
-      std::atexit([] { get().stop_at_exit(); });
-    }
-    if (stopping_) return false;
+    if (!load_library() || stopping_) return false;
     if (multi_ == nullptr) {
       multi_ = curl_.multi_init();
       if (multi_ == nullptr) return false;
@@ -636,6 +644,8 @@ bool http_pause(Ticket &ticket, std::chrono::milliseconds duration) {
 RetryClock::Point http_now() { return Engine::get().clock()->now(); }
 
 void set_http_clock(RetryClock *clock) { Engine::get().set_clock(clock); }
+
+void prepare_http() { Engine::get().prepare(); }
 
 void wake_http() { Engine::get().wake(); }
 

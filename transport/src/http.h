@@ -64,6 +64,9 @@ struct HttpAnswer {
 /** Blocks until the answer is there or @p ticket is cancelled. Any thread. */
 HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request);
 
+/** Load the HTTP library ahead of the first exchange, whose error it is when that fails. */
+void prepare_http();
+
 /** Wait between two exchanges. @return false when @p ticket was cancelled before the end */
 bool http_pause(Ticket &ticket, std::chrono::milliseconds duration);
 
