@@ -200,6 +200,8 @@ int backup_trans_upload_file_ors_async(backup_trans_handle_h handle, const char 
  * @param options #BACKUP_TRANS_OPTION_NONE
  *
  * A folder that does not exist has no children: the answer is an empty list.
+ * The page that follows the last one is of the same moment as that, while it is
+ * asked for within a minute and this library changed nothing in between.
  */
 int backup_trans_get_folder_child_list_async(backup_trans_handle_h handle, const char *folder_path,
                                              int start, int count, int options, void *user_data,
