@@ -57,9 +57,9 @@ class Dav:
             os.makedirs(os.path.join(self.dir, name), exist_ok=True)
             os.chown(os.path.join(self.dir, name), nobody.pw_uid, nobody.pw_gid)
         # The server is not root's.
-        while work != tempfile.gettempdir():
-            os.chmod(work, 0o755)
-            work = os.path.dirname(work)
+        for path in (work, os.path.dirname(work), os.path.dirname(os.path.dirname(work))):
+            if path != tempfile.gettempdir():
+                os.chmod(path, 0o755)
         self.port = free_port()
         with open(os.path.join(FIXTURES, "apache.conf")) as file:
             text = file.read().replace("@DIR@", self.dir).replace("@PORT@", str(self.port))

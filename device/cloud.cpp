@@ -77,10 +77,9 @@ std::string read_password(const std::string &path) {
     const Prompt prompt;
     password = read_line(STDIN_FILENO, "standard input");
   } else {
-    const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) throw Failure("cannot read " + path + ": " + reason());
-    password = read_line(fd, path);
-    close(fd);
+    const Fd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (file.fd < 0) throw Failure("cannot read " + path + ": " + reason());
+    password = read_line(file.fd, path);
   }
   if (password.empty()) throw Failure("no password was given");
   // A text of C would end there.
@@ -202,15 +201,14 @@ void check_cloud(const Cloud &cloud) {
         "that is no cloud: use file:///PATH, webdav+https://HOST/PATH or "
         "s3+https://HOST/BUCKET/PREFIX");
   // In memory, where nothing is left of what is refused.
-  const int fd = memfd_create(kCloudFile, MFD_CLOEXEC);
+  const Fd memory(memfd_create(kCloudFile, MFD_CLOEXEC));
   const std::string text = text_of(cloud);
-  if (fd < 0 || fchmod(fd, kPrivateFile) != 0 ||
-      write(fd, text.data(), text.size()) != static_cast<ssize_t>(text.size()))
+  if (memory.fd < 0 || fchmod(memory.fd, kPrivateFile) != 0 ||
+      write(memory.fd, text.data(), text.size()) != static_cast<ssize_t>(text.size()))
     throw Failure("cannot look at the cloud's configuration: " + reason());
-  const std::string path = "/proc/self/fd/" + std::to_string(fd);
+  const std::string path = "/proc/self/fd/" + std::to_string(memory.fd);
   Check check;
   run(path, &check);
-  close(fd);
   if (check.error == BACKUP_TRANS_ERROR_NONE) return;
   const std::string place = path + ": ";
   throw Failure(check.message.rfind(place, 0) == 0 ? check.message.substr(place.size())

@@ -8,6 +8,8 @@
 #ifndef QUARN_DEVICE_H
 #define QUARN_DEVICE_H
 
+#include <unistd.h>
+
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -24,6 +26,17 @@ enum device_exit : int {
   /** cloud-check: this and the cause's number. */
   DEVICE_CLOUD = 10,
   DEVICE_USAGE = 64,
+};
+
+/** Closes the descriptor it holds, unless that is negative. */
+struct Fd {
+  explicit Fd(int number = -1) : fd(number) {}
+  ~Fd() {
+    if (fd >= 0) close(fd);
+  }
+  Fd(const Fd &) = delete;
+  Fd &operator=(const Fd &) = delete;
+  int fd;
 };
 
 /** A verb that cannot go on; its text is what the user reads. */

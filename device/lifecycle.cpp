@@ -56,16 +56,6 @@ constexpr char kReady = 'R';
 /** A daemon that asks for its restart gets it this often in a row. */
 constexpr int kMaxRestarts = 5;
 
-struct Fd {
-  explicit Fd(int number = -1) : fd(number) {}
-  ~Fd() {
-    if (fd >= 0) close(fd);
-  }
-  Fd(const Fd &) = delete;
-  Fd &operator=(const Fd &) = delete;
-  int fd;
-};
-
 /* ---- the supervisor's record: its process and when that began -------------------------------- */
 
 /** Start time of a process in clock ticks, empty when there is none: a number is used again. */

@@ -1,8 +1,8 @@
 #include "checksum.h"
 
-#include <dlfcn.h>
-
 #include <atomic>
+
+#include "symbols.h"
 
 namespace transport {
 namespace {
@@ -21,19 +21,14 @@ struct Crypto {
   int (*final)(void *, unsigned char *, unsigned int *) = nullptr;
 };
 
-template <typename Function>
-bool find(void *library, const char *name, Function *function) {
-  *function = reinterpret_cast<Function>(dlsym(library, name));
-  return *function != nullptr;
-}
-
 bool find_all(void *library, Crypto *crypto) {
-  return find(library, "EVP_MD_CTX_new", &crypto->context_new) &&
-         find(library, "EVP_MD_CTX_free", &crypto->context_free) &&
-         find(library, "EVP_md5", &crypto->md5) && find(library, "EVP_sha256", &crypto->sha256) &&
-         find(library, "EVP_DigestInit_ex", &crypto->init) &&
-         find(library, "EVP_DigestUpdate", &crypto->update) &&
-         find(library, "EVP_DigestFinal_ex", &crypto->final);
+  return find_symbol(library, "EVP_MD_CTX_new", &crypto->context_new) &&
+         find_symbol(library, "EVP_MD_CTX_free", &crypto->context_free) &&
+         find_symbol(library, "EVP_md5", &crypto->md5) &&
+         find_symbol(library, "EVP_sha256", &crypto->sha256) &&
+         find_symbol(library, "EVP_DigestInit_ex", &crypto->init) &&
+         find_symbol(library, "EVP_DigestUpdate", &crypto->update) &&
+         find_symbol(library, "EVP_DigestFinal_ex", &crypto->final);
 }
 
 /** Null while nobody has loaded it. */

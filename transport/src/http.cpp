@@ -27,6 +27,7 @@
 
 #include "checksum.h"
 #include "http_date.h"
+#include "symbols.h"
 
 namespace transport {
 namespace {
@@ -66,18 +67,12 @@ struct Curl {
   decltype(&::curl_multi_cleanup) multi_cleanup = nullptr;
 };
 
-template <typename Function>
-bool find(void *library, const char *name, Function *function) {
-  *function = reinterpret_cast<Function>(dlsym(library, name));
-  return *function != nullptr;
-}
-
 // The TLS library would otherwise take itself down when the process exits, under a thread that is
 // only just setting it up.
 void keep_tls_until_the_end(void *library) {
   constexpr uint64_t kNoExitHandler = 0x00080000;  // OPENSSL_INIT_NO_ATEXIT of <openssl/crypto.h>
   int (*init)(uint64_t, const void *) = nullptr;
-  if (find(library, "OPENSSL_init_crypto", &init)) init(kNoExitHandler, nullptr);
+  if (find_symbol(library, "OPENSSL_init_crypto", &init)) init(kNoExitHandler, nullptr);
 }
 
 bool load(Curl *curl) {
@@ -88,23 +83,23 @@ bool load(Curl *curl) {
   if (library == nullptr) return false;
   keep_tls_until_the_end(library);
   count_checksums_with(library);
-  return find(library, "curl_global_init", &curl->global_init) &&
-         find(library, "curl_easy_init", &curl->easy_init) &&
-         find(library, "curl_easy_setopt", &curl->easy_setopt) &&
-         find(library, "curl_easy_getinfo", &curl->easy_getinfo) &&
-         find(library, "curl_easy_cleanup", &curl->easy_cleanup) &&
-         find(library, "curl_easy_strerror", &curl->easy_strerror) &&
-         find(library, "curl_slist_append", &curl->slist_append) &&
-         find(library, "curl_slist_free_all", &curl->slist_free_all) &&
-         find(library, "curl_multi_init", &curl->multi_init) &&
-         find(library, "curl_multi_setopt", &curl->multi_setopt) &&
-         find(library, "curl_multi_add_handle", &curl->multi_add_handle) &&
-         find(library, "curl_multi_remove_handle", &curl->multi_remove_handle) &&
-         find(library, "curl_multi_perform", &curl->multi_perform) &&
-         find(library, "curl_multi_poll", &curl->multi_poll) &&
-         find(library, "curl_multi_wakeup", &curl->multi_wakeup) &&
-         find(library, "curl_multi_info_read", &curl->multi_info_read) &&
-         find(library, "curl_multi_cleanup", &curl->multi_cleanup) &&
+  return find_symbol(library, "curl_global_init", &curl->global_init) &&
+         find_symbol(library, "curl_easy_init", &curl->easy_init) &&
+         find_symbol(library, "curl_easy_setopt", &curl->easy_setopt) &&
+         find_symbol(library, "curl_easy_getinfo", &curl->easy_getinfo) &&
+         find_symbol(library, "curl_easy_cleanup", &curl->easy_cleanup) &&
+         find_symbol(library, "curl_easy_strerror", &curl->easy_strerror) &&
+         find_symbol(library, "curl_slist_append", &curl->slist_append) &&
+         find_symbol(library, "curl_slist_free_all", &curl->slist_free_all) &&
+         find_symbol(library, "curl_multi_init", &curl->multi_init) &&
+         find_symbol(library, "curl_multi_setopt", &curl->multi_setopt) &&
+         find_symbol(library, "curl_multi_add_handle", &curl->multi_add_handle) &&
+         find_symbol(library, "curl_multi_remove_handle", &curl->multi_remove_handle) &&
+         find_symbol(library, "curl_multi_perform", &curl->multi_perform) &&
+         find_symbol(library, "curl_multi_poll", &curl->multi_poll) &&
+         find_symbol(library, "curl_multi_wakeup", &curl->multi_wakeup) &&
+         find_symbol(library, "curl_multi_info_read", &curl->multi_info_read) &&
+         find_symbol(library, "curl_multi_cleanup", &curl->multi_cleanup) &&
          curl->global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
 }
 
