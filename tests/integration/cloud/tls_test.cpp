@@ -1,4 +1,7 @@
 // Certificates, protocols, connections and passwords, over TLS with apache.
+#include <sched.h>
+#include <sys/mount.h>
+
 #include <set>
 #include <sstream>
 
@@ -27,7 +30,7 @@ class CountingClock : public transport::RetryClock {
 /** Certificates as they are needed, made by openssl in a folder. */
 class Authority {
  public:
-  explicit Authority(const std::string &dir) : dir_(dir) {
+  explicit Authority(const std::string &dir, const std::string &name = "Authority") : dir_(dir) {
     write_file(dir_ + "/ca.conf",
                "[ca]\ndefault_ca=c\n[c]\ndatabase=" + dir_ + "/index\nserial=" + dir_ +
                    "/serial\nnew_certs_dir=" + dir_ +
@@ -35,7 +38,7 @@ class Authority {
                    "[p]\ncommonName=supplied\n");
     write_file(dir_ + "/index", "");
     write_file(dir_ + "/serial", "01\n");
-    run("req -x509 " + key("ca.key") + " -out " + file() + " -days 2 -subj /CN=Authority");
+    run("req -x509 " + key("ca.key") + " -out " + file() + " -days 2 -subj /CN=" + name);
   }
 
   /** PEM file to trust. */
@@ -148,6 +151,51 @@ TEST_F(TlsTest, UnknownAuthorityIsRefused) {
   const std::string message = "SSL certificate problem: unable to get local issuer certificate";
   expect_refused(config(other.file()), message);
   expect_refused(config(""), message);
+}
+
+// Where libcurl has the system's authorities from in Debian.
+constexpr char kSystemAuthorities[] = "/etc/ssl/certs";
+constexpr int kNoNamespace = 125;
+
+// Uploads where the system's authorities are those of a directory: CONFIG-PATH DIRECTORY. Its exit
+// status is the result.
+int trusting_role(int argc, char **argv) {
+  if (argc != 2 || unshare(CLONE_NEWNS) != 0 ||
+      mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      mount(argv[1], kSystemAuthorities, nullptr, MS_BIND, nullptr) != 0)
+    return kNoNamespace;
+  Cloud cloud(read_file(argv[0]));
+  return cloud.put("/a", "x");
+}
+const bool trusting_added = add_role("trusting", trusting_role);
+
+TEST_F(TlsTest, AuthorityOfTheConfigurationReplacesThoseOfTheSystem) {
+  start_good();
+  const TempDir system;
+  write_file(system / "ca-certificates.crt", read_file(authority.file()));
+  write_file(system / "authority.pem", read_file(authority.file()));
+  ASSERT_EQ(std::system(("openssl rehash " + system.path()).c_str()), 0);
+  const TempDir other_dir;
+  // By another name: the directory is not looked into for one that the file has.
+  const Authority other(other_dir.path(), "Another");
+  const auto put = [&](const std::string &ca_file) {
+    write_file(dir / "cloud.conf", config(ca_file));
+    return run_role({"trusting", dir / "cloud.conf", system.path()});
+  };
+  EXPECT_EQ(put(""), 0);
+  EXPECT_EQ(put(other.file()), BACKUP_TRANS_ERROR_CERTIFICATE);
+}
+
+TEST_F(TlsTest, AuthorityFileThatIsReplacedCountsAtOnce) {
+  start_good();
+  const TempDir other_dir;
+  const Authority other(other_dir.path());
+  const std::string trusted = dir / "trusted.pem";
+  write_file(trusted, read_file(other.file()));
+  Cloud cloud(config(trusted));
+  EXPECT_EQ(cloud.put("/a", "x"), BACKUP_TRANS_ERROR_CERTIFICATE);
+  write_file(trusted, read_file(authority.file()));
+  EXPECT_EQ(cloud.put("/a", "x"), 0);
 }
 
 TEST_F(TlsTest, CertificateOfAnotherHostIsRefused) {
