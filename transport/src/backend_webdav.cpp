@@ -271,12 +271,6 @@ class WebdavBackend : public Backend {
 
   Outcome move(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
                const Conditions &conditions) {
-    if (uploaded->move_asked) {
-      // The earlier answer was lost or an error, which does not tell whether it was done.
-      const HttpAnswer left = client_.send(ticket, "HEAD", uploaded->temporary);
-      if (is_absent(left)) return find_moved(ticket, upload, uploaded);
-      if (!left.good()) return dav_outcome(left, "upload");
-    }
     HttpRequest request = client_.request_for("MOVE", uploaded->temporary);
     request.headers = {"Destination: " + client_.url_of(upload.path),
                        conditions.overwrite ? "Overwrite: T" : "Overwrite: F"};
@@ -311,9 +305,12 @@ class WebdavBackend : public Backend {
   // To most servers a folder in the object's place is a thing that may be replaced with everything
   // in it, and some put the object into it.
   Outcome move_plainly(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+    bool done = false;
+    Outcome result = look_at_move(ticket, upload, uploaded, &done);
+    if (!result.ok() || done) return result;
     Conditions conditions;
     conditions.overwrite = false;
-    Outcome result = move(ticket, upload, uploaded, conditions);
+    result = move(ticket, upload, uploaded, conditions);
     if (result.code == BACKUP_TRANS_ERROR_CONFLICT) {
       uploaded->move_asked = false;
       if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
@@ -335,7 +332,22 @@ class WebdavBackend : public Backend {
     return failure(BACKUP_TRANS_ERROR_SERVER, "upload: there is a folder in its place");
   }
 
-  Outcome find_moved(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
+  // What became of an earlier attempt's move, whose answer was lost or an error, which does not
+  // tell whether it was done. One that was not is asked for again like the first one: meanwhile
+  // another device may have been there.
+  Outcome look_at_move(Ticket &ticket, const Upload &upload, Uploaded *uploaded, bool *done) const {
+    if (!uploaded->move_asked) return success();
+    const HttpAnswer left = client_.send(ticket, "HEAD", uploaded->temporary);
+    if (is_absent(left)) {
+      *done = true;
+      return find_moved(ticket, upload, uploaded);
+    }
+    if (!left.good()) return dav_outcome(left, "upload");
+    uploaded->move_asked = false;
+    return success();
+  }
+
+  Outcome find_moved(Ticket &ticket, const Upload &upload, Uploaded *uploaded) const {
     if (upload.basis != nullptr) {
       // Another device may have replaced it since, which nobody can tell from its never having
       // been there.
@@ -393,19 +405,20 @@ class WebdavBackend : public Backend {
   Outcome move_if_unchanged(Ticket &ticket, const Upload &upload, Uploaded *uploaded,
                             const HeldLock &lock) {
     const std::string &token = lock.token;
+    bool done = false;
+    Outcome result = look_at_move(ticket, upload, uploaded, &done);
+    if (!result.ok() || done) return result;
+    std::string tag;
+    result = compare_basis(ticket, upload, &tag);
+    if (!result.ok()) return result;
     Conditions conditions;
-    // A move whose answer was lost has changed the object itself.
-    if (!uploaded->move_asked) {
-      std::string tag;
-      const Outcome compared = compare_basis(ticket, upload, &tag);
-      if (!compared.ok()) return compared;
-      // Where there is no lock, the server may be able to compare at the last moment.
-      if (token.empty() && !tag.empty() && uploaded->failed_preconditions == 0)
-        conditions.header = client_.tag_condition(upload.path, tag);
-      conditions.overwrite = upload.basis->has_value();
-    }
-    if (!token.empty()) conditions.header = client_.lock_condition(parent_of(upload.path), token);
-    Outcome result = check_lock(lock);
+    conditions.overwrite = upload.basis->has_value();
+    // Where there is no lock, the server may be able to compare at the last moment.
+    if (!token.empty())
+      conditions.header = client_.lock_condition(parent_of(upload.path), token);
+    else if (!tag.empty() && uploaded->failed_preconditions == 0)
+      conditions.header = client_.tag_condition(upload.path, tag);
+    result = check_lock(lock);
     if (!result.ok()) return result;
     result = move(ticket, upload, uploaded, conditions);
     if (result.code != BACKUP_TRANS_ERROR_CONFLICT || !uploaded->complete) return result;

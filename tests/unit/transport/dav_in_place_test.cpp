@@ -1,69 +1,26 @@
 // Uploads to a WebDAV server that cannot move, where other devices and odd servers come in between.
-#include <algorithm>
+#include "dav_test.h"
 
-#include "dav_front_store.h"
-#include "session.h"
-#include "virtual_clock.h"
+#include "dav_client.h"
 
 using namespace harness;
 using front::Fault;
 using front::Response;
 using front::Rule;
 using front::Spoil;
-using transport::kWorkerName;
 
 namespace {
 
-using Content = std::map<std::string, std::string>;
-
-constexpr char kObject[] = "/f/o";
-constexpr char kForeign[] = "of another device";
-
-class InPlaceTest : public ::testing::Test {
+class InPlaceTest : public DavTest {
  protected:
-  InPlaceTest() : cloud(config()) {
-    transport::set_retry_clock(&clock, {});
-    transport::set_http_clock(&clock);
-    model.refuse("MOVE", 405);
-  }
-  ~InPlaceTest() override {
-    EXPECT_TRUE(run_until([] { return threads_named(kWorkerName) == 0; }));
-    transport::set_retry_clock(nullptr, {});
-    transport::set_http_clock(nullptr);
-  }
+  InPlaceTest() { model.refuse("MOVE", 405); }
 
-  std::string config() const {
-    return "[cloud]\nurl=webdav+http://127.0.0.1:" + std::to_string(server.port()) +
-           "/dav\nuser=device\npassword=right\n";
-  }
-  int requests(const std::string &method, const std::string &target) const {
-    const std::vector<std::string> log = server.log();
-    return static_cast<int>(std::count_if(log.begin(), log.end(), [&](const std::string &line) {
-      return line.rfind(method + " ", 0) == 0 && line.find(target) != std::string::npos;
-    }));
-  }
-  // The server's answer to the nth of these requests, and what happens right after it was made up.
-  static Rule after(const char *method, int nth, std::function<void(Response *)> change) {
-    Fault fault;
-    fault.spoil = Spoil::edit;
-    fault.edit = std::move(change);
-    return {method, kObject, "", "", nth, nth, false, fault};
-  }
   static Rule cut(std::size_t at, int last, bool keeps_part) {
     Fault fault;
     fault.spoil = Spoil::reset_request;
     fault.at = at;
     return {"PUT", kObject, "", "", 1, last, keeps_part, fault};
   }
-  void read_as_basis(const std::string &content) {
-    model.put(kObject, content);
-    ASSERT_TRUE(cloud.get(kObject, BACKUP_TRANS_OPTION_BASIS) == content);
-  }
-
-  VirtualClock clock;
-  DavModel model;
-  front::Front server{model};
-  Cloud cloud;
 };
 
 class RefusedMove : public InPlaceTest, public ::testing::WithParamInterface<int> {};
