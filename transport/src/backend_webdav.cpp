@@ -102,7 +102,10 @@ class WebdavBackend : public Backend {
     if (!target.begin()) return local_failure("cannot make a local file");
     const Received received =
         receive(attempt.ticket, client_.request_for("GET", path), G_CHECKSUM_SHA256, target);
-    if (!is_object(attempt.ticket, received.answer, path)) {
+    bool found = false;
+    const Outcome looked = find_object(attempt.ticket, received.answer, path, &found);
+    if (!looked.ok()) return looked;
+    if (!found) {
       if (version != nullptr) version->reset();
       return no_such_object();
     }
@@ -174,16 +177,22 @@ class WebdavBackend : public Backend {
 
  private:
   // Whether the answer to a GET is an object's, or an error that does not tell.
-  bool is_object(Ticket &ticket, const HttpAnswer &answer, const std::string &path) {
-    if (is_absent(answer) || client_.means_folder(answer, path)) return false;
-    if (has_status(answer, kHttpMethodNotAllowed)) return !client_.is_folder(ticket, path);
-    if (!answer.good()) return true;
+  Outcome find_object(Ticket &ticket, const HttpAnswer &answer, const std::string &path,
+                      bool *found) {
+    *found = !is_absent(answer) && !client_.means_folder(answer, path);
+    bool has_folder = false;
+    if (has_status(answer, kHttpMethodNotAllowed)) {
+      const Outcome looked = client_.find_folder(ticket, path, &has_folder);
+      *found = !has_folder;
+      return looked;
+    }
     // Some take what comes behind an object's name for an argument of the object.
     const std::string folder = parent_of(path);
-    if (folder.empty() || is_known(folder)) return true;
-    const bool has_folder = client_.is_folder(ticket, folder);
+    if (!answer.good() || folder.empty() || is_known(folder)) return success();
+    const Outcome looked = client_.find_folder(ticket, folder, &has_folder);
     if (has_folder) remember(folder);
-    return has_folder || ticket.cancelled();
+    *found = has_folder;
+    return looked;
   }
 
   Outcome put_and_move(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
@@ -208,7 +217,12 @@ class WebdavBackend : public Backend {
     const bool folder_gone = has_status(answer, kHttpNotFound) ||
                              has_status(answer, kHttpConflict) ||
                              has_status(answer, kHttpServerError);
-    if (folder_gone && !folder.empty() && !client_.is_folder(ticket, folder)) {
+    bool is_there = folder.empty();
+    if (folder_gone && !is_there) {
+      result = client_.find_folder(ticket, folder, &is_there);
+      if (!result.ok()) return result;
+    }
+    if (folder_gone && !is_there) {
       // Another device has deleted what was known.
       forget("");
       result = ensure_folder(ticket, folder, uploaded);
@@ -286,13 +300,15 @@ class WebdavBackend : public Backend {
     Outcome result = outcome_under(conditions.header, answer);
     // What has moved something before can do it.
     if (is_unsupported(answer) && moving_ != Moving::done) {
-      if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+      const Outcome looked = look_for_folder(ticket, upload.path);
+      if (!looked.ok()) return looked;
       moving_ = Moving::refused;
       uploaded->is_immovable = true;
       return result;
     }
     if (is_absent(answer) || has_status(answer, kHttpConflict)) {
-      if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+      const Outcome looked = look_for_folder(ticket, upload.path);
+      if (!looked.ok()) return looked;
       // The folder was deleted, and what had been sent with it; not again and again.
       forget("");
       result.transient = !uploaded->was_lost;
@@ -313,7 +329,8 @@ class WebdavBackend : public Backend {
     result = move(ticket, upload, uploaded, conditions);
     if (result.code == BACKUP_TRANS_ERROR_CONFLICT) {
       uploaded->move_asked = false;
-      if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+      result = look_for_folder(ticket, upload.path);
+      if (!result.ok()) return result;
       conditions.overwrite = true;
       return move(ticket, upload, uploaded, conditions);
     }
@@ -323,9 +340,19 @@ class WebdavBackend : public Backend {
     const HttpAnswer moved = client_.send(ticket, "HEAD", upload.path);
     if (moved.good() && has_size(moved, upload.source.size())) return result;
     if (!moved.complete()) return moved.problem;
-    if (!client_.is_folder(ticket, upload.path)) return of_upload(dav_outcome(moved, "upload"));
+    bool is_folder = false;
+    result = client_.find_folder(ticket, upload.path, &is_folder);
+    if (!result.ok()) return result;
+    if (!is_folder) return of_upload(dav_outcome(moved, "upload"));
     client_.delete_pieces(ticket, upload.path, upload.path + "/" + name_of(uploaded->temporary));
     return folder_in_its_place();
+  }
+
+  // To be sure that there is none in the object's place.
+  Outcome look_for_folder(Ticket &ticket, const std::string &path) const {
+    bool found = false;
+    const Outcome looked = client_.find_folder(ticket, path, &found);
+    return found ? folder_in_its_place() : looked;
   }
 
   static Outcome folder_in_its_place() {
@@ -514,7 +541,8 @@ class WebdavBackend : public Backend {
 
   // From here on a part of the content may come to lie in the object's place.
   Outcome note_place(Ticket &ticket, const Upload &upload, Uploaded *uploaded) const {
-    if (client_.is_folder(ticket, upload.path)) return folder_in_its_place();
+    const Outcome looked = look_for_folder(ticket, upload.path);
+    if (!looked.ok()) return looked;
     DavPlace place(client_, upload.path, upload.source);
     const Outcome noted = place.note(ticket);
     if (noted.ok()) uploaded->place.emplace(std::move(place));

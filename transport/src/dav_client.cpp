@@ -41,6 +41,15 @@ bool outcome_is_open(const HttpAnswer &answer) {
   return answer.status == 0 || outcome_of(answer, "").transient;
 }
 
+// Some find an object's name with a slash too odd to say that there is nothing.
+bool is_odd(const HttpAnswer &answer, const Outcome &problem) {
+  return answer.complete() && !problem.transient && answer.status != kHttpUnauthorized;
+}
+
+Outcome no_listing(const char *what) {
+  return no_store(std::string(what) + ": the server's answer is not a listing");
+}
+
 }  // namespace
 
 std::string stored_name(const std::string &name) {
@@ -148,15 +157,13 @@ Outcome DavClient::list(Ticket &ticket, const std::string &folder, DavListing *l
   if (is_absent(answer)) return no_such_object();
   if (!answer.good()) {
     const Outcome problem = dav_outcome(answer, "list");
-    // Some find an object's name with a slash too odd to say that there is nothing.
-    const bool odd = answer.complete() && !problem.transient && answer.status != kHttpUnauthorized;
-    if (odd && !folder.empty() && is_object(ticket, folder)) return no_such_object();
+    if (is_odd(answer, problem) && !folder.empty() && is_object(ticket, folder))
+      return no_such_object();
     return problem;
   }
   std::vector<DavEntry> temporary;
   bool is_folder = false;
-  if (!read_listing(answer, folder, listing, &temporary, &is_folder))
-    return no_store("list: the server's answer is not a listing");
+  if (!read_listing(answer, folder, listing, &temporary, &is_folder)) return no_listing("list");
   if (!is_folder) return no_such_object();
   const std::optional<int64_t> now = parse_http_date(answer.header("date"));
   for (const DavEntry &entry : temporary) {
@@ -179,12 +186,18 @@ HttpAnswer DavClient::make_collection(Ticket &ticket, const std::string &path) c
   return http_perform(ticket, request);
 }
 
-bool DavClient::is_folder(Ticket &ticket, const std::string &folder) const {
-  DavListing listing;
-  std::vector<DavEntry> temporary;
-  bool is_folder = false;
-  return read_listing(propfind(ticket, folder, "0"), folder, &listing, &temporary, &is_folder) &&
-         is_folder;
+Outcome DavClient::find_folder(Ticket &ticket, const std::string &folder, bool *found) const {
+  *found = false;
+  const HttpAnswer answer = propfind(ticket, folder, "0");
+  if (has_status(answer, kHttpMultiStatus)) {
+    DavListing listing;
+    std::vector<DavEntry> temporary;
+    return read_listing(answer, folder, &listing, &temporary, found)
+               ? success()
+               : no_listing("look for a folder");
+  }
+  const Outcome problem = dav_outcome(answer, "look for a folder");
+  return is_absent(answer) || is_odd(answer, problem) ? success() : problem;
 }
 
 // Also when it is below one.

@@ -82,8 +82,12 @@ class DavClient {
   /** Make the folder that the store is, and those that it lies in where they are missing. */
   HttpAnswer make_top(Ticket &ticket) const;
 
-  /** Is there a folder of that name? Also false when that is not known. */
-  bool is_folder(Ticket &ticket, const std::string &folder) const;
+  /**
+   * Is there a folder of that name?
+   * @param found is false when there is none, and when the server finds the question too odd to say
+   * @return a failure when that is not known, transient where it is worth another attempt
+   */
+  Outcome find_folder(Ticket &ticket, const std::string &folder, bool *found) const;
 
   /**
    * Lock a folder with everything in it.
