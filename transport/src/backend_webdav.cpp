@@ -309,13 +309,18 @@ class WebdavBackend : public Backend {
     if (is_absent(answer) || has_status(answer, kHttpConflict)) {
       const Outcome looked = look_for_folder(ticket, upload.path);
       if (!looked.ok()) return looked;
-      // The folder was deleted, and what had been sent with it; not again and again.
-      forget("");
-      result.transient = !uploaded->was_lost;
-      uploaded->was_lost = true;
-      uploaded->give_up();
+      return start_over(std::move(result), uploaded);
     }
     return result;
+  }
+
+  // The folder was deleted, and what had been sent with it; not again and again.
+  Outcome start_over(Outcome result, Uploaded *uploaded) {
+    forget("");
+    result.transient = !uploaded->was_lost;
+    uploaded->was_lost = true;
+    if (uploaded->complete) uploaded->give_up();
+    return of_upload(result);
   }
 
   // To most servers a folder in the object's place is a thing that may be replaced with everything
@@ -394,16 +399,17 @@ class WebdavBackend : public Backend {
 
   // The comparison and the move happen while nobody else may change the folder.
   Outcome move_locked(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
-    return while_locked(ticket, parent_of(upload.path), [&](const HeldLock &lock) {
+    return while_locked(ticket, parent_of(upload.path), uploaded, [&](const HeldLock &lock) {
       return move_if_unchanged(ticket, upload, uploaded, lock);
     });
   }
 
-  Outcome while_locked(Ticket &ticket, const std::string &folder,
+  Outcome while_locked(Ticket &ticket, const std::string &folder, Uploaded *uploaded,
                        const std::function<Outcome(const HeldLock &lock)> &step) {
     HeldLock lock;
     lock.until = http_now() + kLockDuration;
     Outcome result = client_.lock(ticket, folder, &lock.token);
+    if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) return start_over(result, uploaded);
     if (!result.ok()) {
       forget("");
       if (result.transient) look_at_lock(ticket, folder);
@@ -471,7 +477,7 @@ class WebdavBackend : public Backend {
     const std::string folder = parent_of(upload.path);
     const Outcome result = ensure_folder(ticket, folder, uploaded);
     if (!result.ok()) return result;
-    return while_locked(ticket, folder, [&](const HeldLock &lock) {
+    return while_locked(ticket, folder, uploaded, [&](const HeldLock &lock) {
       return replace_if_unchanged(ticket, upload, uploaded, lock);
     });
   }

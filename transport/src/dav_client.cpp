@@ -219,7 +219,8 @@ Outcome DavClient::lock(Ticket &ticket, const std::string &folder, std::string *
   if (is_unsupported(answer)) return success();
   const bool done = answer.status / kStatusClass == kHttpOk / kStatusClass;
   *token = done ? answer.header("lock-token") : "";
-  const Outcome result = done && !token->empty() ? success() : dav_outcome(answer, "lock");
+  Outcome result = done && !token->empty() ? success() : dav_outcome(answer, "lock");
+  if (has_status(answer, kHttpConflict)) result.code = BACKUP_TRANS_ERROR_NO_SUCH_OBJECT;
   // An answer that was lost, or an error on its way, does not tell that there is no lock now, and
   // ours would keep us out like everybody else.
   const bool unclear = result.transient || ticket.cancelled();
@@ -237,7 +238,7 @@ Outcome DavClient::lock(Ticket &ticket, const std::string &folder, std::string *
   http_perform(ticket, removal);
   unlock(folder, *token);
   token->clear();
-  return again("lock: the folder was deleted meanwhile");
+  return failure(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT, "lock: the folder was deleted meanwhile");
 }
 
 void DavClient::unlock(const std::string &folder, const std::string &token) const {

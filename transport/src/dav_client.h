@@ -92,6 +92,7 @@ class DavClient {
   /**
    * Lock a folder with everything in it.
    * @param token receives the lock's name; stays empty on a server without locks
+   * @return #BACKUP_TRANS_ERROR_NO_SUCH_OBJECT when there is no such folder
    */
   Outcome lock(Ticket &ticket, const std::string &folder, std::string *token) const;
   /** Also after a cancellation: others would wait until the lock ends by itself. */

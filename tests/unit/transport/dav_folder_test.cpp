@@ -2,6 +2,7 @@
 #include "dav_test.h"
 
 using namespace harness;
+using front::Response;
 using front::Rule;
 
 namespace {
@@ -111,5 +112,56 @@ TEST_F(UnknownFolder, IsNotAnsweredByAnythingElse) {
   ASSERT_TRUE(cloud.settle());
   EXPECT_EQ(answer->code, BACKUP_TRANS_ERROR_SERVER);
 }
+
+// A folder that another device prunes once the object was sent to it, before it can be locked.
+class PrunedFolder : public DavTest, public ::testing::WithParamInterface<int> {
+ protected:
+  // The look at what was sent.
+  Rule prune_at(int nth) {
+    Rule rule = after("HEAD", nth, [this](Response *) { model.drop("/f"); });
+    rule.target = "/f/";
+    return rule;
+  }
+  // What the server says of a lock on what is not there.
+  static Rule lock_answer(int nth) {
+    Rule rule = refusal("LOCK", "/f/", GetParam());
+    rule.first = rule.last = nth;
+    if (GetParam() == 201) rule.fault.answer.headers["Lock-Token"] = "<made>";
+    return rule;
+  }
+};
+
+TEST_P(PrunedFolder, IsMadeAgain) {
+  model.put("/f/p", "x");
+  ASSERT_EQ(cloud.get(kObject, BACKUP_TRANS_OPTION_BASIS), "<12>");
+  server.set_rules({prune_at(1), lock_answer(1)});
+  EXPECT_EQ(cloud.put(kObject, "new"), 0);
+  EXPECT_EQ(clock.pauses().size(), 1U);
+  EXPECT_EQ(model.content(), (Content{{kObject, "new"}}));
+  EXPECT_EQ(model.locks(), 0U);
+}
+
+TEST_P(PrunedFolder, IsMadeAgainOnce) {
+  ASSERT_EQ(cloud.get(kObject, BACKUP_TRANS_OPTION_BASIS), "<12>");
+  Rule always = lock_answer(1);
+  always.last = front::kForEver;
+  server.set_rules({always});
+  EXPECT_EQ(cloud.put(kObject, "new"), BACKUP_TRANS_ERROR_SERVER);
+  EXPECT_EQ(requests("PUT", "/f/"), 2);
+}
+
+TEST_P(PrunedFolder, OfAServerThatCannotMoveIsMadeAgain) {
+  model.refuse("MOVE", 501);
+  ASSERT_EQ(cloud.put("/g", "x"), 0);
+  ASSERT_EQ(cloud.get(kObject, BACKUP_TRANS_OPTION_BASIS), "<12>");
+  Rule prune = after("MKCOL", 1, [this](Response *) { model.drop("/f"); });
+  prune.target = "/f/";
+  server.set_rules({prune, lock_answer(1)});
+  EXPECT_EQ(cloud.put(kObject, "new"), 0);
+  EXPECT_EQ(clock.pauses().size(), 1U);
+  EXPECT_EQ(model.content(), (Content{{"/g", "x"}, {kObject, "new"}}));
+}
+
+INSTANTIATE_TEST_SUITE_P(Answers, PrunedFolder, ::testing::Values(404, 409, 201));
 
 }  // namespace

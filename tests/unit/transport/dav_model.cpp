@@ -76,6 +76,11 @@ void DavModel::put(const std::string &path, const std::string &content) {
   nodes_[path] = {false, content};
 }
 
+void DavModel::drop(const std::string &path) {
+  const std::lock_guard<std::mutex> guard(mutex_);
+  remove(path);
+}
+
 std::size_t DavModel::locks() const {
   const std::lock_guard<std::mutex> guard(mutex_);
   return locks_.size();

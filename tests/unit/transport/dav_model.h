@@ -30,6 +30,8 @@ class DavModel : public front::Service {
   std::map<std::string, std::string> content(const std::string &folder = "") const;
   /** With the collections that it lies in. */
   void put(const std::string &path, const std::string &content);
+  /** An object or a collection, with everything in it. */
+  void drop(const std::string &path);
   std::size_t locks() const;
 
  private:
