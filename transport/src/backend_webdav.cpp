@@ -687,7 +687,7 @@ class WebdavBackend : public Backend {
   bool is_empty(Ticket &ticket, const std::string &folder) const {
     DavListing listing;
     return client_.list(ticket, folder, &listing).ok() && listing.children.empty() &&
-           !listing.has_temporary;
+           !listing.has_others;
   }
 
   bool prune_one(Ticket &ticket, const std::string &folder) {

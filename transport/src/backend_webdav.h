@@ -32,10 +32,11 @@ struct DavEntry {
 /**
  * The resources of a multi-status document, in its order.
  * @param host the server's name; absolute references to others are left out
+ * @param left_out receives whether the document tells of more than @p entries
  * @return false when it is none, or holds a document type
  */
 bool parse_multistatus(const std::string &xml, const std::string &host,
-                       std::vector<DavEntry> *entries);
+                       std::vector<DavEntry> *entries, bool *left_out);
 
 /** The token of the lock that has that owner, in angle brackets; "" when there is none. */
 std::string parse_lock_token(const std::string &xml, const std::string &owner);

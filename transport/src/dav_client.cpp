@@ -130,8 +130,11 @@ bool DavClient::read_listing(const HttpAnswer &answer, const std::string &folder
                              DavListing *listing, std::vector<DavEntry> *temporary,
                              bool *is_folder) const {
   std::vector<DavEntry> all;
-  if (!has_status(answer, kHttpMultiStatus) || !parse_multistatus(answer.body, url_.host, &all))
+  bool left_out = false;
+  if (!has_status(answer, kHttpMultiStatus) ||
+      !parse_multistatus(answer.body, url_.host, &all, &left_out))
     return false;
+  listing->has_others = left_out;
   const std::string own = url_.path + stored_path(folder);
   for (DavEntry &entry : all) {
     if (entry.path == own || (own.empty() && entry.path == "/")) {
@@ -140,13 +143,14 @@ bool DavClient::read_listing(const HttpAnswer &answer, const std::string &folder
     }
     if (entry.path.compare(0, own.size() + 1, own + "/") != 0) continue;
     const std::string stored = entry.path.substr(own.size() + 1);
-    if (stored.find('/') != std::string::npos) continue;
     const std::string name = name_of_stored(stored);
     entry.path = folder + "/" + name;
     if (is_temporary_name(name)) {
       temporary->push_back(std::move(entry));
-    } else if (is_object_path(entry.path.c_str())) {
+    } else if (stored.find('/') == std::string::npos && is_object_path(entry.path.c_str())) {
       listing->children.push_back(std::move(entry));
+    } else {
+      listing->has_others = true;
     }
   }
   return true;
@@ -168,7 +172,7 @@ Outcome DavClient::list(Ticket &ticket, const std::string &folder, DavListing *l
   const std::optional<int64_t> now = parse_http_date(answer.header("date"));
   for (const DavEntry &entry : temporary) {
     const bool swept = is_leftover(entry, now) && send(ticket, "DELETE", entry.path).good();
-    listing->has_temporary = listing->has_temporary || !swept;
+    listing->has_others = listing->has_others || !swept;
   }
   return success();
 }

@@ -59,7 +59,8 @@ Outcome dav_outcome(const HttpAnswer &answer, const char *what);
 /** What lies in a folder. */
 struct DavListing {
   std::vector<DavEntry> children; /**< with their paths in the store */
-  bool has_temporary = false;     /**< something that is not an object yet is being sent */
+  /** Something else lies there: being sent, or under a name that no object of this store has. */
+  bool has_others = false;
 };
 
 class DavClient {

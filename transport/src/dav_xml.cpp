@@ -89,17 +89,18 @@ void read_properties(const xmlNode *response, bool slash, DavEntry *entry) {
   entry->size = entry->is_collection ? 0 : size;
 }
 
-void read_response(const xmlNode *node, const std::string &host, std::vector<DavEntry> *entries) {
-  if (!is_element(node, "response")) return;
+// False for one that cannot be told of.
+bool read_response(const xmlNode *node, const std::string &host, std::vector<DavEntry> *entries) {
   const xmlNode *status = child_named(node, "status");
   const xmlNode *href = child_named(node, "href");
-  if (href == nullptr || (status != nullptr && !is_good(status))) return;
+  if (href == nullptr || (status != nullptr && !is_good(status))) return false;
   const std::string reference = text_of(href);
   DavEntry entry;
   entry.path = path_of_href(reference, host);
-  if (entry.path.empty()) return;
+  if (entry.path.empty()) return false;
   read_properties(node, reference.back() == '/', &entry);
   entries->push_back(std::move(entry));
+  return true;
 }
 
 std::string find_token(const xmlNode *node, const std::string &owner) {
@@ -146,11 +147,14 @@ std::string href_in(const xmlNode *parent, const char *name) {
 }  // namespace
 
 bool parse_multistatus(const std::string &xml, const std::string &host,
-                       std::vector<DavEntry> *entries) {
+                       std::vector<DavEntry> *entries, bool *left_out) {
   const std::size_t before = entries->size();
+  *left_out = false;
   const bool whole = read_xml(
       xml, [](const xmlNode *root) { return is_element(root, "multistatus"); },
-      [&](const xmlNode *node) { read_response(node, host, entries); });
+      [&](const xmlNode *node) {
+        if (is_element(node, "response") && !read_response(node, host, entries)) *left_out = true;
+      });
   if (!whole) entries->resize(before);
   return whole;
 }

@@ -162,6 +162,51 @@ TEST_P(PrunedFolder, OfAServerThatCannotMoveIsMadeAgain) {
   EXPECT_EQ(model.content(), (Content{{"/g", "x"}, {kObject, "new"}}));
 }
 
+// The parent of a folder that is deleted.
+class Parent : public DavTest {
+ protected:
+  void expect_kept_with(const std::string &folder, const std::string &name) {
+    model.put(folder + name, "x");
+    expect_kept(folder, {{folder + name, "x"}});
+  }
+  void expect_kept(const std::string &folder, const Content &content) {
+    model.put(folder + "sub/o", "y");
+    EXPECT_EQ(cloud.drop(folder + "sub"), 0);
+    EXPECT_EQ(model.content(), content);
+    EXPECT_EQ(model.locks(), 0U);
+  }
+  // The server tells of something more in its listings.
+  void add_to_listings(const std::string &response) {
+    Rule more{"PROPFIND", "/f/"};
+    more.fault.spoil = front::Spoil::edit;
+    more.fault.edit = [response](Response *answer) {
+      const std::size_t end = answer->body.rfind("</multistatus>");
+      if (end != std::string::npos) answer->body.insert(end, response);
+    };
+    server.set_rules({more});
+  }
+};
+
+TEST_F(Parent, GoesWhenItIsEmpty) { expect_kept("/f/", {}); }
+
+TEST_F(Parent, StaysForANameThatIsNoText) { expect_kept_with("/f/", "\xff\xfe"); }
+
+TEST_F(Parent, StaysForAPathThatIsTooLong) {
+  const std::string part = "/" + std::string(250, 'x');
+  expect_kept_with(part + part + part + "/", "too-long-a-name");
+}
+
+TEST_F(Parent, StaysForANameWithASlash) {
+  add_to_listings("<response><href>/dav/f/a%2Fb</href></response>");
+  expect_kept("/f/", {{"/f/", ""}});
+}
+
+TEST_F(Parent, StaysForWhatCannotBeLookedAt) {
+  add_to_listings(
+      "<response><href>/dav/f/a</href><status>HTTP/1.1 403 Forbidden</status></response>");
+  expect_kept("/f/", {{"/f/", ""}});
+}
+
 INSTANTIATE_TEST_SUITE_P(Answers, PrunedFolder, ::testing::Values(404, 409, 201));
 
 }  // namespace

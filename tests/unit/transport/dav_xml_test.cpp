@@ -18,7 +18,8 @@ std::string text_of(const DavEntry &entry) {
 
 std::vector<std::string> parsed(const std::string &xml, const std::string &host = kHost) {
   std::vector<DavEntry> entries;
-  if (!parse_multistatus(xml, host, &entries)) {
+  bool left_out = false;
+  if (!parse_multistatus(xml, host, &entries, &left_out)) {
     EXPECT_TRUE(entries.empty());
     return {"refused"};
   }
@@ -132,6 +133,19 @@ TEST(DavXml, ResourcesWithAnErrorOfTheirOwnAreLeftOut) {
                             "<D:response><D:href>/there</D:href>"
                             "<D:status>HTTP/1.1 200 OK</D:status></D:response>")),
             (Texts{"/there object 0"}));
+}
+
+TEST(DavXml, ThatSomethingIsLeftOutIsTold) {
+  const std::string forbidden =
+      "<D:response><D:href>/f/a</D:href><D:status>HTTP/1.1 403 Forbidden</D:status></D:response>";
+  for (const std::string &xml :
+       {document(forbidden), object("/f/%00"), object("/f/%zz"), object("//f"), object("f/a"),
+        object("http://other.example.org/f/a"), document("<D:response/>")}) {
+    std::vector<DavEntry> entries;
+    bool left_out = false;
+    EXPECT_TRUE(parse_multistatus(xml, kHost, &entries, &left_out));
+    EXPECT_EQ(left_out, entries.empty()) << xml;
+  }
 }
 
 TEST(DavXml, CollectionsHaveNoLength) {
@@ -272,7 +286,10 @@ TEST(DavXml, LargeListingsAreRead) {
 TEST(DavXml, NameMayBeAsLongAsTheXmlLibraryTakesATextToBe) {
   constexpr std::size_t kBytes = 9U << 20;
   std::vector<DavEntry> entries;
-  ASSERT_TRUE(parse_multistatus(object("/" + std::string(kBytes, 'x')), kHost, &entries));
+  bool left_out = true;
+  ASSERT_TRUE(
+      parse_multistatus(object("/" + std::string(kBytes, 'x')), kHost, &entries, &left_out));
+  EXPECT_FALSE(left_out);
   ASSERT_EQ(entries.size(), 1U);
   EXPECT_EQ(entries[0].path.size(), kBytes + 1);
   EXPECT_EQ(href_alone("/" + std::string(15U << 20, 'x')), Texts{"refused"});
