@@ -43,6 +43,8 @@ constexpr int kLookMs = 1000;  // how soon to look at what the kernel holds
 constexpr std::size_t kThreadStackBytes = 1024 * 1024;
 constexpr long kUploadBufferBytes = 64 * 1024;
 constexpr long kNoContinueMs = 1;
+constexpr char kPlainScheme[] = "http:";
+constexpr char kNoProxy[] = "";
 constexpr std::chrono::seconds kExitPatience{2};
 constexpr std::chrono::seconds kLongestRetryAfter{3600};
 constexpr guint kDecimal = 10;
@@ -481,6 +483,9 @@ class Engine {
     set(exchange, CURLOPT_PRIVATE, &exchange);
     set(exchange, CURLOPT_URL, request.url.c_str());
     set(exchange, CURLOPT_PROTOCOLS_STR, "http,https");
+    // It is for this machine itself only, and would show a proxy the password.
+    if (g_str_has_prefix(request.url.c_str(), kPlainScheme))
+      set(exchange, CURLOPT_PROXY, static_cast<const char *>(kNoProxy));
     set(exchange, CURLOPT_FOLLOWLOCATION, 0L);
     set(exchange, CURLOPT_PATH_AS_IS, 1L);
     set(exchange, CURLOPT_NOSIGNAL, 1L);
