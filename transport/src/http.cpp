@@ -28,6 +28,7 @@
 #include "checksum.h"
 #include "http_date.h"
 #include "symbols.h"
+#include "upload_queue.h"
 
 namespace transport {
 namespace {
@@ -124,9 +125,9 @@ struct Exchange {
   CURL *easy = nullptr;
   curl_slist *headers = nullptr;
   uint64_t sent = 0;
-  int64_t received = 0;       // bytes of headers and body
-  int64_t moved = 0;          // bytes sent and received when it was last looked at
-  std::optional<int> queued;  // bytes that the kernel held when nothing else had moved
+  int64_t received = 0;  // bytes of headers and body
+  int64_t moved = 0;     // bytes sent and received when it was last looked at
+  UploadQueue queue;
   Clock::time_point moved_at;
   Clock::time_point began_at;
   bool local_failure = false;
@@ -422,11 +423,9 @@ class Engine {
     if (sent + exchange.received != exchange.moved) {
       exchange.moved = sent + exchange.received;
       exchange.moved_at = now;
-      exchange.queued.reset();
-    } else if (exchange.request->has_body) {
-      const int queued = queued_of(exchange);
-      if (exchange.queued && *exchange.queued != queued) exchange.moved_at = now;
-      exchange.queued = queued;
+      exchange.queue.restart();
+    } else if (exchange.request->has_body && exchange.queue.look(queued_of(exchange))) {
+      exchange.moved_at = now;
     }
   }
 
@@ -436,7 +435,8 @@ class Engine {
     const std::chrono::seconds limit(exchange.request->seconds);
     if (limit.count() > 0) end = std::min(end, exchange.began_at + limit);
     *patience = std::min(*patience, milliseconds_until(end, now));
-    if (exchange.request->has_body && !exchange.queued) *patience = std::min(*patience, kLookMs);
+    if (exchange.request->has_body && !exchange.queue.is_known())
+      *patience = std::min(*patience, kLookMs);
     return now >= end;
   }
 
