@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <functional>
+#include <memory>
 #include <string>
 
 #include "local_file.h"
@@ -59,9 +60,10 @@ Outcome local_problem() {
  * that commits must not keep the later ones from being cancelled.
  */
 Outcome step(Ticket &ticket, const std::function<Outcome(Attempt &attempt)> &run) {
-  Ticket own;
-  ticket.set_waker([&own] { own.cancel(); });
-  Attempt attempt{own, 1, {}};
+  // A canceller may still call the waker when the step is over.
+  const auto own = std::make_shared<Ticket>();
+  ticket.set_waker([own] { own->cancel(); });
+  Attempt attempt{*own, 1, {}};
   const Outcome outcome = ticket.cancelled() ? cancelled() : run(attempt);
   ticket.set_waker(nullptr);
   return outcome;

@@ -58,7 +58,9 @@ class Ticket {
 
   /**
    * Have @p waker called by a cancellation, on the canceller's thread; an empty
-   * function ends that. Not called for a cancellation that came before.
+   * function ends that. Not called for a cancellation that came before. A
+   * cancellation that is under way may still call it after the end, so it must
+   * own what it uses.
    */
   void set_waker(std::function<void()> waker) {
     const std::lock_guard<std::mutex> lock(mutex_);

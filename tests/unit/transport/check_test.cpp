@@ -2,7 +2,10 @@
 
 #include <gmock/gmock.h>
 
+#include <functional>
+#include <future>
 #include <map>
+#include <thread>
 #include <utility>
 
 #include "harness.h"
@@ -16,8 +19,9 @@ namespace {
 /** A store in memory whose steps can be made to fail. */
 class StepStore : public Backend {
  public:
-  Outcome list(Attempt &, const std::string &, int, int, ListPage *) override {
+  Outcome list(Attempt &attempt, const std::string &, int, int, ListPage *) override {
     steps.emplace_back("list");
+    if (on_list) on_list(attempt);
     return outcomes["list"];
   }
   Outcome upload(Attempt &attempt, const Upload &upload, ObjectInfo *) override {
@@ -50,6 +54,7 @@ class StepStore : public Backend {
   std::string object;
   std::string given_back = "this can be deleted\n";
   Ticket *cancel_in_upload = nullptr;
+  std::function<void(Attempt &attempt)> on_list;
 };
 
 using Steps = std::vector<std::string>;
@@ -116,6 +121,61 @@ TEST_F(CheckTest, ACancellationReachesTheStepThatRunsAndStillTidiesUp) {
   store.cancel_in_upload = &ticket;
   EXPECT_EQ(check().code, BACKUP_TRANS_ERROR_CANCELLED);
   EXPECT_EQ(store.steps, (Steps{"list", "upload", "remove"}));
+}
+
+/** Something that happens once. Any thread. */
+class Event {
+ public:
+  void happen() { promise_.set_value(); }
+  bool wait() const { return happened_.wait_for(kPatience) == std::future_status::ready; }
+
+ private:
+  static constexpr std::chrono::seconds kPatience{30};
+
+  std::promise<void> promise_;
+  std::shared_future<void> happened_{promise_.get_future()};
+};
+
+struct SlowCopy {
+  Event begun;
+  Event may_end;
+  bool original_lives = false;
+};
+
+/** A waker that takes its time when a canceller copies it. */
+class SlowlyCopiedWaker {
+ public:
+  explicit SlowlyCopiedWaker(SlowCopy *copy) : copy_(copy) {}
+  SlowlyCopiedWaker(const SlowlyCopiedWaker &other) : copy_(other.copy_) {
+    const std::weak_ptr<int> original = other.life_;
+    copy_->begun.happen();
+    EXPECT_TRUE(copy_->may_end.wait());
+    copy_->original_lives = !original.expired();
+  }
+  SlowlyCopiedWaker(SlowlyCopiedWaker &&) = default;
+  SlowlyCopiedWaker &operator=(const SlowlyCopiedWaker &) = delete;
+  SlowlyCopiedWaker &operator=(SlowlyCopiedWaker &&) = delete;
+  ~SlowlyCopiedWaker() = default;
+  void operator()() const {}
+
+ private:
+  SlowCopy *copy_;
+  std::shared_ptr<int> life_ = std::make_shared<int>();
+};
+
+TEST_F(CheckTest, ACancellationMayOutliveTheStepThatItEnds) {
+  SlowCopy copy;
+  std::thread canceller;
+  store.outcomes["list"] = failure(BACKUP_TRANS_ERROR_NETWORK, "lost");
+  store.on_list = [&](Attempt &attempt) {
+    attempt.ticket.set_waker(SlowlyCopiedWaker(&copy));
+    canceller = std::thread([&] { EXPECT_TRUE(ticket.cancel()); });
+    EXPECT_TRUE(copy.begun.wait());
+  };
+  EXPECT_EQ(check().message, "lost");
+  copy.may_end.happen();
+  canceller.join();
+  EXPECT_TRUE(copy.original_lives);
 }
 
 TEST(CauseTest, TellsWhatToLookAt) {
