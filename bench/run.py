@@ -157,7 +157,7 @@ SECTIONS = {
     "others": lambda bin_dir, work, short, checks:
         others.others(bin_dir, work, checks, 1 if short else 7),
     "cloud": lambda bin_dir, work, short, checks:
-        cloud.cloud(bin_dir, work, checks, 1 if short else 3),
+        cloud.cloud(bin_dir, work, checks, 1 if short else 7),
 }
 
 
