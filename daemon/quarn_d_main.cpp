@@ -52,6 +52,7 @@ void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(backup_request_outstanding);
   set_restore_disable(disable_restore);
+  set_boot_recovery(recover_interrupted_restores);
   set_bus_acquired_hook(quarnd_status_export);
   quarnd_progress_init();
 }

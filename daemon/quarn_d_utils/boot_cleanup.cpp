@@ -10,6 +10,8 @@ namespace {
 constexpr char kSharedDataDir[] = "/shared/data/";
 constexpr const char *kArchiveSuffixes[] = {"_upload.zip", "_download.zip"};
 
+void (*boot_recovery)() = nullptr;
+
 timespec file_clock_now() {
   timespec now{};
   clock_gettime(CLOCK_REALTIME_COARSE, &now);
@@ -78,4 +80,7 @@ void boot_cleanup_backup_items() {
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_manager_foreach_package_info() failed %d", ret);
   }
+  if (boot_recovery != nullptr) boot_recovery();
 }
+
+void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }

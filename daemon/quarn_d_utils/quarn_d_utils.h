@@ -237,6 +237,8 @@ void set_pending_request_probe(bool (*probe)());
 void boot_cleanup_backup_items();
 /** One package of that sweep. */
 bool boot_foreach_package_info_callback(package_info_h info, void *user_data);
+/** What else an earlier process may have left is mended after the sweep. Set once at start. */
+void set_boot_recovery(void (*recover)());
 
 /* ---- icon.cpp: main thread ------------------------------------------------- */
 

@@ -117,6 +117,17 @@ TEST_F(BootCleanupTest, ASecondSweepDoesNothing) {
   EXPECT_TRUE(captured_texts().empty());
 }
 
+TEST_F(BootCleanupTest, RestoresThatWereCutOffAreMendedOnceAlsoAfterAFailedWalk) {
+  static int mended;
+  mended = 0;
+  EXPECT_CALL(platform, package_manager_foreach_package_info).WillOnce(Return(kServiceError));
+  set_boot_recovery([] { ++mended; });
+  boot_cleanup_backup_items();
+  boot_cleanup_backup_items();
+  set_boot_recovery(nullptr);
+  EXPECT_EQ(mended, 1);
+}
+
 TEST_F(BootCleanupTest, AFailedWalkIsLoggedAndNotRepeated) {
   EXPECT_CALL(platform, package_manager_foreach_package_info).WillOnce(Return(kServiceError));
   boot_cleanup_backup_items();

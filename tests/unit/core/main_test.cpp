@@ -40,6 +40,7 @@ std::vector<int> woken;
 int (*wifi_probe)() = nullptr;
 bool (*pending_probe)() = nullptr;
 int (*restore_disable)() = nullptr;
+void (*boot_recovery)() = nullptr;
 void (*bus_acquired_hook)(GDBusConnection *) = nullptr;
 
 void step(const char *name) {
@@ -106,6 +107,8 @@ bool backup_request_outstanding() { return true; }
 void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
+void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
+void recover_interrupted_restores() { step("recovery"); }
 int quarnd_restore_enable(int on, int client, const char *, const char *, void *record) {
   EXPECT_EQ(on, 0);
   EXPECT_EQ(client, 0);
@@ -131,6 +134,7 @@ class Main : public ::testing::Test {
     wifi_probe = nullptr;
     pending_probe = nullptr;
     restore_disable = nullptr;
+    boot_recovery = nullptr;
     for (const int signo : signals_) signal(signo, SIG_DFL);
     restart();
   }
@@ -257,12 +261,14 @@ TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {
   ASSERT_NE(wifi_probe, nullptr);
   ASSERT_NE(pending_probe, nullptr);
   ASSERT_NE(restore_disable, nullptr);
+  ASSERT_NE(boot_recovery, nullptr);
   EXPECT_EQ(bus_acquired_hook, quarnd_status_export);
   EXPECT_EQ(wifi_probe(), 1);
   EXPECT_TRUE(pending_probe());
   restart();
   EXPECT_EQ(restore_disable(), 0);
-  EXPECT_EQ(steps, Texts{"restore_off"});
+  boot_recovery();
+  EXPECT_EQ(steps, (Texts{"restore_off", "recovery"}));
 }
 
 }  // namespace
