@@ -89,7 +89,12 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
     return restore_outcome::rolled_back;
   }
   restore_step("restored");
-  discard_snapshot(pkgid, root);
+  if (!discard_snapshot(pkgid, root)) {
+    LOGE("fail to restore for (%s)", pkgid);
+    rollback_to_initial_app_data(pkgid, root);
+    ctx->result = QUARN_REFUSED;
+    return restore_outcome::rolled_back;
+  }
   LOGI("restore successfully completed for (%s)", pkgid);
   return restore_outcome::restored;
 }

@@ -99,8 +99,11 @@ int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid,
 int rollback_to_initial_app_data(const char *pkgid, const char *root);
 /** Copy what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
 int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
-/** Remove the snapshot, its table first: from then on the present data counts. */
-void discard_snapshot(const char *pkgid, const char *root);
+/**
+ * Remove the snapshot, its table first: from then on the present data counts.
+ * @return false when that data cannot be brought onto the disk; the snapshot is kept then
+ */
+bool discard_snapshot(const char *pkgid, const char *root);
 /**
  * Undo what a daemon that died in a restore of the package left: a complete
  * snapshot is put back, an incomplete one removed. Takes package_data_mutex.

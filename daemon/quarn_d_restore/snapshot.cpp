@@ -237,16 +237,20 @@ void put_attributes_back(json_object *table, const char *root) {
 
 }  // namespace
 
-void discard_snapshot(const char *pkgid, const char *root) {
+bool discard_snapshot(const char *pkgid, const char *root) {
   const restore_files files(pkgid, root);
   // Without its table a half-deleted snapshot is never taken for a whole one.
   if (file_exist(files.snapshot_table.c_str())) {
-    flush(files.dirs[1]);
+    if (!flush(files.dirs[1])) {
+      LOGE("data of (%s) is not on the disk, so its snapshot is kept", pkgid);
+      return false;
+    }
     delete_file(files.snapshot_table.c_str());
     flush_directory(files.snapshot_table);
   }
   restore_step("snapshot-released");
   clear_directory(files.snapshot.c_str(), true);
+  return true;
 }
 
 int temp_backup_initial_app_data(const char *pkgid, const char *root) {

@@ -10,6 +10,26 @@
 
 using ::testing::Return;
 
+extern "C" {
+int __real_syncfs(int fd);
+int __wrap_syncfs(int fd);
+}
+
+namespace {
+
+/** Calls of syncfs() that still succeed, and those after them that fail. */
+int flushes_until_failure = -1;
+int failing_flushes = 0;
+
+}  // namespace
+
+int __wrap_syncfs(int fd) {
+  if (flushes_until_failure < 0 || flushes_until_failure-- > 0) return __real_syncfs(fd);
+  if (--failing_flushes > 0) flushes_until_failure = 0;
+  errno = EIO;
+  return -1;
+}
+
 namespace {
 
 class FailureTest : public RestoreTest {
@@ -134,6 +154,23 @@ TEST_F(FailureTest, UnpackOntoAFullDisk) {
   });
   EXPECT_EQ(result, 31);
   expect_error("fail to restore app info for (org.example.notes) err : 31");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, DiskThatDoesNotTakeWhatWasRestored) {
+  flushes_until_failure = 1;  // the snapshot's own
+  failing_flushes = 1;
+  EXPECT_EQ(restore(), 36);
+  expect_error("data of (org.example.notes) is not on the disk, so its snapshot is kept");
+  expect_error("fail to restore for (org.example.notes)");
+  expect_untouched();
+}
+
+TEST_F(FailureTest, DiskThatTakesNothingAnyMoreLeavesTheSnapshotToTheNextDaemon) {
+  flushes_until_failure = 1;
+  failing_flushes = 2;
+  EXPECT_EQ(restore(), 36);
+  EXPECT_TRUE(recover_interrupted_restore(kPkg, root.c_str()));
   expect_untouched();
 }
 
