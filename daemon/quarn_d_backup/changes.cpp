@@ -138,7 +138,8 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (skipped != QUARN_OK) return skipped;
 
   int error = QUARN_OK;
-  make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), archive_path.c_str(), &error);
+  make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), archive_path.c_str(), &error,
+                kMaxBackupSize);
   if (error != QUARN_OK) {
     LOGE("fail to make zip data for %s", ctx->cur_pkg_id.c_str());
     delete_staged_file(archive_path);

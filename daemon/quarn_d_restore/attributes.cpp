@@ -112,6 +112,11 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
       QUARN_OK) {
     return 0;
   }
+  if (S_ISREG(status.st_mode) && status.st_nlink > 1) {
+    // what a restore unpacks has one name; by another the application would get any file
+    LOGE("refused : %s is a link to a file elsewhere", path);
+    return 0;
+  }
   // The set-id bits wait for the owner: the file must never run as the daemon's
   // user, and a change of owner clears them anyway.
   const mode_t mode = static_cast<mode_t>(stored_mode) & kPermissionBits;

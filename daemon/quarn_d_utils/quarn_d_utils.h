@@ -118,6 +118,11 @@ std::uint64_t get_dir_backup_size(const char *dir, const char *pkg_id, const cha
 
 /* ---- zip_writer.cpp, zip_reader.cpp -------------------------------------- */
 
+/** Most bytes and entries that an archive may unpack to: the largest backup and its table. */
+inline constexpr std::uint64_t kMaxTableSize = 32U << 20;
+inline constexpr std::uint64_t kMaxUnpackedSize = kMaxBackupSize + kMaxTableSize;
+inline constexpr std::uint64_t kMaxArchiveEntries = 100000;
+
 /**
  * Held while a package's data is packed, unpacked or put back, so that an
  * archive never mixes two states. Any thread; held for the length of one
@@ -127,10 +132,12 @@ extern std::mutex package_data_mutex;
 
 /**
  * Pack one package's data. Takes package_data_mutex. The rules of the calling
- * thread apply.
+ * thread apply. Files and links beyond kMaxArchiveEntries, and those with which
+ * the files would hold more than @p max_size bytes, fail.
  * @param[out] error set on failure only: 31 archive not opened, 36 any entry failed
  */
-void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error);
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                   std::uint64_t max_size = UINT64_MAX);
 /** Walk one directory into the archive. @return true when anything was recorded */
 bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
                            file_info_table_h *table, int *error);
@@ -148,11 +155,6 @@ struct unzip_report {
   /** True when the destination holds everything that the archive had. */
   bool complete() const { return refused == 0 && failed == 0; }
 };
-
-/** Most bytes and entries that an archive may unpack to: the largest backup and its table. */
-inline constexpr std::uint64_t kMaxTableSize = 32U << 20;
-inline constexpr std::uint64_t kMaxUnpackedSize = kMaxBackupSize + kMaxTableSize;
-inline constexpr std::uint64_t kMaxArchiveEntries = 100000;
 
 /**
  * Unpack an archive below @p destination: files are created new, mode 0600,

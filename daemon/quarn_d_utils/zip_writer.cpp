@@ -31,11 +31,21 @@ constexpr uLong kMadeByDefault = 0;
  */
 class ArchiveFile {
  public:
-  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) {}
+  ArchiveFile(UniqueFd fd, std::uint64_t max_size) : fd_(std::move(fd)), room_(max_size) {}
   ArchiveFile(const ArchiveFile &) = delete;
   ArchiveFile &operator=(const ArchiveFile &) = delete;
 
   bool is_open() const { return static_cast<bool>(fd_); }
+
+  /** Room for one more file or link of @p size: no restore takes what is beyond. */
+  bool admit(std::uint64_t size) {
+    constexpr std::uint64_t kTableItself = 1;
+    full_ = full_ || ++entries_ + kTableItself > kMaxArchiveEntries || size > room_;
+    if (full_) return false;
+    room_ -= size;
+    return true;
+  }
+  bool is_full() const { return full_; }
 
   /** Let the next header fit into memory. @return false when the file cannot be written */
   bool make_room() { return !failed_ && (filled_ + kHeaderRoom <= kBuffer || flush()); }
@@ -131,6 +141,9 @@ class ArchiveFile {
   ZPOS64_T start_ = 0;     // bytes before it are in the file
   ZPOS64_T position_ = 0;  // where the next write goes
   bool failed_ = false;
+  std::uint64_t room_;  // for the files' bytes
+  std::uint64_t entries_ = 0;
+  bool full_ = false;
 };
 
 /** The archive that this thread is writing: its file, and the codec whose memory entries share. */
@@ -162,7 +175,8 @@ class FileSource : public ByteSource {
     return static_cast<long>(filled);
   }
 
-  bool changed() const { return grew_ || total_ != expected_; }
+  bool grew() const { return grew_; }
+  bool shrank() const { return total_ != expected_; }
 
  private:
   int fd_;
@@ -226,9 +240,12 @@ bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
     LOGE("zipWriteInFileInZip() failed, zip_err = [%d]", sink.error());
   } else if (!added) {
     LOGE("cannot read %s", path);
-  } else if (source.changed()) {
+  } else if (source.shrank()) {
     LOGE("file changed while it was archived : %s", path);
     added = false;
+  } else if (source.grew()) {
+    // what is written to all the time, a log say, would never be backed up otherwise
+    LOGI("file grew while it was archived : %s", path);
   }
   const int closed = zipCloseFileInZipRaw64(zip, totals.plain, totals.crc);
   if (closed != ZIP_OK && added) {
@@ -260,9 +277,24 @@ bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, in
   return walk_dir(walk, dir.get(), path, depth);
 }
 
+/** Whether the archive takes one more file or link. */
+bool admit(Walk *walk, const std::string &path, off_t size) {
+  if (archive_file == nullptr || archive_file->admit(static_cast<std::uint64_t>(size))) return true;
+  LOGE("archive is full at %s", path.c_str());
+  *walk->error = QUARN_REFUSED;
+  return false;
+}
+
 /** Record a file and pack it, when it could be opened. */
 void add_regular(Walk *walk, const std::string &path, const UniqueFd &fd,
                  const struct stat &status) {
+  if (status.st_nlink > 1 && status.st_uid != kAppUid) {
+    // by such a link an application would get a copy of what it may not read
+    LOGE("refused : %s is a link to another owner's file", path.c_str());
+    *walk->error = QUARN_REFUSED;
+    return;
+  }
+  if (!admit(walk, path, status.st_size)) return;
   add_to_file_info_table(walk->table, walk->root.c_str(), path.c_str(), status, walk->error,
                          fd.get());
   if (fd) {
@@ -308,7 +340,7 @@ bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, 
     return true;
   }
   if (S_ISLNK(status.st_mode)) {
-    if (!is_backup_file(path->c_str())) return false;
+    if (!is_backup_file(path->c_str()) || !admit(walk, *path, 0)) return false;
     add_sym_info_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status,
                                     walk->error);
     return true;
@@ -322,6 +354,7 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
   bool noted = false;
   while (const dirent *entry = readdir(dir)) {
     if (is_dot_entry(entry->d_name)) continue;
+    if (archive_file != nullptr && archive_file->is_full()) break;
     const PathStep step(path, entry->d_name);
     if (walk->working.contain(*path) || *path == archive_path) continue;
     if (walk_entry(walk, dirfd(dir), *entry, path, depth)) noted = true;
@@ -353,7 +386,8 @@ struct ReleaseTable {
 
 }  // namespace
 
-void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error) {
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                   std::uint64_t max_size) {
   const std::lock_guard<std::mutex> lock(package_data_mutex);
   if (is_half_restored(pkg_id, root)) {
     LOGE("restore of (%s) was interrupted, so its data is not packed", pkg_id);
@@ -370,7 +404,7 @@ void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, i
     return;
   }
   UniqueFd fd = create_archive(zip_path);
-  ArchiveFile file(std::move(fd));
+  ArchiveFile file(std::move(fd), max_size);
   zlib_filefunc64_def functions = file.functions();
   zipFile zip =
       file.is_open() ? zipOpen2_64(zip_path, APPEND_STATUS_CREATE, nullptr, &functions) : nullptr;

@@ -191,6 +191,18 @@ TEST_F(AttributesTest, ALinkIsNeverFollowed) {
   EXPECT_EQ(label_of(outside_file), kFloorLabel);
 }
 
+TEST_F(AttributesTest, AFileWithAnotherNameElsewhereIsLeftAsItIs) {
+  const std::string secret = file("elsewhere", "root's");
+  ASSERT_EQ(chown(secret.c_str(), 0, 0), 0);
+  ASSERT_EQ(chmod(secret.c_str(), 0600), 0);
+  std::filesystem::create_directories(at("data"));
+  ASSERT_EQ(link(secret.c_str(), at("data/a").c_str()), 0);
+  EXPECT_EQ(restore("data/a", R"({"0": 438, "1": 0, "2": 0, "3": "App::Label"})"), 0);
+  expect_error("refused : " + at("data/a") + " is a link to a file elsewhere");
+  EXPECT_EQ(mode_of(secret), 0600);
+  EXPECT_EQ(status_of(secret).st_uid, 0U);
+}
+
 TEST_F(AttributesTest, AnOwnerThatCannotBeSetIsAFailureAfterTheMode) {
   const std::string path = file("data/a", "x", 0640);
   ASSERT_EQ(chown(path.c_str(), 0, 0), 0);
