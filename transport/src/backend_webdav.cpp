@@ -7,6 +7,7 @@
 #include <atomic>
 #include <cerrno>
 #include <chrono>
+#include <deque>
 #include <functional>
 #include <mutex>
 #include <set>
@@ -27,6 +28,8 @@ constexpr std::size_t kMaxKnownFolders = 4096;
 constexpr int kRefusalsOfAFullStore = 3;
 // So often does a condition fail that should hold until it counts as a conflict.
 constexpr int kFailuresOfAConflict = 3;
+// So many temporary objects that could not be deleted are remembered.
+constexpr std::size_t kMaxLeftovers = 64;
 // What an upload in place replaces is kept up to this size, to be put back.
 constexpr uint64_t kMaxKeptBytes = 1024 * 1024;
 // An upload cannot end with what is said of objects that are asked for.
@@ -55,7 +58,7 @@ struct Uploaded {
     move_asked = false;
   }
 
-  std::string temporary;
+  std::string temporary;    // that may lie there
   std::string made_folder;  // to go again when nothing comes to lie in it
   bool answered = false;    // the server has come to an end with it
   bool complete = false;
@@ -121,6 +124,7 @@ class WebdavBackend : public Backend {
     }
     const auto uploaded = std::any_cast<std::shared_ptr<Uploaded>>(attempt.memory);
     const bool may_move = moving_ != Moving::refused;
+    if (!uploaded->complete) sweep(attempt.ticket);
     Outcome result;
     if (may_move) result = put_and_move(attempt.ticket, upload, uploaded.get());
     if (!may_move || uploaded->is_immovable)
@@ -198,8 +202,8 @@ class WebdavBackend : public Backend {
   Outcome put_and_move(Ticket &ticket, const Upload &upload, Uploaded *uploaded) {
     if (!uploaded->complete) {
       uploaded->give_up();
-      uploaded->temporary = parent_of(upload.path) + "/" + make_temporary_name();
-      const Outcome sent = send(ticket, upload, uploaded, {uploaded->temporary, "", ""});
+      const std::string temporary = parent_of(upload.path) + "/" + make_temporary_name();
+      const Outcome sent = send(ticket, upload, uploaded, {temporary, "", ""});
       if (!sent.ok()) return sent;
       uploaded->complete = true;
     }
@@ -257,6 +261,7 @@ class WebdavBackend : public Backend {
     for (const std::string &header : {destination.lock, destination.condition}) {
       if (!header.empty()) request.headers.push_back(header);
     }
+    if (destination.path != upload.path) uploaded->temporary = destination.path;
     uploaded->answered = false;
     HttpAnswer answer = http_perform(ticket, request);
     uploaded->answered = answer.complete();
@@ -482,7 +487,7 @@ class WebdavBackend : public Backend {
     });
   }
 
-  void drop_temporary(Uploaded *uploaded) const {
+  void drop_temporary(Uploaded *uploaded) {
     Ticket own;
     if (!uploaded->temporary.empty()) delete_temporary(own, *uploaded);
     uploaded->temporary.clear();
@@ -713,10 +718,15 @@ class WebdavBackend : public Backend {
     if (!left.made_folder.empty()) prune(own, left.made_folder);
   }
 
-  // Returns whether the server can be spoken to.
-  bool delete_temporary(Ticket &ticket, const Uploaded &left) const {
-    HttpRequest request = client_.request_for("DELETE", left.temporary);
+  HttpRequest deletion_of(const std::string &temporary) const {
+    HttpRequest request = client_.request_for("DELETE", temporary);
     request.seconds = kTidyUpSeconds;
+    return request;
+  }
+
+  // Returns whether the server can be spoken to.
+  bool delete_temporary(Ticket &ticket, const Uploaded &left) {
+    const HttpRequest request = deletion_of(left.temporary);
     HttpAnswer answer = http_perform(ticket, request);
     for (const std::chrono::milliseconds pause : kTidyUpPauses) {
       // What was cut off may come to lie there after it was looked for.
@@ -727,14 +737,45 @@ class WebdavBackend : public Backend {
     }
     if (answer.complete() && left.answered && !left.complete)
       client_.delete_pieces(ticket, parent_of(left.temporary), left.temporary);
+    if (!answer.complete()) remember_leftover(left.temporary);
     return answer.complete();
+  }
+
+  // Those of a connection that was just lost come first: what is tried after that leaves no more.
+  void remember_leftover(const std::string &temporary) {
+    const std::lock_guard<std::mutex> guard(mutex_);
+    if (leftovers_.size() < kMaxLeftovers) leftovers_.push_back(temporary);
+  }
+
+  // "" when there is none.
+  std::string next_leftover() {
+    const std::lock_guard<std::mutex> guard(mutex_);
+    if (leftovers_.empty()) return "";
+    std::string temporary = std::move(leftovers_.front());
+    leftovers_.pop_front();
+    return temporary;
+  }
+
+  // Delete what could not be deleted when it should have been, once the server answers again.
+  void sweep(Ticket &ticket) {
+    std::set<std::string> folders;
+    for (std::string left = next_leftover(); !left.empty(); left = next_leftover()) {
+      const HttpAnswer answer = http_perform(ticket, deletion_of(left));
+      if (!answer.complete() || dav_outcome(answer, "delete").transient) {
+        remember_leftover(left);
+        return;
+      }
+      folders.insert(parent_of(left));
+    }
+    for (const std::string &folder : folders) prune(ticket, folder);
   }
 
   const DavClient client_;
   std::atomic<Moving> moving_{Moving::unknown};
   std::mutex mutex_;
-  std::set<std::string> known_;  // folders that were seen or made
-  std::string seen_lock_;        // the last one that was in the way
+  std::set<std::string> known_;        // folders that were seen or made
+  std::deque<std::string> leftovers_;  // temporary objects that may still lie there
+  std::string seen_lock_;              // the last one that was in the way
   std::chrono::steady_clock::time_point lock_seen_at_;
 };
 

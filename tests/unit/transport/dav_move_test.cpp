@@ -89,4 +89,103 @@ TEST_F(LostMove, ThatAnotherDeviceFollowedIsAConflict) {
   EXPECT_EQ(model.content(), (Content{{kObject, kForeign}}));
 }
 
+using Paths = std::vector<std::string>;
+
+// Uploads that are cut off, and a server that then says nothing any more.
+class LostConnection : public DavTest {
+ protected:
+  LostConnection() { model.put("/f/p", "x"); }
+  void lose() {
+    Rule cut{"PUT", "quarn-part-"};
+    cut.takes_effect = true;
+    cut.fault.spoil = Spoil::reset_request;
+    cut.fault.at = 60000;
+    Rule silence{"DELETE", ""};
+    silence.fault.spoil = Spoil::reset_response;
+    server.set_rules({cut, silence});
+  }
+  std::size_t leftovers() const {
+    std::size_t found = 0;
+    for (const auto &[path, ignored] : model.content())
+      if (path.find("quarn-part-") != std::string::npos) ++found;
+    return found;
+  }
+  Paths paths() const {
+    Paths all;
+    for (const auto &[path, ignored] : model.content()) all.push_back(path);
+    return all;
+  }
+
+  const std::string content = bytes(100000);
+};
+
+TEST_F(LostConnection, LeavesNothingOnceAnUploadIsDone) {
+  lose();
+  EXPECT_EQ(cloud.put(kObject, content), BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_GT(leftovers(), 1U);
+  server.set_rules({});
+  EXPECT_EQ(cloud.put("/g", "new"), 0);
+  EXPECT_EQ(paths(), (Paths{"/f/p", "/g"}));
+}
+
+TEST_F(LostConnection, LeavesNothingWhenItComesBackInTime) {
+  lose();
+  clock.set_on_pause([this] {
+    if (leftovers() > 2) server.set_rules({});
+  });
+  EXPECT_EQ(cloud.put(kObject, content), 0);
+  EXPECT_EQ(paths(), (Paths{kObject, "/f/p"}));
+}
+
+TEST_F(LostConnection, LeavesNoFolderThatWasMadeForIt) {
+  model.drop("/f");
+  model.put("/g", "x");
+  lose();
+  EXPECT_EQ(cloud.put(kObject, content), BACKUP_TRANS_ERROR_NETWORK);
+  server.set_rules({});
+  EXPECT_EQ(cloud.put("/g", "new"), 0);
+  EXPECT_EQ(paths(), Paths{"/g"});
+}
+
+TEST_F(LostConnection, IsRememberedUntilTheServerAnswers) {
+  lose();
+  EXPECT_EQ(cloud.put(kObject, content), BACKUP_TRANS_ERROR_NETWORK);
+  const std::size_t left = leftovers();
+  server.set_rules({refusal("DELETE", "/f/", 503)});
+  EXPECT_EQ(cloud.put("/g", "new"), 0);
+  EXPECT_EQ(leftovers(), left);
+  EXPECT_EQ(cloud.put("/g", "newer"), 0);
+  EXPECT_EQ(leftovers(), 0U);
+}
+
+TEST_F(LostConnection, IsNotAskedAboutWhatItRefusesToDelete) {
+  lose();
+  EXPECT_EQ(cloud.put(kObject, content), BACKUP_TRANS_ERROR_NETWORK);
+  server.set_rules({refusal("DELETE", "/f/", 403, front::kForEver)});
+  EXPECT_EQ(cloud.put("/g", "new"), 0);
+  const int asked = server.count(0);
+  EXPECT_GT(asked, 1);
+  EXPECT_EQ(cloud.put("/g", "newer"), 0);
+  EXPECT_EQ(server.count(0), asked);
+}
+
+TEST_F(LostConnection, LeavesNoMoreThanCanBeRemembered) {
+  constexpr std::size_t kRemembered = 64;
+  lose();
+  while (leftovers() <= kRemembered)
+    ASSERT_EQ(cloud.put(kObject, content), BACKUP_TRANS_ERROR_NETWORK);
+  const std::size_t left = leftovers();
+  server.set_rules({});
+  EXPECT_EQ(cloud.put("/g", "new"), 0);
+  EXPECT_EQ(leftovers(), left - kRemembered);
+}
+
+TEST_F(LostConnection, ThatSentNothingIsNotTidiedUpAfter) {
+  Rule silence{"MKCOL", ""};
+  silence.fault.spoil = Spoil::reset_response;
+  server.set_rules({silence});
+  EXPECT_EQ(cloud.put("/new/o", content), BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(requests("DELETE", ""), 0);
+}
+
 }  // namespace
