@@ -13,7 +13,7 @@ import threading
 import time
 
 import trees
-from harness import CEILING_KB, Table, median, unshared_pss
+from harness import CEILING_KB, Table, median, peak_pss
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 FIXTURES = os.path.join(HERE, "../tests/integration/cloud")
@@ -139,12 +139,10 @@ def rclone_environment(options):
                 **{"RCLONE_CONFIG_BENCH_" + name: value for name, value in options.items()})
 
 
-def peak_pss(pid, done, result):
-    while not done.wait(0.005):
-        try:
-            result.append(unshared_pss(pid))
-        except OSError:
-            return
+def watch(pid, done, result):
+    # The peak goes with the process, so it is read as long as that is there.
+    while not done.wait(0.003):
+        result.append(peak_pss(pid))
 
 
 def timed(command, environment):
@@ -152,7 +150,7 @@ def timed(command, environment):
     begin = time.monotonic()
     process = subprocess.Popen(command, env=environment)
     done, samples = threading.Event(), [0]
-    watcher = threading.Thread(target=peak_pss, args=(process.pid, done, samples))
+    watcher = threading.Thread(target=watch, args=(process.pid, done, samples))
     watcher.start()
     _, status, usage = os.wait4(process.pid, 0)
     wall = time.monotonic() - begin
@@ -161,6 +159,8 @@ def timed(command, environment):
     process.returncode = os.waitstatus_to_exitcode(status)
     if process.returncode != 0:
         raise SystemExit("%s ended with %d" % (command[0], process.returncode))
+    if max(samples) == 0:
+        raise SystemExit("%s was not seen: its memory is not measured" % command[0])
     return wall, usage.ru_utime + usage.ru_stime, max(samples)
 
 

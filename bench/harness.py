@@ -63,7 +63,10 @@ class Checks:
             self.failed.append("%s is %.3f, allowed %.3f" % (what, value, allowed))
 
     def hard(self, what, value, limit):
-        if value > limit:
+        """`value` is None where it could not be measured, which is not met either."""
+        if value is None:
+            self.failed.append("%s was not measured, allowed %s" % (what, limit))
+        elif value > limit:
             self.failed.append("%s is %s, allowed %s" % (what, value, limit))
 
 
@@ -105,18 +108,31 @@ class Device:
         self.run("stop")
 
 
-def unshared_pss(pid):
+def peak_pss(pid):
     """
-    PSS of a process in kB if it shared no page with another one, a library's neither: that is its
-    resident set. On a device where nothing else has the same libraries loaded it is what counts.
+    The peak PSS of a process in kB if it shared no page with another one, a library's neither:
+    that is its resident set. On a device where nothing else has the same libraries loaded it is
+    what counts. The kernel keeps the peak, so a short one is not missed. 0 where there is none.
     """
-    with open("/proc/%d/smaps_rollup" % pid) as file:
-        # A process that has ended but was not waited for has none.
-        return next((int(line.split()[1]) for line in file if line.startswith("Rss:")), 0)
+    try:
+        with open("/proc/%d/status" % pid) as file:
+            # A process that has ended but was not waited for has none.
+            return next((int(line.split()[1]) for line in file if line.startswith("VmHWM:")), 0)
+    except OSError:
+        return 0
+
+
+def forget_peak(pid):
+    """From now on the peak is counted anew."""
+    try:
+        with open("/proc/%d/clear_refs" % pid, "w") as file:
+            file.write("5")  # of proc(5): the peak becomes what is resident now
+    except (FileNotFoundError, ProcessLookupError):
+        pass
 
 
 class Watch:
-    """Samples the daemon's memory, as unshared_pss() counts it, while a block runs."""
+    """The daemon's peak memory while a block runs, as peak_pss() counts it."""
 
     def __init__(self, device):
         self.device = device
@@ -125,17 +141,23 @@ class Watch:
         self.thread = threading.Thread(target=self._sample)
 
     def _sample(self):
+        # Again and again, as the daemon may end; and once more when the block is over.
         pid = None
-        while not self.done.wait(0.003):
+        over = False
+        while not over:
+            over = self.done.wait(0.003)
             pid = pid or self.device.daemon_pid()
             if pid is None:
                 continue
-            try:
-                self.peak = max(self.peak, unshared_pss(pid))
-            except OSError:
+            peak = peak_pss(pid)
+            self.peak = max(self.peak, peak)
+            if peak == 0:
                 pid = None
 
     def __enter__(self):
+        pid = self.device.daemon_pid()
+        if pid is not None:
+            forget_peak(pid)
         self.thread.start()
         self.start = time.monotonic()
         return self
@@ -144,3 +166,5 @@ class Watch:
         self.wall = time.monotonic() - self.start
         self.done.set()
         self.thread.join()
+        if self.peak == 0 and exc[0] is None:
+            raise SystemExit("the daemon was not seen: its memory is not measured")
