@@ -5,10 +5,12 @@ import random
 import shutil
 
 import trees
-from harness import CEILING_KB, Device, Table, Watch
+from harness import CEILING_KB, Device, Table, Watch, wall_of
 
 #: Time a unit may grow by this from one size to the next, from the second size on.
 FLAT = 1.2
+#: How often the list is read; what else the machine does only adds to the fastest.
+READS = 10
 PACKAGE = "org.example.bench"
 
 
@@ -54,8 +56,8 @@ def files(bin_dir, work, checks, counts):
 def listed(bin_dir, work, checks, counts, packages=200):
     """A backup of one package, and reading the list, with more and more other devices in it."""
     table = Table("devices", "entries", "list kB", "backup s", "list s", "us an entry",
-                  "peak PSS kB")
-    rows = []
+                  "list: us an entry", "peak PSS kB")
+    rows, reads = [], []
     source = os.path.join(work, "listed")
     trees.make_package(source, PACKAGE, "1.0.0",
                        lambda root: trees._write(os.path.join(root, "data/file"), b"text"))
@@ -78,15 +80,18 @@ def listed(bin_dir, work, checks, counts, packages=200):
             with Watch(device) as backup:
                 device.client("backup")
             with Watch(device) as read:
-                device.client("list")
+                fastest = min(wall_of(lambda: device.client("list")) for _ in range(READS))
         finally:
             device.stop()
         shutil.rmtree(device.path)
         entries = count * packages
         peak = max(backup.peak, read.peak)
-        rows.append((entries, (backup.wall + read.wall) / entries))
-        table.add(count, entries, size, "%.2f" % backup.wall, "%.2f" % read.wall,
-                  "%.1f" % (1e6 * rows[-1][1]), peak)
+        rows.append((entries, (backup.wall + fastest) / entries))
+        # By itself too: most of a backup takes the same time at any size, which hides growth.
+        reads.append((entries, fastest / entries))
+        table.add(count, entries, size, "%.2f" % backup.wall, "%.3f" % fastest,
+                  *("%.1f" % (1e6 * each[-1][1]) for each in (rows, reads)), peak)
         checks.hard("peak PSS with %d devices in the list" % count, peak, CEILING_KB)
     table.show("An application list of many devices with %d packages each" % packages)
     flat(checks, "time an entry of the list", rows)
+    flat(checks, "time an entry of the list, reading alone", reads)

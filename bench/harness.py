@@ -29,6 +29,13 @@ def measure(command, cwd=None):
     return usage.ru_utime + usage.ru_stime, wall
 
 
+def wall_of(run):
+    """Wall seconds of a call."""
+    start = time.monotonic()
+    run()
+    return time.monotonic() - start
+
+
 def median(values):
     return statistics.median(values)
 
