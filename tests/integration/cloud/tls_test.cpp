@@ -172,9 +172,9 @@ const bool trusting_added = add_role("trusting", trusting_role);
 TEST_F(TlsTest, AuthorityOfTheConfigurationReplacesThoseOfTheSystem) {
   start_good();
   const TempDir system;
-  write_file(system / "ca-certificates.crt", read_file(authority.file()));
   write_file(system / "authority.pem", read_file(authority.file()));
   ASSERT_EQ(std::system(("openssl rehash " + system.path()).c_str()), 0);
+  write_file(system / "ca-certificates.crt", read_file(authority.file()));
   const TempDir other_dir;
   // By another name: the directory is not looked into for one that the file has.
   const Authority other(other_dir.path(), "Another");
