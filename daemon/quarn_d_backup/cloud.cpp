@@ -28,9 +28,7 @@ struct app_list_transfer {
 struct app_data_upload {
   BackupContextPtr ctx;
   std::string pkg_id;
-  std::string version;
   std::string local_path;
-  std::string remote_path;
   std::uint64_t size = 0;
 };
 
@@ -402,9 +400,8 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   auto record = std::make_unique<app_data_upload>();
   record->ctx = share_backup_context(ctx);
   record->pkg_id = pkg_id;
-  record->version = version;
   record->local_path = staged_archive_path(root_path, pkg_id);
-  record->remote_path =
+  const std::string remote_path =
       version_folder(ctx->serial_number, pkg_id, version) + "/" + pkg_id + kArchiveSuffix;
   record->size = staged_file_size(record->local_path);
   if (ctx->single_package) {
@@ -415,14 +412,12 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   ++ctx->upload_remain;
   // all three become names in the cloud
   const bool nameable = is_safe_path_component(ctx->serial_number) &&
-                        is_safe_path_component(record->pkg_id) &&
-                        is_safe_path_component(record->version);
-  const int ret =
-      !nameable ? BACKUP_TRANS_ERROR_ARGUMENT
-                : backup_trans_upload_file_ors_async(
-                      cloud_handler(), record->local_path.c_str(), record->remote_path.c_str(),
-                      __upload_app_data_resp_cb, _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE,
-                      record.get(), nullptr);
+                        is_safe_path_component(record->pkg_id) && is_safe_path_component(version);
+  const int ret = !nameable ? BACKUP_TRANS_ERROR_ARGUMENT
+                            : backup_trans_upload_file_ors_async(
+                                  cloud_handler(), record->local_path.c_str(), remote_path.c_str(),
+                                  __upload_app_data_resp_cb, _get_current_timestamp(),
+                                  BACKUP_TRANS_OPTION_NONE, record.get(), nullptr);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
     static_cast<void>(record.release());
     return;

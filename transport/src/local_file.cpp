@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <linux/openat2.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 
 #include <array>
@@ -101,19 +102,21 @@ bool LocalSource::open(const std::string &path) {
   // A pipe would block the caller without O_NONBLOCK.
   fd_.reset(openat(folder.get(), name.c_str(),
                    O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-  if (!fd_ || fstat(fd_.get(), &status_) != 0) return false;
-  if (!S_ISREG(status_.st_mode)) {
+  struct stat status {};
+  if (!fd_ || fstat(fd_.get(), &status) != 0) return false;
+  if (!S_ISREG(status.st_mode)) {
     errno = EINVAL;
     return false;
   }
+  size_ = status.st_size;
+  changed_ = status.st_mtim;
   return true;
 }
 
 bool LocalSource::unchanged() const {
   struct stat now {};
-  return fstat(fd_.get(), &now) == 0 && now.st_size == status_.st_size &&
-         now.st_mtim.tv_sec == status_.st_mtim.tv_sec &&
-         now.st_mtim.tv_nsec == status_.st_mtim.tv_nsec;
+  return fstat(fd_.get(), &now) == 0 && now.st_size == size_ &&
+         now.st_mtim.tv_sec == changed_.tv_sec && now.st_mtim.tv_nsec == changed_.tv_nsec;
 }
 
 bool LocalTarget::open(const std::string &path) {

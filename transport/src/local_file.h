@@ -10,9 +10,10 @@
 #ifndef BACKUP_TRANSPORT_LOCAL_FILE_H
 #define BACKUP_TRANSPORT_LOCAL_FILE_H
 
-#include <sys/stat.h>
+#include <sys/types.h>
 
 #include <cstdint>
+#include <ctime>
 #include <memory>
 #include <string>
 
@@ -31,14 +32,15 @@ class LocalSource {
   bool open(const std::string &path);
 
   int fd() const { return fd_.get(); }
-  uint64_t size() const { return static_cast<uint64_t>(status_.st_size); }
+  uint64_t size() const { return static_cast<uint64_t>(size_); }
 
   /** Is the content the one that was there when it was opened? */
   bool unchanged() const;
 
  private:
   UniqueFd fd_;
-  struct stat status_ = {};
+  off_t size_ = 0;
+  timespec changed_ = {};
 };
 
 /** The file that a download becomes. One thread at a time. */

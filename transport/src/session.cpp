@@ -73,7 +73,7 @@ struct Request {
   Ticket ticket;
   // Guarded by the session's mutex.
   bool ended = false;
-  Result result;
+  std::unique_ptr<Result> result;  // once it has ended: thousands may wait
 };
 
 using RequestPtr = std::shared_ptr<Request>;
@@ -89,7 +89,7 @@ std::string description(const Outcome &outcome) {
 
 /** Does the end of a request tell of the store, and not of the device or its user? */
 bool tells_of_store(const Request &request) {
-  const backup_trans_error_code code = request.result.outcome.code;
+  const backup_trans_error_code code = request.result->outcome.code;
   return !request.ticket.cancelled() && code != BACKUP_TRANS_ERROR_CANCELLED &&
          code != BACKUP_TRANS_ERROR_LOCAL_FILE;
 }
@@ -100,7 +100,7 @@ bool was_served(const Outcome &outcome) {
 }
 
 void call_back(const Request &request) {
-  const Outcome &outcome = request.result.outcome;
+  const Outcome &outcome = request.result->outcome;
   switch (request.kind) {
     case Kind::download: {
       std::string message = outcome.message;
@@ -108,16 +108,16 @@ void call_back(const Request &request) {
       break;
     }
     case Kind::upload: {
-      const backup_trans_file_info_s info = public_info(request.result.info);
+      const backup_trans_file_info_s info = public_info(request.result->info);
       request.upload_cb(outcome.code, request.user_data, outcome.ok() ? &info : nullptr);
       break;
     }
     case Kind::list: {
       std::vector<backup_trans_file_info_s> children;
-      for (const ObjectInfo &child : request.result.page.children)
+      for (const ObjectInfo &child : request.result->page.children)
         children.push_back(public_info(child));
       const backup_trans_child_list_s list = {children.data(), static_cast<int>(children.size()),
-                                              request.result.page.more};
+                                              request.result->page.more};
       request.list_cb(outcome.code, request.user_data, outcome.ok() ? &list : nullptr);
       break;
     }
@@ -248,7 +248,7 @@ class Session {
     ended_.wait_for(lock, std::chrono::milliseconds(kCancelPatienceMs),
                     [&] { return request->ended; });
     if (!request->ended) end(request, Result{cancelled(), {}, {}});
-    return request->result.outcome.code;
+    return request->result->outcome.code;
   }
 
   void set_maker(BackendMaker maker) {
@@ -306,8 +306,8 @@ class Session {
   void end(const RequestPtr &request, Result result) {
     if (request->ended) return;
     request->ended = true;
-    request->result = std::move(result);
-    const Outcome &outcome = request->result.outcome;
+    request->result = std::make_unique<Result>(std::move(result));
+    const Outcome &outcome = request->result->outcome;
     if (tells_of_store(*request))
       last_cause_ = was_served(outcome) ? BACKUP_TRANS_CAUSE_NONE : cause_of(outcome);
     if (request->waited_for) {
