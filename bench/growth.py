@@ -5,6 +5,7 @@ import random
 import shutil
 
 import trees
+from archives import Disk
 from harness import CEILING_KB, Device, Table, Watch, wall_of
 
 #: Time a unit may grow by this from one size to the next, from the second size on.
@@ -20,34 +21,41 @@ def flat(checks, what, rows):
         checks.at_most("%s, %d against %d" % (what, large, small), after / before, FLAT)
 
 
+def backed_up_and_restored(bin_dir, place, count):
+    """What a backup of a package of `count` files took, and a restore of it over them."""
+    rng = random.Random(11)
+    source = os.path.join(place, "files-%d" % count)
+    trees.make_package(source, PACKAGE, "1.0.0", lambda root: [
+        trees._write(os.path.join(root, "data/%03d/%05d.txt" % (index // 100, index)),
+                     trees._text(rng, 1000)) for index in range(count)])
+    device = Device(bin_dir, os.path.join(place, "device-files-%d" % count))
+    try:
+        device.install(source)
+        device.client("activate")
+        with Watch(device) as backup:
+            device.client("app", "backup", PACKAGE)
+        with Watch(device) as restore:
+            device.client("app", "restore", PACKAGE)
+    finally:
+        device.stop()
+    shutil.rmtree(device.path)
+    shutil.rmtree(source)
+    return backup, restore
+
+
 def files(bin_dir, work, checks, counts):
     """One package of more and more files, backed up and restored."""
     table = Table("files", "backup s", "ms a file", "restore s", "ms a file", "peak PSS kB")
     packed, restored = [], []
-    for count in counts:
-        rng = random.Random(11)
-        source = os.path.join(work, "files-%d" % count)
-        trees.make_package(source, PACKAGE, "1.0.0", lambda root: [
-            trees._write(os.path.join(root, "data/%03d/%05d.txt" % (index // 100, index)),
-                         trees._text(rng, 1000)) for index in range(count)])
-        device = Device(bin_dir, os.path.join(work, "device-files-%d" % count))
-        try:
-            device.install(source)
-            device.client("activate")
-            with Watch(device) as backup:
-                device.client("app", "backup", PACKAGE)
-            with Watch(device) as restore:
-                device.client("app", "restore", PACKAGE)
-        finally:
-            device.stop()
-        shutil.rmtree(device.path)
-        shutil.rmtree(source)
-        peak = max(backup.peak, restore.peak)
-        packed.append((count, backup.wall / count))
-        restored.append((count, restore.wall / count))
-        table.add(count, "%.2f" % backup.wall, "%.3f" % (1000 * backup.wall / count),
-                  "%.2f" % restore.wall, "%.3f" % (1000 * restore.wall / count), peak)
-        checks.hard("peak PSS with %d files" % count, peak, CEILING_KB)
+    with Disk(os.path.join(work, "disk-files"), 2048) as disk:
+        for count in counts:
+            backup, restore = backed_up_and_restored(bin_dir, disk.path, count)
+            peak = max(backup.peak, restore.peak)
+            packed.append((count, backup.wall / count))
+            restored.append((count, restore.wall / count))
+            table.add(count, "%.2f" % backup.wall, "%.3f" % (1000 * backup.wall / count),
+                      "%.2f" % restore.wall, "%.3f" % (1000 * restore.wall / count), peak)
+            checks.hard("peak PSS with %d files" % count, peak, CEILING_KB)
     table.show("One package of many files (1 kB each)")
     flat(checks, "time a file, backup", packed)
     flat(checks, "time a file, restore", restored)
