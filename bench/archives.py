@@ -4,7 +4,7 @@ import shutil
 import subprocess
 
 import trees
-from harness import Table, measure, median
+from harness import Table, measure, median, touch_memory
 
 PACKAGE = "org.example.bench"
 ARCHIVE = "archive CPU / best of zip -1 and bsdtar"
@@ -176,6 +176,7 @@ def unpack_tree(tool, disk, kind, archive, runs, table, ratios):
             target = os.path.join(disk, "%s-%d-%s" % (kind, run, name))
             os.makedirs(target)
             kept.append(target)  # deleted when all is measured: deleting has consequences
+            touch_memory()
             return [target if part is None else part for part in command], None
         return prepare
 
@@ -201,6 +202,7 @@ def restore_tree(tool, disk, kind, root, archive, runs, table, ratios):
             target = os.path.join(disk, "restore-%s-%d-%s" % (kind, run, name))
             subprocess.run(["cp", "-a", root, target], check=True)
             subprocess.run(["sync", "-f", target], check=True)  # else a restore's own sync does it
+            touch_memory()
             return [target if part is None else part for part in command], None
         return prepare
 
