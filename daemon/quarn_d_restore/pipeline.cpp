@@ -82,14 +82,9 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
   }
   restore_step("unpacked");
   report_restore_step(ctx->pkgid, restore_stage::attributes, size);
-  if (!restore_app_info(pkgid, root)) {
-    LOGE("fail to restore for (%s)", pkgid);
-    rollback_to_initial_app_data(pkgid, root);
-    ctx->result = QUARN_REFUSED;
-    return restore_outcome::rolled_back;
-  }
-  restore_step("restored");
-  if (!discard_snapshot(pkgid, root)) {
+  const bool restored = restore_app_info(pkgid, root) != 0;
+  if (restored) restore_step("restored");
+  if (!restored || !discard_snapshot(pkgid, root)) {
     LOGE("fail to restore for (%s)", pkgid);
     rollback_to_initial_app_data(pkgid, root);
     ctx->result = QUARN_REFUSED;

@@ -159,6 +159,8 @@ class KilledRestore(CrashTest):
         self.device.install(make_source(self.path("other"), "org.example.other", "1.0.0",
                                         {"data/other": b"other"}))
         self.root = self.device.app_path(PACKAGE).rstrip("/")
+        self.snapshot = os.path.join(self.root, "shared/data/quarn_tmp_rst_dir")
+        self.snapshot_table = os.path.join(self.snapshot, "shared/data", PACKAGE + ".perm")
         self.device.quarnctl("backup")
         self.device.remove("org.example.other")
         self.saved = tree(self.root)
@@ -213,8 +215,7 @@ class KilledRestore(CrashTest):
 
     def moments(self):
         """Conditions that hold from some moment of a restore on."""
-        snapshot = os.path.join(self.root, "shared/data/quarn_tmp_rst_dir")
-        table = os.path.join(snapshot, "shared/data", PACKAGE + ".perm")
+        snapshot, table = self.snapshot, self.snapshot_table
         unpacked_table = os.path.join(self.root, "shared/data", PACKAGE + ".perm")
         yield lambda: os.path.exists(
             os.path.join(self.root, "shared/data", PACKAGE + "_download.zip"))
@@ -267,18 +268,16 @@ class KilledRestore(CrashTest):
     def kill_half_way(self):
         """Leave the package with files of the archive beside its own."""
         self.reset()
-        table = os.path.join(self.root, "shared/data/quarn_tmp_rst_dir/shared/data",
-                             PACKAGE + ".perm")
         client = self.ask("app", "restore", PACKAGE)
         self.assertTrue(self.kill_daemon_when(
-            lambda: os.path.exists(table) and self.count("data", content=b"saved") > 5, client))
+            lambda: (os.path.exists(self.snapshot_table)
+                     and self.count("data", content=b"saved") > 5), client))
         self.assertNotIn(tree(self.root), (self.present, self.restored))
 
     def test_whatever_starts_the_next_daemon_the_tree_is_the_old_one_again(self):
         self.kill_half_way()
         self.device.quarnctl("status")
-        snapshot = os.path.join(self.root, "shared/data/quarn_tmp_rst_dir")
-        wait_until(lambda: not os.path.lexists(snapshot), "the snapshot is gone")
+        wait_until(lambda: not os.path.lexists(self.snapshot), "the snapshot is gone")
         self.assertEqual(self.leftovers(), [])
         now = tree(self.root)
         self.assertTrue(now == self.present, self.difference(now))
