@@ -1,6 +1,8 @@
 #include "state/labels.h"
 
 #include <fcntl.h>
+#include <limits.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -11,6 +13,9 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+
+#include "state/packages.h"
+#include "state/state_file.h"
 
 namespace embedded {
 namespace {
@@ -111,6 +116,50 @@ Present attributes_present(const char *path, Links links, const Attribute &attri
   return {lists(names, size, attribute.kernel), lists(names, size, attribute.user)};
 }
 
+/** An attribute that nothing has: taking it away tells who may write its like. */
+constexpr char kProbe[] = "security.quarn.probe";
+
+/** The package below whose root a place lies, empty where it is none's. */
+std::string package_around(const std::string &place) {
+  const std::string apps = package_root("");
+  for (const std::string &top : {apps, current_device() + "/root" + apps}) {
+    if (place.compare(0, top.size(), top) != 0) continue;
+    const std::size_t end = place.find('/', top.size());
+    if (end != std::string::npos) return place.substr(top.size(), end - top.size());
+  }
+  return "";
+}
+
+/** Where an object lies, whichever way @p path leads to it, and what it is. */
+bool find_object(const char *path, Links links, std::string *place, struct stat *status) {
+  const int given = links == Links::kFollow ? descriptor_of(path) : -1;
+  const int fd = given >= 0
+                     ? given
+                     : open(path, O_PATH | O_CLOEXEC | (links == Links::kFollow ? 0 : O_NOFOLLOW));
+  if (fd < 0) return false;
+  char name[PATH_MAX];
+  const ssize_t length =
+      readlink((kOwnDescriptors + std::to_string(fd)).c_str(), name, sizeof name);
+  const bool found = length > 0 && fstat(fd, status) == 0;
+  if (given < 0) close(fd);
+  if (found) place->assign(name, static_cast<std::size_t>(length));
+  return found;
+}
+
+/** What an object without the attribute is labelled with: with labels, its maker's. */
+std::string label_without_attribute(const char *path, Links links) {
+  std::string place;
+  struct stat status {};
+  if (!find_object(path, links, &place, &status)) return kFloorLabel;
+  const std::string package = package_around(place);
+  if (!is_label(package)) return kFloorLabel;
+  if (S_ISREG(status.st_mode) || S_ISDIR(status.st_mode)) return package;
+  // Where labels are user attributes, links and special files cannot have one.
+  const int removed =
+      links == Links::kFollow ? removexattr(path, kProbe) : lremovexattr(path, kProbe);
+  return removed != 0 && errno == EPERM ? kFloorLabel : package;
+}
+
 bool has_no_attribute() { return errno == ENODATA || errno == ENOTSUP || errno == EPERM; }
 
 }  // namespace
@@ -138,7 +187,7 @@ int read_label(const char *path, Links links, LabelKind kind, std::string *label
     errno = ENODATA;
     return -1;
   }
-  *label = kFloorLabel;
+  *label = label_without_attribute(path, links);
   return 0;
 }
 

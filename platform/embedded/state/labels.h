@@ -5,7 +5,12 @@
  * The attribute is the kernel's own, "security.SMACK64". A process that may
  * not write it (a container without CAP_SYS_ADMIN) keeps labels in
  * "user.quarn.SMACK64" instead, which symbolic links and special files cannot
- * have. An object without either has the floor label. Any thread.
+ * have.
+ *
+ * What an application makes has neither. On a kernel that labels it would have
+ * its maker's label: below a package's root an object without the attribute
+ * has the package's, which is the package's id, elsewhere the floor label.
+ * What cannot have the attribute has the floor label everywhere. Any thread.
  */
 #ifndef QUARN_EMBEDDED_LABELS_H
 #define QUARN_EMBEDDED_LABELS_H
@@ -14,7 +19,7 @@
 
 namespace embedded {
 
-/** Label of what has none. */
+/** Label of what has none and is no application's. */
 inline constexpr char kFloorLabel[] = "_";
 /** Longest label. */
 inline constexpr std::string::size_type kMaxLabel = 255;

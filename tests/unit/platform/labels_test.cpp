@@ -1,6 +1,7 @@
 #include "state/labels.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -149,6 +150,89 @@ TEST_F(Labels, OfWhatIsNotThereAreAnError) {
   EXPECT_EQ(smack_lsetlabel(nullptr, "a", SMACK_LABEL_ACCESS), -1);
   EXPECT_EQ(smack_lsetlabel(file_.c_str(), nullptr, SMACK_LABEL_ACCESS), -1);
   EXPECT_EQ(errno, EINVAL);
+}
+
+/** What an application makes has no attribute; the device is the process's own. */
+class MadeByAnApplication : public Labels {
+ protected:
+  MadeByAnApplication() {
+    file_ = dir_.file("root/opt/usr/apps/org.example.notes/data/new/note", "");
+    link_ = dir_.link("root/opt/usr/apps/org.example.notes/data/link", "new/note");
+  }
+  std::string below(const char *path) const {
+    return dir_ / ("root/opt/usr/apps/" + std::string(path));
+  }
+};
+
+TEST_F(MadeByAnApplication, ItHasItsPackagesLabel) {
+  EXPECT_EQ(get(file_), "org.example.notes");
+  EXPECT_EQ(get(file_, true), "org.example.notes");
+  EXPECT_EQ(get(below("org.example.notes/data/new")), "org.example.notes");
+  EXPECT_EQ(get(below("org.example.notes/data")), "org.example.notes");
+  EXPECT_EQ(get(link_), "org.example.notes");
+  EXPECT_EQ(get(link_, true), privileged_ ? "org.example.notes" : "_");
+  const std::string fifo = below("org.example.notes/data/fifo");
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  EXPECT_EQ(get(fifo), privileged_ ? "org.example.notes" : "_");
+  EXPECT_EQ(attribute_of(file_, attribute()), "") << "reading writes nothing";
+  EXPECT_EQ(attribute_of(link_, attribute()), "");
+}
+
+TEST_F(MadeByAnApplication, ItHasNoLabelOfTheOtherKinds) {
+  char *label = nullptr;
+  for (const auto type : {SMACK_LABEL_EXEC, SMACK_LABEL_MMAP}) {
+    EXPECT_EQ(smack_getlabel(file_.c_str(), &label, type), -1);
+    EXPECT_EQ(errno, ENODATA);
+  }
+}
+
+TEST_F(MadeByAnApplication, TheWayToItDoesNotMatter) {
+  const std::string own = "/proc/self/fd/";
+  for (const int flags : {O_RDONLY, O_PATH}) {
+    const int fd = open(file_.c_str(), flags | O_CLOEXEC);
+    ASSERT_GE(fd, 0);
+    EXPECT_EQ(get(own + std::to_string(fd)), "org.example.notes");
+    close(fd);
+  }
+  const int folder = open(below("org.example.notes/data").c_str(), O_PATH | O_CLOEXEC);
+  ASSERT_GE(folder, 0);
+  const std::string relative = own + std::to_string(folder) + "/";
+  EXPECT_EQ(get(relative + "new/note"), "org.example.notes");
+  EXPECT_EQ(get(relative + "link", true), privileged_ ? "org.example.notes" : "_");
+  close(folder);
+  const std::string elsewhere = dir_.link("alias", file_);
+  EXPECT_EQ(get(elsewhere), "org.example.notes") << "what it is counts, not what leads to it";
+  EXPECT_EQ(get(elsewhere, true), "_");
+}
+
+TEST_F(MadeByAnApplication, WhatLiesElsewhereHasTheFloorLabel) {
+  const std::string outside = dir_.file("outside", "");
+  const std::string loose = dir_.file("root/opt/usr/apps/loose", "");
+  const std::string beside = dir_.file("root/opt/usr/appsx/org.example.notes/data/file", "");
+  const std::string out = dir_.link("root/opt/usr/apps/org.example.notes/data/out", outside);
+  for (const std::string &path : {outside, loose, beside, out, below("org.example.notes/../loose"),
+                                  below("org.example.notes")}) {
+    EXPECT_EQ(get(path), "_") << path;
+  }
+  const std::string odd = dir_.file("root/opt/usr/apps/no label/data/file", "");
+  EXPECT_EQ(get(odd), "_") << "an id that cannot be a label";
+  leave_device();
+  EXPECT_EQ(get(file_), "_") << "no package of this process's device";
+}
+
+TEST_F(MadeByAnApplication, ALabelThatItWasGivenCounts) {
+  EXPECT_EQ(smack_setlabel(file_.c_str(), "other", SMACK_LABEL_ACCESS), 0);
+  EXPECT_EQ(get(file_), "other");
+  EXPECT_EQ(smack_setlabel(file_.c_str(), "_", SMACK_LABEL_ACCESS), 0);
+  EXPECT_EQ(get(file_), "_");
+}
+
+TEST_F(MadeByAnApplication, ALinkHasTheFloorLabelWhereLabelsAreUserAttributes) {
+  const WithoutSysAdmin contained;
+  EXPECT_EQ(get(file_), "org.example.notes");
+  EXPECT_EQ(get(below("org.example.notes/data/new")), "org.example.notes");
+  EXPECT_EQ(get(link_, true), "_");
+  EXPECT_EQ(get(link_), "org.example.notes");
 }
 
 TEST_F(Labels, FailOnRequest) {
