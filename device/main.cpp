@@ -8,6 +8,7 @@
 #include <cstring>
 
 #include "device.h"
+#include "state/printable.h"
 
 namespace {
 
@@ -143,11 +144,12 @@ int main(int argc, char **argv) {
     if (failure.code == DEVICE_USAGE && failure.what()[0] == '\0') {
       std::fprintf(stderr, "quarn-device: usage: quarn-device %s\n", verb->synopsis);
     } else {
-      std::fprintf(stderr, "quarn-device: %s\n", failure.what());
+      // There may be a name in it that anybody has chosen.
+      std::fprintf(stderr, "quarn-device: %s\n", embedded::printable(failure.what()).c_str());
     }
     return failure.code;
   } catch (const std::exception &error) {
-    std::fprintf(stderr, "quarn-device: %s\n", error.what());
+    std::fprintf(stderr, "quarn-device: %s\n", embedded::printable(error.what()).c_str());
     return DEVICE_FAILED;
   }
 }

@@ -11,6 +11,7 @@
 
 #include "device.h"
 #include "state/labels.h"
+#include "state/printable.h"
 
 namespace {
 
@@ -226,8 +227,9 @@ int verb_list(const Arguments &arguments) {
       json_object_array_add(array.get(), package_json(package));
       continue;
     }
-    std::printf("%-32s %-10s %-4s%s%s%s\n", package.id.c_str(), package.version.c_str(),
-                package.type.c_str(), package.preload ? " preloaded" : "",
+    std::printf("%-32s %-10s %-4s%s%s%s\n", embedded::printable(package.id).c_str(),
+                embedded::printable(package.version).c_str(),
+                embedded::printable(package.type).c_str(), package.preload ? " preloaded" : "",
                 package.external ? " external" : "", package.hidden ? " hidden" : "");
   }
   if (json) {

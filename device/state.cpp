@@ -1,5 +1,7 @@
 #include <fcntl.h>
 #include <glib.h>
+#include <signal.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -14,6 +16,7 @@
 #include "device.h"
 #include "state/alarms.h"
 #include "state/facts.h"
+#include "state/printable.h"
 #include "state/state_file.h"
 #include "state/values.h"
 
@@ -88,6 +91,40 @@ std::string local_time(std::int64_t ms) {
   char text[40];
   std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S", &parts);
   return text;
+}
+
+/** A log may be older than the rule that nothing in it speaks to a terminal. */
+void print_log_line(const std::string &line) { std::cout << embedded::printable(line) << "\n"; }
+
+/** Print a log and what is added to it, until somebody ends this. */
+[[noreturn]] void follow_log(const std::string &path) {
+  int pipe[2];
+  if (pipe2(pipe, O_CLOEXEC) != 0) throw Failure("cannot make a pipe: " + reason());
+  const Fd out(pipe[0]);
+  const pid_t self = getpid();
+  const pid_t tail = fork();
+  if (tail == 0) {
+    prctl(PR_SET_PDEATHSIG, SIGTERM);
+    if (getppid() != self || dup2(pipe[1], STDOUT_FILENO) < 0) _exit(DEVICE_FAILED);
+    execlp("tail", "tail", "-n", "+1", "-F", path.c_str(), nullptr);
+    _exit(DEVICE_FAILED);
+  }
+  close(pipe[1]);
+  if (tail < 0) throw Failure("cannot run tail: " + reason());
+  std::string line;
+  char text[4096];
+  for (ssize_t length = 0; (length = TEMP_FAILURE_RETRY(read(out.fd, text, sizeof text))) > 0;) {
+    for (ssize_t i = 0; i < length; ++i) {
+      if (text[i] != '\n') {
+        line += text[i];
+        continue;
+      }
+      print_log_line(line);
+      line.clear();
+    }
+    if (!std::cout.flush()) break;
+  }
+  throw Failure("the log cannot be followed any longer");
 }
 
 }  // namespace
@@ -218,7 +255,8 @@ int verb_alarms(const Arguments &arguments) {
     return DEVICE_OK;
   }
   for (const embedded::Alarm &alarm : alarms) {
-    std::printf("%6d  %-10s %s\n", alarm.id, alarm.owner.c_str(), local_time(alarm.due_ms).c_str());
+    std::printf("%6d  %-10s %s\n", alarm.id, embedded::printable(alarm.owner).c_str(),
+                local_time(alarm.due_ms).c_str());
   }
   return DEVICE_OK;
 }
@@ -247,15 +285,12 @@ int verb_log(const Arguments &arguments) {
   const bool follow = arguments.size() == 2 && arguments[1] == "--follow";
   if (arguments.empty() || (arguments.size() != 1 && !follow)) wrong_use();
   const std::string path = open_device(arguments[0]) + "/log/quarnd.log";
-  if (follow) {
-    execlp("tail", "tail", "-n", "+1", "-F", path.c_str(), nullptr);
-    throw Failure("cannot run tail: " + reason());
-  }
+  if (follow) follow_log(path);
   std::ifstream file(path);
   if (!file) {
     if (errno == ENOENT) return DEVICE_OK;  // nothing was logged yet
     throw Failure("cannot read " + path + ": " + reason());
   }
-  if (file.peek() != std::ifstream::traits_type::eof()) std::cout << file.rdbuf();
+  for (std::string line; std::getline(file, line);) print_log_line(line);
   return DEVICE_OK;
 }

@@ -15,6 +15,7 @@
 #include <mutex>
 #include <string>
 
+#include "state/printable.h"
 #include "state/state_file.h"
 
 namespace {
@@ -49,21 +50,6 @@ int journal_priority(log_priority level) {
       break;
   }
   return 6;
-}
-
-/** A message is one line, whatever a file name in it holds. */
-std::string one_line(const char *text) {
-  std::string line;
-  for (const char *c = text; *c != '\0'; ++c) {
-    if (*c == '\n') {
-      line += "\\n";
-    } else if (*c == '\r') {
-      line += "\\r";
-    } else {
-      line += *c;
-    }
-  }
-  return line;
 }
 
 std::string stamp() {
@@ -173,7 +159,8 @@ extern "C" int dlog_print(log_id_t, log_priority prio, const char *tag, const ch
   const int length = vasprintf(&text, fmt, args);
   va_end(args);
   if (length < 0) return length;
-  const std::string message = one_line(text);
+  // Whatever a file name in it holds: one line, and nothing that a terminal obeys.
+  const std::string message = embedded::printable(text);
   std::free(text);
   if (stderr_is_journal() && send_to_journal(prio, tag, message)) {
     errno = saved_errno;

@@ -86,7 +86,7 @@ class Device:
 
     def call(self, verb, *arguments, check=True, **keywords):
         result = subprocess.run([self.tool, verb, self.path, *arguments], stdout=subprocess.PIPE,
-                                stderr=subprocess.PIPE, text=True, **keywords)
+                                stderr=subprocess.PIPE, **{"text": True, **keywords})
         if check and result.returncode != 0:
             raise AssertionError("quarn-device %s %s: exit %d\n%s%s" %
                                  (verb, " ".join(arguments), result.returncode, result.stdout,

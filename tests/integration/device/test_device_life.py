@@ -200,6 +200,50 @@ class Daemon(TestCase):
             follower.stdout.close()
         self.assertIn("== main loop begin ==", device.call("log").stdout)
 
+    def test_a_name_does_not_speak_to_a_terminal(self):
+        """Neither from the file nor from what shows it, even a file of earlier days."""
+        name = "\x1b]0;owned\x07\x1b[2J\u009b31m\x7f\n"
+        device = self.new_device()
+        device.start()
+        device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {
+            "data/" + name: b"x", "data/" + os.fsdecode(b"\x9b31m"): ("->", "anywhere"),
+            "data/link" + name: ("->", "to" + name)}))
+        log = os.path.join(device.path, "log/quarnd.log")
+        with open(log, "ab") as file:
+            file.write(b"an old line \x1b[5m\n")
+        follower = subprocess.Popen([device.tool, "log", device.path, "--follow"],
+                                    stdout=subprocess.PIPE, stderr=subprocess.DEVNULL)
+        self.addCleanup(follower.wait)
+        self.addCleanup(follower.stdout.close)
+        self.addCleanup(follower.kill)
+        device.quarnctl("backup")
+        device.wait_for_log("\\x1b]0;owned\\x07\\x1b[2J\\u{9b}31m\\x7f\\n")
+        with open(log, "rb") as file:
+            logged = file.read().split(b"\n", 1)[1]
+        self.assert_speaks_to_no_terminal(logged)
+        self.assertIn(b"\\x9b31m", logged)
+        shown = device.call("log", text=False).stdout
+        self.assert_speaks_to_no_terminal(shown)
+        self.assertTrue(shown.startswith(b"an old line \\x1b[5m\n"), shown[:80])
+        followed = b""
+        while b"\\x1b]0;owned" not in followed:
+            followed += follower.stdout.readline()
+        self.assert_speaks_to_no_terminal(followed)
+
+    def assert_speaks_to_no_terminal(self, text):
+        self.assertEqual([c for c in text.decode() if c != "\n" and
+                          (ord(c) < 0x20 or 0x7f <= ord(c) < 0xa0)], [])
+
+    def test_a_name_in_a_failure_does_not_speak_to_a_terminal(self):
+        device = self.new_device()
+        source = make_source(self.path("src"), "org.example.a", "1.0.0", {})
+        os.makedirs(os.path.join(source, "data"))
+        os.mkfifo(os.path.join(source, "data/\x1b[2Jpipe\n"))
+        result = device.call("install", source, check=False)
+        self.assertEqual(result.returncode, 1)
+        self.assertEqual(result.stderr, "quarn-device: %s/data/\\x1b[2Jpipe\\n is neither file, "
+                         "directory nor link\n" % source)
+
     @staticmethod
     def add_alarm(device, due_ms):
         path = os.path.join(device.path, "state/alarms.ini")

@@ -57,6 +57,42 @@ TEST_F(Log, KeepsAMessageWithLineEndsOnOneLine) {
   EXPECT_EQ(lines().size(), 1U);
 }
 
+TEST_F(Log, LetsNoNameSpeakToATerminal) {
+  const std::vector<std::pair<std::string, std::string>> cases = {
+      {"a\x1b[2Jb", "a\\x1b[2Jb"},
+      {"\x1b]0;title\x07", "\\x1b]0;title\\x07"},
+      {"a\tb\bc\x01", "a\\tb\\x08c\\x01"},
+      {"del\x7f", "del\\x7f"},
+      {"csi\xc2\x9b"
+       "31m",
+       "csi\\u{9b}31m"},
+      {"next\xc2\x85line", "next\\u{85}line"},
+      {"separated\xe2\x80\xa8line", "separated\\u{2028}line"},
+      {"reversed\xe2\x80\xaetxt", "reversed\\u{202e}txt"},
+      {"bare\x9b"
+       "31m",
+       "bare\\x9b31m"},
+      {"cut\xe2\x80", "cut\\xe2\\x80"},
+      {"overlong\xc0\x9b", "overlong\\xc0\\x9b"},
+      {"surrogate\xed\xa0\x80", "surrogate\\xed\\xa0\\x80"},
+      {"d\xc3\xa9j\xc3\xa0 vu \xe6\x97\xa5 \\ \"quoted\"",
+       "d\xc3\xa9j\xc3\xa0 vu \xe6\x97\xa5 \\ \"quoted\""},
+  };
+  testing::internal::CaptureStderr();
+  for (const auto &[name, shown] : cases) {
+    dlog_print(LOG_ID_MAIN, DLOG_ERROR, "QUARND", "file.cpp: work(1) > %s", name.c_str());
+  }
+  const std::string told = testing::internal::GetCapturedStderr();
+  const auto all = lines();
+  ASSERT_EQ(all.size(), cases.size());
+  std::string written;
+  for (std::size_t i = 0; i < cases.size(); ++i) {
+    EXPECT_EQ(all[i].substr(all[i].find(" > ") + 3), cases[i].second);
+    written += all[i] + "\n";
+  }
+  EXPECT_EQ(told, written);
+}
+
 TEST_F(Log, DoesNotChangeErrno) {
   testing::internal::CaptureStderr();
   errno = ENOTTY;
