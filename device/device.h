@@ -19,6 +19,9 @@ using Arguments = std::vector<std::string>;
 /** Owner of the alarms that the daemon is started for. */
 inline constexpr char kAlarmOwner[] = "quarn";
 
+/** The daemon's name on the device's bus. */
+inline constexpr char kBusName[] = "org.orvane.Quarn";
+
 /** Exit codes of the tool. */
 enum device_exit : int {
   DEVICE_OK = 0,
@@ -55,6 +58,15 @@ std::string program_directory();
 
 /** Bus address of a device. */
 std::string bus_address(const std::string &device);
+
+/** Replace the text of a small file; fails when it cannot be written. */
+void write_file(const std::string &path, const std::string &text);
+
+/**
+ * Write what the device's bus reads, with the policy that is shipped with the daemon.
+ * @return the configuration's path
+ */
+std::string write_bus_files(const std::string &device);
 
 /** The text of errno. */
 std::string reason();

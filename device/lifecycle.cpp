@@ -40,8 +40,6 @@ namespace fs = std::filesystem;
 
 constexpr char kAppsPath[] = "/opt/usr/apps";
 constexpr char kTmpPath[] = "/tmp";
-constexpr char kBusName[] = "org.orvane.Quarn";
-/** Owner of the alarms that start the daemon. */
 /** What the daemon makes below /tmp: it is the device's own, whatever the host has there. */
 constexpr char kDaemonTmpEntry[] = "quarn";
 constexpr char kSupervisorFile[] = "run/supervisor";
@@ -84,13 +82,6 @@ bool find_supervisor(const std::string &device, Supervisor *supervisor) {
   std::string birth;
   if (!(file >> supervisor->pid >> birth >> supervisor->own_namespace)) return false;
   return birth == birth_of(supervisor->pid);
-}
-
-void write_file(const std::string &path, const std::string &text) {
-  std::ofstream file(path, std::ios::trunc);
-  file << text;
-  file.close();
-  if (!file) throw Failure("cannot write " + path + ": " + reason());
 }
 
 /* ---- the view from inside ---------------------------------------------------------------------
@@ -246,47 +237,9 @@ void set_environment(const std::string &device) {
 /* ---- the bus ----------------------------------------------------------------------------------
  */
 
-std::string xml_text(const std::string &text) {
-  const embedded::GText escaped(g_markup_escape_text(text.c_str(), -1));
-  return escaped.get();
-}
-
-std::string shell_text(const std::string &text) {
-  const embedded::GText quoted(g_shell_quote(text.c_str()));
-  return quoted.get();
-}
-
-void write_bus_files(const std::string &device) {
-  std::error_code error;
-  fs::create_directories(device + "/run/services", error);
-  const std::string program = program_directory() + "/quarn-device";
-  write_file(device + "/run/services/" + kBusName + ".service",
-             std::string("[D-BUS Service]\nName=") + kBusName + "\nExec=" + shell_text(program) +
-                 " daemon " + shell_text(device) + "\n");
-  write_file(device + "/run/bus.conf",
-             "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-BUS Bus Configuration 1.0//EN\"\n"
-             " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
-             "<busconfig>\n"
-             "  <listen>" +
-                 xml_text(bus_address(device)) +
-                 "</listen>\n"
-                 "  <auth>EXTERNAL</auth>\n"
-                 "  <servicedir>" +
-                 xml_text(device) +
-                 "/run/services</servicedir>\n"
-                 "  <policy context=\"default\">\n"
-                 "    <allow user=\"*\"/>\n"
-                 "    <allow own=\"*\"/>\n"
-                 "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
-                 "    <allow eavesdrop=\"true\"/>\n"
-                 "  </policy>\n"
-                 "  <limit name=\"max_replies_per_connection\">50000</limit>\n"
-                 "  <limit name=\"max_match_rules_per_connection\">50000</limit>\n"
-                 "</busconfig>\n");
-}
-
 /** Start the bus daemon; returns once it listens. */
 pid_t start_bus(const std::string &device) {
+  const std::string config = write_bus_files(device);
   unlink((device + "/run/bus").c_str());
   int address[2];
   if (pipe2(address, O_CLOEXEC) != 0) throw Failure("cannot make a pipe: " + reason());
@@ -297,9 +250,9 @@ pid_t start_bus(const std::string &device) {
     prctl(PR_SET_PDEATHSIG, SIGTERM);
     if (getppid() != supervisor) _exit(1);
     const int out = dup(address[1]);  // without close-on-exec
-    execlp("dbus-daemon", "dbus-daemon", ("--config-file=" + device + "/run/bus.conf").c_str(),
-           "--nofork", "--nopidfile", "--nosyslog",
-           ("--print-address=" + std::to_string(out)).c_str(), nullptr);
+    execlp("dbus-daemon", "dbus-daemon", ("--config-file=" + config).c_str(), "--nofork",
+           "--nopidfile", "--nosyslog", ("--print-address=" + std::to_string(out)).c_str(),
+           nullptr);
     _exit(127);
   }
   close(address[1]);
@@ -432,7 +385,6 @@ void stop_daemon(Running *self) {
     self.own_namespace = enter_own_namespace(device);
     if (!self.own_namespace) map_apps_path(device);
     set_environment(device);
-    write_bus_files(device);
     self.bus = start_bus(device);
     write_file(device + "/" + kSupervisorFile, std::to_string(getpid()) + " " + birth_of(getpid()) +
                                                    " " + (self.own_namespace ? "1" : "0") + "\n");
@@ -626,6 +578,13 @@ void request_daemon(const std::string &device) {
 }
 
 }  // namespace
+
+void write_file(const std::string &path, const std::string &text) {
+  std::ofstream file(path, std::ios::trunc);
+  file << text;
+  file.close();
+  if (!file) throw Failure("cannot write " + path + ": " + reason());
+}
 
 std::string bus_address(const std::string &device) {
   const embedded::GText escaped(g_dbus_address_escape_value((device + "/run/bus").c_str()));
