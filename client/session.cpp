@@ -11,6 +11,7 @@
 #include "backup_sets.h"
 #include "bus_client.h"
 #include "json_read.h"
+#include "platform_clock.h"
 #include "progress.h"
 #include "quarn_common.h"
 #include "quarn_handles.h"
@@ -364,7 +365,10 @@ void Session::show_status() {
       [this](GVariant *answer) {
         if (done_) return;
         const DaemonStatus status = read_status(answer);
-        const std::int64_t now_ms = g_get_real_time() / kUsPerMs;
+        // Ages are told by the clock that the times are of: the device's.
+        const std::int64_t now_ms =
+            g_get_real_time() / kUsPerMs +
+            (platform_clock_offset_ms == nullptr ? 0 : platform_clock_offset_ms());
         status_to_json(status, now_ms, document_.get());
         screen_.text(status_text(status, now_ms));
         // Without Wi-Fi the daemon would try for a minute to reach the cloud.

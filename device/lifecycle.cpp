@@ -17,6 +17,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cstdio>
@@ -30,6 +31,7 @@
 
 #include "device.h"
 #include "state/alarms.h"
+#include "state/clock.h"
 #include "state/power.h"
 #include "state/state_file.h"
 #include "state/watch.h"
@@ -299,6 +301,7 @@ struct Running {
   pid_t bus = 0;
   Connection connection;
   std::unique_ptr<embedded::StateWatch> alarms;
+  std::unique_ptr<embedded::StateWatch> clock;
   int timer = -1;
   bool own_namespace = false;
 };
@@ -321,13 +324,15 @@ void wake_daemon(Running *self) {
 }
 
 void look_at_alarms(Running *self) {
-  embedded::fire_due_alarms(self->device, embedded::now_ms());
+  embedded::fire_due_alarms(self->device, embedded::device_now_ms(self->device));
   if (embedded::has_fired_alarms(self->device, kAlarmOwner)) wake_daemon(self);
   itimerspec when{};
   if (const auto due = embedded::next_due(self->device)) {
-    when.it_value.tv_sec = *due / kMillisInSecond;
-    when.it_value.tv_nsec = *due % kMillisInSecond * 1000000L;
-    if (when.it_value.tv_sec == 0 && when.it_value.tv_nsec == 0) when.it_value.tv_nsec = 1;
+    // A time before the machine's own epoch is due as well, but cannot be waited for.
+    const std::int64_t at =
+        std::max<std::int64_t>(*due - embedded::clock_offset_ms(self->device), 1);
+    when.it_value.tv_sec = at / kMillisInSecond;
+    when.it_value.tv_nsec = at % kMillisInSecond * 1000000L;
   }
   timerfd_settime(self->timer, TFD_TIMER_ABSTIME, &when, nullptr);
 }
@@ -406,6 +411,8 @@ void stop_daemon(Running *self) {
     g_unix_fd_add(self.timer, G_IO_IN, on_timer, &self);
     self.alarms = std::make_unique<embedded::StateWatch>(device, embedded::kAlarmsFile,
                                                          [&self] { look_at_alarms(&self); });
+    self.clock = std::make_unique<embedded::StateWatch>(device, embedded::kClockFile,
+                                                        [&self] { look_at_alarms(&self); });
     const std::string note = self.own_namespace
                                  ? std::string()
                                  : std::string("mount namespaces are not permitted here: ") +

@@ -43,6 +43,7 @@ constexpr Verb kVerbs[] = {
      "Change what the device finds around it:\n"
      "  network wifi|cellular|none    charger on|off    display on|dim|off\n"
      "  account NAME|none             modem on|off\n"
+     "  clock +SECONDS|-SECONDS|real  ahead of the machine's clock, or behind it\n"
      "  cloud URL [--user NAME [--password-file FILE]] [--ca-file FILE]\n"
      "            [--region NAME] [--addressing path|virtual]\n"
      "The password of --user is read from the file, else from standard input. --ca-file names\n"

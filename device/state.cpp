@@ -15,6 +15,7 @@
 
 #include "device.h"
 #include "state/alarms.h"
+#include "state/clock.h"
 #include "state/facts.h"
 #include "state/printable.h"
 #include "state/state_file.h"
@@ -26,7 +27,8 @@ namespace fs = std::filesystem;
 
 constexpr char kDefaultModel[] = "Orvane Embedded";
 constexpr char kDefaultAccount[] = "user";
-constexpr std::int64_t kFireMilliseconds = 20000;
+constexpr gint64 kFireMicroseconds = 20000000;
+constexpr std::int64_t kMillisInSecond = 1000;
 constexpr gulong kFirePauseMicroseconds = 5000;
 
 /** An IMEI: 14 digits of the device's own and their check digit. */
@@ -127,6 +129,26 @@ void print_log_line(const std::string &line) { std::cout << embedded::printable(
   throw Failure("the log cannot be followed any longer");
 }
 
+/** The verb `set DIR clock +SECONDS`: how far the device's clock is ahead of the machine's. */
+void set_clock(const std::string &device, const std::string &value) {
+  // Further than that no device was ever off.
+  constexpr gint64 kMaxSeconds = 100LL * 365 * 24 * 3600;
+  gint64 seconds = 0;
+  const bool with_sign = value.size() > 1 && (value[0] == '+' || value[0] == '-') &&
+                         g_ascii_isdigit(value[1]) != FALSE;
+  const bool back = value == "real" || value == "0";
+  const std::string number = back ? "0" : value.substr(value[0] == '+' ? 1 : 0);
+  if ((!with_sign && !back) || g_ascii_string_to_signed(number.c_str(), 10, -kMaxSeconds,
+                                                        kMaxSeconds, &seconds, nullptr) == FALSE) {
+    throw Failure("\"" + value + "\" is no time of the clock: use +SECONDS, -SECONDS or real");
+  }
+  const std::int64_t offset = seconds * kMillisInSecond;
+  if (embedded::machine_now_ms() + offset < 0) throw Failure("no clock goes back behind 1970");
+  if (!embedded::set_clock_offset_ms(device, offset)) {
+    throw Failure("cannot write clock: " + reason());
+  }
+}
+
 }  // namespace
 
 int verb_create(const Arguments &arguments) {
@@ -208,6 +230,8 @@ int verb_set(const Arguments &arguments) {
     set_if(embedded::kDisplay, {"on", "dim", "off"});
   } else if (key == "modem") {
     set_if(embedded::kModem, {"on", "off"});
+  } else if (key == "clock") {
+    set_clock(device, value);
   } else if (key == "account") {
     if (!is_text(value)) throw Failure("empty or unprintable account name");
     set_fact(device, embedded::kAccount, value == "none" ? "" : value);
@@ -269,13 +293,13 @@ int verb_fire(const Arguments &arguments) {
     throw Failure("\"" + arguments[1] + "\" is no alarm's id");
   }
   if (!is_started(device)) throw Failure("the device is not started");
-  if (!embedded::fire_alarm(device, static_cast<int>(id), embedded::now_ms())) {
+  if (!embedded::fire_alarm(device, static_cast<int>(id), embedded::device_now_ms(device))) {
     throw Failure("no alarm " + arguments[1]);
   }
   // The supervisor starts a daemon that is not running; either way it takes the alarm.
-  const std::int64_t patience = embedded::now_ms() + kFireMilliseconds;
+  const gint64 patience = g_get_monotonic_time() + kFireMicroseconds;
   while (embedded::has_fired_alarms(device, kAlarmOwner)) {
-    if (embedded::now_ms() > patience) throw Failure("the daemon did not take the alarm");
+    if (g_get_monotonic_time() > patience) throw Failure("the daemon did not take the alarm");
     g_usleep(kFirePauseMicroseconds);
   }
   return DEVICE_OK;

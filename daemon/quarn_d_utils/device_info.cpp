@@ -1,5 +1,6 @@
 #include <sys/time.h>
 
+#include "platform_clock.h"
 #include "platform_system_info.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
@@ -26,5 +27,7 @@ void get_device_info(char **model, char **serial) {
 std::int64_t _get_current_timestamp() {
   timeval now{};
   gettimeofday(&now, nullptr);
-  return now.tv_sec * kMillisecondsPerSecond + now.tv_usec / kMicrosecondsPerMillisecond;
+  const std::int64_t time =
+      now.tv_sec * kMillisecondsPerSecond + now.tv_usec / kMicrosecondsPerMillisecond;
+  return platform_clock_offset_ms == nullptr ? time : time + platform_clock_offset_ms();
 }

@@ -15,11 +15,13 @@
 #include <mutex>
 #include <string>
 
+#include "state/clock.h"
 #include "state/printable.h"
 #include "state/state_file.h"
 
 namespace {
 
+constexpr std::int64_t kMillisInSecond = 1000;
 constexpr long kNanosInMilli = 1000000;
 constexpr mode_t kLogMode = 0644;
 
@@ -55,12 +57,15 @@ int journal_priority(log_priority level) {
 std::string stamp() {
   timespec now{};
   clock_gettime(CLOCK_REALTIME, &now);
+  const std::int64_t ms = now.tv_sec * kMillisInSecond + now.tv_nsec / kNanosInMilli +
+                          embedded::clock_offset_ms(embedded::current_device());
+  const auto seconds = static_cast<time_t>(ms / kMillisInSecond);
   tm parts{};
-  gmtime_r(&now.tv_sec, &parts);
+  gmtime_r(&seconds, &parts);
   char date[32];
   std::strftime(date, sizeof date, "%Y-%m-%dT%H:%M:%S", &parts);
   char text[48];
-  std::snprintf(text, sizeof text, "%s.%03ldZ", date, now.tv_nsec / kNanosInMilli);
+  std::snprintf(text, sizeof text, "%s.%03dZ", date, static_cast<int>(ms % kMillisInSecond));
   return text;
 }
 

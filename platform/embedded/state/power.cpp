@@ -1,5 +1,6 @@
 #include "state/power.h"
 
+#include "state/clock.h"
 #include "state/state_file.h"
 
 namespace embedded {
@@ -15,7 +16,7 @@ bool set_power_lock(const std::string &device, const char *lock, int pid, int ti
     g_key_file_remove_group(file, lock, nullptr);
     if (pid != 0) {
       g_key_file_set_integer(file, lock, kHolder, pid);
-      if (timeout_ms > 0) g_key_file_set_int64(file, lock, kUntil, now_ms() + timeout_ms);
+      if (timeout_ms > 0) g_key_file_set_int64(file, lock, kUntil, machine_now_ms() + timeout_ms);
     }
     return true;
   });
@@ -25,7 +26,7 @@ int power_lock_holder(const std::string &device, const char *lock) {
   const KeyFilePtr file = read_state(device, kPowerFile);
   if (file == nullptr) return 0;
   const gint64 until = number_of(file.get(), lock, kUntil, 0);
-  if (until != 0 && until <= now_ms()) return 0;
+  if (until != 0 && until <= machine_now_ms()) return 0;
   return static_cast<int>(number_of(file.get(), lock, kHolder, 0));
 }
 

@@ -13,11 +13,12 @@
 #include <system_error>
 #include <thread>
 
+#include "state/clock.h"
+
 namespace embedded {
 namespace {
 
 constexpr mode_t kStateMode = 0644;
-constexpr gint64 kMicrosInMilli = 1000;
 // Temporary files have a folder of their own: the one that is watched sees whole files only.
 constexpr char kTemporaryFolder[] = ".tmp";
 constexpr char kLockFile[] = ".lock";
@@ -183,6 +184,6 @@ gint64 number_of(GKeyFile *file, const char *group, const char *key, gint64 othe
   return otherwise;
 }
 
-gint64 now_ms() { return g_get_real_time() / kMicrosInMilli; }
+gint64 now_ms() { return device_now_ms(current_device()); }
 
 }  // namespace embedded

@@ -89,7 +89,7 @@ std::string text_of(GKeyFile *file, const char *group, const char *key);
 /** Whole number of a key, @p otherwise when it is missing or no number. */
 gint64 number_of(GKeyFile *file, const char *group, const char *key, gint64 otherwise);
 
-/** Milliseconds since the Unix epoch, now. */
+/** Milliseconds since the Unix epoch by the clock of this process's device. */
 gint64 now_ms();
 
 }  // namespace embedded
