@@ -1,6 +1,8 @@
 #include "state/packages.h"
 
+#include <fcntl.h>
 #include <json-c/json.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -126,6 +128,60 @@ fs::path outside_root(const std::string &device, const std::string &id) {
   return fs::path(device) / "root/opt/usr/apps" / id;
 }
 
+/** One installation, update or removal at a time, as a device has one installer. */
+class InstallerLock {
+ public:
+  explicit InstallerLock(const std::string &device)
+      : lock_(open(embedded::state_path(device, ".installer").c_str(), O_RDWR | O_CREAT | O_CLOEXEC,
+                   kLockMode)) {
+    if (lock_.fd < 0 || TEMP_FAILURE_RETRY(flock(lock_.fd, LOCK_EX)) != 0) {
+      throw Failure("cannot lock the installer: " + reason());
+    }
+  }
+
+ private:
+  static constexpr mode_t kLockMode = 0600;
+  Fd lock_;
+};
+
+/** Where a package goes at once, whoever still works in it; empty again when its removal ends. */
+fs::path removed_folder(const std::string &device) {
+  return fs::path(device) / "root/opt/usr/.removed";
+}
+
+/** Delete what was removed, also by a removal that was killed. Others may still write below it. */
+void empty_removed_folder(const std::string &device) {
+  constexpr int kTries = 1000;
+  std::error_code error;
+  for (int i = 0; i < kTries; ++i) {
+    fs::remove_all(removed_folder(device), error);
+    if (!error) return;
+  }
+  throw Failure("cannot remove the package's files: " + error.message());
+}
+
+/** Take a package's files away in one step. */
+void take_away(const std::string &device, const std::string &id) {
+  empty_removed_folder(device);
+  const fs::path folder = removed_folder(device);
+  constexpr mode_t kPrivateFolder = 0700;
+  if (mkdir(folder.c_str(), kPrivateFolder) != 0) {
+    throw Failure("cannot make " + folder.string() + ": " + reason());
+  }
+  if (rename(outside_root(device, id).c_str(), (folder / id).c_str()) != 0 && errno != ENOENT) {
+    throw Failure("cannot remove the package's files: " + reason());
+  }
+  empty_removed_folder(device);
+}
+
+/** The same after another failure, which is the one to tell. */
+void take_away_quietly(const std::string &device, const std::string &id) {
+  try {
+    take_away(device, id);
+  } catch (const Failure &) {
+  }
+}
+
 /** Applications are looked up by id: two packages cannot share one. */
 void check_applications(const std::string &device, const embedded::Package &package) {
   for (const embedded::Application &application : package.applications) {
@@ -173,6 +229,7 @@ int verb_install(const Arguments &arguments) {
   if (!embedded::parse_package(manifest.get(), &package, &problem)) {
     throw Failure(ini + ": " + problem);
   }
+  const InstallerLock lock(device);
   check_applications(device, package);
   embedded::Package before;
   const bool update = embedded::get_package(device, package.id, &before);
@@ -181,13 +238,14 @@ int verb_install(const Arguments &arguments) {
   send_event(device, package, action, embedded::kStateStarted);
   const fs::path root = outside_root(device, package.id);
   try {
+    // What an installation or a removal that was killed has left is nobody's.
+    if (!update) take_away(device, package.id);
     copy_tree(arguments[1], root, package, update);
     if (!embedded::put_package(device, package)) {
       throw Failure("cannot record the package: " + reason());
     }
   } catch (...) {
-    std::error_code ignored;
-    if (!update) fs::remove_all(root, ignored);
+    if (!update) take_away_quietly(device, package.id);
     send_event(device, package, action, embedded::kStateFailed);
     throw;
   }
@@ -198,6 +256,7 @@ int verb_install(const Arguments &arguments) {
 int verb_remove(const Arguments &arguments) {
   if (arguments.size() != 2) wrong_use();
   const std::string device = open_device(arguments[0]);
+  const InstallerLock lock(device);
   embedded::Package package;
   if (!embedded::get_package(device, arguments[1], &package)) {
     throw Failure("no package \"" + arguments[1] + "\"");
@@ -206,9 +265,7 @@ int verb_remove(const Arguments &arguments) {
   if (!embedded::drop_package(device, package.id)) {
     throw Failure("cannot forget the package: " + reason());
   }
-  std::error_code error;
-  fs::remove_all(outside_root(device, package.id), error);
-  if (error) throw Failure("cannot remove the package's files: " + error.message());
+  take_away(device, package.id);
   send_event(device, package, embedded::kActionUninstall, embedded::kStateCompleted);
   return DEVICE_OK;
 }
