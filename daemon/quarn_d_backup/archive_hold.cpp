@@ -44,7 +44,8 @@ bool note_package(package_info_h info, void *user_data) {
   auto *walk = static_cast<package_walk *>(user_data);
   CString id;
   bool preload = false;
-  if (package_info_get_package(info, out(id)) != PACKAGE_MANAGER_ERROR_NONE || !id) {
+  const int named = package_info_get_package(info, out(id));
+  if (named != PACKAGE_MANAGER_ERROR_NONE || !id) {
     walk->complete = false;
     return true;
   }

@@ -146,6 +146,7 @@ void look_for_unknown_backup(backup_context *ctx) {
     note_own_backup(serial);
   } else if (!ctx->is_manual && !knows_own_backup(serial)) {
     LOGI("backup in cloud is older than what this device knows of, so all of it is kept");
+    note_found_backup();
     notes.keep_all_listed = true;
   }
 }
@@ -246,7 +247,12 @@ bool may_be_installed(const std::string &pkg_id) {
   PackageInfoPtr info;
   const int ret = package_manager_get_package_info(pkg_id.c_str(), out(info));
   if (ret == PACKAGE_MANAGER_ERROR_NO_SUCH_PACKAGE) return false;
-  return ret != PACKAGE_MANAGER_ERROR_NONE || info != nullptr;
+  if (ret != PACKAGE_MANAGER_ERROR_NONE) return true;
+  bool preload = false;
+  // a preloaded one is not backed up, so it is not missed either
+  return info != nullptr &&
+         !(package_info_is_preload_package(info.get(), &preload) == PACKAGE_MANAGER_ERROR_NONE &&
+           preload);
 }
 
 bool foreach_package_info_callback(package_info_h info, void *user_data) {

@@ -9,12 +9,15 @@
 
 namespace {
 
+/** In place of a serial's: a backup was found, and nothing has been decided on it. */
+constexpr int kUndecided = -1;
+
 /** Never 0, which a setting that was never written may read as. */
 int mark_of(const std::string &serial) {
   const uLong crc =
       crc32(0, reinterpret_cast<const Bytef *>(serial.data()), static_cast<uInt>(serial.size()));
   const int mark = static_cast<int>(static_cast<std::uint32_t>(crc));
-  return mark != 0 ? mark : 1;
+  return mark != 0 && mark != kUndecided ? mark : 1;
 }
 
 bool has_mark(const std::string &serial) {
@@ -47,6 +50,13 @@ bool knows_own_backup(const std::string &serial) { return has_mark(serial) || kn
 void note_own_backup(const std::string &serial) {
   if (has_mark(serial)) return;
   if (vconf_set_int(kOwnBackupKey, mark_of(serial)) != VCONF_OK) {
+    LOGE("cannot set own backup to vconf");
+  }
+}
+
+void note_found_backup() {
+  if (has_any_mark()) return;
+  if (vconf_set_int(kOwnBackupKey, kUndecided) != VCONF_OK) {
     LOGE("cannot set own backup to vconf");
   }
 }

@@ -13,7 +13,8 @@
 
 #include <string>
 
-/** Setting: the CRC-32 of the serial number whose backup is this device's own, an integer. */
+/** Setting: the CRC-32 of the serial number whose backup is this device's own, an integer; -1
+ * while a backup that was found is undecided on. */
 inline constexpr char kOwnBackupKey[] = "db/private/quarn/own_backup";
 
 /**
@@ -23,6 +24,8 @@ inline constexpr char kOwnBackupKey[] = "db/private/quarn/own_backup";
 bool knows_own_backup(const std::string &serial);
 /** Remember it. */
 void note_own_backup(const std::string &serial);
+/** A run keeps a backup that it found: the time of that run, too, tells of no decision. */
+void note_found_backup();
 /** The time of the last backup is about to be forgotten; what it tells of is not. */
 void keep_knowledge_of_last_backup();
 /** Restore mode was used to its end: the user had what was wanted of the backup. */

@@ -62,7 +62,7 @@ bool claimed_package_is_missing(backup_context *ctx);
 
 /* ---- changes.cpp ---- */
 
-/** True when the package manager does not say that there is no such package. */
+/** True unless the package manager says that there is no such package, or a preloaded one. */
 bool may_be_installed(const std::string &pkg_id);
 
 #endif
