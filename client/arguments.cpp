@@ -42,9 +42,15 @@ constexpr VerbInfo kVerbs[] = {
     {Verb::deactivate, "deactivate", "", "end the daemon when it is idle",
      "The daemon forgets when the last backup was, and ends itself unless it is busy.\n",
      kShortWait, 0, 0},
-    {Verb::backup, "backup", "", "back up now and wait for the end",
+    {Verb::backup, "backup", "[--yes]", "back up now and wait for the end",
      "Shows what happens until the backup has ended. An interrupt (Ctrl-C) cancels the backup and\n"
-     "waits for its end; a second one leaves at once. After a time-out the backup goes on.\n",
+     "waits for its end; a second one leaves at once. After a time-out the backup goes on.\n"
+     "\n"
+     "A backup removes from the cloud what is no longer installed. When there is such a package "
+     "it\n"
+     "is named and confirmed first, or the backup is not begun.\n"
+     "\n"
+     "  --yes              back up, and remove, without a question\n",
      kNoLimit, 0, 0},
     {Verb::cancel, "cancel", "", "cancel the manual backup that is running",
      "Returns when the daemon has taken the request, which may be before the backup has stopped.\n",
@@ -117,10 +123,9 @@ constexpr char kCommonOptions[] =
     "  --help             this help\n";
 
 constexpr char kExitCodes[] =
-    "Exit status: 0 success, 1 to 42 the daemon's result, 64 wrong arguments, 69 bus or daemon "
-    "not\n"
-    "reachable, 70 the daemon ended before it answered, 75 time-out, 76 unusable answer, 77 not\n"
-    "allowed, 130 interrupted.\n";
+    "Exit status: 0 success, 1 to 42 the daemon's result, 64 wrong arguments, 65 not confirmed,\n"
+    "69 bus or daemon not reachable, 70 the daemon ended before it answered, 75 time-out,\n"
+    "76 unusable answer, 77 not allowed, 130 interrupted.\n";
 
 std::string seconds_text(double seconds) {
   return seconds > 0 ? std::to_string(static_cast<long>(seconds)) + " seconds" : "no limit";
@@ -184,6 +189,7 @@ struct Options {
   bool version = false;
   bool watch = false;
   bool transfer = false;
+  bool yes = false;
   bool from_given = false;
   bool timeout_given = false;
   double timeout = 0;
@@ -234,6 +240,8 @@ bool split_options(const std::vector<std::string> &arguments, Options &options,
       options.watch = true;
     } else if (argument == "--transfer") {
       options.transfer = true;
+    } else if (argument == "--yes") {
+      options.yes = true;
     } else if (is_option(argument, "--from")) {
       if (!take_value(arguments, i, "--from", options.serial, error)) return false;
       options.from_given = true;
@@ -258,6 +266,10 @@ bool check_operands(const VerbInfo &info, const Options &options, Command &comma
   if (!is_restore && (options.watch || options.from_given || options.transfer)) {
     const char *option = options.watch ? "--watch" : options.transfer ? "--transfer" : "--from";
     error = std::string(option) + " belongs to restore on";
+    return false;
+  }
+  if (options.yes && info.verb != Verb::backup) {
+    error = "--yes belongs to backup";
     return false;
   }
   if (command.packages.size() < info.min_operands || command.packages.size() > info.max_operands) {
@@ -332,6 +344,7 @@ bool parse_arguments(const std::vector<std::string> &arguments, Command &command
   command.timeout_given = options.timeout_given;
   command.watch = options.watch;
   command.transfer = options.transfer;
+  command.yes = options.yes;
   command.serial = options.serial;
   command.packages.assign(options.words.begin() + static_cast<std::ptrdiff_t>(used),
                           options.words.end());

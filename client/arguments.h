@@ -13,6 +13,7 @@ namespace quarn_client {
 /** quarnctl's exit codes that are not results of the daemon. */
 enum exit_code : int {
   EXIT_USAGE = 64,        /**< wrong arguments */
+  EXIT_UNCONFIRMED = 65,  /**< backup: it would remove packages, and nobody said yes */
   EXIT_NO_INPUT = 66,     /**< rules: no such package, source or path */
   EXIT_UNREACHABLE = 69,  /**< the bus or the daemon cannot be reached */
   EXIT_DAEMON_ENDED = 70, /**< the daemon ended before it had answered */
@@ -51,6 +52,7 @@ struct Command {
   bool json = false;
   bool watch = false;                /**< restore on: follow until the last package is done */
   bool transfer = false;             /**< restore on: archives in the companion's directory */
+  bool yes = false;                  /**< backup: what it removes needs no question */
   bool switch_on = false;            /**< auto: on or off */
   double timeout = 0;                /**< seconds; 0 waits without a limit */
   bool timeout_given = false;        /**< it bounds the watching, too */

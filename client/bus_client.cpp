@@ -14,6 +14,7 @@ constexpr char kBusPath[] = "/org/freedesktop/DBus";
 constexpr char kPropertiesInterface[] = "org.freedesktop.DBus.Properties";
 constexpr char kStatusPath[] = "/org/orvane/Quarn/Status";
 constexpr char kStatusInterface[] = "org.orvane.Quarn.Status";
+constexpr char kCleanUpInterface[] = "org.orvane.Quarn.CleanUp";
 constexpr char kProgressSignal[] = "progress";
 constexpr char kProgressPath[] = "/progress";
 // The caller has a clock of its own; the bus library's would end a long transfer.
@@ -285,6 +286,12 @@ void BusClient::on_reply(GObject *source, GAsyncResult *result, gpointer user_da
   } else if (!is_cancelled(error.get())) {
     pending->failure(failure_of(error.get()));
   }
+}
+
+void BusClient::read_kept_packages(Reply reply, Failure failure) {
+  call_object(kStatusPath, kPropertiesInterface, "Get",
+              g_variant_new("(ss)", kCleanUpInterface, "KeptPackages"), "(v)", std::move(reply),
+              std::move(failure));
 }
 
 void BusClient::flush() {

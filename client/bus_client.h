@@ -78,6 +78,9 @@ class BusClient {
   /** Reads all properties of the daemon's status object; the reply is "(a{sv})". */
   void read_status(Reply reply, Failure failure);
 
+  /** Reads which packages a backup leaves in the cloud; the reply is "(v)", of an "as". */
+  void read_kept_packages(Reply reply, Failure failure);
+
   /** Waits until everything is written: a reply that is still queued would be lost at the exit. */
   void flush();
 

@@ -43,7 +43,10 @@ constexpr Words kReasons[] = {
     {"too-large", "its data is too large"},
     {"no-space", "not enough free space on the device"},
     {"disabled", "the application does not allow it"},
+    {"removed", "it was removed meanwhile"},
+    {"too-deep", "its folders are nested too deeply"},
     {"unreadable", "its data could not be read"},
+    {"restoring", "a restore is to have its backup first"},
     {"upload-failed", "the upload failed"},
     {"not-installed", "restore mode ended before it was installed"},
 };
@@ -87,12 +90,25 @@ std::optional<ProgressEvent> parse_progress(const std::string &text) {
   event.size = optional_size(object, "size");
   event.cap = optional_size(object, "cap");
   event.result = json_integer(object, "result");
+  event.cause = json_string(object, "cause").value_or("");
+  event.notice = json_string(object, "notice").value_or("");
+  json_object *written = json_member(object, "list_written", json_type_boolean);
+  if (written != nullptr) event.list_written = json_object_get_boolean(written) != 0;
   return event;
 }
 
 std::string stage_text(const std::string &kind, const std::string &stage) {
   if (stage == kFinished && kind == kBackup) return "backup finished";
   return words(kStages, stage);
+}
+
+std::string notice_text(const ProgressEvent &event) {
+  if (event.notice != "list-nearly-full") return "";
+  std::string text = "the application list is nearly full";
+  if (event.size && event.cap) {
+    text += ": " + size_text(*event.size) + " of at most " + size_text(*event.cap);
+  }
+  return text + "; once it is full no device of the account can back up";
 }
 
 std::string reason_text(const PackageOutcome &outcome) {

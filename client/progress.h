@@ -31,6 +31,9 @@ struct ProgressEvent {
   std::optional<std::uint64_t> size; /**< bytes: the archive's, or what was too large */
   std::optional<std::uint64_t> cap;  /**< bytes that are allowed at most */
   std::optional<std::int64_t> result;
+  std::string cause;                /**< what the run failed of; empty when that is not told */
+  std::optional<bool> list_written; /**< the failed run's list stands in the cloud */
+  std::string notice;               /**< something that is to be seen to; empty as a rule */
 };
 
 /** Reads a signal's text; nothing when it is not an object with a kind and a stage. */
@@ -79,6 +82,9 @@ class ProgressBoard {
 
 /** Words for a stage of the daemon's work; the stage itself when it is not known. */
 std::string stage_text(const std::string &kind, const std::string &stage);
+
+/** Words for a notice; empty when it is not known. */
+std::string notice_text(const ProgressEvent &event);
 
 /** Words for why a package came out as it did. */
 std::string reason_text(const PackageOutcome &outcome);

@@ -6,10 +6,12 @@
 #include <cmath>
 #include <csignal>
 #include <optional>
+#include <set>
 #include <utility>
 
 #include "backup_sets.h"
 #include "bus_client.h"
+#include "clean_up.h"
 #include "json_read.h"
 #include "platform_clock.h"
 #include "progress.h"
@@ -79,6 +81,10 @@ class Session {
   void switch_state(const char *method, int on, const char *done);
   void last_time();
   void backup();
+  void preview_backup(const std::set<std::string> &kept);
+  void preview_set(const std::string &text);
+  void confirm_removal(const BackupSet &set, const std::vector<std::string> &removed);
+  void start_backup();
   void cancel();
   void app_request(const char *method, const char *what, const char *done);
   void app_export();
@@ -100,6 +106,7 @@ class Session {
   void take_callback(const Callback &callback);
   void take_status(const Callback &callback);
   void take_progress(const std::string &text);
+  void take_notices(const ProgressEvent &event);
   bool concerns_us(const ProgressEvent &event) const;
   void daemon_ended();
   void fail(const BusFailure &failure);
@@ -120,7 +127,10 @@ class Session {
   void finish(int code, const std::string &error = "");
   void finish_with(int result, const std::string &what, const std::string &done);
   /** A failure in which the cloud may have had its part: the daemon is asked for it first. */
-  void finish_explained(int code, const std::string &error);
+  void finish_explained(int code, const std::string &what, const std::string &error);
+  void finish_for(const std::string &problem, int code, const std::string &what,
+                  const std::string &error);
+  void tell_of_list();
 
   static gboolean on_interrupt(gpointer user_data);
   static gboolean on_timeout(gpointer user_data);
@@ -139,6 +149,11 @@ class Session {
   std::optional<int> reply_;
   std::optional<Callback> callback_;
   std::uint32_t req_id_;
+  Question question_;
+  std::set<std::string> kept_; /**< backup: what it leaves in the cloud */
+  bool previewing_ = false;    /**< backup: it is looked what it would remove */
+  std::string cause_;          /**< what the run failed of, as its last signal told */
+  std::optional<bool> list_written_;
   bool called_ = false;
   bool cancelling_ = false;
   bool watching_ = false;
@@ -262,6 +277,80 @@ void Session::last_time() {
 }
 
 void Session::backup() {
+  if (command_.yes) return start_backup();
+  previewing_ = true;
+  // What cannot be found out now is not asked about: the backup finds it out as well.
+  client_->read_kept_packages(
+      [this](GVariant *answer) {
+        if (done_ || !previewing_) return;
+        const auto kept = read_kept_packages(answer);
+        if (!kept) return start_backup();
+        preview_backup(*kept);
+      },
+      [this](const BusFailure &) { start_backup(); });
+}
+
+void Session::preview_backup(const std::set<std::string> &kept) {
+  kept_ = kept;
+  client_->read_status(
+      [this](GVariant *answer) {
+        if (done_ || !previewing_) return;
+        const DaemonStatus status = read_status(answer);
+        if (!status.wifi.value_or(false) || status.serial.empty()) return start_backup();
+        set_.serial = status.serial;
+        on_answer_ = [this] {
+          if (!callback_) return;
+          if (callback_->result != QUARN_OK) return start_backup();
+          preview_set(callback_->text);
+        };
+        client_->call(
+            "get_app_list", g_variant_new("(iu)", kCloudClient, req_id_), "(i)", [](GVariant *) {},
+            [this](const BusFailure &) { start_backup(); });
+      },
+      [this](const BusFailure &) { start_backup(); });
+}
+
+void Session::preview_set(const std::string &text) {
+  std::string error;
+  const auto sets = parse_backup_sets(text, error);
+  const BackupSet *own = sets ? find_set(*sets, set_.serial) : nullptr;
+  if (own == nullptr) return start_backup();
+  const std::vector<std::string> removed = packages_to_remove(*own, kept_);
+  if (removed.empty()) return start_backup();
+  confirm_removal(*own, removed);
+}
+
+void Session::confirm_removal(const BackupSet &set, const std::vector<std::string> &removed) {
+  json_object *names = json_object_new_array();
+  for (const std::string &package : removed) {
+    json_object_array_add(names, json_object_new_string(package.c_str()));
+  }
+  json_object_object_add(document_.get(), "would_remove", names);
+  const std::string what = std::to_string(removed.size()) +
+                           (removed.size() == 1 ? " package that is" : " packages that are") +
+                           " not installed from the cloud: " + packages_text(removed);
+  if (command_.json || !Question::possible()) {
+    return finish(EXIT_UNCONFIRMED,
+                  "the backup would remove " + what +
+                      "; quarnctl backup --yes does, quarnctl restore on --from " + set.serial +
+                      " gets them back as they are installed");
+  }
+  on_answer_ = nullptr;
+  screen_.line("the backup would remove " + printable(what));
+  question_.ask("back up and remove? [y/N] ", [this](bool yes) {
+    if (done_ || !previewing_) return;
+    if (yes) return start_backup();
+    finish(EXIT_UNCONFIRMED, "not confirmed; nothing was backed up");
+  });
+}
+
+void Session::start_backup() {
+  if (done_ || (!previewing_ && !command_.yes)) return;
+  previewing_ = false;
+  // Whatever is still on its way belongs to the preview.
+  req_id_ = random_request_id();
+  callback_.reset();
+  json_object_object_del(document_.get(), "would_remove");
   on_answer_ = [this] {
     // The final state may overtake the reply; the daemon is not left before it has given both.
     if (!reply_) return;
@@ -340,7 +429,9 @@ void Session::fetch_list(std::function<void(const BackupSets &)> then,
                 " installed?";
         return finish(exit_of(result), error);
       }
-      return otherwise ? otherwise(error) : finish_explained(exit_of(result), error);
+      return otherwise
+                 ? otherwise(error)
+                 : finish_explained(exit_of(result), "getting the application list failed", error);
     }
     if (!reply_ || !callback_) return;
     std::string error;
@@ -549,10 +640,20 @@ void Session::take_status(const Callback &callback) {
   answered();
 }
 
+void Session::take_notices(const ProgressEvent &event) {
+  if (!event.cause.empty()) cause_ = event.cause;
+  if (event.list_written) list_written_ = event.list_written;
+  const std::string notice = notice_text(event);
+  if (notice.empty()) return;
+  json_add(document_.get(), "notice", event.notice);
+  screen_.error("note: " + notice);
+}
+
 void Session::take_progress(const std::string &text) {
-  if (done_ || !called_) return;
+  if (done_ || !called_ || previewing_) return;
   const auto event = parse_progress(text);
   if (!event || !concerns_us(*event)) return;
+  if (command_.verb == Verb::backup) take_notices(*event);
   reported_ = true;
   const std::string line = board_.feed(*event);
   if (screen_.redraws()) {
@@ -632,11 +733,14 @@ void Session::end_watch(bool mode_ended) {
   show_outcomes();
   if (result == QUARN_OK) return finish_with(QUARN_OK, "", "restore finished");
   const std::string error = "not every package was restored: " + result_words(result);
-  return of_the_cloud(result) ? finish_explained(result, error) : finish(result, error);
+  return of_the_cloud(result) ? finish_explained(result, "not every package was restored", error)
+                              : finish(result, error);
 }
 
 void Session::daemon_ended() {
   if (done_ || explaining_ || !called_) return;
+  // One that ended before the backup was asked for is started again by that.
+  if (previewing_) return;
   if (watching_ && all_told()) return end_watch(false);
   if (watching_) {
     std::string missing;
@@ -684,7 +788,7 @@ gboolean Session::on_interrupt(gpointer user_data) {
 
 void Session::interrupt() {
   if (done_) return;
-  if (command_.verb == Verb::backup && called_ && !cancelling_) {
+  if (command_.verb == Verb::backup && called_ && !previewing_ && !cancelling_) {
     cancelling_ = true;
     screen_.line("cancelling the backup; interrupt again to leave at once");
     // The run's own final state tells the outcome, so the answer to this is not waited for.
@@ -710,7 +814,7 @@ gboolean Session::on_timeout(gpointer user_data) {
 void Session::time_out() {
   if (done_) return;
   std::string error = "no answer within " + seconds_words(command_.timeout);
-  if (command_.verb == Verb::backup && called_) {
+  if (command_.verb == Verb::backup && called_ && !previewing_) {
     error = "the backup has not ended within " + seconds_words(command_.timeout) +
             "; it goes on (quarnctl cancel stops it)";
   } else if (watching_) {
@@ -747,26 +851,49 @@ void Session::finish_with(int result, const std::string &what, const std::string
     screen_.line(printable(done));
     return finish(QUARN_OK);
   }
-  const std::string error = what + " failed: " + result_words(result);
-  return of_the_cloud(result) ? finish_explained(exit_of(result), error)
+  const std::string failed = what + " failed";
+  const std::string error = failed + ": " + result_words(result);
+  if (command_.verb == Verb::backup) tell_of_list();
+  return of_the_cloud(result) ? finish_explained(exit_of(result), failed, error)
                               : finish(exit_of(result), error);
 }
 
-void Session::finish_explained(int code, const std::string &error) {
+void Session::tell_of_list() {
+  if (!list_written_) return;
+  json_object_object_add(document_.get(), "list_written", json_object_new_boolean(*list_written_));
+  const auto &outcomes = board_.outcomes();
+  const bool sent = std::any_of(outcomes.begin(), outcomes.end(), [](const auto &package) {
+    return package.outcome == "uploaded" || package.reason == "upload-failed";
+  });
+  if (*list_written_ || !sent) return;
+  screen_.error(
+      "no list was written: what this backup sent of changed packages cannot be restored yet; "
+      "the next backup sends it again");
+}
+
+void Session::finish_explained(int code, const std::string &what, const std::string &error) {
   if (done_ || explaining_) return;
+  // The run's own cause counts, whatever has happened since.
+  if (!cause_.empty()) return finish_for(cause_, code, what, error);
   explaining_ = true;
   client_->read_status(
-      [this, code, error](GVariant *answer) {
-        if (done_) return;
-        const std::string problem = read_status(answer).cloud_problem;
-        const std::string words = cloud_problem_words(problem);
-        if (words.empty()) return finish(code, error);
-        json_add(document_.get(), "cloud_problem", problem);
-        finish(code, error + ": " + words);
+      [this, code, what, error](GVariant *answer) {
+        if (!done_) finish_for(read_status(answer).cloud_problem, code, what, error);
       },
       [this, code, error](const BusFailure &) {
         if (!done_) finish(code, error);
       });
+}
+
+void Session::finish_for(const std::string &problem, int code, const std::string &what,
+                         const std::string &error) {
+  const std::string of_cloud = cloud_problem_words(problem);
+  const std::string of_device = device_problem_words(problem);
+  if (of_cloud.empty() && of_device.empty()) return finish(code, error);
+  json_add(document_.get(), "cloud_problem", problem);
+  if (of_device.empty()) return finish(code, error + ": " + of_cloud);
+  // The code's own words would tell of something else.
+  finish(code, what + ": " + of_device + " (" + std::to_string(code) + ")");
 }
 
 void Session::finish(int code, const std::string &error) {

@@ -119,6 +119,20 @@ std::string cloud_problem_words(const std::string &problem) {
   return found == kWords.end() ? "" : found->second;
 }
 
+std::string device_problem_words(const std::string &problem) {
+  static const std::map<std::string, const char *> kWords = {
+      {"wifi", "Wi-Fi was lost"},
+      {"device-full", "this device has no room left"},
+      {"device-file", "a file on this device could not be read or written"},
+      {"removed", "a package was removed while it was backed up"},
+      {"list-foreign", "the cloud's application list is in a form that this device does not know"},
+      {"list-too-large", "the application list is larger than what devices can read"},
+      {"list-unreadable", "the application list could not be read"},
+      {"list-changed", "another device changed the application list meanwhile"}};
+  const auto found = kWords.find(problem);
+  return found == kWords.end() ? "" : found->second;
+}
+
 DaemonStatus read_status(GVariant *answer) {
   const GVariantPtr properties(g_variant_get_child_value(answer, 0));
   GVariant *all = properties.get();
@@ -159,6 +173,7 @@ std::string status_text(const DaemonStatus &status, std::int64_t now_ms) {
   std::string device = status.model + (both ? ", " : "") + status.serial;
   if (device.empty()) device = kUnknown;
   const std::string problem = cloud_problem_words(status.cloud_problem);
+  const std::string own_problem = device_problem_words(status.cloud_problem);
   return line("device", printable(device)) +
          line("automatic backup", choice(status.auto_backup, "on", "off")) +
          line("charger", choice(status.charger, "connected", "not connected")) +
@@ -169,7 +184,8 @@ std::string status_text(const DaemonStatus &status, std::int64_t now_ms) {
          line("last backup", last_backup_text(status, now_ms)) +
          line("backup", choice(status.backup_running, "running", "not running")) +
          line("restore mode", restore_text(status)) +
-         (problem.empty() ? "" : line("cloud", problem));
+         (problem.empty() ? "" : line("cloud", problem)) +
+         (own_problem.empty() ? "" : line("last problem", own_problem));
 }
 
 void status_to_json(const DaemonStatus &status, std::int64_t now_ms, json_object *object) {

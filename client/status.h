@@ -45,6 +45,9 @@ void status_to_json(const DaemonStatus &status, std::int64_t now_ms, json_object
 /** What a word for the cloud's problem means; empty for none and for words of a later daemon. */
 std::string cloud_problem_words(const std::string &problem);
 
+/** The same for what is the device's own trouble, or the application list's. */
+std::string device_problem_words(const std::string &problem);
+
 /** A length of time in its largest two units: "3 d 4 h", "12 min 5 s". */
 std::string duration_text(std::int64_t ms);
 

@@ -87,8 +87,14 @@ outcome_words words(backup_outcome outcome) {
       return {"skipped", "no-space"};
     case backup_outcome::disabled:
       return {"skipped", "disabled"};
+    case backup_outcome::removed:
+      return {"skipped", "removed"};
+    case backup_outcome::too_deep:
+      return {"skipped", "too-deep"};
     case backup_outcome::unreadable:
       return {"skipped", "unreadable"};
+    case backup_outcome::restoring:
+      return {"skipped", "restoring"};
     case backup_outcome::upload_failed:
       return {"failed", "upload-failed"};
   }
@@ -178,7 +184,14 @@ std::string backup_progress_text(const backup_progress &progress) {
   put(root, "reason", settled.reason);
   if (progress.size != 0) put(root, "size", progress.size);
   if (progress.limit != 0) put(root, "cap", progress.limit);
-  if (progress.stage == backup_stage::finished) put(root, "result", progress.result);
+  if (*progress.notice != '\0') put(root, "notice", progress.notice);
+  if (progress.stage == backup_stage::finished) {
+    put(root, "result", progress.result);
+    if (*progress.cause != '\0') put(root, "cause", progress.cause);
+    if (progress.result != QUARN_OK) {
+      json_object_object_add(root, "list_written", json_object_new_boolean(progress.list_written));
+    }
+  }
   return text_of(root);
 }
 
@@ -202,8 +215,8 @@ std::string restore_progress_text(const restore_progress &progress) {
 }
 
 void note_backup_progress(const backup_progress &progress) {
-  const bool settled =
-      progress.outcome != backup_outcome::none || progress.stage == backup_stage::finished;
+  const bool settled = progress.outcome != backup_outcome::none || *progress.notice != '\0' ||
+                       progress.stage == backup_stage::finished;
   leave({backup_progress_text(progress), std::string("backup ") + stage_name(progress.stage),
          settled});
   // A client stops listening with its final status, which follows: everything goes out before.

@@ -3,14 +3,17 @@
 #include <atomic>
 #include <cstdint>
 #include <map>
+#include <set>
 #include <string>
 
 #include "platform_device.h"
+#include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/request_cause.h"
 #include "quarn_log.h"
 
 const char kStatusIntrospection[] =
@@ -38,12 +41,18 @@ const char kStatusIntrospection[] =
     "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"const\"/>"
     "</property>"
     "</interface>"
+    "<interface name=\"org.orvane.Quarn.CleanUp\">"
+    "<property name=\"KeptPackages\" type=\"as\" access=\"read\">"
+    "<annotation name=\"org.freedesktop.DBus.Property.EmitsChangedSignal\" value=\"false\"/>"
+    "</property>"
+    "</interface>"
     "</node>";
 
 namespace {
 
 GDBusConnection *status_connection = nullptr;
 guint status_registration = 0;
+guint clean_up_registration = 0;
 std::atomic<bool> refresh_queued{false};
 std::atomic<bool> served{false};
 
@@ -87,6 +96,9 @@ GVariant *device_text(bool serial) {
 }
 
 GVariant *cloud_problem() {
+  // The last run's or request's own, whatever the transport has served since.
+  const request_cause noted = last_request_cause();
+  if (noted != request_cause::none) return g_variant_new_string(request_cause_word(noted));
   const backup_trans_cause cause = backup_trans_last_cause();
   return g_variant_new_string(cause == BACKUP_TRANS_CAUSE_NONE ? ""
                                                                : backup_trans_cause_word(cause));
@@ -115,6 +127,22 @@ GVariant *get_property(GDBusConnection *, const gchar *, const gchar *, const gc
                        const gchar *property, GError **, gpointer) {
   return value_of(property);
 }
+
+GVariant *get_kept_packages(GDBusConnection *, const gchar *, const gchar *, const gchar *,
+                            const gchar *, GError **error, gpointer) {
+  std::set<std::string> kept;
+  if (!packages_kept_by_backup(&kept)) {
+    g_set_error_literal(error, G_DBUS_ERROR, G_DBUS_ERROR_FAILED,
+                        "the installed packages are not all known");
+    return nullptr;
+  }
+  GVariantBuilder builder;
+  g_variant_builder_init(&builder, G_VARIANT_TYPE("as"));
+  for (const std::string &package : kept) g_variant_builder_add(&builder, "s", package.c_str());
+  return g_variant_builder_end(&builder);
+}
+
+const GDBusInterfaceVTable kCleanUpTable = {nullptr, get_kept_packages, nullptr, {nullptr}};
 
 const GDBusInterfaceVTable kStatusTable = {nullptr, get_property, nullptr, {nullptr}};
 
@@ -164,6 +192,11 @@ void quarnd_status_export(GDBusConnection *connection) {
   status_registration =
       g_dbus_connection_register_object(connection, kStatusObjectPath, node->interfaces[0],
                                         &kStatusTable, nullptr, nullptr, out(error));
+  if (status_registration != 0) {
+    clean_up_registration =
+        g_dbus_connection_register_object(connection, kStatusObjectPath, node->interfaces[1],
+                                          &kCleanUpTable, nullptr, nullptr, out(error));
+  }
   g_dbus_node_info_unref(node);
   if (status_registration == 0) {
     LOGE("status object is not available: %s", error->message);
@@ -177,6 +210,10 @@ void quarnd_status_unexport() {
   served = false;
   if (status_connection == nullptr) return;
   g_dbus_connection_unregister_object(status_connection, status_registration);
+  if (clean_up_registration != 0) {
+    g_dbus_connection_unregister_object(status_connection, clean_up_registration);
+  }
+  clean_up_registration = 0;
   status_connection = nullptr;
   status_registration = 0;
   last_told().clear();

@@ -1,11 +1,15 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cstring>
 #include <limits>
 
 #include "quarn_common.h"
+#include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/model_entries.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
@@ -143,6 +147,55 @@ bool prepare_file(const std::string &path) {
          fchmod(fd.get(), kPrivateFile) == 0;
 }
 
+/** Whether the list's text may be written: what is written must be readable again. */
+bool fits_bound(backup_context *ctx, std::uint64_t size) {
+  run_notes &notes = notes_of(ctx);
+  notes.list_size = size;
+  notes.list_too_large = size > kMaxAppListSize;
+  if (notes.list_too_large) {
+    LOGE("app list would have %llu bytes, but at the most %llu can be read again",
+         static_cast<unsigned long long>(size), static_cast<unsigned long long>(kMaxAppListSize));
+    note_cause(ctx, request_cause::list_too_large);
+    return false;
+  }
+  if (size >= kNearlyFullAppListSize) {
+    LOGW("app list is nearly full : %llu of %llu bytes", static_cast<unsigned long long>(size),
+         static_cast<unsigned long long>(kMaxAppListSize));
+    report_notice(ctx, "list-nearly-full", size, kMaxAppListSize);
+  }
+  return true;
+}
+
+/** Write the document's text. @return true when the file is whole */
+bool write_document(backup_context *ctx, const std::string &path) {
+  const char *text = json_object_get_string(ctx->app_list_root.get());
+  if (text == nullptr || !fits_bound(ctx, std::strlen(text))) return false;
+  if (!prepare_file(path)) {
+    LOGE("cannot create app list file %s", path.c_str());
+    return false;
+  }
+  return write_string_to_file(text, path) == QUARN_OK;
+}
+
+/**
+ * Make the document of @p text anew, with what is claimed and not in it.
+ * @return false when that is no list of ours
+ */
+bool amend_document(backup_context *ctx, CString text) {
+  // a rebase reads the text's own entries as the previous ones
+  std::vector<pkg_information> previous;
+  previous.swap(ctx->previous_pkg_list);
+  ctx->cloud_app_list_text = std::move(text);
+  rebase_app_list_info(ctx, ctx->model_name.c_str(), ctx->serial_number.c_str());
+  previous.swap(ctx->previous_pkg_list);
+  if (!ctx->app_list_root) return false;
+  notes_of(ctx).listed.clear();
+  for (const pkg_information &entry : previous) {
+    add_pkg_info_to_app_list(ctx, entry.pkg_id.c_str(), entry.version.c_str(), entry.crc);
+  }
+  return true;
+}
+
 }  // namespace
 
 json_object *generate_new_json_object(backup_context *ctx) {
@@ -186,6 +239,7 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
   ctx->app_list_root.reset(generate_new_json_tokener_parser(ctx, list.frame.c_str()));
   own_entry own;
   bool too_deep = false;
+  notes_of(ctx).list_understood = false;
   if (!ctx->app_list_root) {
     parse_whole_json(list.frame, JSON_TOKENER_DEFAULT_DEPTH, &too_deep);
   } else if (!find_own_entry(list, serial, &own, &too_deep)) {
@@ -212,6 +266,8 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
     return QUARN_OK;
   }
 
+  notes_of(ctx).list_understood = true;
+  notes_of(ctx).serial_listed = own.entry != nullptr;
   for (std::size_t i = 0; i < list.entries.size(); ++i) {
     if (own.entry && own.index == i) continue;
     json_object_array_put_idx(ctx->model_list, i, new_json_from_text(list.entries[i]));
@@ -266,6 +322,7 @@ void get_previous_package_list_info(backup_context *ctx,
 void add_pkg_info_to_app_list(backup_context *ctx, const char *pkg_id, const char *version,
                               int crc) {
   if (ctx->pkg_list == nullptr) return;
+  if (!ctx->for_pellix) notes_of(ctx).listed.insert(listed_key(pkg_id, version));
   JsonPtr package(json_object_new_object());
   json_object_object_add(package.get(), kPkgId, json_object_new_string(pkg_id));
   json_object_object_add(package.get(), kVersion, json_object_new_string(version));
@@ -278,18 +335,47 @@ void add_pkg_info_to_app_list(backup_context *ctx, const char *pkg_id, const cha
 bool save_app_list_to_file(backup_context *ctx) {
   const std::string path = ctx->for_pellix ? companion_list_path() : kLocalAppListPath;
   bool saved = false;
-  if (ctx->app_list_root && (ctx->for_pellix || prepare_staging_directory())) {
-    if (!prepare_file(path)) {
-      LOGE("cannot create app list file %s", path.c_str());
-    } else {
-      const char *text = json_object_get_string(ctx->app_list_root.get());
-      saved = text != nullptr && write_string_to_file(text, path) == QUARN_OK;
-    }
+  if (!ctx->app_list_root) {
+    note_cause(ctx, request_cause::list_foreign);
+  } else if (ctx->for_pellix || prepare_staging_directory()) {
+    saved = write_document(ctx, path);
   }
+  // before what takes the room is deleted
+  if (!saved) note_cause(ctx, cause_of_local_file(path));
   // half a list, or one of another run, must not be taken for this run's
   if (!saved) delete_staged_file(path);
+  notes_of(ctx).list_staged = saved;
   release_json_resource_of_app_list(ctx);
   return saved;
+}
+
+std::string listed_key(const std::string &pkg_id, const std::string &version) {
+  return pkg_id + '/' + version;
+}
+
+bool claimed_package_is_missing(backup_context *ctx) {
+  const std::vector<std::string> claimed = claimed_packages(ctx->serial_number);
+  if (claimed.empty()) return false;
+  const std::set<std::string> &listed = notes_of(ctx).listed;
+  return std::any_of(ctx->previous_pkg_list.begin(), ctx->previous_pkg_list.end(),
+                     [&](const auto &previous) {
+                       return std::binary_search(claimed.begin(), claimed.end(), previous.pkg_id) &&
+                              listed.count(listed_key(previous.pkg_id, previous.version)) == 0;
+                     });
+}
+
+bool add_claimed_packages_to_list(backup_context *ctx, CString text) {
+  if (!amend_document(ctx, std::move(text))) return false;
+  for (const pkg_information &previous : ctx->previous_pkg_list) {
+    if (claim_on_archive(ctx->serial_number, previous.pkg_id) == archive_claim::none ||
+        notes_of(ctx).listed.count(listed_key(previous.pkg_id, previous.version)) != 0) {
+      continue;
+    }
+    LOGI("(%s) stays in the list : a restore is to have it", previous.pkg_id.c_str());
+    add_pkg_info_to_app_list(ctx, previous.pkg_id.c_str(), previous.version.c_str(), previous.crc);
+    ctx->unexamined_pkg_ids.push_back(previous.pkg_id);
+  }
+  return save_app_list_to_file(ctx);
 }
 
 void release_json_resource_of_app_list(backup_context *ctx) {

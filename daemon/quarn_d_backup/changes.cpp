@@ -2,9 +2,13 @@
 #include <cstring>
 
 #include "quarn_common.h"
+#include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/own_backup.h"
+#include "quarn_d_backup/package_trouble.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 namespace {
@@ -94,37 +98,74 @@ void keep_unexamined(backup_context *ctx, const char *pkg_id) {
   }
 }
 
-/**
- * What stays in the cloud stays in the list: the last list's entries of
- * packages that could not be examined.
- */
-void list_unexamined_packages(backup_context *ctx) {
-  if (ctx->package_walk_complete && ctx->unexamined_pkg_ids.empty()) return;
-  std::vector<std::string> listed;
-  listed.reserve(ctx->current_pkg_list.size());
-  for (const pkg_information &package : ctx->current_pkg_list) listed.push_back(package.pkg_id);
-  std::sort(listed.begin(), listed.end());
-  std::sort(ctx->unexamined_pkg_ids.begin(), ctx->unexamined_pkg_ids.end());
-  for (const pkg_information &previous : ctx->previous_pkg_list) {
-    if (std::binary_search(listed.begin(), listed.end(), previous.pkg_id)) continue;
-    if (!ctx->package_walk_complete ||
-        std::binary_search(ctx->unexamined_pkg_ids.begin(), ctx->unexamined_pkg_ids.end(),
-                           previous.pkg_id)) {
-      add_pkg_info_to_app_list(ctx, previous.pkg_id.c_str(), previous.version.c_str(),
-                               previous.crc);
-    }
-  }
+/** True when a package that the walk did not see keeps its entries all the same. */
+bool stays_unseen(const backup_context *ctx, const std::string &pkg_id) {
+  return !ctx->package_walk_complete || notes_of(ctx).keep_all_listed ||
+         std::binary_search(ctx->unexamined_pkg_ids.begin(), ctx->unexamined_pkg_ids.end(),
+                            pkg_id) ||
+         claim_on_archive(ctx->serial_number, pkg_id) != archive_claim::none ||
+         (notes_of(ctx).packages_seen == 0 &&
+          is_directory((std::string(kAppsDir) + pkg_id).c_str())) ||
+         may_be_installed(pkg_id);
 }
 
-bool any_directory_unreadable(const std::string &root) {
-  return std::any_of(std::begin(kDataDirs), std::end(kDataDirs), [&](const char *dir) {
-    return safe_opendir((root + dir).c_str()) == nullptr;
-  });
+/** True when a package that is listed keeps the entries of its other versions. */
+bool keeps_other_versions(const backup_context *ctx, const std::string &pkg_id) {
+  return notes_of(ctx).keep_all_listed ||
+         claim_on_archive(ctx->serial_number, pkg_id) != archive_claim::none;
+}
+
+/**
+ * What stays in the cloud stays in the list: the last list's entries of
+ * packages that could not be examined, and of those that are to come back.
+ */
+void list_kept_packages(backup_context *ctx) {
+  std::vector<std::string> seen;
+  seen.reserve(ctx->current_pkg_list.size());
+  for (const pkg_information &package : ctx->current_pkg_list) seen.push_back(package.pkg_id);
+  std::sort(seen.begin(), seen.end());
+  std::sort(ctx->unexamined_pkg_ids.begin(), ctx->unexamined_pkg_ids.end());
+  std::vector<std::string> kept;
+  for (const pkg_information &previous : ctx->previous_pkg_list) {
+    const std::string &pkg_id = previous.pkg_id;
+    if (notes_of(ctx).listed.count(listed_key(pkg_id, previous.version)) != 0) continue;
+    const bool was_seen = std::binary_search(seen.begin(), seen.end(), pkg_id);
+    if (was_seen ? !keeps_other_versions(ctx, pkg_id) : !stays_unseen(ctx, pkg_id)) continue;
+    add_pkg_info_to_app_list(ctx, pkg_id.c_str(), previous.version.c_str(), previous.crc);
+    kept.push_back(pkg_id);
+  }
+  ctx->unexamined_pkg_ids.insert(ctx->unexamined_pkg_ids.end(), kept.begin(), kept.end());
+}
+
+/** Whether the backup in the cloud is this device's own, as far as it knows. */
+void look_for_unknown_backup(backup_context *ctx) {
+  run_notes &notes = notes_of(ctx);
+  const std::string &serial = ctx->serial_number;
+  if (!notes.list_understood) return;
+  if (!notes.serial_listed) {
+    note_own_backup(serial);
+  } else if (!ctx->is_manual && !knows_own_backup(serial)) {
+    LOGI("backup in cloud is older than what this device knows of, so all of it is kept");
+    note_found_backup();
+    notes.keep_all_listed = true;
+  }
 }
 
 void report_package(backup_context *ctx, backup_outcome outcome, std::uint64_t size = 0,
                     std::uint64_t limit = 0) {
   report_progress(ctx, backup_stage::archiving, ctx->cur_pkg_id.c_str(), outcome, size, limit);
+}
+
+/** A size that is too large may be that of a folder that cannot be measured. */
+void report_oversize(backup_context *ctx, backup_outcome outcome, std::uint64_t size,
+                     std::uint64_t limit) {
+  const backup_outcome trouble =
+      size < kUnmeasurableSize ? backup_outcome::none : find_package_trouble(ctx->cur_root_path);
+  if (trouble == backup_outcome::none) {
+    report_package(ctx, outcome, size, limit);
+  } else {
+    report_package(ctx, trouble);
+  }
 }
 
 /** make_app_data_zip() between taking the staged archive and settling what becomes of it. */
@@ -143,7 +184,8 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (error != QUARN_OK) {
     LOGE("fail to make zip data for %s", ctx->cur_pkg_id.c_str());
     delete_staged_file(archive_path);
-    report_package(ctx, backup_outcome::unreadable);
+    const backup_outcome trouble = find_package_trouble(ctx->cur_root_path);
+    report_package(ctx, trouble == backup_outcome::none ? backup_outcome::unreadable : trouble);
     return error;
   }
 
@@ -176,16 +218,12 @@ int check_current_backup_size(backup_context *ctx) {
   if (size > available) {
     LOGE("app backup size(=%llu) exceed available space size(=%llu), so can not backup data",
          static_cast<unsigned long long>(size), static_cast<unsigned long long>(available));
-    report_package(ctx, backup_outcome::no_space, size, available);
+    report_oversize(ctx, backup_outcome::no_space, size, available);
     return QUARN_SKIPPED;
   }
   if (size > kMaxBackupSize) {
     LOGI("app backup size exceed %dMB, so will not backup data", kMaxBackupMegabytes);
-    if (any_directory_unreadable(ctx->cur_root_path)) {
-      report_package(ctx, backup_outcome::unreadable);
-    } else {
-      report_package(ctx, backup_outcome::too_large, size, kMaxBackupSize);
-    }
+    report_oversize(ctx, backup_outcome::too_large, size, kMaxBackupSize);
     return QUARN_SKIPPED;
   }
   return QUARN_OK;
@@ -194,18 +232,32 @@ int check_current_backup_size(backup_context *ctx) {
 int make_backup_items(backup_context *ctx) {
   forget_single_uploads();
   if (!create_app_list_info(ctx)) return QUARN_FAILED;
+  look_for_unknown_backup(ctx);
   const int ret = package_manager_foreach_package_info(foreach_package_info_callback, ctx);
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_manager_foreach_package_info() failed %d", ret);
     ctx->package_walk_complete = false;
   }
-  list_unexamined_packages(ctx);
+  list_kept_packages(ctx);
   save_app_list_to_file(ctx);
-  return QUARN_OK;
+  return notes_of(ctx).list_too_large ? QUARN_FAILED : QUARN_OK;
+}
+
+bool may_be_installed(const std::string &pkg_id) {
+  PackageInfoPtr info;
+  const int ret = package_manager_get_package_info(pkg_id.c_str(), out(info));
+  if (ret == PACKAGE_MANAGER_ERROR_NO_SUCH_PACKAGE) return false;
+  if (ret != PACKAGE_MANAGER_ERROR_NONE) return true;
+  bool preload = false;
+  // a preloaded one is not backed up, so it is not missed either
+  return info != nullptr &&
+         !(package_info_is_preload_package(info.get(), &preload) == PACKAGE_MANAGER_ERROR_NONE &&
+           preload);
 }
 
 bool foreach_package_info_callback(package_info_h info, void *user_data) {
   auto *ctx = static_cast<backup_context *>(user_data);
+  ++notes_of(ctx).packages_seen;
   bool preload = false;
   int ret = package_info_is_preload_package(info, &preload);
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {
@@ -235,6 +287,14 @@ bool foreach_package_info_callback(package_info_h info, void *user_data) {
   ctx->cur_root_path = values.root.get();
   ctx->cur_backup_enabled = true;
   ctx->cur_crc = 0;
+
+  if (!ctx->for_pellix &&
+      claim_on_archive(ctx->serial_number, ctx->cur_pkg_id) == archive_claim::whole) {
+    LOGI("backup of (%s) waits for its restore", ctx->cur_pkg_id.c_str());
+    report_package(ctx, backup_outcome::restoring);
+    keep_unexamined(ctx, ctx->cur_pkg_id.c_str());
+    return true;
+  }
 
   ret = package_info_foreach_app_from_package(info, PACKAGE_INFO_ALLAPP, check_backup_enabled, ctx);
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {

@@ -6,6 +6,9 @@
 
 #include "backup_transport.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/list_bound.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
@@ -14,8 +17,6 @@ namespace {
 
 constexpr char kWaitedForSuffix[] = ".waited_for.";
 constexpr char kArchiveSuffix[] = ".zip";
-// Some forty thousand packages; a longer one would not fit the daemon's memory.
-constexpr std::uint64_t kMaxAppListSize = std::uint64_t{4} << 20;
 
 /** A transfer of the application list. */
 struct app_list_transfer {
@@ -40,7 +41,8 @@ struct folder_child {
 /** One clean-up: the listing of a folder, and what of it stays. */
 struct cleanup_listing {
   BackupContextPtr ctx;
-  std::string folder;  // ends with "/"
+  std::string folder;   // ends with "/"
+  std::string package;  // whose versions these are; empty for a clean-up of packages
   std::unordered_set<std::string> keep;
   std::vector<folder_child> children;  // of the pages so far
 };
@@ -96,6 +98,16 @@ bool read_app_list_file(const std::string &path, CString *text) {
   return false;
 }
 
+request_cause cause_of_unread_list(const std::string &path) {
+  return staged_file_size(path) > kMaxAppListSize ? request_cause::list_too_large
+                                                  : request_cause::list_unreadable;
+}
+
+/** A run of one package ends with its upload. */
+void note_single_end(backup_context *ctx) {
+  if (ctx->single_package) note_request_end(notes_of(ctx).cause);
+}
+
 void __get_app_list_from_cloud_cb(backup_trans_error_code error, void *user_data, char *) {
   const std::unique_ptr<app_list_transfer> record(static_cast<app_list_transfer *>(user_data));
   if (record == nullptr) {
@@ -109,11 +121,13 @@ void __get_app_list_from_cloud_cb(backup_trans_error_code error, void *user_data
   if (error == BACKUP_TRANS_ERROR_NONE) {
     LOGI("success : get app list file from cloud");
     checked = read_app_list_file(record->local_path, &text);
+    if (!checked) note_cause(ctx, cause_of_unread_list(record->local_path));
   } else if (error == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) {
     LOGI("app list file is not exist in cloud");
     checked = true;
   } else {
     LOGE("backup_trans_download_file_ors failed... %d", error);
+    note_cause(ctx, cause_of_transfer(error, record->local_path));
   }
   // nobody waits for an abandoned run's list
   if (!ctx->abandoned) ctx->cloud_app_list_text = std::move(text);
@@ -138,8 +152,10 @@ void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
   } else {
     LOGE("upload app data of (%s) failed...err_code[%d]", record->pkg_id.c_str(), error);
     outcome = backup_outcome::upload_failed;
+    note_cause(ctx, cause_of_transfer(error, record->local_path));
     set_result_once(ctx, QUARN_TRANSFER_FAILED);
   }
+  note_single_end(ctx);
   ++ctx->uploads_answered;
   report_progress(ctx, backup_stage::uploading, record->pkg_id.c_str(), outcome, record->size);
   delete_staged_file(record->local_path);
@@ -164,8 +180,10 @@ void __upload_app_list_resp_cb(backup_trans_error_code error, void *user_data,
   backup_context *ctx = record->ctx.get();
   if (error == BACKUP_TRANS_ERROR_NONE) {
     LOGI("backup trans success : app list upload");
+    notes_of(ctx).list_written = true;
   } else {
     LOGE("__upload_app_list_resp_cb failed...err_code[%d]", error);
+    note_cause(ctx, cause_of_transfer(error, record->local_path));
     set_result_once(ctx, QUARN_TRANSFER_FAILED);
   }
   delete_staged_file(record->local_path);
@@ -256,11 +274,26 @@ void request_listing(std::unique_ptr<cleanup_listing> record, const cleanup_kind
   --(ctx->*kind.listings_pending);
 }
 
+/** False for a package that a restore is to have, or that is there after all. */
+bool may_remove(const cleanup_listing &record, const std::string &package) {
+  if (claim_on_archive(record.ctx->serial_number, package) != archive_claim::none) {
+    LOGI("(%s) stays in cloud : a restore is to have it", package.c_str());
+    return false;
+  }
+  if (record.package.empty() && may_be_installed(package)) {
+    LOGE("(%s) stays in cloud : it may be installed", package.c_str());
+    return false;
+  }
+  return true;
+}
+
 /** Delete what does not stay. */
 void delete_listed_folders(const cleanup_listing &record, const cleanup_kind &kind) {
   for (const folder_child &child : record.children) {
     if (child.is_file || record.keep.count(child.path) != 0) continue;
     if (!is_child_of(record.folder, child.path) || uploaded_by_single_request(child.path)) continue;
+    const std::string name = child.path.substr(record.folder.size());
+    if (!may_remove(record, record.package.empty() ? name : record.package)) continue;
     request_folder_deletion(record.ctx.get(), kind, child.path);
   }
 }
@@ -348,7 +381,9 @@ void forget_single_uploads() {
 int get_app_list_from_cloud(backup_context *ctx) {
   // Held to the run's last callback: a list or a deletion of an abandoned run
   // must not come in between.
-  if (!acquire_staged_archive(ctx, kStagedListLease) || !prepare_staging_directory()) {
+  if (!acquire_staged_archive(ctx, kStagedListLease)) return QUARN_LIST_CHECK_FAILED;
+  if (!prepare_staging_directory()) {
+    note_cause(ctx, cause_of_local_file(kLocalAppListPath));
     return QUARN_LIST_CHECK_FAILED;
   }
   auto record = std::make_unique<app_list_transfer>();
@@ -364,6 +399,7 @@ int get_app_list_from_cloud(backup_context *ctx) {
     return QUARN_OK;
   }
   LOGE("backup_trans_download_file_ors_async failed... %d", ret);
+  note_cause(ctx, cause_of_transfer(ret, record->local_path));
   ctx->app_list_downloading = false;
   if (ctx->cloud_app_list_text) ctx->cloud_app_list_text.get()[0] = '\0';
   delete_staged_file(record->local_path);
@@ -423,12 +459,16 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
     return;
   }
   LOGE("backup_trans_upload_file_ors_async failed... %d", ret);
+  // with the package its staged archive goes
+  const bool removed = !is_directory(root_path);
+  note_cause(ctx, removed ? request_cause::removed : cause_of_transfer(ret, record->local_path));
   delete_staged_file(record->local_path);
   set_result_once(ctx, QUARN_TRANSFER_FAILED);
+  note_single_end(ctx);
   release_staged_archive(ctx, record->pkg_id);
   ++ctx->uploads_answered;
-  report_progress(ctx, backup_stage::uploading, pkg_id, backup_outcome::upload_failed,
-                  record->size);
+  report_progress(ctx, backup_stage::uploading, pkg_id,
+                  removed ? backup_outcome::removed : backup_outcome::upload_failed, record->size);
   --ctx->upload_remain;
 }
 
@@ -448,6 +488,7 @@ int upload_app_list(backup_context *ctx) {
     return 1;
   }
   LOGE("backup_trans_upload_file_ors_async failed... %d", ret);
+  note_cause(ctx, cause_of_transfer(ret, record->local_path));
   delete_staged_file(record->local_path);
   set_result_once(ctx, QUARN_TRANSFER_FAILED);
   ctx->app_list_uploading = false;
@@ -457,6 +498,10 @@ int upload_app_list(backup_context *ctx) {
 void delete_other_backup_items_in_cloud(backup_context *ctx) {
   if (!ctx->package_walk_complete) {
     LOGE("not every package could be examined, so no package is removed from cloud");
+    return;
+  }
+  if (notes_of(ctx).keep_all_listed) {
+    LOGI("no package is removed from cloud by an automatic backup of a device that was reset");
     return;
   }
   auto record = std::make_unique<cleanup_listing>();
@@ -473,6 +518,7 @@ void delete_other_backup_items_in_cloud(backup_context *ctx) {
 }
 
 void delete_other_pkg_version_in_cloud(backup_context *ctx) {
+  if (notes_of(ctx).keep_all_listed) return;
   for (const pkg_information &package : ctx->upload_list) {
     delete_other_version_in_cloud(ctx, ctx->serial_number, package.pkg_id, package.version);
   }
@@ -483,6 +529,7 @@ void delete_other_version_in_cloud(backup_context *ctx, const std::string &seria
   auto record = std::make_unique<cleanup_listing>();
   record->ctx = share_backup_context(ctx);
   record->folder = package_folder(serial, pkg_id) + "/";
+  record->package = pkg_id;
   record->keep.insert(version_folder(serial, pkg_id, version));
   ++ctx->version_list_pending;
   request_listing(std::move(record), kVersionCleanup);

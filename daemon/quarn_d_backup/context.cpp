@@ -8,6 +8,7 @@
 #include <mutex>
 
 #include "quarn_common.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
@@ -80,12 +81,19 @@ void release_all_staged_archives(backup_context *ctx) {
 
 }  // namespace
 
-backup_context::backup_context() : run_id(++last_run_id) {}
+backup_context::backup_context() : notes(std::make_shared<run_notes>()), run_id(++last_run_id) {}
 
 backup_context::~backup_context() {
   release_all_staged_archives(this);
   GMainLoop *loop = wait_loop.exchange(nullptr);
   if (loop != nullptr) g_main_loop_unref(loop);
+}
+
+run_notes &notes_of(const backup_context *ctx) { return *ctx->notes; }
+
+void note_cause(backup_context *ctx, request_cause cause) {
+  request_cause none = request_cause::none;
+  ctx->notes->cause.compare_exchange_strong(none, cause);
 }
 
 BackupContextPtr share_backup_context(backup_context *ctx) {

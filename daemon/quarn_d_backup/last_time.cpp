@@ -1,5 +1,6 @@
 #include "platform_settings.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/own_backup.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
@@ -19,7 +20,10 @@ void store_last_backup_time(std::uint64_t time) {
 
 }  // namespace
 
-void init_last_backup_time() { store_last_backup_time(0); }
+void init_last_backup_time() {
+  keep_knowledge_of_last_backup();
+  store_last_backup_time(0);
+}
 
 void set_last_backup_time() {
   store_last_backup_time(static_cast<std::uint64_t>(_get_current_timestamp()));

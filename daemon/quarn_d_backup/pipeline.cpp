@@ -2,6 +2,8 @@
 
 #include "backup_transport.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/own_backup.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
@@ -33,6 +35,7 @@ enum class Transfers { kLeave, kCancel };
 bool stop_without_wifi(backup_context *ctx, Transfers transfers) {
   if (backup_wifi_connected() != 0) return false;
   LOGE("WIFI disconnected");
+  note_cause(ctx, request_cause::wifi);
   if (transfers == Transfers::kCancel) backup_trans_cancel_request(cloud_handler());
   abandon(ctx, QUARN_TRANSFER_FAILED);
   return true;
@@ -130,6 +133,42 @@ bool upload_list_of_items(backup_context *ctx) {
   return answered && ctx->result == QUARN_OK;
 }
 
+/** A run that has no list to write sends nothing: it could not be restored. */
+bool has_list(backup_context *ctx) {
+  if (notes_of(ctx).list_staged) return true;
+  LOGE("there is no app list to upload, so no app data is uploaded");
+  ctx->result = QUARN_TRANSFER_FAILED;
+  return false;
+}
+
+/** Stage the list @p text with what a restore is to have. @return false when that failed */
+bool stage_claimed(backup_context *ctx, CString text) {
+  if (!text || !add_claimed_packages_to_list(ctx, std::move(text))) {
+    ctx->result = notes_of(ctx).list_too_large ? QUARN_FAILED : QUARN_TRANSFER_FAILED;
+    return false;
+  }
+  return true;
+}
+
+/** Restore mode may have been switched on since the list was made. */
+bool refresh_staged_list(backup_context *ctx) {
+  if (ctx->result != QUARN_OK || !claimed_package_is_missing(ctx)) return true;
+  CString text;
+  read_data_from_file(kLocalAppListPath, out(text));
+  return stage_claimed(ctx, std::move(text));
+}
+
+/** Or while it was on its way: then it is written once more. */
+bool write_missing_claims(backup_context *ctx) {
+  while (claimed_package_is_missing(ctx)) {
+    if (!check_app_list(ctx) || !stage_claimed(ctx, std::move(ctx->cloud_app_list_text)) ||
+        !upload_list_of_items(ctx)) {
+      return false;
+    }
+  }
+  return true;
+}
+
 bool cleanup_pending(const backup_context *ctx) {
   return ctx->serial_clean_pending != 0 || ctx->pkg_delete_pending != 0 ||
          ctx->version_list_pending != 0 || ctx->version_delete_pending != 0;
@@ -159,10 +198,12 @@ void run_stages(backup_context *ctx) {
   if (backup_context_init(ctx) != QUARN_OK) return;
   if (backup_wifi_connected() == 0) {
     LOGE("WIFI disconnected");
+    note_cause(ctx, request_cause::wifi);
     ctx->result = QUARN_TRANSFER_FAILED;
     return;
   }
-  if (check_app_list(ctx) && make_items(ctx) && upload_items(ctx) && upload_list_of_items(ctx)) {
+  if (check_app_list(ctx) && make_items(ctx) && has_list(ctx) && upload_items(ctx) &&
+      refresh_staged_list(ctx) && upload_list_of_items(ctx) && write_missing_claims(ctx)) {
     clean_up_cloud(ctx);
   }
 }
@@ -190,6 +231,7 @@ void finish_manual_backup(backup_context *ctx) {
     ctx->result = QUARN_CANCELLED;
   } else if (ctx->result == QUARN_OK) {
     set_last_backup_time();
+    note_own_backup(ctx->serial_number);
     LOGI("manual backup successful!");
     report_to_client(ctx, QUARN_BACKUP_SUCCEEDED);
     return;
@@ -202,6 +244,7 @@ void finish_manual_backup(backup_context *ctx) {
 void finish_auto_backup(backup_context *ctx) {
   if (ctx->result == QUARN_OK) {
     set_last_backup_time();
+    if (!notes_of(ctx).keep_all_listed) note_own_backup(ctx->serial_number);
     LOGI("auto backup successful!");
   } else {
     LOGE("auto backup couldn't be completed... cause=%d", ctx->result.load());
@@ -227,6 +270,7 @@ void do_backup(bool is_manual, void *client) {
 void finish_backup(backup_context *ctx) {
   // before the client is told: its answer may take long
   drop_unsent_archives(ctx);
+  note_request_end(ctx->result == QUARN_OK ? request_cause::none : notes_of(ctx).cause.load());
   if (ctx->is_manual) {
     finish_manual_backup(ctx);
   } else {

@@ -1,3 +1,5 @@
+#include "quarn_common.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 
 namespace {
@@ -28,5 +30,24 @@ void report_progress(const backup_context *ctx, backup_stage stage, const char *
   progress.size = size;
   progress.limit = limit;
   progress.result = ctx->result;
+  if (stage == backup_stage::finished) {
+    const run_notes &notes = notes_of(ctx);
+    if (ctx->result != QUARN_OK) progress.cause = request_cause_word(notes.cause);
+    progress.list_written = notes.list_written;
+  }
+  sink(progress);
+}
+
+void report_notice(const backup_context *ctx, const char *notice, std::uint64_t size,
+                   std::uint64_t limit) {
+  const backup_progress_sink sink = progress_sink;
+  if (sink == nullptr || ctx->for_pellix) return;
+  backup_progress progress;
+  progress.run = ctx->run_id;
+  progress.stage = backup_stage::archiving;
+  progress.index = ctx->packages_examined;
+  progress.notice = notice;
+  progress.size = size;
+  progress.limit = limit;
   sink(progress);
 }

@@ -91,6 +91,9 @@ struct backup_context {
   /** Entries of upload_list whose upload was requested; the rest is the run's to delete. */
   std::size_t uploads_requested = 0;
 
+  /** What the run finds out on its way; run_notes.h. */
+  const std::shared_ptr<struct run_notes> notes;
+
   const std::uint32_t run_id; /**< tells runs apart in progress reports */
   std::int32_t packages_examined = 0;
   std::atomic<std::int32_t> uploads_answered{0};
@@ -133,7 +136,10 @@ enum class backup_outcome {
   too_large,  /**< size is over limit, the cap */
   no_space,   /**< size is over limit, the free space */
   disabled,   /**< an application of it opted out */
+  removed,    /**< it was removed while the run went */
+  too_deep,   /**< its folders are nested deeper than what is packed */
   unreadable, /**< its data could not be read or packed whole */
+  restoring,  /**< a restore is to have its archive in the cloud */
   upload_failed
 };
 
@@ -147,9 +153,12 @@ struct backup_progress {
   std::int32_t count = 0; /**< packages in this stage, 0 while unknown */
   std::uint64_t bytes_done = 0;
   std::uint64_t bytes_total = 0;
-  std::uint64_t size = 0;  /**< bytes: of data for too_large and no_space, else of the archive */
-  std::uint64_t limit = 0; /**< what it exceeded */
-  std::int32_t result = 0; /**< result of the run, for finished */
+  std::uint64_t size = 0;    /**< bytes: of data for too_large and no_space, else of the archive */
+  std::uint64_t limit = 0;   /**< what it exceeded */
+  std::int32_t result = 0;   /**< result of the run, for finished */
+  const char *cause = "";    /**< a word for what it failed of, for finished; may be empty */
+  bool list_written = false; /**< the run's list stands in the cloud, for finished */
+  const char *notice = "";   /**< a word for something that is to be seen to; empty as a rule */
 };
 using backup_progress_sink = void (*)(const backup_progress &progress);
 

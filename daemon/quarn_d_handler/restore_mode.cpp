@@ -1,6 +1,9 @@
 #include <memory>
+#include <set>
 #include <utility>
 
+#include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
@@ -50,6 +53,14 @@ void start_monitor(int client, const std::string &serial_num, RecordPtr record) 
   }
 }
 
+/** From now on a backup leaves what is waited for in the cloud. */
+void await_candidates() {
+  std::set<std::string> installed;
+  // what is not known to be installed counts as what is to come
+  list_installed_packages(&installed);
+  await_archives(serial_num_user_select, pkg_list_to_be_restored, installed);
+}
+
 int switch_on(int client, const std::string &serial_num, const char *pkg_list, RecordPtr record) {
   std::vector<std::string> list = parse_package_list(pkg_list);
   if (!list.empty() && client == kCloudClient && !is_safe_path_component(serial_num)) {
@@ -58,6 +69,7 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   }
   recover_interrupted_restores();
   pkg_list_to_be_restored = std::move(list);
+  if (pkg_list_to_be_restored.empty() || client == kPellixClient) await_no_archives();
   if (pkg_list_to_be_restored.empty()) {
     LOGI("there is no package should be restored");
     return QUARN_OK;
@@ -67,6 +79,7 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   init_icon_hide_delay_timer_list();
   current_restore_client = client;
   serial_num_user_select = serial_num;
+  if (client == kCloudClient) await_candidates();
   const unsigned int this_change = ++mode_changes;
   if (client == kPellixClient) {
     start_monitor(client, serial_num, std::move(record));
@@ -88,6 +101,8 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
 
 int switch_off() {
   ++mode_changes;
+  await_no_archives();
+  if (cloud_restore_running) note_restore_mode_used();
   current_restore_client = kCloudClient;
   if (stop_install_monitor()) {
     LOGI("stop install event monitor");

@@ -1,8 +1,11 @@
 #include <memory>
 
+#include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/request_cause.h"
+#include "quarn_d_utils/safe_path.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 
@@ -33,9 +36,17 @@ void remove_list(const std::string &path) {
 }
 
 /** The downloaded list, malloc'd; null with the reason logged. */
-CString read_list(const std::string &path) {
+CString read_list(const std::string &path, request_cause *cause) {
+  *cause = request_cause::list_unreadable;
+  struct stat status = {};
   if (!file_exist(path.c_str())) {
     LOGE("there isn't app list file...");
+    return nullptr;
+  }
+  if (safe_lstat(path.c_str(), &status) == 0 &&
+      static_cast<std::uint64_t>(status.st_size) > kMaxAppListSize) {
+    *cause = request_cause::list_too_large;
+    LOGE("couldn't read app list...");
     return nullptr;
   }
   char *raw = nullptr;
@@ -46,6 +57,7 @@ CString read_list(const std::string &path) {
     return nullptr;
   }
   LOGI("app list : %s", text.get());
+  *cause = request_cause::none;
   return text;
 }
 
@@ -54,12 +66,15 @@ void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char
   g_assert(user_data != nullptr);
   const std::unique_ptr<list_request> request(static_cast<list_request *>(user_data));
   CString text;
+  request_cause cause = cause_of_transfer(error, request->local_path);
   if (error != BACKUP_TRANS_ERROR_NONE) {
     LOGE("__get_app_list_resp_cb failed...err_code[%d]", error);
   } else {
     LOGI("backup trans success : app list download");
-    text = read_list(request->local_path);
+    text = read_list(request->local_path, &cause);
   }
+  // before the answer: the client asks for it then
+  note_request_end(cause);
   remove_list(request->local_path);
   if (text == nullptr) {
     quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kNone, request->invocation);
@@ -95,6 +110,7 @@ int get_app_list(int client, void *invocation) {
   }
   if (result != BACKUP_TRANS_ERROR_NONE) {
     LOGE("backup_trans_download_file_ors_async failed... %d", result);
+    note_request_end(cause_of_transfer(result, request->local_path));
     remove_list(request->local_path);
     quarn_dbus_get_app_list_cb(QUARN_TRANSFER_FAILED, kNone, invocation);
     return QUARN_FAILED;

@@ -127,11 +127,17 @@ void package_event_cb(const char * /*type*/, const char *package,
     LOGE("package_manager error: %d", error);
     return;
   }
+  if (event_type == PACKAGE_MANAGER_EVENT_TYPE_UNINSTALL &&
+      event_state == PACKAGE_MANAGER_EVENT_STATE_COMPLETED) {
+    note_awaited_package_removed(package);
+  }
   if (event_type != PACKAGE_MANAGER_EVENT_TYPE_INSTALL ||
       event_state != PACKAGE_MANAGER_EVENT_STATE_COMPLETED) {
     LOGE("this is not new install event");
     return;
   }
+  // No backup comes in between: it would put the new package's data in the archive's place.
+  const archive_hold archive(serial_num_user_select, package);
   if (!package_to_be_restored(package) || already_installed_package(package)) return;
   PackageInfoPtr info;
   if (package_manager_get_package_info(package, out(info)) != PACKAGE_MANAGER_ERROR_NONE) {
@@ -189,6 +195,7 @@ int package_to_be_restored(const char *pkgid) {
   const bool candidate = found != pkg_list_to_be_restored.end();
   if (candidate) {
     pkg_list_to_be_restored.erase(found);
+    stop_awaiting_archive(pkgid);
     note_restore_mode_change();
   }
   if (pkg_list_to_be_restored.empty()) g_idle_add(_restore_disable_cb, nullptr);

@@ -5,6 +5,7 @@
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
@@ -131,6 +132,7 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
   std::uint64_t size = 0;
   if (error != BACKUP_TRANS_ERROR_NONE) {
     LOGE("download app data of (%s) failed...err_code[%d]", ctx->pkgid.c_str(), error);
+    note_request_end(cause_of_transfer(error, request->local_path));
     ctx->result = QUARN_TRANSFER_FAILED;
   } else {
     LOGI("backup trans success : download for (%s)", ctx->pkgid.c_str());
@@ -149,6 +151,7 @@ bool start_download(RequestPtr request) {
       __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE);
   if (result != BACKUP_TRANS_ERROR_NONE) {
     LOGE("backup_trans_download_file_ors_async failed... %d", result);
+    note_request_end(cause_of_transfer(result, request->local_path));
     ctx->result = QUARN_LIST_CHECK_FAILED;
     remove_download(request->local_path);
     return false;
@@ -182,6 +185,7 @@ int restore_from_cloud(pkg_restore_context *ctx) {
       "/" + ctx->serial + "/" + ctx->pkgid + "/" + ctx->version + "/" + ctx->pkgid + ".zip";
   request->local_path = restore_files(ctx->pkgid, ctx->root).download;
   request->ctx = ctx;
+  ctx->archive = archive_hold(ctx->serial, ctx->pkgid);
   LOGI("request download for (%s)", ctx->pkgid.c_str());
   if (is_running(ctx->pkgid)) {
     waiting.push_back(std::move(request));

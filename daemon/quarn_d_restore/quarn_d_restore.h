@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "platform_package_manager.h"
+#include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 /** The state of one package's restore; freed by the engine or by the waiting request. */
@@ -31,6 +32,7 @@ struct pkg_restore_context {
   bool backup_enabled = true;
   void *client = nullptr; /**< client_cb_data of a waiting request */
   bool abandoned = false; /**< the waiting request is gone; the engine deletes the context */
+  archive_hold archive;   /**< no backup touches the archive before the restore has ended */
 };
 
 /** Restore candidates still expected, in the order given. */

@@ -223,10 +223,11 @@ int backup_trans_check_async(backup_trans_handle_h handle, void *user_data,
                              backup_trans_check_cb callback);
 
 /**
- * What kept the last request, of any handle, from being served. An object that
- * is not there or has changed is no such thing, and what was cancelled or
- * failed on the device does not count. #BACKUP_TRANS_CAUSE_NONE before the
- * first request. Any thread.
+ * What kept the last request, of any handle, from being served. A request that
+ * was accepted before that one failed does not make it forgotten when it is
+ * served; a later one does. An object that is not there or has changed is no
+ * such thing, and what was cancelled or failed on the device does not count.
+ * #BACKUP_TRANS_CAUSE_NONE before the first request. Any thread.
  */
 backup_trans_cause backup_trans_last_cause(void);
 

@@ -72,6 +72,7 @@ struct Request {
 
   Ticket ticket;
   // Guarded by the session's mutex.
+  std::uint64_t number = 0;  // in the order of their acceptance
   bool ended = false;
   std::unique_ptr<Result> result;  // once it has ended: thousands may wait
 };
@@ -229,6 +230,7 @@ class Session {
     // The session may have ended while the request's file was opened.
     if (!config_ || request->handle->generation != generation_)
       return BACKUP_TRANS_ERROR_NOT_INITIALIZED;
+    request->number = ++accepted_;
     waiting_.push_back(request);
     if (workers_ < BACKUP_TRANS_MAX_CONCURRENT_TRANSFERS && !start_worker() && workers_ == 0) {
       waiting_.pop_back();
@@ -303,13 +305,22 @@ class Session {
     delivery();
   }
 
+  // What was accepted beside a request that failed does not tell that the trouble is over.
+  void note_cause(const Request &request, const Outcome &outcome) {
+    if (!was_served(outcome)) {
+      last_cause_ = cause_of(outcome);
+      failed_before_ = accepted_;
+    } else if (request.number > failed_before_) {
+      last_cause_ = BACKUP_TRANS_CAUSE_NONE;
+    }
+  }
+
   void end(const RequestPtr &request, Result result) {
     if (request->ended) return;
     request->ended = true;
     request->result = std::make_unique<Result>(std::move(result));
     const Outcome &outcome = request->result->outcome;
-    if (tells_of_store(*request))
-      last_cause_ = was_served(outcome) ? BACKUP_TRANS_CAUSE_NONE : cause_of(outcome);
+    if (tells_of_store(*request)) note_cause(*request, outcome);
     if (request->waited_for) {
       ended_.notify_all();
     } else {
@@ -504,6 +515,8 @@ class Session {
   std::list<RequestPtr> running_;
   std::deque<std::function<void()>> deliveries_;
   int workers_ = 0;
+  std::uint64_t accepted_ = 0;       // requests so far
+  std::uint64_t failed_before_ = 0;  // of them, when one was not served
   backup_trans_cause last_cause_ = BACKUP_TRANS_CAUSE_NONE;
 };
 

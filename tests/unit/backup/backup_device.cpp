@@ -1,5 +1,7 @@
 #include "backup_device.h"
 
+#include "quarn_d_backup/archive_hold.h"
+
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/file.h>
@@ -270,6 +272,7 @@ BackupDevice::BackupDevice() {
 
 BackupDevice::~BackupDevice() {
   set_backup_progress_sink(nullptr);
+  await_no_archives();
   std::filesystem::remove_all(directory_);
   std::filesystem::remove_all("/tmp/quarn");
   close(lock_);
@@ -381,6 +384,25 @@ void BackupDevice::script_packages() {
         *value = disable;
         return PMINFO_R_OK;
       });
+  ON_CALL(platform_, package_manager_get_package_info)
+      .WillByDefault([this](const char *id, package_info_h *info) {
+        for (auto &package : packages_) {
+          if (package.id != id) continue;
+          *info = reinterpret_cast<package_info_h>(&package);
+          return 0;
+        }
+        return unknown_package_result_;
+      });
+  ON_CALL(platform_, vconf_set_int).WillByDefault([this](const char *key, int value) {
+    if (!settings_work_) return VCONF_ERROR;
+    settings_[key] = value;
+    return VCONF_OK;
+  });
+  ON_CALL(platform_, vconf_get_int).WillByDefault([this](const char *key, int *value) {
+    if (settings_.count(key) == 0) return VCONF_ERROR;
+    *value = static_cast<int>(settings_[key]);
+    return VCONF_OK;
+  });
   ON_CALL(platform_, vconf_set_dbl).WillByDefault([this](const char *key, double value) {
     if (!settings_work_) return VCONF_ERROR;
     settings_[key] = value;

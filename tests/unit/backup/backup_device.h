@@ -143,6 +143,8 @@ class BackupDevice : public ::testing::Test {
   FakeCloud cloud_;
   std::list<FakePackage> packages_;
   int package_walk_result_ = 0;
+  /** What the package manager says of one that is not installed. */
+  int unknown_package_result_ = PACKAGE_MANAGER_ERROR_NO_SUCH_PACKAGE;
   std::map<std::string, double> settings_;
   bool settings_work_ = true;
 

@@ -463,6 +463,7 @@ TEST_F(Cloud, PackageUploadedByARequestMeanwhileKeepsItsFolder) {
   cloud_.answer_all();
   EXPECT_THAT(cloud_.paths(), ElementsAre(app.object()));
   forget_single_uploads();
+  remove("org.fresh");
   delete_other_backup_items_in_cloud(ctx_.get());
   cloud_.answer_all();
   EXPECT_THAT(cloud_.paths(), IsEmpty());

@@ -176,6 +176,10 @@ void FakeDaemon::serve_status(GVariant *properties) {
   status_filter_ = g_dbus_connection_add_filter(connection_.get(), answer_status, this, nullptr);
 }
 
+void FakeDaemon::serve_kept_packages(GVariant *packages) {
+  kept_.reset(g_variant_ref_sink(packages));
+}
+
 GDBusMessage *FakeDaemon::answer_status(GDBusConnection *connection, GDBusMessage *message,
                                         gboolean incoming, gpointer user_data) {
   auto *self = static_cast<FakeDaemon *>(user_data);
@@ -184,7 +188,11 @@ GDBusMessage *FakeDaemon::answer_status(GDBusConnection *connection, GDBusMessag
     return message;
   }
   const Handle<GDBusMessage, &g_object_unref> reply(g_dbus_message_new_method_reply(message));
-  g_dbus_message_set_body(reply.get(), g_variant_new("(@a{sv})", self->status_.get()));
+  if (self->kept_ && g_strcmp0(g_dbus_message_get_member(message), "Get") == 0) {
+    g_dbus_message_set_body(reply.get(), g_variant_new("(v)", self->kept_.get()));
+  } else {
+    g_dbus_message_set_body(reply.get(), g_variant_new("(@a{sv})", self->status_.get()));
+  }
   g_dbus_connection_send_message(connection, reply.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
                                  nullptr);
   g_object_unref(message);
@@ -245,6 +253,7 @@ QuarnctlRun::QuarnctlRun(const PrivateBus &bus, const std::vector<std::string> &
     terminal_.reset(master);
     fcntl(master, F_SETFL, O_NONBLOCK);
     fcntl(master, F_SETFD, FD_CLOEXEC);
+    g_subprocess_launcher_take_stdin_fd(launcher.get(), fcntl(slave, F_DUPFD_CLOEXEC, 0));
     g_subprocess_launcher_take_stdout_fd(launcher.get(), slave);
     terminal_source_ = g_unix_fd_add(
         master, static_cast<GIOCondition>(G_IO_IN | G_IO_HUP | G_IO_ERR), on_terminal, this);
@@ -298,6 +307,10 @@ void QuarnctlRun::on_end(GObject *source, GAsyncResult *result, gpointer user_da
 }
 
 void QuarnctlRun::signal(int number) { g_subprocess_send_signal(process_.get(), number); }
+
+void QuarnctlRun::type(const std::string &text) {
+  EXPECT_EQ(write(terminal_.get(), text.data(), text.size()), static_cast<ssize_t>(text.size()));
+}
 
 Outcome QuarnctlRun::wait() {
   EXPECT_TRUE(run_until([this] { return ended_ && terminal_source_ == 0; }))

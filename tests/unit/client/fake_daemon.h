@@ -76,6 +76,8 @@ class FakeDaemon {
   void die();
   /** Serves a status object; @p properties is an a{sv}. */
   void serve_status(GVariant *properties);
+  /** With a status object: answers what a backup leaves in the cloud; @p packages is an "as". */
+  void serve_kept_packages(GVariant *packages);
   /** Publishes a "progress" signal. */
   void publish(const std::string &text);
   GDBusConnection *connection() const { return connection_.get(); }
@@ -93,6 +95,7 @@ class FakeDaemon {
   guint object_ = 0;
   guint status_filter_ = 0;
   GVariantPtr status_;
+  GVariantPtr kept_;
   std::map<std::string, Script> scripts_;
   std::vector<std::string> calls_;
 };
@@ -115,6 +118,10 @@ class QuarnctlRun {
   QuarnctlRun &operator=(const QuarnctlRun &) = delete;
 
   void signal(int number);
+  /** With a terminal: what somebody types there. */
+  void type(const std::string &text);
+  /** What has come on the terminal so far. */
+  const std::string &shown() const { return outcome_.out; }
   /** Runs the main context until the process has ended. */
   Outcome wait();
 

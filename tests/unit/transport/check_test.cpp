@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 
+#include <atomic>
 #include <functional>
 #include <future>
 #include <map>
@@ -279,6 +280,32 @@ TEST_F(CheckRequestTest, TheLastCauseIsThatOfTheLastRequestThatTellsOfTheStore) 
   check();
   EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_CERTIFICATE);
   store->outcomes["list"] = success();
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_NONE);
+}
+
+TEST_F(CheckRequestTest, WhatWasAcceptedBeforeAFailureDoesNotMakeItForgotten) {
+  std::promise<void> go_on;
+  std::shared_future<void> gate = go_on.get_future().share();
+  std::promise<void> entered;
+  std::atomic<int> checks{0};
+  store->on_list = [&](Attempt &) {
+    if (++checks != 1) return;
+    entered.set_value();
+    gate.wait();
+  };
+  std::atomic<int> answered{0};
+  const auto count = [](backup_trans_error_code, void *user_data, backup_trans_cause,
+                        const char *) { ++*static_cast<std::atomic<int> *>(user_data); };
+  ASSERT_EQ(backup_trans_check_async(cloud->handle, &answered, count), BACKUP_TRANS_ERROR_NONE);
+  entered.get_future().wait();
+  store->outcomes["list"] = failure(BACKUP_TRANS_ERROR_QUOTA, "full");
+  check();
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_SPACE);
+  store->outcomes["list"] = success();
+  go_on.set_value();
+  while (answered == 0) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_SPACE) << "it began before the failure";
   check();
   EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_NONE);
 }
