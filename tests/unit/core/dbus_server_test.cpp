@@ -64,6 +64,8 @@ guint __wrap_g_bus_own_name(GBusType type, const gchar *name, GBusNameOwnerFlags
 }
 }
 
+bool is_idle_status() { return true; }
+void quarn_loop_quit() { steps.emplace_back("quit"); }
 void init_last_backup_time() { note("init_last_backup_time"); }
 void request_quarn_terminate(double delay, bool restart) {
   note("terminate " + number(static_cast<int>(delay)) + (restart ? " restart" : ""));
