@@ -46,7 +46,8 @@ void stay() {
 }
 
 gboolean decide(gpointer) {
-  if (wanted && is_idle_status()) {
+  // One that has to go anyway has answered what came, and goes.
+  if ((wanted || leave_when_idle) && is_idle_status()) {
     quarn_loop_quit();
   } else {
     stay();

@@ -90,6 +90,8 @@ constexpr std::size_t kMaxDeferred = 512;
 guint registration_id = 0;
 guint filter_id = 0;
 guint name_owner_id = 0;
+/** The bus has answered the latest request for the name. */
+bool name_settled = true;
 gulong closed_handler = 0;
 void (*bus_acquired_hook)(GDBusConnection *connection) = nullptr;
 
@@ -516,12 +518,14 @@ void _dbus_on_bus_acquired(GDBusConnection *connection, const gchar *, gpointer 
 
 void _dbus_on_name_acquired(GDBusConnection *, const gchar *name, gpointer) {
   LOGI("Acquired the name %s", name);
+  name_settled = true;
   note_quarn_name(true);
   release_quarn_terminate();
 }
 
 void _dbus_on_name_lost(GDBusConnection *, const gchar *name, gpointer) {
   LOGI("Lost the name %s", name);
+  name_settled = true;
   note_quarn_name(false);
   release_quarn_terminate();
 }
@@ -540,6 +544,7 @@ void take_name_back() {
   hold_quarn_terminate();
   const auto flags = static_cast<GBusNameOwnerFlags>(G_BUS_NAME_OWNER_FLAGS_REPLACE |
                                                      G_BUS_NAME_OWNER_FLAGS_DO_NOT_QUEUE);
+  name_settled = false;
   name_owner_id =
       g_bus_own_name_on_connection(quarn_dbus_connection, kQuarnBusName, flags,
                                    _dbus_on_name_acquired, _dbus_on_name_lost, nullptr, nullptr);
@@ -566,6 +571,7 @@ unsigned int quarnd_dbus_init() {
     release_quarn_terminate();
     LOGE("g_bus_own_name() Fail");
   }
+  name_settled = name_owner_id == 0;
   return name_owner_id;
 }
 
@@ -579,6 +585,8 @@ void quarnd_dispatch_deferred() {
 }
 
 void quarnd_dbus_leave() {
+  // The bus keeps the calls for a process that it has started until that process has the name.
+  while (!name_settled) g_main_context_iteration(nullptr, TRUE);
   give_up_name();
   quarnd_dispatch_deferred();
   // What arrived before the bus had answered has a higher priority than this mark.

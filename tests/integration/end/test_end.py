@@ -262,6 +262,18 @@ class Signals(EndTest):
             self.assertEqual(self.client.callbacks("restore_enable_cb"),
                              [("restore_enable_cb", (CANCELLED, "restore_stop", 5))])
 
+    def test_while_the_daemon_starts_the_calls_that_started_it_are_answered(self):
+        for number in range(10):
+            starts = self.device.log().count("init backup resource")
+            calls = [self.client.start("last_bu_time"),
+                     self.client.start("manual_backup_start", request(number))]
+            self.device.wait_for_log("init backup resource", starts + 1)
+            os.kill(self.pid(), signal.SIGTERM)
+            self.client.until(lambda: all(call.done for call in calls), "the replies")
+            self.assertEqual([call.error for call in calls], [None] * 2)
+            self.client.until(lambda: len(self.states(number)) == 2, "the last status")
+            self.device.wait_for_daemon_end()
+
     def test_at_any_moment_each_request_is_answered_and_ends_once(self):
         self.install(size=200000)
         choice = random.Random(11)

@@ -187,14 +187,29 @@ TEST_F(End, DaemonThatIsToGoGoesAsSoonAsItIsIdle) {
   EXPECT_EQ(steps, Texts{"give up"});
 }
 
-TEST_F(End, CallDelaysADaemonThatIsToGoButDoesNotKeepIt) {
+TEST_F(End, CallDoesNotKeepADaemonThatIsToGo) {
   set_quarn_bus_name({[] {
                         give_up();
                         if (steps.size() == 1) withdraw_quarn_end();  // a call that had arrived
                       },
                       take_back});
   end_quarn_when_idle();
+  EXPECT_TRUE(is_quit_later());
+  EXPECT_EQ(steps, Texts{"give up"});
+}
+
+TEST_F(End, WorkKeepsADaemonThatIsToGoUntilItIsDone) {
+  set_quarn_bus_name({[] {
+                        give_up();
+                        lifecycle_idle = steps.size() > 2;  // work that had arrived
+                      },
+                      [] {
+                        take_back();
+                        lifecycle_idle = true;
+                      }});
+  end_quarn_when_idle();
   while (steps.size() < 2) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(lifecycle_quits, 0);
   note_quarn_name(true);
   EXPECT_TRUE(is_quit_later());
   EXPECT_EQ(steps, (Texts{"give up", "take back", "give up"}));
