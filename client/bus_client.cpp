@@ -77,6 +77,7 @@ constexpr char kStatusMethod[] = "manual_backup_status";
 constexpr char kCancelMethod[] = "manual_backup_cancel_result";
 
 using NodeInfo = Handle<GDBusNodeInfo, &g_dbus_node_info_unref>;
+using Message = Handle<GDBusMessage, &g_object_unref>;
 using VariantType = Handle<GVariantType, &g_variant_type_free>;
 
 Callback read_callback(const char *method, GVariant *parameters) {
@@ -127,10 +128,6 @@ BusFailure failure_of(GError *error) {
   if (is(G_DBUS_ERROR_SERVICE_UNKNOWN) || is(G_DBUS_ERROR_NAME_HAS_NO_OWNER) ||
       is(G_DBUS_ERROR_TIMED_OUT) || is(G_DBUS_ERROR_TIMEOUT) || is(G_DBUS_ERROR_DISCONNECTED) ||
       error->domain == G_IO_ERROR) {
-    const bool refused_reply = g_error_matches(error, G_IO_ERROR, G_IO_ERROR_INVALID_ARGUMENT);
-    if (refused_reply) {
-      return {BusFailure::Kind::unusable, "the daemon's answer is not usable: " + text};
-    }
     return {BusFailure::Kind::unreachable, "cannot reach the daemon: " + text};
   }
   return {BusFailure::Kind::unusable, "the daemon refused the call: " + text};
@@ -139,6 +136,9 @@ BusFailure failure_of(GError *error) {
 }  // namespace
 
 struct BusClient::PendingCall {
+  BusClient *client; /**< not to be used once the call is cancelled */
+  VariantType reply_type;
+  bool is_request; /**< whoever answers it has taken what was asked for */
   Reply reply;
   Failure failure;
 };
@@ -177,10 +177,11 @@ void BusClient::on_bus(GObject *, GAsyncResult *result, gpointer user_data) {
   g_dbus_connection_set_exit_on_close(bus, FALSE);
   self->closed_handler_ = g_signal_connect(bus, "closed", G_CALLBACK(on_closed), self);
   self->owner_subscription_ = g_dbus_connection_signal_subscribe(
-      bus, kBusService, kBusService, "NameOwnerChanged", kBusPath, kQuarnBusName,
+      bus, kBusService, kBusService, "NameOwnerChanged", kBusPath, nullptr,
       G_DBUS_SIGNAL_FLAGS_NONE, on_owner_changed, self, nullptr);
+  // From any sender: a daemon that works on without its name is told from strangers here.
   self->progress_subscription_ = g_dbus_connection_signal_subscribe(
-      bus, kQuarnBusName, kQuarnInterface, kProgressSignal, kProgressPath, nullptr,
+      bus, nullptr, kQuarnInterface, kProgressSignal, kProgressPath, nullptr,
       G_DBUS_SIGNAL_FLAGS_NONE, on_progress, self, nullptr);
   if (!self->export_object()) {
     self->events_.failed(
@@ -211,7 +212,7 @@ void BusClient::on_owner(GObject *source, GAsyncResult *result, gpointer user_da
   if (reply) {
     const char *owner = nullptr;
     g_variant_get(reply.get(), "(&s)", &owner);
-    self->owner_ = owner;
+    self->daemons_.insert(owner);
   }
   self->events_.ready();
 }
@@ -220,19 +221,29 @@ void BusClient::on_owner_changed(GDBusConnection *, const char *, const char *, 
                                  const char *, GVariant *parameters, gpointer user_data) {
   auto *self = static_cast<BusClient *>(user_data);
   if (g_variant_is_of_type(parameters, G_VARIANT_TYPE("(sss)")) == FALSE) return;
+  const char *name = nullptr;
   const char *owner = nullptr;
-  g_variant_get(parameters, "(&s&s&s)", nullptr, nullptr, &owner);
-  const bool had_owner = !self->owner_.empty();
-  self->owner_ = owner;
-  if (had_owner) self->events_.daemon_ended();
+  g_variant_get(parameters, "(&s&s&s)", &name, nullptr, &owner);
+  self->name_changed(name, owner);
 }
 
-void BusClient::on_progress(GDBusConnection *, const char *, const char *, const char *,
+void BusClient::name_changed(const char *name, const char *owner) {
+  if (std::strcmp(name, kQuarnBusName) == 0) {
+    if (*owner != '\0') daemons_.insert(owner);
+  } else if (*owner == '\0' && serving_ == name) {
+    serving_.clear();
+    events_.daemon_ended();
+  }
+}
+
+void BusClient::on_progress(GDBusConnection *, const char *sender, const char *, const char *,
                             const char *, GVariant *parameters, gpointer user_data) {
+  auto *self = static_cast<BusClient *>(user_data);
+  if (self->daemons_.count(sender) == 0) return;
   if (g_variant_is_of_type(parameters, G_VARIANT_TYPE("(s)")) == FALSE) return;
   const char *text = nullptr;
   g_variant_get(parameters, "(&s)", &text);
-  static_cast<BusClient *>(user_data)->events_.progress(text);
+  self->events_.progress(text);
 }
 
 void BusClient::on_closed(GDBusConnection *, gboolean, GError *, gpointer user_data) {
@@ -244,12 +255,13 @@ void BusClient::on_method(GDBusConnection *, const char *sender, const char *, c
                           const char *method, GVariant *parameters,
                           GDBusMethodInvocation *invocation, gpointer user_data) {
   auto *self = static_cast<BusClient *>(user_data);
-  if (self->owner_ != sender) {
+  if (self->daemons_.count(sender) == 0) {
     g_dbus_method_invocation_return_error_literal(invocation, G_DBUS_ERROR,
                                                   G_DBUS_ERROR_ACCESS_DENIED,
                                                   "only the daemon may call this object");
     return;
   }
+  self->serving_ = sender;
   const Callback callback = read_callback(method, parameters);
   g_dbus_method_invocation_return_value(invocation, g_variant_new("(i)", QUARN_OK));
   self->events_.callback(callback);
@@ -257,35 +269,47 @@ void BusClient::on_method(GDBusConnection *, const char *sender, const char *, c
 
 void BusClient::call(const char *method, GVariant *arguments, const char *reply_type, Reply reply,
                      Failure failure) {
-  call_object(kQuarnObjectPath, kQuarnInterface, method, arguments, reply_type, std::move(reply),
-              std::move(failure));
+  call_object({kQuarnObjectPath, kQuarnInterface, method, true}, arguments, reply_type,
+              std::move(reply), std::move(failure));
 }
 
 void BusClient::read_status(Reply reply, Failure failure) {
-  call_object(kStatusPath, kPropertiesInterface, "GetAll", g_variant_new("(s)", kStatusInterface),
-              "(a{sv})", std::move(reply), std::move(failure));
+  call_object({kStatusPath, kPropertiesInterface, "GetAll", false},
+              g_variant_new("(s)", kStatusInterface), "(a{sv})", std::move(reply),
+              std::move(failure));
 }
 
-void BusClient::call_object(const char *path, const char *interface, const char *method,
-                            GVariant *arguments, const char *reply_type, Reply reply,
-                            Failure failure) {
-  const VariantType type(g_variant_type_new(reply_type));
-  auto *pending = new PendingCall{std::move(reply), std::move(failure)};
-  g_dbus_connection_call(connection_.get(), kQuarnBusName, path, interface, method, arguments,
-                         type.get(), G_DBUS_CALL_FLAGS_NONE, kNoTimeout, cancellable_.get(),
-                         on_reply, pending);
+void BusClient::call_object(const Target &target, GVariant *arguments, const char *reply_type,
+                            Reply reply, Failure failure) {
+  const Message message(
+      g_dbus_message_new_method_call(kQuarnBusName, target.path, target.interface, target.method));
+  if (arguments != nullptr) g_dbus_message_set_body(message.get(), arguments);
+  auto *pending = new PendingCall{this, VariantType(g_variant_type_new(reply_type)),
+                                  target.is_request, std::move(reply), std::move(failure)};
+  g_dbus_connection_send_message_with_reply(connection_.get(), message.get(),
+                                            G_DBUS_SEND_MESSAGE_FLAGS_NONE, kNoTimeout, nullptr,
+                                            cancellable_.get(), on_reply, pending);
 }
 
 void BusClient::on_reply(GObject *source, GAsyncResult *result, gpointer user_data) {
   const std::unique_ptr<PendingCall> pending(static_cast<PendingCall *>(user_data));
   GErrorPtr error;
-  const GVariantPtr value(
-      g_dbus_connection_call_finish(G_DBUS_CONNECTION(source), result, out(error)));
-  if (value) {
-    pending->reply(value.get());
-  } else if (!is_cancelled(error.get())) {
+  const Message message(g_dbus_connection_send_message_with_reply_finish(G_DBUS_CONNECTION(source),
+                                                                         result, out(error)));
+  if (!message && is_cancelled(error.get())) return;
+  if (!message || g_dbus_message_to_gerror(message.get(), out(error)) != FALSE) {
     pending->failure(failure_of(error.get()));
+    return;
   }
+  if (pending->is_request) pending->client->serving_ = g_dbus_message_get_sender(message.get());
+  GVariant *const body = g_dbus_message_get_body(message.get());
+  if (body == nullptr || g_variant_is_of_type(body, pending->reply_type.get()) == FALSE) {
+    pending->failure({BusFailure::Kind::unusable,
+                      std::string("the daemon's answer is not usable: it is of type ") +
+                          (body == nullptr ? "()" : g_variant_get_type_string(body))});
+    return;
+  }
+  pending->reply(body);
 }
 
 void BusClient::read_kept_packages(Reply reply, Failure failure) {

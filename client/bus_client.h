@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <set>
 #include <string>
 
 #include "quarn_handles.h"
@@ -51,7 +52,8 @@ class BusClient {
     std::function<void()> ready; /**< connected; calls may be made */
     std::function<void(const Callback &)> callback;
     std::function<void(const std::string &)> progress; /**< text of a "progress" signal */
-    std::function<void()> daemon_ended; /**< the daemon that was on the bus has left it */
+    /** The process that took the latest call, by its answer or a callback, has left the bus. */
+    std::function<void()> daemon_ended;
     std::function<void(const BusFailure &)> failed; /**< no connection, or it was lost */
   };
 
@@ -101,15 +103,28 @@ class BusClient {
   static void on_reply(GObject *source, GAsyncResult *result, gpointer user_data);
 
   bool export_object();
-  void call_object(const char *path, const char *interface, const char *method, GVariant *arguments,
-                   const char *reply_type, Reply reply, Failure failure);
+  void name_changed(const char *name, const char *owner);
+  struct Target {
+    const char *path;
+    const char *interface;
+    const char *method;
+    bool is_request;
+  };
+  void call_object(const Target &target, GVariant *arguments, const char *reply_type, Reply reply,
+                   Failure failure);
 
   struct PendingCall;
 
   Events events_;
   Handle<GCancellable, &g_object_unref> cancellable_;
   Handle<GDBusConnection, &g_object_unref> connection_;
-  std::string owner_; /**< unique name of the daemon; empty when it is not on the bus */
+  /**
+   * Unique names of all that owned the daemon's name since connecting. A
+   * process gives that name up before it has finished its work, and calls back
+   * on the connection that was called.
+   */
+  std::set<std::string> daemons_;
+  std::string serving_; /**< the one that took the latest call; empty while that is not known */
   guint object_id_ = 0;
   guint owner_subscription_ = 0;
   guint progress_subscription_ = 0;

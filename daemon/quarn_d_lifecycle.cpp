@@ -1,5 +1,6 @@
 #include "quarn_d_lifecycle.h"
 
+#include "quarn_d_end.h"
 #include "quarn_d_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
@@ -27,7 +28,7 @@ struct held_request {
 unsigned char terminate_cb(void *) {
   quarn_terminate_timer = nullptr;  // Ecore deletes it with this return
   LOGI("terminate quarn");
-  quarn_loop_quit();
+  begin_quarn_end();
   return kDoNotRepeat;
 }
 
@@ -44,7 +45,7 @@ void request_quarn_terminate(double delay, bool restart) {
       return;
     }
     LOGI("terminate quarn");
-    quarn_loop_quit();
+    begin_quarn_end();
     return;
   }
   cancel_quarn_terminate();
@@ -61,6 +62,7 @@ void release_quarn_terminate() {
 }
 
 void cancel_quarn_terminate() {
+  withdraw_quarn_end();
   held.pending = false;
   if (quarn_terminate_timer == nullptr) return;
   quarn_loop_timer_del(quarn_terminate_timer);

@@ -150,9 +150,7 @@ void shut_down() {
 /* ---- signals ---------------------------------------------------------------- */
 
 struct SignalWatch {
-  void (*log)(int signo);
-  void (*end)(int signo);
-  int grace_ms;
+  quarn_signal_watch hooks;
   int read_fd;
   std::atomic<int> received; /**< hands the signal, and all above, to the main thread */
 };
@@ -164,7 +162,7 @@ static_assert(std::atomic<int>::is_always_lock_free, "used in signal context");
 gboolean end_on_main_thread(gpointer data) {
   const auto *watch = static_cast<const SignalWatch *>(data);
   const int signo = watch->received.load(std::memory_order_acquire);
-  watch->end(signo);
+  watch->hooks.end(signo);
   return G_SOURCE_REMOVE;
 }
 
@@ -175,16 +173,47 @@ void sleep_ms(int ms) {
   }
 }
 
+/** The next signal; 0 when none came in @p timeout_ms, which may be #kForever. */
+int read_signal(int fd, int timeout_ms) {
+  pollfd readable{fd, POLLIN, 0};
+  int ready = 0;
+  while ((ready = poll(&readable, 1, timeout_ms)) < 0 && errno == EINTR) {
+  }
+  int signo = 0;
+  if (ready <= 0) return 0;
+  while (read(fd, &signo, sizeof signo) < 0 && errno == EINTR) {
+  }
+  return signo;
+}
+
+/** Returns with the signal that ends the process, when it is to end. */
+int wait_for_end(const SignalWatch &watch) {
+  int put_off = 0;
+  gint64 due = 0;
+  for (;;) {
+    const gint64 left = due - g_get_monotonic_time();
+    const int timeout =
+        put_off == 0 ? kForever
+                     : static_cast<int>(std::max<gint64>(left, 0) / kMicrosecondsPerMillisecond);
+    const int signo = read_signal(watch.read_fd, timeout);
+    if (signo == 0) return put_off;
+    const int delay_ms = watch.hooks.take(signo);
+    if (delay_ms == 0) return signo;
+    if (delay_ms < 0) continue;
+    put_off = signo;
+    due = g_get_monotonic_time() + static_cast<gint64>(delay_ms) * kMicrosecondsPerMillisecond;
+  }
+}
+
 /** A thread, not a source: the main thread may be blocked in a call to a client. */
 void *watch_signals(void *data) {
   auto *watch = static_cast<SignalWatch *>(data);
-  int signo = 0;
-  while (read(watch->read_fd, &signo, sizeof signo) < 0 && errno == EINTR) {
-  }
-  watch->log(signo);
+  const int signo = wait_for_end(*watch);
+  watch->hooks.begin_end();
   watch->received.store(signo, std::memory_order_release);
   g_idle_add_full(G_PRIORITY_HIGH, end_on_main_thread, watch, nullptr);
-  sleep_ms(watch->grace_ms);
+  sleep_ms(watch->hooks.grace_ms);
+  watch->hooks.last();
   _exit(EXIT_SUCCESS);
 }
 
@@ -224,7 +253,7 @@ void *quarn_loop_timer_add(double seconds, unsigned char (*callback)(void *), vo
 
 void quarn_loop_timer_del(void *timer) { ecore_timer_del(static_cast<Ecore_Timer *>(timer)); }
 
-bool quarn_loop_watch_signals(void (*log)(int signo), void (*end)(int signo), int grace_ms) {
+bool quarn_loop_watch_signals(const quarn_signal_watch &hooks) {
   int ends[2];
   if (pipe2(ends, O_CLOEXEC) != 0) {
     LOGE("pipe2() failed : %d", errno);
@@ -235,9 +264,7 @@ bool quarn_loop_watch_signals(void (*log)(int signo), void (*end)(int signo), in
 
   // The thread lives as long as the process does.
   static SignalWatch watch{};
-  watch.log = log;
-  watch.end = end;
-  watch.grace_ms = grace_ms;
+  watch.hooks = hooks;
   watch.read_fd = ends[0];
 
   pthread_attr_t attributes;

@@ -33,15 +33,28 @@ void *quarn_loop_timer_add(double seconds, unsigned char (*callback)(void *), vo
 /** Delete a pending timer. */
 void quarn_loop_timer_del(void *timer);
 
+/** What a signal does. All but end() are called on the watching thread. */
+struct quarn_signal_watch {
+  /**
+   * A signal came. @return milliseconds until it ends the process: 0 at once,
+   * negative: it does not. Another signal may end it earlier.
+   */
+  int (*take)(int signo);
+  /** The process is to end: let the main thread go on, wherever it waits. */
+  void (*begin_end)();
+  /** On the main thread, by the main loop or by a loop nested in it. */
+  void (*end)(int signo);
+  /** The process has not ended by then: the last thing that is done. */
+  void (*last)();
+  int grace_ms; /**< from begin_end() to last() and the end with status 0 */
+};
+
 /**
- * Have @p log called at once on a thread of its own, and then @p end on the
- * main thread by the main loop or by a loop nested in it, for the first signal
- * that is handed to quarn_loop_wake_from_signal(). When the process still
- * lives @p grace_ms after that, for its main thread is blocked, it ends with
- * status 0.
+ * Have a thread of its own wait for signals that are handed to
+ * quarn_loop_wake_from_signal().
  * @return false when the system has no room for it; signals are then lost
  */
-bool quarn_loop_watch_signals(void (*log)(int signo), void (*end)(int signo), int grace_ms);
+bool quarn_loop_watch_signals(const quarn_signal_watch &watch);
 
 /** Hand a signal over. Async-signal-safe. */
 void quarn_loop_wake_from_signal(int signo);

@@ -1,11 +1,13 @@
 #include "quarn_d_main.h"
 
+#include <glib.h>
 #include <unistd.h>
 
 #include <csignal>
 #include <cstdio>
 
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_end.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
@@ -13,7 +15,9 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
+#include "quarn_d_turn.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
 
@@ -27,15 +31,56 @@ std::uint32_t quarn_dbus_owner_id = 0;
 namespace {
 
 /** Milliseconds from a signal to the end of a process whose main thread is blocked. */
-constexpr int kSignalGrace = 900;
+constexpr int kSignalGrace = 850;
+/** Milliseconds of that time's rest in which the last callbacks are written. */
+constexpr unsigned int kLastFlush = 50;
+/**
+ * Milliseconds that a process may go on with its work when the service manager
+ * has asked it to end because it gave its bus name up; it is killed at 90 s.
+ */
+constexpr int kServiceGrace = 80000;
+constexpr int kNoEnd = -1;
+constexpr int kAtOnce = 0;
+constexpr char kLockName[] = "/tmp/quarn/lock";
 
 bool signals_watched = false;
 
-void log_signal(int signo) { LOGI("SIGNAL %d received", signo); }
+bool ended_by_signal = false;
+
+gboolean cancel_backups(gpointer) {
+  LOGI("cancel from the next process");
+  manual_backup_canceled = true;
+  cancel_backup(nullptr);
+  return G_SOURCE_REMOVE;
+}
+
+gboolean leave_when_idle(gpointer) {
+  end_quarn_when_idle();
+  return G_SOURCE_REMOVE;
+}
+
+/** On the watching thread, as the two that follow. */
+int take_signal(int signo) {
+  if (signo == kCancelSignal) {
+    g_idle_add_full(G_PRIORITY_DEFAULT, cancel_backups, nullptr, nullptr);
+    return kNoEnd;
+  }
+  LOGI("SIGNAL %d received", signo);
+  if (!is_answer_to_given_up_name(signo)) return kAtOnce;
+  g_idle_add_full(G_PRIORITY_DEFAULT, leave_when_idle, nullptr, nullptr);
+  return kServiceGrace;
+}
+
+void tell_waiting_clients() {
+  quarn_dbus_end_requests();
+  quarn_dbus_flush(kLastFlush);
+}
 
 void end_by_signal(int) {
-  deinit_quarn();
+  ended_by_signal = true;
   quarn_exit_code = 0;
+  // Before those that wait in nested loops go on and find reasons of their own.
+  quarn_dbus_end_requests();
   quit_nested_loops();
   quarn_loop_quit();
 }
@@ -43,18 +88,28 @@ void end_by_signal(int) {
 void install_signal_handlers() {
   if (!signals_watched) return;
   for (const int signo : {SIGINT, SIGHUP, SIGTERM, SIGQUIT}) signal(signo, signal_handler);
+  signal(kCancelSignal, signal_handler);
 }
+
+bool request_pending() { return backup_request_outstanding() || quarnd_calls_deferred(); }
 
 int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
 
 /** Lower floors learn how to ask the upper ones. */
 void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
-  set_pending_request_probe(backup_request_outstanding);
+  set_pending_request_probe(request_pending);
   set_restore_disable(disable_restore);
   set_boot_recovery(recover_interrupted_restores);
   set_bus_acquired_hook(quarnd_status_export);
   quarnd_progress_init();
+}
+
+/** Whoever still waits hears that it is over: only a signal ends what is not idle. */
+void leave_clients() {
+  quarn_dbus_stop_waiting();
+  if (ended_by_signal) quarnd_dbus_leave();
+  quarn_dbus_end_requests();
 }
 
 }  // namespace
@@ -95,12 +150,15 @@ int quarn_run() {
     LOGI("no signed-in. Daemon stop");
     return 0;
   }
-  signals_watched = quarn_loop_watch_signals(log_signal, end_by_signal, kSignalGrace);
+  signals_watched = quarn_loop_watch_signals(
+      {take_signal, quarn_dbus_stop_waiting, end_by_signal, tell_waiting_clients, kSignalGrace});
   install_signal_handlers();
+  if (prepare_staging_directory()) begin_quarn_turn(kLockName, quarnd_dispatch_deferred);
   init_quarn();
   init_backup_req_dispatch_thread();
   LOGI("== main loop begin ==");
   quarn_loop_begin();
+  leave_clients();
   deinit_quarn();
   LOGI("Good-Bye from Quarn");
   return quarn_exit_code;

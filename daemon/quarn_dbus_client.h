@@ -3,7 +3,8 @@
  * @brief Calls back to clients, and published signals.
  *
  * Any thread: every call blocks its caller until the client has answered or
- * the time-out has passed. Failures are logged and end in #QUARN_FAILED.
+ * the time-out has passed, or until quarn_dbus_stop_waiting(). Failures are
+ * logged and end in #QUARN_FAILED.
  */
 #ifndef QUARN_DBUS_CLIENT_H
 #define QUARN_DBUS_CLIENT_H
@@ -24,6 +25,30 @@ struct client_cb_data {
 
 /** The connection that the bus-acquired callback was given; null before. */
 extern GDBusConnection *quarn_dbus_connection;
+
+/** What a request is, and with it which callback is its last. */
+enum class quarn_request { restore_mode, app_list, manual_backup, cancel, app_backup, app_restore };
+
+/**
+ * A request is accepted: from now on it ends with exactly one last callback,
+ * that of its sender below or that of quarn_dbus_end_requests(). Nothing of the
+ * record is read after its last callback.
+ * @param text what the last callback carries beside the result: a package id
+ */
+void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void *record);
+
+/**
+ * The process ends: whoever waits for a client goes on at once, and callbacks
+ * are sent without waiting for their answers from now on. Not to be undone.
+ */
+void quarn_dbus_stop_waiting();
+/** True after quarn_dbus_stop_waiting(). */
+bool quarn_dbus_waiting_stopped();
+
+/** Tell each accepted request that has not had its last callback that it is cancelled. */
+void quarn_dbus_end_requests();
+/** Returns when everything is written, or when @p ms have passed. */
+void quarn_dbus_flush(unsigned int ms);
 
 /** "restore_enable_cb"; the record is deleted when @p msg is "restore_stop". */
 int quarn_dbus_restore_enable_cb(int err, const char *msg, void *record);

@@ -2,14 +2,19 @@
 
 #include <gio/gio.h>
 
+#include <algorithm>
 #include <atomic>
 #include <memory>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_end.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_turn.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -77,8 +82,17 @@ constexpr int kArgumentsMissing = -1;
 /** Milliseconds that the bus itself may take to answer. */
 constexpr int kBusTimeout = 5000;
 
+/** Milliseconds for the last answers to be written. */
+constexpr unsigned int kFlushLimit = 500;
+/** Calls that wait for an earlier process to end. */
+constexpr std::size_t kMaxDeferred = 512;
+
 guint registration_id = 0;
 guint filter_id = 0;
+guint name_owner_id = 0;
+/** The bus has answered the latest request for the name. */
+bool name_settled = true;
+gulong closed_handler = 0;
 void (*bus_acquired_hook)(GDBusConnection *connection) = nullptr;
 
 /** One call, and the way its one answer goes. */
@@ -126,7 +140,6 @@ class InvokedCall : public MethodCall {
   GDBusMethodInvocation *invocation_;
 };
 
-using ConnectionPtr = Handle<GDBusConnection, &g_object_unref>;
 using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
 
 /** A call that GDBus would have answered by itself, without telling anyone. */
@@ -166,6 +179,26 @@ class RawCall : public MethodCall {
 
 client_cb_data *make_record(const MethodCall &call, guint32 req_id) {
   return new client_cb_data{req_id, call.sender()};
+}
+
+/** The record of a request that ends with a last callback, whatever happens. */
+client_cb_data *accept(const MethodCall &call, guint32 req_id, quarn_request kind,
+                       const char *text = "") {
+  client_cb_data *const record = make_record(call, req_id);
+  quarn_dbus_accept_request(kind, text, record);
+  return record;
+}
+
+/** Do a request's work, unless the process ends: then it has its last callback here. */
+template <typename Work>
+void serve(MethodCall &call, client_cb_data *record, int reply_at_end, Work work) {
+  if (!quarn_dbus_waiting_stopped()) {
+    call.reply_int(work(record));
+    return;
+  }
+  quarn_dbus_end_requests();
+  delete record;
+  call.reply_int(reply_at_end);
 }
 
 /** The user that a client runs as, told by the bus. */
@@ -209,6 +242,10 @@ void on_restore_enable(MethodCall &call, GVariant *parameters) {
   const char *pkg_list = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(ii&s&su)", &on, &client, &serial_num, &pkg_list, &req_id);
+  if (on != 0 && quarn_dbus_waiting_stopped()) {
+    call.reply_int(QUARN_REFUSED);
+    return;
+  }
   call.reply_int(
       quarnd_restore_enable(on, client, serial_num, pkg_list, make_record(call, req_id)));
 }
@@ -223,39 +260,48 @@ void on_get_app_list(MethodCall &call, GVariant *parameters) {
   gint32 client = 0;
   guint32 req_id = 0;
   g_variant_get(parameters, "(iu)", &client, &req_id);
-  call.reply_int(quarnd_get_app_list(client, make_record(call, req_id)));
+  serve(call, accept(call, req_id, quarn_request::app_list), QUARN_CANCELLED,
+        [client](void *record) { return quarnd_get_app_list(client, record); });
 }
 
 void on_manual_backup_start(MethodCall &call, GVariant *parameters) {
   guint32 req_id = 0;
   g_variant_get(parameters, "(u)", &req_id);
-  call.reply_int(quarnd_manual_backup(make_record(call, req_id)));
+  call.reply_int(quarnd_manual_backup(accept(call, req_id, quarn_request::manual_backup)));
 }
 
 void on_manual_backup_cancel(MethodCall &call, GVariant *parameters) {
   guint32 req_id = 0;
   g_variant_get(parameters, "(u)", &req_id);
-  call.reply_int(quarnd_manual_backup_cancel(make_record(call, req_id)));
+  // What runs may be an earlier process's.
+  if (signal_quarn_predecessor(kCancelSignal)) LOGI("cancel passed on");
+  call.reply_int(quarnd_manual_backup_cancel(accept(call, req_id, quarn_request::cancel)));
 }
 
 void on_app_data_backup_start(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
-  call.reply_int(quarnd_backup_app_data(pkg_id, make_record(call, req_id)));
+  serve(call, accept(call, req_id, quarn_request::app_backup, pkg_id), QUARN_OK,
+        [pkg_id](void *record) { return quarnd_backup_app_data(pkg_id, record); });
 }
 
 void on_app_data_restore_start(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
-  call.reply_int(quarnd_restore_app_data(pkg_id, make_record(call, req_id)));
+  serve(call, accept(call, req_id, quarn_request::app_restore, pkg_id), QUARN_OK,
+        [pkg_id](void *record) { return quarnd_restore_app_data(pkg_id, record); });
 }
 
 void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *parameters) {
   const char *pkg_id = nullptr;
   g_variant_get(parameters, "(&s)", &pkg_id);
   guint32 uid = 0;
+  if (quarn_dbus_waiting_stopped()) {
+    call.reply_int(QUARN_CANCELLED);
+    return;
+  }
   if (!get_client_uid(connection, call.sender(), &uid)) {
     call.reply_int(QUARN_REFUSED);
     return;
@@ -307,11 +353,67 @@ void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
   }
 }
 
+/* ---- calls that wait for an earlier process ------------------------------------ */
+
+using ConnectionPtr = Handle<GDBusConnection, &g_object_unref>;
+
+/** A call that touches what the earlier process may be writing. */
+struct deferred_call {
+  ConnectionPtr connection;
+  std::unique_ptr<MethodCall> call;
+  GVariantPtr parameters;
+};
+using DeferredPtr = std::unique_ptr<deferred_call>;
+
+std::vector<DeferredPtr> deferred;
+/** Calls that have had to wait and are not dispatched yet. */
+std::size_t deferred_count = 0;
+
+void dispatch_deferred(const DeferredPtr &waiting) {
+  --deferred_count;
+  dispatch(waiting->connection.get(), *waiting->call, waiting->parameters.get());
+}
+
+gboolean on_deferred(gpointer data) {
+  dispatch_deferred(DeferredPtr(static_cast<deferred_call *>(data)));
+  return G_SOURCE_REMOVE;
+}
+
+/** Whether the call has to wait until the earlier process has ended. */
+bool must_wait(const MethodCall &call, GVariant *parameters) {
+  if (is_quarn_turn() || parameters == nullptr || quarn_dbus_waiting_stopped()) return false;
+  if (call.is("restore_enable")) {
+    gint32 on = 0;
+    g_variant_get_child(parameters, 0, "i", &on);
+    return on != 0;
+  }
+  return call.is("get_app_list") || call.is("app_data_backup_start") ||
+         call.is("app_data_restore_start") || call.is("make_app_data");
+}
+
+void defer(GDBusConnection *connection, std::unique_ptr<MethodCall> call, GVariant *parameters) {
+  cancel_quarn_terminate();
+  if (deferred_count >= kMaxDeferred) {
+    call->refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "too many requests wait");
+    return;
+  }
+  ++deferred_count;
+  auto waiting = std::make_unique<deferred_call>();
+  waiting->connection.reset(G_DBUS_CONNECTION(g_object_ref(connection)));
+  waiting->call = std::move(call);
+  waiting->parameters.reset(g_variant_ref(parameters));
+  deferred.push_back(std::move(waiting));
+}
+
 void _dbus_handle_method_call(GDBusConnection *connection, const gchar *sender, const gchar *,
                               const gchar *interface_name, const gchar *method_name,
                               GVariant *parameters, GDBusMethodInvocation *invocation, gpointer) {
-  InvokedCall call(sender, interface_name, method_name, invocation);
-  dispatch(connection, call, parameters);
+  auto call = std::make_unique<InvokedCall>(sender, interface_name, method_name, invocation);
+  if (must_wait(*call, parameters)) {
+    defer(connection, std::move(call), parameters);
+    return;
+  }
+  dispatch(connection, *call, parameters);
 }
 
 constexpr GDBusInterfaceVTable kMethodTable = {_dbus_handle_method_call, nullptr, nullptr, {}};
@@ -388,9 +490,17 @@ void unref_node(gpointer node) { g_dbus_node_info_unref(static_cast<GDBusNodeInf
 
 /* ---- the bus name -------------------------------------------------------------- */
 
+void on_bus_closed(GDBusConnection *, gboolean, GError *error, gpointer) {
+  LOGE("the bus is gone : %s", error == nullptr ? "" : error->message);
+  // Nobody can ask for anything any more; what was asked for is finished.
+  end_quarn_when_idle();
+}
+
 void _dbus_on_bus_acquired(GDBusConnection *connection, const gchar *, gpointer user_data) {
   SLOGI(">>>>>>>> called");
   g_set_object(&quarn_dbus_connection, connection);
+  g_dbus_connection_set_exit_on_close(connection, FALSE);
+  closed_handler = g_signal_connect(connection, "closed", G_CALLBACK(on_bus_closed), nullptr);
   auto *node = static_cast<GDBusNodeInfo *>(user_data);
   GErrorPtr error;
   registration_id =
@@ -408,12 +518,36 @@ void _dbus_on_bus_acquired(GDBusConnection *connection, const gchar *, gpointer 
 
 void _dbus_on_name_acquired(GDBusConnection *, const gchar *name, gpointer) {
   LOGI("Acquired the name %s", name);
+  name_settled = true;
+  note_quarn_name(true);
   release_quarn_terminate();
 }
 
 void _dbus_on_name_lost(GDBusConnection *, const gchar *name, gpointer) {
   LOGI("Lost the name %s", name);
+  name_settled = true;
+  note_quarn_name(false);
   release_quarn_terminate();
+}
+
+gboolean set_flag(gpointer flag) {
+  *static_cast<bool *>(flag) = true;
+  return G_SOURCE_REMOVE;
+}
+
+/** GLib asks the bus and waits for its answer. */
+void give_up_name() {
+  if (name_owner_id != 0) g_bus_unown_name(std::exchange(name_owner_id, 0));
+}
+
+void take_name_back() {
+  hold_quarn_terminate();
+  const auto flags = static_cast<GBusNameOwnerFlags>(G_BUS_NAME_OWNER_FLAGS_REPLACE |
+                                                     G_BUS_NAME_OWNER_FLAGS_DO_NOT_QUEUE);
+  name_settled = false;
+  name_owner_id =
+      g_bus_own_name_on_connection(quarn_dbus_connection, kQuarnBusName, flags,
+                                   _dbus_on_name_acquired, _dbus_on_name_lost, nullptr, nullptr);
 }
 
 }  // namespace
@@ -427,28 +561,52 @@ unsigned int quarnd_dbus_init() {
     LOGE("g_dbus_node_info_new_for_xml() Fail(%s)", error ? error->message : "");
     return kNoOwner;
   }
+  set_quarn_bus_name({give_up_name, take_name_back});
   hold_quarn_terminate();
-  const guint owner_id = g_bus_own_name(
-      G_BUS_TYPE_SYSTEM, kQuarnBusName, G_BUS_NAME_OWNER_FLAGS_REPLACE, _dbus_on_bus_acquired,
-      _dbus_on_name_acquired, _dbus_on_name_lost, node, unref_node);
-  if (owner_id == 0) {
+  name_owner_id = g_bus_own_name(G_BUS_TYPE_SYSTEM, kQuarnBusName, G_BUS_NAME_OWNER_FLAGS_REPLACE,
+                                 _dbus_on_bus_acquired, _dbus_on_name_acquired, _dbus_on_name_lost,
+                                 node, unref_node);
+  if (name_owner_id == 0) {
     g_dbus_node_info_unref(node);
     release_quarn_terminate();
     LOGE("g_bus_own_name() Fail");
   }
-  return owner_id;
+  name_settled = name_owner_id == 0;
+  return name_owner_id;
+}
+
+bool quarnd_calls_deferred() { return deferred_count != 0; }
+
+void quarnd_dispatch_deferred() {
+  // Each on its own: one that waits in turn must not keep the others.
+  for (DeferredPtr &waiting : std::exchange(deferred, {})) {
+    g_idle_add_full(G_PRIORITY_DEFAULT, on_deferred, waiting.release(), nullptr);
+  }
+}
+
+void quarnd_dbus_leave() {
+  // The bus keeps the calls for a process that it has started until that process has the name.
+  while (!name_settled) g_main_context_iteration(nullptr, TRUE);
+  give_up_name();
+  quarnd_dispatch_deferred();
+  // What arrived before the bus had answered has a higher priority than this mark.
+  bool drained = false;
+  g_idle_add_full(G_PRIORITY_LOW, set_flag, &drained, nullptr);
+  while (!drained) g_main_context_iteration(nullptr, TRUE);
 }
 
 void quarnd_dbus_deinit(unsigned int owner_id) {
   if (quarn_dbus_connection != nullptr) {
-    // The process may end right after this; answers that were given must be on their way.
-    g_dbus_connection_flush_sync(quarn_dbus_connection, nullptr, nullptr);
     if (filter_id != 0) g_dbus_connection_remove_filter(quarn_dbus_connection, filter_id);
     if (registration_id != 0) {
       g_dbus_connection_unregister_object(quarn_dbus_connection, registration_id);
     }
+    if (closed_handler != 0) g_signal_handler_disconnect(quarn_dbus_connection, closed_handler);
     filter_id = 0;
     registration_id = 0;
+    closed_handler = 0;
   }
-  if (owner_id != 0 && owner_id != kNoOwner) g_bus_unown_name(owner_id);
+  if (owner_id != 0 && owner_id != kNoOwner) give_up_name();
+  // The process may end right after this; answers that were given must have left.
+  quarn_dbus_flush(kFlushLimit);
 }

@@ -9,6 +9,11 @@
 
 #include <gio/gio.h>
 
+#include <csignal>
+
+/** What a process sends its predecessor to cancel the backups that run there. */
+inline constexpr int kCancelSignal = SIGUSR1;
+
 /** The introspection document: tabs between its elements. */
 extern const char quarn_introspection_xml[];
 
@@ -18,7 +23,18 @@ void set_bus_acquired_hook(void (*hook)(GDBusConnection *connection));
 /** Own the bus name and serve the object. @return owner id, or (unsigned) -1 */
 unsigned int quarnd_dbus_init();
 
-/** Give the bus name up, once every answer that was given is on its way. */
+/** True while calls wait for an earlier process to end. */
+bool quarnd_calls_deferred();
+/** The earlier process has ended: dispatch the calls that wait for it. */
+void quarnd_dispatch_deferred();
+
+/**
+ * Give the bus name up and dispatch what has arrived until then. For an end
+ * that is not begun by begin_quarn_end(), after quarn_dbus_stop_waiting().
+ */
+void quarnd_dbus_leave();
+
+/** Serve nothing any more and give the bus name up; returns when every answer has left. */
 void quarnd_dbus_deinit(unsigned int owner_id);
 
 #endif

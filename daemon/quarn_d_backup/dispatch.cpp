@@ -8,6 +8,7 @@
 #include "backup_transport.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_turn.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -18,6 +19,7 @@ std::atomic<bool> g_is_backing_up{false};
 namespace {
 
 constexpr std::size_t kKeepNothing = 0;
+constexpr int kTurnCheckMs = 100;
 
 // The worker has no end and may be anywhere when the process exits: what it
 // waits on and reads is never destroyed.
@@ -90,6 +92,8 @@ void run_request(void *client) {
 void *backup_req_dispatch_thread(void *) {
   for (;;) {
     LOGI("backup_req_dispatch_thread");
+    // Nothing is swept or run beside an earlier process that still works; a cancel is answered.
+    while (!wait_for_quarn_turn(kTurnCheckMs)) answer_cancelled_clients();
     boot_cleanup_backup_items();
     answer_cancelled_clients();
     void *client = nullptr;

@@ -89,6 +89,7 @@ void report_restore_end(const std::string &package, restore_outcome outcome, int
 }
 
 void keep_restore_record(void *record) {
+  if (record != nullptr) quarn_dbus_accept_request(quarn_request::restore_mode, "", record);
   void *earlier = std::exchange(g_restore_cb_data, record);
   if (earlier == nullptr) return;
   if (std::exchange(stop_due, false)) {

@@ -159,6 +159,14 @@ FakeDaemon::~FakeDaemon() {
   die();
 }
 
+void FakeDaemon::give_name_up() {
+  const GVariantPtr reply(g_dbus_connection_call_sync(
+      connection_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+      "ReleaseName", g_variant_new("(s)", kQuarnBusName), nullptr, G_DBUS_CALL_FLAGS_NONE, -1,
+      nullptr, nullptr));
+  EXPECT_TRUE(reply);
+}
+
 void FakeDaemon::die() {
   if (g_dbus_connection_is_closed(connection_.get()) == FALSE) {
     g_dbus_connection_flush_sync(connection_.get(), nullptr, nullptr);

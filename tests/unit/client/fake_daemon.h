@@ -74,6 +74,8 @@ class FakeDaemon {
 
   /** Leaves the bus, as a process that dies does. */
   void die();
+  /** Gives the bus name up, as a process does that finishes its work without it. */
+  void give_name_up();
   /** Serves a status object; @p properties is an a{sv}. */
   void serve_status(GVariant *properties);
   /** With a status object: answers what a backup leaves in the cloud; @p packages is an "as". */

@@ -193,6 +193,48 @@ TEST_F(Quarnctl, OnlyTheDaemonMayCallBack) {
   EXPECT_TRUE(refused);
 }
 
+TEST_F(Quarnctl, ADaemonThatGaveItsNameUpIsStillHeard) {
+  FakeDaemon daemon(bus());
+  daemon.on("manual_backup_start", [&](const IncomingCall &call) {
+    daemon.give_name_up();
+    call.call_back("manual_backup_status", status_arguments(0, QUARN_BACKUP_RUNNING, call.req_id()),
+                   [call] {
+                     call.reply(0);
+                     call.call_back("manual_backup_status",
+                                    status_arguments(QUARN_TRANSFER_FAILED, QUARN_BACKUP_FAILED,
+                                                     call.req_id()));
+                   });
+  });
+  EXPECT_EQ(quarnctl(bus(), {"backup"}).exit, QUARN_TRANSFER_FAILED);
+}
+
+TEST_F(Quarnctl, AProcessThatTakesTheNameOverDoesNotEndTheRequestOfTheEarlierOne) {
+  FakeDaemon daemon(bus());
+  std::unique_ptr<FakeDaemon> next;
+  daemon.on("manual_backup_start", [&](const IncomingCall &call) {
+    call.reply(0);
+    daemon.give_name_up();
+    next = std::make_unique<FakeDaemon>(bus());
+    next->die();
+    call.call_back("manual_backup_status",
+                   status_arguments(0, QUARN_BACKUP_SUCCEEDED, call.req_id()));
+  });
+  EXPECT_EQ(quarnctl(bus(), {"backup"}).exit, 0);
+}
+
+TEST_F(Quarnctl, ADaemonThatDiesWithoutItsNameIsTold) {
+  FakeDaemon daemon(bus());
+  daemon.on("manual_backup_start", [&](const IncomingCall &call) {
+    daemon.give_name_up();
+    call.call_back("manual_backup_status", status_arguments(0, QUARN_BACKUP_RUNNING, call.req_id()),
+                   [&, call] {
+                     call.reply(0);
+                     daemon.die();
+                   });
+  });
+  EXPECT_EQ(quarnctl(bus(), {"backup"}).exit, kDaemonEnded);
+}
+
 TEST_F(Quarnctl, RequestIdsDiffer) {
   FakeDaemon daemon(bus());
   std::vector<std::uint32_t> ids;

@@ -237,6 +237,126 @@ TEST_F(Callbacks, ThreadsDoNotDisturbEachOther) {
   EXPECT_EQ(client_->callbacks().size(), 8u);
 }
 
+/* ---- accepted requests ---- */
+
+struct Kind {
+  quarn_request kind;
+  const char *text;
+  const char *cancelled;
+};
+const Kind kKinds[] = {
+    {quarn_request::restore_mode, "", "restore_enable_cb(17, 'restore_stop', 7)"},
+    {quarn_request::app_list, "", "get_app_list_cb(17, 'failed', 7)"},
+    {quarn_request::manual_backup, "", "manual_backup_status(17, 6, 7)"},
+    {quarn_request::cancel, "", "manual_backup_cancel_result(17, 7)"},
+    {quarn_request::app_backup, "org.example.notes",
+     "app_data_backup_complete(17, 'org.example.notes', 7)"},
+    {quarn_request::app_restore, "org.example.notes",
+     "app_data_restore_complete(17, 'org.example.notes', 7)"}};
+
+int send_last(quarn_request kind, void *record) {
+  switch (kind) {
+    case quarn_request::restore_mode:
+      return quarn_dbus_restore_enable_cb(0, "restore_stop", record);
+    case quarn_request::app_list:
+      return quarn_dbus_get_app_list_cb(0, "{}", record);
+    case quarn_request::manual_backup:
+      return quarn_dbus_manual_backup_status(0, 4, record);
+    case quarn_request::cancel:
+      return quarn_dbus_manual_backup_cancel_result(0, record);
+    case quarn_request::app_backup:
+      return quarn_dbus_app_backup_complete(0, "org.example.notes", record);
+    case quarn_request::app_restore:
+      return quarn_dbus_app_restore_complete(0, "org.example.notes", record);
+  }
+  return -1;
+}
+
+TEST_F(Callbacks, AcceptedRequestThatIsCutShortIsToldOnceAndItsRecordIsDeletedLater) {
+  for (const Kind &kind : kKinds) {
+    const std::size_t before = client_->callbacks().size();
+    client_cb_data *data = record();
+    quarn_dbus_accept_request(kind.kind, kind.text, data);
+    quarn_dbus_end_requests();
+    quarn_dbus_end_requests();
+    ASSERT_TRUE(client_->wait_for_callbacks(before + 1)) << kind.cancelled;
+    EXPECT_FALSE(watched_deleted);
+    EXPECT_EQ(send_last(kind.kind, data), 42);
+    EXPECT_TRUE(watched_deleted);
+    quarn_dbus_end_requests();
+    EXPECT_EQ(client_->callbacks().size(), before + 1);
+    EXPECT_EQ(client_->callbacks().back(), kind.cancelled);
+  }
+}
+
+TEST_F(Callbacks, AcceptedRequestThatHasEndedIsNotToldAgain) {
+  for (const Kind &kind : kKinds) {
+    client_cb_data *data = record();
+    quarn_dbus_accept_request(kind.kind, kind.text, data);
+    const std::size_t before = client_->callbacks().size();
+    EXPECT_EQ(send_last(kind.kind, data), 0);
+    quarn_dbus_end_requests();
+    quarn_dbus_flush(1000);
+    EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record()), 0);
+    EXPECT_EQ(client_->callbacks().size(), before + 2);
+  }
+}
+
+TEST_F(Callbacks, NothingFollowsTheLastCallback) {
+  client_cb_data *data = record();
+  quarn_dbus_accept_request(quarn_request::manual_backup, "", data);
+  quarn_dbus_end_requests();
+  EXPECT_EQ(quarn_dbus_manual_backup_status(0, 2, data), 42);
+  EXPECT_FALSE(watched_deleted);
+  ASSERT_TRUE(client_->wait_for_callbacks(1));
+  EXPECT_EQ(client_->callbacks(), Texts{"manual_backup_status(17, 6, 7)"});
+  quarn_dbus_manual_backup_status(0, 4, data);
+}
+
+TEST_F(Callbacks, RequestOfAClientThatHasLeftEndsWithoutHarm) {
+  client_cb_data *data = record_for(left());
+  quarn_dbus_accept_request(quarn_request::app_list, "", data);
+  quarn_dbus_end_requests();
+  EXPECT_EQ(quarn_dbus_get_app_list_cb(0, "{}", data), 42);
+}
+
+TEST_F(Callbacks, LastCallbackAndTheEndMeetAndExactlyOneIsSent) {
+  constexpr std::uint32_t kRounds = 200;
+  for (std::uint32_t id = 0; id < kRounds; ++id) {
+    auto *data = new client_cb_data{id, client_->name()};
+    quarn_dbus_accept_request(quarn_request::manual_backup, "", data);
+    std::thread worker([data] { quarn_dbus_manual_backup_status(0, 4, data); });
+    quarn_dbus_end_requests();
+    worker.join();
+  }
+  ASSERT_TRUE(client_->wait_for_callbacks(kRounds));
+  EXPECT_EQ(quarn_dbus_manual_backup_cancel_result(0, record()), 0);
+  EXPECT_EQ(client_->callbacks().size(), kRounds + 1);
+}
+
+/** In a process of its own: it is not to be undone. */
+void stop_while_a_client_is_waited_for() {
+  const ConnectionHandle connection = connect_to_private_bus();
+  quarn_dbus_connection = connection.get();
+  ScriptedClient client;
+  client.keep_silent("manual_backup_status");
+  auto *data = new client_cb_data{7, client.name()};
+  std::thread waiting([data] { quarn_dbus_manual_backup_status(0, 2, data); });
+  if (!client.wait_for_callbacks(1)) std::_Exit(1);
+  quarn_dbus_stop_waiting();
+  waiting.join();
+  // Nobody answers this one either.
+  quarn_dbus_manual_backup_status(0, 4, data);
+  if (!client.wait_for_callbacks(2)) std::_Exit(2);
+  std::_Exit(quarn_dbus_waiting_stopped() ? 0 : 3);
+}
+
+TEST(StopWaitingDeathTest, LetsThoseGoOnThatWaitAndSendsWithoutWaiting) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  private_bus_address();
+  EXPECT_EXIT(stop_while_a_client_is_waited_for(), ::testing::ExitedWithCode(0), "");
+}
+
 /* ---- published signals ---- */
 
 class Publish : public ::testing::Test {

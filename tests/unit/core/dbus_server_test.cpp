@@ -1,6 +1,8 @@
 #include "quarn_dbus_server.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -11,8 +13,10 @@
 #include "private_bus.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_end.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_turn.h"
 #include "quarn_dbus_client.h"
 
 namespace {
@@ -64,6 +68,8 @@ guint __wrap_g_bus_own_name(GBusType type, const gchar *name, GBusNameOwnerFlags
 }
 }
 
+bool is_idle_status() { return true; }
+void quarn_loop_quit() { steps.emplace_back("quit"); }
 void init_last_backup_time() { note("init_last_backup_time"); }
 void request_quarn_terminate(double delay, bool restart) {
   note("terminate " + number(static_cast<int>(delay)) + (restart ? " restart" : ""));
@@ -319,6 +325,91 @@ TEST_F(Server, AnswersAreOnTheirWayWhenTheNameIsGivenUp) {
   EXPECT_TRUE(run_until(acquired));
 }
 
+/* ---- an earlier process that still works ---- */
+
+/** Holds the lock for which the process under test waits, until it is told to go. */
+class EarlierProcess {
+ public:
+  EarlierProcess() {
+    EXPECT_NE(mkdtemp(folder_.data()), nullptr);
+    int ready[2];
+    EXPECT_EQ(pipe2(ready, O_CLOEXEC), 0);
+    EXPECT_EQ(pipe2(hold_, O_CLOEXEC), 0);
+    pid_ = fork();
+    if (pid_ == 0) {
+      close(hold_[1]);
+      begin_quarn_turn(lock().c_str(), nullptr);
+      char byte = 'R';
+      if (write(ready[1], &byte, 1) == 1) static_cast<void>(!read(hold_[0], &byte, 1));
+      _exit(0);
+    }
+    char byte = 0;
+    EXPECT_EQ(read(ready[0], &byte, 1), 1);
+    close(ready[0]);
+    close(ready[1]);
+    close(hold_[0]);
+    begin_quarn_turn(lock().c_str(), quarnd_dispatch_deferred);
+    EXPECT_FALSE(is_quarn_turn());
+  }
+  ~EarlierProcess() {
+    end();
+    unlink(lock().c_str());
+    rmdir(folder_.c_str());
+  }
+  EarlierProcess(const EarlierProcess &) = delete;
+  EarlierProcess &operator=(const EarlierProcess &) = delete;
+  void end() {
+    if (pid_ == 0) return;
+    close(hold_[1]);
+    waitpid(pid_, nullptr, 0);
+    pid_ = 0;
+    EXPECT_TRUE(run_until(is_quarn_turn));
+  }
+
+ private:
+  std::string lock() const { return folder_ + "/lock"; }
+  std::string folder_ = "/tmp/quarn-server-XXXXXX";
+  int hold_[2] = {-1, -1};
+  pid_t pid_ = 0;
+};
+
+/** Once a process: a lock is kept for its life. */
+TEST_F(Server, CallsThatTouchDataWaitForAnEarlierProcessAndTheOthersDoNot) {
+  EarlierProcess earlier;
+  const std::vector<std::pair<const char *, const char *>> waiting = {
+      {"restore_enable", "(1, 0, 's', '[]', uint32 1)"},
+      {"get_app_list", "(0, uint32 2)"},
+      {"app_data_backup_start", "('org.example.notes', uint32 3)"},
+      {"app_data_restore_start", "('org.example.notes', uint32 4)"},
+      {"make_app_data", "('org.example.notes',)"}};
+  std::vector<std::shared_ptr<CallOutcome>> outcomes;
+  for (const auto &[method, arguments] : waiting) {
+    outcomes.push_back(std::make_shared<CallOutcome>());
+    client_->start_call(method, arguments, outcomes.back());
+  }
+  EXPECT_EQ(client_->call("set_activation", "(1,)").reply, "(0,)");
+  EXPECT_EQ(client_->call("restore_enable", "(0, 0, '', '', uint32 5)").reply, "(0,)");
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 6,)").reply, "(0,)");
+  EXPECT_EQ(client_->call("get_app_list", "()").reply, "(-1,)");
+  EXPECT_EQ(steps,
+            (Texts{"cancel", "cancel", "cancel", "cancel", "cancel", "cancel", "cancel",
+                   "restore_enable 0 0   " + id(5), "cancel", "manual_backup " + id(6), "cancel"}));
+  EXPECT_TRUE(quarnd_calls_deferred());
+  for (const auto &outcome : outcomes) EXPECT_FALSE(outcome->finished);
+  steps.clear();
+  earlier.end();
+  EXPECT_TRUE(run_until([&] {
+    return std::all_of(outcomes.begin(), outcomes.end(),
+                       [](const auto &outcome) { return outcome->finished; });
+  }));
+  EXPECT_FALSE(quarnd_calls_deferred());
+  EXPECT_EQ(steps,
+            (Texts{"cancel", "restore_enable 1 0 s [] " + id(1), "cancel",
+                   "get_app_list 0 " + id(2), "cancel", "backup_app_data " + id(3),
+                   "org.example.notes", "cancel", "restore_app_data org.example.notes " + id(4),
+                   "cancel", "make_app_data org.example.notes " + number(getuid())}));
+}
+
 TEST_F(Server, NameThatAnotherOwnsIsLostAndLogged) {
   quarnd_dbus_deinit(owner_id_);
   const ConnectionHandle other = connect_to_private_bus();
@@ -355,6 +446,84 @@ TEST_F(Server, ObjectThatCannotBeRegisteredIsLoggedBeforeTheLineOfSuccess) {
   EXPECT_EQ(*(failure + 1), "g_dbus_connection_register_object() succeed");
   g_dbus_connection_unregister_object(quarn_dbus_connection, in_the_way);
   g_dbus_node_info_unref(node);
+}
+
+/* ---- the end ---- */
+
+TEST_F(Server, CallThatArrivedBeforeTheNameWasGivenUpIsAnswered) {
+  const auto outcome = std::make_shared<CallOutcome>();
+  client_->start_call("backup_enable", "(1,)", outcome);
+  g_dbus_connection_flush_sync(client_->connection(), nullptr, nullptr);
+  // The bus has passed the call on, and nobody has looked at it.
+  client_->call_bus("GetId");
+  quarnd_dbus_leave();
+  EXPECT_EQ(steps, (Texts{"cancel", "backup_enable 1"}));
+  EXPECT_EQ(client_->call("backup_enable", "(1,)").error_name,
+            "org.freedesktop.DBus.Error.ServiceUnknown");
+  EXPECT_EQ(outcome->reply, "(0,)");
+}
+
+TEST_F(Server, EndTakesTheNameBackForACallThatHadArrived) {
+  const auto outcome = std::make_shared<CallOutcome>();
+  inside_handler = [] { withdraw_quarn_end(); };
+  client_->start_call("backup_enable", "(1,)", outcome);
+  client_->call_bus("GetId");
+  clear_captured_log();
+  begin_quarn_end();
+  EXPECT_TRUE(run_until(acquired));
+  EXPECT_EQ(outcome->reply, "(0,)");
+  EXPECT_EQ(client_->call("backup_enable", "(2,)").reply, "(0,)");
+  EXPECT_EQ(std::count(steps.begin(), steps.end(), "quit"), 0);
+}
+
+TEST_F(Server, EndWithoutACallQuitsTheLoopWithoutTheName) {
+  begin_quarn_end();
+  EXPECT_TRUE(run_until([] { return !steps.empty(); }));
+  EXPECT_EQ(steps, Texts{"quit"});
+  EXPECT_EQ(client_->call("backup_enable", "(1,)").error_name,
+            "org.freedesktop.DBus.Error.ServiceUnknown");
+}
+
+TEST_F(Server, BusThatIsGoneEndsTheDaemonWhenItIsIdle) {
+  EXPECT_FALSE(g_dbus_connection_get_exit_on_close(quarn_dbus_connection));
+  g_signal_emit_by_name(quarn_dbus_connection, "closed", TRUE, nullptr);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "the bus is gone : "), 1);
+  EXPECT_TRUE(run_until([] { return !steps.empty(); }));
+  EXPECT_EQ(steps, Texts{"quit"});
+}
+
+/** In a process of its own: it is not to be undone. */
+void serve_calls_at_the_end() {
+  quarnd_dbus_init();
+  if (!run_until(acquired)) _exit(1);
+  ScriptedClient client;
+  quarn_dbus_stop_waiting();
+  steps.clear();
+  const std::vector<std::pair<const char *, const char *>> calls = {
+      {"restore_enable", "(1, 0, 's', '[]', uint32 1)"},
+      {"get_app_list", "(0, uint32 2)"},
+      {"app_data_backup_start", "('org.example.notes', uint32 3)"},
+      {"app_data_restore_start", "('org.example.notes', uint32 4)"},
+      {"make_app_data", "('org.example.notes',)"},
+      {"backup_enable", "(1,)"}};
+  std::string replies;
+  for (const auto &[method, arguments] : calls) replies += client.call(method, arguments).reply;
+  if (!client.wait_for_callbacks(3)) _exit(2);
+  for (const std::string &callback : client.callbacks()) replies += callback + " ";
+  for (const std::string &step : steps) {
+    if (step != "cancel") replies += step;
+  }
+  std::fputs(replies.c_str(), stderr);
+  _exit(0);
+}
+
+TEST(ServerAtTheEndDeathTest, AnswersEveryCallAndBeginsNoWork) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  private_bus_address();
+  EXPECT_EXIT(serve_calls_at_the_end(), ::testing::ExitedWithCode(0),
+              ".36,..17,..0,..0,..17,..0,.get_app_list_cb.17, 'failed', 2. "
+              "app_data_backup_complete.17, 'org.example.notes', 3. "
+              "app_data_restore_complete.17, 'org.example.notes', 4. backup_enable 1");
 }
 
 TEST(ServerStart, UnreadableIntrospectionDataGivesMinusOne) {

@@ -4,9 +4,13 @@
 
 #include <vector>
 
+#include "lifecycle_world.h"
 #include "log_capture.h"
 #include "quarn_d_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+
+bool lifecycle_idle = true;
+int lifecycle_quits = 0;
 
 namespace {
 
@@ -16,8 +20,6 @@ struct Timer {
   void *data;
 };
 
-bool idle = true;
-int quits = 0;
 std::vector<Timer *> timers;
 int timers_made = 0;
 
@@ -38,8 +40,8 @@ class Lifecycle : public ::testing::Test {
   void SetUp() override {
     cancel_quarn_terminate();
     quarn_exit_code = 0;
-    idle = true;
-    quits = 0;
+    lifecycle_idle = true;
+    lifecycle_quits = 0;
     timers_made = 0;
     clear_captured_log();
   }
@@ -51,7 +53,7 @@ class Lifecycle : public ::testing::Test {
 
 TEST_F(Lifecycle, RequestWithRestartQuitsAtOnceWithMinusOne) {
   request_quarn_terminate(0.0, true);
-  EXPECT_EQ(quits, 1);
+  EXPECT_EQ(lifecycle_quits, 1);
   EXPECT_EQ(quarn_exit_code, -1);
   EXPECT_EQ(count_logged(DLOG_INFO, "terminate quarn"), 1);
   EXPECT_TRUE(timers.empty());
@@ -60,19 +62,19 @@ TEST_F(Lifecycle, RequestWithRestartQuitsAtOnceWithMinusOne) {
 TEST_F(Lifecycle, RequestWithoutRestartQuitsAtOnceWithZero) {
   quarn_exit_code = -1;
   request_quarn_terminate(0.0, false);
-  EXPECT_EQ(quits, 1);
+  EXPECT_EQ(lifecycle_quits, 1);
   EXPECT_EQ(quarn_exit_code, 0);
 }
 
 TEST_F(Lifecycle, DelayedRequestQuitsWhenItsTimerFires) {
   request_quarn_terminate(5.0, true);
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
   EXPECT_EQ(quarn_exit_code, -1);
   EXPECT_EQ(count_logged(DLOG_INFO, "terminate quarn"), 0);
   ASSERT_EQ(timers.size(), 1u);
   EXPECT_EQ(timers[0]->seconds, 5.0);
   fire(timers[0]);
-  EXPECT_EQ(quits, 1);
+  EXPECT_EQ(lifecycle_quits, 1);
   EXPECT_EQ(count_logged(DLOG_INFO, "terminate quarn"), 1);
 }
 
@@ -103,31 +105,31 @@ TEST_F(Lifecycle, CancelDropsThePendingTimer) {
   request_quarn_terminate(5.0, false);
   cancel_quarn_terminate();
   EXPECT_TRUE(timers.empty());
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
 }
 
 TEST_F(Lifecycle, CancelWithoutATimerDoesNothing) {
   cancel_quarn_terminate();
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
 }
 
 TEST_F(Lifecycle, RequestWhileTheNameIsAskedForWaitsForIt) {
   hold_quarn_terminate();
   request_quarn_terminate(0.0, true);
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
   release_quarn_terminate();
-  EXPECT_EQ(quits, 1);
+  EXPECT_EQ(lifecycle_quits, 1);
   EXPECT_EQ(quarn_exit_code, -1);
   release_quarn_terminate();
-  EXPECT_EQ(quits, 1);
+  EXPECT_EQ(lifecycle_quits, 1);
 }
 
 TEST_F(Lifecycle, RequestThatWaitedIsDroppedWhenTheDaemonIsBusyByThen) {
   hold_quarn_terminate();
   request_quarn_terminate(0.0, false);
-  idle = false;
+  lifecycle_idle = false;
   release_quarn_terminate();
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
   EXPECT_EQ(count_logged(DLOG_INFO, "Not in idle state"), 1);
 }
 
@@ -136,16 +138,16 @@ TEST_F(Lifecycle, CallDropsARequestThatWaits) {
   request_quarn_terminate(0.0, false);
   cancel_quarn_terminate();
   release_quarn_terminate();
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
 }
 
 TEST_F(Lifecycle, RequestWhileBusyChangesNothingNotEvenTheExitCode) {
   request_quarn_terminate(5.0, true);
   const Timer *pending = timers[0];
-  idle = false;
+  lifecycle_idle = false;
   for (const double delay : {0.0, 3.0}) request_quarn_terminate(delay, false);
   EXPECT_EQ(quarn_exit_code, -1);
-  EXPECT_EQ(quits, 0);
+  EXPECT_EQ(lifecycle_quits, 0);
   ASSERT_EQ(timers.size(), 1u);
   EXPECT_EQ(timers[0], pending);
   EXPECT_EQ(count_logged(DLOG_INFO, "Not in idle state"), 2);
@@ -154,8 +156,8 @@ TEST_F(Lifecycle, RequestWhileBusyChangesNothingNotEvenTheExitCode) {
 
 }  // namespace
 
-bool is_idle_status() { return idle; }
-void quarn_loop_quit() { ++quits; }
+bool is_idle_status() { return lifecycle_idle; }
+void quarn_loop_quit() { ++lifecycle_quits; }
 void *quarn_loop_timer_add(double seconds, unsigned char (*callback)(void *), void *data) {
   ++timers_made;
   timers.push_back(new Timer{seconds, callback, data});

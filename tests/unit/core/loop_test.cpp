@@ -316,7 +316,17 @@ TEST(QuitNestedLoopsDeathTest, EndsTheInnermostFirstAndRefusesFurtherOnes) {
 
 /* ---- signals; each in a process of its own ---- */
 
-void print_signal(int signo) { std::fprintf(stderr, "signal %d;", signo); }
+int take_signal(int signo) {
+  std::fprintf(stderr, "signal %d;", signo);
+  return 0;
+}
+
+void begin_end() { std::fputs("begin;", stderr); }
+void last() { std::fputs("last;", stderr); }
+
+bool watch_signals(void (*end)(int), int grace_ms, int (*take)(int) = take_signal) {
+  return quarn_loop_watch_signals({take, begin_end, end, last, grace_ms});
+}
 
 void end_of(int signo) {
   std::fprintf(stderr, "end %d on %s;", signo,
@@ -328,7 +338,7 @@ void end_never(int) { std::fputs("ended", stderr); }
 
 void run_until_signal(int signo) {
   quarn_loop_init();
-  if (!quarn_loop_watch_signals(print_signal, end_of, kDeadlineSeconds * 1000)) std::_Exit(1);
+  if (!watch_signals(end_of, kDeadlineSeconds * 1000)) std::_Exit(1);
   std::signal(signo, quarn_loop_wake_from_signal);
   on_main_loop([signo] { raise(signo); });
   quarn_loop_begin();
@@ -343,7 +353,7 @@ void end_with_nested_loops(int) {
 
 void signal_inside_a_nested_loop() {
   quarn_loop_init();
-  if (!quarn_loop_watch_signals(print_signal, end_with_nested_loops, kDeadlineSeconds * 1000)) {
+  if (!watch_signals(end_with_nested_loops, kDeadlineSeconds * 1000)) {
     std::_Exit(1);
   }
   std::signal(SIGTERM, quarn_loop_wake_from_signal);
@@ -360,7 +370,7 @@ void signal_inside_a_nested_loop() {
 
 void block_under_signal() {
   quarn_loop_init();
-  if (!quarn_loop_watch_signals(print_signal, end_never, 100)) std::_Exit(1);
+  if (!watch_signals(end_never, 100)) std::_Exit(1);
   std::signal(SIGTERM, quarn_loop_wake_from_signal);
   raise(SIGTERM);
   while (true) pause();
@@ -375,25 +385,73 @@ TEST_P(SignalDeathTest, IsLoggedAndEndsOnTheMainThread) {
   const int signo = GetParam();
   const std::string number = std::to_string(signo);
   EXPECT_EXIT(run_until_signal(signo), ::testing::ExitedWithCode(4),
-              "signal " + number + ";end " + number + " on main;");
+              "signal " + number + ";begin;end " + number + " on main;");
 }
 
 INSTANTIATE_TEST_SUITE_P(All, SignalDeathTest, ::testing::Values(SIGINT, SIGHUP, SIGTERM, SIGQUIT));
 
 TEST(NestedLoopDeathTest, IsLeftUnderASignal) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_EXIT(signal_inside_a_nested_loop(), ::testing::ExitedWithCode(4), "signal 15;unwound");
+  EXPECT_EXIT(signal_inside_a_nested_loop(), ::testing::ExitedWithCode(4),
+              "signal 15;begin;unwound");
 }
 
 TEST(BlockedMainThreadDeathTest, EndsWithStatusZeroAfterTheGracePeriod) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_EXIT(block_under_signal(), ::testing::ExitedWithCode(0), "signal 15;$");
+  EXPECT_EXIT(block_under_signal(), ::testing::ExitedWithCode(0), "signal 15;begin;last;$");
+}
+
+int ignore_usr1(int signo) {
+  std::fprintf(stderr, "signal %d;", signo);
+  if (signo == SIGUSR1) on_main_loop([] { raise(SIGTERM); });
+  return signo == SIGUSR1 ? -1 : 0;
+}
+
+int put_off_term(int signo) {
+  std::fprintf(stderr, "signal %d;", signo);
+  return signo == SIGTERM ? 50 : 0;
+}
+
+int put_off_term_for_long(int signo) {
+  std::fprintf(stderr, "signal %d;", signo);
+  if (signo == SIGTERM) on_main_loop([] { raise(SIGINT); });
+  return signo == SIGTERM ? kDeadlineSeconds * 1000 : 0;
+}
+
+void run_until_end_by(int signo, int (*take)(int)) {
+  quarn_loop_init();
+  if (!watch_signals(end_of, kDeadlineSeconds * 1000, take)) std::_Exit(1);
+  for (const int watched : {SIGINT, SIGTERM, SIGUSR1}) {
+    std::signal(watched, quarn_loop_wake_from_signal);
+  }
+  on_main_loop([signo] { raise(signo); });
+  quarn_loop_begin();
+  quarn_loop_shutdown();
+  std::_Exit(4);
+}
+
+TEST(SignalThatIsNoEndDeathTest, IsTakenAndTheNextOneEndsTheProcess) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(run_until_end_by(SIGUSR1, ignore_usr1), ::testing::ExitedWithCode(4),
+              "signal 10;signal 15;begin;end 15 on main;");
+}
+
+TEST(SignalThatIsPutOffDeathTest, EndsTheProcessWhenItsTimeIsOver) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(run_until_end_by(SIGTERM, put_off_term), ::testing::ExitedWithCode(4),
+              "signal 15;begin;end 15 on main;");
+}
+
+TEST(SignalThatIsPutOffDeathTest, IsOvertakenByAnother) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(run_until_end_by(SIGTERM, put_off_term_for_long), ::testing::ExitedWithCode(4),
+              "signal 15;signal 2;begin;end 2 on main;");
 }
 
 void exhaust_descriptors_and_watch() {
   const rlimit none{0, 0};
   setrlimit(RLIMIT_NOFILE, &none);
-  const bool watched = quarn_loop_watch_signals(print_signal, end_of, 1);
+  const bool watched = watch_signals(end_of, 1);
   quarn_loop_wake_from_signal(SIGTERM);
   std::_Exit(watched ? 1 : 5);
 }

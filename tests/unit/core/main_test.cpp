@@ -9,6 +9,7 @@
 
 #include "log_capture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_end.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
@@ -16,7 +17,9 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
+#include "quarn_d_turn.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
 
@@ -33,9 +36,10 @@ bool account = true;
 bool watchable = true;
 /** What happens in the main loop. */
 void (*in_loop)() = nullptr;
-void (*end_by_signal)(int) = nullptr;
-void (*log_signal)(int) = nullptr;
-int grace = 0;
+quarn_signal_watch hooks{};
+bool waiting_stopped = false;
+bool answer_to_given_up_name = false;
+void (*on_turn)() = nullptr;
 std::vector<int> woken;
 int (*wifi_probe)() = nullptr;
 bool (*pending_probe)() = nullptr;
@@ -63,12 +67,36 @@ bool server_util_is_account_exist() {
   step("account");
   return account;
 }
-bool quarn_loop_watch_signals(void (*log)(int), void (*end)(int), int grace_ms) {
+bool quarn_loop_watch_signals(const quarn_signal_watch &watch) {
   step("watch_signals");
-  log_signal = log;
-  end_by_signal = end;
-  grace = grace_ms;
+  hooks = watch;
   return watchable;
+}
+bool is_answer_to_given_up_name(int signo) { return signo == SIGTERM && answer_to_given_up_name; }
+void end_quarn_when_idle() { step("end_when_idle"); }
+void quarn_dbus_stop_waiting() { waiting_stopped = true; }
+void quarn_dbus_end_requests() { step("end_requests"); }
+void quarn_dbus_flush(unsigned int ms) {
+  EXPECT_LT(ms, 1000u);
+  step("flush");
+}
+void quarnd_dbus_leave() {
+  EXPECT_TRUE(waiting_stopped);
+  step("dbus_leave");
+}
+bool calls_deferred = false;
+bool quarnd_calls_deferred() { return calls_deferred; }
+void quarnd_dispatch_deferred() { step("dispatch_deferred"); }
+bool prepare_staging_directory() { return true; }
+void begin_quarn_turn(const char *lock_file, void (*observer)()) {
+  step("begin_turn");
+  EXPECT_STREQ(lock_file, "/tmp/quarn/lock");
+  on_turn = observer;
+}
+std::atomic<bool> manual_backup_canceled{false};
+void cancel_backup(void *client) {
+  EXPECT_EQ(client, nullptr);
+  step("cancel_backup");
 }
 void quarn_loop_wake_from_signal(int signo) { woken.push_back(signo); }
 void quarn_loop_init() {
@@ -103,7 +131,8 @@ int start_wifi_monitor() {
 int wifi_connected() { return 1; }
 void monitor_auto_backup_status() { step("monitor_auto_backup_status"); }
 void init_backup_req_dispatch_thread() { step("init_backup_req_dispatch_thread"); }
-bool backup_request_outstanding() { return true; }
+bool backups_outstanding = true;
+bool backup_request_outstanding() { return backups_outstanding; }
 void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
@@ -131,6 +160,11 @@ class Main : public ::testing::Test {
     in_loop = nullptr;
     quarn_exit_code = 0;
     woken.clear();
+    waiting_stopped = false;
+    answer_to_given_up_name = false;
+    calls_deferred = false;
+    backups_outstanding = true;
+    manual_backup_canceled = false;
     wifi_probe = nullptr;
     pending_probe = nullptr;
     restore_disable = nullptr;
@@ -157,13 +191,26 @@ class Main : public ::testing::Test {
 
 TEST_F(Main, RunsItsStepsInOrder) {
   EXPECT_EQ(quarn_run(), 0);
-  EXPECT_EQ(
-      captured_texts(),
-      (Texts{"Quarn Daemon start", "account", "watch_signals", "progress_init", "loop_init",
-             "dbus_init", "init_backup_resource", "start_wifi_monitor",
-             LIVE_STEP "init_backup_req_dispatch_thread", "== main loop begin ==", "loop_begin",
-             "deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport", "dbus_deinit",
-             "ecore_shutdown ~", "loop_shutdown", "Good-Bye from Quarn"}));
+  EXPECT_EQ(captured_texts(), (Texts{"Quarn Daemon start",
+                                     "account",
+                                     "watch_signals",
+                                     "begin_turn",
+                                     "progress_init",
+                                     "loop_init",
+                                     "dbus_init",
+                                     "init_backup_resource",
+                                     "start_wifi_monitor",
+                                     LIVE_STEP "init_backup_req_dispatch_thread",
+                                     "== main loop begin ==",
+                                     "loop_begin",
+                                     "end_requests",
+                                     "deinit_backup_resource",
+                                     "quarnd_dbus_deinit ~",
+                                     "status_unexport",
+                                     "dbus_deinit",
+                                     "ecore_shutdown ~",
+                                     "loop_shutdown",
+                                     "Good-Bye from Quarn"}));
 }
 
 TEST_F(Main, WithoutAnAccountNothingIsStarted) {
@@ -207,26 +254,65 @@ TEST_F(Main, HandlerOnlyWakesTheWatcher) {
   EXPECT_TRUE(captured_texts().empty());
 }
 
-TEST_F(Main, SignalIsLoggedWithItsNumber) {
+TEST_F(Main, SignalIsLoggedWithItsNumberAndEndsTheProcessAtOnce) {
   quarn_run();
   restart();
-  log_signal(SIGQUIT);
+  EXPECT_EQ(hooks.take(SIGQUIT), 0);
   EXPECT_EQ(captured_texts(), Texts{"SIGNAL 3 received"});
-  EXPECT_GT(grace, 0);
-  EXPECT_LT(grace, 1000);
+  EXPECT_EQ(hooks.begin_end, quarn_dbus_stop_waiting);
+  EXPECT_GT(hooks.grace_ms, 0);
+  EXPECT_LT(hooks.grace_ms, 1000);
 }
 
-TEST_F(Main, SignalTearsDownOnceAndEndsWithZero) {
+TEST_F(Main, SignalTellsTheClientsTearsDownOnceAndEndsWithZero) {
   in_loop = [] {
     quarn_exit_code = -1;
     restart();
-    end_by_signal(SIGTERM);
+    hooks.end(SIGTERM);
   };
   EXPECT_EQ(quarn_run(), 0);
   EXPECT_EQ(captured_texts(),
-            (Texts{"deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport",
-                   "dbus_deinit", "ecore_shutdown ~", "loop_shutdown", "quit_nested_loops",
-                   "loop_quit", "Good-Bye from Quarn"}));
+            (Texts{"end_requests", "quit_nested_loops", "loop_quit", "dbus_leave", "end_requests",
+                   "deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport",
+                   "dbus_deinit", "ecore_shutdown ~", "loop_shutdown", "Good-Bye from Quarn"}));
+}
+
+TEST_F(Main, ProcessThatDoesNotEndTellsItsClientsLast) {
+  quarn_run();
+  restart();
+  hooks.last();
+  EXPECT_EQ(steps, (Texts{"end_requests", "flush"}));
+}
+
+TEST_F(Main, ServiceManagersAnswerToTheNameGivenUpLeavesTimeForTheWork) {
+  quarn_run();
+  restart();
+  answer_to_given_up_name = true;
+  EXPECT_EQ(hooks.take(SIGTERM), 80000);
+  EXPECT_EQ(steps, Texts{});
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+  EXPECT_EQ(steps, Texts{"end_when_idle"});
+}
+
+TEST_F(Main, CancelFromTheNextProcessIsCarriedOutOnTheMainThread) {
+  quarn_run();
+  restart();
+  EXPECT_LT(hooks.take(kCancelSignal), 0);
+  EXPECT_FALSE(manual_backup_canceled);
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+  EXPECT_TRUE(manual_backup_canceled);
+  EXPECT_EQ(captured_texts(), (Texts{"cancel from the next process", "cancel_backup"}));
+}
+
+TEST_F(Main, CallsThatWaitForTheEarlierProcessKeepTheDaemonAndFollowIt) {
+  quarn_run();
+  backups_outstanding = false;
+  EXPECT_FALSE(pending_probe());
+  calls_deferred = true;
+  EXPECT_TRUE(pending_probe());
+  EXPECT_EQ(on_turn, quarnd_dispatch_deferred);
 }
 
 TEST_F(Main, InitTwiceLogsAndAsksForTheBusOnce) {

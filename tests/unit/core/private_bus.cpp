@@ -231,6 +231,14 @@ void ScriptedClient::start_call(const std::string &method, const std::string &ar
                          new std::shared_ptr<CallOutcome>(std::move(outcome)));
 }
 
+void ScriptedClient::call_bus(const char *method) const {
+  GErrorPtr error;
+  const GVariantPtr reply(g_dbus_connection_call_sync(
+      connection_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+      method, nullptr, nullptr, G_DBUS_CALL_FLAGS_NONE, -1, nullptr, out(error)));
+  EXPECT_TRUE(reply) << error->message;
+}
+
 CallOutcome ScriptedClient::call(const std::string &method, const std::string &arguments,
                                  const char *interface_name) {
   const auto outcome = std::make_shared<CallOutcome>();

@@ -71,6 +71,9 @@ class ScriptedClient {
                   std::shared_ptr<CallOutcome> outcome,
                   const char *interface_name = "org.orvane.Quarn");
 
+  /** Ask the bus itself and wait for its answer. */
+  void call_bus(const char *method) const;
+
   GDBusConnection *connection() const { return connection_.get(); }
 
  private:

@@ -1,0 +1,125 @@
+#include "quarn_d_turn.h"
+
+#include <fcntl.h>
+#include <glib.h>
+#include <poll.h>
+#include <pthread.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <condition_variable>
+#include <csignal>
+#include <mutex>
+
+#include "quarn_d_utils/handles.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr mode_t kLockMode = 0600;
+constexpr std::size_t kWaiterStackSize = 131072;
+
+// Never destroyed: threads wait here when the process ends.
+std::mutex &turn_mutex = *new std::mutex;
+std::condition_variable &turn_changed = *new std::condition_variable;
+std::atomic<bool> turn{true};
+int lock_fd = -1;
+void (*turn_observer)() = nullptr;
+
+/** A record lock: it belongs to the process, goes with it, and tells who holds it. */
+struct flock whole_file() {
+  struct flock lock {};
+  lock.l_type = F_WRLCK;
+  lock.l_whence = SEEK_SET;
+  return lock;
+}
+
+pid_t holder() {
+  struct flock lock = whole_file();
+  if (fcntl(lock_fd, F_GETLK, &lock) != 0 || lock.l_type == F_UNLCK) return 0;
+  return lock.l_pid;
+}
+
+gboolean tell_observer(gpointer) {
+  if (turn_observer != nullptr) turn_observer();
+  return G_SOURCE_REMOVE;
+}
+
+void take_turn() {
+  {
+    const std::lock_guard<std::mutex> lock(turn_mutex);
+    turn = true;
+  }
+  turn_changed.notify_all();
+  g_idle_add_full(G_PRIORITY_DEFAULT, tell_observer, nullptr, nullptr);
+}
+
+void *wait_for_lock(void *) {
+  struct flock lock = whole_file();
+  while (fcntl(lock_fd, F_SETLKW, &lock) != 0) {
+    if (errno == EINTR) continue;
+    LOGE("cannot wait for the earlier process : %d", errno);
+    break;
+  }
+  take_turn();
+  return nullptr;
+}
+
+bool start_waiter() {
+  pthread_attr_t attributes;
+  pthread_attr_init(&attributes);
+  pthread_attr_setstacksize(&attributes, kWaiterStackSize);
+  pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
+  sigset_t all;
+  sigset_t before;
+  sigfillset(&all);
+  pthread_sigmask(SIG_SETMASK, &all, &before);
+  pthread_t thread;
+  const int error = pthread_create(&thread, &attributes, wait_for_lock, nullptr);
+  pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  pthread_attr_destroy(&attributes);
+  if (error != 0) LOGE("pthread_create() failed : %d", error);
+  return error == 0;
+}
+
+}  // namespace
+
+void begin_quarn_turn(const char *lock_file, void (*on_turn)()) {
+  turn_observer = on_turn;
+  if (lock_fd < 0) {
+    lock_fd = open(lock_file, O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode);
+  }
+  if (lock_fd < 0) {
+    LOGE("cannot open %s : %d", lock_file, errno);
+    return;
+  }
+  struct flock lock = whole_file();
+  if (fcntl(lock_fd, F_SETLK, &lock) == 0) return;
+  if (errno != EACCES && errno != EAGAIN) {
+    LOGE("cannot lock %s : %d", lock_file, errno);
+    return;
+  }
+  LOGI("an earlier process still works");
+  turn = false;
+  if (!start_waiter()) take_turn();
+}
+
+bool is_quarn_turn() { return turn; }
+
+bool wait_for_quarn_turn(int ms) {
+  std::unique_lock<std::mutex> lock(turn_mutex);
+  return turn_changed.wait_for(lock, std::chrono::milliseconds(ms), [] { return turn.load(); });
+}
+
+bool signal_quarn_predecessor(int signo) {
+  if (turn || lock_fd < 0) return false;
+  const pid_t process = holder();
+  if (process <= 0) return false;
+  const UniqueFd handle(static_cast<int>(syscall(SYS_pidfd_open, process, 0)));
+  // Looked at again: what was opened may be a later process of that number.
+  if (!handle || holder() != process) return false;
+  return syscall(SYS_pidfd_send_signal, handle.get(), signo, nullptr, 0) == 0;
+}

@@ -1,0 +1,29 @@
+/**
+ * @file quarn_d_turn.h
+ * @brief Whose turn it is to write, when the bus has started a process while its predecessor
+ * still finishes its work.
+ *
+ * The turn is a lock on a file that the process keeps for its life. Without
+ * begin_quarn_turn(), or where the file cannot be had, it is always one's turn.
+ */
+#ifndef QUARN_D_TURN_H
+#define QUARN_D_TURN_H
+
+/**
+ * Ask for the turn without waiting for it. Once, on the main thread.
+ * @param lock_file a file in a folder that only the daemon's user can enter
+ * @param on_turn   called once on the main thread when the turn comes later; not when it is there
+ */
+void begin_quarn_turn(const char *lock_file, void (*on_turn)());
+
+/** Any thread. */
+bool is_quarn_turn();
+
+/** Wait up to @p ms. @return is_quarn_turn(). Any thread but the main one. */
+bool wait_for_quarn_turn(int ms);
+
+/** Send a signal to the process whose turn it is. @return false when it is one's own. Any thread.
+ */
+bool signal_quarn_predecessor(int signo);
+
+#endif

@@ -1,0 +1,156 @@
+// The turn belongs to a process, so each case is played by processes of its own.
+#include "quarn_d_turn.h"
+
+#include <fcntl.h>
+#include <glib.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+#include <thread>
+
+namespace {
+
+constexpr int kDeadlineMs = 20000;
+
+/** A folder with the lock in it. */
+class Folder {
+ public:
+  Folder() { EXPECT_NE(mkdtemp(path_.data()), nullptr); }
+  ~Folder() {
+    unlink(lock().c_str());
+    rmdir(path_.c_str());
+  }
+  Folder(const Folder &) = delete;
+  Folder &operator=(const Folder &) = delete;
+  std::string lock() const { return path_ + "/lock"; }
+
+ private:
+  std::string path_ = "/tmp/quarn-turn-XXXXXX";
+};
+
+/** A process that holds the lock until its pipe is closed; it counts SIGUSR1. */
+class Holder {
+ public:
+  explicit Holder(const std::string &lock) {
+    EXPECT_EQ(pipe2(hold_, O_CLOEXEC), 0);
+    EXPECT_EQ(pipe2(tell_, O_CLOEXEC), 0);
+    pid_ = fork();
+    if (pid_ == 0) hold(lock);
+    close(hold_[0]);
+    close(tell_[1]);
+    EXPECT_EQ(read_told(), 'H');
+  }
+  ~Holder() { let_go(); }
+  Holder(const Holder &) = delete;
+  Holder &operator=(const Holder &) = delete;
+  char read_told() const {
+    char told = 0;
+    while (read(tell_[0], &told, 1) < 0 && errno == EINTR) {
+    }
+    return told;
+  }
+  void let_go() {
+    if (pid_ <= 0) return;
+    close(hold_[1]);
+    waitpid(pid_, nullptr, 0);
+    close(tell_[0]);
+    pid_ = 0;
+  }
+
+ private:
+  static void on_signal(int) { static_cast<void>(!write(told_fd, "C", 1)); }
+  [[noreturn]] void hold(const std::string &lock) {
+    close(hold_[1]);
+    told_fd = tell_[1];
+    std::signal(SIGUSR1, on_signal);
+    begin_quarn_turn(lock.c_str(), nullptr);
+    if (is_quarn_turn()) on_signal_ready();
+    char nothing = 0;
+    while (read(hold_[0], &nothing, 1) < 0 && errno == EINTR) {
+    }
+    _exit(0);
+  }
+  static void on_signal_ready() { static_cast<void>(!write(told_fd, "H", 1)); }
+  static int told_fd;
+  int hold_[2] = {-1, -1};
+  int tell_[2] = {-1, -1};
+  pid_t pid_ = 0;
+};
+
+int Holder::told_fd = -1;
+
+bool turn_told = false;
+void on_turn() { turn_told = true; }
+
+void check(bool holds, const char *what) {
+  if (holds) return;
+  std::fprintf(stderr, "failed: %s;", what);
+  _exit(1);
+}
+
+void take_a_free_turn() {
+  const Folder folder;
+  begin_quarn_turn(folder.lock().c_str(), on_turn);
+  check(is_quarn_turn(), "the turn is there");
+  check(wait_for_quarn_turn(0), "nothing to wait for");
+  check(!signal_quarn_predecessor(SIGUSR1), "nobody is before it");
+  struct stat status {};
+  check(stat(folder.lock().c_str(), &status) == 0 && (status.st_mode & 07777) == 0600,
+        "the lock is the owner's alone");
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+  check(!turn_told, "a turn that is there is not told of");
+  unlink(folder.lock().c_str());
+  _exit(::testing::Test::HasFailure() ? 1 : 0);
+}
+
+void wait_for_the_turn() {
+  const Folder folder;
+  Holder holder(folder.lock());
+  begin_quarn_turn(folder.lock().c_str(), on_turn);
+  check(!is_quarn_turn(), "another has it");
+  check(!wait_for_quarn_turn(10), "it keeps it");
+  check(signal_quarn_predecessor(SIGUSR1), "it can be told");
+  check(holder.read_told() == 'C', "it is told");
+  std::thread waiter([] { check(wait_for_quarn_turn(kDeadlineMs), "a thread gets its turn"); });
+  holder.let_go();
+  waiter.join();
+  check(is_quarn_turn(), "the turn has come");
+  while (!turn_told) g_main_context_iteration(nullptr, TRUE);
+  check(!signal_quarn_predecessor(SIGUSR1), "nobody is before it any more");
+  unlink(folder.lock().c_str());
+  _exit(::testing::Test::HasFailure() ? 1 : 0);
+}
+
+void go_without_a_lock() {
+  begin_quarn_turn("/nowhere/at/all/lock", on_turn);
+  check(is_quarn_turn(), "it is always one's turn");
+  check(!signal_quarn_predecessor(SIGUSR1), "nobody is known");
+  _exit(0);
+}
+
+class TurnDeathTest : public ::testing::Test {
+ protected:
+  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
+};
+
+TEST_F(TurnDeathTest, IsThereWhenNobodyElseHasIt) {
+  EXPECT_EXIT(take_a_free_turn(), ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(TurnDeathTest, ComesWhenTheEarlierProcessEnds) {
+  EXPECT_EXIT(wait_for_the_turn(), ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(TurnDeathTest, IsAlwaysThereWithoutALock) {
+  EXPECT_EXIT(go_without_a_lock(), ::testing::ExitedWithCode(0), "");
+}
+
+}  // namespace
