@@ -44,6 +44,11 @@ constexpr Words kReasons[] = {
     {"no-space", "not enough free space on the device"},
     {"disabled", "the application does not allow it"},
     {"unreadable", "its data could not be read"},
+    {"rules", "its rules file cannot be used"},
+    {"too-many-files", "it has too many files"},
+    {"names-too-long", "its file names are too long"},
+    {"table-too-large", "the table of its files is too large"},
+    {"too-deep", "its directories are too deep"},
     {"upload-failed", "the upload failed"},
     {"not-installed", "restore mode ended before it was installed"},
 };

@@ -4,6 +4,7 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
@@ -169,6 +170,11 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
 int check_current_backup_size(backup_context *ctx) {
   parse_backup_path_xml(ctx->cur_pkg_id.c_str(), ctx->cur_pkg_type.c_str(),
                         ctx->cur_root_path.c_str());
+  if (!backup_rules_usable()) {
+    LOGE("rules file of (%s) cannot be used, so will not backup data", ctx->cur_pkg_id.c_str());
+    report_package(ctx, backup_outcome::unusable_rules);
+    return QUARN_REFUSED;
+  }
   const std::uint64_t size = get_app_backup_size(ctx);
   const std::uint64_t available = get_dir_available_size(ctx->cur_root_path.c_str());
   LOGI("app backup size : %llu, available space size : %llu", static_cast<unsigned long long>(size),

@@ -128,12 +128,17 @@ enum class backup_stage { checking, archiving, uploading, listing, cleaning, fin
 enum class backup_outcome {
   none,
   uploaded,
-  unchanged,  /**< the cloud has this archive already */
-  external,   /**< its data lies on external storage */
-  too_large,  /**< size is over limit, the cap */
-  no_space,   /**< size is over limit, the free space */
-  disabled,   /**< an application of it opted out */
-  unreadable, /**< its data could not be read or packed whole */
+  unchanged,       /**< the cloud has this archive already */
+  external,        /**< its data lies on external storage */
+  too_large,       /**< size is over limit, the cap */
+  no_space,        /**< size is over limit, the free space */
+  disabled,        /**< an application of it opted out */
+  unreadable,      /**< its data could not be read or packed whole */
+  unusable_rules,  /**< what its rules file says cannot be known */
+  too_many_files,  /**< files, directories and links: size is over limit, the bound */
+  names_too_long,  /**< all names together, bytes: size is over limit, the bound */
+  table_too_large, /**< the archive's file-info table, bytes: size is over limit, the bound */
+  too_deep,        /**< directories in one another: limit is the bound */
   upload_failed
 };
 

@@ -7,6 +7,7 @@
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
@@ -389,6 +390,12 @@ struct ReleaseTable {
 void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
                    std::uint64_t max_size) {
   const std::lock_guard<std::mutex> lock(package_data_mutex);
+  if (!backup_rules_usable()) {
+    LOGE("(%s) is not packed, because its rules file cannot be used: %s", pkg_id,
+         rules_state_text(backup_rules_state()));
+    *error = QUARN_REFUSED;
+    return;
+  }
   if (is_half_restored(pkg_id, root)) {
     LOGE("restore of (%s) was interrupted, so its data is not packed", pkg_id);
     *error = QUARN_REFUSED;
