@@ -128,6 +128,25 @@ void report_package(backup_context *ctx, backup_outcome outcome, std::uint64_t s
   report_progress(ctx, backup_stage::archiving, ctx->cur_pkg_id.c_str(), outcome, size, limit);
 }
 
+/** What a package is told to be whose archive failed. */
+backup_outcome outcome_of(archive_bound bound) {
+  switch (bound) {
+    case archive_bound::none:
+      break;
+    case archive_bound::content:
+      return backup_outcome::too_large;
+    case archive_bound::members:
+      return backup_outcome::too_many_files;
+    case archive_bound::names:
+      return backup_outcome::names_too_long;
+    case archive_bound::table:
+      return backup_outcome::table_too_large;
+    case archive_bound::depth:
+      return backup_outcome::too_deep;
+  }
+  return backup_outcome::unreadable;
+}
+
 /** make_app_data_zip() between taking the staged archive and settling what becomes of it. */
 int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (app_data_storage_is_external(ctx->cur_pkg_id.c_str())) {
@@ -139,13 +158,14 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (skipped != QUARN_OK) return skipped;
 
   int error = QUARN_OK;
+  archive_excess excess;
   make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), archive_path.c_str(), &error,
-                kMaxBackupSize);
+                kBackupBounds, &excess);
   if (error != QUARN_OK) {
     LOGE("fail to make zip data for %s", ctx->cur_pkg_id.c_str());
     delete_staged_file(archive_path);
-    report_package(ctx, backup_outcome::unreadable);
-    return error;
+    report_package(ctx, outcome_of(excess.bound), excess.size, excess.limit);
+    return excess.bound == archive_bound::none ? error : QUARN_SKIPPED;
   }
 
   ctx->cur_crc = static_cast<std::int32_t>(get_file_crc(archive_path.c_str()));
