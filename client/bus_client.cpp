@@ -313,7 +313,7 @@ void BusClient::on_reply(GObject *source, GAsyncResult *result, gpointer user_da
 }
 
 void BusClient::read_kept_packages(Reply reply, Failure failure) {
-  call_object(kStatusPath, kPropertiesInterface, "Get",
+  call_object({kStatusPath, kPropertiesInterface, "Get", false},
               g_variant_new("(ss)", kCleanUpInterface, "KeptPackages"), "(v)", std::move(reply),
               std::move(failure));
 }

@@ -47,6 +47,10 @@ constexpr Words kReasons[] = {
     {"too-deep", "its folders are nested too deeply"},
     {"unreadable", "its data could not be read"},
     {"restoring", "a restore is to have its backup first"},
+    {"rules", "its rules file cannot be used"},
+    {"too-many-files", "it has too many files"},
+    {"names-too-long", "its file names are too long"},
+    {"table-too-large", "the table of its files is too large"},
     {"upload-failed", "the upload failed"},
     {"not-installed", "restore mode ended before it was installed"},
 };

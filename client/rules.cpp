@@ -62,28 +62,34 @@ bool exists(const std::string &path) {
 
 /** Why the daemon gets no document out of a file that is there. */
 rule_problem unusable_file(const rules_report &report, const std::string &path) {
-  struct stat status {};
   if (!file_exist(path.c_str())) {
     return {"unreadable", 0, report.file, "the rules file is no regular file: it is ignored"};
   }
   if (!safe_open(path.c_str(), O_RDONLY)) {
     return {"unreadable", 0, report.file, "the rules file cannot be read: it is ignored"};
   }
-  if (safe_lstat(path.c_str(), &status) == 0 &&
-      static_cast<std::size_t>(status.st_size) > kMaxRulesSize) {
-    return {"too-large", 0, report.file,
-            "larger than " + std::to_string(kMaxRulesSize) + " bytes: the file is ignored"};
-  }
   return {"malformed", 0, report.file, "not readable as XML: the file is ignored"};
+}
+
+/** Why nothing of an application with such a file is backed up. */
+rule_problem blocking_file(const rules_report &report, rules_state state) {
+  const char *kind = state == rules_state::too_large  ? "too-large"
+                     : state == rules_state::entities ? "entities"
+                                                      : "no-library";
+  return {kind, 0, report.file,
+          std::string(rules_state_text(state)) + ": the application is not backed up"};
 }
 
 // The daemon's loader keeps what exists; a report also needs what it dropped, and line numbers.
 void read_elements(rules_report *report) {
   const std::string path = report->root + "/" + report->file;
-  const RulesDoc document = load_rules(path.c_str());
+  rules_state state = rules_state::none;
+  const RulesDoc document = load_rules(path.c_str(), &state);
   if (!document) {
-    report->ignored = true;
-    report->problems.push_back(unusable_file(*report, path));
+    report->blocked = !rules_usable(state);
+    report->ignored = !report->blocked;
+    report->problems.push_back(report->blocked ? blocking_file(*report, state)
+                                               : unusable_file(*report, path));
     return;
   }
   xmlNode *root = xmlDocGetRootElement(document.get());
@@ -153,7 +159,7 @@ void note_entry(rules_report *report, const std::string &path, const struct stat
   }
   entry.link = S_ISLNK(status.st_mode);
   entry.size = static_cast<std::uint64_t>(status.st_size);
-  entry.in = is_backup_file(path.c_str());
+  entry.in = !report->blocked && is_backup_file(path.c_str());
   entry.element = deciding_element(report, path, entry.in);
   report->entries.push_back(entry);
 }
@@ -232,6 +238,7 @@ std::string why(const rules_report &report, const rule_entry &entry) {
            "\", line " + std::to_string(element.line);
   }
   if (report.ignored) return "the rules file is ignored";
+  if (report.blocked) return "the rules file cannot be used";
   if (entry.in) return report.file.empty() ? "no rules file" : "no rule speaks of it";
   return "no include covers it";
 }
@@ -278,14 +285,15 @@ json_object *entry_json(const rules_report &report, const rule_entry &entry) {
 }
 
 /** What an exit code of a finished check says. */
-const char *exit_text(int code) {
+const char *exit_text(int code, bool blocked = false) {
   switch (code) {
     case RULES_PROBLEMS:
       return "mistakes were found";
     case RULES_OVER_CAP:
       return "over the size limit";
     case RULES_UNUSABLE:
-      return "the rules file is ignored";
+      return blocked ? "the rules file cannot be used, so nothing is backed up"
+                     : "the rules file is ignored";
     default:
       return "success";
   }
@@ -380,7 +388,7 @@ rules_report check_rules(const std::string &package_id, const std::string &type,
 }
 
 int rules_exit_code(const rules_report &report) {
-  if (report.ignored) return RULES_UNUSABLE;
+  if (report.ignored || report.blocked) return RULES_UNUSABLE;
   if (report.total > report.cap) return RULES_OVER_CAP;
   return report.problems.empty() ? RULES_OK : RULES_PROBLEMS;
 }
@@ -429,6 +437,7 @@ std::string rules_json(const rules_report &report) {
   json_add(object.get(), "package", report.package);
   json_add(object.get(), "rules", report.file);
   json_object_object_add(object.get(), "ignored", json_object_new_boolean(report.ignored ? 1 : 0));
+  json_object_object_add(object.get(), "blocked", json_object_new_boolean(report.blocked ? 1 : 0));
   put(object.get(), "total", report.total);
   put(object.get(), "cap", report.cap);
   json_object_object_add(object.get(), "over_cap",
@@ -456,7 +465,7 @@ std::string rules_json(const rules_report &report) {
   }
   json_object_object_add(object.get(), "problems", problems);
   const int code = rules_exit_code(report);
-  return finished(object.get(), code, exit_text(code));
+  return finished(object.get(), code, exit_text(code, report.blocked));
 }
 
 std::string explain_rules(const rules_report &report, const std::string &path, bool json,

@@ -17,7 +17,8 @@ enum rules_exit : int {
   RULES_OK = 0,
   RULES_PROBLEMS = 1, /**< mistakes were found */
   RULES_OVER_CAP = 2, /**< the application would be skipped */
-  RULES_UNUSABLE = 3, /**< the file is ignored: no file, malformed, or another root element */
+  /** The file is ignored (no file, malformed, or another root element) or blocks every backup. */
+  RULES_UNUSABLE = 3,
   RULES_NO_INPUT = 66 /**< no such package or source */
 };
 
@@ -55,6 +56,7 @@ struct rules_report {
   std::string root;
   std::string file;     /**< the rules file, relative to the root; empty: none */
   bool ignored = false; /**< a file is there, but the daemon does not use it */
+  bool blocked = false; /**< what the file says cannot be known: nothing is backed up */
   std::vector<rule_element> elements;
   std::vector<rule_entry> entries;
   std::vector<rule_problem> problems;

@@ -2,7 +2,12 @@
 // library with the first document. Linking it brings four libraries and a quarter of the symbols
 // that the daemon's start would have to look up; most runs read no XML at all. What is not here is
 // missed by the linker.
+#include "lazy_xml.h"
+
 #include <dlfcn.h>
+
+#include <algorithm>
+#include <iterator>
 
 #pragma GCC visibility push(hidden)
 #include <libxml/parser.h>
@@ -21,12 +26,38 @@ Function find(const char *name) {
   return library == nullptr ? nullptr : reinterpret_cast<Function>(dlsym(library, name));
 }
 
+constexpr const char *kFunctions[] = {"xmlFree",
+                                      "xmlReadMemory",
+                                      "xmlDocGetRootElement",
+                                      "xmlGetProp",
+                                      "xmlNodeGetContent",
+                                      "xmlReaderForMemory",
+                                      "xmlTextReaderRead",
+                                      "xmlTextReaderNext",
+                                      "xmlTextReaderNodeType",
+                                      "xmlFreeTextReader",
+                                      "xmlTextReaderExpand",
+                                      "xmlTextReaderDepth",
+                                      "xmlFreeDoc",
+                                      "xmlTextReaderCurrentNode",
+                                      "xmlGetLineNo"};
+
+bool all_functions_found() {
+  return std::all_of(std::begin(kFunctions), std::end(kFunctions),
+                     [](const char *name) { return find<void *>(name) != nullptr; });
+}
+
 void free_text(void *memory) {
   static auto *const real = find<xmlFreeFunc *>("xmlFree");
   if (real != nullptr) (*real)(memory);
 }
 
 }  // namespace
+
+const char *missing_xml_library() {
+  static const bool complete = all_functions_found();
+  return complete ? nullptr : kLibrary;
+}
 
 // Looked up once each. Without the library there is no document, and nothing else is called.
 #define FORWARD(name, ...)                                  \

@@ -95,6 +95,14 @@ outcome_words words(backup_outcome outcome) {
       return {"skipped", "unreadable"};
     case backup_outcome::restoring:
       return {"skipped", "restoring"};
+    case backup_outcome::unusable_rules:
+      return {"skipped", "rules"};
+    case backup_outcome::too_many_files:
+      return {"skipped", "too-many-files"};
+    case backup_outcome::names_too_long:
+      return {"skipped", "names-too-long"};
+    case backup_outcome::table_too_large:
+      return {"skipped", "table-too-large"};
     case backup_outcome::upload_failed:
       return {"failed", "upload-failed"};
   }

@@ -9,6 +9,8 @@
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_state.h"
+#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 namespace {
@@ -168,6 +170,25 @@ void report_oversize(backup_context *ctx, backup_outcome outcome, std::uint64_t 
   }
 }
 
+/** What a package is told to be whose archive failed. */
+backup_outcome outcome_of(archive_bound bound) {
+  switch (bound) {
+    case archive_bound::none:
+      break;
+    case archive_bound::content:
+      return backup_outcome::too_large;
+    case archive_bound::members:
+      return backup_outcome::too_many_files;
+    case archive_bound::names:
+      return backup_outcome::names_too_long;
+    case archive_bound::table:
+      return backup_outcome::table_too_large;
+    case archive_bound::depth:
+      return backup_outcome::too_deep;
+  }
+  return backup_outcome::unreadable;
+}
+
 /** make_app_data_zip() between taking the staged archive and settling what becomes of it. */
 int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (app_data_storage_is_external(ctx->cur_pkg_id.c_str())) {
@@ -179,11 +200,16 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
   if (skipped != QUARN_OK) return skipped;
 
   int error = QUARN_OK;
+  archive_excess excess;
   make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), archive_path.c_str(), &error,
-                kMaxBackupSize);
+                kBackupBounds, &excess);
   if (error != QUARN_OK) {
     LOGE("fail to make zip data for %s", ctx->cur_pkg_id.c_str());
     delete_staged_file(archive_path);
+    if (excess.bound != archive_bound::none) {
+      report_package(ctx, outcome_of(excess.bound), excess.size, excess.limit);
+      return QUARN_SKIPPED;
+    }
     const backup_outcome trouble = find_package_trouble(ctx->cur_root_path);
     report_package(ctx, trouble == backup_outcome::none ? backup_outcome::unreadable : trouble);
     return error;
@@ -211,6 +237,11 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
 int check_current_backup_size(backup_context *ctx) {
   parse_backup_path_xml(ctx->cur_pkg_id.c_str(), ctx->cur_pkg_type.c_str(),
                         ctx->cur_root_path.c_str());
+  if (!backup_rules_usable()) {
+    LOGE("rules file of (%s) cannot be used, so will not backup data", ctx->cur_pkg_id.c_str());
+    report_package(ctx, backup_outcome::unusable_rules);
+    return QUARN_REFUSED;
+  }
   const std::uint64_t size = get_app_backup_size(ctx);
   const std::uint64_t available = get_dir_available_size(ctx->cur_root_path.c_str());
   LOGI("app backup size : %llu, available space size : %llu", static_cast<unsigned long long>(size),

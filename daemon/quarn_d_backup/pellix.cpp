@@ -39,7 +39,7 @@ void make_companion_archive(backup_context *ctx) {
       companion_dir() + ctx->cur_pkg_id + "_" + ctx->cur_version + kArchiveSuffix;
   int error = QUARN_OK;
   make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), path.c_str(), &error,
-                kMaxBackupSize);
+                kBackupBounds);
   if (error != QUARN_OK || !hand_over_archive(path)) {
     delete_staged_file(path);
     return;

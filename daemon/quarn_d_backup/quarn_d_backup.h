@@ -131,15 +131,19 @@ enum class backup_stage { checking, archiving, uploading, listing, cleaning, fin
 enum class backup_outcome {
   none,
   uploaded,
-  unchanged,  /**< the cloud has this archive already */
-  external,   /**< its data lies on external storage */
-  too_large,  /**< size is over limit, the cap */
-  no_space,   /**< size is over limit, the free space */
-  disabled,   /**< an application of it opted out */
-  removed,    /**< it was removed while the run went */
-  too_deep,   /**< its folders are nested deeper than what is packed */
-  unreadable, /**< its data could not be read or packed whole */
-  restoring,  /**< a restore is to have its archive in the cloud */
+  unchanged,       /**< the cloud has this archive already */
+  external,        /**< its data lies on external storage */
+  too_large,       /**< size is over limit, the cap */
+  no_space,        /**< size is over limit, the free space */
+  disabled,        /**< an application of it opted out */
+  removed,         /**< it was removed while the run went */
+  too_deep,        /**< its folders are nested deeper than what is packed */
+  unreadable,      /**< its data could not be read or packed whole */
+  restoring,       /**< a restore is to have its archive in the cloud */
+  unusable_rules,  /**< what its rules file says cannot be known */
+  too_many_files,  /**< files, directories and links: size is over limit, the bound */
+  names_too_long,  /**< all names together, bytes: size is over limit, the bound */
+  table_too_large, /**< the archive's file-info table, bytes: size is over limit, the bound */
   upload_failed
 };
 

@@ -36,7 +36,10 @@ void report_progress(const backup_context *ctx, backup_stage stage, const char *
 
 /* ---- changes.cpp ---- */
 
-/** Load the current package's rules and test its data against space and cap. @return 0 or 34 */
+/**
+ * Load the current package's rules and test its data against space and cap.
+ * @return 0, 34, or 36 when the rules cannot be used
+ */
 int check_current_backup_size(backup_context *ctx);
 
 /* ---- cloud.cpp ---- */

@@ -76,6 +76,31 @@ json_object *attributes_of(file_info_table_h *table, const char *path, const str
   return attribute_object(table, permission, uid, gid, label == nullptr ? "" : label.get());
 }
 
+/** Bytes of a text in the document, its quotes included. */
+std::size_t quoted_size(const char *text) {
+  constexpr std::size_t kShort = 2;  // a sign behind a backslash
+  constexpr std::size_t kLong = 6;   // \u and four digits
+  std::size_t size = 2;
+  for (; *text != '\0'; ++text) {
+    const auto c = static_cast<unsigned char>(*text);
+    if (std::strchr("\"\\/\b\n\r\t\f", c) != nullptr) {
+      size += kShort;
+    } else {
+      size += c < ' ' ? kLong : 1;
+    }
+  }
+  return size;
+}
+
+/** Note one more member, whose attributes are the last used ones. */
+void count_member(file_info_table_h *table, const char *name, std::size_t text) {
+  constexpr std::size_t kSeparators = 4;  // before it and behind its name
+  ++table->members;
+  table->names += std::strlen(name);
+  table->text +=
+      text + kSeparators + std::strlen(json_object_get_string(table->used->second.get()));
+}
+
 const char *relative_name(const char *root, const char *path) {
   const std::size_t skipped = std::strlen(root) + 1;
   const std::size_t length = std::strlen(path);
@@ -125,7 +150,9 @@ void add_to_file_info_table(file_info_table_h *table, const char *root, const ch
   bool complete = false;
   json_object *attributes = attributes_of(table, path, stat, fd, error, &complete);
   if (!complete) *error = QUARN_REFUSED;
-  json_object_object_add(table->root, relative_name(root, path), attributes);
+  const char *name = relative_name(root, path);
+  json_object_object_add(table->root, name, attributes);
+  count_member(table, name, quoted_size(name));
 }
 
 void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
@@ -147,10 +174,13 @@ void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root,
   bool complete = false;
   json_object *attributes = attributes_of(table, path, stat, kNotOpen, error, &complete);
   json_object *entry = json_object_new_object();
-  add_constant(entry, kRealNameKey, json_object_new_string(relative_name(root, path)));
+  const char *name = relative_name(root, path);
+  add_constant(entry, kRealNameKey, json_object_new_string(name));
   add_constant(entry, kLinkKey, json_object_new_string(target));
   add_constant(entry, kPermKey, attributes);
   json_object_array_add(table->symbolic_list, entry);
+  constexpr char kFrame[] = R"({ "real_name": , "lnk": , "perm":  })";
+  count_member(table, name, quoted_size(name) + quoted_size(target) + sizeof kFrame);
 }
 
 int save_file_info_table(file_info_table_h *table, const char *path) {

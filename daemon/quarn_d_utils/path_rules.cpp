@@ -5,6 +5,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "lazy_xml.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
@@ -34,27 +35,83 @@ bool has_name(const xmlNode *node, const char *name) {
   return std::strcmp(reinterpret_cast<const char *>(node->name), name) == 0;
 }
 
-/** The rules file's text; false when it is larger than any real one. */
-bool read_rules(const char *path, std::string *text) {
+thread_local rules_state loaded_state = rules_state::none;
+
+/** The rules file's text; no more of it than kMaxRulesSize. @return loaded, ignored or too_large */
+rules_state read_rules(const char *path, std::string *text) {
   const UniqueFd fd = safe_open(path, O_RDONLY | O_NONBLOCK | O_NOCTTY);
   struct stat status = {};
-  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return false;
-  if (static_cast<std::size_t>(status.st_size) > kMaxRulesSize) return false;
+  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return rules_state::ignored;
+  if (static_cast<std::size_t>(status.st_size) > kMaxRulesSize) return rules_state::too_large;
   text->resize(kMaxRulesSize + 1);
   std::size_t done = 0;
   while (done < text->size()) {
     const ssize_t count = read(fd.get(), text->data() + done, text->size() - done);
     if (count < 0 && errno == EINTR) continue;
-    if (count < 0) return false;
+    if (count < 0) return rules_state::ignored;
     if (count == 0) break;
     done += static_cast<std::size_t>(count);
   }
   text->resize(done);
-  return done <= kMaxRulesSize;
+  return done <= kMaxRulesSize ? rules_state::loaded : rules_state::too_large;
+}
+
+RulesDoc parse(const std::string &text, const char *path, int more_options) {
+  return RulesDoc(
+      xmlReadMemory(text.data(), static_cast<int>(text.size()), path, nullptr,
+                    XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING | more_options));
+}
+
+bool defines_entities(const xmlDoc *doc) {
+  const xmlNode *declaration = doc->intSubset == nullptr ? nullptr : doc->intSubset->children;
+  while (declaration != nullptr && declaration->type != XML_ENTITY_DECL) {
+    declaration = declaration->next;
+  }
+  return declaration != nullptr;
+}
+
+/** Whether a rule's text holds an entity that only a file which is never read could define. */
+bool lacks_entities(const xmlDoc *doc) {
+  const xmlNode *root = doc->children;
+  while (root != nullptr && root->type != XML_ELEMENT_NODE) root = root->next;
+  if (root == nullptr) return false;
+  for (const xmlNode *rule = root->children; rule != nullptr; rule = rule->next) {
+    if (rule->type == XML_ENTITY_REF_NODE) return true;
+    if (rule->type != XML_ELEMENT_NODE) continue;
+    for (const xmlAttr *attribute = rule->properties; attribute != nullptr;
+         attribute = attribute->next) {
+      for (const xmlNode *part = attribute->children; part != nullptr; part = part->next) {
+        if (part->type == XML_ENTITY_REF_NODE) return true;
+      }
+    }
+  }
+  return false;
+}
+
+rules_state why_not_parsed(const std::string &text, const char *path) {
+  if (missing_xml_library() != nullptr) return rules_state::no_library;
+  // Entities that expand without end are malformed as well; they are looked for first.
+  const RulesDoc remains = parse(text, path, XML_PARSE_RECOVER);
+  return remains != nullptr && defines_entities(remains.get()) ? rules_state::entities
+                                                               : rules_state::ignored;
 }
 
 std::string absolute_path(const char *root, const char *value) {
   return value[0] == '/' ? std::string(root) + value : std::string(root) + "/" + value;
+}
+
+void collect_rules(const xmlNode *element, const char *root) {
+  for (xmlNode *child = element->children; child != nullptr; child = child->next) {
+    if (child->type != XML_ELEMENT_NODE) continue;
+    const bool is_include = has_name(child, kIncludeElement);
+    if (!is_include && !has_name(child, kExcludeElement)) continue;
+    const XmlText value(xmlGetProp(child, reinterpret_cast<const xmlChar *>(kPathAttribute)));
+    // an include that names nothing must not shut out everything
+    if (value == nullptr) continue;
+    if (is_include) xml_has_include_field = true;
+    add_to_path_info_list(absolute_path(root, reinterpret_cast<const char *>(value.get())).c_str(),
+                          is_include ? &backup_include_list : &backup_exclude_list);
+  }
 }
 
 std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path, int depth) {
@@ -92,14 +149,38 @@ std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path
 
 }  // namespace
 
-RulesDoc load_rules(const char *path) {
+const char *rules_state_text(rules_state state) {
+  static_assert(kMaxRulesSize == 262144, "the text names it");
+  switch (state) {
+    case rules_state::too_large:
+      return "it is larger than 262144 bytes";
+    case rules_state::entities:
+      return "it needs entities";
+    case rules_state::no_library:
+      return "libxml2.so.2 cannot be loaded";
+    case rules_state::none:
+    case rules_state::loaded:
+    case rules_state::ignored:
+      break;
+  }
+  return "";
+}
+
+rules_state backup_rules_state() { return loaded_state; }
+
+bool backup_rules_usable() { return rules_usable(loaded_state); }
+
+RulesDoc load_rules(const char *path, rules_state *state) {
   std::string text;
-  if (!read_rules(path, &text)) return nullptr;
-  RulesDoc doc(xmlReadMemory(text.data(), static_cast<int>(text.size()), path, nullptr,
-                             XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING));
-  // rules need no entities; whoever declares some means the parser
-  if (doc != nullptr && doc->intSubset != nullptr && doc->intSubset->children != nullptr) {
-    return nullptr;
+  *state = read_rules(path, &text);
+  if (*state != rules_state::loaded) return nullptr;
+  RulesDoc doc = parse(text, path, 0);
+  if (doc == nullptr) {
+    *state = why_not_parsed(text, path);
+  } else if (defines_entities(doc.get()) || lacks_entities(doc.get())) {
+    // rules need no entities; whoever declares some means the parser
+    *state = rules_state::entities;
+    doc.reset();
   }
   return doc;
 }
@@ -108,6 +189,7 @@ void reset_backup_path_info() {
   backup_include_list.clear();
   backup_exclude_list.clear();
   xml_has_include_field = false;
+  loaded_state = rules_state::none;
 }
 
 void parse_backup_path_xml(const char *pkg_id, const char *pkg_type, const char *root) {
@@ -117,31 +199,26 @@ void parse_backup_path_xml(const char *pkg_id, const char *pkg_type, const char 
   if (!file_exist(path.c_str())) return;
   LOGI("(%s) has xml file(for include/exlude path)", pkg_id);
 
-  const RulesDoc doc = load_rules(path.c_str());
+  const RulesDoc doc = load_rules(path.c_str(), &loaded_state);
   if (doc == nullptr) {
     LOGE("Could not load xml file.\n");
+    if (!backup_rules_usable()) {
+      LOGE("rules file of (%s) cannot be used: %s", pkg_id, rules_state_text(loaded_state));
+    }
     return;
   }
   const xmlNode *element = xmlDocGetRootElement(doc.get());
   if (element == nullptr) {
     LOGE("empty document.\n");
+    loaded_state = rules_state::ignored;
     return;
   }
   if (!has_name(element, kRootElement)) {
     LOGE("root name %s error!\n", reinterpret_cast<const char *>(element->name));
+    loaded_state = rules_state::ignored;
     return;
   }
-  for (xmlNode *child = element->children; child != nullptr; child = child->next) {
-    if (child->type != XML_ELEMENT_NODE) continue;
-    const bool is_include = has_name(child, kIncludeElement);
-    if (!is_include && !has_name(child, kExcludeElement)) continue;
-    const XmlText value(xmlGetProp(child, reinterpret_cast<const xmlChar *>(kPathAttribute)));
-    // an include that names nothing must not shut out everything
-    if (value == nullptr) continue;
-    if (is_include) xml_has_include_field = true;
-    add_to_path_info_list(absolute_path(root, reinterpret_cast<const char *>(value.get())).c_str(),
-                          is_include ? &backup_include_list : &backup_exclude_list);
-  }
+  collect_rules(element, root);
 }
 
 void add_to_path_info_list(const char *path, std::vector<std::string> *list) {

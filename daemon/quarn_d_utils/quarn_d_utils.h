@@ -15,6 +15,7 @@
 #include <unzip.h>
 #include <zip.h>
 
+#include <atomic>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -25,6 +26,7 @@
 #include "backup_transport.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/handles.h"
 
 /* ---- file.cpp: any thread ------------------------------------------------ */
@@ -72,6 +74,9 @@ struct file_info_table_h {
   /** Attribute objects by permission, owner, group and label: entries with the same share one. */
   Attributes attributes;
   Attributes::iterator used = attributes.end(); /**< the last one: the next entry's as a rule */
+  std::uint64_t members = 0;                    /**< files, directories and links that were added */
+  std::uint64_t names = 0;                      /**< bytes of their names */
+  std::uint64_t text = 0; /**< bytes of the document's text with them, or a few less */
 };
 
 /** Make an empty table; *@p table is null on failure. Released with release_file_info_table(). */
@@ -118,11 +123,6 @@ std::uint64_t get_dir_backup_size(const char *dir, const char *pkg_id, const cha
 
 /* ---- zip_writer.cpp, zip_reader.cpp -------------------------------------- */
 
-/** Most bytes and entries that an archive may unpack to: the largest backup and its table. */
-inline constexpr std::uint64_t kMaxTableSize = 32U << 20;
-inline constexpr std::uint64_t kMaxUnpackedSize = kMaxBackupSize + kMaxTableSize;
-inline constexpr std::uint64_t kMaxArchiveEntries = 100000;
-
 /**
  * Held while a package's data is packed, unpacked or put back, so that an
  * archive never mixes two states. Any thread; held for the length of one
@@ -132,12 +132,15 @@ extern std::mutex package_data_mutex;
 
 /**
  * Pack one package's data. Takes package_data_mutex. The rules of the calling
- * thread apply. Files and links beyond kMaxArchiveEntries, and those with which
- * the files would hold more than @p max_size bytes, fail.
- * @param[out] error set on failure only: 31 archive not opened, 36 any entry failed
+ * thread apply. Nothing is made below a root that has gone, and a package that
+ * goes meanwhile fails. The first member beyond one of @p bounds ends the work.
+ * @param[out] error  set on failure only: 31 archive not opened, 36 any entry failed
+ * @param[out] excess when not null: the bound that was met
+ * @param stop        when not null: once it is true the work ends with 36; any thread sets it
  */
 void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
-                   std::uint64_t max_size = UINT64_MAX);
+                   const archive_bounds &bounds = kNoBounds, archive_excess *excess = nullptr,
+                   const std::atomic<bool> *stop = nullptr);
 /** Walk one directory into the archive. @return true when anything was recorded */
 bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
                            file_info_table_h *table, int *error);
@@ -149,9 +152,9 @@ void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const 
 
 /** What became of an archive's entries. */
 struct unzip_report {
-  unsigned int extracted = 0;
-  unsigned int refused = 0; /**< hostile: nothing of them lies below the destination */
-  unsigned int failed = 0;  /**< corrupt, or not to be written; a part may lie there */
+  unsigned int extracted = 0; /**< files; folder entries count nowhere */
+  unsigned int refused = 0;   /**< hostile: nothing of them lies below the destination */
+  unsigned int failed = 0;    /**< corrupt, or not to be written; a part may lie there */
   /** True when the destination holds everything that the archive had. */
   bool complete() const { return refused == 0 && failed == 0; }
 };
@@ -160,8 +163,9 @@ struct unzip_report {
  * Unpack an archive below @p destination: files are created new, mode 0600,
  * whatever lay in their place. Does not take package_data_mutex. Entries that
  * are refused or fail are logged and left out; @p report tells how many.
+ * Entries that name a folder make it, and cost nothing where that is refused.
  * @return 0, 14, or 31 for an archive that cannot be opened, is empty, or
- *         would unpack to more than the bounds above
+ *         announces more than bounds.h lets it: of such a one nothing is unpacked
  */
 int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
                unzip_report *report);

@@ -10,8 +10,9 @@
 #include <cstddef>
 
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/rules_state.h"
 
-/** Larger files are ignored: a parsed document takes many times its text. Bytes. */
+/** Larger files are not parsed: a document takes many times its text. Bytes. */
 inline constexpr std::size_t kMaxRulesSize = 256U << 10;
 
 /** Owner of a parsed document. */
@@ -19,9 +20,8 @@ using RulesDoc = Handle<xmlDoc, &xmlFreeDoc>;
 
 /**
  * Read and parse a rules file without network, external parts or entities.
- * @return null when the daemon ignores the file: not readable, too large,
- *         malformed, or with a document type of its own declarations
+ * @param[out] state what became of it: loaded, when there is a document, or why there is none
  */
-RulesDoc load_rules(const char *path);
+RulesDoc load_rules(const char *path, rules_state *state);
 
 #endif

@@ -15,6 +15,7 @@
 
 #include <string>
 
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/handles.h"
 
 /**
@@ -38,7 +39,6 @@ DirPtr safe_opendir(const char *path);
  * descriptor.
  */
 DirPtr safe_opendir_at(int dir, const char *name);
-inline constexpr int kMaxDirDepth = 400;
 
 /**
  * Open the regular file @p name of the directory @p dir for reading, and tell its status; none

@@ -5,6 +5,8 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
+#include <vector>
 
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
@@ -22,7 +24,9 @@ constexpr int kRaw = 1;
 // What a snapshot holds: only there can an unpacking be undone.
 constexpr const char *kDataDirs[] = {"data/", "shared/data/", "shared/trusted/"};
 
-enum class Extracted { kDone, kRefused, kFailed };
+constexpr char kNoData[] = "it does not belong to the application's data";
+
+enum class Extracted { kDone, kFolder, kRefused, kFailed };
 
 /**
  * The archive file under minizip. Two pieces of it are in memory: one of the entries and one of
@@ -203,6 +207,11 @@ class Unpacker {
         root_(safe_open(destination, O_PATH | O_DIRECTORY)) {}
 
   Extracted extract(ByteSource *source, const unz_file_info64 &info, const char *name) {
+    const std::size_t length = std::strlen(name);
+    if (length > 0 && name[length - 1] == '/' && info.uncompressed_size == 0) {
+      make_folder(name, info);
+      return Extracted::kFolder;
+    }
     const char *why = refusal(name, info);
     if (why != nullptr) return refuse(name, why);
     const std::string path = name;
@@ -226,6 +235,32 @@ class Unpacker {
   }
 
  private:
+  /** A folder's own entry, of an archive that another program made: without it nothing is lost. */
+  void make_folder(const char *name, const unz_file_info64 &info) {
+    std::string path = name;
+    path.pop_back();
+    const char *why = path.size() + 1 != info.size_filename ? "its name holds a NUL"
+                      : is_data_place(path + "/")           ? name_refusal(path)
+                                                            : kNoData;
+    if (why != nullptr) {
+      refuse(name, why);
+      return;
+    }
+    if (root_ && safe_open_below(root_.get(), path.c_str(), O_PATH | O_DIRECTORY)) return;
+    const int made = open_parent(path);
+    // the table knows nothing of a folder without files, which is the application's all the same
+    if (made < 0 || fchown(made, kAppUid, kAppGid) != 0) {
+      LOGE("fail to make folder %s : %d", (destination_ + "/" + path).c_str(), errno);
+    }
+  }
+
+  /** True for what lies in a data directory, and for such a directory and those that hold one. */
+  static bool is_data_place(const std::string &path) {
+    return std::any_of(std::begin(kDataDirs), std::end(kDataDirs), [&](const std::string &dir) {
+      return path.compare(0, dir.size(), dir) == 0 || dir.compare(0, path.size(), path) == 0;
+    });
+  }
+
   static Extracted refuse(const char *name, const char *why) {
     LOGE("refused archive entry %s: %s", name, why);
     return Extracted::kRefused;
@@ -234,8 +269,23 @@ class Unpacker {
   const char *refusal(const char *name, const unz_file_info64 &info) const {
     const std::string path = name;
     if (path.size() != info.size_filename) return "its name holds a NUL";
+    if (!path.empty() && path.back() == '/') return "it is a directory";
+    if (const char *why = name_refusal(path)) return why;
+    if (std::none_of(std::begin(kDataDirs), std::end(kDataDirs), [&](const char *dir) {
+          return path.compare(0, std::strlen(dir), dir) == 0;
+        })) {
+      return kNoData;
+    }
+    if (info.compression_method != Z_DEFLATED && info.compression_method != kStored) {
+      return "its compression is not known";
+    }
+    if ((info.flag & 1U) != 0) return "it is encrypted";
+    return nullptr;
+  }
+
+  /** What is wrong with a name wherever it lies. */
+  const char *name_refusal(const std::string &path) const {
     if (path.empty() || path.front() == '/') return "its name is absolute or empty";
-    if (path.back() == '/') return "it is a directory";
     for (std::size_t start = 0; start <= path.size();) {
       const std::size_t end = std::min(path.find('/', start), path.size());
       if (!is_safe_path_component(path.substr(start, end - start))) {
@@ -243,15 +293,7 @@ class Unpacker {
       }
       start = end + 1;
     }
-    bool in_data = false;
-    for (const char *dir : kDataDirs)
-      in_data = in_data || path.compare(0, std::strlen(dir), dir) == 0;
-    if (!in_data) return "it does not belong to the application's data";
     if (working_.contain(destination_ + "/" + path)) return "it is a working file of a restore";
-    if (info.compression_method != Z_DEFLATED && info.compression_method != kStored) {
-      return "its compression is not known";
-    }
-    if ((info.flag & 1U) != 0) return "it is encrypted";
     return nullptr;
   }
 
@@ -355,20 +397,40 @@ Archive open_archive(const char *zip_path) {
   return archive;
 }
 
-/** What an archive announces must be what a backup can hold; the entries are held to it later. */
-bool announces_too_much(unzFile archive) {
+/** Directories in one another that an entry's name has, the data directory counted as one. */
+int depth_of(const char *name) {
+  constexpr char kShared[] = "shared/";
+  const bool shared = std::strncmp(name, kShared, std::strlen(kShared)) == 0;
+  return static_cast<int>(std::count(name, name + std::strlen(name), '/')) - (shared ? 1 : 0);
+}
+
+/**
+ * What an archive announces must be what a backup can hold; the entries are held to it later.
+ * @return why it is refused, null when it is not
+ */
+const char *announces_too_much(unzFile archive) {
   std::uint64_t entries = 0;
   std::uint64_t size = 0;
+  std::uint64_t names = 0;
+  std::vector<char> name(kMaxNameSize + 1);
   for (int at = unzGoToFirstFile(archive); at == UNZ_OK; at = unzGoToNextFile(archive)) {
     unz_file_info64 info = {};
-    if (unzGetCurrentFileInfo64(archive, &info, nullptr, 0, nullptr, 0, nullptr, 0) != UNZ_OK) {
+    if (unzGetCurrentFileInfo64(archive, &info, name.data(), name.size(), nullptr, 0, nullptr, 0) !=
+        UNZ_OK) {
       break;
     }
     ++entries;
+    names += info.size_filename;
     size += std::min<std::uint64_t>(info.uncompressed_size, kMaxUnpackedSize + 1);
-    if (entries > kMaxArchiveEntries || size > kMaxUnpackedSize) return true;
+    if (entries > kMaxArchiveEntries || size > kMaxUnpackedSize) {
+      return "it unpacks to more than a backup can hold";
+    }
+    if (names > kMaxUnpackedSize) return "its names are longer than a backup's can be";
+    if (depth_of(name.data()) > kMaxDirDepth) {
+      return "its directories are deeper than a backup's can be";
+    }
   }
-  return false;
+  return nullptr;
 }
 
 /** One entry, under the names and with the messages of its steps. 14 when memory is out. */
@@ -404,6 +466,8 @@ int unpack_entry(Unpacker *unpacker, const Archive &from, CString *name, unzip_r
     case Extracted::kDone:
       ++report->extracted;
       return QUARN_OK;
+    case Extracted::kFolder:
+      return QUARN_OK;
     case Extracted::kRefused:
       ++report->refused;
       break;
@@ -425,8 +489,8 @@ int unzip_data(const char *pkg_id, const char *destination, const char *zip_path
     LOGE("unzOpen() failed, unzf is NULL");
     return QUARN_UNREADABLE;
   }
-  if (announces_too_much(archive.handle.get())) {
-    LOGE("refused archive %s: it unpacks to more than a backup can hold", zip_path);
+  if (const char *why = announces_too_much(archive.handle.get())) {
+    LOGE("refused archive %s: %s", zip_path, why);
     return QUARN_UNREADABLE;
   }
   int at = unzGoToFirstFile(archive.handle.get());
@@ -462,5 +526,6 @@ bool extract_file_from_zip(const char *pkg_id, const char *destination, unzFile 
     return false;
   }
   LibrarySource source(archive);
-  return Unpacker(pkg_id, destination).extract(&source, info, name) == Extracted::kDone;
+  const Extracted result = Unpacker(pkg_id, destination).extract(&source, info, name);
+  return result == Extracted::kDone || result == Extracted::kFolder;
 }

@@ -1,12 +1,14 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
@@ -21,6 +23,7 @@ constexpr char kTableDir[] = "/shared/data/";
 constexpr char kTableSuffix[] = ".perm";
 constexpr int kLevel = 1;
 constexpr mode_t kArchiveMode = 0600;
+constexpr mode_t kFolderMode = 0755;
 /** Name flag of the zip format: the entry's name is UTF-8. */
 constexpr uLong kUtf8Name = 1UL << 11;
 constexpr uLong kMadeByDefault = 0;
@@ -31,24 +34,19 @@ constexpr uLong kMadeByDefault = 0;
  */
 class ArchiveFile {
  public:
-  ArchiveFile(UniqueFd fd, std::uint64_t max_size) : fd_(std::move(fd)), room_(max_size) {}
+  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) {}
   ArchiveFile(const ArchiveFile &) = delete;
   ArchiveFile &operator=(const ArchiveFile &) = delete;
 
   bool is_open() const { return static_cast<bool>(fd_); }
 
-  /** Room for one more file or link of @p size: no restore takes what is beyond. */
-  bool admit(std::uint64_t size) {
-    constexpr std::uint64_t kTableItself = 1;
-    full_ = full_ || ++entries_ + kTableItself > kMaxArchiveEntries || size > room_;
-    if (full_) return false;
-    room_ -= size;
-    return true;
-  }
-  bool is_full() const { return full_; }
+  /** One more entry was written. */
+  void count_entry() { ++entries_; }
 
   /** Let the next header fit into memory. @return false when the file cannot be written */
-  bool make_room() { return !failed_ && (filled_ + kHeaderRoom <= kBuffer || flush()); }
+  bool make_room(std::size_t name) {
+    return !failed_ && (filled_ + name + kHeaderRoom <= kBuffer || flush());
+  }
 
   zlib_filefunc64_def functions() {
     zlib_filefunc64_def table = {};
@@ -69,7 +67,16 @@ class ArchiveFile {
 
  private:
   static constexpr std::size_t kBuffer = 128U << 10;
-  static constexpr std::size_t kHeaderRoom = 8U << 10;  // the longest path, and the fields
+  static constexpr std::size_t kHeaderRoom = 8U << 10;  // its fields, and a path of usual length
+  // of the format's end records
+  static constexpr std::uint64_t kNotInEnd = 0xffff;
+  static constexpr std::size_t kEndSize = 22;
+  static constexpr std::size_t kEndDirectorySize = 12;
+  static constexpr std::size_t kEndDirectory = 16;
+  static constexpr std::uint32_t kZip64EndRecord = 0x06064b50;
+  static constexpr std::uint32_t kZip64Locator = 0x07064b50;
+  static constexpr std::uint64_t kZip64EndSize = 44;
+  static constexpr std::uint64_t kZip64Version = 45;
 
   static ArchiveFile *of(voidpf self) { return static_cast<ArchiveFile *>(self); }
 
@@ -116,8 +123,49 @@ class ArchiveFile {
   }
 
   bool finish() {
-    const bool flushed = flush();
-    return close(fd_.release()) == 0 && flushed;
+    const bool written = flush() && (entries_ < kNotInEnd || add_zip64_end());
+    return close(fd_.release()) == 0 && written;
+  }
+
+  /**
+   * minizip counts no more than 65,534 entries unless the archive is larger than 4 GiB, and other
+   * programs then look for as many as its end record tells. What has to stand before that is added.
+   */
+  bool add_zip64_end() {
+    char end[kEndSize];
+    if (start_ < sizeof end) return false;
+    const ZPOS64_T at = start_ - sizeof end;
+    const ssize_t count =
+        TEMP_FAILURE_RETRY(pread(fd_.get(), end, sizeof end, static_cast<off_t>(at)));
+    if (count != static_cast<ssize_t>(sizeof end)) return false;
+    const std::uint64_t directory_size = number(end + kEndDirectorySize);
+    const std::uint64_t directory = number(end + kEndDirectory);
+    if (directory == UINT32_MAX) return true;  // it is there already
+    std::string record;
+    put(&record, kZip64EndRecord, 4);
+    put(&record, kZip64EndSize, 8);
+    put(&record, kZip64Version, 2);
+    put(&record, kZip64Version, 2);
+    put(&record, 0, 8);  // disks
+    put(&record, entries_, 8);
+    put(&record, entries_, 8);
+    put(&record, directory_size, 8);
+    put(&record, directory, 8);
+    put(&record, kZip64Locator, 4);
+    put(&record, 0, 4);  // disk
+    put(&record, at, 8);
+    put(&record, 1, 4);  // disks
+    record.append(end, sizeof end);
+    return write_at(record.data(), record.size(), at);
+  }
+
+  static void put(std::string *bytes, std::uint64_t value, int count) {
+    for (int i = 0; i < count; ++i) *bytes += static_cast<char>(value >> (8 * i));
+  }
+  static std::uint32_t number(const char *bytes) {
+    std::uint32_t value = 0;
+    for (int i = 3; i >= 0; --i) value = value << 8 | static_cast<unsigned char>(bytes[i]);
+    return value;
   }
 
   bool write_at(const char *data, std::size_t size, ZPOS64_T offset) {
@@ -141,16 +189,79 @@ class ArchiveFile {
   ZPOS64_T start_ = 0;     // bytes before it are in the file
   ZPOS64_T position_ = 0;  // where the next write goes
   bool failed_ = false;
-  std::uint64_t room_;  // for the files' bytes
   std::uint64_t entries_ = 0;
-  bool full_ = false;
 };
 
-/** The archive that this thread is writing: its file, and the codec whose memory entries share. */
-thread_local ArchiveFile *archive_file = nullptr;
+/** The archive that a thread is making. */
+class Packing {
+ public:
+  Packing(ArchiveFile *file, const char *zip_path, const archive_bounds &bounds,
+          const std::atomic<bool> *stop)
+      : path(zip_path), file_(file), bounds_(bounds), stop_(stop) {}
+
+  /** Where it lies: one that is made among the data it takes in must not take in itself. */
+  const std::string path;
+  std::vector<UniqueFd> data_dirs; /**< those that were walked */
+
+  ArchiveFile *file() const { return file_; }
+  bool stopped() const { return stop_ != nullptr && *stop_; }
+  bool ended() const { return stopped() || excess_.bound != archive_bound::none; }
+  const archive_excess &excess() const { return excess_; }
+
+  /** Whether a file of @p size, a link or a directory, with this name, lies within the bounds. */
+  bool admit(const file_info_table_h &table, std::uint64_t size, std::uint64_t name) {
+    content_ += size;
+    return check(archive_bound::content, content_, bounds_.content) &&
+           check(archive_bound::members, table.members + 1, bounds_.members) &&
+           check(archive_bound::names, table.names + name, bounds_.names);
+  }
+  /** Whether the table with everything that was added does. */
+  bool admit(const file_info_table_h &table) {
+    return check(archive_bound::table, table.text, bounds_.table);
+  }
+  /** Whether a directory at @p depth is too deep for this archive to be of use. */
+  bool refuses_depth(int depth) {
+    if (bounds_.members == kNoBounds.members) return false;
+    return !check(archive_bound::depth, static_cast<std::uint64_t>(depth), kMaxDirDepth);
+  }
+
+ private:
+  bool check(archive_bound bound, std::uint64_t size, std::uint64_t limit) {
+    if (size <= limit) return true;
+    if (excess_.bound == archive_bound::none) excess_ = {bound, size, limit};
+    return false;
+  }
+
+  ArchiveFile *file_;
+  const archive_bounds bounds_;
+  const std::atomic<bool> *stop_;
+  std::uint64_t content_ = 0;
+  archive_excess excess_;
+};
+
+/** The calling thread's, and the codec whose memory its entries share. */
+thread_local Packing *packing = nullptr;
 thread_local std::unique_ptr<Codec> archive_codec;
-/** Where it lies: one that is made among the data it takes in must not take in itself. */
-thread_local std::string archive_path;
+
+bool packing_ended() { return packing != nullptr && packing->ended(); }
+
+class MemorySource : public ByteSource {
+ public:
+  MemorySource(const char *data, std::size_t size) : data_(data), left_(size) {}
+
+  long read(unsigned char *data, std::size_t size, bool *end) override {
+    const std::size_t count = std::min(size, left_);
+    std::memcpy(data, data_, count);
+    data_ += count;
+    left_ -= count;
+    *end = left_ == 0;
+    return static_cast<long>(count);
+  }
+
+ private:
+  const char *data_;
+  std::size_t left_;
+};
 
 /** A file's bytes, as many as it had when it was opened. */
 class FileSource : public ByteSource {
@@ -158,6 +269,7 @@ class FileSource : public ByteSource {
   FileSource(int fd, std::uint64_t size) : fd_(fd), expected_(size) {}
 
   long read(unsigned char *data, std::size_t size, bool *end) override {
+    if (packing != nullptr && packing->stopped()) return -1;
     // one byte more than expected shows a file that grows, which must not grow the archive
     const std::uint64_t left = expected_ - total_;
     const std::size_t wanted = static_cast<std::size_t>(std::min<std::uint64_t>(size, left + 1));
@@ -206,46 +318,42 @@ bool needs_utf8_flag(const char *name) {
   return false;
 }
 
-int open_entry(zipFile zip, const char *name) {
+int open_entry(zipFile zip, const char *name, std::uint64_t size) {
   constexpr int kRaw = 1;
+  // what does not compress becomes a little larger, and must still fit the header's fields
+  constexpr std::uint64_t kLarge = UINT32_MAX - (16U << 20);
   // the library loses memory when it cannot write a header
-  if (archive_file != nullptr && !archive_file->make_room()) return ZIP_ERRNO;
+  if (packing != nullptr && !packing->file()->make_room(std::strlen(name))) return ZIP_ERRNO;
   return zipOpenNewFileInZip4_64(zip, name, nullptr, nullptr, 0, nullptr, 0, nullptr, Z_DEFLATED,
                                  kLevel, kRaw, -MAX_WBITS, DEF_MEM_LEVEL, Z_DEFAULT_STRATEGY,
                                  nullptr, 0, kMadeByDefault, needs_utf8_flag(name) ? kUtf8Name : 0,
-                                 0);
+                                 size >= kLarge ? 1 : 0);
 }
 
-/** One open file's bytes as the entry @p name. */
-bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
-                   const struct stat &status, int *error) {
+/** Everything that @p source gives, about @p size bytes, as the entry @p name. */
+bool add_entry(zipFile zip, const char *path, const char *name, ByteSource *source,
+               std::uint64_t size, int *error) {
   if (archive_codec == nullptr) archive_codec = make_codec(CodecUse::kDeflate);
   if (archive_codec == nullptr) {
     LOGE("calloc() failed, buf is NULL");
     *error = QUARN_REFUSED;
     return false;
   }
-  const int opened = open_entry(zip, name);
+  const int opened = open_entry(zip, name, size);
   if (opened != ZIP_OK) {
     LOGE("zipOpenNewFileInZip() failed, zip_err = [%d]", opened);
     *error = QUARN_REFUSED;
     return false;
   }
-  FileSource source(fd, static_cast<std::uint64_t>(status.st_size));
+  if (packing != nullptr) packing->file()->count_entry();
   EntrySink sink(zip);
   CodecTotals totals;
-  const CodecResult result = archive_codec->deflate(&source, &sink, &totals);
+  const CodecResult result = archive_codec->deflate(source, &sink, &totals);
   bool added = result == CodecResult::kDone;
   if (result == CodecResult::kSinkFailed) {
     LOGE("zipWriteInFileInZip() failed, zip_err = [%d]", sink.error());
   } else if (!added) {
     LOGE("cannot read %s", path);
-  } else if (source.shrank()) {
-    LOGE("file changed while it was archived : %s", path);
-    added = false;
-  } else if (source.grew()) {
-    // what is written to all the time, a log say, would never be backed up otherwise
-    LOGI("file grew while it was archived : %s", path);
   }
   const int closed = zipCloseFileInZipRaw64(zip, totals.plain, totals.crc);
   if (closed != ZIP_OK && added) {
@@ -253,6 +361,18 @@ bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
     added = false;
   }
   if (!added) *error = QUARN_REFUSED;
+  return added;
+}
+
+/** One open file's bytes as the entry @p name. */
+bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
+                   const struct stat &status, int *error) {
+  const auto size = static_cast<std::uint64_t>(status.st_size);
+  FileSource source(fd, size);
+  const bool added = add_entry(zip, path, name, &source, size, error);
+  // what is written to all the time, a log say, would never be backed up otherwise
+  if (added && source.grew()) LOGI("file grew while it was archived : %s", path);
+  if (added && source.shrank()) LOGI("file shrank while it was archived : %s", path);
   return added;
 }
 
@@ -267,7 +387,32 @@ struct Walk {
 
 bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth);
 
+/** Whether the archive takes one more member: none after the first that it does not take. */
+bool admit(Walk *walk, const std::string &path, off_t size) {
+  const std::uint64_t name = path.size() - walk->root.size() - 1;
+  if (name <= kMaxNameSize &&
+      (packing == nullptr ||
+       packing->admit(*walk->table, static_cast<std::uint64_t>(size), name))) {
+    return true;
+  }
+  LOGE("archive is full at %s", path.c_str());
+  *walk->error = QUARN_REFUSED;
+  return false;
+}
+
+/** The same once it is a member of the table. */
+void admit_in_table(Walk *walk, const std::string &path) {
+  if (packing == nullptr || packing->admit(*walk->table)) return;
+  LOGE("archive is full at %s", path.c_str());
+  *walk->error = QUARN_REFUSED;
+}
+
 bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, int depth) {
+  if (depth >= kMaxDirDepth && packing != nullptr && packing->refuses_depth(depth + 1)) {
+    LOGE("archive is full at %s", path->c_str());
+    *walk->error = QUARN_REFUSED;
+    return false;
+  }
   const DirPtr dir = depth < kMaxDirDepth ? safe_opendir_at(parent, name) : nullptr;
   if (dir == nullptr) {
     LOGE("error : cannot open this path %s", path->c_str());
@@ -275,14 +420,6 @@ bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, in
     return false;
   }
   return walk_dir(walk, dir.get(), path, depth);
-}
-
-/** Whether the archive takes one more file or link. */
-bool admit(Walk *walk, const std::string &path, off_t size) {
-  if (archive_file == nullptr || archive_file->admit(static_cast<std::uint64_t>(size))) return true;
-  LOGE("archive is full at %s", path.c_str());
-  *walk->error = QUARN_REFUSED;
-  return false;
 }
 
 /** Record a file and pack it, when it could be opened. */
@@ -297,6 +434,7 @@ void add_regular(Walk *walk, const std::string &path, const UniqueFd &fd,
   if (!admit(walk, path, status.st_size)) return;
   add_to_file_info_table(walk->table, walk->root.c_str(), path.c_str(), status, walk->error,
                          fd.get());
+  admit_in_table(walk, path);
   if (fd) {
     add_open_file(walk->zip, path.c_str(), path.c_str() + walk->root.size() + 1, fd.get(), status,
                   walk->error);
@@ -329,7 +467,9 @@ bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, 
   }
   if (S_ISDIR(status.st_mode)) {
     if (!walk_subdir(walk, parent, name, path, depth + 1)) return false;
+    if (packing_ended() || !admit(walk, *path, 0)) return true;
     add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error);
+    admit_in_table(walk, *path);
     return true;
   }
   if (S_ISREG(status.st_mode)) {
@@ -343,6 +483,7 @@ bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, 
     if (!is_backup_file(path->c_str()) || !admit(walk, *path, 0)) return false;
     add_sym_info_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status,
                                     walk->error);
+    admit_in_table(walk, *path);
     return true;
   }
   LOGE("this is unexpected type : %s", path->c_str());
@@ -354,9 +495,9 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
   bool noted = false;
   while (const dirent *entry = readdir(dir)) {
     if (is_dot_entry(entry->d_name)) continue;
-    if (archive_file != nullptr && archive_file->is_full()) break;
+    if (packing_ended()) break;
     const PathStep step(path, entry->d_name);
-    if (walk->working.contain(*path) || *path == archive_path) continue;
+    if (walk->working.contain(*path) || (packing != nullptr && *path == packing->path)) continue;
     if (walk_entry(walk, dirfd(dir), *entry, path, depth)) noted = true;
   }
   return noted;
@@ -384,17 +525,90 @@ struct ReleaseTable {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
 };
 
-}  // namespace
+/**
+ * The root of the package that is packed, as it was when that began. Nothing is made in its place
+ * once it has gone: half a package, and root's, would be what its next installation finds.
+ */
+class PackageRoot {
+ public:
+  explicit PackageRoot(const char *root)
+      : path_(root), dir_(safe_open(root, O_PATH | O_DIRECTORY)) {}
 
-void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
-                   std::uint64_t max_size) {
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  /** Make the directory of a file; below the root only where that still is. */
+  void create_directory_of(const char *file) const {
+    const std::string path = file;
+    const auto slash = path.rfind('/');
+    if (path.compare(0, path_.size() + 1, path_ + "/") != 0 || slash <= path_.size()) {
+      create_directory_of_file(file);
+      return;
+    }
+    const std::string folder = path.substr(path_.size() + 1, slash - path_.size() - 1);
+    if (!dir_ || is_directory(path.substr(0, slash).c_str())) return;
+    const UniqueFd made = safe_mkdir_below(dir_.get(), folder.c_str(), kFolderMode);
+    if (made && fchownat(made.get(), "", kAppUid, kAppGid, AT_EMPTY_PATH) != 0) {
+      LOGE("fail to give %s to its application : %d", folder.c_str(), errno);
+    }
+  }
+
+  /** True when it was there, and it or one of its data directories is no longer. */
+  bool has_gone(const std::vector<UniqueFd> &data_dirs) const {
+    struct stat opened {};
+    struct stat found {};
+    if (!dir_ || fstat(dir_.get(), &opened) != 0) return false;
+    if (safe_lstat(path_.c_str(), &found) != 0 || found.st_dev != opened.st_dev ||
+        found.st_ino != opened.st_ino) {
+      return true;
+    }
+    return std::any_of(data_dirs.begin(), data_dirs.end(), [](const UniqueFd &dir) {
+      struct stat status {};
+      return fstat(dir.get(), &status) == 0 && status.st_nlink == 0;
+    });
+  }
+
+ private:
+  std::string path_;
+  UniqueFd dir_;
+};
+
+bool may_be_packed(const char *pkg_id, const char *root) {
+  if (!backup_rules_usable()) {
+    LOGE("(%s) is not packed, because its rules file cannot be used: %s", pkg_id,
+         rules_state_text(backup_rules_state()));
+    return false;
+  }
   if (is_half_restored(pkg_id, root)) {
     LOGE("restore of (%s) was interrupted, so its data is not packed", pkg_id);
+    return false;
+  }
+  return true;
+}
+
+/** The data directories and the table; without it what went beyond a bound, or was stopped. */
+void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table_h *table,
+              int *error) {
+  for (const char *dir : kDataDirs) {
+    if (packing->ended()) break;
+    parse_app_dir_for_zip(pkg_id, root, zip, (std::string(root) + dir).c_str(), table, error);
+  }
+  if (packing->ended()) {
     *error = QUARN_REFUSED;
     return;
   }
-  create_directory_of_file(zip_path);
+  insert_file_info_table_to_zip(table, zip, pkg_id, root, error);
+}
+
+}  // namespace
+
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                   const archive_bounds &bounds, archive_excess *excess,
+                   const std::atomic<bool> *stop) {
+  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  if (!may_be_packed(pkg_id, root)) {
+    *error = QUARN_REFUSED;
+    return;
+  }
+  const PackageRoot package(root);
+  package.create_directory_of(zip_path);
   file_info_table_h *made = nullptr;
   ready_file_info_table(&made);
   const std::unique_ptr<file_info_table_h, ReleaseTable> table(made);
@@ -403,8 +617,7 @@ void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, i
     *error = QUARN_REFUSED;
     return;
   }
-  UniqueFd fd = create_archive(zip_path);
-  ArchiveFile file(std::move(fd), max_size);
+  ArchiveFile file(create_archive(zip_path));
   zlib_filefunc64_def functions = file.functions();
   zipFile zip =
       file.is_open() ? zipOpen2_64(zip_path, APPEND_STATUS_CREATE, nullptr, &functions) : nullptr;
@@ -413,20 +626,21 @@ void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, i
     *error = QUARN_UNREADABLE;
     return;
   }
-  archive_file = &file;
-  archive_path = zip_path;
-  for (const char *dir : kDataDirs) {
-    parse_app_dir_for_zip(pkg_id, root, zip, (std::string(root) + dir).c_str(), table.get(), error);
+  Packing current(&file, zip_path, bounds, stop);
+  packing = &current;
+  pack_all(pkg_id, root, zip, table.get(), error);
+  if (package.has_gone(current.data_dirs)) {
+    LOGE("(%s) was removed while it was packed", pkg_id);
+    *error = QUARN_REFUSED;
   }
-  insert_file_info_table_to_zip(table.get(), zip, pkg_id, root, error);
   const int closed = zipClose(zip, nullptr);
-  archive_file = nullptr;
+  packing = nullptr;
   archive_codec.reset();
-  archive_path.clear();
   if (closed != ZIP_OK) {
     LOGE("zipClose() failed, zip_err = [%d]", closed);
     *error = QUARN_REFUSED;
   }
+  if (excess != nullptr) *excess = current.excess();
 }
 
 bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
@@ -438,6 +652,9 @@ bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, co
     return false;
   }
   Walk walk{root, WorkingFiles(pkg_id, root), zip, table, error};
+  if (packing != nullptr) {
+    packing->data_dirs.emplace_back(fcntl(dirfd(opened.get()), F_DUPFD_CLOEXEC, 0));
+  }
   std::string path = dir;
   return walk_dir(&walk, opened.get(), &path, 0);
 }
@@ -455,20 +672,19 @@ bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error
 
 void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const char *pkg_id,
                                    const char *root, int *error) {
-  const char *document = json_object_get_string(table->root);
-  std::string text = document == nullptr ? "" : document;
+  std::size_t size = 0;
+  const char *text = json_object_to_json_string_length(table->root, JSON_C_TO_STRING_SPACED, &size);
   const std::string path = std::string(root) + kTableDir + pkg_id + kTableSuffix;
-  const int written = write_string_to_file(std::move(text), path);
-  if (written != QUARN_OK) {
-    LOGE("fail. insert_file_info_table_to_zip : %d", written);
-    *error = written;
-  }
-  if (!file_exist(path.c_str())) {
-    LOGE("fail. insert_file_info_table_to_zip : %d", QUARN_REFUSED);
+  // The table goes into the archive from memory: a file among the data would take the place of one
+  // that the application calls the same. A directory in that place is one that no restore removes.
+  if (text == nullptr || is_directory(path.c_str())) {
+    LOGE("Writing to File %s Failed", path.c_str());
+    LOGE("fail. insert_file_info_table_to_zip : %d", QUARN_REFUSED);  // not written
+    LOGE("fail. insert_file_info_table_to_zip : %d", QUARN_REFUSED);  // nor there
     *error = QUARN_REFUSED;
   } else {
-    add_file_to_zip(root, zip, path.c_str(), error);
-    delete_file(path.c_str());
+    MemorySource source(text, size);
+    add_entry(zip, path.c_str(), path.c_str() + std::strlen(root) + 1, &source, size, error);
   }
   json_object_put(table->root);
   table->root = nullptr;

@@ -229,6 +229,40 @@ TEST_F(Changes, SinglePackageRunLeavesTheUploadToItsRequester) {
   EXPECT_TRUE(holds_staged_archive(ctx_.get(), "org.app"));
 }
 
+TEST_F(Changes, RulesThatCannotBeUsedLetNothingLeaveTheDevice) {
+  const FakePackage &app = install("org.app");
+  std::filesystem::create_directories(app.root + "/res");
+  std::string large = "<backup><exclude path=\"data/\"/>";
+  large.resize(300000, ' ');
+  for (const std::string &rules :
+       {std::string("<!DOCTYPE backup [<!ENTITY d \"data/\">]><backup><exclude path=\"&d;\"/>"
+                    "</backup>"),
+        large + "</backup>"}) {
+    write_text(app.root + "/res/backup.path.xml", rules);
+    make_current(app);
+    clear_captured_log();
+    EXPECT_EQ(make_app_data_zip(ctx_.get(), "org.app"), 36);
+    EXPECT_EQ(error("rules file of (org.app) cannot be used, so will not backup data"), 1);
+    EXPECT_FALSE(exists(app.staged()));
+    EXPECT_THAT(to_upload(), IsEmpty());
+    EXPECT_THAT(current(), ElementsAre("org.app")) << "what the cloud holds of it stays";
+    // also where nobody looked at the rules
+    int result = 0;
+    make_zip_data("org.app", app.root.c_str(), app.staged().c_str(), &result);
+    EXPECT_EQ(result, 36);
+    EXPECT_FALSE(exists(app.staged()));
+  }
+}
+
+TEST_F(Changes, RulesThatCannotBeUsedCostNoOtherPackage) {
+  const FakePackage &first = install("org.a");
+  std::filesystem::create_directories(first.root + "/res");
+  write_text(first.root + "/res/backup.path.xml", "<!DOCTYPE backup [<!ENTITY d \"x\">]><backup/>");
+  install("org.b");
+  EXPECT_THAT(listed_ids(), ElementsAre("org.a", "org.b"));
+  EXPECT_THAT(to_upload(), ElementsAre("org.b"));
+}
+
 TEST_F(Changes, RulesOfThePackageAreLoaded) {
   const FakePackage &app = install("org.app");
   std::filesystem::create_directories(app.root + "/res");

@@ -682,6 +682,15 @@ TEST_F(Progress, TellsWhyAPackageWasNotUploaded) {
   EXPECT_EQ(of("org.same").size, cloud_.objects[same.object()].size());
 }
 
+TEST_F(Progress, TellsThatARulesFileCannotBeUsed) {
+  const FakePackage &app = install("org.app");
+  std::filesystem::create_directories(app.root + "/res");
+  write_text(app.root + "/res/backup.path.xml", "<!DOCTYPE backup [<!ENTITY d \"x\">]><backup/>");
+  automatic();
+  EXPECT_EQ(of("org.app").outcome, backup_outcome::unusable_rules);
+  EXPECT_THAT(cloud_.requests(), Not(Contains("upload " + app.object())));
+}
+
 TEST_F(Progress, TellsSizeAndFreeSpaceOfAPackageThatDoesNotFit) {
   const FakePackage &app = install("org.app", "1", "");
   const std::uint64_t size = std::uint64_t{1} << 43;

@@ -115,7 +115,8 @@ TEST(ProgressBoard, WithoutOutcomesThereIsNoTable) { EXPECT_EQ(ProgressBoard().t
 
 TEST(ReasonText, HasWordsForEveryReason) {
   for (const char *reason : {"unchanged", "external", "too-large", "no-space", "disabled",
-                             "unreadable", "upload-failed", "not-installed"}) {
+                             "unreadable", "upload-failed", "not-installed", "rules",
+                             "too-many-files", "names-too-long", "table-too-large", "too-deep"}) {
     PackageOutcome outcome;
     outcome.reason = reason;
     EXPECT_NE(reason_text(outcome), reason);

@@ -10,6 +10,7 @@
 #include "fault.h"
 #include "log_capture.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/rules_state.h"
 #include "temp_dir.h"
 
 namespace {
@@ -36,6 +37,11 @@ class PathRules : public ::testing::Test {
     EXPECT_THAT(backup_include_list, IsEmpty());
     EXPECT_THAT(backup_exclude_list, IsEmpty());
     EXPECT_FALSE(xml_has_include_field);
+  }
+  static void expect_unusable(const std::string &why) {
+    EXPECT_FALSE(backup_rules_usable());
+    EXPECT_EQ(count_logged(DLOG_ERROR, "rules file of (org.example.notes) cannot be used: " + why),
+              1);
   }
   std::uint64_t size() const {
     return get_dir_backup_size((root_ / "data").c_str(), kPackage, root_.path().c_str());
@@ -177,12 +183,53 @@ TEST_F(PathRules, EntitiesThatExpandAreRefusedQuickly) {
   EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(2));
   expect_no_rules();
   EXPECT_EQ(count_logged(DLOG_ERROR, "Could not load xml file.\n"), 1);
+  expect_unusable("it needs entities");
 }
 
 TEST_F(PathRules, AHarmlessEntityIsRefusedToo) {
   root_.file("data/a", "1");
-  load(R"(<!DOCTYPE backup [<!ENTITY d "data/a">]><backup><exclude path="&d;"/></backup>)");
-  expect_no_rules();
+  for (const char *text :
+       {R"(<!DOCTYPE backup [<!ENTITY d "data/a">]><backup><exclude path="&d;"/></backup>)",
+        R"(<!DOCTYPE backup [<!ENTITY d "data/a">]><backup><exclude path="data/a"/></backup>)",
+        R"(<!DOCTYPE backup [<!ELEMENT backup ANY><!ENTITY % d "x">]><backup/>)",
+        R"(<!DOCTYPE backup [<!ENTITY d "data/a">]><backup><exclude path="&d;"></backup>)",
+        R"(<!DOCTYPE backup SYSTEM "x.dtd"><backup><exclude path="&d;"/></backup>)"}) {
+    clear_captured_log();
+    load(text);
+    expect_no_rules();
+    expect_unusable("it needs entities");
+  }
+}
+
+TEST_F(PathRules, OtherDeclarationsMakeNoDifference) {
+  root_.file("data/a", "1");
+  for (const char *declarations :
+       {"[]", "[<!ELEMENT backup (include|exclude)*>]", "SYSTEM \"backup.dtd\" []",
+        "[<!ATTLIST exclude path CDATA #REQUIRED>\n<!-- a remark --><?and so on?>]",
+        "[<!NOTATION n SYSTEM \"n\">]"}) {
+    load("<!DOCTYPE backup " + std::string(declarations) +
+         "><backup><exclude path=\"data/a\"/></backup>");
+    EXPECT_FALSE(takes("data/a")) << declarations;
+    EXPECT_TRUE(backup_rules_usable()) << declarations;
+  }
+}
+
+TEST_F(PathRules, WhatIsNoRulesFileLeavesARunUsable) {
+  for (const char *text : {"<backup>", "<other/>", ""}) {
+    load(text);
+    EXPECT_EQ(backup_rules_state(), rules_state::ignored) << text;
+    EXPECT_TRUE(backup_rules_usable()) << text;
+  }
+}
+
+TEST_F(PathRules, AResetForgetsThatTheRulesCouldNotBeUsed) {
+  load(R"(<!DOCTYPE backup [<!ENTITY d "x">]><backup/>)");
+  EXPECT_FALSE(backup_rules_usable());
+  reset_backup_path_info();
+  EXPECT_TRUE(backup_rules_usable());
+  load(R"(<!DOCTYPE backup [<!ENTITY d "x">]><backup/>)");
+  parse_backup_path_xml(kPackage, "wgt", root_.path().c_str());
+  EXPECT_TRUE(backup_rules_usable()) << "another package's, which has none";
 }
 
 TEST_F(PathRules, ExternalPartsAreNeverRead) {
@@ -221,6 +268,7 @@ TEST_F(PathRules, AHugeFileIsNotParsed) {
   load(xml + "</backup>");
   expect_no_rules();
   EXPECT_EQ(count_logged(DLOG_ERROR, "Could not load xml file.\n"), 1);
+  expect_unusable("it is larger than 262144 bytes");
 }
 
 TEST_F(PathRules, ARulesFileThatIsALinkIsNotRead) {

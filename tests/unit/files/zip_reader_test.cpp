@@ -193,6 +193,14 @@ TEST_P(ZipReader, TakesAnArchiveWithAZip64EndRecord) {
   EXPECT_EQ(content_of(root_ / "data/a"), "text");
 }
 
+TEST_P(ZipReader, TakesMoreEntriesThanTheEndRecordCanTell) {
+  // as earlier releases wrote them
+  constexpr unsigned int kEntries = 70000;
+  std::vector<ZipEntry> entries(kEntries, stored_entry("data/a", ""));
+  EXPECT_EQ(unpack(zip_bytes(entries, 0xffff)), QUARN_OK);
+  expect_report(kEntries, 0, 0);
+}
+
 TEST_P(ZipReader, TakesAnArchiveBehindOtherBytes) {
   EXPECT_EQ(unpack(std::string(1000, '#') + zip_bytes({deflated_entry("data/a", "text")})),
             QUARN_OK);
@@ -283,8 +291,53 @@ TEST_P(ZipReader, RefusesANameWithANul) {
   EXPECT_FALSE(exists(root_ / "data/a"));
 }
 
-TEST_P(ZipReader, RefusesDirectories) {
-  expect_refused(stored_entry("data/dir/", ""), "it is a directory");
+TEST_P(ZipReader, AFolderEntryMakesTheFolderForTheApplication) {
+  root_.dir("data/there");
+  EXPECT_EQ(unpack({stored_entry("data/", ""), stored_entry("shared/", ""),
+                    stored_entry("shared/trusted/", ""), stored_entry("data/there/", ""),
+                    stored_entry("data/new/", ""), stored_entry("data/new/er/", ""),
+                    deflated_entry("data/new/a", "x"), deflated_entry("data/packed/", "")}),
+            QUARN_OK);
+  expect_report(1, 0, 0);
+  EXPECT_TRUE(captured_texts().empty());
+  EXPECT_EQ(content_of(root_ / "data/new/a"), "x");
+  for (const char *name : {"data/new", "data/new/er", "data/packed"}) {
+    struct stat status = {};
+    ASSERT_EQ(lstat((root_ / name).c_str(), &status), 0) << name;
+    EXPECT_EQ(status.st_mode, S_IFDIR | 0755U) << name;
+    EXPECT_EQ(status.st_uid, kAppUid) << name;
+    EXPECT_EQ(status.st_gid, kAppGid) << name;
+  }
+}
+
+TEST_P(ZipReader, ARefusedFolderEntryCostsNothing) {
+  const std::string outside = place_.dir("outside");
+  root_.dir("data");
+  root_.link("data/link", outside);
+  const std::pair<const char *, const char *> refused[] = {
+      {"../out/", "it does not belong to the application's data"},
+      {"/data/", "it does not belong to the application's data"},
+      {"res/", "it does not belong to the application's data"},
+      {"data/../../out/", "its name leaves its place"},
+      {"data//", "its name leaves its place"},
+      {"shared/data/quarn_tmp_rst_dir/", "it is a working file of a restore"}};
+  for (const auto &[name, why] : refused) {
+    clear_captured_log();
+    EXPECT_EQ(unpack({stored_entry(name, ""), deflated_entry("data/a", "x")}), QUARN_OK) << name;
+    expect_report(1, 0, 0);
+    EXPECT_THAT(captured_texts(),
+                ElementsAre(std::string("refused archive entry ") + name + ": " + why));
+  }
+  clear_captured_log();
+  EXPECT_EQ(unpack({stored_entry("data/link/in/", ""), deflated_entry("data/a", "x")}), QUARN_OK);
+  expect_report(1, 0, 0);
+  EXPECT_FALSE(exists(outside + "/in"));
+  EXPECT_FALSE(exists(root_ / "../out"));
+  EXPECT_FALSE(exists(root_ / "res"));
+}
+
+TEST_P(ZipReader, AFolderEntryWithContentIsRefusedAsAFile) {
+  expect_refused(stored_entry("data/dir/", "text"), "it is a directory");
   EXPECT_FALSE(exists(root_ / "data/dir"));
 }
 
@@ -459,6 +512,42 @@ TEST_P(ZipReader, MoreEntriesThanABackupCanHoldAreRefused) {
   EXPECT_EQ(unpack(zip64_bytes(entries)), QUARN_UNREADABLE);
   EXPECT_EQ(errors("refused archive " + archive_ + ": it unpacks to more than a backup can hold"),
             1);
+}
+
+TEST_P(ZipReader, DirectoriesDeeperThanABackupsAreRefusedBeforeAnythingIsMade) {
+  for (const char *top : {"data", "shared/trusted"}) {
+    std::string name = top;
+    for (int depth = 1; depth < kMaxDirDepth; ++depth) name += "/d";
+    EXPECT_EQ(unpack({deflated_entry("data/first", "x"), deflated_entry(name + "/a", "x")}),
+              QUARN_OK);
+    expect_report(2, 0, 0);
+    std::filesystem::remove_all(root_ / "data");
+    std::filesystem::remove_all(root_ / "shared");
+    EXPECT_EQ(unpack({deflated_entry("data/first", "x"), deflated_entry(name + "/d/a", "x")}),
+              QUARN_UNREADABLE);
+    EXPECT_EQ(errors("refused archive " + archive_ +
+                     ": its directories are deeper than a backup's can be"),
+              1);
+    EXPECT_THAT(files(), IsEmpty());
+    clear_captured_log();
+  }
+}
+
+TEST_P(ZipReader, LongerNamesThanABackupsAreRefusedBeforeAnythingIsMade) {
+  std::vector<ZipEntry> entries(1000, stored_entry("data/" + std::string(65000, 'n'), ""));
+  EXPECT_EQ(unpack(entries), QUARN_UNREADABLE);
+  EXPECT_EQ(errors("refused archive " + archive_ + ": its names are longer than a backup's can be"),
+            1);
+  EXPECT_THAT(files(), IsEmpty());
+}
+
+TEST_P(ZipReader, ATableThatOnlyEarlierReleasesMadeIsTaken) {
+  const std::string table(std::size_t{20} << 20, ' ');
+  ASSERT_GT(table.size(), kBackupBounds.table);
+  EXPECT_EQ(unpack({deflated_entry("data/a", "x"),
+                    deflated_entry("shared/data/org.example.notes.perm", table)}),
+            QUARN_OK);
+  expect_report(2, 0, 0);
 }
 
 /* ---- failures ---------------------------------------------------------------- */

@@ -50,6 +50,18 @@ class ZipWriter : public ::testing::TestWithParam<ArchiveCodec> {
     make_zip_data(kPackage, root_.path().c_str(), archive_.c_str(), &error);
     return error;
   }
+  /** The same within bounds; what went beyond is in excess_ then. */
+  int pack_within(const archive_bounds &bounds) {
+    int error = 0;
+    excess_ = {};
+    make_zip_data(kPackage, root_.path().c_str(), archive_.c_str(), &error, bounds, &excess_);
+    return error;
+  }
+  void expect_excess(archive_bound bound, std::uint64_t size, std::uint64_t limit) const {
+    EXPECT_EQ(excess_.bound, bound);
+    EXPECT_EQ(excess_.size, size);
+    EXPECT_EQ(excess_.limit, limit);
+  }
   std::vector<ZipEntry> entries() const { return parse_zip(content_of(archive_)); }
   std::vector<std::string> names() const {
     std::vector<std::string> all;
@@ -82,6 +94,7 @@ class ZipWriter : public ::testing::TestWithParam<ArchiveCodec> {
   TempDir root_;
   TempDir place_;
   const std::string archive_ = place_ / "archive.zip";
+  archive_excess excess_;
 };
 
 INSTANTIATE_TEST_SUITE_P(Codec, ZipWriter,
@@ -445,42 +458,223 @@ TEST_P(ZipWriter, AFileThatShrinksIsPackedAsFarAsItGoes) {
   static std::string cut;
   cut = file;
   set_call_hook("read", [] { static_cast<void>(truncate(cut.c_str(), 10)); });
-  EXPECT_EQ(pack(), QUARN_REFUSED);
+  EXPECT_EQ(pack(), QUARN_OK);
   set_call_hook(nullptr, nullptr);
-  EXPECT_EQ(errors("file changed while it was archived : " + file), 1);
+  EXPECT_EQ(count_logged(DLOG_INFO, "file shrank while it was archived : " + file), 1);
   EXPECT_EQ(text("data/a"), std::string(10, 'x'));
 }
 
-TEST_P(ZipWriter, FilesBeyondTheSizeEndTheWalk) {
+TEST_P(ZipWriter, AFileThatIsEmptiedIsPackedEmpty) {
+  static std::string cut;
+  cut = root_.file("data/a", "words");
+  set_call_hook("read", [] { static_cast<void>(truncate(cut.c_str(), 0)); });
+  EXPECT_EQ(pack(), QUARN_OK);
+  set_call_hook(nullptr, nullptr);
+  EXPECT_EQ(text("data/a"), "");
+}
+
+/* ---- bounds ------------------------------------------------------------------ */
+
+TEST_P(ZipWriter, DataBeyondTheBoundEndsTheWork) {
   root_.file("data/a", std::string(600, 'x'));
   const std::string beyond = root_.file("shared/data/b", std::string(401, 'x'));
   root_.file("shared/trusted/c", "x");
-  int error = 0;
-  make_zip_data(kPackage, root_.path().c_str(), archive_.c_str(), &error, 1000);
-  EXPECT_EQ(error, QUARN_REFUSED);
+  archive_bounds bounds = kBackupBounds;
+  bounds.content = 1000;
+  EXPECT_EQ(pack_within(bounds), QUARN_REFUSED);
   EXPECT_EQ(errors("archive is full at " + beyond), 1);
-  EXPECT_THAT(names(), ElementsAre("data/a", kTableEntry));
-  error = 0;
-  make_zip_data(kPackage, root_.path().c_str(), archive_.c_str(), &error, 1002);
-  EXPECT_EQ(error, QUARN_OK);
+  expect_excess(archive_bound::content, 1001, 1000);
+  EXPECT_THAT(names(), ElementsAre("data/a")) << "and no table";
+  bounds.content = 1002;
+  EXPECT_EQ(pack_within(bounds), QUARN_OK);
+  expect_excess(archive_bound::none, 0, 0);
 }
 
-TEST_P(ZipWriter, MoreFilesThanARestoreTakesEndTheWalk) {
-  // one entry is the table's
-  const auto files = static_cast<int>(kMaxArchiveEntries) - 1;
-  for (int i = 0; i < files; ++i) {
+TEST_P(ZipWriter, FilesLinksAndDirectoriesAllCount) {
+  root_.file("data/dir/a", "x");
+  root_.link("data/dir/link", "a");
+  root_.file("shared/data/b", "x");
+  archive_bounds bounds = kBackupBounds;
+  bounds.members = 4;
+  EXPECT_EQ(pack_within(bounds), QUARN_OK);
+  bounds.members = 3;
+  EXPECT_EQ(pack_within(bounds), QUARN_REFUSED);
+  expect_excess(archive_bound::members, 4, 3);
+  EXPECT_EQ(errors("archive is full at " + root_ / "shared/data/b"), 1);
+}
+
+TEST_P(ZipWriter, NamesCountWithTheirDirectories) {
+  root_.file("data/dir/a", "");
+  archive_bounds bounds = kBackupBounds;
+  bounds.names = std::strlen("data/dir/a") + std::strlen("data/dir");
+  EXPECT_EQ(pack_within(bounds), QUARN_OK);
+  --bounds.names;
+  EXPECT_EQ(pack_within(bounds), QUARN_REFUSED);
+  expect_excess(archive_bound::names, bounds.names + 1, bounds.names);
+}
+
+TEST_P(ZipWriter, TheTableCountsAsItWillBeWritten) {
+  root_.file("data/quote\" back\\ line\n bell\a gr\xc3\xbc\xc3\x9f", "x");
+  root_.file("data/dir/a", "x");
+  root_.link("data/link", "to\t\x01");
+  ASSERT_EQ(pack(), QUARN_OK);
+  const std::size_t size = table().size();
+  constexpr std::size_t kFrame = 32;  // what a table without members has
+  archive_bounds bounds = kBackupBounds;
+  bounds.table = size;
+  EXPECT_EQ(pack_within(bounds), QUARN_OK);
+  bounds.table = size - kFrame;
+  EXPECT_EQ(pack_within(bounds), QUARN_REFUSED);
+  EXPECT_EQ(excess_.bound, archive_bound::table);
+  EXPECT_EQ(excess_.limit, bounds.table);
+}
+
+TEST_P(ZipWriter, ManyLongNamesEndTheWorkBeforeTheyTakeMemory) {
+  std::string below = root_ / "data";
+  const std::string part(200, 'p');
+  for (int i = 0; i < 17; ++i) below += "/" + part;
+  std::filesystem::create_directories(below);
+  for (int i = 0; i < 5200; ++i) {
+    ASSERT_EQ(mknod((below + "/" + std::to_string(i)).c_str(), S_IFREG | 0600, 0), 0);
+  }
+  EXPECT_EQ(pack_within(kBackupBounds), QUARN_REFUSED);
+  EXPECT_EQ(excess_.bound, archive_bound::table) << "where every name stands";
+  EXPECT_EQ(excess_.limit, kBackupBounds.table);
+}
+
+TEST_P(ZipWriter, TheMostMembersOfABackupAreTakenByARestoreAndOneMoreIsNot) {
+  for (std::uint64_t i = 0; i < kBackupBounds.members; ++i) {
     const std::string path = root_ / ("data/" + std::to_string(i));
     ASSERT_EQ(mknod(path.c_str(), S_IFREG | 0600, 0), 0);
   }
-  EXPECT_EQ(pack(), QUARN_OK);
+  EXPECT_EQ(pack_within(kBackupBounds), QUARN_OK);
   const TempDir out;
   unzip_report report;
   EXPECT_EQ(unzip_data(kPackage, out.path().c_str(), archive_.c_str(), &report), QUARN_OK);
   EXPECT_TRUE(report.complete());
-  EXPECT_EQ(report.extracted, kMaxArchiveEntries);
+  EXPECT_EQ(report.extracted, kBackupBounds.members + 1);
   ASSERT_EQ(symlink("/nowhere", (root_ / "shared/trusted/link").c_str()), 0);
-  EXPECT_EQ(pack(), QUARN_REFUSED);
+  EXPECT_EQ(pack_within(kBackupBounds), QUARN_REFUSED);
   EXPECT_EQ(errors("archive is full at " + (root_ / "shared/trusted/link")), 1);
+  expect_excess(archive_bound::members, kBackupBounds.members + 1, kBackupBounds.members);
+}
+
+TEST_P(ZipWriter, TheDeepestTreeIsTakenByARestoreAndADeeperOneIsNot) {
+  std::string path = "data";
+  for (int depth = 1; depth < kMaxDirDepth; ++depth) {
+    path += "/d";
+    ASSERT_EQ(mkdir((root_ / path).c_str(), 0755), 0);
+  }
+  root_.file(path + "/deepest", "text");
+  EXPECT_EQ(pack_within(kBackupBounds), QUARN_OK);
+  const TempDir out;
+  unzip_report report;
+  EXPECT_EQ(unzip_data(kPackage, out.path().c_str(), archive_.c_str(), &report), QUARN_OK);
+  EXPECT_TRUE(report.complete());
+  EXPECT_EQ(content_of(out / (path + "/deepest")), "text");
+  root_.file(path + "/d/beyond", "text");
+  EXPECT_EQ(pack_within(kBackupBounds), QUARN_REFUSED);
+  expect_excess(archive_bound::depth, kMaxDirDepth + 1, kMaxDirDepth);
+  EXPECT_EQ(errors("archive is full at " + root_ / (path + "/d")), 1);
+}
+
+TEST_P(ZipWriter, OtherProgramsFindEveryEntryHoweverMany) {
+  for (const int count : {65533, 65535}) {
+    for (int i = 0; i < count; ++i) {
+      static_cast<void>(mknod((root_ / ("data/" + std::to_string(i))).c_str(), S_IFREG | 0600, 0));
+    }
+    EXPECT_EQ(pack(), QUARN_OK);
+    const std::string command = "unzip -l '" + archive_ + "' | tail -n 1 | grep -qw '" +
+                                std::to_string(count + 1) + " files'";
+    EXPECT_EQ(std::system(command.c_str()), 0) << count;
+  }
+}
+
+TEST_P(ZipWriter, AnArchiveThatStaysOnTheDeviceHasNoBounds) {
+  for (std::uint64_t i = 0; i < kBackupBounds.members; ++i) {
+    ASSERT_EQ(mknod((root_ / ("data/" + std::to_string(i))).c_str(), S_IFREG | 0600, 0), 0);
+  }
+  for (int i = 0; i < 3; ++i) root_.file("shared/data/" + std::to_string(i), "x");
+  EXPECT_EQ(pack(), QUARN_OK);
+  const std::string command = "unzip -tqq '" + archive_ + "' >/dev/null";
+  EXPECT_EQ(std::system(command.c_str()), 0);
+}
+
+TEST_P(ZipWriter, WorkThatIsNoLongerWantedEnds) {
+  static std::atomic<bool> stop;
+  stop = false;
+  root_.file("data/a", std::string(2000000, 'x'));
+  root_.file("shared/data/b", "x");
+  set_call_hook("read", [] { stop = true; });
+  int error = 0;
+  make_zip_data(kPackage, root_.path().c_str(), archive_.c_str(), &error, kNoBounds, nullptr,
+                &stop);
+  set_call_hook(nullptr, nullptr);
+  EXPECT_EQ(error, QUARN_REFUSED);
+  EXPECT_THAT(names(), ElementsAre("data/a"));
+}
+
+/* ---- packages that go, and what is not ours ---------------------------------- */
+
+TEST_P(ZipWriter, APackageThatIsRemovedMeanwhileDoesNotComeBack) {
+  static std::string root;
+  for (const char *archive : {"/archive.zip", "/shared/data/org.example.notes_upload.zip"}) {
+    const TempDir place;
+    root = place / "app";
+    place.file("app/data/a", "x");
+    place.file("app/shared/data/b", "x");
+    place.file("app/shared/trusted/c", "x");
+    set_call_hook("read", [] { std::filesystem::remove_all(root); });
+    const std::string path = archive[1] == 'a' ? place_ / "archive.zip" : root + archive;
+    int error = 0;
+    make_zip_data(kPackage, root.c_str(), path.c_str(), &error);
+    set_call_hook(nullptr, nullptr);
+    EXPECT_EQ(error, QUARN_REFUSED) << archive;
+    EXPECT_EQ(errors("(org.example.notes) was removed while it was packed"), 1);
+    EXPECT_FALSE(exists(root)) << archive;
+    clear_captured_log();
+  }
+}
+
+TEST_P(ZipWriter, APackageThatLosesADataDirectoryMeanwhileFails) {
+  static std::string dir;
+  root_.file("shared/trusted/c", "x");
+  dir = root_ / "shared/trusted";
+  set_call_hook("read", [] { std::filesystem::remove_all(dir); });
+  EXPECT_EQ(pack(), QUARN_REFUSED);
+  set_call_hook(nullptr, nullptr);
+  EXPECT_FALSE(exists(dir));
+  EXPECT_EQ(errors("(org.example.notes) was removed while it was packed"), 1);
+}
+
+TEST_P(ZipWriter, APackageThatHasGoneIsNotMade) {
+  const std::string root = place_ / "gone";
+  const std::string archive = root + "/shared/data/org.example.notes_upload.zip";
+  int error = 0;
+  make_zip_data(kPackage, root.c_str(), archive.c_str(), &error);
+  EXPECT_EQ(error, QUARN_UNREADABLE);
+  EXPECT_EQ(errors("zipOpen() failed, zf is NULL"), 1);
+  EXPECT_FALSE(exists(root));
+}
+
+TEST_P(ZipWriter, ADirectoryThatIsMissingIsNotMadeForTheTable) {
+  ASSERT_EQ(rmdir((root_ / "shared/data").c_str()), 0);
+  root_.file("data/a", "x");
+  EXPECT_EQ(pack(), QUARN_REFUSED);
+  EXPECT_THAT(names(), ElementsAre("data/a", kTableEntry));
+  EXPECT_FALSE(exists(root_ / "shared/data"));
+}
+
+TEST_P(ZipWriter, ADirectoryThatTheArchiveNeedsIsTheApplications) {
+  ASSERT_EQ(rmdir((root_ / "shared/data").c_str()), 0);
+  const std::string archive = root_ / "shared/data/org.example.notes_upload.zip";
+  int error = 0;
+  make_zip_data(kPackage, root_.path().c_str(), archive.c_str(), &error);
+  EXPECT_EQ(error, QUARN_OK);
+  struct stat status = {};
+  ASSERT_EQ(lstat((root_ / "shared/data").c_str(), &status), 0);
+  EXPECT_EQ(status.st_uid, kAppUid);
+  EXPECT_EQ(status.st_gid, kAppGid);
 }
 
 TEST_P(ZipWriter, AnotherOwnersFileIsNotPackedByALinkToIt) {
@@ -556,11 +750,25 @@ TEST_P(ZipWriter, ATableThatCannotBeWrittenIsAnError) {
   EXPECT_EQ(errors("fail. insert_file_info_table_to_zip : 36"), 2) << "not written, not there";
 }
 
-TEST_P(ZipWriter, AFileInTheTablesPlaceIsPackedAndReplaced) {
-  root_.file(kTableEntry, "the application's own");
+TEST_P(ZipWriter, AFileInTheTablesPlaceIsPackedAndStays) {
+  const std::string own = root_.file(kTableEntry, "the application's own");
+  ASSERT_EQ(chown(own.c_str(), kAppUid, kAppGid), 0);
+  struct stat before = {};
+  ASSERT_EQ(lstat(own.c_str(), &before), 0);
   EXPECT_EQ(pack(), 0);
   EXPECT_THAT(names(), ElementsAre(kTableEntry, kTableEntry));
   EXPECT_EQ(inflate_text(entries()[1].data).find(R"({ "quarn_symbolic_info")"), 0U);
+  EXPECT_EQ(content_of(own), "the application's own");
+  struct stat after = {};
+  ASSERT_EQ(lstat(own.c_str(), &after), 0);
+  EXPECT_EQ(after.st_ino, before.st_ino);
+}
+
+TEST_P(ZipWriter, ALinkInTheTablesPlaceStays) {
+  root_.link(kTableEntry, "elsewhere");
+  EXPECT_EQ(pack(), 0);
+  EXPECT_THAT(names(), ElementsAre(kTableEntry));
+  EXPECT_TRUE(std::filesystem::is_symlink(root_ / kTableEntry));
 }
 
 TEST_P(ZipWriter, DataOfAnInterruptedRestoreIsNotPacked) {

@@ -313,26 +313,43 @@ TEST_F(Rules, ErrorsAreToldOnStandardErrorAndAsEveryVerbsJson) {
             "source nor an installed package\"}\n");
 }
 
-TEST_F(Rules, FileOverTheDaemonsOwnLimitIsSaidToBeIgnored) {
+TEST_F(Rules, FileOverTheDaemonsOwnLimitIsSaidToBlockEveryBackup) {
   const std::string element = "<backup><exclude path=\"data/cache/\"/></backup>";
   rules(element + std::string(kMaxRulesSize - element.size(), '\n'));
   EXPECT_FALSE(check().ignored);
   EXPECT_FALSE(entry(check(), "data/cache/tile").in);
   rules(element + std::string(kMaxRulesSize - element.size() + 1, '\n'));
   const rules_report report = check();
-  EXPECT_TRUE(report.ignored);
-  EXPECT_TRUE(entry(report, "data/cache/tile").in);
+  EXPECT_TRUE(report.blocked);
+  EXPECT_FALSE(report.ignored);
+  EXPECT_FALSE(entry(report, "data/keep.db").in);
   EXPECT_EQ(kinds(report), std::vector<std::string>{"too-large"});
   EXPECT_EQ(rules_exit_code(report), RULES_UNUSABLE);
-  EXPECT_NE(rules_text(report).find("larger than 262144 bytes"), std::string::npos);
+  EXPECT_NE(
+      rules_text(report).find("it is larger than 262144 bytes: the application is not backed up"),
+      std::string::npos);
+  EXPECT_NE(rules_json(report).find("\"exit\":3,\"message\":\"the rules file cannot be used, so "
+                                    "nothing is backed up\"}\n"),
+            std::string::npos);
 }
 
-TEST_F(Rules, FileThatDeclaresEntitiesIsIgnoredAsByTheDaemon) {
+TEST_F(Rules, FileThatDefinesEntitiesBlocksEveryBackupAsInTheDaemon) {
   rules("<!DOCTYPE backup [<!ENTITY p \"data/cache/\">]><backup><exclude path=\"&p;\"/></backup>");
   const rules_report report = check();
-  EXPECT_TRUE(report.ignored);
-  EXPECT_TRUE(entry(report, "data/cache/tile").in);
+  EXPECT_TRUE(report.blocked);
+  EXPECT_FALSE(entry(report, "data/keep.db").in);
+  EXPECT_EQ(kinds(report), std::vector<std::string>{"entities"});
   EXPECT_EQ(rules_exit_code(report), RULES_UNUSABLE);
+}
+
+TEST_F(Rules, FileWithOtherDeclarationsOfItsOwnIsARulesFile) {
+  rules(
+      "<!DOCTYPE backup [<!ELEMENT backup ANY><!-- none -->]>"
+      "<backup><exclude path=\"data/cache/\"/></backup>");
+  const rules_report report = check();
+  EXPECT_FALSE(report.blocked);
+  EXPECT_FALSE(report.ignored);
+  EXPECT_FALSE(entry(report, "data/cache/tile").in);
 }
 
 TEST_F(Rules, CommandReadsASource) {
