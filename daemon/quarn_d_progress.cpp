@@ -117,6 +117,8 @@ const char *word(restore_outcome outcome) {
       return "restored";
     case restore_outcome::rolled_back:
       return "rolled-back";
+    case restore_outcome::incomplete:
+      return "incomplete";
     case restore_outcome::failed:
       return "failed";
     case restore_outcome::skipped:

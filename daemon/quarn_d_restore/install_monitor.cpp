@@ -1,6 +1,7 @@
 #include <algorithm>
 #include <memory>
 
+#include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/handles.h"
@@ -88,6 +89,15 @@ bool is_restorable(package_info_h info, const char *package, std::string *root) 
   return !preload;
 }
 
+/** Only what the next daemon would show again, should this one end, is hidden. */
+void hide_until_restored(const char *package, const std::string &root) {
+  if (note_hidden_icon(package, root.c_str())) {
+    appear_app_icon(package, false, kIconHideDelay);
+  } else {
+    LOGE("icon of (%s) stays: that it is hidden cannot be noted", package);
+  }
+}
+
 void restore_new_package(package_info_h info, const char *package) {
   auto ctx = std::make_unique<pkg_restore_context>();
   if (!is_restorable(info, package, &ctx->root)) return;
@@ -113,7 +123,7 @@ void restore_new_package(package_info_h info, const char *package) {
   if (result != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_info_foreach_app_from_package() failed");
   } else if (ctx->pending != 0) {
-    appear_app_icon(package, false, kIconHideDelay);
+    hide_until_restored(package, ctx->root);
   }
   // With a download on its way the context is the pipeline's; otherwise nobody holds it.
   if (ctx->pending > 0) static_cast<void>(ctx.release());

@@ -3,8 +3,11 @@
 #include <memory>
 
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -58,6 +61,19 @@ int unpack(const pkg_restore_context &ctx, const std::string &archive) {
   return result;
 }
 
+/** End a restore that failed after the snapshot was made: with what became of the data. */
+restore_outcome roll_back(pkg_restore_context *ctx, int result) {
+  ctx->result = result;
+  switch (put_snapshot_back(ctx->pkgid.c_str(), ctx->root.c_str())) {
+    case rollback_result::whole:
+      return restore_outcome::rolled_back;
+    case rollback_result::kept:
+    case rollback_result::none:
+      break;
+  }
+  return restore_outcome::incomplete;
+}
+
 /** Replace the package's data by the archive's, or leave it as it is. */
 restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive,
                                      std::uint64_t size) {
@@ -65,6 +81,12 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
   const char *root = ctx->root.c_str();
   const std::lock_guard<std::mutex> lock(package_data_mutex);
   report_restore_step(ctx->pkgid, restore_stage::snapshot, size);
+  if (recover_package_data(pkgid, root) == recovery_result::kept) {
+    // A further snapshot would take the place of what is still to be put back.
+    LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, QUARN_REFUSED);
+    ctx->result = QUARN_REFUSED;
+    return restore_outcome::incomplete;
+  }
   int result = temp_backup_initial_app_data(pkgid, root);
   if (result != QUARN_OK) {
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
@@ -77,20 +99,19 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
   result = unpack(*ctx, archive);
   if (result != QUARN_OK) {
     LOGE("fail to restore app info for (%s) err : %d", pkgid, result);
-    rollback_to_initial_app_data(pkgid, root);
-    ctx->result = result;
-    return restore_outcome::rolled_back;
+    return roll_back(ctx, result);
   }
   restore_step("unpacked");
   report_restore_step(ctx->pkgid, restore_stage::attributes, size);
-  const bool restored = restore_app_info(pkgid, root) != 0;
+  const bool noted = note_unpacked_files(pkgid, root);
+  if (!noted) LOGE("unpacked files of (%s) cannot be noted", pkgid);
+  const bool restored = noted && restore_app_info(pkgid, root) != 0;
   if (restored) restore_step("restored");
   if (!restored || !discard_snapshot(pkgid, root)) {
     LOGE("fail to restore for (%s)", pkgid);
-    rollback_to_initial_app_data(pkgid, root);
-    ctx->result = QUARN_REFUSED;
-    return restore_outcome::rolled_back;
+    return roll_back(ctx, QUARN_REFUSED);
   }
+  forget_told_snapshot(restore_files(ctx->pkgid, ctx->root));
   LOGI("restore successfully completed for (%s)", pkgid);
   return restore_outcome::restored;
 }
@@ -146,6 +167,7 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
 /** Hand the request to the transport, or tell its context that it was refused. */
 bool start_download(RequestPtr request) {
   pkg_restore_context *ctx = request->ctx;
+  claim_working_file(request->local_path);
   const int result = backup_trans_download_file_ors_async(
       cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
       __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE);
@@ -201,26 +223,48 @@ std::string companion_archive(const pkg_restore_context &ctx) {
          ".zip";
 }
 
-int unpack_from_companion(pkg_restore_context *ctx, bool *restored) {
-  const char *pkgid = ctx->pkgid.c_str();
-  if (!is_safe_path_component(ctx->pkgid) || !is_safe_path_component(ctx->version)) {
-    LOGE("refused : not an archive name (%s, %s)", pkgid, ctx->version.c_str());
-    return QUARN_REFUSED;
+/** What a restore from the companion came to. */
+struct companion_restore {
+  int unpacked = QUARN_OK; /**< what the unpacking gave: 0 also when entries are missing */
+  bool whole = false;      /**< every entry was unpacked */
+  bool attributes = false; /**< everything that was unpacked has its attributes */
+  std::uint64_t size = 0;
+};
+
+companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
+  const char *pkgid = ctx.pkgid.c_str();
+  companion_restore done;
+  if (!is_safe_path_component(ctx.pkgid) || !is_safe_path_component(ctx.version)) {
+    LOGE("refused : not an archive name (%s, %s)", pkgid, ctx.version.c_str());
+    done.unpacked = QUARN_REFUSED;
+    return done;
   }
-  const std::string archive = companion_archive(*ctx);
+  const std::string archive = companion_archive(ctx);
   const std::lock_guard<std::mutex> lock(package_data_mutex);
-  const std::uint64_t size = archive_size(archive);
-  report_restore_step(ctx->pkgid, restore_stage::unpacking, size);
-  const int result = unpack(*ctx, archive);
-  if (result != QUARN_OK) return result;
-  report_restore_step(ctx->pkgid, restore_stage::attributes, size);
-  *restored = restore_app_info(pkgid, ctx->root.c_str()) != 0;
-  if (*restored) {
+  if (recover_package_data(pkgid, ctx.root.c_str()) == recovery_result::kept) {
+    // What is still to be put back would go over what is unpacked now.
+    LOGE("fail to restore for (%s)", pkgid);
+    done.unpacked = QUARN_REFUSED;
+    return done;
+  }
+  done.size = archive_size(archive);
+  report_restore_step(ctx.pkgid, restore_stage::unpacking, done.size);
+  unzip_report report;
+  done.unpacked = unzip_data(pkgid, ctx.root.c_str(), archive.c_str(), &report);
+  if (done.unpacked != QUARN_OK) return done;
+  done.whole = report.complete();
+  if (!done.whole) {
+    LOGE("%u entries of (%s) were not restored", report.refused + report.failed, pkgid);
+  }
+  // There is nothing to roll back to: what could be unpacked is the application's.
+  report_restore_step(ctx.pkgid, restore_stage::attributes, done.size);
+  done.attributes = restore_app_info(pkgid, ctx.root.c_str()) != 0;
+  if (done.attributes) {
     LOGI("restore completed for (%s)", pkgid);
   } else {
     LOGE("fail to restore for (%s)", pkgid);
   }
-  return QUARN_OK;
+  return done;
 }
 
 /**
@@ -229,15 +273,20 @@ int unpack_from_companion(pkg_restore_context *ctx, bool *restored) {
  * not the engine's to show.
  */
 int restore_from_companion(pkg_restore_context *ctx) {
-  bool restored = false;
-  const int result = unpack_from_companion(ctx, &restored);
-  if (result != QUARN_OK) ctx->result = result;
+  const companion_restore done = unpack_from_companion(*ctx);
+  if (done.unpacked != QUARN_OK) ctx->result = done.unpacked;
   LOGI("restore_app_data for %s complete", ctx->pkgid.c_str());
-  const int reported = result == QUARN_OK && !restored ? QUARN_REFUSED : result;
-  report_restore_end(ctx->pkgid, restored ? restore_outcome::restored : restore_outcome::failed,
-                     reported, result == QUARN_OK ? archive_size(companion_archive(*ctx)) : 0);
+  int reported = done.unpacked;
+  if (reported == QUARN_OK && !done.whole) reported = QUARN_UNREADABLE;
+  if (reported == QUARN_OK && !done.attributes) reported = QUARN_REFUSED;
+  const bool begun = done.unpacked == QUARN_OK;
+  report_restore_end(ctx->pkgid,
+                     reported == QUARN_OK ? restore_outcome::restored
+                     : begun              ? restore_outcome::incomplete
+                                          : restore_outcome::failed,
+                     reported, begun ? done.size : 0);
   check_package_restore_complete(ctx);
-  return result;
+  return done.unpacked;
 }
 
 }  // namespace
@@ -254,6 +303,7 @@ void check_package_restore_complete(pkg_restore_context *ctx) {
     delete ctx;
   } else if (!ctx->wait_for_result) {
     appear_app_icon(ctx->pkgid.c_str(), true, 0.0);
+    forget_hidden_icon(ctx->pkgid.c_str(), ctx->root.c_str());
     delete ctx;
   } else if (ctx->main_loop != nullptr) {
     GMainLoop *loop = ctx->main_loop;

@@ -97,9 +97,9 @@ int temp_backup_initial_app_data(const char *pkgid, const char *root);
 /** Copy what lies below @p dir into the snapshot @p temp_dir. @return 1, 0 when anything failed */
 int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
                        file_info_table_h *table);
-/** Put the snapshot back and remove it; may be repeated when it was interrupted. @return 0 */
+/** put_snapshot_back() of snapshot.h. @return 0 */
 int rollback_to_initial_app_data(const char *pkgid, const char *root);
-/** Copy what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
+/** Move what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
 int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
 /**
  * Remove the snapshot, its table first: from then on the present data counts.
@@ -108,8 +108,9 @@ int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root)
 bool discard_snapshot(const char *pkgid, const char *root);
 /**
  * Undo what a daemon that died in a restore of the package left: a complete
- * snapshot is put back, an incomplete one removed. Takes package_data_mutex.
- * @return true when data was put back
+ * snapshot is put back, an incomplete one removed. Where the application has
+ * written since, its data stays and the snapshot is kept. Takes package_data_mutex.
+ * @return true when all data was put back
  */
 bool recover_interrupted_restore(const char *pkgid, const char *root);
 /** The same for every installed package. */
@@ -144,7 +145,8 @@ enum class restore_outcome {
   none,
   restored,
   rolled_back, /**< the data is as it was before */
-  failed,      /**< nothing was changed; from the companion, the data may be incomplete */
+  incomplete,  /**< not all of the data is in its place; what is missing is kept and tried again */
+  failed,      /**< nothing was changed */
   skipped      /**< not attempted */
 };
 

@@ -1,3 +1,5 @@
+#include "quarn_d_restore/snapshot.h"
+
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -5,12 +7,11 @@
 #include <cstring>
 #include <utility>
 
-#include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
-#include "quarn_d_restore/restore_files.h"
-#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
 namespace {
@@ -18,119 +19,75 @@ namespace {
 constexpr mode_t kSnapshotMode = 0700;
 constexpr std::size_t kSmallFile = 64 << 10;
 constexpr mode_t kCopyMode = 0600;
-constexpr mode_t kPermissionBits = 07777;
+constexpr mode_t kFolderMode = 0755;
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
-constexpr char kUnfinishedTable[] = "/table";
-constexpr char kKept[] = "/kept";
 
 struct TableRelease {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
 };
 using TablePtr = std::unique_ptr<file_info_table_h, TableRelease>;
 
-using Paths = std::vector<std::string>;
+std::string folder_of(const std::string &path) { return path.substr(0, path.rfind('/')); }
 
-/** The snapshot folder of this daemon: an application can neither make nor enter one. */
-bool is_own_snapshot(const std::string &path) {
-  struct stat status = {};
-  return safe_lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode) &&
-         status.st_uid == geteuid() && (status.st_mode & ACCESSPERMS) == kSnapshotMode;
+/** A directory that an application can neither make nor enter. */
+bool is_own_snapshot(const struct stat &status) {
+  return S_ISDIR(status.st_mode) && status.st_uid == geteuid() &&
+         (status.st_mode & ACCESSPERMS) == kSnapshotMode;
 }
 
-bool is_complete_snapshot(const restore_files &files) {
-  return is_own_snapshot(files.snapshot) && file_exist(files.snapshot_table.c_str());
+bool rename_path(const std::string &from, const std::string &to) {
+  std::string old_name;
+  std::string name;
+  const UniqueFd source = safe_open_parent(from.c_str(), &old_name);
+  const UniqueFd target = safe_open_parent(to.c_str(), &name);
+  return source && target &&
+         renameat(source.get(), old_name.c_str(), target.get(), name.c_str()) == 0;
 }
 
-/** Bring everything written so far below @p path onto the disk. */
-bool flush(const std::string &path) {
-  const UniqueFd dir = safe_open(path.c_str(), O_RDONLY | O_DIRECTORY);
-  return dir && syncfs(dir.get()) == 0;
-}
-
-/** Bring the entry @p path of its directory, or its absence, onto the disk. */
-bool flush_directory(const std::string &path) {
-  const std::string dir = path.substr(0, path.rfind('/'));
-  const UniqueFd handle = safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY);
-  return handle && fsync(handle.get()) == 0;
-}
-
-/** Remove one name that is not a directory, without looking where it leads. */
-bool unlink_entry(const std::string &path) {
+bool unlink_path(const std::string &path) {
   std::string name;
   const UniqueFd parent = safe_open_parent(path.c_str(), &name);
-  return parent && unlinkat(parent.get(), name.c_str(), 0) == 0;
+  return parent && (unlinkat(parent.get(), name.c_str(), 0) == 0 || errno == ENOENT);
 }
 
-/** An empty snapshot folder, whatever lay in its place. */
-bool make_snapshot_dir(const restore_files &files) {
+bool remove_any(const std::string &path) {
   std::string name;
-  const UniqueFd parent = safe_open_parent(files.snapshot.c_str(), &name);
+  const UniqueFd parent = safe_open_parent(path.c_str(), &name);
   if (!parent) return false;
   struct stat status = {};
-  if (fstatat(parent.get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0) {
-    if (S_ISDIR(status.st_mode)) {
-      clear_directory(files.snapshot.c_str(), true);
-    } else {
-      unlinkat(parent.get(), name.c_str(), 0);
-    }
+  if (fstatat(parent.get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
+    return errno == ENOENT;
   }
-  return mkdirat(parent.get(), name.c_str(), kSnapshotMode) == 0 && is_own_snapshot(files.snapshot);
+  if (!S_ISDIR(status.st_mode)) return unlinkat(parent.get(), name.c_str(), 0) == 0;
+  return delete_tree_at(parent.get(), name.c_str(), path, OtherTypes::kRemoved);
+}
+
+/** An empty snapshot folder; one that is only kept makes way. */
+bool make_snapshot_dir(const restore_files &files) {
+  if (state_of_snapshot(files) == snapshot_state::told) {
+    remove_any(files.aside);
+    if (!rename_path(files.snapshot, files.aside)) return false;
+  }
+  if (!remove_snapshot(files)) return false;
+  std::string name;
+  const UniqueFd parent = safe_open_parent(files.snapshot.c_str(), &name);
+  return parent && mkdirat(parent.get(), name.c_str(), kSnapshotMode) == 0 &&
+         state_of_snapshot(files) == snapshot_state::incomplete;
 }
 
 /** Save the table under its name only when it is whole and everything it tells of is on disk. */
 int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
   // Beside the copies, not among them, where an application's file could have the name.
-  const std::string unfinished = files.snapshot + kUnfinishedTable;
-  const int result = save_file_info_table(table, unfinished.c_str());
+  const int result = save_file_info_table(table, files.unfinished_table.c_str());
   if (result != QUARN_OK) return result;
   restore_step("snapshot-table-written");
-  if (!create_directory_of_file(files.snapshot_table.c_str()) || !flush(files.snapshot)) {
+  // The snapshot's own name is in the folder that it lies in.
+  if (!create_directory_of_file(files.snapshot_table.c_str()) || !sync_tree(files.snapshot) ||
+      !sync_directory(folder_of(files.snapshot))) {
     return QUARN_REFUSED;
   }
-  std::string old_name;
-  std::string name;
-  const UniqueFd source = safe_open_parent(unfinished.c_str(), &old_name);
-  const UniqueFd parent = safe_open_parent(files.snapshot_table.c_str(), &name);
-  if (!source || !parent ||
-      renameat(source.get(), old_name.c_str(), parent.get(), name.c_str()) != 0) {
-    return QUARN_REFUSED;
-  }
-  return flush_directory(files.snapshot_table) ? QUARN_OK : QUARN_REFUSED;
-}
-
-/** Move every entry of one directory that @p wanted takes into another. */
-template <typename Wanted>
-void move_entries(const std::string &from, const std::string &to, Wanted wanted) {
-  const DirPtr source = safe_opendir(from.c_str());
-  const UniqueFd target = safe_open(to.c_str(), O_PATH | O_DIRECTORY);
-  if (source == nullptr || !target) return;
-  while (const dirent *entry = readdir(source.get())) {
-    const char *name = entry->d_name;
-    if (is_dot_entry(name) || !wanted(from + "/" + name)) continue;
-    if (renameat(dirfd(source.get()), name, target.get(), name) != 0) {
-      LOGE("fail to move %s from %s to %s", name, from.c_str(), to.c_str());
-    }
-  }
-}
-
-/**
- * What no snapshot holds is not emptied by a rollback either: an archive that
- * a backup run has staged, and what is skipped for its name.
- */
-void set_aside(const restore_files &files) {
-  const std::string kept = files.snapshot + kKept;
-  if (safe_mkdir_with_parents(kept.c_str(), kSnapshotMode) != 0) return;
-  move_entries(files.dirs[1], kept, [&](const std::string &path) {
-    return files.is_skipped(path) && path != files.snapshot && path != files.download;
-  });
-}
-
-void bring_back(const restore_files &files) {
-  const std::string kept = files.snapshot + kKept;
-  move_entries(kept, files.dirs[1], [](const std::string &) { return true; });
-  std::string name;
-  const UniqueFd parent = safe_open_parent(kept.c_str(), &name);
-  if (parent) unlinkat(parent.get(), name.c_str(), AT_REMOVEDIR);
+  if (!rename_path(files.unfinished_table, files.snapshot_table)) return QUARN_REFUSED;
+  return sync_directory(folder_of(files.snapshot_table)) ? QUARN_OK : QUARN_REFUSED;
 }
 
 /** Copy all of a file's bytes: small ones through memory, which costs less than a set-up. */
@@ -149,107 +106,213 @@ bool copy_bytes(int from, int to, off_t size) {
   return true;
 }
 
-/** Copy an open file the quick way; false, and nothing is left, when that cannot be done. */
-bool copy_within(const UniqueFd &from, off_t size, int to_dir, const char *name) {
-  if (!from) return false;
-  UniqueFd to(openat(to_dir, name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kCopyMode));
-  if (!to) return false;
-  const bool copied = copy_bytes(from.get(), to.get(), size);
-  if (close(to.release()) == 0 && copied) return true;
-  unlinkat(to_dir, name, 0);
-  return false;
-}
+/** Copies one package's directories into its snapshot. */
+class SnapshotCopy {
+ public:
+  SnapshotCopy(const char *pkgid, const char *root, std::string snapshot, file_info_table_h *table,
+               StampWriter *stamps)
+      : files_(pkgid, root),
+        root_(root),
+        snapshot_(std::move(snapshot)),
+        table_(table),
+        stamps_(stamps) {}
 
-/** Copy a file out of the snapshot; without room for a copy, the snapshot's own file serves. */
-bool put_file_back(const std::string &from, const std::string &to) {
-  if (create_directory_of_file(to.c_str()) && copy_file(from.c_str(), to.c_str())) return true;
-  std::string from_name;
-  std::string to_name;
-  const UniqueFd source = safe_open_parent(from.c_str(), &from_name);
-  const UniqueFd target = safe_open_parent(to.c_str(), &to_name);
-  if (!source || !target) return false;
-  unlinkat(target.get(), to_name.c_str(), 0);
-  return linkat(source.get(), from_name.c_str(), target.get(), to_name.c_str(), 0) == 0;
-}
-
-JsonPtr read_table(const std::string &path) {
-  char *raw = nullptr;
-  const bool read = read_data_from_file(path.c_str(), &raw);
-  const CString text(raw);
-  return JsonPtr(read ? parse_file_info_table(text.get()) : nullptr);
-}
-
-/**
- * Make one object what the snapshot's table says. The table is this device's
- * own, so unlike a restore it may put back any owner and any label.
- */
-void put_object_back(int root, const char *key, json_object *entry) {
-  json_object *values[4] = {};
-  const char *const keys[4] = {"0", "1", "2", "3"};
-  for (int i = 0; i < 4; ++i) {
-    if (!json_object_object_get_ex(entry, keys[i], &values[i])) return;
-  }
-  const UniqueFd object = safe_open_below(root, key, O_PATH | O_NOFOLLOW);
-  struct stat status = {};
-  if (!object || fstat(object.get(), &status) != 0) return;  // an empty directory stays away
-  if (!S_ISREG(status.st_mode) && !S_ISDIR(status.st_mode)) return;
-
-  const auto uid = static_cast<uid_t>(json_object_get_int64(values[1]));
-  const auto gid = static_cast<gid_t>(json_object_get_int64(values[2]));
-  mode_t mode = static_cast<mode_t>(json_object_get_int(values[0])) & kPermissionBits;
-  // Running as somebody else is nothing an application's data may bring about.
-  if (uid != kAppUid || gid != kAppGid) mode &= ~kSetIdBits;
-  if (status.st_uid != uid || status.st_gid != gid) {
-    if (change_object_owner(object.get(), uid, gid) < 0) LOGE("chown: error \n");
-    if (fstat(object.get(), &status) != 0) return;
-  }
-  if ((status.st_mode & kPermissionBits) != mode &&
-      change_object_mode(object.get(), status, mode) < 0) {
-    LOGE("chmod failed");
+  /** @return true when everything below @p dir was recorded and copied */
+  bool copy(const std::string &dir) {
+    TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    if (!place) {
+      LOGE("error : cannot open this path %s", dir.c_str());
+      return false;
+    }
+    path_ = dir;
+    copied_ = true;
+    std::vector<std::vector<std::string>> pending;
+    pending.push_back(copy_folder(place.fd()));
+    while (true) {
+      if (pending.back().empty()) {
+        pending.pop_back();
+        if (pending.empty()) return copied_;
+        if (!place.up()) return false;
+        path_.resize(path_.rfind('/'));
+        continue;
+      }
+      const std::string name = std::move(pending.back().back());
+      pending.back().pop_back();
+      const std::size_t length = path_.size();
+      path_ += "/" + name;
+      if (place.down(name.c_str())) {
+        pending.push_back(copy_folder(place.fd()));
+        continue;
+      }
+      LOGE("error : cannot open this path %s", path_.c_str());
+      copied_ = false;
+      path_.resize(length);
+    }
   }
 
-  const char *label = json_object_get_string(values[3]);
-  const std::string path = fd_path(object.get());
-  CString current;
-  if (label == nullptr || label[0] == '\0') return;
-  if (smack_getlabel(path.c_str(), out(current), SMACK_LABEL_ACCESS) == 0 && current != nullptr &&
-      std::strcmp(current.get(), label) == 0) {
-    return;
+ private:
+  /** The files of the directory at the walk's path. @return the directories in it */
+  std::vector<std::string> copy_folder(int dir) {
+    std::vector<TreeEntry> entries;
+    std::vector<std::string> folders;
+    if (!list_tree_entries(dir, &entries)) {
+      LOGE("error : cannot open this path %s", path_.c_str());
+      copied_ = false;
+    }
+    UniqueFd target;  // made with the first file that is copied into it
+    for (TreeEntry &entry : entries) {
+      const PathStep step(&path_, entry.name.c_str());
+      // by the names of this package, and by the folder that the copies go to
+      if (files_.is_skipped(path_) || path_.compare(0, snapshot_.size(), snapshot_) == 0) continue;
+      restore_step("snapshot-entry");
+      if (copy_entry(dir, entry, &target)) folders.push_back(std::move(entry.name));
+    }
+    return folders;
   }
-  if (security_server_label_access(path.c_str(), label) != SECURITY_SERVER_SUCCESS &&
-      smack_setlabel(path.c_str(), label, SMACK_LABEL_ACCESS) != 0) {
-    LOGE("fail to put label of %s back", key);
-  }
-}
 
-/**
- * restore_app_info() stops at the first thing that a restore may not do, a
- * security service that refuses, say. The data goes back all the same.
- */
-void put_attributes_back(json_object *table, const char *root) {
-  const UniqueFd dir = safe_open(root, O_PATH | O_DIRECTORY);
-  if (!dir || table == nullptr) return;
-  json_object_object_foreach(table, key, entry) {
-    restore_step("rollback-attributes");
-    if (json_object_is_type(entry, json_type_object)) put_object_back(dir.get(), key, entry);
+  /** Record one entry and copy it when it is a file. @return true for a directory */
+  bool copy_entry(int dir, const TreeEntry &entry, UniqueFd *target) {
+    const char *name = entry.name.c_str();
+    struct stat status = {};
+    UniqueFd object;  // what the directory calls a file need not be looked at twice
+    if (entry.type == DT_REG) object = safe_open_file_at(dir, name, &status);
+    if (!object) {
+      const int found = fstatat(dir, name, &status, AT_SYMLINK_NOFOLLOW);
+      if (found != 0) {
+        LOGE("error : lstat for %d %s", found, path_.c_str());
+        return false;
+      }
+    }
+    if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode)) {
+      LOGE("this is unexpected type : %s", path_.c_str());
+      return false;
+    }
+    // A path may be longer than the kernel takes: the label is read by a descriptor.
+    if (S_ISDIR(status.st_mode)) object.reset(openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    int error = QUARN_OK;
+    add_to_file_info_table(table_, root_.c_str(), path_.c_str(), status, &error, object.get());
+    if (error != QUARN_OK) copied_ = false;
+    if (S_ISDIR(status.st_mode)) return true;
+    // A table that lies in the data would make the snapshot look complete before it is.
+    if (path_ != files_.table) copy_regular(object, status, target, name);
+    return false;
   }
-}
+
+  void copy_regular(const UniqueFd &file, const struct stat &status, UniqueFd *target,
+                    const char *name) {
+    if (!*target) *target = make_folder(path_.substr(root_.size() + 1));
+    if (file && *target && copy_open_file(file, status, target->get(), name)) return;
+    const std::string copy = snapshot_ + path_.substr(root_.size());
+    if (*target && copy_file(path_.c_str(), copy.c_str())) return;
+    LOGE("fail copy : from %s to %s", path_.c_str(), copy.c_str());
+    copied_ = false;
+  }
+
+  /** Copy an open file, its label too: setting one may need space, which a rollback must not. */
+  bool copy_open_file(const UniqueFd &from, const struct stat &status, int to_dir,
+                      const char *name) {
+    UniqueFd to(openat(to_dir, name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kCopyMode));
+    if (!to) return false;
+    struct stat copy = {};
+    const bool copied = copy_bytes(from.get(), to.get(), status.st_size) &&
+                        fstat(to.get(), &copy) == 0 && is_still_the_same(from.get(), status);
+    if (copied) label_copy(to.get(), path_.substr(root_.size() + 1));
+    if (close(to.release()) == 0 && copied) {
+      if (stamps_ != nullptr) {
+        stamps_->add(status);
+        stamps_->add(copy);
+      }
+      return true;
+    }
+    unlinkat(to_dir, name, 0);
+    return false;
+  }
+
+  /** Another's program whose bytes may have changed since its mode was read is not that program. */
+  static bool is_still_the_same(int fd, const struct stat &before) {
+    if ((before.st_mode & kSetIdBits) == 0) return true;
+    struct stat now = {};
+    return fstat(fd, &now) == 0 && now.st_mode == before.st_mode &&
+           now.st_ctim.tv_sec == before.st_ctim.tv_sec &&
+           now.st_ctim.tv_nsec == before.st_ctim.tv_nsec;
+  }
+
+  /** Give a copy the label that the table has for @p key, where this may be done. */
+  void label_copy(int fd, const std::string &key) const {
+    json_object *entry = nullptr;
+    json_object *label = nullptr;
+    if (!json_object_object_get_ex(table_->root, key.c_str(), &entry) ||
+        !json_object_object_get_ex(entry, "3", &label)) {
+      return;
+    }
+    const char *text = json_object_get_string(label);
+    if (text == nullptr || text[0] == '\0') return;
+    static_cast<void>(smack_setlabel(own_fd_path(fd).c_str(), text, SMACK_LABEL_ACCESS));
+  }
+
+  /** The folder in the snapshot for the file @p key, one name after the other, labels too. */
+  UniqueFd make_folder(const std::string &key) const {
+    UniqueFd at = safe_open(snapshot_.c_str(), O_RDONLY | O_DIRECTORY);
+    std::size_t begin = 0;
+    for (std::size_t end = key.find('/'); at && end != std::string::npos;
+         begin = end + 1, end = key.find('/', begin)) {
+      const std::string name = key.substr(begin, end - begin);
+      const bool made = mkdirat(at.get(), name.c_str(), kFolderMode) == 0;
+      UniqueFd next(
+          openat(at.get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+      if (next && made) label_copy(next.get(), key.substr(0, end));
+      at = std::move(next);
+    }
+    return at;
+  }
+
+  const restore_files files_;
+  const std::string root_;
+  const std::string snapshot_;
+  file_info_table_h *table_;
+  StampWriter *stamps_;
+  std::string path_;
+  bool copied_ = true;
+};
 
 }  // namespace
+
+snapshot_state state_of_snapshot(const restore_files &files) {
+  struct stat status = {};
+  if (safe_lstat(files.snapshot.c_str(), &status) != 0) return snapshot_state::none;
+  if (!is_own_snapshot(status)) return snapshot_state::foreign;
+  if (file_exist(files.snapshot_table.c_str())) return snapshot_state::complete;
+  return file_exist(files.told.c_str()) ? snapshot_state::told : snapshot_state::incomplete;
+}
+
+bool remove_snapshot(const restore_files &files) { return remove_any(files.snapshot); }
+
+void forget_told_snapshot(const restore_files &files) {
+  if (!remove_any(files.aside)) LOGE("fail to delete dir : %s", files.aside.c_str());
+}
+
+bool keep_told_snapshot(const restore_files &files) {
+  return rename_path(files.snapshot_table, files.told) && sync_directory(files.snapshot);
+}
 
 bool discard_snapshot(const char *pkgid, const char *root) {
   const restore_files files(pkgid, root);
   // Without its table a half-deleted snapshot is never taken for a whole one.
-  if (file_exist(files.snapshot_table.c_str())) {
-    if (!flush(files.dirs[1])) {
+  if (state_of_snapshot(files) == snapshot_state::complete) {
+    const auto skipped = [&](const std::string &path) { return files.is_skipped(path); };
+    for (const auto &dir : files.dirs) {
+      if (sync_tree(dir, skipped)) continue;
       LOGE("data of (%s) is not on the disk, so its snapshot is kept", pkgid);
       return false;
     }
-    delete_file(files.snapshot_table.c_str());
-    flush_directory(files.snapshot_table);
+    if (!unlink_path(files.snapshot_table)) {
+      LOGE("snapshot of (%s) cannot be released, so it is kept", pkgid);
+      return false;
+    }
+    sync_directory(folder_of(files.snapshot_table));
   }
   restore_step("snapshot-released");
-  clear_directory(files.snapshot.c_str(), true);
+  if (state_of_snapshot(files) != snapshot_state::told) remove_snapshot(files);
   return true;
 }
 
@@ -267,15 +330,18 @@ int temp_backup_initial_app_data(const char *pkgid, const char *root) {
     LOGE("fail to make snapshot directory : %s", files.snapshot.c_str());
     return QUARN_REFUSED;
   }
+  StampWriter stamps(files.stamps);
+  SnapshotCopy copy(pkgid, root, files.snapshot, table.get(), &stamps);
   for (const auto &dir : files.dirs) {
-    if (!parse_dir_for_copy(dir.c_str(), files.snapshot.c_str(), pkgid, root, table.get())) {
+    if (!copy.copy(dir)) {
       LOGE("fail to temp backup : %s", dir.c_str());
       clear_directory(files.snapshot.c_str(), true);
       return QUARN_REFUSED;
     }
   }
   restore_step("snapshot-copied");
-  const int result = save_snapshot_table(table.get(), files);
+  const int result =
+      stamps.finish() ? save_snapshot_table(table.get(), files) : static_cast<int>(QUARN_REFUSED);
   if (result != QUARN_OK) {
     LOGE("fail. temp_backup_initial_app_data : %d", result);
     return result;
@@ -286,144 +352,5 @@ int temp_backup_initial_app_data(const char *pkgid, const char *root) {
 
 int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
                        file_info_table_h *table) {
-  const restore_files files(pkgid, root);
-  const std::string snapshot = temp_dir;
-  const std::size_t root_length = std::strlen(root);
-  Paths pending{dir};
-  int result = 1;
-  while (!pending.empty()) {
-    const std::string current = std::move(pending.back());
-    pending.pop_back();
-    const DirPtr handle = safe_opendir(current.c_str());
-    if (handle == nullptr) {
-      LOGE("error : cannot open this path %s", current.c_str());
-      result = 0;
-      continue;
-    }
-    UniqueFd target;  // made with the first file that is copied into it
-    std::string path = current;
-    while (const dirent *entry = readdir(handle.get())) {
-      if (is_dot_entry(entry->d_name)) continue;
-      const PathStep step(&path, entry->d_name);
-      if (files.is_archive(path) || path.compare(0, snapshot.size(), snapshot) == 0) continue;
-      restore_step("snapshot-entry");
-      struct stat status = {};
-      UniqueFd file;  // what the directory calls a file need not be looked at twice
-      if (entry->d_type == DT_REG)
-        file = safe_open_file_at(dirfd(handle.get()), entry->d_name, &status);
-      const int found =
-          file ? 0 : fstatat(dirfd(handle.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
-      if (found != 0) {
-        LOGE("error : lstat for %d %s", found, path.c_str());
-        continue;
-      }
-      if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode)) {
-        LOGE("this is unexpected type : %s", path.c_str());
-        continue;
-      }
-      int error = QUARN_OK;
-      add_to_file_info_table(table, root, path.c_str(), status, &error, file.get());
-      if (error != QUARN_OK) result = 0;
-      if (S_ISDIR(status.st_mode)) {
-        pending.push_back(path);
-        continue;
-      }
-      // A table that lies in the data would make the snapshot look complete before it is.
-      if (path == files.table) continue;
-      const std::string copy = snapshot + path.substr(root_length);
-      if (!target && create_directory_of_file(copy.c_str())) {
-        std::string name;
-        target = safe_open_parent(copy.c_str(), &name);
-      }
-      if (copy_within(file, status.st_size, target.get(), entry->d_name)) continue;
-      if (!create_directory_of_file(copy.c_str()) || !copy_file(path.c_str(), copy.c_str())) {
-        LOGE("fail copy : from %s to %s", path.c_str(), copy.c_str());
-        result = 0;
-      }
-    }
-  }
-  return result;
-}
-
-int rollback_to_initial_app_data(const char *pkgid, const char *root) {
-  const restore_files files(pkgid, root);
-  if (!is_complete_snapshot(files)) {
-    LOGE("there isn't a snapshot of (%s) to roll back to", pkgid);
-    return QUARN_OK;
-  }
-  restore_step("rollback");
-  const JsonPtr table = read_table(files.snapshot_table);
-  bring_back(files);  // of a rollback that was interrupted
-  set_aside(files);
-  restore_step("rollback-set-aside");
-  clear_app_dir(pkgid, root);
-  restore_step("rollback-cleared");
-  bring_back(files);
-  parse_dir_for_rollback(files.snapshot.c_str(), pkgid, root);
-  restore_app_info(pkgid, root);
-  put_attributes_back(table.get(), root);
-  restore_step("rollback-done");
-  discard_snapshot(pkgid, root);
-  return QUARN_OK;
-}
-
-int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root) {
-  const restore_files files(pkgid, root);
-  const std::string kept = files.snapshot + kKept;
-  Paths pending{dir};
-  int result = 1;
-  while (!pending.empty()) {
-    const std::string current = std::move(pending.back());
-    pending.pop_back();
-    const DirPtr handle = safe_opendir(current.c_str());
-    if (handle == nullptr) {
-      LOGE("error : cannot open this path %s", current.c_str());
-      result = 0;
-      continue;
-    }
-    std::string path = current;
-    while (const dirent *entry = readdir(handle.get())) {
-      if (is_dot_entry(entry->d_name)) continue;
-      const PathStep step(&path, entry->d_name);
-      if (files.is_archive(path) || path == kept) continue;
-      restore_step("rollback-entry");
-      struct stat status = {};
-      const int found = fstatat(dirfd(handle.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
-      if (found != 0) {
-        LOGE("error : lstat for %d %s", found, path.c_str());
-        continue;
-      }
-      if (S_ISDIR(status.st_mode)) {
-        pending.push_back(path);
-      } else if (S_ISREG(status.st_mode)) {
-        const std::string original = root + path.substr(files.snapshot.size());
-        if (!put_file_back(path, original)) {
-          LOGE("fail copy : from %s to %s", path.c_str(), original.c_str());
-          result = 0;
-        }
-      } else {
-        LOGE("this is unexpected type : %s", path.c_str());
-      }
-    }
-  }
-  return result;
-}
-
-bool recover_interrupted_restore(const char *pkgid, const char *root) {
-  const restore_files files(pkgid, root);
-  struct stat status = {};
-  if (safe_lstat(files.snapshot.c_str(), &status) != 0) return false;
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
-  if (is_complete_snapshot(files)) {
-    LOGI("restore of (%s) was interrupted, so its data will be put back", pkgid);
-    rollback_to_initial_app_data(pkgid, root);
-    return true;
-  }
-  // The table is written last: without it the data was not touched, or is whole again.
-  if (S_ISDIR(status.st_mode)) {
-    clear_directory(files.snapshot.c_str(), true);
-  } else {
-    unlink_entry(files.snapshot);
-  }
-  return false;
+  return SnapshotCopy(pkgid, root, temp_dir, table, nullptr).copy(dir) ? 1 : 0;
 }

@@ -9,6 +9,7 @@
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
 namespace {
@@ -29,23 +30,21 @@ bool same_object(const struct stat &a, const struct stat &b) {
   return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
 }
 
-int walk_directory(const walk_context &ctx, const std::string &dir, const struct stat *checked);
-
-/** One directory of the walk; what lies in it follows once its parent is closed. */
+/** A directory of the walk, which follows: its name, and what was looked at. */
 using Found = std::vector<std::pair<std::string, struct stat>>;
 
 /** What an entry is, and a descriptor to change it by; none, with errno, when it is gone. */
-UniqueFd open_entry(int dir, const dirent &entry, struct stat *status) {
+UniqueFd open_entry(int dir, const TreeEntry &entry, struct stat *status) {
   UniqueFd object;
   // The label of a file that is open is read without a walk to it.
-  if (entry.d_type == DT_REG) object = safe_open_file_at(dir, entry.d_name, status);
+  if (entry.type == DT_REG) object = safe_open_file_at(dir, entry.name.c_str(), status);
   if (object) return object;
-  object.reset(openat(dir, entry.d_name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  object.reset(openat(dir, entry.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   if (object && fstat(object.get(), status) != 0) return {};
   return object;
 }
 
-int restore_entry(const walk_context &ctx, int dir, const dirent &entry, const std::string &path,
+int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, const std::string &path,
                   Found *found) {
   struct stat status = {};
   const UniqueFd object = open_entry(dir, entry, &status);
@@ -56,7 +55,7 @@ int restore_entry(const walk_context &ctx, int dir, const dirent &entry, const s
   }
   if (S_ISLNK(status.st_mode)) return 1;
   if (S_ISDIR(status.st_mode)) {
-    found->emplace_back(path, status);
+    found->emplace_back(entry.name, status);
     if (restore_object_info(object.get(), status, path.c_str(), ctx.pkgid, ctx.root, ctx.table)) {
       return 1;
     }
@@ -78,31 +77,58 @@ int restore_entry(const walk_context &ctx, int dir, const dirent &entry, const s
   return 0;
 }
 
-int walk_directory(const walk_context &ctx, const std::string &dir, const struct stat *checked) {
-  int result = 1;
-  Found found;
-  {
-    const DirPtr handle = safe_opendir(dir.c_str());
-    struct stat opened = {};
-    if (handle == nullptr || fstat(dirfd(handle.get()), &opened) != 0 ||
-        (checked != nullptr && !same_object(*checked, opened))) {
-      LOGE("error : cannot open this path %s", dir.c_str());
-      return 0;
-    }
-    std::string path = dir;
-    while (const dirent *entry = readdir(handle.get())) {
-      if (is_dot_entry(entry->d_name)) continue;
-      const PathStep step(&path, entry->d_name);
-      if (ctx.files.is_skipped(path)) continue;
-      restore_step("attributes");
-      if (!restore_entry(ctx, dirfd(handle.get()), *entry, path, &found)) result = 0;
-    }
-  }
-  // One descriptor at a time, however deep the tree is.
-  for (const auto &[path, status] : found) {
-    if (!walk_directory(ctx, path, &status)) result = 0;
+/** One directory: everything in it but what lies deeper. @return 1, or 0 when anything failed */
+int restore_folder(const walk_context &ctx, int dir, std::string *path, Found *found) {
+  std::vector<TreeEntry> entries;
+  int result = list_tree_entries(dir, &entries) ? 1 : 0;
+  for (const TreeEntry &entry : entries) {
+    const PathStep step(path, entry.name.c_str());
+    if (ctx.files.is_skipped(*path)) continue;
+    restore_step("attributes");
+    if (!restore_entry(ctx, dir, entry, *path, found)) result = 0;
   }
   return result;
+}
+
+/** Go into a directory that was looked at; not into another that was put in its place. */
+bool enter_checked(TreePlace *place, const std::string &name, const struct stat &checked) {
+  struct stat opened = {};
+  if (!place->down(name.c_str())) return false;
+  if (fstat(place->fd(), &opened) == 0 && same_object(checked, opened)) return true;
+  static_cast<void>(place->up());
+  return false;
+}
+
+int walk_directory(const walk_context &ctx, const std::string &dir) {
+  TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+  if (!place) {
+    LOGE("error : cannot open this path %s", dir.c_str());
+    return 0;
+  }
+  std::string path = dir;
+  std::vector<Found> pending(1);
+  int result = restore_folder(ctx, place.fd(), &path, &pending.back());
+  while (true) {
+    if (pending.back().empty()) {
+      pending.pop_back();
+      if (pending.empty()) return result;
+      if (!place.up()) return 0;
+      path.resize(path.rfind('/'));
+      continue;
+    }
+    const auto [name, status] = std::move(pending.back().back());
+    pending.back().pop_back();
+    const std::size_t length = path.size();
+    path += "/" + name;
+    if (enter_checked(&place, name, status)) {
+      pending.emplace_back();
+      if (!restore_folder(ctx, place.fd(), &path, &pending.back())) result = 0;
+    } else {
+      LOGE("error : cannot open this path %s", path.c_str());
+      result = 0;
+      path.resize(length);
+    }
+  }
 }
 
 /** Read the table and remove its file; null with the reason logged. */
@@ -257,7 +283,7 @@ int restore_app_info(const char *pkgid, const char *root) {
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table) {
   const walk_context ctx{pkgid, root, table, restore_files(pkgid, root)};
-  return walk_directory(ctx, dir, nullptr);
+  return walk_directory(ctx, dir);
 }
 
 int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table) {

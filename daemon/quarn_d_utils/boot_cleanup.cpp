@@ -2,37 +2,16 @@
 
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kSharedDataDir[] = "/shared/data/";
-constexpr const char *kArchiveSuffixes[] = {"_upload.zip", "_download.zip"};
-
 void (*boot_recovery)() = nullptr;
-
-timespec file_clock_now() {
-  timespec now{};
-  clock_gettime(CLOCK_REALTIME_COARSE, &now);
-  return now;
-}
-
-// The sweep runs beside the main thread, where a request may already have
-// staged or downloaded an archive of its own.
-bool left_by_an_earlier_process(const char *path) {
-  struct stat status {};
-  if (safe_lstat(path, &status) != 0) return false;
-  const timespec &changed = status.st_ctim;
-  return changed.tv_sec < quarn_process_start.tv_sec ||
-         (changed.tv_sec == quarn_process_start.tv_sec &&
-          changed.tv_nsec < quarn_process_start.tv_nsec);
-}
 
 }  // namespace
 
 std::atomic<bool> boot_cleanup_done{false};
-timespec quarn_process_start = file_clock_now();
 
 bool boot_foreach_package_info_callback(package_info_h info, void *) {
   bool preload = false;
@@ -64,12 +43,7 @@ bool boot_foreach_package_info_callback(package_info_h info, void *) {
     return true;
   }
 
-  for (const char *suffix : kArchiveSuffixes) {
-    const std::string archive = std::string(root.get()) + kSharedDataDir + pkg_id.get() + suffix;
-    if (file_exist(archive.c_str()) && left_by_an_earlier_process(archive.c_str())) {
-      delete_file(archive.c_str());
-    }
-  }
+  sweep_working_files(pkg_id.get(), root.get());
   return true;
 }
 

@@ -11,6 +11,7 @@
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
 namespace {
@@ -55,30 +56,51 @@ bool write_all(int fd, const void *data, std::size_t size) {
   return true;
 }
 
-bool search_for_files(DirPtr dir, std::string *path, int depth) {
+/** Looks through one directory of a search; the folders in it follow. */
+bool search_folder(int dir, const std::string &path, std::vector<std::string> *folders) {
   bool found = false;
-  while (const dirent *entry = readdir(dir.get())) {
-    if (is_dot_entry(entry->d_name)) continue;
-    const PathStep step(path, entry->d_name);
+  std::vector<TreeEntry> entries;
+  list_tree_entries(dir, &entries);
+  for (TreeEntry &entry : entries) {
+    const std::string below = path + "/" + entry.name;
     struct stat status = {};
-    const int result = fstatat(dirfd(dir.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
+    const int result = fstatat(dir, entry.name.c_str(), &status, AT_SYMLINK_NOFOLLOW);
     if (result != 0) {
-      LOGE("error : lstat for %d %s", result, path->c_str());
+      LOGE("error : lstat for %d %s", result, below.c_str());
     } else if (S_ISDIR(status.st_mode)) {
-      DirPtr child;
-      if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), entry->d_name);
-      if (child == nullptr) {
-        LOGE("error : cannot open this path %s", path->c_str());
-      } else if (search_for_files(std::move(child), path, depth + 1)) {
-        found = true;
-      }
+      folders->push_back(std::move(entry.name));
     } else if (S_ISREG(status.st_mode)) {
       found = true;
     } else {
-      LOGE("this is unexpected type : %s", path->c_str());
+      LOGE("this is unexpected type : %s", below.c_str());
     }
   }
   return found;
+}
+
+/** True when a regular file lies anywhere below the open directory, whose path is @p path. */
+bool search_for_files(UniqueFd dir, std::string path) {
+  TreePlace place(std::move(dir));
+  std::vector<std::vector<std::string>> pending(1);
+  bool found = search_folder(place.fd(), path, &pending.back());
+  while (true) {
+    if (pending.back().empty()) {
+      pending.pop_back();
+      if (pending.empty() || !place.up()) return found;
+      path.resize(path.rfind('/'));
+      continue;
+    }
+    const std::string name = std::move(pending.back().back());
+    pending.back().pop_back();
+    const std::string below = path + "/" + name;
+    if (!place.down(name.c_str())) {
+      LOGE("error : cannot open this path %s", below.c_str());
+      continue;
+    }
+    path = below;
+    pending.emplace_back();
+    if (search_folder(place.fd(), path, &pending.back())) found = true;
+  }
 }
 
 bool is_regular_at(int dir, const char *name) {
@@ -102,53 +124,6 @@ bool delete_file_at(int dir, const char *name) {
   return true;
 }
 
-bool delete_directory_at(int parent, const char *name, std::string *path, int depth);
-
-/** Delete everything in @p dir, whose path is @p path. */
-bool delete_children(DIR *dir, std::string *path, int depth) {
-  bool deleted = true;
-  while (const dirent *entry = readdir(dir)) {
-    if (is_dot_entry(entry->d_name)) continue;
-    const PathStep step(path, entry->d_name);
-    struct stat status = {};
-    const bool is_dir = fstatat(dirfd(dir), entry->d_name, &status, AT_SYMLINK_NOFOLLOW) == 0 &&
-                        S_ISDIR(status.st_mode);
-    if (is_dir) {
-      if (!delete_directory_at(dirfd(dir), entry->d_name, path, depth + 1)) {
-        LOGE("fail to delete dir : %s", path->c_str());
-        deleted = false;
-      }
-    } else if (!delete_file_at(dirfd(dir), entry->d_name)) {
-      LOGE("fail to delete file : %s", path->c_str());
-      deleted = false;
-    }
-  }
-  return deleted;
-}
-
-bool delete_directory_at(int parent, const char *name, std::string *path, int depth) {
-  DirPtr dir;
-  if (depth < kMaxDirDepth) {
-    dir = safe_opendir_at(parent, name);
-  } else {
-    errno = EMFILE;
-  }
-  if (dir == nullptr) {
-    const GErrorPtr error(g_error_new(G_FILE_ERROR, g_file_error_from_errno(errno),
-                                      "Error opening directory “%s”: %s", path->c_str(),
-                                      g_strerror(errno)));
-    LOGE("directory open failed, err = [%s]", error->message);
-    return false;
-  }
-  bool deleted = delete_children(dir.get(), path, depth);
-  dir.reset();
-  if (unlinkat(parent, name, AT_REMOVEDIR) == -1) {
-    LOGE("Directory delete was failed");
-    deleted = false;
-  }
-  return deleted;
-}
-
 /** Empty a directory but for the entry whose full path is @p keep (null: nothing is kept). */
 bool empty_directory(const char *path_text, const char *keep) {
   const DirPtr dir = safe_opendir(path_text);
@@ -167,7 +142,7 @@ bool empty_directory(const char *path_text, const char *keep) {
     if (result != 0) {
       LOGE("error : lstat for %d %s", result, path.c_str());
     } else if (S_ISDIR(status.st_mode)) {
-      if (!delete_directory_at(dirfd(dir.get()), entry->d_name, &path, 1)) {
+      if (!delete_tree_at(dirfd(dir.get()), entry->d_name, path)) {
         LOGE("fail to delete dir : %s", path.c_str());
         emptied = false;
       }
@@ -261,13 +236,12 @@ bool is_directory(const char *path) {
 }
 
 bool file_exist_in_directory(const char *dir_path) {
-  DirPtr dir = safe_opendir(dir_path);
-  if (dir == nullptr) {
+  UniqueFd dir = safe_open(dir_path, O_RDONLY | O_DIRECTORY | O_NONBLOCK);
+  if (!dir) {
     LOGE("error : cannot open this path %s", dir_path);
     return false;
   }
-  std::string path = dir_path;
-  return search_for_files(std::move(dir), &path, 1);
+  return search_for_files(std::move(dir), dir_path);
 }
 
 bool is_empty_directory(const char *dir) { return !file_exist_in_directory(dir); }
@@ -368,8 +342,7 @@ bool delete_directory_util(const char *dir_path) {
     LOGE("directory_path is not directory");
     return false;
   }
-  std::string path = dir_path;
-  return delete_directory_at(parent.get(), name.c_str(), &path, 0);
+  return delete_tree_at(parent.get(), name.c_str(), dir_path);
 }
 
 bool clear_directory(const char *dir, bool remove_directory) {

@@ -225,7 +225,8 @@ UniqueFd safe_open_below(int dir, const char *path, int flags, mode_t mode) {
   if (!is_plain_relative(path)) return fail(EINVAL);
   if (!openat2_missing) {
     UniqueFd fd(open_without_links(dir, path, flags, mode, RESOLVE_BENEATH));
-    if (fd || !no_openat2(errno)) return fd;
+    // a path may be longer than the kernel takes at once
+    if (fd || (errno != ENAMETOOLONG && !no_openat2(errno))) return fd;
   }
   std::string name;
   const UniqueFd parent = walk_below(dir, path, Missing::kFails, 0, &name);

@@ -1,30 +1,71 @@
 /**
  * @file working_files.h
- * @brief The daemon's own files among a package's data: never archived, never unpacked.
+ * @brief Every file that the daemon makes among a package's data, in one place.
+ *
+ * They are never archived, unpacked, copied or counted, and one that an ended
+ * process has left is removed. Those with a fixed name are known by it; the
+ * transport's, with a name of its own making, by name and owner: an application
+ * cannot make a file that is root's. Any thread.
  */
 #ifndef QUARN_D_UTILS_WORKING_FILES_H
 #define QUARN_D_UTILS_WORKING_FILES_H
 
+#include <sys/stat.h>
+
 #include <string>
+
+/**
+ * True for what the transport makes beside a download where the file system
+ * has no nameless files.
+ * @param status of the file, as lstat() tells it
+ */
+bool is_own_leftover(const char *name, const struct stat &status);
+/** The same for whatever lies at @p path; costs nothing for another name. */
+bool is_own_leftover(const std::string &path);
 
 /** Their paths for one package below one root. */
 class WorkingFiles {
  public:
   WorkingFiles(const std::string &pkg_id, const std::string &root)
-      : upload_(root + "/shared/data/" + pkg_id + "_upload.zip"),
-        download_(root + "/shared/data/" + pkg_id + "_download.zip"),
-        snapshot_(root + "/shared/data/quarn_tmp_rst_dir") {}
+      : folder_(root + "/shared/data"),
+        upload_(folder_ + "/" + pkg_id + "_upload.zip"),
+        download_(folder_ + "/" + pkg_id + "_download.zip"),
+        table_(folder_ + "/" + pkg_id + ".perm"),
+        snapshot_(folder_ + "/quarn_tmp_rst_dir") {}
 
-  /** True for both archives, and for every path that begins with the snapshot's. */
+  const std::string &folder() const { return folder_; } /**< where all of them lie */
+  const std::string &upload() const { return upload_; }
+  const std::string &download() const { return download_; }
+  /** The table on its way into an archive or out of one; the application's own may have the name.
+   */
+  const std::string &table() const { return table_; }
+
+  /**
+   * True for both archives, for every path that begins with the snapshot's,
+   * and for the transport's files.
+   */
   bool contain(const std::string &path) const {
     return path.compare(0, snapshot_.size(), snapshot_) == 0 || path == upload_ ||
-           path == download_;
+           path == download_ || is_own_leftover(path);
   }
 
  private:
+  std::string folder_;
   std::string upload_;
   std::string download_;
+  std::string table_;
   std::string snapshot_;
 };
+
+/** From now on @p path is this process's own: its sweep leaves it alone. */
+void claim_working_file(const std::string &path);
+
+/**
+ * Remove what an ended process has left of a package: archives in transit, a
+ * table, parts of downloads. What the application owns stays, whatever its
+ * name. No clock is asked: what this process uses it has claimed, and a
+ * transfer that lives holds a lock on its file. Takes package_data_mutex.
+ */
+void sweep_working_files(const std::string &pkg_id, const std::string &root);
 
 #endif

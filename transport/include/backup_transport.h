@@ -54,6 +54,13 @@ extern "C" {
 #define BACKUP_TRANS_MAX_LIST_COUNT 100
 
 /**
+ * How the temporary files begin that a download makes beside its target on a
+ * file system without nameless files. While its transfer lives it is locked
+ * with flock(); one that is not was left by a process that has ended.
+ */
+#define BACKUP_TRANS_TEMPORARY_PREFIX ".quarn-part-"
+
+/**
  * Results. 12 is part of the device's established interface; the others were
  * chosen beside it and do not change.
  */

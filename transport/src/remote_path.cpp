@@ -6,10 +6,12 @@
 #include <array>
 #include <cstring>
 
+#include "backup_transport.h"
+
 namespace transport {
 namespace {
 
-constexpr std::string_view kTemporaryPrefix = ".quarn-part-";
+constexpr std::string_view kTemporaryPrefix = BACKUP_TRANS_TEMPORARY_PREFIX;
 constexpr std::size_t kTemporaryRandomBytes = 12;
 constexpr std::size_t kHexPerByte = 2;
 constexpr char kHexDigits[] = "0123456789abcdef";

@@ -1,7 +1,9 @@
 #include "quarn_d_utils/boot_cleanup.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -13,7 +15,9 @@
 
 #include "log_capture.h"
 #include "mock_platform.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/working_files.h"
 
 namespace {
 
@@ -37,7 +41,6 @@ class BootCleanupTest : public ::testing::Test {
     shared = root / "shared/data";
     fs::create_directories(shared);
     boot_cleanup_done = false;
-    set_process_start_after_files();
     clear_captured_log();
     ON_CALL(platform, package_info_get_package).WillByDefault([](package_info_h, char **id) {
       *id = strdup(kPkgId);
@@ -54,16 +57,7 @@ class BootCleanupTest : public ::testing::Test {
           return PACKAGE_MANAGER_ERROR_NONE;
         });
   }
-  ~BootCleanupTest() override {
-    quarn_process_start = real_process_start;
-    fs::remove_all(root);
-  }
-
-  /** Whatever the test makes was there before the process. */
-  static void set_process_start_after_files() {
-    clock_gettime(CLOCK_REALTIME, &quarn_process_start);
-    quarn_process_start.tv_sec += 3600;
-  }
+  ~BootCleanupTest() override { fs::remove_all(root); }
 
   fs::path make_file(const fs::path &path) {
     std::ofstream(path) << "left behind";
@@ -83,7 +77,6 @@ class BootCleanupTest : public ::testing::Test {
   }
 
   NiceMock<MockPlatform> platform;
-  const timespec real_process_start = quarn_process_start;
   fs::path root;
   fs::path shared;
 };
@@ -135,13 +128,53 @@ TEST_F(BootCleanupTest, AFailedWalkIsLoggedAndNotRepeated) {
   boot_cleanup_backup_items();
 }
 
-TEST_F(BootCleanupTest, AnArchiveOfThisProcessIsLeftAlone) {
-  quarn_process_start = real_process_start;
-  make_file(upload());
+TEST_F(BootCleanupTest, AnArchiveThatThisProcessUsesIsLeftAlone) {
+  claim_working_file(make_file(upload()));
   make_file(download());
   boot_cleanup_backup_items();
   EXPECT_TRUE(fs::exists(upload()));
-  EXPECT_TRUE(fs::exists(download()));
+  EXPECT_FALSE(fs::exists(download()));
+}
+
+TEST_F(BootCleanupTest, TheClockIsNotAsked) {
+  // A device without a clock of its own boots in the past: what was left lies in the future.
+  make_file(upload());
+  make_file(download());
+  const timespec later[2] = {{4000000000, 0}, {4000000000, 0}};
+  ASSERT_EQ(utimensat(AT_FDCWD, upload().c_str(), later, 0), 0);
+  ASSERT_EQ(utimensat(AT_FDCWD, download().c_str(), later, 0), 0);
+  boot_cleanup_backup_items();
+  EXPECT_FALSE(fs::exists(upload()));
+  EXPECT_FALSE(fs::exists(download()));
+}
+
+TEST_F(BootCleanupTest, AnApplicationsOwnFileIsNotDeletedForItsName) {
+  const fs::path named[] = {make_file(upload()), make_file(download()),
+                            make_file(shared / ".quarn-part-0123456789abcdef01234567"),
+                            make_file(shared / (std::string(kPkgId) + ".perm"))};
+  for (const fs::path &path : named) {
+    ASSERT_EQ(chmod(path.c_str(), 0600), 0);
+    ASSERT_EQ(chown(path.c_str(), kAppUid, kAppGid), 0);
+  }
+  boot_cleanup_backup_items();
+  for (const fs::path &path : named) EXPECT_TRUE(fs::exists(path)) << path;
+}
+
+TEST_F(BootCleanupTest, APartOfADownloadIsDeletedOnceNoTransferHoldsIt) {
+  const fs::path left = make_file(shared / ".quarn-part-0123456789abcdef01234567");
+  const fs::path held = make_file(shared / ".quarn-part-1123456789abcdef01234567");
+  const UniqueFd transfer(open(held.c_str(), O_RDONLY));
+  ASSERT_EQ(flock(transfer.get(), LOCK_EX), 0);
+  boot_cleanup_backup_items();
+  EXPECT_FALSE(fs::exists(left));
+  EXPECT_TRUE(fs::exists(held));
+}
+
+TEST_F(BootCleanupTest, ATableOfTheDaemonsOwnIsDeleted) {
+  const fs::path table = make_file(shared / (std::string(kPkgId) + ".perm"));
+  ASSERT_EQ(chmod(table.c_str(), 0600), 0);
+  boot_cleanup_backup_items();
+  EXPECT_FALSE(fs::exists(table));
 }
 
 TEST_F(BootCleanupTest, APreloadedPackagesArchiveIsNotDeleted) {

@@ -1,6 +1,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/statfs.h>
 #include <zlib.h>
 
@@ -113,19 +114,45 @@ TEST_F(Files, TheSearchGoesOnAfterAFileAndAfterFailures) {
   EXPECT_EQ(errors("error : cannot open this path " + dir_ / "top/sub"), 1);
 }
 
-TEST_F(Files, ATreeWithoutEndIsNotSearchedToItsEnd) {
-  int at = open(dir_.path().c_str(), O_PATH | O_DIRECTORY);
-  for (int level = 0; level < 420; ++level) {
+/** Folders one in the other below @p path, and a file in the last of them. */
+void make_deep_tree(const std::string &path, int levels) {
+  int at = open(path.c_str(), O_PATH | O_DIRECTORY);
+  for (int level = 0; level < levels; ++level) {
     ASSERT_EQ(mkdirat(at, "d", 0755), 0);
     const int next = openat(at, "d", O_PATH | O_DIRECTORY);
     close(at);
     at = next;
   }
+  close(openat(at, "file", O_WRONLY | O_CREAT, 0600));
   close(at);
-  EXPECT_FALSE(file_exist_in_directory(dir_.path().c_str()));
-  EXPECT_FALSE(delete_directory_util((dir_ / "d").c_str()));
-  const auto texts = captured_texts();
-  EXPECT_EQ(texts.front().rfind("error : cannot open this path ", 0), 0U);
+}
+
+TEST_F(Files, ATreeIsSearchedHoweverDeepItIs) {
+  make_deep_tree(dir_.path(), 2000);
+  EXPECT_TRUE(file_exist_in_directory(dir_.path().c_str()));
+  EXPECT_TRUE(captured_texts().empty());
+  EXPECT_TRUE(delete_directory_util((dir_ / "d").c_str()));
+}
+
+TEST_F(Files, ATreeIsDeletedHoweverDeepItIs) {
+  make_deep_tree(dir_.path(), 30000);
+  EXPECT_TRUE(delete_directory_util((dir_ / "d").c_str()));
+  EXPECT_FALSE(exists(dir_ / "d"));
+  make_deep_tree(dir_.path(), 2000);
+  EXPECT_TRUE(clear_directory(dir_.path().c_str(), false));
+  EXPECT_FALSE(exists(dir_ / "d"));
+  EXPECT_TRUE(captured_texts().empty());
+}
+
+TEST_F(Files, ADeepTreeIsDeletedWithFewDescriptors) {
+  make_deep_tree(dir_.path(), 1000);
+  rlimit before = {};
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit few = {32, before.rlim_max};
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &few), 0);
+  EXPECT_TRUE(delete_directory_util((dir_ / "d").c_str()));
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_FALSE(exists(dir_ / "d"));
 }
 
 /* ---- size, content, checksum ------------------------------------------------ */

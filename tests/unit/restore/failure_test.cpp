@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <filesystem>
 #include <fstream>
 
@@ -11,21 +12,19 @@
 using ::testing::Return;
 
 extern "C" {
-int __real_syncfs(int fd);
-int __wrap_syncfs(int fd);
+int __real_fsync(int fd);
+int __wrap_fsync(int fd);
 }
 
 namespace {
 
-/** Calls of syncfs() that still succeed, and those after them that fail. */
-int flushes_until_failure = -1;
-int failing_flushes = 0;
+/** The disk takes nothing while this is set. */
+std::atomic<bool> disk_fails{false};
 
 }  // namespace
 
-int __wrap_syncfs(int fd) {
-  if (flushes_until_failure < 0 || flushes_until_failure-- > 0) return __real_syncfs(fd);
-  if (--failing_flushes > 0) flushes_until_failure = 0;
+int __wrap_fsync(int fd) {
+  if (!disk_fails) return __real_fsync(fd);
   errno = EIO;
   return -1;
 }
@@ -158,8 +157,8 @@ TEST_F(FailureTest, UnpackOntoAFullDisk) {
 }
 
 TEST_F(FailureTest, DiskThatDoesNotTakeWhatWasRestored) {
-  flushes_until_failure = 1;  // the snapshot's own
-  failing_flushes = 1;
+  const AtStep fails("restored", [] { disk_fails = true; });
+  const AtStep works("rollback", [] { disk_fails = false; });
   EXPECT_EQ(restore(), 36);
   expect_error("data of (org.example.notes) is not on the disk, so its snapshot is kept");
   expect_error("fail to restore for (org.example.notes)");
@@ -167,10 +166,19 @@ TEST_F(FailureTest, DiskThatDoesNotTakeWhatWasRestored) {
 }
 
 TEST_F(FailureTest, DiskThatTakesNothingAnyMoreLeavesTheSnapshotToTheNextDaemon) {
-  flushes_until_failure = 1;
-  failing_flushes = 2;
+  const AtStep fails("restored", [] { disk_fails = true; });
   EXPECT_EQ(restore(), 36);
+  disk_fails = false;
+  EXPECT_TRUE(exists(snapshot()));
   EXPECT_TRUE(recover_interrupted_restore(kPkg, root.c_str()));
+  expect_untouched();
+}
+
+TEST_F(FailureTest, DiskThatDoesNotTakeTheSnapshot) {
+  const AtStep fails("snapshot-copied", [] { disk_fails = true; });
+  EXPECT_EQ(restore(), 36);
+  disk_fails = false;
+  expect_error("fail to make backup for (org.example.notes) before restore. err : 36");
   expect_untouched();
 }
 
@@ -222,19 +230,18 @@ TEST_F(FailureTest, SecurityServerThatRefusesAtEachStep) {
   const struct {
     int *result;
     std::string message;
-    int times;  // again in the rollback
   } cases[] = {
-      {&begin_result, "fail : security_server_perm_begin...(err=-2)", 2},
-      {&setup_result, "error : security_server_perm_app_setup_path " + at("data") + " (err=-2)", 2},
-      {&commit_result, "fail : security_server_perm_commit...(err=-2)", 2},
-      {&label_result, "fail : security_server_label_access...(err=-2)", 2},
+      {&begin_result, "fail : security_server_perm_begin...(err=-2)"},
+      {&setup_result, "error : security_server_perm_app_setup_path " + at("data") + " (err=-2)"},
+      {&commit_result, "fail : security_server_perm_commit...(err=-2)"},
+      {&label_result, "fail : security_server_label_access...(err=-2)"},
   };
   for (const auto &one : cases) {
     clear_captured_log();
     *one.result = -2;
     EXPECT_EQ(restore(), 36) << one.message;
     *one.result = 0;
-    expect_error(one.message, one.times);
+    expect_error(one.message);
     expect_error("fail to restore for (org.example.notes)");
     expect_untouched();
     EXPECT_EQ(transactions, 0);

@@ -1,0 +1,24 @@
+/**
+ * @file recovery.h
+ * @brief What an ended daemon, or a device that lost power, has left half done.
+ */
+#ifndef QUARN_D_RESTORE_RECOVERY_H
+#define QUARN_D_RESTORE_RECOVERY_H
+
+enum class recovery_result {
+  nothing,  /**< no restore was interrupted */
+  put_back, /**< the data is what it was before the restore */
+  told,     /**< the application has gone on with its data, which stays; the snapshot is kept */
+  kept      /**< not all could be put back yet: the snapshot still counts */
+};
+/** Mend one package. The caller holds package_data_mutex. */
+recovery_result recover_package_data(const char *pkgid, const char *root);
+
+/**
+ * Everything for every installed package: interrupted restores, working files,
+ * icons that were hidden. For a process that does nothing else, or before
+ * anything else; needs neither account nor bus. Takes package_data_mutex.
+ */
+void recover_device();
+
+#endif

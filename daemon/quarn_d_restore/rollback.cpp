@@ -1,0 +1,415 @@
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <utility>
+
+#include "platform_security_server.h"
+#include "platform_smack.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr mode_t kPermissionBits = 07777;
+constexpr mode_t kCopyMode = 0600;
+constexpr mode_t kFolderMode = 0755;
+constexpr std::size_t kCopyChunk = 64 << 10;
+/** Where an earlier release set aside what no snapshot holds. */
+constexpr char kKept[] = "/kept";
+
+JsonPtr read_table(const std::string &path) {
+  char *raw = nullptr;
+  const bool read = read_data_from_file(path.c_str(), &raw);
+  const CString text(raw);
+  return JsonPtr(read ? parse_file_info_table(text.get()) : nullptr);
+}
+
+json_object *entry_of(json_object *table, const std::string &key) {
+  json_object *entry = nullptr;
+  const bool found = json_object_object_get_ex(table, key.c_str(), &entry) != 0;
+  return found && json_object_is_type(entry, json_type_object) ? entry : nullptr;
+}
+
+/* ---- attributes ---------------------------------------------------------- */
+
+void put_label_back(int fd, const char *label, const char *key) {
+  if (label == nullptr || label[0] == '\0') return;
+  CString current;
+  // By way of this process's own descriptors reading costs no walk.
+  if (smack_getlabel(own_fd_path(fd).c_str(), out(current), SMACK_LABEL_ACCESS) == 0 &&
+      current != nullptr && std::strcmp(current.get(), label) == 0) {
+    return;
+  }
+  const std::string path = fd_path(fd);
+  if (security_server_label_access(path.c_str(), label) != SECURITY_SERVER_SUCCESS &&
+      smack_setlabel(path.c_str(), label, SMACK_LABEL_ACCESS) != 0) {
+    LOGE("fail to put label of %s back", key);
+  }
+}
+
+/**
+ * Make an open object what the snapshot's table says. The table is this
+ * device's own, so unlike a restore it may put back any owner, mode and label.
+ */
+void put_attributes_back(int fd, const struct stat &before, const char *key, json_object *entry) {
+  json_object *values[4] = {};
+  const char *const keys[4] = {"0", "1", "2", "3"};
+  for (int i = 0; i < 4; ++i) {
+    if (!json_object_object_get_ex(entry, keys[i], &values[i])) return;
+  }
+  const auto uid = static_cast<uid_t>(json_object_get_int64(values[1]));
+  const auto gid = static_cast<gid_t>(json_object_get_int64(values[2]));
+  const mode_t mode = static_cast<mode_t>(json_object_get_int(values[0])) & kPermissionBits;
+  struct stat status = before;
+  if (status.st_uid != uid || status.st_gid != gid) {
+    // A change of owner clears the bits that run a file as somebody.
+    if (change_object_owner(fd, uid, gid) < 0) LOGE("chown: error \n");
+    if (fstat(fd, &status) != 0) return;
+  }
+  if ((status.st_mode & kPermissionBits) != mode && change_object_mode(fd, status, mode) < 0) {
+    LOGE("chmod failed");
+  }
+  put_label_back(fd, json_object_get_string(values[3]), key);
+}
+
+enum class Objects { kAll, kDirectories };
+
+/**
+ * The attributes of what the table has below the directory @p top. Files get
+ * theirs in the snapshot, where the application cannot put another file in
+ * their place; what is not there stays away.
+ */
+void put_all_attributes_back(json_object *table, const std::string &top, Objects objects) {
+  const UniqueFd dir = safe_open(top.c_str(), O_PATH | O_DIRECTORY);
+  if (!dir) return;
+  const int flags = O_PATH | O_NOFOLLOW | (objects == Objects::kDirectories ? O_DIRECTORY : 0);
+  json_object_object_foreach(table, key, entry) {
+    restore_step("rollback-attributes");
+    if (!json_object_is_type(entry, json_type_object)) continue;
+    const UniqueFd object = safe_open_below(dir.get(), key, flags);
+    struct stat status = {};
+    if (!object || fstat(object.get(), &status) != 0) continue;
+    if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode)) continue;
+    put_attributes_back(object.get(), status, key, entry);
+  }
+}
+
+/* ---- what the snapshot does not hold ------------------------------------- */
+
+/** Empties the data directories of everything that the snapshot will not replace. */
+class Clearing {
+ public:
+  Clearing(const restore_files &files, const std::string &root, json_object *table)
+      : files_(files), root_(root), table_(table) {}
+
+  /** @return true when no file is left that there was not */
+  bool run() {
+    LOGI("clearing app data backup directory");
+    for (const auto &dir : files_.dirs) clear(dir);
+    return cleared_;
+  }
+
+ private:
+  void clear(const std::string &dir) {
+    TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    if (!place) {
+      LOGE("error : cannot open this path %s", dir.c_str());
+      return;
+    }
+    path_ = dir;
+    std::vector<std::vector<std::string>> pending;
+    pending.push_back(clear_folder(place.fd()));
+    while (true) {
+      if (pending.back().empty()) {
+        pending.pop_back();
+        if (pending.empty() || !place.up()) return;
+        const std::string name = path_.substr(path_.rfind('/') + 1);
+        path_.resize(path_.rfind('/'));
+        // One that is empty now is not made again, and comes back with what it held.
+        static_cast<void>(unlinkat(place.fd(), name.c_str(), AT_REMOVEDIR));
+        continue;
+      }
+      const std::string name = std::move(pending.back().back());
+      pending.back().pop_back();
+      const std::size_t length = path_.size();
+      path_ += "/" + name;
+      if (place.down(name.c_str())) {
+        pending.push_back(clear_folder(place.fd()));
+        continue;
+      }
+      LOGE("error : cannot open this path %s", path_.c_str());
+      path_.resize(length);
+    }
+  }
+
+  /** One directory. @return the directories in it that the snapshot knows */
+  std::vector<std::string> clear_folder(int dir) {
+    std::vector<TreeEntry> entries;
+    std::vector<std::string> folders;
+    list_tree_entries(dir, &entries);
+    for (TreeEntry &entry : entries) {
+      const PathStep step(&path_, entry.name.c_str());
+      if (files_.is_skipped(path_)) continue;
+      restore_step("rollback-clear");
+      const char *name = entry.name.c_str();
+      struct stat status = {};
+      const int found = fstatat(dir, name, &status, AT_SYMLINK_NOFOLLOW);
+      if (found != 0) {
+        LOGE("error : lstat for %d %s", found, path_.c_str());
+      } else if (S_ISDIR(status.st_mode)) {
+        if (is_known()) {
+          folders.push_back(std::move(entry.name));
+        } else {
+          clear_unknown_folder(dir, name);
+        }
+      } else if (!S_ISREG(status.st_mode)) {
+        LOGE("this is unexpected type : %s", path_.c_str());
+      } else if (!is_known() && unlinkat(dir, name, 0) != 0) {
+        LOGE("fail to delete file : %s", path_.c_str());
+        cleared_ = false;
+      }
+    }
+    return folders;
+  }
+
+  void clear_unknown_folder(int dir, const char *name) {
+    if (delete_tree_at(dir, name, path_)) return;
+    LOGE("fail to delete dir : %s", path_.c_str());
+    // What is refused, a link, is not the archive's.
+    if (!is_empty_directory(path_.c_str())) cleared_ = false;
+  }
+
+  bool is_known() const {
+    return path_ != files_.table && entry_of(table_, path_.substr(root_.size() + 1)) != nullptr;
+  }
+
+  const restore_files &files_;
+  const std::string &root_;
+  json_object *table_;
+  std::string path_;
+  bool cleared_ = true;
+};
+
+/* ---- moving the snapshot's files back ------------------------------------ */
+
+/** Moves what lies in the snapshot to its place; a name is replaced, so nothing needs space. */
+class MovingBack {
+ public:
+  MovingBack(const restore_files &files, std::string root, json_object *table)
+      : files_(files), root_(std::move(root)), table_(table), own_{files.snapshot + kKept,
+                                                                   files.unfinished_table,
+                                                                   files.stamps,
+                                                                   files.unpacked,
+                                                                   files.told,
+                                                                   files.snapshot_table} {}
+
+  /** @return true when everything below @p dir, in the snapshot, is in its place */
+  bool run(const std::string &dir) {
+    TreePlace source(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    if (!source) {
+      LOGE("error : cannot open this path %s", dir.c_str());
+      return false;
+    }
+    path_ = dir;
+    const std::string original = target_path();
+    TreePlace target(safe_open(original.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    if (!target) {
+      LOGE("error : cannot open this path %s", original.c_str());
+      return false;
+    }
+    std::vector<std::vector<std::string>> pending;
+    pending.push_back(move_folder(source.fd(), target.fd()));
+    while (true) {
+      if (pending.back().empty()) {
+        pending.pop_back();
+        if (pending.empty()) return moved_;
+        if (!source.up() || !target.up()) return false;
+        const std::string name = path_.substr(path_.rfind('/') + 1);
+        path_.resize(path_.rfind('/'));
+        static_cast<void>(unlinkat(source.fd(), name.c_str(), AT_REMOVEDIR));
+        continue;
+      }
+      const std::string name = std::move(pending.back().back());
+      pending.back().pop_back();
+      const std::size_t length = path_.size();
+      path_ += "/" + name;
+      if (move_whole(source.fd(), target.fd(), name.c_str())) {
+        path_.resize(length);
+      } else if (enter(&source, &target, name.c_str())) {
+        pending.push_back(move_folder(source.fd(), target.fd()));
+      } else {
+        failed();
+        path_.resize(length);
+      }
+    }
+  }
+
+ private:
+  std::string target_path() const {
+    return path_.size() > files_.snapshot.size() ? root_ + path_.substr(files_.snapshot.size())
+                                                 : root_;
+  }
+
+  void failed() {
+    LOGE("fail copy : from %s to %s", path_.c_str(), target_path().c_str());
+    moved_ = false;
+  }
+
+  bool is_own() const {
+    for (const auto &path : own_) {
+      if (path_ == path) return true;
+    }
+    return files_.is_archive(path_);
+  }
+
+  /** The files of one directory. @return the directories in it */
+  std::vector<std::string> move_folder(int from, int to) {
+    std::vector<TreeEntry> entries;
+    std::vector<std::string> folders;
+    if (!list_tree_entries(from, &entries)) moved_ = false;
+    for (TreeEntry &entry : entries) {
+      const PathStep step(&path_, entry.name.c_str());
+      if (is_own()) continue;
+      restore_step("rollback-entry");
+      struct stat status = {};
+      const int found = fstatat(from, entry.name.c_str(), &status, AT_SYMLINK_NOFOLLOW);
+      if (found != 0) {
+        LOGE("error : lstat for %d %s", found, path_.c_str());
+      } else if (S_ISDIR(status.st_mode)) {
+        folders.push_back(std::move(entry.name));
+      } else if (!S_ISREG(status.st_mode)) {
+        LOGE("this is unexpected type : %s", path_.c_str());
+      } else if (!move_file(from, to, entry.name.c_str(), status)) {
+        failed();
+      }
+    }
+    return folders;
+  }
+
+  bool move_file(int from, int to, const char *name, const struct stat &status) {
+    struct stat present = {};
+    if (fstatat(to, name, &present, AT_SYMLINK_NOFOLLOW) == 0) {
+      if (S_ISDIR(present.st_mode) && !delete_tree_at(to, name, target_path())) return false;
+      // Two names of one file: renaming one to the other would do nothing.
+      if (present.st_ino == status.st_ino && present.st_dev == status.st_dev) {
+        return unlinkat(from, name, 0) == 0;
+      }
+    }
+    if (renameat(from, name, to, name) == 0) return true;
+    return errno == EXDEV && copy_file_back(from, to, name);
+  }
+
+  /** To another file system only a copy leads; the snapshot keeps its own until the end. */
+  bool copy_file_back(int from, int to, const char *name) {
+    struct stat status = {};
+    const UniqueFd source = safe_open_file_at(from, name, &status);
+    unlinkat(to, name, 0);
+    UniqueFd copy(openat(to, name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kCopyMode));
+    bool copied = source && copy;
+    std::vector<char> chunk(kCopyChunk);
+    while (copied) {
+      const ssize_t count = TEMP_FAILURE_RETRY(read(source.get(), chunk.data(), chunk.size()));
+      if (count == 0) break;
+      copied =
+          count > 0 && write(copy.get(), chunk.data(), static_cast<std::size_t>(count)) == count;
+    }
+    const std::string key = path_.substr(files_.snapshot.size() + 1);
+    json_object *entry = entry_of(table_, key);
+    if (copied && entry != nullptr && fstat(copy.get(), &status) == 0) {
+      put_attributes_back(copy.get(), status, key.c_str(), entry);
+    }
+    if (copied && close(copy.release()) == 0) return true;
+    if (copy) unlinkat(to, name, 0);
+    return false;
+  }
+
+  /** A directory whose place is free goes there with all that it holds. */
+  bool move_whole(int from, int to, const char *name) {
+    struct stat present = {};
+    if (fstatat(to, name, &present, AT_SYMLINK_NOFOLLOW) == 0) {
+      if (S_ISDIR(present.st_mode) || unlinkat(to, name, 0) != 0) return false;
+    }
+    // The snapshot's table stays where it is until the end.
+    if (files_.snapshot_table.compare(0, path_.size() + 1, path_ + "/") == 0) return false;
+    return renameat(from, name, to, name) == 0;
+  }
+
+  bool enter(TreePlace *source, TreePlace *target, const char *name) {
+    static_cast<void>(mkdirat(target->fd(), name, kFolderMode));  // as a rule it is there
+    if (!target->down(name)) return false;
+    if (source->down(name)) return true;
+    static_cast<void>(target->up());
+    return false;
+  }
+
+  const restore_files &files_;
+  const std::string root_;
+  json_object *table_;
+  const std::vector<std::string> own_;
+  std::string path_;
+  bool moved_ = true;
+};
+
+/** An earlier release that was interrupted has moved some files away. */
+void bring_back_kept(const restore_files &files) {
+  const std::string kept = files.snapshot + kKept;
+  const DirPtr source = safe_opendir(kept.c_str());
+  const UniqueFd target = safe_open(files.dirs[1].c_str(), O_PATH | O_DIRECTORY);
+  if (source == nullptr || !target) return;
+  while (const dirent *entry = readdir(source.get())) {
+    const char *name = entry->d_name;
+    if (is_dot_entry(name) || renameat(dirfd(source.get()), name, target.get(), name) == 0)
+      continue;
+    LOGE("fail to move %s from %s to %s", name, kept.c_str(), files.dirs[1].c_str());
+  }
+}
+
+}  // namespace
+
+rollback_result put_snapshot_back(const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  if (state_of_snapshot(files) != snapshot_state::complete) {
+    LOGE("there isn't a snapshot of (%s) to roll back to", pkgid);
+    return rollback_result::none;
+  }
+  restore_step("rollback");
+  const JsonPtr table = read_table(files.snapshot_table);
+  if (table == nullptr) {
+    // What is in its place already and what is the restore's could not be told apart.
+    LOGE("snapshot of (%s) cannot be read, so it is kept", pkgid);
+    return rollback_result::kept;
+  }
+  bring_back_kept(files);
+  bool whole = Clearing(files, root, table.get()).run();
+  restore_step("rollback-cleared");
+  put_all_attributes_back(table.get(), files.snapshot, Objects::kAll);
+  restore_step("rollback-ready");
+  if (!MovingBack(files, root, table.get()).run(files.snapshot)) whole = false;
+  restore_step("rollback-moved");
+  put_all_attributes_back(table.get(), root, Objects::kDirectories);
+  restore_step("rollback-done");
+  if (!whole) {
+    LOGE("not all data of (%s) could be put back, so its snapshot is kept", pkgid);
+    return rollback_result::kept;
+  }
+  // Where this fails the data stands all the same, and is looked at again by the next start.
+  discard_snapshot(pkgid, root);
+  return rollback_result::whole;
+}
+
+int rollback_to_initial_app_data(const char *pkgid, const char *root) {
+  static_cast<void>(put_snapshot_back(pkgid, root));
+  return QUARN_OK;
+}
+
+int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  const JsonPtr table =
+      file_exist(files.snapshot_table.c_str()) ? read_table(files.snapshot_table) : nullptr;
+  return MovingBack(files, root, table.get()).run(dir) ? 1 : 0;
+}

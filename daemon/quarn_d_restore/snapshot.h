@@ -1,0 +1,79 @@
+/**
+ * @file snapshot.h
+ * @brief What a snapshot is good for at the moment, and what became of a rollback.
+ *
+ * A snapshot is incomplete until its table has its name, then complete: the
+ * data may be half replaced. It is released by the table's removal, or told
+ * when the application has gone on with its data: then it is only kept. Main
+ * thread or the backup worker; the caller holds package_data_mutex.
+ */
+#ifndef QUARN_D_RESTORE_SNAPSHOT_H
+#define QUARN_D_RESTORE_SNAPSHOT_H
+
+#include <sys/stat.h>
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "quarn_d_restore/restore_files.h"
+#include "quarn_d_utils/handles.h"
+
+enum class snapshot_state {
+  none,
+  foreign,    /**< something of that name that is not the daemon's */
+  incomplete, /**< the data was not touched, or is whole again */
+  complete,   /**< what counts until the restore has ended */
+  told        /**< kept for whoever wants it; the present data counts */
+};
+snapshot_state state_of_snapshot(const restore_files &files);
+
+enum class rollback_result {
+  none,  /**< there was no snapshot to roll back to */
+  whole, /**< the data is as it was before the restore */
+  kept   /**< not all of it is: the rest is in the snapshot, and will be tried again */
+};
+/**
+ * Put the snapshot back: by moving, so that no step needs space. It may be
+ * repeated after an interruption at any point.
+ */
+rollback_result put_snapshot_back(const char *pkgid, const char *root);
+
+/** Remember what has been unpacked. @return false when it could not be written */
+bool note_unpacked_files(const char *pkgid, const char *root);
+/**
+ * True when a file has changed that neither the restore nor the rollback wrote;
+ * @p path is one. Files are told apart by inode, size and time of change, and
+ * times are only ever compared for being the same.
+ */
+bool application_has_written(const restore_files &files, std::string *path);
+
+/** Keep a complete snapshot without its being rolled back to ever again. @return false: it failed
+ */
+bool keep_told_snapshot(const restore_files &files);
+/** Remove a told snapshot that made way for a further restore, which has succeeded. */
+void forget_told_snapshot(const restore_files &files);
+/** Remove whatever lies in the snapshot's place. @return true when nothing does any more */
+bool remove_snapshot(const restore_files &files);
+
+/** The fingerprint of a file's present content, as the stamps have it. */
+std::uint64_t file_stamp(const struct stat &status);
+
+/** Writes stamps as a file that has its name only when it is whole. */
+class StampWriter {
+ public:
+  explicit StampWriter(std::string path);
+  void add(const struct stat &status);
+  /** @return true when all of them are on the disk under their name */
+  bool finish();
+
+ private:
+  void flush();
+
+  std::string path_;
+  UniqueFd file_;
+  std::vector<std::uint64_t> waiting_;
+  bool failed_;
+};
+
+#endif

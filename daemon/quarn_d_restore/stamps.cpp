@@ -1,0 +1,180 @@
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <utility>
+
+#include "quarn_common.h"
+#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/disk_sync.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
+#include "quarn_d_utils/working_files.h"
+
+namespace {
+
+constexpr mode_t kPrivateFile = 0600;
+constexpr std::size_t kWaitingStamps = 4096;
+constexpr char kUnfinished[] = ".new";
+
+using Stamps = std::vector<std::uint64_t>;
+
+/** Spreads what differs little over all bits. */
+std::uint64_t mix(std::uint64_t value) {
+  value = (value ^ (value >> 30U)) * 0xbf58476d1ce4e5b9U;
+  value = (value ^ (value >> 27U)) * 0x94d049bb133111ebU;
+  return value ^ (value >> 31U);
+}
+
+/** Append the stamps of a file. @return false when there is none that is whole */
+bool read_stamps(const std::string &path, Stamps *stamps) {
+  const UniqueFd file = safe_open(path.c_str(), O_RDONLY);
+  struct stat status = {};
+  if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return false;
+  const auto count = static_cast<std::size_t>(status.st_size) / sizeof(std::uint64_t);
+  const std::size_t before = stamps->size();
+  stamps->resize(before + count);
+  auto *at = reinterpret_cast<char *>(stamps->data() + before);
+  std::size_t left = count * sizeof(std::uint64_t);
+  while (left > 0) {
+    const ssize_t got = TEMP_FAILURE_RETRY(read(file.get(), at, left));
+    if (got <= 0) return false;
+    at += got;
+    left -= static_cast<std::size_t>(got);
+  }
+  return true;
+}
+
+/** Visits the regular files of a package's data. */
+class DataWalk {
+ public:
+  explicit DataWalk(const restore_files &files) : files_(files) {}
+
+  /** @p visit gets path and status, and goes on while it answers true. */
+  template <typename Visit>
+  void run(Visit visit) {
+    for (const auto &dir : files_.dirs) {
+      if (!walk(dir, visit)) return;
+    }
+  }
+
+ private:
+  template <typename Visit>
+  bool walk(const std::string &dir, Visit &visit) {
+    TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    if (!place) return true;
+    std::string path = dir;
+    std::vector<std::vector<std::string>> pending(1);
+    if (!scan(place.fd(), path, visit, &pending.back())) return false;
+    while (true) {
+      if (pending.back().empty()) {
+        pending.pop_back();
+        if (pending.empty() || !place.up()) return true;
+        path.resize(path.rfind('/'));
+        continue;
+      }
+      const std::string name = std::move(pending.back().back());
+      pending.back().pop_back();
+      if (!place.down(name.c_str())) continue;
+      path += "/" + name;
+      pending.emplace_back();
+      if (!scan(place.fd(), path, visit, &pending.back())) return false;
+    }
+  }
+
+  template <typename Visit>
+  bool scan(int dir, const std::string &folder, Visit &visit, std::vector<std::string> *folders) {
+    std::vector<TreeEntry> entries;
+    list_tree_entries(dir, &entries);
+    for (TreeEntry &entry : entries) {
+      const std::string path = folder + "/" + entry.name;
+      if (files_.is_skipped(path) || path == files_.table) continue;
+      struct stat status = {};
+      if (fstatat(dir, entry.name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) continue;
+      if (S_ISDIR(status.st_mode)) {
+        folders->push_back(std::move(entry.name));
+      } else if (S_ISREG(status.st_mode) && !is_own_leftover(entry.name.c_str(), status) &&
+                 !visit(path, status)) {
+        return false;
+      }
+    }
+    return true;
+  }
+
+  const restore_files &files_;
+};
+
+}  // namespace
+
+std::uint64_t file_stamp(const struct stat &status) {
+  std::uint64_t stamp = mix(status.st_ino);
+  stamp = mix(stamp ^ static_cast<std::uint64_t>(status.st_size));
+  stamp = mix(stamp ^ static_cast<std::uint64_t>(status.st_mtim.tv_sec));
+  return mix(stamp ^ static_cast<std::uint64_t>(status.st_mtim.tv_nsec));
+}
+
+StampWriter::StampWriter(std::string path) : path_(std::move(path)) {
+  file_ = safe_open((path_ + kUnfinished).c_str(), O_WRONLY | O_CREAT | O_TRUNC, kPrivateFile);
+  failed_ = !file_;
+}
+
+void StampWriter::add(const struct stat &status) {
+  waiting_.push_back(file_stamp(status));
+  if (waiting_.size() >= kWaitingStamps) flush();
+}
+
+void StampWriter::flush() {
+  const auto *at = reinterpret_cast<const char *>(waiting_.data());
+  std::size_t left = waiting_.size() * sizeof(std::uint64_t);
+  while (!failed_ && left > 0) {
+    const ssize_t written = TEMP_FAILURE_RETRY(write(file_.get(), at, left));
+    failed_ = written <= 0;
+    if (failed_) break;
+    at += written;
+    left -= static_cast<std::size_t>(written);
+  }
+  waiting_.clear();
+}
+
+bool StampWriter::finish() {
+  flush();
+  if (failed_ || fsync(file_.get()) != 0) return false;
+  const std::string unfinished = path_ + kUnfinished;
+  std::string name;
+  const UniqueFd parent = safe_open_parent(path_.c_str(), &name);
+  return parent &&
+         renameat(parent.get(), (name + kUnfinished).c_str(), parent.get(), name.c_str()) == 0 &&
+         sync_directory(path_.substr(0, path_.rfind('/')));
+}
+
+bool note_unpacked_files(const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  StampWriter stamps(files.unpacked);
+  DataWalk(files).run([&](const std::string &, const struct stat &status) {
+    stamps.add(status);
+    return true;
+  });
+  return stamps.finish();
+}
+
+bool application_has_written(const restore_files &files, std::string *path) {
+  Stamps known;
+  // A snapshot of an earlier release tells nothing of it.
+  if (!read_stamps(files.stamps, &known)) return false;
+  const bool unpacked = read_stamps(files.unpacked, &known);
+  std::sort(known.begin(), known.end());
+  bool written = false;
+  DataWalk(files).run([&](const std::string &file, const struct stat &status) {
+    if (std::binary_search(known.begin(), known.end(), file_stamp(status))) return true;
+    // What the unpacking makes is the daemon's alone until all of it is noted.
+    if (!unpacked && status.st_uid == geteuid() && (status.st_mode & ALLPERMS) == kPrivateFile) {
+      return true;
+    }
+    *path = file;
+    written = true;
+    return false;
+  });
+  return written;
+}

@@ -1,0 +1,67 @@
+/**
+ * @file tree_place.h
+ * @brief A walk that holds one descriptor, however deep it goes.
+ */
+#ifndef QUARN_D_UTILS_TREE_PLACE_H
+#define QUARN_D_UTILS_TREE_PLACE_H
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+#include "quarn_d_utils/handles.h"
+
+/**
+ * A directory that is open, and the way back to the one where the walk began.
+ * No link is followed. Functions set errno and log nothing; one thread.
+ */
+class TreePlace {
+ public:
+  /** @param top the directory to begin in, open for reading; none makes a place that is nowhere */
+  explicit TreePlace(UniqueFd top);
+
+  explicit operator bool() const { return static_cast<bool>(here_); }
+  int fd() const { return here_.get(); }
+  /** Directories between this one and the first. */
+  std::size_t depth() const { return above_.size(); }
+
+  /** Go into the directory @p name. @return false, and nothing has changed, when it is none */
+  bool down(const char *name);
+  /** Go back. @return false when the directory was moved meanwhile: the walk cannot go on then */
+  bool up();
+
+ private:
+  struct Identity {
+    dev_t device;
+    ino_t inode;
+  };
+  UniqueFd here_;
+  Identity identity_ = {};
+  std::vector<Identity> above_;
+};
+
+/** One name in a directory. */
+struct TreeEntry {
+  std::string name;
+  unsigned char type; /**< as readdir() tells it: may be DT_UNKNOWN */
+};
+
+/** The entries of an open directory but "." and "..". @return false when it cannot be read */
+bool list_tree_entries(int dir, std::vector<TreeEntry> *entries);
+
+/** What a removal does with what is neither file nor directory. */
+enum class OtherTypes {
+  kStay,   /**< refused, as everywhere in an application's data */
+  kRemoved /**< in what is the daemon's own */
+};
+
+/**
+ * Remove the directory @p name of @p parent with everything in it, without a
+ * limit to its depth. @p path is its path, for messages.
+ * @return true when all of it is gone
+ */
+bool delete_tree_at(int parent, const char *name, const std::string &path,
+                    OtherTypes others = OtherTypes::kStay);
+
+#endif

@@ -1,0 +1,88 @@
+#include "quarn_d_utils/working_files.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <mutex>
+#include <set>
+#include <string_view>
+#include <vector>
+
+#include "backup_transport.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr std::string_view kPartPrefix = BACKUP_TRANS_TEMPORARY_PREFIX;
+
+std::mutex claimed_mutex;
+std::set<std::string> &claimed() {
+  static auto *paths = new std::set<std::string>;
+  return *paths;
+}
+
+bool is_part_name(const char *name) {
+  return std::strncmp(name, kPartPrefix.data(), kPartPrefix.size()) == 0;
+}
+
+/** A file that nobody but the daemon has made, and that has no other name. */
+bool is_own_file(const struct stat &status) {
+  return S_ISREG(status.st_mode) && status.st_uid == geteuid() && status.st_nlink == 1;
+}
+
+constexpr mode_t kPrivateFile = 0600;
+
+/** Remove the file at @p path when it is the daemon's, and no longer used. */
+void sweep_file(const std::string &path, mode_t modes = ALLPERMS) {
+  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  struct stat status = {};
+  if (claimed().count(path) != 0 || safe_lstat(path.c_str(), &status) != 0) return;
+  if (is_own_file(status) && (status.st_mode & ALLPERMS & ~modes) == 0) delete_file(path.c_str());
+}
+
+/** Remove a part of a download when no transfer holds it. */
+void sweep_part(int dir, const char *name) {
+  struct stat status = {};
+  const UniqueFd file = safe_open_file_at(dir, name, &status);
+  if (!file || !is_own_leftover(name, status)) return;
+  if (flock(file.get(), LOCK_EX | LOCK_NB) != 0) return;
+  if (unlinkat(dir, name, 0) != 0) LOGE("fail to delete file : %s", name);
+}
+
+}  // namespace
+
+bool is_own_leftover(const char *name, const struct stat &status) {
+  return is_part_name(name) && is_own_file(status);
+}
+
+bool is_own_leftover(const std::string &path) {
+  const std::size_t slash = path.rfind('/');
+  const char *name = path.c_str() + (slash == std::string::npos ? 0 : slash + 1);
+  struct stat status = {};
+  return is_part_name(name) && safe_lstat(path.c_str(), &status) == 0 &&
+         is_own_leftover(name, status);
+}
+
+void claim_working_file(const std::string &path) {
+  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  claimed().insert(path);
+}
+
+void sweep_working_files(const std::string &pkg_id, const std::string &root) {
+  const WorkingFiles files(pkg_id, root);
+  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  sweep_file(files.upload());
+  sweep_file(files.download());
+  sweep_file(files.table(), kPrivateFile);
+  const UniqueFd dir = safe_open(files.folder().c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK);
+  std::vector<TreeEntry> entries;
+  if (!dir || !list_tree_entries(dir.get(), &entries)) return;
+  for (const TreeEntry &entry : entries) {
+    if (is_part_name(entry.name.c_str())) sweep_part(dir.get(), entry.name.c_str());
+  }
+}
