@@ -10,6 +10,8 @@
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_utils/admission.h"
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -165,7 +167,20 @@ class RawCall : public MethodCall {
 };
 
 client_cb_data *make_record(const MethodCall &call, guint32 req_id) {
-  return new client_cb_data{req_id, call.sender()};
+  return new client_cb_data{req_id, call.sender(), count_waiting(call.sender())};
+}
+
+/** A request that ends what others wait for is accepted however many wait. */
+client_cb_data *make_uncounted_record(const MethodCall &call, guint32 req_id) {
+  return new client_cb_data{req_id, call.sender(), nullptr};
+}
+
+/** Refuse a request that may wait where too many do. */
+bool refuse_beyond_bounds(MethodCall &call) {
+  if (may_wait(call.sender())) return false;
+  LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
+  call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "Too many requests are waiting");
+  return true;
 }
 
 /** The user that a client runs as, told by the bus. */
@@ -209,8 +224,10 @@ void on_restore_enable(MethodCall &call, GVariant *parameters) {
   const char *pkg_list = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(ii&s&su)", &on, &client, &serial_num, &pkg_list, &req_id);
-  call.reply_int(
-      quarnd_restore_enable(on, client, serial_num, pkg_list, make_record(call, req_id)));
+  if (on != 0 && refuse_beyond_bounds(call)) return;
+  client_cb_data *const record =
+      on != 0 ? make_record(call, req_id) : make_uncounted_record(call, req_id);
+  call.reply_int(quarnd_restore_enable(on, client, serial_num, pkg_list, record));
 }
 
 void on_last_bu_time(MethodCall &call) {
@@ -223,25 +240,28 @@ void on_get_app_list(MethodCall &call, GVariant *parameters) {
   gint32 client = 0;
   guint32 req_id = 0;
   g_variant_get(parameters, "(iu)", &client, &req_id);
+  if (refuse_beyond_bounds(call)) return;
   call.reply_int(quarnd_get_app_list(client, make_record(call, req_id)));
 }
 
 void on_manual_backup_start(MethodCall &call, GVariant *parameters) {
   guint32 req_id = 0;
   g_variant_get(parameters, "(u)", &req_id);
+  if (refuse_beyond_bounds(call)) return;
   call.reply_int(quarnd_manual_backup(make_record(call, req_id)));
 }
 
 void on_manual_backup_cancel(MethodCall &call, GVariant *parameters) {
   guint32 req_id = 0;
   g_variant_get(parameters, "(u)", &req_id);
-  call.reply_int(quarnd_manual_backup_cancel(make_record(call, req_id)));
+  call.reply_int(quarnd_manual_backup_cancel(make_uncounted_record(call, req_id)));
 }
 
 void on_app_data_backup_start(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
+  if (refuse_beyond_bounds(call)) return;
   call.reply_int(quarnd_backup_app_data(pkg_id, make_record(call, req_id)));
 }
 
@@ -249,6 +269,7 @@ void on_app_data_restore_start(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
+  if (refuse_beyond_bounds(call)) return;
   call.reply_int(quarnd_restore_app_data(pkg_id, make_record(call, req_id)));
 }
 
@@ -260,7 +281,9 @@ void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *p
     call.reply_int(QUARN_REFUSED);
     return;
   }
-  call.reply_int(quarnd_make_app_data(pkg_id, uid));
+  int result = QUARN_FAILED;
+  run_on_thread_stack([&] { result = quarnd_make_app_data(pkg_id, uid); });
+  call.reply_int(result);
 }
 
 /** The one dispatcher; @p given is null when the call has no arguments. */
@@ -310,8 +333,11 @@ void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
 void _dbus_handle_method_call(GDBusConnection *connection, const gchar *sender, const gchar *,
                               const gchar *interface_name, const gchar *method_name,
                               GVariant *parameters, GDBusMethodInvocation *invocation, gpointer) {
-  InvokedCall call(sender, interface_name, method_name, invocation);
-  dispatch(connection, call, parameters);
+  // The invocation, ours until it is answered, owns all of these.
+  run_on_fiber([=] {
+    InvokedCall call(sender, interface_name, method_name, invocation);
+    dispatch(connection, call, parameters);
+  });
 }
 
 constexpr GDBusInterfaceVTable kMethodTable = {_dbus_handle_method_call, nullptr, nullptr, {}};
