@@ -9,6 +9,7 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
+#include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -47,13 +48,18 @@ void install_signal_handlers() {
 
 int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
 
+void export_objects(GDBusConnection *connection) {
+  quarnd_status_export(connection);
+  quarnd_packages_export(connection);
+}
+
 /** Lower floors learn how to ask the upper ones. */
 void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(backup_request_outstanding);
   set_restore_disable(disable_restore);
   set_boot_recovery(recover_interrupted_restores);
-  set_bus_acquired_hook(quarnd_status_export);
+  set_bus_acquired_hook(export_objects);
   quarnd_progress_init();
 }
 
@@ -82,6 +88,7 @@ void deinit_quarn() {
   if (quarn_started == 0) return;
   deinit_backup_resource();
   LOGI("quarnd_dbus_deinit ~");
+  quarnd_packages_unexport();
   quarnd_status_unexport();
   quarnd_dbus_deinit(quarn_dbus_owner_id);
   LOGI("ecore_shutdown ~");

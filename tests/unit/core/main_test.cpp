@@ -12,6 +12,7 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
+#include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -91,8 +92,10 @@ void quarnd_dbus_deinit(unsigned int owner_id) {
   step("dbus_deinit");
 }
 void set_bus_acquired_hook(void (*hook)(GDBusConnection *)) { bus_acquired_hook = hook; }
-void quarnd_status_export(GDBusConnection *) {}
+void quarnd_status_export(GDBusConnection *) { step("status_export"); }
 void quarnd_status_unexport() { step("status_unexport"); }
+void quarnd_packages_export(GDBusConnection *) { step("packages_export"); }
+void quarnd_packages_unexport() { step("packages_unexport"); }
 void quarnd_progress_init() { step("progress_init"); }
 void init_backup_resource() { step("init_backup_resource"); }
 void deinit_backup_resource() { step("deinit_backup_resource"); }
@@ -157,13 +160,13 @@ class Main : public ::testing::Test {
 
 TEST_F(Main, RunsItsStepsInOrder) {
   EXPECT_EQ(quarn_run(), 0);
-  EXPECT_EQ(
-      captured_texts(),
-      (Texts{"Quarn Daemon start", "account", "watch_signals", "progress_init", "loop_init",
-             "dbus_init", "init_backup_resource", "start_wifi_monitor",
-             LIVE_STEP "init_backup_req_dispatch_thread", "== main loop begin ==", "loop_begin",
-             "deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport", "dbus_deinit",
-             "ecore_shutdown ~", "loop_shutdown", "Good-Bye from Quarn"}));
+  EXPECT_EQ(captured_texts(),
+            (Texts{"Quarn Daemon start", "account", "watch_signals", "progress_init", "loop_init",
+                   "dbus_init", "init_backup_resource", "start_wifi_monitor",
+                   LIVE_STEP "init_backup_req_dispatch_thread",
+                   "== main loop begin ==", "loop_begin", "deinit_backup_resource",
+                   "quarnd_dbus_deinit ~", "packages_unexport", "status_unexport", "dbus_deinit",
+                   "ecore_shutdown ~", "loop_shutdown", "Good-Bye from Quarn"}));
 }
 
 TEST_F(Main, WithoutAnAccountNothingIsStarted) {
@@ -224,9 +227,9 @@ TEST_F(Main, SignalTearsDownOnceAndEndsWithZero) {
   };
   EXPECT_EQ(quarn_run(), 0);
   EXPECT_EQ(captured_texts(),
-            (Texts{"deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport",
-                   "dbus_deinit", "ecore_shutdown ~", "loop_shutdown", "quit_nested_loops",
-                   "loop_quit", "Good-Bye from Quarn"}));
+            (Texts{"deinit_backup_resource", "quarnd_dbus_deinit ~", "packages_unexport",
+                   "status_unexport", "dbus_deinit", "ecore_shutdown ~", "loop_shutdown",
+                   "quit_nested_loops", "loop_quit", "Good-Bye from Quarn"}));
 }
 
 TEST_F(Main, InitTwiceLogsAndAsksForTheBusOnce) {
@@ -262,13 +265,14 @@ TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {
   ASSERT_NE(pending_probe, nullptr);
   ASSERT_NE(restore_disable, nullptr);
   ASSERT_NE(boot_recovery, nullptr);
-  EXPECT_EQ(bus_acquired_hook, quarnd_status_export);
+  ASSERT_NE(bus_acquired_hook, nullptr);
   EXPECT_EQ(wifi_probe(), 1);
   EXPECT_TRUE(pending_probe());
   restart();
   EXPECT_EQ(restore_disable(), 0);
   boot_recovery();
-  EXPECT_EQ(steps, (Texts{"restore_off", "recovery"}));
+  bus_acquired_hook(nullptr);
+  EXPECT_EQ(steps, (Texts{"restore_off", "recovery", "status_export", "packages_export"}));
 }
 
 }  // namespace
