@@ -38,14 +38,15 @@ void quarnd_packages_export(GDBusConnection *connection) {
     LOGE("packages object is not available: %s", error->message);
     return;
   }
-  packages_registration =
+  const guint registration =
       g_dbus_connection_register_object(connection, kPackagesObjectPath, node->interfaces[0],
                                         &kPackagesTable, nullptr, nullptr, out(error));
   g_dbus_node_info_unref(node);
-  if (packages_registration == 0) {
+  if (registration == 0) {
     LOGE("packages object is not available: %s", error->message);
     return;
   }
+  packages_registration = registration;
   packages_connection = connection;
 }
 
