@@ -11,6 +11,7 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
+#include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -95,13 +96,18 @@ bool request_pending() { return backup_request_outstanding() || quarnd_calls_def
 
 int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
 
+void export_objects(GDBusConnection *connection) {
+  quarnd_status_export(connection);
+  quarnd_packages_export(connection);
+}
+
 /** Lower floors learn how to ask the upper ones. */
 void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(request_pending);
   set_restore_disable(disable_restore);
   set_boot_recovery(recover_interrupted_restores);
-  set_bus_acquired_hook(quarnd_status_export);
+  set_bus_acquired_hook(export_objects);
   quarnd_progress_init();
 }
 
@@ -137,6 +143,7 @@ void deinit_quarn() {
   if (quarn_started == 0) return;
   deinit_backup_resource();
   LOGI("quarnd_dbus_deinit ~");
+  quarnd_packages_unexport();
   quarnd_status_unexport();
   quarnd_dbus_deinit(quarn_dbus_owner_id);
   LOGI("ecore_shutdown ~");

@@ -12,6 +12,7 @@
 #include <gio/gio.h>
 
 #include <cstdint>
+#include <memory>
 #include <string>
 
 /**
@@ -21,6 +22,8 @@
 struct client_cb_data {
   std::uint32_t req_id = 0; /**< chosen by the client, echoed in every callback */
   std::string sender;       /**< the client's unique bus name */
+  /** Counts among the waiting requests while this record lives; null: does not count. */
+  std::shared_ptr<const void> counted = nullptr;
 };
 
 /** The connection that the bus-acquired callback was given; null before. */

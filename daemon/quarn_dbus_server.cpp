@@ -15,7 +15,11 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
+#include "quarn_d_utils/admission.h"
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 
@@ -84,8 +88,6 @@ constexpr int kBusTimeout = 5000;
 
 /** Milliseconds for the last answers to be written. */
 constexpr unsigned int kFlushLimit = 500;
-/** Calls that wait for an earlier process to end. */
-constexpr std::size_t kMaxDeferred = 512;
 
 guint registration_id = 0;
 guint filter_id = 0;
@@ -178,13 +180,27 @@ class RawCall : public MethodCall {
 };
 
 client_cb_data *make_record(const MethodCall &call, guint32 req_id) {
-  return new client_cb_data{req_id, call.sender()};
+  return new client_cb_data{req_id, call.sender(), count_waiting(call.sender())};
+}
+
+/** A request that ends what others wait for is accepted however many wait. */
+client_cb_data *make_uncounted_record(const MethodCall &call, guint32 req_id) {
+  return new client_cb_data{req_id, call.sender(), nullptr};
+}
+
+/** Refuse a request that may wait where too many do. */
+bool refuse_beyond_bounds(MethodCall &call) {
+  if (may_wait(call.sender())) return false;
+  LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
+  call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "Too many requests are waiting");
+  return true;
 }
 
 /** The record of a request that ends with a last callback, whatever happens. */
 client_cb_data *accept(const MethodCall &call, guint32 req_id, quarn_request kind,
                        const char *text = "") {
-  client_cb_data *const record = make_record(call, req_id);
+  client_cb_data *const record = kind == quarn_request::cancel ? make_uncounted_record(call, req_id)
+                                                               : make_record(call, req_id);
   quarn_dbus_accept_request(kind, text, record);
   return record;
 }
@@ -246,8 +262,14 @@ void on_restore_enable(MethodCall &call, GVariant *parameters) {
     call.reply_int(QUARN_REFUSED);
     return;
   }
-  call.reply_int(
-      quarnd_restore_enable(on, client, serial_num, pkg_list, make_record(call, req_id)));
+  if (on != 0 && waits_are_ended()) {
+    call.reply_int(QUARN_CANCELLED);
+    return;
+  }
+  if (on != 0 && refuse_beyond_bounds(call)) return;
+  client_cb_data *const record =
+      on != 0 ? make_record(call, req_id) : make_uncounted_record(call, req_id);
+  call.reply_int(quarnd_restore_enable(on, client, serial_num, pkg_list, record));
 }
 
 void on_last_bu_time(MethodCall &call) {
@@ -260,6 +282,7 @@ void on_get_app_list(MethodCall &call, GVariant *parameters) {
   gint32 client = 0;
   guint32 req_id = 0;
   g_variant_get(parameters, "(iu)", &client, &req_id);
+  if (refuse_beyond_bounds(call)) return;
   serve(call, accept(call, req_id, quarn_request::app_list), QUARN_CANCELLED,
         [client](void *record) { return quarnd_get_app_list(client, record); });
 }
@@ -267,6 +290,7 @@ void on_get_app_list(MethodCall &call, GVariant *parameters) {
 void on_manual_backup_start(MethodCall &call, GVariant *parameters) {
   guint32 req_id = 0;
   g_variant_get(parameters, "(u)", &req_id);
+  if (refuse_beyond_bounds(call)) return;
   call.reply_int(quarnd_manual_backup(accept(call, req_id, quarn_request::manual_backup)));
 }
 
@@ -282,6 +306,7 @@ void on_app_data_backup_start(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
+  if (refuse_beyond_bounds(call)) return;
   serve(call, accept(call, req_id, quarn_request::app_backup, pkg_id), QUARN_OK,
         [pkg_id](void *record) { return quarnd_backup_app_data(pkg_id, record); });
 }
@@ -290,6 +315,7 @@ void on_app_data_restore_start(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   guint32 req_id = 0;
   g_variant_get(parameters, "(&su)", &pkg_id, &req_id);
+  if (refuse_beyond_bounds(call)) return;
   serve(call, accept(call, req_id, quarn_request::app_restore, pkg_id), QUARN_OK,
         [pkg_id](void *record) { return quarnd_restore_app_data(pkg_id, record); });
 }
@@ -298,7 +324,7 @@ void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *p
   const char *pkg_id = nullptr;
   g_variant_get(parameters, "(&s)", &pkg_id);
   guint32 uid = 0;
-  if (quarn_dbus_waiting_stopped()) {
+  if (waits_are_ended()) {
     call.reply_int(QUARN_CANCELLED);
     return;
   }
@@ -306,7 +332,9 @@ void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *p
     call.reply_int(QUARN_REFUSED);
     return;
   }
-  call.reply_int(quarnd_make_app_data(pkg_id, uid));
+  int result = QUARN_FAILED;
+  run_on_thread_stack([&] { result = quarnd_make_app_data(pkg_id, uid); });
+  call.reply_int(result);
 }
 
 /** The one dispatcher; @p given is null when the call has no arguments. */
@@ -355,29 +383,10 @@ void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
 
 /* ---- calls that wait for an earlier process ------------------------------------ */
 
-using ConnectionPtr = Handle<GDBusConnection, &g_object_unref>;
+using LoopPtr = Handle<GMainLoop, &g_main_loop_unref>;
 
-/** A call that touches what the earlier process may be writing. */
-struct deferred_call {
-  ConnectionPtr connection;
-  std::unique_ptr<MethodCall> call;
-  GVariantPtr parameters;
-};
-using DeferredPtr = std::unique_ptr<deferred_call>;
-
-std::vector<DeferredPtr> deferred;
-/** Calls that have had to wait and are not dispatched yet. */
-std::size_t deferred_count = 0;
-
-void dispatch_deferred(const DeferredPtr &waiting) {
-  --deferred_count;
-  dispatch(waiting->connection.get(), *waiting->call, waiting->parameters.get());
-}
-
-gboolean on_deferred(gpointer data) {
-  dispatch_deferred(DeferredPtr(static_cast<deferred_call *>(data)));
-  return G_SOURCE_REMOVE;
-}
+/** What calls wait for that touch what the earlier process may be writing. */
+std::vector<GMainLoop *> waits_for_turn;
 
 /** Whether the call has to wait until the earlier process has ended. */
 bool must_wait(const MethodCall &call, GVariant *parameters) {
@@ -391,34 +400,34 @@ bool must_wait(const MethodCall &call, GVariant *parameters) {
          call.is("app_data_restore_start") || call.is("make_app_data");
 }
 
-void defer(GDBusConnection *connection, std::unique_ptr<MethodCall> call, GVariant *parameters) {
+/** @return false when the call was refused or is not wanted any more, and is answered */
+bool wait_for_turn(MethodCall &call) {
   cancel_quarn_terminate();
-  if (deferred_count >= kMaxDeferred) {
-    call->refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "too many requests wait");
-    return;
-  }
-  ++deferred_count;
-  auto waiting = std::make_unique<deferred_call>();
-  waiting->connection.reset(G_DBUS_CONNECTION(g_object_ref(connection)));
-  waiting->call = std::move(call);
-  waiting->parameters.reset(g_variant_ref(parameters));
-  deferred.push_back(std::move(waiting));
+  if (refuse_beyond_bounds(call)) return false;
+  const auto counted = count_waiting(call.sender());
+  const LoopPtr loop(new_wait_loop());
+  waits_for_turn.push_back(loop.get());
+  run_nested_loop(loop.get());
+  waits_for_turn.erase(std::find(waits_for_turn.begin(), waits_for_turn.end(), loop.get()));
+  return true;
 }
 
 void _dbus_handle_method_call(GDBusConnection *connection, const gchar *sender, const gchar *,
                               const gchar *interface_name, const gchar *method_name,
                               GVariant *parameters, GDBusMethodInvocation *invocation, gpointer) {
-  auto call = std::make_unique<InvokedCall>(sender, interface_name, method_name, invocation);
-  if (must_wait(*call, parameters)) {
-    defer(connection, std::move(call), parameters);
-    return;
-  }
-  dispatch(connection, *call, parameters);
+  // The invocation, ours until it is answered, owns all of these.
+  run_on_fiber([=] {
+    InvokedCall call(sender, interface_name, method_name, invocation);
+    if (must_wait(call, parameters) && !wait_for_turn(call)) return;
+    dispatch(connection, call, parameters);
+  });
 }
 
 constexpr GDBusInterfaceVTable kMethodTable = {_dbus_handle_method_call, nullptr, nullptr, {}};
 
 /* ---- calls that GDBus does not hand over ------------------------------------- */
+
+using ConnectionPtr = Handle<GDBusConnection, &g_object_unref>;
 
 /** A message on its way from the bus thread to the main thread. */
 struct Passed {
@@ -575,13 +584,10 @@ unsigned int quarnd_dbus_init() {
   return name_owner_id;
 }
 
-bool quarnd_calls_deferred() { return deferred_count != 0; }
+bool quarnd_calls_deferred() { return !waits_for_turn.empty(); }
 
 void quarnd_dispatch_deferred() {
-  // Each on its own: one that waits in turn must not keep the others.
-  for (DeferredPtr &waiting : std::exchange(deferred, {})) {
-    g_idle_add_full(G_PRIORITY_DEFAULT, on_deferred, waiting.release(), nullptr);
-  }
+  for (GMainLoop *loop : waits_for_turn) g_main_loop_quit(loop);
 }
 
 void quarnd_dbus_leave() {

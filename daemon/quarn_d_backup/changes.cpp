@@ -7,6 +7,7 @@
 #include "quarn_d_backup/package_trouble.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_state.h"
@@ -349,6 +350,7 @@ bool foreach_package_info_callback(package_info_h info, void *user_data) {
     keep_unexamined(ctx, ctx->cur_pkg_id.c_str());
     return true;
   }
+  if (ctx->abandoned) return false;
   enter_current_package(ctx);
   LOGI("add (%s) to package list", ctx->cur_pkg_id.c_str());
   add_pkg_info_to_app_list(ctx, ctx->cur_pkg_id.c_str(), ctx->cur_version.c_str(), ctx->cur_crc);
@@ -379,7 +381,8 @@ int make_app_data_zip(backup_context *ctx, const char *) {
   const std::string archive_path = staged_archive_path(ctx->cur_root_path, ctx->cur_pkg_id);
   enter_current_package(ctx);
   if (!acquire_staged_archive(ctx, ctx->cur_pkg_id)) return QUARN_REFUSED;
-  const int ret = make_staged_archive(ctx, archive_path);
+  int ret = QUARN_FAILED;
+  run_on_thread_stack([&] { ret = make_staged_archive(ctx, archive_path); });
   if (ret != QUARN_OK) release_staged_archive(ctx, ctx->cur_pkg_id);
   return ret;
 }

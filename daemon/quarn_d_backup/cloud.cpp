@@ -17,6 +17,8 @@ namespace {
 
 constexpr char kWaitedForSuffix[] = ".waited_for.";
 constexpr char kArchiveSuffix[] = ".zip";
+/** How often an upload is begun again that was aborted for somebody else's sake. */
+constexpr int kMaxTimesAborted = 8;
 
 /** A transfer of the application list. */
 struct app_list_transfer {
@@ -30,7 +32,9 @@ struct app_data_upload {
   BackupContextPtr ctx;
   std::string pkg_id;
   std::string local_path;
+  std::string remote_path;
   std::uint64_t size = 0;
+  int times_aborted = 0;
 };
 
 struct folder_child {
@@ -137,13 +141,41 @@ void __get_app_list_from_cloud_cb(backup_trans_error_code error, void *user_data
 }
 
 void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
+                               const backup_trans_file_info_s *info);
+
+/** Hand the upload to the transport, which has the record then. */
+int request_upload(std::unique_ptr<app_data_upload> &record) {
+  const int ret = backup_trans_upload_file_ors_async(
+      cloud_handler(), record->local_path.c_str(), record->remote_path.c_str(),
+      __upload_app_data_resp_cb, _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE, record.get(),
+      nullptr);
+  if (ret == BACKUP_TRANS_ERROR_NONE) static_cast<void>(record.release());
+  return ret;
+}
+
+/**
+ * The transport aborts everything at once, also what others wait for: the
+ * upload of a request that still stands is begun again.
+ */
+bool begin_upload_again(std::unique_ptr<app_data_upload> &record) {
+  const backup_context *ctx = record->ctx.get();
+  if (!ctx->single_package || ctx->abandoned || backup_wifi_connected() == 0) return false;
+  if (++record->times_aborted > kMaxTimesAborted) return false;
+  const std::string pkg_id = record->pkg_id;
+  if (request_upload(record) != BACKUP_TRANS_ERROR_NONE) return false;
+  LOGI("upload of (%s) was aborted with others, so it is requested again", pkg_id.c_str());
+  return true;
+}
+
+void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
                                const backup_trans_file_info_s *) {
-  const std::unique_ptr<app_data_upload> record(static_cast<app_data_upload *>(user_data));
+  std::unique_ptr<app_data_upload> record(static_cast<app_data_upload *>(user_data));
   if (record == nullptr) {
     LOGE("cb user_data is NULL...");
     assert(user_data != nullptr);
     return;
   }
+  if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_upload_again(record)) return;
   backup_context *ctx = record->ctx.get();
   backup_outcome outcome = backup_outcome::uploaded;
   if (error == BACKUP_TRANS_ERROR_NONE) {
@@ -437,7 +469,7 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   record->ctx = share_backup_context(ctx);
   record->pkg_id = pkg_id;
   record->local_path = staged_archive_path(root_path, pkg_id);
-  const std::string remote_path =
+  record->remote_path =
       version_folder(ctx->serial_number, pkg_id, version) + "/" + pkg_id + kArchiveSuffix;
   record->size = staged_file_size(record->local_path);
   if (ctx->single_package) {
@@ -449,15 +481,8 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   // all three become names in the cloud
   const bool nameable = is_safe_path_component(ctx->serial_number) &&
                         is_safe_path_component(record->pkg_id) && is_safe_path_component(version);
-  const int ret = !nameable ? BACKUP_TRANS_ERROR_ARGUMENT
-                            : backup_trans_upload_file_ors_async(
-                                  cloud_handler(), record->local_path.c_str(), remote_path.c_str(),
-                                  __upload_app_data_resp_cb, _get_current_timestamp(),
-                                  BACKUP_TRANS_OPTION_NONE, record.get(), nullptr);
-  if (ret == BACKUP_TRANS_ERROR_NONE) {
-    static_cast<void>(record.release());
-    return;
-  }
+  const int ret = nameable ? request_upload(record) : BACKUP_TRANS_ERROR_ARGUMENT;
+  if (ret == BACKUP_TRANS_ERROR_NONE) return;
   LOGE("backup_trans_upload_file_ors_async failed... %d", ret);
   // with the package its staged archive goes
   const bool removed = !is_directory(root_path);

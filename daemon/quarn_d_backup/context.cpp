@@ -4,12 +4,14 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 #include <condition_variable>
 #include <mutex>
 
 #include "quarn_common.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -21,9 +23,12 @@ constexpr char kStagedArchiveSuffix[] = "_upload.zip";
 constexpr char kStagingDirectory[] = "/tmp/quarn";
 constexpr mode_t kPrivateDirectory = 0700;
 
+/** How long a run that waits for a lease does not look at cancel and Wi-Fi. */
+constexpr std::chrono::milliseconds kLookInterval{100};
+
 std::atomic<std::uint32_t> last_run_id{0};
 
-/** The main thread, waiting in a nested loop. */
+/** A request on the main thread that waits. */
 struct loop_waiter {
   GMainLoop *loop;
   bool woken;
@@ -45,22 +50,11 @@ lease_table &leases() {
 
 bool on_main_thread() { return getpid() == gettid(); }
 
-// A loop that is quit before it runs would run for ever. This comes from the
-// main context, so whatever waits there is running by then.
-gboolean wake_loop_waiters(gpointer) {
-  lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
+void wake_waiters(lease_table &table) {
+  table.released.notify_all();
   for (loop_waiter *waiter : table.waiters) {
     waiter->woken = true;
     g_main_loop_quit(waiter->loop);
-  }
-  return G_SOURCE_REMOVE;
-}
-
-void wake_waiters(lease_table &table) {
-  table.released.notify_all();
-  if (!table.waiters.empty()) {
-    g_idle_add_full(G_PRIORITY_DEFAULT, wake_loop_waiters, nullptr, nullptr);
   }
 }
 
@@ -77,6 +71,27 @@ void release_all_staged_archives(backup_context *ctx) {
     }
   }
   if (any) wake_waiters(table);
+}
+
+/** @return false when nobody wants the lease any more */
+bool wait_in_loop(lease_table &table, std::unique_lock<std::mutex> &lock) {
+  const GMainLoopPtr loop(new_wait_loop());
+  loop_waiter waiter{loop.get(), false};
+  table.waiters.push_back(&waiter);
+  lock.unlock();
+  run_nested_loop(loop.get());
+  lock.lock();
+  table.waiters.erase(std::find(table.waiters.begin(), table.waiters.end(), &waiter));
+  return waiter.woken;
+}
+
+/** The same for the worker's run. */
+bool wait_in_run(backup_context *ctx, lease_table &table, std::unique_lock<std::mutex> &lock) {
+  table.released.wait_for(lock, kLookInterval);
+  lock.unlock();
+  const bool stop = backup_must_stop(ctx);
+  lock.lock();
+  return !stop;
 }
 
 }  // namespace
@@ -122,18 +137,9 @@ bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id) {
   for (;;) {
     const auto holder = table.holders.emplace(pkg_id, ctx).first;
     if (holder->second == ctx) return true;
-    if (!on_main_thread()) {
-      table.released.wait(lock);
-      continue;
-    }
-    const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
-    loop_waiter waiter{loop.get(), false};
-    table.waiters.push_back(&waiter);
-    lock.unlock();
-    run_nested_loop(loop.get());
-    lock.lock();
-    table.waiters.erase(std::find(table.waiters.begin(), table.waiters.end(), &waiter));
-    if (!waiter.woken) {
+    const bool goes_on =
+        on_main_thread() ? wait_in_loop(table, lock) : wait_in_run(ctx, table, lock);
+    if (!goes_on) {
       LOGE("gave up waiting for the archive of (%s)", pkg_id.c_str());
       return false;
     }

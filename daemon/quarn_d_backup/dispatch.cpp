@@ -3,10 +3,13 @@
 
 #include <algorithm>
 #include <condition_variable>
+#include <cstdint>
 #include <mutex>
+#include <string>
 
 #include "backup_transport.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/quarn_d_utils.h"
@@ -26,6 +29,15 @@ constexpr int kTurnCheckMs = 100;
 std::mutex &backup_req_list_mutex = *new std::mutex;
 std::vector<void *> &backup_req_list = *new std::vector<void *>;
 std::vector<void *> &cancelled_clients = *new std::vector<void *>;  // with the list's mutex
+
+/** The manual run that a cancel meets. */
+struct running_manual {
+  bool standing = false;  // from its taking to its outcome
+  bool cancelled = false;
+  std::string sender;
+};
+running_manual &running = *new running_manual;  // with the list's mutex
+
 std::mutex &backup_req_cond_mutex = *new std::mutex;
 std::condition_variable &backup_req_cond = *new std::condition_variable;
 
@@ -51,6 +63,8 @@ Taken take_request(void **client) {
   *client = backup_req_list.front();
   backup_req_list.erase(backup_req_list.begin());
   --waiting_entries;
+  const auto *record = static_cast<const client_cb_data *>(*client);
+  running = {record != nullptr, false, record != nullptr ? record->sender : ""};
   return Taken::kRequest;
 }
 
@@ -82,7 +96,10 @@ void run_request(void *client) {
     return;
   }
   if (!can_reach_cloud()) {
-    quarn_dbus_manual_backup_status(QUARN_NO_SESSION, QUARN_BACKUP_FAILED, client);
+    const bool cancelled = settle_running_backup();
+    quarn_dbus_manual_backup_status(cancelled ? QUARN_CANCELLED : QUARN_NO_SESSION,
+                                    cancelled ? QUARN_BACKUP_CANCELLED : QUARN_BACKUP_FAILED,
+                                    client);
     return;
   }
   LOGI("now manual backup start!");
@@ -101,6 +118,7 @@ void *backup_req_dispatch_thread(void *) {
       request_power_lock(true);
       g_is_backing_up = true;
       run_request(client);
+      settle_running_backup();
       g_is_backing_up = false;
       request_power_lock(false);
       end_request();
@@ -109,6 +127,29 @@ void *backup_req_dispatch_thread(void *) {
     std::unique_lock<std::mutex> lock(backup_req_cond_mutex);
     backup_req_cond.wait(lock, [] { return waiting_entries != 0; });
   }
+}
+
+/** Under the list's mutex: take the manual requests out that @p meant says. @return how many */
+template <typename Meant>
+std::uint32_t drop_reservations(Meant meant) {
+  const auto dropped =
+      std::stable_partition(backup_req_list.begin(), backup_req_list.end(), [&meant](void *client) {
+        return client == nullptr || !meant(*static_cast<const client_cb_data *>(client));
+      });
+  std::uint32_t count = 0;
+  for (auto client = dropped; client != backup_req_list.end(); ++client, ++count) {
+    LOGI("reservation for manual backup is canceled");
+    cancelled_clients.push_back(*client);
+  }
+  backup_req_list.erase(dropped, backup_req_list.end());
+  return count;
+}
+
+void abort_transfers() {
+  const backup_trans_handle_h handle = cloud_handler();
+  LOGI("request cancel to handler(0x%x)",
+       static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(handle)));
+  backup_trans_cancel_request(handle);
 }
 
 void wake_worker() {
@@ -142,21 +183,44 @@ void request_backup(void *client) {
 }
 
 void cancel_backup(void *) {
-  const backup_trans_handle_h handle = cloud_handler();
-  LOGI("request cancel to handler(0x%x)",
-       static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(handle)));
-  backup_trans_cancel_request(handle);
+  {
+    // Before the transfers end: the run is to know why they did.
+    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    running.cancelled = running.standing;
+  }
+  abort_transfers();
   {
     const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
-    const auto manual = std::stable_partition(backup_req_list.begin(), backup_req_list.end(),
-                                              [](void *client) { return client == nullptr; });
-    for (auto client = manual; client != backup_req_list.end(); ++client) {
-      LOGI("reservation for manual backup is canceled");
-      cancelled_clients.push_back(*client);
-    }
-    backup_req_list.erase(manual, backup_req_list.end());
+    running.cancelled = running.standing || running.cancelled;  // taken from the queue meanwhile
+    drop_reservations([](const client_cb_data &) { return true; });
   }
   wake_worker();
+}
+
+std::uint32_t cancel_backups_of(const std::string &sender) {
+  std::uint32_t count = 0;
+  bool runs = false;
+  {
+    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    count = drop_reservations(
+        [&sender](const client_cb_data &client) { return client.sender == sender; });
+    runs = running.standing && !running.cancelled && running.sender == sender;
+    if (runs) running.cancelled = true;
+  }
+  if (runs) abort_transfers();
+  wake_worker();
+  return runs ? count + 1 : count;
+}
+
+bool running_backup_cancelled() {
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  return running.cancelled;
+}
+
+bool settle_running_backup() {
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  running.standing = false;
+  return running.cancelled;
 }
 
 bool backup_request_outstanding() { return outstanding_requests != 0; }

@@ -2,6 +2,7 @@
 
 #include "backup_transport.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
@@ -23,9 +24,23 @@ void abandon(backup_context *ctx, std::int32_t result) {
   ctx->abandoned = true;
 }
 
-bool stop_when_cancelled(backup_context *ctx) {
-  if (!ctx->is_manual || !manual_backup_canceled) return false;
+/**
+ * The flag belongs to the latest start, so a run that was cancelled before that
+ * has a mark of its own.
+ */
+bool was_cancelled(const backup_context *ctx) {
+  return ctx->is_manual && (manual_backup_canceled || running_backup_cancelled());
+}
+
+void note_cancelled(backup_context *ctx) {
+  if (ctx->cancel_noted) return;
+  ctx->cancel_noted = true;
   LOGI("manual backup cancelled");
+}
+
+bool stop_when_cancelled(backup_context *ctx) {
+  if (!was_cancelled(ctx)) return false;
+  note_cancelled(ctx);
   abandon(ctx, QUARN_CANCELLED);
   return true;
 }
@@ -57,7 +72,8 @@ bool wait_while(backup_context *ctx, Pending pending, LogMinute log_minute) {
     if (rounds % kRoundsPerMinute == 0) log_minute(rounds / kRoundsPerMinute);
     pause_once();
   }
-  return true;
+  // The abort of its transfers may have ended the wait before the cancel was seen.
+  return !stop_when_cancelled(ctx);
 }
 
 bool check_app_list(backup_context *ctx) {
@@ -65,6 +81,7 @@ bool check_app_list(backup_context *ctx) {
   report_progress(ctx, backup_stage::checking);
   const int ret = get_app_list_from_cloud(ctx);
   if (ret != QUARN_OK) {
+    if (ctx->abandoned) return false;
     ctx->result = ret;
     return false;
   }
@@ -83,6 +100,7 @@ bool make_items(backup_context *ctx) {
   LOGI("=== make backup items ===");
   report_progress(ctx, backup_stage::archiving);
   const int ret = make_backup_items(ctx);
+  if (ctx->abandoned) return false;
   if (ret != QUARN_OK) {
     ctx->result = ret;
     return false;
@@ -109,6 +127,7 @@ bool upload_items(backup_context *ctx) {
         !wait_for_uploads(ctx, kMaxRequestedUploads - 1)) {
       return false;
     }
+    if (must_stop(ctx, Transfers::kCancel)) return false;
     ++ctx->uploads_requested;
     upload_app_data(ctx, package.pkg_id.c_str(), package.root_path.c_str(),
                     package.version.c_str());
@@ -186,6 +205,7 @@ void clean_up_cloud(backup_context *ctx) {
     }
     if (must_stop(ctx, Transfers::kCancel)) return;
   }
+  if (stop_when_cancelled(ctx)) return;
   if (ctx->cleanup_result != QUARN_OK) {
     LOGE("=== failed : clean up cloud ===");
   } else {
@@ -227,7 +247,8 @@ void report_to_client(backup_context *ctx, int status) {
 
 void finish_manual_backup(backup_context *ctx) {
   int status = QUARN_BACKUP_FAILED;
-  if (manual_backup_canceled) {
+  if (settle_running_backup() || manual_backup_canceled) {
+    note_cancelled(ctx);
     ctx->result = QUARN_CANCELLED;
   } else if (ctx->result == QUARN_OK) {
     set_last_backup_time();
@@ -254,9 +275,11 @@ void finish_auto_backup(backup_context *ctx) {
 
 }  // namespace
 
+bool backup_must_stop(backup_context *ctx) { return must_stop(ctx, Transfers::kCancel); }
+
 void do_backup(bool is_manual, void *client) {
   const BackupContextPtr ctx(new backup_context);
-  if (is_manual && manual_backup_canceled) {
+  if (is_manual && (manual_backup_canceled || running_backup_cancelled())) {
     LOGE("manual backup was cancelled");
     quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
     return;

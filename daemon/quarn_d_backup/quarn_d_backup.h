@@ -78,6 +78,7 @@ struct backup_context {
   bool cur_backup_enabled = true;
   std::int32_t cur_crc = 0;
 
+  bool cancel_noted = false;    /**< the log tells of the cancel */
   bool first_app_taken = false; /**< single-package runs: the first application was taken */
   /** The cloud's list is of a form that is not understood: it is left as it is. */
   bool keep_cloud_list = false;
@@ -178,7 +179,10 @@ using backup_end_observer = void (*)();
 /** Follow the ends of requests: called on the worker when nothing of one is left; null ends it. */
 void set_backup_end_observer(backup_end_observer observer);
 
-/** A manual backup was cancelled; cleared by the next manual request. */
+/**
+ * A manual backup was cancelled; cleared by the next manual request. A run that
+ * stood when the cancel came stays cancelled.
+ */
 extern std::atomic<bool> manual_backup_canceled;
 /** The worker runs a request. */
 extern std::atomic<bool> g_is_backing_up;
@@ -209,7 +213,9 @@ int backup_context_init(backup_context *ctx);
  * holds it at a time, from the archive's making to the answer of its upload;
  * a run that has it already is given it again. Waiting for it: other threads
  * block, the main thread runs a nested loop.
- * @return false when the wait was ended by the end of the process
+ * @return false when the wait was ended: by the end of the process, the
+ *         withdrawal of the request, or for a run by its cancel or the loss of
+ *         Wi-Fi, which has abandoned it then
  */
 bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id);
 /** Give it back; nothing happens when @p ctx does not hold it. Any thread. */

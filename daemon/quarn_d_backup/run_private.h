@@ -27,6 +27,14 @@ void delete_staged_file(const std::string &path);
 /** Bytes of a staged file, 0 when there is none. */
 std::uint64_t staged_file_size(const std::string &path);
 
+/* ---- pipeline.cpp ---- */
+
+/**
+ * Whether the run is to stop, for it was cancelled or Wi-Fi is gone. It is
+ * abandoned then, with its result, and its transfers are ended.
+ */
+bool backup_must_stop(backup_context *ctx);
+
 /* ---- progress.cpp ---- */
 
 /** Tell the sink, if there is one. */

@@ -9,7 +9,9 @@
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -153,22 +155,21 @@ bool _package_cb_for_restore(package_info_app_component_type_e /*type*/, const c
   auto *ctx = static_cast<pkg_restore_context *>(data);
   if (!ctx->backup_enabled || ctx->restore_started) return true;
   ctx->restore_started = true;
-  restore_app_data(app_id, ctx);
+  run_on_thread_stack([&] { restore_app_data(app_id, ctx); });
   return true;
 }
 
 /** Wait for the answer to the upload. @return the run's result */
 int wait_for_upload(backup_context *ctx) {
+  const GMainLoopPtr loop(new_wait_loop());
+  // Before the look at what remains: the last answer may come on any thread.
+  ctx->wait_loop = g_main_loop_ref(loop.get());
+  if (ctx->upload_remain > 0) run_nested_loop(loop.get());
+  const GMainLoopPtr left(ctx->wait_loop.exchange(nullptr));
   if (ctx->upload_remain > 0) {
-    const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
-    ctx->wait_loop = g_main_loop_ref(loop.get());
-    run_nested_loop(loop.get());
-    const GMainLoopPtr left(ctx->wait_loop.exchange(nullptr));
-    if (left != nullptr) {
-      // The daemon ends. The run lives on until its answer comes, if it comes.
-      ctx->abandoned = true;
-      return QUARN_CANCELLED;
-    }
+    // Withdrawn, or the daemon ends. The run lives on until its answer comes, if it comes.
+    ctx->abandoned = true;
+    return QUARN_CANCELLED;
   }
   return ctx->result;
 }
@@ -196,6 +197,7 @@ int back_up(const std::string &pkg_id, package_info_h info, void *record) {
   if (result == QUARN_OK) result = refuse_disabled(pkg_id, ctx->cur_backup_enabled);
   if (result != QUARN_OK) return result;
   result = visit_applications(info, _package_cb_for_backup, ctx.get());
+  if (ctx->upload_remain == 0 && waits_are_ended()) return QUARN_CANCELLED;
   const int uploaded = wait_for_upload(ctx.get());
   return result != QUARN_OK ? result : uploaded;
 }
@@ -203,12 +205,12 @@ int back_up(const std::string &pkg_id, package_info_h info, void *record) {
 /** Wait for the end of the restore, and take its context back. @return its result */
 int wait_for_restore(std::unique_ptr<pkg_restore_context> ctx) {
   if (ctx->pending > 0) {
-    const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+    const GMainLoopPtr loop(new_wait_loop());
     ctx->main_loop = g_main_loop_ref(loop.get());
     run_nested_loop(loop.get());
     const GMainLoopPtr left(std::exchange(ctx->main_loop, nullptr));
     if (left != nullptr) {
-      // The daemon ends, and the download still has its context.
+      // Withdrawn, or the daemon ends, and the download still has its context.
       ctx->abandoned = true;
       static_cast<void>(ctx.release());
       return QUARN_CANCELLED;
@@ -223,7 +225,7 @@ int restore(const std::string &pkg_id, package_info_h info, void *record) {
   if (result == QUARN_OK) result = read_version(info, &facts);
   if (result == QUARN_OK) result = read_root_path(info, &facts);
   if (result == QUARN_OK) {
-    recover_interrupted_restore(pkg_id.c_str(), facts.root.c_str());
+    run_on_thread_stack([&] { recover_interrupted_restore(pkg_id.c_str(), facts.root.c_str()); });
     if (!read_device(&facts)) result = QUARN_REFUSED;
   }
   if (result != QUARN_OK) return result;
@@ -255,8 +257,8 @@ int serve(const char *id, void *record, Work work, Answer answer) {
     return QUARN_BAD_ARGUMENT;
   }
   const PowerLock lock;
-  if (!cloud_initialized()) {
-    answer(QUARN_NO_SESSION, pkg_id.c_str(), record);
+  if (waits_are_ended() || !cloud_initialized()) {
+    answer(waits_are_ended() ? QUARN_CANCELLED : QUARN_NO_SESSION, pkg_id.c_str(), record);
     return QUARN_OK;
   }
   PackageInfoPtr info;

@@ -3,6 +3,8 @@
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -33,13 +35,15 @@ int quarnd_get_app_list(int client, void *record) {
     return QUARN_BAD_ARGUMENT;
   }
   request_power_lock(true);
-  if (client == CLIENT_CLOUD && !cloud_initialized()) {
-    quarn_dbus_get_app_list_cb(QUARN_NO_SESSION, kFailed, record);
+  if (waits_are_ended() || (client == CLIENT_CLOUD && !cloud_initialized())) {
+    const int reason = waits_are_ended() ? QUARN_CANCELLED : QUARN_NO_SESSION;
+    quarn_dbus_get_app_list_cb(reason, kFailed, record);
     request_power_lock(false);
-    return QUARN_NO_SESSION;
+    return reason;
   }
   LOGI("quarnd_get_app_list");
-  const int result = get_app_list(client, record);
+  int result = QUARN_FAILED;
+  run_on_thread_stack([&] { result = get_app_list(client, record); });
   request_power_lock(false);
   return result;
 }

@@ -6,7 +6,10 @@
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_record.h"
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 
@@ -61,13 +64,21 @@ void await_candidates() {
   await_archives(serial_num_user_select, pkg_list_to_be_restored, installed);
 }
 
+/** The answer to a request in whose place another came while it waited for the session. */
+int superseded_result(RecordPtr record) {
+  if (pellix_restore_running) return QUARN_REFUSED;
+  // It was accepted, so it has its end as well.
+  send_restore_stop(record.release(), QUARN_OK);
+  return QUARN_OK;
+}
+
 int switch_on(int client, const std::string &serial_num, const char *pkg_list, RecordPtr record) {
   std::vector<std::string> list = parse_package_list(pkg_list);
   if (!list.empty() && client == kCloudClient && !is_safe_path_component(serial_num)) {
     LOGE("refused : not a serial number (%s)", serial_num.c_str());
     return QUARN_REFUSED;
   }
-  recover_interrupted_restores();
+  run_on_thread_stack(recover_interrupted_restores);
   pkg_list_to_be_restored = std::move(list);
   if (pkg_list_to_be_restored.empty() || client == kPellixClient) await_no_archives();
   if (pkg_list_to_be_restored.empty()) {
@@ -91,9 +102,15 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   const bool session = cloud_initialized();
   // Other requests are served while the session starts; the latest of them counts.
   const bool superseded = this_change != mode_changes;
+  const bool withdrawn = !session && waits_are_ended();
   if (session && !superseded) start_monitor(client, serial_num, std::move(record));
   request_power_lock(false);
-  if (superseded) return pellix_restore_running ? QUARN_REFUSED : QUARN_OK;
+  if (withdrawn) {
+    if (!superseded) pkg_list_to_be_restored.clear();
+    send_restore_stop(record.release(), QUARN_CANCELLED);
+    return QUARN_CANCELLED;
+  }
+  if (superseded) return superseded_result(std::move(record));
   cloud_restore_running = 1;
   pellix_restore_running = 0;
   return QUARN_OK;

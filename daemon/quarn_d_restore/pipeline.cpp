@@ -8,6 +8,7 @@
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -19,12 +20,15 @@ std::string serial_num_user_select;
 namespace {
 
 constexpr int kCloudClient = 0;
+/** How often a download is begun again that was aborted for somebody else's sake. */
+constexpr int kMaxTimesAborted = 8;
 
 /** One download, from its request to its answer. */
 struct download_request {
   std::string local_path;
   std::string cloud_path;
   pkg_restore_context *ctx;
+  int times_aborted = 0;
 };
 using RequestPtr = std::unique_ptr<download_request>;
 
@@ -142,11 +146,36 @@ void finish_restore(pkg_restore_context *ctx, restore_outcome outcome, std::uint
   if (pkg_list_to_be_restored.empty()) g_idle_add(terminate_when_idle, nullptr);
 }
 
+void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data, char *unused);
+
+/** Hand the request to the transport, which has it then. */
+int request_download(RequestPtr &request) {
+  const int result = backup_trans_download_file_ors_async(
+      cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
+      __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE);
+  if (result == BACKUP_TRANS_ERROR_NONE) static_cast<void>(request.release());
+  return result;
+}
+
+/**
+ * The transport aborts everything at once, also what others wait for: the
+ * download of a restore that is still wanted is begun again.
+ */
+bool begin_download_again(RequestPtr &request) {
+  if (request->ctx->abandoned || !wifi_connected()) return false;
+  if (++request->times_aborted > kMaxTimesAborted) return false;
+  const std::string pkgid = request->ctx->pkgid;
+  if (request_download(request) != BACKUP_TRANS_ERROR_NONE) return false;
+  LOGI("download of (%s) was aborted with others, so it is requested again", pkgid.c_str());
+  return true;
+}
+
 void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
                                  char * /*unused*/) {
   if (user_data == nullptr) LOGE("cb user_data is NULL...");
   g_assert(user_data != nullptr);
-  const RequestPtr request(static_cast<download_request *>(user_data));
+  RequestPtr request(static_cast<download_request *>(user_data));
+  if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_download_again(request)) return;
   pkg_restore_context *ctx = request->ctx;
   running.erase(std::find(running.begin(), running.end(), ctx->pkgid));
   restore_outcome outcome = restore_outcome::failed;
@@ -155,6 +184,9 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
     LOGE("download app data of (%s) failed...err_code[%d]", ctx->pkgid.c_str(), error);
     note_request_end(cause_of_transfer(error, request->local_path));
     ctx->result = QUARN_TRANSFER_FAILED;
+  } else if (ctx->abandoned) {
+    LOGI("restore of (%s) was cancelled", ctx->pkgid.c_str());
+    ctx->result = QUARN_CANCELLED;
   } else {
     LOGI("backup trans success : download for (%s)", ctx->pkgid.c_str());
     size = archive_size(request->local_path);
@@ -168,9 +200,7 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
 bool start_download(RequestPtr request) {
   pkg_restore_context *ctx = request->ctx;
   claim_working_file(request->local_path);
-  const int result = backup_trans_download_file_ors_async(
-      cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
-      __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE);
+  const int result = request_download(request);
   if (result != BACKUP_TRANS_ERROR_NONE) {
     LOGE("backup_trans_download_file_ors_async failed... %d", result);
     note_request_end(cause_of_transfer(result, request->local_path));
@@ -179,7 +209,6 @@ bool start_download(RequestPtr request) {
     return false;
   }
   running.push_back(ctx->pkgid);
-  static_cast<void>(request.release());
   return true;
 }
 
@@ -191,7 +220,12 @@ void start_next(const std::string &pkgid) {
   RequestPtr request = std::move(*next);
   waiting.erase(next);
   pkg_restore_context *ctx = request->ctx;
-  if (!start_download(std::move(request))) finish_restore(ctx, restore_outcome::failed);
+  if (ctx->abandoned) {
+    ctx->result = QUARN_CANCELLED;
+    finish_restore(ctx, restore_outcome::failed);
+  } else if (!start_download(std::move(request))) {
+    finish_restore(ctx, restore_outcome::failed);
+  }
 }
 
 int restore_from_cloud(pkg_restore_context *ctx) {

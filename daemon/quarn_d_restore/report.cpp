@@ -1,7 +1,9 @@
 #include <map>
+#include <memory>
 #include <utility>
 
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_record.h"
 #include "quarn_dbus_client.h"
 
 void *g_restore_cb_data = nullptr;
@@ -44,25 +46,29 @@ int outstanding_restores = 0;
 /** Restore mode is over; the kept client is told when nothing is outstanding any more. */
 bool stop_due = false;
 
+/** What the kept client's "restore_stop" carries. */
+int stop_result = QUARN_OK;
+
 /** "restore_stop" messages that are on their way through the main loop. */
 int stops_to_send = 0;
 
-gboolean send_stop(gpointer record) {
-  --stops_to_send;
-  quarn_dbus_restore_enable_cb(QUARN_OK, kStopMessage, record);
-  return G_SOURCE_REMOVE;
-}
+struct pending_stop {
+  void *record;
+  int result;
+};
 
-/** Never from inside a method call: the client may be waiting for that call's reply. */
-void send_stop_later(void *record) {
-  ++stops_to_send;
-  g_idle_add(send_stop, record);
+gboolean send_stop(gpointer data) {
+  const std::unique_ptr<pending_stop> stop(static_cast<pending_stop *>(data));
+  --stops_to_send;
+  quarn_dbus_restore_enable_cb(stop->result, kStopMessage, stop->record);
+  return G_SOURCE_REMOVE;
 }
 
 void send_stop_when_due() {
   if (!stop_due || outstanding_restores > 0) return;
   stop_due = false;
-  send_stop_later(std::exchange(g_restore_cb_data, nullptr));
+  send_restore_stop(std::exchange(g_restore_cb_data, nullptr),
+                    std::exchange(stop_result, QUARN_OK));
 }
 
 }  // namespace
@@ -91,12 +97,22 @@ void report_restore_end(const std::string &package, restore_outcome outcome, int
 void keep_restore_record(void *record) {
   if (record != nullptr) quarn_dbus_accept_request(quarn_request::restore_mode, "", record);
   void *earlier = std::exchange(g_restore_cb_data, record);
-  if (earlier == nullptr) return;
-  if (std::exchange(stop_due, false)) {
-    send_stop_later(earlier);
-  } else {
-    delete static_cast<client_cb_data *>(earlier);
-  }
+  stop_due = false;
+  const int result = std::exchange(stop_result, QUARN_OK);
+  if (earlier != nullptr) send_restore_stop(earlier, result);
+}
+
+bool restore_record_is_of(const std::string &sender) {
+  const auto *record = static_cast<const client_cb_data *>(g_restore_cb_data);
+  return record != nullptr && record->sender == sender;
+}
+
+void set_restore_stop_result(int result) { stop_result = result; }
+
+// Never from inside a method call: the client may be waiting for that call's reply.
+void send_restore_stop(void *record, int result) {
+  ++stops_to_send;
+  g_idle_add(send_stop, new pending_stop{record, result});
 }
 
 void end_restore_report() {

@@ -7,6 +7,7 @@
 #include <condition_variable>
 
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
@@ -101,7 +102,7 @@ gboolean _waiting_timeout(gpointer user_data) {
 bool on_main_thread() { return gettid() == getpid(); }
 
 void wait_in_nested_loop(wait_record *record) {
-  const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr loop(new_wait_loop());
   {
     const std::lock_guard<std::mutex> lock(session_mutex);
     if (record->answered) return;
@@ -144,7 +145,12 @@ void leave_attempt(wait_record *record) {
   const std::lock_guard<std::mutex> lock(session_mutex);
   wait_records.erase(std::remove(wait_records.begin(), wait_records.end(), record),
                      wait_records.end());
-  if (!record->answered) end_attempt(record->attempt);
+  const bool others_wait =
+      std::any_of(wait_records.begin(), wait_records.end(),
+                  [record](const wait_record *other) { return other->attempt == record->attempt; });
+  // One that was withdrawn leaves the attempt to those that share it.
+  const bool left_to_others = others_wait && waits_are_ended();
+  if (!record->answered && !left_to_others) end_attempt(record->attempt);
 }
 
 }  // namespace

@@ -220,9 +220,13 @@ backup_trans_handle_h cloud_handler();
 
 /* ---- nested_loop.cpp: main thread ----------------------------------------- */
 
-/** Run @p loop until it is quit; quit_nested_loops() ends it as well. */
+/**
+ * Wait until @p loop, one of new_wait_loop(), is quit; quit_nested_loops() and
+ * withdraw_waits() end the wait as well. On a fiber everything else goes on
+ * meanwhile; off it, GLib's sources do, and later waits end first.
+ */
 void run_nested_loop(GMainLoop *loop);
-/** Quit every nested loop, the innermost first, and refuse further ones. */
+/** End every wait, the longest first, and refuse further ones. Returns when nobody waits. */
 void quit_nested_loops();
 
 /* ---- power.cpp: any thread ------------------------------------------------ */

@@ -74,7 +74,9 @@ void clear_sent_statuses() {
 
 void set_status_hook(std::function<void(int, int)> hook) { status_hook = std::move(hook); }
 
-client_cb_data *new_client(std::uint32_t req_id) { return new client_cb_data{req_id, ":1.7"}; }
+client_cb_data *new_client(std::uint32_t req_id, const std::string &sender) {
+  return new client_cb_data{req_id, sender};
+}
 
 /* The calls back to clients: no bus in these tests. */
 
@@ -182,6 +184,7 @@ FakeCloud::FakeCloud() {
   ON_CALL(transport, backup_trans_cancel_request).WillByDefault([this](backup_trans_handle_h) {
     const std::lock_guard<std::recursive_mutex> lock(mutex_);
     ++cancels;
+    if (aborts) aborted_ = answers_.size();
   });
 }
 
@@ -192,7 +195,10 @@ bool FakeCloud::accept(Op op, const std::string &path, int *result) {
   return *result == 0;
 }
 
-int FakeCloud::outcome(Op op, const std::string &path) { return fail ? fail(op, path) : 0; }
+int FakeCloud::outcome(Op op, const std::string &path) {
+  if (aborting_) return BACKUP_TRANS_ERROR_CANCELLED;
+  return fail ? fail(op, path) : 0;
+}
 
 void FakeCloud::answer_later(std::function<void()> answer) {
   const std::lock_guard<std::recursive_mutex> lock(mutex_);
@@ -206,8 +212,11 @@ bool FakeCloud::answer_next() {
     if (answers_.empty()) return false;
     answer = std::move(answers_.front());
     answers_.pop_front();
+    aborting_ = aborted_ > 0;
+    if (aborting_) --aborted_;
   }
   answer();
+  aborting_ = false;
   return true;
 }
 
@@ -310,7 +319,7 @@ void BackupDevice::script_packages() {
   ON_CALL(platform_, package_manager_foreach_package_info)
       .WillByDefault([this](package_manager_package_info_cb callback, void *user_data) {
         for (auto &package : packages_) {
-          callback(reinterpret_cast<package_info_h>(&package), user_data);
+          if (!callback(reinterpret_cast<package_info_h>(&package), user_data)) break;
         }
         return package_walk_result_;
       });

@@ -78,6 +78,8 @@ class FakeCloud {
   /** Children per listing answer. */
   int page = BACKUP_TRANS_MAX_LIST_COUNT;
   int cancels = 0;
+  /** A cancel ends what waits then with the transport's error; its answer comes in its turn. */
+  bool aborts = false;
   /** Downloads are answered with success, but there is no file. */
   bool lose_downloads = false;
   std::vector<int> download_options;
@@ -102,6 +104,8 @@ class FakeCloud {
 
   std::recursive_mutex mutex_;
   std::deque<std::function<void()>> answers_;
+  std::size_t aborted_ = 0; /**< of them, from the front */
+  bool aborting_ = false;
   std::vector<std::string> requests_;
 };
 
@@ -121,7 +125,7 @@ std::vector<SentStatus> sent_statuses();
 void clear_sent_statuses();
 /** Called before each status is recorded; on the sender's thread. */
 void set_status_hook(std::function<void(int err, int status)> hook);
-client_cb_data *new_client(std::uint32_t req_id);
+client_cb_data *new_client(std::uint32_t req_id, const std::string &sender = ":1.7");
 
 /** Whether the device is on Wi-Fi. */
 extern std::atomic<int> fake_wifi;

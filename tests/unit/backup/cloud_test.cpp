@@ -2,6 +2,8 @@
 
 #include "backup_device.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/quarn_d_utils.h"
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
@@ -293,7 +295,7 @@ TEST_F(Cloud, LastAnswerOfASinglePackageRunEndsItsWait) {
   const FakePackage &app = staged("org.app");
   ctx_->single_package = true;
   upload(app);
-  const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr loop(new_wait_loop());
   ctx_->wait_loop = g_main_loop_ref(loop.get());
   g_idle_add(
       [](gpointer cloud) -> gboolean {
@@ -301,9 +303,78 @@ TEST_F(Cloud, LastAnswerOfASinglePackageRunEndsItsWait) {
         return G_SOURCE_REMOVE;
       },
       &cloud_);
-  g_main_loop_run(loop.get());
+  run_nested_loop(loop.get());
   EXPECT_EQ(ctx_->upload_remain, 0);
   EXPECT_EQ(ctx_->wait_loop, nullptr);
+}
+
+TEST_F(Cloud, UploadAbortedForAnothersSakeIsBegunAgain) {
+  const FakePackage &app = staged("org.app");
+  ctx_->single_package = true;
+  cloud_.aborts = true;
+  upload(app);
+  constexpr int kCancels = 3;
+  for (int i = 0; i < kCancels; ++i) {
+    backup_trans_cancel_request(nullptr);
+    EXPECT_TRUE(cloud_.answer_next());
+    EXPECT_EQ(ctx_->upload_remain, 1) << "it goes on";
+  }
+  cloud_.answer_all();
+  EXPECT_EQ(ctx_->upload_remain, 0);
+  EXPECT_EQ(ctx_->result, 0);
+  EXPECT_EQ(cloud_.objects[app.object()], "archive of org.app");
+  EXPECT_EQ(cloud_.count_requests("upload " + app.object()), kCancels + 1);
+  EXPECT_EQ(info("upload of (org.app) was aborted with others, so it is requested again"),
+            kCancels);
+  EXPECT_EQ(error("upload app data of (org.app) failed...err_code[15]"), 0);
+  EXPECT_FALSE(exists(app.staged()));
+}
+
+TEST_F(Cloud, UploadThatIsAbortedAgainAndAgainEnds) {
+  const FakePackage &app = staged("org.app");
+  ctx_->single_package = true;
+  fail_all(BACKUP_TRANS_ERROR_CANCELLED);
+  upload(app);
+  cloud_.answer_all();
+  EXPECT_EQ(ctx_->upload_remain, 0);
+  EXPECT_EQ(ctx_->result, 12);
+  EXPECT_EQ(cloud_.count_requests("upload " + app.object()), 9);
+  EXPECT_FALSE(exists(app.staged()));
+}
+
+TEST_F(Cloud, AbortedUploadIsNotBegunAgainWhenNobodyWantsIt) {
+  const FakePackage &app = staged("org.app");
+  upload(app);  // of a run: that one is told by its own cancel
+  fail_all(BACKUP_TRANS_ERROR_CANCELLED);
+  cloud_.answer_all();
+  EXPECT_EQ(cloud_.count_requests("upload " + app.object()), 1);
+
+  const FakePackage &withdrawn = staged("org.withdrawn");
+  ctx_->single_package = true;
+  upload(withdrawn);
+  ctx_->abandoned = true;
+  cloud_.answer_all();
+  EXPECT_EQ(cloud_.count_requests("upload " + withdrawn.object()), 1);
+
+  ctx_->abandoned = false;
+  const FakePackage &offline = staged("org.offline");
+  upload(offline);
+  fake_wifi = 0;
+  cloud_.answer_all();
+  EXPECT_EQ(cloud_.count_requests("upload " + offline.object()), 1);
+  EXPECT_EQ(ctx_->result, 12);
+}
+
+TEST_F(Cloud, AbortedUploadThatIsRefusedThenEndsAsItWould) {
+  const FakePackage &app = staged("org.app");
+  ctx_->single_package = true;
+  fail_all(BACKUP_TRANS_ERROR_CANCELLED);
+  upload(app);
+  refuse_all();
+  cloud_.answer_all();
+  EXPECT_EQ(ctx_->upload_remain, 0);
+  EXPECT_EQ(ctx_->result, 12);
+  EXPECT_EQ(error("upload app data of (org.app) failed...err_code[15]"), 1);
 }
 
 TEST_F(Cloud, SinglePackageRunWithoutAWaitJustEnds) {
@@ -316,7 +387,7 @@ TEST_F(Cloud, SinglePackageRunWithoutAWaitJustEnds) {
 
 TEST_F(Cloud, WaitLoopOfAFullRunIsLeftAlone) {
   const FakePackage &app = staged("org.app");
-  const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr loop(new_wait_loop());
   ctx_->wait_loop = g_main_loop_ref(loop.get());
   upload(app);
   cloud_.answer_all();

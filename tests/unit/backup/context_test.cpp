@@ -6,6 +6,8 @@
 
 #include "backup_device.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
@@ -56,7 +58,7 @@ TEST_F(Context, LastReferenceGivesEverythingBack) {
 }
 
 TEST_F(Context, WaitLoopThatNobodyTookIsReleased) {
-  holder_->wait_loop = g_main_loop_new(nullptr, FALSE);
+  holder_->wait_loop = new_wait_loop();
   holder_.reset();
 }
 
@@ -105,29 +107,40 @@ TEST_F(Context, ReleaseOfAnotherArchiveDoesNotEndTheWait) {
   EXPECT_TRUE(second_released);
 }
 
-// A request inside another's wait is served first; the outer one cannot go on before.
-TEST_F(Context, InnerWaitOfTheMainThreadComesFirst) {
-  static backup_context *holder;
-  static std::vector<std::string> order;
-  holder = holder_.get();
-  order.clear();
-  g_idle_add(
-      [](gpointer) -> gboolean {
-        g_idle_add(
-            [](gpointer) -> gboolean {
-              release_staged_archive(holder, "org.app");
-              return G_SOURCE_REMOVE;
-            },
-            nullptr);
-        const BackupContextPtr inner(new backup_context);
-        EXPECT_TRUE(acquire_staged_archive(inner.get(), "org.app"));
-        order.emplace_back("inner");
-        return G_SOURCE_REMOVE;
-      },
-      nullptr);
-  EXPECT_TRUE(acquire_staged_archive(other_.get(), "org.app"));
-  order.emplace_back("outer");
-  EXPECT_THAT(order, ::testing::ElementsAre("inner", "outer"));
+// Who came first has the archive first, and nobody waits for another's end.
+TEST_F(Context, RequestsOnFibersHaveTheArchiveInTheirOrder) {
+  std::vector<std::string> order;
+  std::list<BackupContextPtr> requests;
+  for (const char *name : {"first", "second", "third"}) {
+    requests.emplace_back(new backup_context);
+    backup_context *const request = requests.back().get();
+    run_on_fiber([&order, request, name] {
+      EXPECT_TRUE(acquire_staged_archive(request, "org.app"));
+      order.emplace_back(name);
+    });
+  }
+  EXPECT_TRUE(order.empty());
+  release_staged_archive(holder_.get(), "org.app");
+  for (auto &request : requests) {
+    while (!holds_staged_archive(request.get(), "org.app")) {
+      g_main_context_iteration(nullptr, TRUE);
+    }
+    release_staged_archive(request.get(), "org.app");
+  }
+  EXPECT_THAT(order, ::testing::ElementsAre("first", "second", "third"));
+}
+
+TEST_F(Context, AWithdrawnRequestWaitsForNoArchive) {
+  std::uint64_t number = 0;
+  bool taken = true;
+  run_on_fiber([&] {
+    number = fiber_id(current_fiber());
+    taken = acquire_staged_archive(other_.get(), "org.app");
+  });
+  EXPECT_TRUE(withdraw_waits(number));
+  while (taken) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "gave up waiting for the archive of (org.app)"), 1);
+  EXPECT_TRUE(holds_staged_archive(holder_.get(), "org.app"));
 }
 
 TEST_F(Context, EndOfTheProcessEndsTheWait) {

@@ -2,6 +2,7 @@
 #include <thread>
 
 #include "backup_device.h"
+#include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
@@ -212,6 +213,162 @@ TEST_F(Dispatch, NewRequestClearsACancellation) {
   finish();
   EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}, SentStatus{0, 4, 2}));
 }
+
+/** What the handlers do, without the calls to the clients. */
+void start(std::uint32_t request, const std::string &sender = ":1.7") {
+  manual_backup_canceled = false;
+  request_backup(new_client(request, sender));
+}
+void cancel() {
+  manual_backup_canceled = true;
+  cancel_backup(nullptr);
+}
+
+TEST_F(Dispatch, AStartAfterACancelDoesNotCallTheCancelOff) {
+  install("org.a");
+  run_one(1);
+  cancel();
+  start(2);
+  EXPECT_FALSE(manual_backup_canceled) << "cleared by the start";
+  held_ = false;
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}, SentStatus{0, 4, 2}));
+  EXPECT_EQ(info("manual backup cancelled"), 1);
+  EXPECT_EQ(info("manual backup successful!"), 1);
+}
+
+// However the run stands when they come: none is reported as done that was cancelled.
+TEST_F(Dispatch, CancelAndStartAtAnyMomentLeaveOneOfEach) {
+  for (int i = 0; i < 4; ++i) install("org.package" + std::to_string(i));
+  constexpr int kLastAnswer = 12;
+  for (int answers = 0; answers < kLastAnswer; ++answers) {
+    clear_sent_statuses();
+    held_ = true;
+    start(1);
+    int given = 0;
+    run_until([&] {
+      if (given < answers && cloud_.answer_next()) ++given;
+      return given == answers ? cloud_.waiting() > 0 || !sent_statuses().empty()
+                              : !sent_statuses().empty();
+    });
+    const bool ended = !sent_statuses().empty();
+    cancel();
+    start(2);
+    held_ = false;
+    finish();
+    const SentStatus first = ended ? SentStatus{0, 4, 1} : SentStatus{17, 6, 1};
+    EXPECT_THAT(sent_statuses(), ElementsAre(first, SentStatus{0, 4, 2})) << answers;
+    cloud_.objects.clear();
+  }
+}
+
+TEST_F(Dispatch, ACancelledRequestThatFindsNoWifiIsReportedAsCancelled) {
+  static std::atomic<bool> cancelled;
+  cancelled = false;
+  set_backup_wifi_probe([] {
+    if (!cancelled.exchange(true)) cancel();
+    return 0;
+  });
+  start(1);
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}));
+  start(2);
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}, SentStatus{33, 5, 2}));
+}
+
+TEST_F(Dispatch, OneClientsCancelMeetsItsOwnRequestsOnly) {
+  run_one(1);
+  start(2, ":1.8");
+  start(3, ":1.9");
+  start(4, ":1.8");
+  EXPECT_EQ(cancel_backups_of(":1.8"), 2U);
+  EXPECT_EQ(cancel_backups_of(":1.8"), 0U);
+  EXPECT_EQ(cancel_backups_of(":1.1"), 0U);
+  EXPECT_EQ(cloud_.cancels, 0) << "the run is another's";
+  EXPECT_FALSE(manual_backup_canceled);
+  held_ = false;
+  finish();
+  EXPECT_THAT(sent_statuses(),
+              ::testing::UnorderedElementsAre(SentStatus{0, 4, 1}, SentStatus{17, 6, 2},
+                                              SentStatus{0, 4, 3}, SentStatus{17, 6, 4}));
+  EXPECT_EQ(info("reservation for manual backup is canceled"), 2);
+}
+
+TEST_F(Dispatch, OneClientsCancelStopsItsRunningBackupAndOthersGoOn) {
+  install("org.a");
+  run_one(1);
+  start(2, ":1.8");
+  EXPECT_EQ(cancel_backups_of(":1.7"), 1U);
+  EXPECT_EQ(cancel_backups_of(":1.7"), 0U) << "it is withdrawn already";
+  EXPECT_EQ(cloud_.cancels, 1);
+  held_ = false;
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}, SentStatus{0, 4, 2}));
+}
+
+TEST_F(Dispatch, ABackupWhoseOutcomeIsSettledIsNotWithdrawn) {
+  std::atomic<std::uint32_t> met{99};
+  set_status_hook([&met](int, int) { met = cancel_backups_of(":1.7"); });
+  start(1);
+  finish();
+  EXPECT_EQ(met, 0U);
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{0, 4, 1}));
+}
+
+/** A request that holds an archive for as long as it likes. */
+class HeldArchive {
+ public:
+  explicit HeldArchive(const std::string &name) : holder_(new backup_context) {
+    EXPECT_TRUE(acquire_staged_archive(holder_.get(), name));
+  }
+
+ private:
+  BackupContextPtr holder_;
+};
+
+class LeaseWait : public Dispatch, public ::testing::WithParamInterface<const char *> {
+ protected:
+  /** A manual backup that waits for what another holds. */
+  void wait_for_lease() {
+    install("org.a");
+    install("org.b");
+    start(1);
+    run_until([] { return g_is_backing_up.load(); });
+    if (GetParam() == std::string(kStagedListLease)) {
+      run_until([this] { return info("=== checking app list from cloud ===") == 1; });
+    } else {
+      run_until([this] { return info("backup enabled for (org.a)") == 1; });
+    }
+  }
+  static constexpr std::chrono::seconds kSoon{3};
+};
+
+TEST_P(LeaseWait, IsEndedByACancel) {
+  const HeldArchive held(GetParam());
+  wait_for_lease();
+  const auto begin = std::chrono::steady_clock::now();
+  cancel();
+  finish();
+  EXPECT_LT(std::chrono::steady_clock::now() - begin, kSoon);
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{17, 6, 1}));
+  EXPECT_EQ(info("manual backup cancelled"), 1);
+  EXPECT_EQ(info("backup enabled for (org.b)"), 0) << "nothing more is packed";
+}
+
+TEST_P(LeaseWait, IsEndedByTheLossOfWifi) {
+  const HeldArchive held(GetParam());
+  wait_for_lease();
+  const auto begin = std::chrono::steady_clock::now();
+  fake_wifi = 0;
+  finish();
+  EXPECT_LT(std::chrono::steady_clock::now() - begin, kSoon);
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{12, 5, 1}));
+  EXPECT_EQ(error("WIFI disconnected"), 1);
+  EXPECT_GE(cloud_.cancels, 1);
+}
+
+INSTANTIATE_TEST_SUITE_P(OfArchiveAndList, LeaseWait, ::testing::Values("org.a", kStagedListLease));
 
 TEST_F(Dispatch, RequestIsOutstandingFromItsQueuingToItsEnd) {
   ::testing::InSequence in_order;

@@ -454,9 +454,67 @@ TEST_F(Pipeline, CancelThatComesAfterTheLastCheckStillCounts) {
     return op == Op::list ? 2 : 0;
   };
   manual();
-  EXPECT_EQ(info("manual backup cancelled"), 0);
+  EXPECT_EQ(info("manual backup cancelled"), 1);
   expect_failed(17, 6);
 }
+
+TEST_F(Pipeline, CancelAmongTheUploadRequestsIsTheLastOfThem) {
+  constexpr int kPackages = 12;
+  constexpr int kBefore = 3;
+  for (int i = 0; i < kPackages; ++i) install("org.package" + std::to_string(i));
+  int uploads = 0;
+  cloud_.refuse = [&uploads](Op op, const std::string &) {
+    if (op == Op::upload && ++uploads == kBefore) manual_backup_canceled = true;
+    return 0;
+  };
+  manual();
+  EXPECT_EQ(uploads, kBefore);
+  EXPECT_EQ(info("manual backup cancelled"), 1);
+  expect_failed(17, 6);
+  cloud_.answer_all();
+  expect_all_released();
+}
+
+TEST_F(Pipeline, WifiLossAmongTheUploadRequestsIsTheLastOfThem) {
+  constexpr int kPackages = 12;
+  constexpr int kBefore = 3;
+  for (int i = 0; i < kPackages; ++i) install("org.package" + std::to_string(i));
+  int uploads = 0;
+  cloud_.refuse = [&uploads](Op op, const std::string &) {
+    if (op == Op::upload && ++uploads == kBefore) fake_wifi = 0;
+    return 0;
+  };
+  manual();
+  EXPECT_EQ(uploads, kBefore);
+  EXPECT_EQ(cloud_.cancels, 1);
+  expect_failed(12, 5);
+  cloud_.answer_all();
+  expect_all_released();
+}
+
+/** The transport's answers to a cancel are all there before the run looks again. */
+class AbortDuring : public Pipeline, public ::testing::WithParamInterface<const char *> {};
+
+TEST_P(AbortDuring, TheCancelledRunHasItsLineAndItsResult) {
+  install("org.a");
+  install("org.b");
+  cloud_.objects["/350000000000001/org.gone/1/a.zip"] = "x";
+  cloud_.aborts = true;
+  during(GetParam(), [this] {
+    manual_backup_canceled = true;
+    backup_trans_cancel_request(nullptr);
+    cloud_.answer_all();
+  });
+  manual();
+  EXPECT_EQ(info("manual backup cancelled"), 1);
+  EXPECT_EQ(cloud_.waiting(), 0U);
+  expect_failed(17, 6);
+  expect_all_released();
+}
+
+INSTANTIATE_TEST_SUITE_P(EveryWait, AbortDuring,
+                         ::testing::Values("download ", "upload /350000000000001/org.b",
+                                           "upload /app_list", "list ", "delete "));
 
 /* ---- Wi-Fi loss ---- */
 

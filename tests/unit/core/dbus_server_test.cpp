@@ -17,6 +17,10 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
+#include "quarn_d_utils/admission.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 
 namespace {
@@ -36,10 +40,16 @@ int note(const std::string &step) {
   return result;
 }
 
-/** The record's content; the handler owns and, here, deletes it. */
+using RecordPtr = std::unique_ptr<client_cb_data>;
+/** Records of requests whose outcome is still to come; null: each ends with its handler. */
+std::vector<RecordPtr> *kept_records = nullptr;
+
+/** The record's content; the handler owns it. */
 std::string take(void *record) {
-  const std::unique_ptr<client_cb_data> data(static_cast<client_cb_data *>(record));
-  return data->sender + "#" + std::to_string(data->req_id);
+  RecordPtr data(static_cast<client_cb_data *>(record));
+  std::string text = data->sender + "#" + std::to_string(data->req_id);
+  if (kept_records != nullptr) kept_records->push_back(std::move(data));
+  return text;
 }
 
 std::string number(long long value) { return std::to_string(value); }
@@ -122,8 +132,10 @@ class Server : public ::testing::Test {
     steps.clear();
     result = 0;
     inside_handler = nullptr;
+    kept_records = nullptr;
   }
   void TearDown() override {
+    kept_records = nullptr;
     client_.reset();
     quarnd_dbus_deinit(owner_id_);
     while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
@@ -236,6 +248,74 @@ TEST_F(Server, CallsAreServedWhileAHandlerWaitsInANestedLoop) {
             "(0,)");
   EXPECT_EQ(second->reply, "(0,)");
   EXPECT_EQ(steps, (Texts{"cancel", "backup_app_data " + id(1), "cancel", "org.example.notes"}));
+}
+
+TEST_F(Server, EachCallIsAnsweredWhenItsOwnEventComes) {
+  constexpr std::size_t kCalls = 3;
+  std::vector<GMainLoopPtr> marks;
+  inside_handler = [&marks] {
+    marks.emplace_back(new_wait_loop());
+    run_nested_loop(marks.back().get());
+  };
+  std::vector<std::shared_ptr<CallOutcome>> outcomes;
+  for (std::size_t i = 0; i < kCalls; ++i) {
+    outcomes.push_back(std::make_shared<CallOutcome>());
+    client_->start_call("app_data_backup_start", "('org.example.notes', uint32 1)", outcomes[i]);
+    ASSERT_TRUE(run_until([&] { return marks.size() == i + 1; }));
+  }
+  for (const std::size_t answered : {1U, 0U, 2U}) {
+    EXPECT_FALSE(outcomes[answered]->finished);
+    g_main_loop_quit(marks[answered].get());
+    EXPECT_TRUE(run_until([&] { return outcomes[answered]->finished; })) << answered;
+    EXPECT_EQ(outcomes[answered]->reply, "(0,)");
+  }
+}
+
+constexpr char kTooMany[] = "org.freedesktop.DBus.Error.LimitsExceeded";
+
+/** Every request that waits, and its arguments. */
+const std::vector<std::pair<const char *, const char *>> kWaiting = {
+    {"manual_backup_start", "(uint32 1,)"},
+    {"app_data_backup_start", "('org.example.notes', uint32 1)"},
+    {"app_data_restore_start", "('org.example.notes', uint32 1)"},
+    {"get_app_list", "(0, uint32 1)"},
+    {"restore_enable", "(1, 0, '35', '[\"a\"]', uint32 1)"}};
+
+TEST_F(Server, OneCallerMayHaveSixtyFourRequestsWaiting) {
+  std::vector<RecordPtr> records;
+  kept_records = &records;
+  for (std::size_t i = 0; i < kMaxWaitingOfCaller; ++i) {
+    const auto &[method, arguments] = kWaiting[i % kWaiting.size()];
+    ASSERT_EQ(client_->call(method, arguments).reply, "(0,)") << i;
+  }
+  for (const auto &[method, arguments] : kWaiting) {
+    steps.clear();
+    EXPECT_EQ(client_->call(method, arguments).error_name, kTooMany) << method;
+    EXPECT_EQ(steps, Texts{"cancel"}) << "the end is put off all the same";
+  }
+  EXPECT_EQ(records.size(), kMaxWaitingOfCaller) << "no record is made";
+  // What ends waiting, or never waits, is served.
+  EXPECT_EQ(client_->call("manual_backup_cancel", "(uint32 1,)").reply, "(0,)");
+  EXPECT_EQ(client_->call("restore_enable", "(0, 0, '', '', uint32 1)").reply, "(0,)");
+  EXPECT_EQ(client_->call("set_activation", "(1,)").reply, "(0,)");
+  ScriptedClient other;
+  EXPECT_EQ(other.call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
+  records.erase(records.begin());
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").error_name, kTooMany);
+}
+
+TEST_F(Server, AllCallersTogetherMayHaveFiveHundredAndTwelveRequestsWaiting) {
+  std::vector<RecordPtr> records;
+  kept_records = &records;
+  std::vector<std::unique_ptr<ScriptedClient>> clients;
+  for (std::size_t i = 0; i < kMaxWaiting; ++i) {
+    if (i % kMaxWaitingOfCaller == 0) clients.push_back(std::make_unique<ScriptedClient>());
+    ASSERT_EQ(clients.back()->call("manual_backup_start", "(uint32 1,)").reply, "(0,)") << i;
+  }
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").error_name, kTooMany);
+  records.pop_back();
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
 }
 
 TEST_F(Server, UnknownMethodIsAnErrorAndCancelsTheTerminateTimer) {

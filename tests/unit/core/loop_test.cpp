@@ -1,6 +1,7 @@
 #include "quarn_d_loop.h"
 
 #include <Ecore.h>
+#include <alloca.h>
 #include <fcntl.h>
 #include <glib-unix.h>
 #include <glib.h>
@@ -12,10 +13,13 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <fstream>
 #include <functional>
 #include <thread>
 
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
@@ -61,6 +65,21 @@ class Loop : public ::testing::Test {
     g_source_remove(deadline);
   }
 };
+
+/** Memory of this process that is in use. */
+std::size_t resident_bytes() {
+  std::ifstream statm("/proc/self/statm");
+  std::size_t total = 0;
+  std::size_t resident = 0;
+  statm >> total >> resident;
+  return resident * static_cast<std::size_t>(sysconf(_SC_PAGESIZE));
+}
+
+/** Write to that much of the stack. */
+void use_stack(std::size_t bytes) {
+  auto *const used = static_cast<volatile char *>(alloca(bytes));
+  for (std::size_t i = 0; i < bytes; i += 512) used[i] = 1;
+}
 
 TEST_F(Loop, RunsTimersOfBothLoops) {
   bool glib_fired = false;
@@ -182,45 +201,221 @@ TEST_F(Loop, ServesADescriptorThatNoFdSetHolds) {
   setrlimit(RLIMIT_NOFILE, &before);
 }
 
-TEST_F(Loop, DispatchedSourceMayRunANestedLoop) {
+TEST_F(Loop, DispatchedSourceMayWaitOnTheThreadsOwnStack) {
   std::vector<int> order;
-  const GMainLoopPtr nested(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr mark(new_wait_loop());
   on_main_loop([&] {
     order.push_back(1);
-    run_nested_loop(nested.get());
+    run_nested_loop(mark.get());
     order.push_back(3);
     quarn_loop_quit();
   });
   on_main_loop(
       [&] {
         order.push_back(2);
-        g_main_loop_quit(nested.get());
+        g_main_loop_quit(mark.get());
       },
       10);
   run();
   EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
 }
 
-TEST_F(Loop, NestedLoopInsideANestedLoopUnwindsInOrder) {
-  std::vector<int> order;
-  const GMainLoopPtr outer(g_main_loop_new(nullptr, FALSE));
-  const GMainLoopPtr inner(g_main_loop_new(nullptr, FALSE));
-  on_main_loop([&] {
-    run_nested_loop(outer.get());
-    order.push_back(2);
-    quarn_loop_quit();
+/** Wait on a fiber of its own, and say so when the wait is over. */
+void wait_on_fiber_for(GMainLoop *mark, Step then) {
+  run_on_fiber([mark, then = std::move(then)] {
+    run_nested_loop(mark);
+    then();
   });
-  on_main_loop(
-      [&] {
-        run_nested_loop(inner.get());
-        order.push_back(1);
+}
+
+TEST_F(Loop, EcoresTimersRunWhileARequestWaits) {
+  const GMainLoopPtr mark(new_wait_loop());
+  int fired = 0;
+  bool answered = false;
+  on_main_loop([&] {
+    wait_on_fiber_for(mark.get(), [&] {
+      answered = true;
+      quarn_loop_quit();
+    });
+    quarn_loop_timer_add(
+        kShort,
+        [](void *data) -> unsigned char {
+          ++*static_cast<int *>(data);
+          return 0;
+        },
+        &fired);
+  });
+  struct Watched {
+    int *fired;
+    GMainLoop *mark;
+  } watched{&fired, mark.get()};
+  // quit by nothing but the timer's having run
+  g_timeout_add(
+      1,
+      [](gpointer data) -> gboolean {
+        const auto *both = static_cast<Watched *>(data);
+        if (*both->fired == 0) return G_SOURCE_CONTINUE;
+        g_main_loop_quit(both->mark);
+        return G_SOURCE_REMOVE;
       },
-      1);
-  // The outer one is quit first and still waits for the inner one.
-  on_main_loop([&] { g_main_loop_quit(outer.get()); }, 10);
-  on_main_loop([&] { g_main_loop_quit(inner.get()); }, 20);
+      &watched);
+  run();
+  EXPECT_EQ(fired, 1);
+  EXPECT_TRUE(answered);
+}
+
+TEST_F(Loop, EachRequestIsAnsweredWhenItsOwnEventComes) {
+  constexpr std::size_t kRequests = 5;
+  std::vector<std::size_t> order;
+  std::vector<GMainLoopPtr> marks;
+  for (std::size_t i = 0; i < kRequests; ++i) marks.emplace_back(new_wait_loop());
+  const auto wait_for = [&](std::size_t i) {
+    wait_on_fiber_for(marks[i].get(), [&order, i] {
+      order.push_back(i);
+      if (order.size() == kRequests) quarn_loop_quit();
+    });
+  };
+  on_main_loop([&] {
+    for (std::size_t i = 0; i < kRequests; ++i) wait_for(i);
+  });
+  const std::vector<std::size_t> events{2, 0, 4, 1, 3};
+  std::size_t next = 0;
+  Step event = [&] {
+    g_main_loop_quit(marks[events[next]].get());
+    if (++next < kRequests) on_main_loop(event, 1);
+  };
+  on_main_loop(event, 1);
+  run();
+  EXPECT_EQ(order, events);
+}
+
+TEST_F(Loop, WhatIsQuitTogetherGoesOnInTheOrderOfItsWaiting) {
+  std::vector<int> order;
+  const GMainLoopPtr first(new_wait_loop());
+  const GMainLoopPtr second(new_wait_loop());
+  on_main_loop([&] {
+    wait_on_fiber_for(first.get(), [&] { order.push_back(1); });
+    wait_on_fiber_for(second.get(), [&] {
+      order.push_back(2);
+      quarn_loop_quit();
+    });
+    g_main_loop_quit(second.get());
+    g_main_loop_quit(first.get());
+  });
   run();
   EXPECT_EQ(order, (std::vector<int>{1, 2}));
+}
+
+TEST_F(Loop, AnEventThatComesBeforeTheWaitIsNotLost) {
+  std::vector<std::string> over;
+  on_main_loop([&] {
+    const GMainLoopPtr mark(new_wait_loop());
+    g_main_loop_quit(mark.get());
+    run_nested_loop(mark.get());
+    over.emplace_back("own stack");
+    run_on_fiber([&] {
+      run_nested_loop(mark.get());
+      over.emplace_back("fiber");
+    });
+    quarn_loop_quit();
+  });
+  run();
+  EXPECT_EQ(over, (std::vector<std::string>{"own stack", "fiber"}));
+}
+
+TEST_F(Loop, AnotherThreadEndsAWaitWheneverItQuits) {
+  constexpr int kRounds = 300;
+  int over = 0;
+  Step round = [&] {
+    run_on_fiber([&] {
+      const GMainLoopPtr mark(new_wait_loop());
+      std::thread other([&] { g_main_loop_quit(mark.get()); });
+      run_nested_loop(mark.get());
+      other.join();
+      if (++over == kRounds) {
+        quarn_loop_quit();
+      } else {
+        on_main_loop(round);
+      }
+    });
+  };
+  on_main_loop(round);
+  run();
+  EXPECT_EQ(over, kRounds);
+}
+
+TEST_F(Loop, AWithdrawnRequestWaitsNoLongerAndNeverAgain) {
+  const GMainLoopPtr mark(new_wait_loop());
+  const GMainLoopPtr other(new_wait_loop());
+  std::uint64_t number = 0;
+  int over = 0;
+  bool other_over = false;
+  on_main_loop([&] {
+    wait_on_fiber_for(other.get(), [&] { other_over = true; });
+    run_on_fiber([&] {
+      number = fiber_id(current_fiber());
+      EXPECT_FALSE(waits_are_ended());
+      run_nested_loop(mark.get());
+      EXPECT_TRUE(waits_are_ended());
+      EXPECT_NE(g_main_loop_is_running(mark.get()), FALSE) << "it was not answered";
+      ++over;
+      run_nested_loop(mark.get());
+      ++over;
+      quarn_loop_quit();
+    });
+    EXPECT_EQ(over, 0);
+    EXPECT_TRUE(withdraw_waits(number));
+    EXPECT_FALSE(withdraw_waits(number)) << "once";
+  });
+  run();
+  EXPECT_EQ(over, 2);
+  EXPECT_FALSE(other_over);
+  EXPECT_FALSE(waits_are_ended());
+  g_main_loop_quit(other.get());
+  while (!other_over) g_main_context_iteration(nullptr, FALSE);
+}
+
+TEST_F(Loop, WhatIsAnsweredAlreadyIsNotWithdrawn) {
+  const GMainLoopPtr mark(new_wait_loop());
+  std::uint64_t number = 0;
+  bool over = false;
+  on_main_loop([&] {
+    run_on_fiber([&] {
+      number = fiber_id(current_fiber());
+      run_nested_loop(mark.get());
+      EXPECT_FALSE(waits_are_ended());
+      over = true;
+      quarn_loop_quit();
+    });
+    g_main_loop_quit(mark.get());
+    EXPECT_FALSE(withdraw_waits(number));
+    EXPECT_FALSE(withdraw_waits(0));
+  });
+  run();
+  EXPECT_TRUE(over);
+  EXPECT_FALSE(withdraw_waits(number)) << "long gone";
+}
+
+TEST_F(Loop, FiveHundredWaitingRequestsTakeLittleMemory) {
+  constexpr std::size_t kRequests = 512;
+  constexpr std::size_t kBytesEach = 12288;
+  const std::size_t before = resident_bytes();
+  const GMainLoopPtr mark(new_wait_loop());
+  std::size_t over = 0;
+  on_main_loop([&] {
+    for (std::size_t i = 0; i < kRequests; ++i) {
+      run_on_fiber([&] {
+        use_stack(kFiberStackSize / 2);  // what went before the wait is given back
+        run_nested_loop(mark.get());
+        ++over;
+      });
+    }
+    EXPECT_LT(resident_bytes() - before, kRequests * kBytesEach);
+    g_main_loop_quit(mark.get());
+    on_main_loop([] { quarn_loop_quit(); }, 1);
+  });
+  run();
+  EXPECT_EQ(over, kRequests);
 }
 
 struct CountingSource {
@@ -290,8 +485,8 @@ TEST(LoopInit, PrintsNothing) {
 
 void end_nested_loops() {
   quarn_loop_init();
-  const GMainLoopPtr outer(g_main_loop_new(nullptr, FALSE));
-  const GMainLoopPtr inner(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr outer(new_wait_loop());
+  const GMainLoopPtr inner(new_wait_loop());
   on_main_loop([&] {
     on_main_loop([&] {
       on_main_loop([] { quit_nested_loops(); });
@@ -307,6 +502,33 @@ void end_nested_loops() {
   quarn_loop_begin();
   quarn_loop_shutdown();
   std::_Exit(3);
+}
+
+void end_waiting_fibers() {
+  quarn_loop_init();
+  const GMainLoopPtr mark(new_wait_loop());
+  on_main_loop([&] {
+    for (const char *name : {"first ", "second "}) {
+      run_on_fiber([&mark, name] {
+        run_nested_loop(mark.get());
+        std::fputs(name, stderr);
+        run_nested_loop(mark.get());
+        std::fputs("refused ", stderr);
+      });
+    }
+    quit_nested_loops();
+    std::fputs("nobody waits", stderr);
+    quarn_loop_quit();
+  });
+  quarn_loop_begin();
+  quarn_loop_shutdown();
+  std::_Exit(3);
+}
+
+TEST(QuitNestedLoopsDeathTest, EndsTheLongestWaitFirstAndReturnsWhenNobodyWaits) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(end_waiting_fibers(), ::testing::ExitedWithCode(3),
+              "first refused second refused nobody waits");
 }
 
 TEST(QuitNestedLoopsDeathTest, EndsTheInnermostFirstAndRefusesFurtherOnes) {
@@ -357,7 +579,7 @@ void signal_inside_a_nested_loop() {
     std::_Exit(1);
   }
   std::signal(SIGTERM, quarn_loop_wake_from_signal);
-  const GMainLoopPtr nested(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr nested(new_wait_loop());
   on_main_loop([&] {
     on_main_loop([] { raise(SIGTERM); });
     run_nested_loop(nested.get());

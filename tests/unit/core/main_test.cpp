@@ -13,6 +13,7 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
+#include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -119,8 +120,10 @@ void quarnd_dbus_deinit(unsigned int owner_id) {
   step("dbus_deinit");
 }
 void set_bus_acquired_hook(void (*hook)(GDBusConnection *)) { bus_acquired_hook = hook; }
-void quarnd_status_export(GDBusConnection *) {}
+void quarnd_status_export(GDBusConnection *) { step("status_export"); }
 void quarnd_status_unexport() { step("status_unexport"); }
+void quarnd_packages_export(GDBusConnection *) { step("packages_export"); }
+void quarnd_packages_unexport() { step("packages_unexport"); }
 void quarnd_progress_init() { step("progress_init"); }
 void init_backup_resource() { step("init_backup_resource"); }
 void deinit_backup_resource() { step("deinit_backup_resource"); }
@@ -206,6 +209,7 @@ TEST_F(Main, RunsItsStepsInOrder) {
                                      "end_requests",
                                      "deinit_backup_resource",
                                      "quarnd_dbus_deinit ~",
+                                     "packages_unexport",
                                      "status_unexport",
                                      "dbus_deinit",
                                      "ecore_shutdown ~",
@@ -273,8 +277,9 @@ TEST_F(Main, SignalTellsTheClientsTearsDownOnceAndEndsWithZero) {
   EXPECT_EQ(quarn_run(), 0);
   EXPECT_EQ(captured_texts(),
             (Texts{"end_requests", "quit_nested_loops", "loop_quit", "dbus_leave", "end_requests",
-                   "deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport",
-                   "dbus_deinit", "ecore_shutdown ~", "loop_shutdown", "Good-Bye from Quarn"}));
+                   "deinit_backup_resource", "quarnd_dbus_deinit ~", "packages_unexport",
+                   "status_unexport", "dbus_deinit", "ecore_shutdown ~", "loop_shutdown",
+                   "Good-Bye from Quarn"}));
 }
 
 TEST_F(Main, ProcessThatDoesNotEndTellsItsClientsLast) {
@@ -348,13 +353,14 @@ TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {
   ASSERT_NE(pending_probe, nullptr);
   ASSERT_NE(restore_disable, nullptr);
   ASSERT_NE(boot_recovery, nullptr);
-  EXPECT_EQ(bus_acquired_hook, quarnd_status_export);
+  ASSERT_NE(bus_acquired_hook, nullptr);
   EXPECT_EQ(wifi_probe(), 1);
   EXPECT_TRUE(pending_probe());
   restart();
   EXPECT_EQ(restore_disable(), 0);
   boot_recovery();
-  EXPECT_EQ(steps, (Texts{"restore_off", "recovery"}));
+  bus_acquired_hook(nullptr);
+  EXPECT_EQ(steps, (Texts{"restore_off", "recovery", "status_export", "packages_export"}));
 }
 
 }  // namespace

@@ -3,9 +3,15 @@
 
 #include <cstring>
 #include <filesystem>
+#include <thread>
 
 #include "handler_fixture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/cancel_own.h"
+#include "quarn_d_utils/admission.h"
+#include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 
 using ::testing::_;
 using ::testing::Return;
@@ -232,13 +238,19 @@ TEST_F(AppDataTest, ABackupWithoutDeviceInformationIsAnsweredWithFortyTwo) {
   expect_error("cannot get device info");
 }
 
+// In a process of its own: from then on nothing waits any more.
 TEST_F(AppDataTest, ABackupIsCancelledWhenTheDaemonEnds) {
   make_old_data();
-  outside.ending = true;
-  EXPECT_EQ(back_up(), 0);
-  EXPECT_EQ(outside.answers, backed_up(17));
-  answer_upload();  // comes too late, and finds everything it needs
-  EXPECT_EQ(outside.answers.size(), 1U);
+  EXPECT_EXIT(
+      {
+        run_on_fiber([this] { back_up(); });
+        const bool waited = outside.answers.empty();
+        quit_nested_loops();
+        const bool told = outside.answers == backed_up(17);
+        answer_upload();  // comes too late, and finds everything it needs
+        _exit(waited && told && outside.answers.size() == 1 ? 0 : 1);
+      },
+      ::testing::ExitedWithCode(0), "");
 }
 
 /* ---- restore ---- */
@@ -317,32 +329,163 @@ TEST_F(AppDataTest, ARestoreInTheCompanionsModeDoesNotWait) {
   EXPECT_TRUE(downloads.empty());
 }
 
-TEST_F(AppDataTest, TwoRestoresOfOnePackageAreAnsweredOneByOne) {
+TEST_F(AppDataTest, TwoRestoresOfOnePackageAreAnsweredInTheirOrder) {
   make_old_data();
-  later([this] {
-    later([this] {
-      make_archive(download(), new_data, "not json");
-      answer();
-      write_text(download(), "not an archive");
-      answer();
-    });
-    EXPECT_EQ(restore(), 0);
-  });
-  EXPECT_EQ(restore(), 0);
+  run_on_fiber([this] { quarnd_restore_app_data(kPkg, make_record(1)); });
+  run_on_fiber([this] { quarnd_restore_app_data(kPkg, make_record(2)); });
+  make_archive(download(), new_data, "not json");
+  answer();
+  run_main_context();
+  ASSERT_EQ(outside.answers.size(), 1U) << "its own event has come";
+  EXPECT_EQ(outside.answers[0].req_id, 1U);
+  EXPECT_EQ(outside.answers[0].err, 36);
+  write_text(download(), "not an archive");
+  answer();
+  run_main_context();
   ASSERT_EQ(outside.answers.size(), 2U);
-  EXPECT_EQ(outside.answers[0].err, 31) << "the inner request";
-  EXPECT_EQ(outside.answers[1].err, 36);
+  EXPECT_EQ(outside.answers[1].req_id, 2U);
+  EXPECT_EQ(outside.answers[1].err, 31);
 }
 
 TEST_F(AppDataTest, ARestoreIsCancelledWhenTheDaemonEnds) {
   make_old_data();
+  EXPECT_EXIT(
+      {
+        const Tree before = tree_of(root);
+        run_on_fiber([this] { restore(); });
+        quit_nested_loops();
+        const bool told = outside.answers == restored(17);
+        answer(BACKUP_TRANS_ERROR_CANCELLED);
+        _exit(told && outside.answers.size() == 1 && tree_of(root) == before ? 0 : 1);
+      },
+      ::testing::ExitedWithCode(0), "");
+}
+
+/* ---- withdrawn ---- */
+
+/** Requests of one client that wait, and another's beside them. */
+class Withdrawn : public BothRequests {
+ protected:
+  static constexpr char kOwn[] = ":1.7";
+  static constexpr char kOther[] = ":1.8";
+
+  Withdrawn() { make_old_data(); }
+
+  void start_on_fiber(const char *sender, unsigned int req_id) {
+    run_on_fiber([this, sender, req_id] {
+      replies.push_back(GetParam().start(kPkg, make_record(req_id, sender)));
+    });
+  }
+  void session_waits() {
+    session.meanwhile = [this] {
+      mark.reset(new_wait_loop());
+      run_nested_loop(mark.get());
+      session.ready = !waits_are_ended();
+    };
+  }
+  /** The transfer that is under way, done. */
+  void let_it_end(bool newly_installed = true) {
+    if (!uploads.empty()) {
+      answer_upload();
+    } else {
+      answer_with_archive(newly_installed);
+    }
+    run_main_context();
+  }
+  void answer_with_archive(bool newly_installed = true) {
+    if (newly_installed) clear_app_dir(kPkg, root.c_str());
+    make_archive(download(), new_data);
+    answer();
+  }
+  bool transfers() const { return !uploads.empty() || !downloads.empty(); }
+
+  std::vector<int> replies;
+  GMainLoopPtr mark;
+};
+
+TEST_P(Withdrawn, WhileTheSessionStarts) {
+  session_waits();
+  start_on_fiber(kOwn, 7);
+  EXPECT_EQ(quarnd_cancel_own(kOther), 0U);
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 0U);
+  EXPECT_TRUE(outside.answers.empty()) << "the caller has its reply first";
+  run_main_context();
+  EXPECT_EQ(outside.answers, answered(17));
+  EXPECT_EQ(replies, std::vector<int>{0});
+  expect_no_transfer();
+  EXPECT_EQ(waiting_requests(), 0U);
+}
+
+TEST_P(Withdrawn, WhileItsTransferRuns) {
   const Tree before = tree_of(root);
-  outside.ending = true;
-  EXPECT_EQ(restore(), 0);
-  EXPECT_EQ(outside.answers, restored(17));
-  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  start_on_fiber(kOwn, 7);
+  ASSERT_TRUE(transfers());
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
+  run_main_context();
+  EXPECT_EQ(outside.answers, answered(17));
+  EXPECT_EQ(replies, std::vector<int>{0});
+  let_it_end(false);
   EXPECT_EQ(outside.answers.size(), 1U);
-  EXPECT_EQ(tree_of(root), before);
+  EXPECT_EQ(tree_of(root), before) << "what comes too late changes nothing";
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_P(Withdrawn, WhileItWaitsForAnothersRequest) {
+  start_on_fiber(kOther, 8);
+  start_on_fiber(kOwn, 7);
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
+  run_main_context();
+  EXPECT_EQ(outside.answers, answered(17));
+  let_it_end();
+  ASSERT_EQ(outside.answers.size(), 2U);
+  EXPECT_EQ(outside.answers[1].req_id, 8U);
+  EXPECT_EQ(outside.answers[1].err, 0) << "nobody else's";
+  EXPECT_FALSE(transfers()) << "the withdrawn one does not begin";
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_P(Withdrawn, WhatHasEndedIsNot) {
+  start_on_fiber(kOwn, 7);
+  if (uploads.empty()) {
+    answer_with_archive();
+  } else {
+    answer_upload();
+  }
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 0U) << "it is about to be told of its success";
+  run_main_context();
+  EXPECT_EQ(outside.answers, answered(0));
+}
+
+TEST_P(Withdrawn, AllOfOneClient) {
+  for (unsigned int request = 1; request <= 3; ++request) start_on_fiber(kOwn, request);
+  start_on_fiber(kOther, 8);
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 3U);
+  run_main_context();
+  EXPECT_EQ(outside.answers.size(), 3U);
+  for (const auto &told : outside.answers) EXPECT_EQ(told.err, 17);
+  while (transfers()) let_it_end();
+  ASSERT_EQ(outside.answers.size(), 4U);
+  EXPECT_EQ(outside.answers[3].req_id, 8U);
+  EXPECT_EQ(outside.answers[3].err, 0);
+  EXPECT_EQ(waiting_requests(), 0U);
+}
+
+INSTANTIATE_TEST_SUITE_P(AppData, Withdrawn, ::testing::Values(kBackup, kRestore),
+                         [](const auto &info) {
+                           return std::string(info.index == 0 ? "Backup" : "Restore");
+                         });
+
+TEST_F(AppDataTest, AnUploadThatIsAnsweredByAnotherThreadAtOnceIsNotWaitedForForEver) {
+  make_old_data();
+  ON_CALL(transport, backup_trans_upload_file_ors_async)
+      .WillByDefault(
+          [](auto, auto, auto, backup_trans_upload_cb callback, auto, auto, void *data, auto) {
+            std::thread([=] { callback(BACKUP_TRANS_ERROR_NONE, data, nullptr); }).join();
+            return 0;
+          });
+  EXPECT_EQ(back_up(), 0);
+  EXPECT_EQ(outside.answers, backed_up(0));
 }
 
 TEST_F(AppDataTest, WhatADeadDaemonLeftIsPutBackWhenTheRestoreIsRequested) {

@@ -1,6 +1,10 @@
 #include <cstring>
 
 #include "handler_fixture.h"
+#include "quarn_d_handler/cancel_own.h"
+#include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 
 using ::testing::_;
 using ::testing::Return;
@@ -227,12 +231,59 @@ TEST_F(RestoreModeTest, TheKeptClientIsToldThatTheModeIsOver) {
   EXPECT_EQ(g_restore_cb_data, nullptr);
 }
 
-TEST_F(RestoreModeTest, SwitchingOnAgainKeepsTheLaterClientOnly) {
+TEST_F(RestoreModeTest, SwitchingOnAgainEndsTheEarlierClientsMessages) {
   EXPECT_EQ(on(0, kSerial, kList, 1), 0);
   EXPECT_EQ(on(0, kSerial, kList, 2), 0);
+  run_main_context();
+  EXPECT_EQ(outside.answers, Answers{stop(1)});
   EXPECT_EQ(off(), 0);
   run_main_context();
-  EXPECT_EQ(outside.answers, Answers{stop(2)});
+  EXPECT_EQ(outside.answers, (Answers{stop(1), stop(2)}));
+}
+
+TEST_F(RestoreModeTest, TheCompanionsModeEndsTheCloudClientsMessages) {
+  EXPECT_EQ(on(0, kSerial, kList, 1), 0);
+  EXPECT_EQ(on(1, "", kList, 2), 0);
+  run_main_context();
+  EXPECT_EQ(outside.answers, Answers{stop(1)});
+}
+
+TEST_F(RestoreModeTest, ARequestThatIsReplacedWhileItWaitsHasItsEndAsWell) {
+  session.meanwhile = [&] { EXPECT_EQ(off(), 0); };
+  EXPECT_EQ(on(0, kSerial, kList, 1), 0);
+  run_main_context();
+  EXPECT_EQ(outside.answers, Answers{stop(1)});
+}
+
+TEST_F(RestoreModeTest, ItsClientMayWithdrawTheModeAndNobodyElse) {
+  EXPECT_EQ(on(0, kSerial, kList, 1), 0);
+  EXPECT_EQ(quarnd_cancel_own(":1.8"), 0U);
+  EXPECT_EQ(cloud_restore_running, 1);
+  EXPECT_EQ(quarnd_cancel_own(":1.7"), 1U);
+  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(quarnd_cancel_own(":1.7"), 0U);
+  run_main_context();
+  EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
+}
+
+TEST_F(RestoreModeTest, AWithdrawnRequestDoesNotSwitchTheModeOn) {
+  session.ready = false;
+  int reply = -1;
+  run_on_fiber([&] {
+    const std::uint64_t own = fiber_id(current_fiber());
+    session.meanwhile = [this, own] {
+      const GMainLoopPtr answer(new_wait_loop());
+      later([own] { EXPECT_TRUE(withdraw_waits(own)); });
+      run_nested_loop(answer.get());
+    };
+    reply = on(0, kSerial, kList, 1);
+  });
+  run_main_context();
+  EXPECT_EQ(reply, 17);
+  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_TRUE(pkg_list_to_be_restored.empty());
+  EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
+  EXPECT_TRUE(is_idle_status());
 }
 
 TEST_F(RestoreModeTest, AListThatRunsEmptyEndsTheMode) {

@@ -6,6 +6,9 @@
 #include <fstream>
 #include <thread>
 
+#include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "restore_fixture.h"
 
 using ::testing::_;
@@ -41,6 +44,14 @@ class PipelineTest : public RestoreTest {
       shown.emplace_back(id);
       return 0;
     });
+  }
+  ~PipelineTest() override { stop_wifi_monitor(); }
+  void connect_to_wifi() {
+    ON_CALL(platform, connection_get_type).WillByDefault([](auto, auto *type) {
+      *type = CONNECTION_TYPE_WIFI;
+      return 0;
+    });
+    EXPECT_EQ(start_wifi_monitor(), 1);
   }
   int restore(pkg_restore_context *ctx) { return restore_app_data("app", ctx); }
   /** A context that the test keeps, as a waiting request does. */
@@ -221,7 +232,7 @@ TEST_F(PipelineTest, AMonitoredRestoreShowsTheIconAndFreesItsContext) {
 
 TEST_F(PipelineTest, AWaitingRequestGetsItsLoopQuitAndKeepsTheContext) {
   auto ctx = waiting_context();
-  const GMainLoopPtr loop(g_main_loop_new(nullptr, FALSE));
+  const GMainLoopPtr loop(new_wait_loop());
   ASSERT_EQ(restore(ctx.get()), 0);
   ctx->main_loop = g_main_loop_ref(loop.get());
   auto then = [this] { answer(BACKUP_TRANS_ERROR_NETWORK); };
@@ -231,7 +242,7 @@ TEST_F(PipelineTest, AWaitingRequestGetsItsLoopQuitAndKeepsTheContext) {
         return static_cast<gboolean>(G_SOURCE_REMOVE);
       },
       &then);
-  g_main_loop_run(loop.get());
+  run_nested_loop(loop.get());
   EXPECT_EQ(ctx->main_loop, nullptr);
   EXPECT_EQ(ctx->result, 12);
   EXPECT_TRUE(shown.empty());
@@ -244,6 +255,56 @@ TEST_F(PipelineTest, AnAbandonedContextIsFreedByTheEngine) {
   static_cast<void>(ctx.release());
   answer(BACKUP_TRANS_ERROR_NETWORK);
   EXPECT_TRUE(shown.empty());
+}
+
+TEST_F(PipelineTest, AnAbandonedRestoreLeavesTheDataAsItIs) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  ctx->abandoned = true;
+  static_cast<void>(ctx.release());
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(tree_of(root), before);
+  EXPECT_FALSE(exists(download()));
+  expect_info("restore of (org.example.notes) was cancelled");
+}
+
+TEST_F(PipelineTest, ADownloadAbortedForAnothersSakeIsBegunAgain) {
+  connect_to_wifi();
+  make_old_data();
+  pkg_restore_context *ctx = new_context();
+  ASSERT_EQ(restore(ctx), 0);
+  for (int i = 0; i < 3; ++i) {
+    answer(BACKUP_TRANS_ERROR_CANCELLED);
+    ASSERT_EQ(downloads.size(), 1U) << "it goes on";
+    EXPECT_TRUE(shown.empty());
+  }
+  expect_info("download of (org.example.notes) was aborted with others, so it is requested again",
+              3);
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  EXPECT_EQ(shown, std::vector<std::string>{kPkg});
+}
+
+TEST_F(PipelineTest, ADownloadThatIsAbortedAgainAndAgainEnds) {
+  connect_to_wifi();
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  int requested = 1;
+  for (; !downloads.empty(); ++requested) answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_EQ(requested, 10);
+  EXPECT_EQ(ctx->result, 12);
+}
+
+TEST_F(PipelineTest, WithoutWifiAnAbortedDownloadIsNotBegunAgain) {
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_TRUE(downloads.empty());
+  EXPECT_EQ(ctx->result, 12);
 }
 
 TEST_F(PipelineTest, OutstandingDownloadsAreCountedPerPackage) {

@@ -1,3 +1,4 @@
+#include "quarn_d_restore/restore_record.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -42,12 +43,33 @@ TEST_F(ReportTest, TheEndWaitsForTheRestoresThatAreUnderWay) {
   EXPECT_EQ(outside.answers, Answers{stop(3)});
 }
 
-TEST_F(ReportTest, ALaterRecordReplacesTheEarlierWithoutACallback) {
+TEST_F(ReportTest, AnEarlierRecordHasItsEndWhenALaterOneReplacesIt) {
   keep_restore_record(make_record(3));
+  keep_restore_record(make_record(4));
+  EXPECT_TRUE(outside.answers.empty()) << "not inside the call";
+  EXPECT_TRUE(restore_report_pending());
+  run_main_context();
+  EXPECT_EQ(outside.answers, Answers{stop(3)});
+  EXPECT_FALSE(restore_report_pending());
+  end_restore_report();
+  run_main_context();
+  EXPECT_EQ(outside.answers, (Answers{stop(3), stop(4)}));
+}
+
+TEST_F(ReportTest, AWithdrawnModeEndsWithItsReason) {
+  keep_restore_record(make_record(3));
+  EXPECT_TRUE(restore_record_is_of(":1.7"));
+  EXPECT_FALSE(restore_record_is_of(":1.70"));
+  count_outstanding_restore(1);
+  set_restore_stop_result(17);
+  end_restore_report();
+  count_outstanding_restore(-1);
+  EXPECT_FALSE(restore_record_is_of(":1.7"));
   keep_restore_record(make_record(4));
   end_restore_report();
   run_main_context();
-  EXPECT_EQ(outside.answers, Answers{stop(4)});
+  EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 3}, stop(4)}))
+      << "the reason is of that one alone";
 }
 
 TEST_F(ReportTest, AClientWhoseModeIsOverGetsItsEndBeforeItIsReplaced) {

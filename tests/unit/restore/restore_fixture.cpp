@@ -25,6 +25,7 @@
 #include "quarn_common.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_utils/admission.h"
 #include "quarn_dbus_client.h"
 
 using ::testing::_;
@@ -156,11 +157,9 @@ void request_quarn_terminate(double delay, bool restart) {
   outside.terminations.emplace_back(delay, restart);
 }
 
-void run_nested_loop(GMainLoop *loop) {
-  if (!outside.ending) g_main_loop_run(loop);
+void *make_record(unsigned int req_id, const std::string &sender) {
+  return new client_cb_data{req_id, sender, count_waiting(sender)};
 }
-
-void *make_record(unsigned int req_id) { return new client_cb_data{req_id, ":1.7"}; }
 
 void run_main_context() {
   while (g_main_context_iteration(nullptr, FALSE)) {

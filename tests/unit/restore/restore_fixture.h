@@ -65,12 +65,11 @@ struct Outside {
   };
   std::vector<Answer> answers;
   std::vector<std::pair<double, bool>> terminations;
-  bool ending = false; /**< the daemon ends: no nested loop runs any more */
 };
 extern Outside outside;
 
-/** A client_cb_data record. */
-void *make_record(unsigned int req_id);
+/** A client_cb_data record, counted as the dispatcher does. */
+void *make_record(unsigned int req_id, const std::string &sender = ":1.7");
 
 /** Run everything that is ready on the main context. */
 void run_main_context();

@@ -1,0 +1,24 @@
+#include "quarn_d_handler/cancel_own.h"
+
+#include "quarn_common.h"
+#include "quarn_d_backup/cancel.h"
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/restore_record.h"
+#include "quarn_d_utils/admission.h"
+#include "quarn_d_utils/nested_loop.h"
+#include "quarn_log.h"
+
+std::uint32_t quarnd_cancel_own(const std::string &sender) {
+  std::uint32_t count = cancel_backups_of(sender);
+  for (const std::uint64_t fiber : fibers_of_caller(sender)) {
+    if (withdraw_waits(fiber)) ++count;
+  }
+  const bool mode_on = pellix_restore_running != 0 || cloud_restore_running != 0;
+  if (mode_on && restore_record_is_of(sender)) {
+    set_restore_stop_result(QUARN_CANCELLED);
+    quarnd_restore_enable(0, 0, "", "", nullptr);
+    ++count;
+  }
+  LOGI("%u requests of (%s) are withdrawn", count, sender.c_str());
+  return count;
+}

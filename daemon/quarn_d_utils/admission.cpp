@@ -1,0 +1,70 @@
+#include "quarn_d_utils/admission.h"
+
+#include <map>
+#include <mutex>
+#include <set>
+
+#include "quarn_d_utils/fiber.h"
+
+namespace {
+
+struct waiting_table {
+  std::mutex mutex;
+  std::size_t count = 0;
+  /** By caller, the numbers of the fibers; 0 for a request that came without one. */
+  std::map<std::string, std::multiset<std::uint64_t>> callers;
+};
+
+waiting_table &table() {
+  // never destroyed: the worker may outlive main()
+  static auto *made = new waiting_table;
+  return *made;
+}
+
+class counted_request {
+ public:
+  explicit counted_request(const std::string &caller)
+      : caller_(caller), fiber_(fiber_id(current_fiber())) {
+    const std::lock_guard<std::mutex> lock(table().mutex);
+    table().callers[caller_].insert(fiber_);
+    ++table().count;
+  }
+  ~counted_request() {
+    const std::lock_guard<std::mutex> lock(table().mutex);
+    const auto entry = table().callers.find(caller_);
+    entry->second.erase(entry->second.find(fiber_));
+    if (entry->second.empty()) table().callers.erase(entry);
+    --table().count;
+  }
+  counted_request(const counted_request &) = delete;
+  counted_request &operator=(const counted_request &) = delete;
+
+ private:
+  const std::string caller_;
+  const std::uint64_t fiber_;
+};
+
+}  // namespace
+
+bool may_wait(const std::string &caller) {
+  const std::lock_guard<std::mutex> lock(table().mutex);
+  const auto entry = table().callers.find(caller);
+  const std::size_t own = entry == table().callers.end() ? 0 : entry->second.size();
+  return own < kMaxWaitingOfCaller && table().count < kMaxWaiting;
+}
+
+std::shared_ptr<const void> count_waiting(const std::string &caller) {
+  return std::make_shared<counted_request>(caller);
+}
+
+std::size_t waiting_requests() {
+  const std::lock_guard<std::mutex> lock(table().mutex);
+  return table().count;
+}
+
+std::vector<std::uint64_t> fibers_of_caller(const std::string &caller) {
+  const std::lock_guard<std::mutex> lock(table().mutex);
+  const auto entry = table().callers.find(caller);
+  if (entry == table().callers.end()) return {};
+  return {entry->second.begin(), entry->second.end()};
+}

@@ -1,0 +1,117 @@
+#include "quarn_d_packages.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "log_capture.h"
+#include "private_bus.h"
+#include "quarn_d_handler/cancel_own.h"
+#include "quarn_d_lifecycle.h"
+
+namespace {
+
+/** What the object did, in order. */
+std::vector<std::string> steps;
+std::uint32_t withdrawn = 0;
+
+}  // namespace
+
+void cancel_quarn_terminate() { steps.emplace_back("cancel"); }
+std::uint32_t quarnd_cancel_own(const std::string &sender) {
+  steps.push_back(sender);
+  return withdrawn;
+}
+
+namespace {
+
+class Packages : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    private_bus_address();
+    steps.clear();
+    clear_captured_log();
+    connection_ = connect_to_private_bus();
+    client_ = connect_to_private_bus();
+    quarnd_packages_export(connection_.get());
+  }
+  void TearDown() override { quarnd_packages_unexport(); }
+
+  struct Outcome {
+    bool finished = false;
+    std::string text;
+  };
+
+  /** Call the object from the other connection. @return the printed reply, or the error's name */
+  std::string call(const char *method) {
+    Outcome outcome;
+    g_dbus_connection_call(
+        client_.get(), g_dbus_connection_get_unique_name(connection_.get()), kPackagesObjectPath,
+        "org.orvane.Quarn.Packages", method, nullptr, nullptr, G_DBUS_CALL_FLAGS_NONE, -1, nullptr,
+        [](GObject *source, GAsyncResult *result, gpointer data) {
+          auto *into = static_cast<Outcome *>(data);
+          GErrorPtr error;
+          const GVariantPtr reply(
+              g_dbus_connection_call_finish(G_DBUS_CONNECTION(source), result, out(error)));
+          const GString_ text(reply ? g_variant_print(reply.get(), FALSE)
+                                    : g_dbus_error_get_remote_error(error.get()));
+          into->text = text.get();
+          into->finished = true;
+        },
+        &outcome);
+    EXPECT_TRUE(run_until([&outcome] { return outcome.finished; }));
+    return outcome.text;
+  }
+
+  ConnectionHandle connection_;
+  ConnectionHandle client_;
+};
+
+TEST_F(Packages, CancelOwnWithdrawsForTheCallerAndSaysHowMany) {
+  withdrawn = 3;
+  EXPECT_EQ(call("CancelOwn"), "(3,)");
+  EXPECT_EQ(steps,
+            (std::vector<std::string>{"cancel", g_dbus_connection_get_unique_name(client_.get())}));
+}
+
+TEST_F(Packages, OtherMethodsAreUnknown) {
+  EXPECT_EQ(call("CancelAll"), "org.freedesktop.DBus.Error.UnknownMethod");
+  EXPECT_TRUE(steps.empty());
+}
+
+TEST_F(Packages, IsServedNoLongerOnceTakenBack) {
+  quarnd_packages_unexport();
+  EXPECT_EQ(call("CancelOwn"), "org.freedesktop.DBus.Error.UnknownMethod");
+  quarnd_packages_unexport();
+}
+
+TEST_F(Packages, AnObjectThatIsServedAlreadyIsLogged) {
+  quarnd_packages_export(connection_.get());
+  EXPECT_FALSE(captured_texts().empty());
+  EXPECT_EQ(captured_texts().back().rfind("packages object is not available: ", 0), 0U);
+}
+
+/** The signature of each method and argument. */
+std::string interface_text(const char *xml) {
+  GErrorPtr error;
+  GDBusNodeInfo *node = g_dbus_node_info_new_for_xml(xml, out(error));
+  EXPECT_NE(node, nullptr);
+  if (node == nullptr) return "";
+  GString *text = g_string_new(nullptr);
+  g_dbus_node_info_generate_xml(node, 0, text);
+  g_dbus_node_info_unref(node);
+  const GString_ owned(g_string_free(text, FALSE));
+  return owned.get();
+}
+
+TEST(PackagesDocument, IsTheOneThatIsInstalled) {
+  std::ifstream file(QUARN_PACKAGES_FILE);
+  std::stringstream installed;
+  installed << file.rdbuf();
+  EXPECT_EQ(interface_text(installed.str().c_str()), interface_text(kPackagesIntrospection));
+}
+
+}  // namespace
