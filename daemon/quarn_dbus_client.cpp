@@ -211,8 +211,10 @@ void on_flushed(GObject *connection, GAsyncResult *result, gpointer data) {
 }  // namespace
 
 void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void *record) {
+  const auto *data = static_cast<const client_cb_data *>(record);
   const std::lock_guard<std::mutex> lock(requests_mutex);
-  requests[record] = {kind, text, *static_cast<const client_cb_data *>(record)};
+  // The copy does not count among those that wait.
+  requests[record] = {kind, text, {data->req_id, data->sender}};
 }
 
 void quarn_dbus_stop_waiting() {

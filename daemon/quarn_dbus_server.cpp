@@ -324,7 +324,7 @@ void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *p
   const char *pkg_id = nullptr;
   g_variant_get(parameters, "(&s)", &pkg_id);
   guint32 uid = 0;
-  if (waits_are_ended()) {
+  if (quarn_dbus_waiting_stopped() || waits_are_ended()) {
     call.reply_int(QUARN_CANCELLED);
     return;
   }
