@@ -49,7 +49,9 @@ constexpr char kMountsFile[] = "run/tmp-mounts";
 constexpr char kRestartsFile[] = "run/restarts";
 /** The supervisor keeps the host's own /tmp open under this number. */
 constexpr int kHostTmpFd = 100;
-constexpr int kStopSeconds = 10;
+/** A daemon that is told to end tells its clients first; a stop waits longer than it for that. */
+constexpr int kDaemonSeconds = 8;
+constexpr int kStopSeconds = 12;
 constexpr int kStartMilliseconds = 20000;
 constexpr int kMillisInSecond = 1000;
 constexpr char kReady = 'R';
@@ -377,7 +379,8 @@ void stop_daemon(Running *self) {
   kill(static_cast<pid_t>(pid), SIGTERM);
   if (process.fd < 0) return;
   pollfd ended{process.fd, POLLIN, 0};
-  if (poll(&ended, 1, 3 * kMillisInSecond) == 0) kill(static_cast<pid_t>(pid), SIGKILL);
+  if (poll(&ended, 1, kDaemonSeconds * kMillisInSecond) == 0)
+    kill(static_cast<pid_t>(pid), SIGKILL);
 }
 
 [[noreturn]] void supervise(const std::string &device, int tell) {
@@ -616,6 +619,7 @@ int verb_start(const Arguments &arguments) {
   }
   end_leftovers(device, "");
   forget_tmp_entries(device);
+  embedded::sweep_state(device);
   unlink((device + "/" + kRestartsFile).c_str());
   const Fd told(fork_supervisor(device));
   const std::string answer = read_all(told.fd);
