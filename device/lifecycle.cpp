@@ -383,7 +383,8 @@ void stop_daemon(Running *self) {
     kill(static_cast<pid_t>(pid), SIGKILL);
 }
 
-[[noreturn]] void supervise(const std::string &device, int tell) {
+/** @param lock of the start, held until the supervisor can be found: a start may be killed */
+[[noreturn]] void supervise(const std::string &device, int tell, int lock) {
   int status = DEVICE_FAILED;
   try {
     signal(SIGHUP, SIG_IGN);
@@ -396,6 +397,7 @@ void stop_daemon(Running *self) {
     self.bus = start_bus(device);
     write_file(device + "/" + kSupervisorFile, std::to_string(getpid()) + " " + birth_of(getpid()) +
                                                    " " + (self.own_namespace ? "1" : "0") + "\n");
+    close(lock);
     // From here on GLib may have threads of its own.
     self.connection = connect_bus(device);
     GVariant *hello = call_bus(self.connection.get(), "GetId", nullptr, nullptr);
@@ -514,12 +516,14 @@ class StartLock {
     }
   }
 
+  int fd() const { return lock_.fd; }
+
  private:
   Fd lock_;
 };
 
 /** Fork the supervisor. @return the end of the pipe on which it tells how it went */
-int fork_supervisor(const std::string &device) {
+int fork_supervisor(const std::string &device, int lock) {
   int tell[2];
   if (pipe2(tell, O_CLOEXEC) != 0) throw Failure("cannot make a pipe: " + reason());
   const pid_t child = fork();
@@ -535,10 +539,10 @@ int fork_supervisor(const std::string &device) {
     dup2(log, STDERR_FILENO);
     // Whoever started us may wait for its pipes to close, or hold locks that must not live on.
     for (int fd = 3; fd < 256; ++fd) {
-      if (fd != tell[1]) close(fd);
+      if (fd != tell[1] && fd != lock) close(fd);
     }
     if (chdir("/") != 0) _exit(1);
-    supervise(device, tell[1]);
+    supervise(device, tell[1], lock);
   }
   close(tell[1]);
   waitpid(child, nullptr, 0);
@@ -621,7 +625,7 @@ int verb_start(const Arguments &arguments) {
   forget_tmp_entries(device);
   embedded::sweep_state(device);
   unlink((device + "/" + kRestartsFile).c_str());
-  const Fd told(fork_supervisor(device));
+  const Fd told(fork_supervisor(device, lock.fd()));
   const std::string answer = read_all(told.fd);
   if (answer.empty() || answer[0] != kReady) {
     end_leftovers(device, "");
