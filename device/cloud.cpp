@@ -220,7 +220,8 @@ void check_cloud_url(const std::string &url) {
 }
 
 void write_cloud(const std::string &device, const Cloud &cloud) {
-  if (!embedded::write_state_text(device, kCloudFile, text_of(cloud), kPrivateFile)) {
+  const embedded::StateLock lock(device);
+  if (!lock || !embedded::write_state_text(device, kCloudFile, text_of(cloud), kPrivateFile)) {
     throw Failure("cannot write the cloud's configuration: " + reason());
   }
 }

@@ -49,7 +49,9 @@ constexpr char kMountsFile[] = "run/tmp-mounts";
 constexpr char kRestartsFile[] = "run/restarts";
 /** The supervisor keeps the host's own /tmp open under this number. */
 constexpr int kHostTmpFd = 100;
-constexpr int kStopSeconds = 10;
+/** A daemon that is told to end tells its clients first; a stop waits longer than it for that. */
+constexpr int kDaemonSeconds = 8;
+constexpr int kStopSeconds = 12;
 constexpr int kStartMilliseconds = 20000;
 constexpr int kMillisInSecond = 1000;
 constexpr char kReady = 'R';
@@ -377,10 +379,12 @@ void stop_daemon(Running *self) {
   kill(static_cast<pid_t>(pid), SIGTERM);
   if (process.fd < 0) return;
   pollfd ended{process.fd, POLLIN, 0};
-  if (poll(&ended, 1, 3 * kMillisInSecond) == 0) kill(static_cast<pid_t>(pid), SIGKILL);
+  if (poll(&ended, 1, kDaemonSeconds * kMillisInSecond) == 0)
+    kill(static_cast<pid_t>(pid), SIGKILL);
 }
 
-[[noreturn]] void supervise(const std::string &device, int tell) {
+/** @param lock of the start, held until the supervisor can be found: a start may be killed */
+[[noreturn]] void supervise(const std::string &device, int tell, int lock) {
   int status = DEVICE_FAILED;
   try {
     signal(SIGHUP, SIG_IGN);
@@ -393,6 +397,7 @@ void stop_daemon(Running *self) {
     self.bus = start_bus(device);
     write_file(device + "/" + kSupervisorFile, std::to_string(getpid()) + " " + birth_of(getpid()) +
                                                    " " + (self.own_namespace ? "1" : "0") + "\n");
+    close(lock);
     // From here on GLib may have threads of its own.
     self.connection = connect_bus(device);
     GVariant *hello = call_bus(self.connection.get(), "GetId", nullptr, nullptr);
@@ -511,12 +516,14 @@ class StartLock {
     }
   }
 
+  int fd() const { return lock_.fd; }
+
  private:
   Fd lock_;
 };
 
 /** Fork the supervisor. @return the end of the pipe on which it tells how it went */
-int fork_supervisor(const std::string &device) {
+int fork_supervisor(const std::string &device, int lock) {
   int tell[2];
   if (pipe2(tell, O_CLOEXEC) != 0) throw Failure("cannot make a pipe: " + reason());
   const pid_t child = fork();
@@ -532,10 +539,10 @@ int fork_supervisor(const std::string &device) {
     dup2(log, STDERR_FILENO);
     // Whoever started us may wait for its pipes to close, or hold locks that must not live on.
     for (int fd = 3; fd < 256; ++fd) {
-      if (fd != tell[1]) close(fd);
+      if (fd != tell[1] && fd != lock) close(fd);
     }
     if (chdir("/") != 0) _exit(1);
-    supervise(device, tell[1]);
+    supervise(device, tell[1], lock);
   }
   close(tell[1]);
   waitpid(child, nullptr, 0);
@@ -616,8 +623,9 @@ int verb_start(const Arguments &arguments) {
   }
   end_leftovers(device, "");
   forget_tmp_entries(device);
+  embedded::sweep_state(device);
   unlink((device + "/" + kRestartsFile).c_str());
-  const Fd told(fork_supervisor(device));
+  const Fd told(fork_supervisor(device, lock.fd()));
   const std::string answer = read_all(told.fd);
   if (answer.empty() || answer[0] != kReady) {
     end_leftovers(device, "");

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <memory>
 #include <mutex>
 #include <system_error>
@@ -170,6 +171,17 @@ bool edit_state_behind(const std::string &device, const std::string &file,
 }
 
 void wait_for_state() { Writer::get().wait(); }
+
+void sweep_state(const std::string &device) {
+  // Whoever is writing holds the lock.
+  const StateLock lock(device);
+  if (!lock) return;
+  std::error_code ignored;
+  for (const auto &entry :
+       std::filesystem::directory_iterator(state_path(device, kTemporaryFolder), ignored)) {
+    std::filesystem::remove(entry.path(), ignored);
+  }
+}
 
 std::string text_of(GKeyFile *file, const char *group, const char *key) {
   const GText text(g_key_file_get_string(file, group, key, nullptr));

@@ -83,6 +83,9 @@ bool edit_state_behind(const std::string &device, const std::string &file,
 /** Wait until what edit_state_behind() has settled is on the disk. */
 void wait_for_state();
 
+/** Delete what writers that were killed have left; the state itself is whole. */
+void sweep_state(const std::string &device);
+
 /** Text of a key, empty when it is missing. */
 std::string text_of(GKeyFile *file, const char *group, const char *key);
 

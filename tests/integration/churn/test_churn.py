@@ -32,7 +32,7 @@ FILES = ("data/one", "data/deep/er/two", "data/sp ace/three", "shared/data/four"
 CLIENTS = 4
 SECONDS = float(os.environ.get("QUARN_CHURN_SECONDS") or 40)
 #: How long everything may take to come to rest; sanitizers are slow.
-PATIENCE = 240
+PATIENCE = 120
 #: The last callback of each request that has one, and where in it the request's number is.
 LAST = {"manual_backup_start": "manual_backup_status",
         "manual_backup_cancel": "manual_backup_cancel_result",
@@ -57,14 +57,17 @@ class Request:
         self.killed = False
         #: The daemon was told to end, or had no network, before the answer: it may keep no mode.
         self.unsure = False
+        #: It was waited for in vain, once.
+        self.given_up = False
 
     def accepted(self):
         return self.call.done and self.call.error is None and self.call.reply in ((0,), (1,))
 
     def ended(self):
         if not self.call.done:
-            return False
-        if self.method not in LAST or not self.accepted() or self.killed or self.last:
+            return self.given_up
+        if self.method not in LAST or not self.accepted() or self.killed or self.last or \
+                self.given_up:
             return True
         return self.method == "restore_enable" and (self.unsure or self.call.reply != (0,))
 
@@ -381,6 +384,8 @@ class Churn(TestCase):
             self.clients[0].until(at_rest, "every request ends", PATIENCE)
         except AssertionError:
             waiting = [request for request in self.requests if not request.ended()]
+            for request in waiting:
+                request.given_up = True
             self.fail("%s: these requests have not ended:\n%s" %
                       (self.hint, "\n".join(map(repr, waiting))))
 

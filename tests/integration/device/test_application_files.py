@@ -144,6 +144,28 @@ class MadeByTheApplication(TestCase):
         self.assertEqual(result.returncode, 36, result.stdout + result.stderr)
         self.assertEqual(self.tree(), newer)
 
+    def test_an_archive_with_the_floor_label_is_replaced_by_the_next_backup(self):
+        """As a device recorded them that knew no label of what applications make."""
+        self.as_application(WRITE)
+        written = self.tree()
+        paths = [self.device.app_path(PACKAGE, path) for path in written]
+        labelled = os.environ.get("QUARN_TEST_LINKS_LABELLED", "1") == "1"
+        attribute = "security.SMACK64" if labelled else "user.quarn.SMACK64"
+        for path in paths:
+            os.setxattr(path, attribute, b"_")
+        self.device.quarnctl("backup")
+        self.assertEqual(set(self.labels_recorded()[0].values()), {"_"})
+        # No package may have that label from an archive: on a kernel that labels it is root's.
+        result = self.device.quarnctl("app", "restore", PACKAGE, check=False)
+        self.assertEqual(result.returncode, 36, result.stdout + result.stderr)
+        self.assertEqual(self.tree(), written)
+        for path in paths:
+            os.removexattr(path, attribute)
+        self.device.quarnctl("backup")
+        self.assertEqual(set(self.labels_recorded()[0].values()), {PACKAGE})
+        self.device.quarnctl("app", "restore", PACKAGE)
+        self.assertEqual(self.tree(), written)
+
     def test_a_second_backup_of_the_same_files_changes_nothing(self):
         self.as_application(WRITE)
         self.device.quarnctl("backup")
