@@ -42,7 +42,7 @@ constexpr VerbInfo kVerbs[] = {
     {Verb::deactivate, "deactivate", "", "end the daemon when it is idle",
      "The daemon forgets when the last backup was, and ends itself unless it is busy.\n",
      kShortWait, 0, 0},
-    {Verb::backup, "backup", "[--yes]", "back up now and wait for the end",
+    {Verb::backup, "backup", "", "back up now and wait for the end",
      "Shows what happens until the backup has ended. An interrupt (Ctrl-C) cancels the backup and\n"
      "waits for its end; a second one leaves at once. After a time-out the backup goes on.\n"
      "\n"

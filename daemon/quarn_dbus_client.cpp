@@ -1,6 +1,7 @@
 #include "quarn_dbus_client.h"
 
 #include <atomic>
+#include <cstring>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -189,8 +190,17 @@ class LastCallback {
 int send_message_callback(const char *method, int err, const char *msg, client_cb_data *record,
                           bool is_last) {
   const LastCallback last(record, is_last);
-  const GString_ text = as_bus_text(msg);
-  return call_client(*record, method, g_variant_new("(isu)", err, text.get(), record->req_id),
+  GString_ made;
+  const char *text = msg;
+  if (text == nullptr || g_utf8_validate(text, -1, nullptr) == FALSE) {
+    made = as_bus_text(msg);
+    text = made.get();
+  }
+  // Borrowed for the length of the call: a list of some megabytes is there once, and in the
+  // message.
+  GVariant *borrowed = g_variant_new_from_data(G_VARIANT_TYPE_STRING, text, std::strlen(text) + 1,
+                                               TRUE, nullptr, nullptr);
+  return call_client(*record, method, g_variant_new("(i@su)", err, borrowed, record->req_id),
                      is_last);
 }
 

@@ -13,6 +13,7 @@
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"
 
 namespace {
@@ -174,7 +175,7 @@ bool write_document(backup_context *ctx, const std::string &path) {
     LOGE("cannot create app list file %s", path.c_str());
     return false;
   }
-  return write_string_to_file(text, path) == QUARN_OK;
+  return write_text_to_file(text, path) == QUARN_OK;
 }
 
 /**

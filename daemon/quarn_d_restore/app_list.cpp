@@ -14,6 +14,7 @@ namespace {
 constexpr int kPellixClient = 1;
 constexpr char kFailed[] = "failed";
 constexpr char kNone[] = "none";
+constexpr int kMostLoggedBytes = 65536;
 
 /** One request for the list in the cloud. */
 struct list_request {
@@ -56,7 +57,8 @@ CString read_list(const std::string &path, request_cause *cause) {
     LOGE("couldn't read app list...");
     return nullptr;
   }
-  LOGI("app list : %s", text.get());
+  // a line is copied several times on its way
+  LOGI("app list : %.*s", kMostLoggedBytes, text.get());
   *cause = request_cause::none;
   return text;
 }

@@ -12,6 +12,7 @@
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
+#include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"
 
 namespace {
@@ -181,7 +182,7 @@ UniqueFd create_in_place(int dir, const char *name) {
 }
 
 /** Write the whole file under no name first, so that nobody ever sees a half of it. */
-bool replace_content(const char *path, const std::string &data) {
+bool replace_content(const char *path, std::string_view data) {
   std::string name;
   const UniqueFd dir = safe_open_parent(path, &name);
   if (!dir) return false;
@@ -390,6 +391,10 @@ bool create_directory_of_file(const char *file) {
 // By value, as the interface has it.
 // NOLINTNEXTLINE(performance-unnecessary-value-param)
 int write_string_to_file(std::string data, std::string path) {
+  return write_text_to_file(data, path);
+}
+
+int write_text_to_file(std::string_view data, const std::string &path) {
   if (data.empty()) {
     LOGE("Invalid Data");
     return QUARN_BAD_ARGUMENT;

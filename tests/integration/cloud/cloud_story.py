@@ -186,7 +186,7 @@ class CloudStory(TestCase):
                                    {"data/" + name: content for name, content in files.items()}))
 
     def backup(self, device):
-        result = device.quarnctl("backup", check=False)
+        result = device.quarnctl("backup", "--yes", check=False)
         self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
         status = device.quarnctl("status", "--json").stdout
         self.seen += result.stdout + result.stderr + status + device.shown_by_processes()

@@ -54,7 +54,7 @@ class BackupStory(TestCase):
             self.device.install(make_source(self.path("src-" + name), name, "1.0.0", files))
 
     def backup(self, device=None, expected=0):
-        result = (device or self.device).quarnctl("backup", check=False)
+        result = (device or self.device).quarnctl("backup", "--yes", check=False)
         self.assertEqual(result.returncode, expected, result.stdout + result.stderr)
         return result
 

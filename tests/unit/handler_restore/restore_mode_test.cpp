@@ -1,6 +1,8 @@
 #include <cstring>
 
 #include "handler_fixture.h"
+#include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
@@ -67,6 +69,58 @@ TEST_F(RestoreModeTest, TheCloudClientSwitchesOn) {
   EXPECT_NE(g_restore_cb_data, nullptr);
   EXPECT_TRUE(is_idle_status());
   expect_info("start install event monitoring. client:0, serial_num:350000000000001");
+}
+
+TEST_F(RestoreModeTest, TheCloudsModeClaimsWhatItWaitsForUntilItEnds) {
+  EXPECT_EQ(on(0), 0);
+  const List both = {"org.example.chat", "org.example.notes"};
+  EXPECT_EQ(claimed_packages(kSerial), both);
+  EXPECT_EQ(on(0, kSerial, R"(["org.example.chat"])"), 0);
+  EXPECT_EQ(claimed_packages(kSerial), List{"org.example.chat"});
+  EXPECT_EQ(package_to_be_restored("org.example.chat"), 1);
+  EXPECT_TRUE(claimed_packages(kSerial).empty());
+  EXPECT_EQ(on(0), 0);
+  off();
+  EXPECT_TRUE(claimed_packages(kSerial).empty());
+}
+
+TEST_F(RestoreModeTest, ItClaimsBeforeTheSessionIsThere) {
+  List claimed;
+  session.meanwhile = [&] { claimed = claimed_packages(kSerial); };
+  EXPECT_EQ(on(0), 0);
+  EXPECT_EQ(claimed.size(), 2U);
+  off();
+}
+
+TEST_F(RestoreModeTest, AnEmptyListAndTheCompanionsModeClaimNothing) {
+  EXPECT_EQ(on(0), 0);
+  EXPECT_EQ(on(0, kSerial, "[]"), 0);
+  EXPECT_TRUE(claimed_packages(kSerial).empty());
+  EXPECT_EQ(on(0), 0);
+  EXPECT_EQ(on(1), 0);
+  EXPECT_TRUE(claimed_packages(kSerial).empty());
+}
+
+TEST_F(RestoreModeTest, AModeThatWasUsedIsADecisionOnTheBackup) {
+  ON_CALL(platform, vconf_get_dbl).WillByDefault(Return(VCONF_ERROR));
+  int mark = 0;
+  ON_CALL(platform, vconf_set_int).WillByDefault([&](auto, int value) {
+    mark = value;
+    return VCONF_OK;
+  });
+  ON_CALL(platform, vconf_get_int).WillByDefault([&](auto, int *value) {
+    *value = mark;
+    return VCONF_OK;
+  });
+  off();
+  EXPECT_EQ(mark, 0) << "there was none";
+  EXPECT_EQ(on(1), 0);
+  off();
+  EXPECT_EQ(mark, 0) << "the companion's has nothing to do with the cloud";
+  EXPECT_EQ(on(0), 0);
+  EXPECT_FALSE(knows_own_backup(kSerial));
+  off();
+  EXPECT_TRUE(knows_own_backup(kSerial));
 }
 
 TEST_F(RestoreModeTest, TheCompanionSwitchesOnWithoutTheCloud) {

@@ -5,7 +5,9 @@
 #include <csignal>
 #include <filesystem>
 
+#include "quarn_d_backup/list_bound.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/request_cause.h"
 #include "restore_fixture.h"
 
 using ::testing::Return;
@@ -70,6 +72,34 @@ TEST_F(AppListTest, AnUnreadableFileIsAnsweredWithOneAndNone) {
   }
   EXPECT_EQ(outside.answers, answered(1, "none"));
   expect_error("couldn't read app list...");
+}
+
+TEST_F(AppListTest, TakesWhatARunWritesAndNothingLarger) {
+  for (const std::uint64_t more : {0, 1}) {
+    outside.answers.clear();
+    ASSERT_EQ(ask(0), 0);
+    const std::string text(kMaxAppListSize + more, 'x');
+    write_text(downloads[0].local, text);
+    answer();
+    EXPECT_EQ(outside.answers, more == 0 ? answered(0, text) : answered(1, "none"));
+    EXPECT_EQ(last_request_cause(),
+              more == 0 ? request_cause::none : request_cause::list_too_large);
+  }
+}
+
+TEST_F(AppListTest, ACauseIsToldUntilTheNextRequestIsServed) {
+  ASSERT_EQ(ask(0), 0);
+  answer(BACKUP_TRANS_ERROR_LOCAL_FILE);
+  EXPECT_EQ(last_request_cause(), request_cause::device_file);
+  ASSERT_EQ(ask(0), 0);
+  answer(BACKUP_TRANS_ERROR_QUOTA);
+  EXPECT_EQ(last_request_cause(), request_cause::space);
+  ASSERT_EQ(ask(0), 0);
+  answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT);
+  EXPECT_EQ(last_request_cause(), request_cause::none) << "an empty cloud is none";
+  transport_result = BACKUP_TRANS_ERROR_LOCAL_FILE;
+  EXPECT_EQ(ask(0), 42);
+  EXPECT_EQ(last_request_cause(), request_cause::device_file);
 }
 
 TEST_F(AppListTest, ARefusedRequestIsAnsweredWithTwelveAndNone) {

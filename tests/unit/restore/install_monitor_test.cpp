@@ -160,6 +160,34 @@ TEST_F(MonitorTest, ACandidateIsRestoredWhenItsInstallationCompletes) {
             (std::vector<std::string>{"org.example.first", "org.example.last"}));
 }
 
+TEST_F(MonitorTest, NoBackupTouchesTheArchiveFromTheEventToTheRestoresEnd) {
+  await_archives(kSerial, {kPkg, "org.example.last"}, {});
+  serial_num_user_select = kSerial;
+  install();
+  EXPECT_EQ(claimed_packages(kSerial), (std::vector<std::string>{"org.example.last", kPkg}));
+  await_no_archives();
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::whole) << "the mode may end before it";
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::none);
+}
+
+TEST_F(MonitorTest, AnInstallThatIsNotRestoredClaimsNothingAnyMore) {
+  await_archives(kSerial, {kPkg}, {});
+  serial_num_user_select = kSerial;
+  opted_out = true;
+  install();
+  EXPECT_TRUE(claimed_packages(kSerial).empty());
+}
+
+TEST_F(MonitorTest, APackageThatIsRemovedIsWaitedForAsOneThatIsToCome) {
+  await_archives(kSerial, {kPkg}, {kPkg});
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::versions);
+  install(kPkg, PACKAGE_MANAGER_EVENT_TYPE_UNINSTALL);
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::whole);
+  expect_error("this is not new install event");
+  await_no_archives();
+}
+
 TEST_F(MonitorTest, TheIconIsHiddenUntilTheRestoreHasEnded) {
   EXPECT_CALL(platform, pkgmgr_client_deactivate).Times(0);
   EXPECT_CALL(platform, pkgmgr_client_activate).Times(0);

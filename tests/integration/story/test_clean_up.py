@@ -1,0 +1,225 @@
+"""What a backup removes from the cloud, and what it leaves there for a restore."""
+import json
+import os
+import subprocess
+import sys
+import unittest
+
+sys.path[:0] = [os.path.join(os.path.dirname(os.path.abspath(__file__)), folder)
+                for folder in ("..", "../bus")]
+from bus_client import Client, GLib  # noqa: E402
+from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+
+SERIAL = "350000000000001"
+OTHER = "350000000000002"
+GONE = "org.example.gone"
+HERE = "org.example.here"
+OWN_BACKUP = "db/private/quarn/own_backup"
+LAST_TIME = "db/private/quarn/last_time"
+
+
+class CleanUp(TestCase):
+    def setUp(self):
+        self.device = self.new_device(serial=SERIAL, model="Orvane One", account="ada")
+        self.device.start()
+        for package in (HERE, GONE):
+            self.install(self.device, package, b"of " + package.encode())
+        self.device.quarnctl("backup")
+        self.device.remove(GONE)
+
+    def install(self, device, package, content, version="1.0"):
+        name = "src-%s-%d" % (package, len(os.listdir(self.directory)))
+        device.install(make_source(self.path(name), package, version, {"data/file": content}))
+
+    def entries(self, cloud=None):
+        with open(os.path.join(cloud or self.device.cloud, "app_list/app_list.txt")) as file:
+            for entry in json.load(file)["model_list"]:
+                if entry["backup_info"]["serial_number"] == SERIAL:
+                    return {package["pkg_id"]: package for package in entry["pkg_list"]}
+        return {}
+
+    def archive(self, package, version="1.0"):
+        return os.path.join(self.device.cloud, SERIAL, package, version, package + ".zip")
+
+    def backup(self, *options, status=0):
+        result = self.device.quarnctl("backup", *options, check=False)
+        self.assertEqual(result.returncode, status, result.stdout + result.stderr)
+        return result
+
+    def restore_on(self, serial, packages):
+        client = Client(self.device.bus_address())
+        self.addCleanup(client.close)
+        reply = client.call("restore_enable",
+                            GLib.Variant("(iissu)", (1, 0, serial, json.dumps(packages), 7)))
+        self.assertEqual(reply, (0,))
+        return client
+
+    @staticmethod
+    def stops(client):
+        return [event for event in client.callbacks("restore_enable_cb")
+                if event[1][1] == "restore_stop"]
+
+    def nightly(self):
+        """One automatic run, by its alarm."""
+        device = self.device
+        runs = device.log().count("auto backup successful!")
+        device.setting(LAST_TIME, "0")
+        device.quarnctl("auto", "on")
+        device.set("charger", "on")
+        device.set("display", "off")
+        alarm = wait_until(lambda: json.loads(device.quarnctl("status", "--json").stdout)
+                           ["condition_alarm_ms"], "the conditions hold")
+        due = min(device.alarms(), key=lambda one: abs(one["due_ms"] - alarm))
+        device.fire(due["id"])
+        device.wait_for_log("auto backup successful!", runs + 1)
+        device.set("display", "on")
+
+    def assert_kept(self):
+        self.assertIn(GONE, self.entries())
+        self.assertTrue(os.path.exists(self.archive(GONE)))
+
+    def assert_removed(self):
+        self.assertNotIn(GONE, self.entries())
+        self.assertFalse(os.path.exists(self.archive(GONE)))
+
+    def test_a_backup_names_what_it_would_remove_and_wants_it_confirmed(self):
+        result = self.backup(status=65)
+        self.assertIn("the backup would remove 1 package that is not installed from the cloud: " +
+                      GONE, result.stderr)
+        document = json.loads(self.backup("--json", status=65).stdout)
+        self.assertEqual(document["would_remove"], [GONE])
+        self.assert_kept()
+        self.backup("--yes")
+        self.assert_removed()
+        self.backup()
+
+    def test_what_restore_mode_waits_for_survives_every_run_and_comes_back(self):
+        before = self.entries()[GONE]
+        client = self.restore_on(SERIAL, [GONE])
+        self.backup()
+        self.backup("--yes")
+        self.nightly()
+        self.assertEqual(self.entries()[GONE], before)
+        self.install(self.device, GONE, b"as it comes from the shop")
+        path = self.device.app_path(GONE, "data/file")
+
+        def is_back():
+            with open(path, "rb") as file:
+                return file.read() == b"of " + GONE.encode()
+        client.until(lambda: self.stops(client) and is_back(), "the data is back")
+        self.backup()
+        self.assertEqual(set(self.entries()), {HERE, GONE})
+
+    def test_the_mode_for_another_device_keeps_nothing_of_this_one(self):
+        self.restore_on(OTHER, [GONE])
+        self.backup("--yes")
+        self.assert_removed()
+
+    def test_a_device_that_was_reset_keeps_its_backup_through_its_nights(self):
+        self.device.setting(OWN_BACKUP, "0")
+        for _ in range(2):
+            self.nightly()
+            self.assert_kept()
+        # Forgetting the time of the last backup is not what a reset is.
+        self.device.quarnctl("deactivate")
+        self.nightly()
+        self.assert_kept()
+        self.backup("--yes")
+        self.assert_removed()
+
+    def test_forgetting_the_last_time_leaves_nightly_runs_what_they_were(self):
+        self.device.quarnctl("deactivate")
+        self.nightly()
+        self.assert_removed()
+
+    def test_restores_and_backups_that_meet_lose_nothing(self):
+        packages = ["org.example.p%d" % index for index in range(6)]
+        for package in packages:
+            self.install(self.device, package, b"old data of " + package.encode())
+        self.backup("--yes")
+        for package in packages:
+            self.device.remove(package)
+        client = self.restore_on(SERIAL, packages)
+        backups = []
+        try:
+            for index, package in enumerate(packages):
+                backups.append(subprocess.Popen(
+                    [self.device.tool, "exec", self.device.path, "--", "quarnctl", "backup",
+                     "--yes"], stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True))
+                self.install(self.device, package, b"new data")
+            client.until(lambda: self.stops(client), "the mode ends")
+        finally:
+            ends = [(run.communicate(timeout=120)[0], run.returncode) for run in backups]
+        self.assertEqual([status for _out, status in ends], [0] * len(backups), ends)
+        for package in packages:
+            with open(self.device.app_path(package, "data/file"), "rb") as file:
+                self.assertEqual(file.read(), b"old data of " + package.encode())
+        self.backup()
+        self.assertEqual(set(self.entries()), set(packages) | {HERE})
+        for package in packages:
+            self.assertTrue(os.path.exists(self.archive(package)), package)
+
+
+class Causes(TestCase):
+    """A device that is full, for the daemon's own files alone."""
+
+    def setUp(self):
+        self.device = self.new_device(serial=SERIAL, model="Orvane One", account="ada")
+        self.staging = os.path.join(self.device.path, "root/tmp")
+        subprocess.run(["mount", "-t", "tmpfs", "-o", "size=1m", "none", self.staging], check=True)
+        self.addCleanup(subprocess.run, ["umount", "-l", self.staging])
+        os.chmod(self.staging, 0o1777)
+        self.device.start()
+        self.addCleanup(self.device.stop)
+        self.device.install(make_source(self.path("src"), HERE, "1.0", {"data/file": b"text"}))
+
+    def fill(self):
+        filler = os.open(os.path.join(self.staging, "filler"), os.O_WRONLY | os.O_CREAT)
+        try:
+            while os.write(filler, b"\0" * 4096) > 0:
+                pass
+        except OSError:
+            pass
+        finally:
+            os.close(filler)
+
+    def test_a_full_device_is_neither_lost_wifi_nor_an_empty_cloud(self):
+        device = self.device
+        device.quarnctl("backup")
+        self.fill()
+        failed = device.quarnctl("backup", check=False)
+        self.assertEqual(failed.returncode, 13, failed.stdout + failed.stderr)
+        self.assertEqual(failed.stderr,
+                         "quarnctl: backup failed: this device has no room left (13)\n")
+        listed = device.quarnctl("list", check=False)
+        self.assertEqual(listed.returncode, 1)
+        self.assertEqual(listed.stderr, "quarnctl: getting the application list failed: "
+                                        "this device has no room left (1)\n")
+        self.assertIn("last problem      this device has no room left\n",
+                      device.quarnctl("status").stdout)
+        os.unlink(os.path.join(self.staging, "filler"))
+        device.quarnctl("backup")
+        self.assertNotIn("last problem", device.quarnctl("status").stdout)
+
+    def test_a_first_backup_that_cannot_write_its_list_sends_nothing(self):
+        self.fill()
+        failed = self.device.quarnctl("backup", check=False)
+        self.assertEqual(failed.returncode, 12, failed.stdout + failed.stderr)
+        self.assertEqual(failed.stderr,
+                         "quarnctl: backup failed: this device has no room left (12)\n")
+        self.assertEqual(os.listdir(self.device.cloud), [])
+
+    def test_a_list_of_another_form_is_said_to_be_that_and_nothing_is_sent(self):
+        folder = os.path.join(self.device.cloud, "app_list")
+        os.makedirs(folder)
+        with open(os.path.join(folder, "app_list.txt"), "w") as file:
+            file.write('{"format_ver": 2, "model_list": []}')
+        failed = self.device.quarnctl("backup", check=False)
+        self.assertEqual(failed.returncode, 12)
+        self.assertEqual(failed.stderr, "quarnctl: backup failed: the cloud's application list is "
+                                        "in a form that this device does not know (12)\n")
+        self.assertEqual(os.listdir(self.device.cloud), ["app_list"])
+
+
+if __name__ == "__main__":
+    unittest.main()
