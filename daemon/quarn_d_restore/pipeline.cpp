@@ -237,6 +237,12 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
   }
   const std::string archive = companion_archive(ctx);
   const std::lock_guard<std::mutex> lock(package_data_mutex);
+  if (recover_package_data(pkgid, ctx.root.c_str()) == recovery_result::kept) {
+    // What is still to be put back would go over what is unpacked now.
+    LOGE("fail to restore for (%s)", pkgid);
+    done.unpacked = QUARN_REFUSED;
+    return done;
+  }
   done.size = archive_size(archive);
   report_restore_step(ctx.pkgid, restore_stage::unpacking, done.size);
   unzip_report report;

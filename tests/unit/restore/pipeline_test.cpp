@@ -3,6 +3,7 @@
 
 #include <csignal>
 #include <filesystem>
+#include <fstream>
 #include <thread>
 
 #include "restore_fixture.h"
@@ -301,7 +302,7 @@ TEST_F(PipelineTest, WhatADeadDaemonLeftIsPutBackBeforeThePackageIsRestoredAgain
   make_old_data();
   const Tree before = tree_of(root);
   ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
-  file("data/settings.ini", "half of a restore");
+  unpacked_file("data/settings.ini", "half of a restore");
   auto ctx = waiting_context();
   ASSERT_EQ(restore(ctx.get()), 0);
   EXPECT_EQ(tree_of(root), before);
@@ -393,8 +394,52 @@ TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAt
   expect_error("fail to restore for (org.example.notes)");
   expect_info("restore_app_data for org.example.notes complete");
   EXPECT_EQ(read_text(at("data/settings.ini")), "new settings") << "nothing is rolled back";
-  EXPECT_EQ(progress.back().outcome, Outcome::failed);
+  EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
   EXPECT_EQ(progress.back().result, 36);
+}
+
+/** Everything below the root is the application's, labelled, and no table is left. */
+void expect_attributes(const std::string &root, const std::string &but) {
+  for (const auto &[name, object] : tree_of(root)) {
+    if (name == "shared" || name == but) continue;
+    EXPECT_NE(object.find(" 5000:5000 "), std::string::npos) << name << ": " << object;
+    EXPECT_EQ(object.find(" 5000:5000 _ "), std::string::npos) << name << ": " << object;
+    EXPECT_EQ(name.find(".perm"), std::string::npos);
+  }
+}
+
+TEST_F(CompanionTest, WhatWasUnpackedHasItsAttributesThoughAnEntryWasRefused) {
+  make_old_data();
+  auto entries = new_data;
+  entries.push_back({"../../escaped", "x"});
+  entries.push_back({"/absolute", "x"});
+  make_archive(archive(), entries);
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(ctx->result, 0);
+  expect_error("2 entries of (org.example.notes) were not restored");
+  expect_info("restore completed for (org.example.notes)");
+  expect_attributes(root, "");
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
+  EXPECT_EQ(progress.back().result, 31);
+}
+
+TEST_F(CompanionTest, WhatWasUnpackedHasItsAttributesThoughAnEntryIsCorrupt) {
+  make_old_data();
+  make_archive(archive(), new_data);
+  {
+    std::fstream broken(archive(), std::ios::in | std::ios::out | std::ios::binary);
+    broken.seekp(50);
+    broken.write("\xff\xff\xff\xff", 4);
+  }
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 0);
+  expect_error("1 entries of (org.example.notes) were not restored");
+  expect_attributes(root, "");
+  EXPECT_EQ(read_text(at(new_data.back().name)), new_data.back().content);
+  EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
+  EXPECT_EQ(progress.back().result, 31);
 }
 
 TEST_F(CompanionTest, AMissingArchiveCarriesTheUnpackCode) {

@@ -343,6 +343,14 @@ std::string RestoreTest::file(const std::string &name, const std::string &conten
   return path;
 }
 
+std::string RestoreTest::unpacked_file(const std::string &name, const std::string &content) {
+  const std::string path = at(name);
+  unlink(path.c_str());
+  write_text(path, content);
+  EXPECT_EQ(chmod(path.c_str(), 0600), 0);
+  return path;
+}
+
 std::string RestoreTest::dir(const std::string &name, int mode, const std::string &label) {
   const std::string path = at(name);
   std::filesystem::create_directories(path);

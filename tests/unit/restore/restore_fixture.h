@@ -88,6 +88,8 @@ class RestoreTest : public ::testing::Test {
   /** A file of the application: owner 5000:5000, labelled. */
   std::string file(const std::string &name, const std::string &content, int mode = 0644,
                    const std::string &label = kDataLabel);
+  /** A file as the unpacking leaves it: root's, for nobody else, with the label of its folder. */
+  std::string unpacked_file(const std::string &name, const std::string &content);
   std::string dir(const std::string &name, int mode = 0755, const std::string &label = kDataLabel);
   /** Two files with attributes of their own, a database with its own label, in two folders. */
   void make_old_data();
