@@ -5,6 +5,7 @@
 
 #include <csignal>
 #include <cstdio>
+#include <cstring>
 
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_end.h"
@@ -14,6 +15,7 @@
 #include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
@@ -106,7 +108,7 @@ void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(request_pending);
   set_restore_disable(disable_restore);
-  set_boot_recovery(recover_interrupted_restores);
+  set_boot_recovery(recover_device);
   set_bus_acquired_hook(export_objects);
   quarnd_progress_init();
 }
@@ -171,8 +173,15 @@ int quarn_run() {
   return quarn_exit_code;
 }
 
-int main() {
-  const int status = quarn_run();
+int quarn_recover() {
+  LOGI("recovery of what an interrupted restore or backup has left");
+  recover_device();
+  return 0;
+}
+
+int main(int argc, char **argv) {
+  const bool recovery = argc == 2 && std::strcmp(argv[1], "--recover") == 0;
+  const int status = recovery ? quarn_recover() : quarn_run();
   std::fflush(nullptr);
 #if defined(__SANITIZE_ADDRESS__)
   __lsan_do_leak_check();

@@ -17,6 +17,12 @@ extern std::uint32_t quarn_dbus_owner_id;
 /** All that main() does. @return the process' exit status */
 int quarn_run();
 
+/**
+ * What "quarnd --recover" does instead, once after a boot and before the daemon
+ * may be started: it needs neither account nor bus. @return the exit status
+ */
+int quarn_recover();
+
 /** Set up the loop, the bus, the scheduler; only the first call does anything. */
 void init_quarn();
 /** Undo init_quarn(); only the first call after it does anything. */

@@ -383,6 +383,32 @@ void stop_daemon(Running *self) {
     kill(static_cast<pid_t>(pid), SIGKILL);
 }
 
+/** The daemon beside this program, or an installed one; empty when there is none. */
+std::string daemon_program() {
+  const std::string beside = program_directory() + "/quarnd";
+  for (const char *program : {beside.c_str(), QUARN_INSTALLED_DAEMON, "/usr/sbin/quarnd"}) {
+    if (access(program, X_OK) == 0) return program;
+  }
+  return "";
+}
+
+/** What a device does once after it has booted, before anybody may use its bus. */
+void recover_after_boot() {
+  const std::string program = daemon_program();
+  if (program.empty()) return;
+  const pid_t supervisor = getpid();
+  const pid_t pid = fork();
+  if (pid < 0) throw Failure("cannot start the recovery: " + reason());
+  if (pid == 0) {
+    prctl(PR_SET_PDEATHSIG, SIGTERM);
+    if (getppid() != supervisor) _exit(DEVICE_FAILED);
+    execl(program.c_str(), "quarnd", "--recover", nullptr);
+    _exit(DEVICE_FAILED);
+  }
+  while (waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
+  }
+}
+
 /** @param lock of the start, held until the supervisor can be found: a start may be killed */
 [[noreturn]] void supervise(const std::string &device, int tell, int lock) {
   int status = DEVICE_FAILED;
@@ -394,6 +420,7 @@ void stop_daemon(Running *self) {
     self.own_namespace = enter_own_namespace(device);
     if (!self.own_namespace) map_apps_path(device);
     set_environment(device);
+    recover_after_boot();
     self.bus = start_bus(device);
     write_file(device + "/" + kSupervisorFile, std::to_string(getpid()) + " " + birth_of(getpid()) +
                                                    " " + (self.own_namespace ? "1" : "0") + "\n");
@@ -713,11 +740,8 @@ int verb_exec(const Arguments &arguments) {
 
 int verb_daemon(const Arguments &arguments) {
   if (arguments.size() != 1) wrong_use();
-  std::string program = program_directory() + "/quarnd";
-  for (const char *installed : {QUARN_INSTALLED_DAEMON, "/usr/sbin/quarnd"}) {
-    if (access(program.c_str(), X_OK) != 0) program = installed;
-  }
-  if (access(program.c_str(), X_OK) != 0) {
+  const std::string program = daemon_program();
+  if (program.empty()) {
     throw Failure("no quarnd beside this program nor in its place of installation");
   }
   set_environment(arguments[0]);

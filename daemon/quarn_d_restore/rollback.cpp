@@ -201,12 +201,7 @@ class Clearing {
 class MovingBack {
  public:
   MovingBack(const restore_files &files, std::string root, json_object *table)
-      : files_(files), root_(std::move(root)), table_(table), own_{files.snapshot + kKept,
-                                                                   files.unfinished_table,
-                                                                   files.stamps,
-                                                                   files.unpacked,
-                                                                   files.told,
-                                                                   files.snapshot_table} {}
+      : files_(files), root_(std::move(root)), table_(table) {}
 
   /** @return true when everything below @p dir, in the snapshot, is in its place */
   bool run(const std::string &dir) {
@@ -260,11 +255,12 @@ class MovingBack {
     moved_ = false;
   }
 
+  /** True for what lies in the snapshot without being the application's. */
   bool is_own() const {
-    for (const auto &path : own_) {
-      if (path_ == path) return true;
-    }
-    return files_.is_archive(path_);
+    const std::string &top = files_.snapshot;
+    const bool at_top = path_.rfind('/') == top.size() && path_.compare(0, top.size(), top) == 0;
+    if (at_top) return path_ != top + "/data" && path_ != top + "/shared";
+    return path_ == files_.snapshot_table || files_.is_archive(path_);
   }
 
   /** The files of one directory. @return the directories in it */
@@ -350,7 +346,6 @@ class MovingBack {
   const restore_files &files_;
   const std::string root_;
   json_object *table_;
-  const std::vector<std::string> own_;
   std::string path_;
   bool moved_ = true;
 };

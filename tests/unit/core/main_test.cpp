@@ -16,6 +16,7 @@
 #include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
@@ -140,7 +141,7 @@ void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
-void recover_interrupted_restores() { step("recovery"); }
+void recover_device() { step("recovery"); }
 int quarnd_restore_enable(int on, int client, const char *, const char *, void *record) {
   EXPECT_EQ(on, 0);
   EXPECT_EQ(client, 0);
@@ -151,7 +152,13 @@ int quarnd_restore_enable(int on, int client, const char *, const char *, void *
 void quit_nested_loops() { step("quit_nested_loops"); }
 
 /** The program's own. */
-int quarnd_main();
+int quarnd_main(int argc, char **argv);
+
+/** main() with these arguments. */
+int run_program(std::vector<const char *> arguments) {
+  arguments.push_back(nullptr);
+  return quarnd_main(static_cast<int>(arguments.size()) - 1, const_cast<char **>(arguments.data()));
+}
 
 namespace {
 
@@ -232,9 +239,9 @@ TEST_F(Main, AnswersTheExitCodeOfARestartRequest) {
 
 TEST_F(Main, ProcessStatusIsZeroOr255WhenARestartIsWanted) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_EXIT(quarnd_main(), ::testing::ExitedWithCode(0), "");
+  EXPECT_EXIT(run_program({"quarnd"}), ::testing::ExitedWithCode(0), "");
   in_loop = [] { quarn_exit_code = -1; };
-  EXPECT_EXIT(quarnd_main(), ::testing::ExitedWithCode(255), "");
+  EXPECT_EXIT(run_program({"quarnd"}), ::testing::ExitedWithCode(255), "");
 }
 
 TEST_F(Main, HandlersStandAgainAfterEcoreHasReplacedThem) {
@@ -345,6 +352,22 @@ TEST_F(Main, CanBeStartedAgainAfterItsTearDown) {
   init_quarn();
   EXPECT_EQ(quarn_started, 1);
   EXPECT_EQ(std::count(steps.begin(), steps.end(), "dbus_init"), 1);
+}
+
+TEST_F(Main, TheRecoveryNeedsNoAccountAndNoBus) {
+  account = false;
+  EXPECT_EQ(quarn_recover(), 0);
+  EXPECT_EQ(steps, Texts{"recovery"});
+}
+
+TEST_F(Main, OnlyTheRecoveryIsMadeWhenItIsAskedFor) {
+  account = false;
+  EXPECT_EXIT(run_program({"quarnd", "--recover"}), ::testing::ExitedWithCode(0), "");
+  // with an account it would be in its main loop, which asks for a restart here
+  account = true;
+  in_loop = [] { quarn_exit_code = -1; };
+  EXPECT_EXIT(run_program({"quarnd", "--recover"}), ::testing::ExitedWithCode(0), "");
+  EXPECT_EXIT(run_program({"quarnd"}), ::testing::ExitedWithCode(255), "");
 }
 
 TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {

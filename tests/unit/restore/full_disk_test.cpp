@@ -16,7 +16,7 @@
 
 namespace {
 
-constexpr int kFiles = 120;
+constexpr int kFiles = 42;
 
 enum class Kind { kMemory, kExt4 };
 
@@ -26,11 +26,11 @@ class SmallDisk {
   SmallDisk(Kind kind, std::string place) : place_(std::move(place)), image_(place_ + ".img") {
     std::filesystem::create_directories(place_);
     if (kind == Kind::kMemory) {
-      mounted_ = mount("quarn", place_.c_str(), "tmpfs", 0, "size=8m,nr_inodes=3000") == 0;
+      mounted_ = mount("quarn", place_.c_str(), "tmpfs", 0, "size=3m,nr_inodes=900") == 0;
       EXPECT_TRUE(mounted_) << "a file system of memory cannot be mounted: " << strerror(errno);
       return;
     }
-    const std::string make = "truncate -s 12M " + image_ + " && mkfs.ext4 -q -F -m 0 -N 3000 " +
+    const std::string make = "truncate -s 6M " + image_ + " && mkfs.ext4 -q -F -m 0 -N 900 " +
                              image_ + " && mount -o loop " + image_ + " " + place_;
     mounted_ = std::system(make.c_str()) == 0;
     EXPECT_TRUE(mounted_) << "a small ext4 cannot be made and mounted";
@@ -62,7 +62,7 @@ class SmallDisk {
   void expect_full() const {
     struct statfs status = {};
     ASSERT_EQ(statfs(place_.c_str(), &status), 0);
-    EXPECT_EQ(status.f_bfree, 0U);
+    EXPECT_EQ(status.f_bavail, 0U);
   }
   void empty() const { std::filesystem::remove_all(place_ + "/filler"); }
 
@@ -106,7 +106,9 @@ class FullDiskTest : public RestoreTest, public ::testing::WithParamInterface<Ki
       dir(deep, 0711, i % 2 == 0 ? kDataLabel : "a.folders.label");
       file(name, std::string(static_cast<std::size_t>(3000 + i), 'o'), 0600 + i % 8,
            i % 5 == 0 ? "wrt::db_origin" : kDataLabel);
-      if (i % 11 == 0) EXPECT_EQ(chown(at(name).c_str(), 5001, 100), 0);
+      if (i % 11 == 0) {
+        EXPECT_EQ(chown(at(name).c_str(), 5001, 100), 0);
+      }
     }
   }
   void reset() {
@@ -134,6 +136,22 @@ class FullDiskTest : public RestoreTest, public ::testing::WithParamInterface<Ki
       at = ours ? all.erase(at) : std::next(at);
     }
     return all;
+  }
+  /** What is not as it is in @p wanted, in short. */
+  std::string difference(const Tree &wanted) const {
+    const Tree now = data();
+    std::string text;
+    for (const auto &[name, object] : wanted) {
+      const auto found = now.find(name);
+      if (found == now.end()) text += "missing " + name + "\n";
+      if (found != now.end() && found->second != object) {
+        text += name + " is " + found->second.substr(0, 60) + " not " + object.substr(0, 60) + "\n";
+      }
+    }
+    for (const auto &[name, object] : now) {
+      if (wanted.count(name) == 0) text += "too much: " + name + "\n";
+    }
+    return text;
   }
   /** Run @p work in a process that ends at its @p nth step, there once the disk is full. */
   bool killed_at(int nth, const std::string &full_from, const std::function<void()> &work) {
@@ -207,7 +225,7 @@ TEST_P(FullDiskTest, AFailedRestoreLeavesTheDataAsItWasFromWhicheverStepOnTheDis
       disk.fill();
       disk.expect_full();
     }
-    EXPECT_TRUE(data() == old_tree) << step;
+    EXPECT_EQ(difference(old_tree), "") << step;
     EXPECT_FALSE(exists(snapshot())) << step;
   }
 }
@@ -220,7 +238,7 @@ TEST_P(FullDiskTest, WhatIsReportedIsTrue) {
     restore_here(base + "/good.zip");
   }
   EXPECT_EQ(outcome, restore_outcome::rolled_back);
-  EXPECT_TRUE(data() == old_tree);
+  EXPECT_EQ(difference(old_tree), "");
 }
 
 TEST_P(FullDiskTest, AGoodRestoreOnAFullDiskEndsWithTheOldOrTheNew) {
@@ -231,7 +249,7 @@ TEST_P(FullDiskTest, AGoodRestoreOnAFullDiskEndsWithTheOldOrTheNew) {
       const FullFrom full(disk, step);
       result = restore_here(base + "/good.zip")->result;
     }
-    EXPECT_TRUE(data() == (result == 0 ? new_tree : old_tree)) << step;
+    EXPECT_EQ(difference(result == 0 ? new_tree : old_tree), "") << step << ": " << result;
     EXPECT_FALSE(exists(snapshot())) << step;
   }
 }
@@ -239,7 +257,7 @@ TEST_P(FullDiskTest, AGoodRestoreOnAFullDiskEndsWithTheOldOrTheNew) {
 TEST_P(FullDiskTest, KilledAtEachStepOfARollbackAndRecoveredWhileTheDiskIsFull) {
   // every step is visited in turn, a few of the many alike
   std::set<int> nths;
-  for (int i = 1; i < 40; ++i) nths.insert(i * i);
+  for (int i = 1; i < 24; ++i) nths.insert(i * i);
   int killed = 0;
   for (const int nth : nths) {
     reset();
@@ -250,15 +268,15 @@ TEST_P(FullDiskTest, KilledAtEachStepOfARollbackAndRecoveredWhileTheDiskIsFull) 
       disk.fill();
       recover_interrupted_restore(kPkg, root.c_str());
     }
-    EXPECT_TRUE(data() == old_tree) << "killed at step " << nth;
+    EXPECT_EQ(difference(old_tree), "") << "killed at step " << nth;
     EXPECT_FALSE(exists(snapshot())) << "killed at step " << nth;
   }
-  EXPECT_GT(killed, 15);
+  EXPECT_GT(killed, 12);
 }
 
 TEST_P(FullDiskTest, KilledInTheRecoveryAsWell) {
   int killed = 0;
-  for (int nth = 1; nth < 1500; nth = nth * 3 / 2 + 1) {
+  for (int nth = 1; nth < 600; nth = nth * 2 + 1) {
     reset();
     ASSERT_TRUE(killed_at(5, "rollback", [this] { restore_here(base + "/broken.zip"); }));
     if (killed_at(nth, "rollback", [this] { recover_interrupted_restore(kPkg, root.c_str()); })) {
@@ -266,10 +284,10 @@ TEST_P(FullDiskTest, KilledInTheRecoveryAsWell) {
     }
     disk.fill();
     recover_interrupted_restore(kPkg, root.c_str());
-    EXPECT_TRUE(data() == old_tree) << "killed at step " << nth;
+    EXPECT_EQ(difference(old_tree), "") << "killed at step " << nth;
     EXPECT_FALSE(exists(snapshot())) << "killed at step " << nth;
   }
-  EXPECT_GT(killed, 8);
+  EXPECT_GT(killed, 6);
 }
 
 INSTANTIATE_TEST_SUITE_P(Disks, FullDiskTest, ::testing::Values(Kind::kMemory, Kind::kExt4),
