@@ -14,6 +14,8 @@ constexpr char kBusPath[] = "/org/freedesktop/DBus";
 constexpr char kPropertiesInterface[] = "org.freedesktop.DBus.Properties";
 constexpr char kStatusPath[] = "/org/orvane/Quarn/Status";
 constexpr char kStatusInterface[] = "org.orvane.Quarn.Status";
+constexpr char kPackagesPath[] = "/org/orvane/Quarn/Packages";
+constexpr char kPackagesInterface[] = "org.orvane.Quarn.Packages";
 constexpr char kProgressSignal[] = "progress";
 constexpr char kProgressPath[] = "/progress";
 // The caller has a clock of its own; the bus library's would end a long transfer.
@@ -263,6 +265,11 @@ void BusClient::call(const char *method, GVariant *arguments, const char *reply_
 void BusClient::read_status(Reply reply, Failure failure) {
   call_object(kStatusPath, kPropertiesInterface, "GetAll", g_variant_new("(s)", kStatusInterface),
               "(a{sv})", std::move(reply), std::move(failure));
+}
+
+void BusClient::cancel_own(Reply reply, Failure failure) {
+  call_object(kPackagesPath, kPackagesInterface, "CancelOwn", nullptr, "(u)", std::move(reply),
+              std::move(failure));
 }
 
 void BusClient::call_object(const char *path, const char *interface, const char *method,

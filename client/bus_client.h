@@ -78,6 +78,9 @@ class BusClient {
   /** Reads all properties of the daemon's status object; the reply is "(a{sv})". */
   void read_status(Reply reply, Failure failure);
 
+  /** Withdraws what this connection has asked for; the reply is "(u)", how many requests. */
+  void cancel_own(Reply reply, Failure failure);
+
   /** Waits until everything is written: a reply that is still queued would be lost at the exit. */
   void flush();
 
