@@ -15,6 +15,8 @@ constexpr char kPropertiesInterface[] = "org.freedesktop.DBus.Properties";
 constexpr char kStatusPath[] = "/org/orvane/Quarn/Status";
 constexpr char kStatusInterface[] = "org.orvane.Quarn.Status";
 constexpr char kCleanUpInterface[] = "org.orvane.Quarn.CleanUp";
+constexpr char kPackagesPath[] = "/org/orvane/Quarn/Packages";
+constexpr char kPackagesInterface[] = "org.orvane.Quarn.Packages";
 constexpr char kProgressSignal[] = "progress";
 constexpr char kProgressPath[] = "/progress";
 // The caller has a clock of its own; the bus library's would end a long transfer.
@@ -277,6 +279,11 @@ void BusClient::read_status(Reply reply, Failure failure) {
   call_object({kStatusPath, kPropertiesInterface, "GetAll", false},
               g_variant_new("(s)", kStatusInterface), "(a{sv})", std::move(reply),
               std::move(failure));
+}
+
+void BusClient::cancel_own(Reply reply, Failure failure) {
+  call_object({kPackagesPath, kPackagesInterface, "CancelOwn", false}, nullptr, "(u)",
+              std::move(reply), std::move(failure));
 }
 
 void BusClient::call_object(const Target &target, GVariant *arguments, const char *reply_type,

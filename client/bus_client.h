@@ -82,6 +82,8 @@ class BusClient {
 
   /** Reads which packages a backup leaves in the cloud; the reply is "(v)", of an "as". */
   void read_kept_packages(Reply reply, Failure failure);
+  /** Withdraws what this connection has asked for; the reply is "(u)", how many requests. */
+  void cancel_own(Reply reply, Failure failure);
 
   /** Waits until everything is written: a reply that is still queued would be lost at the exit. */
   void flush();

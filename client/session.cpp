@@ -118,6 +118,8 @@ class Session {
   int watched_result() const;
   bool has_archive(const std::string &package) const;
 
+  /** An interrupt withdraws the request and waits for its end. */
+  bool can_be_withdrawn() const;
   void interrupt();
   void time_out();
   void arm_timer();
@@ -786,13 +788,19 @@ gboolean Session::on_interrupt(gpointer user_data) {
   return G_SOURCE_CONTINUE;
 }
 
+bool Session::can_be_withdrawn() const {
+  return command_.verb == Verb::backup || command_.verb == Verb::app_backup ||
+         command_.verb == Verb::app_restore;
+}
+
 void Session::interrupt() {
   if (done_) return;
-  if (command_.verb == Verb::backup && called_ && !previewing_ && !cancelling_) {
+  if (can_be_withdrawn() && called_ && !previewing_ && !cancelling_) {
     cancelling_ = true;
-    screen_.line("cancelling the backup; interrupt again to leave at once");
-    // The run's own final state tells the outcome, so the answer to this is not waited for.
-    call_for_result("manual_backup_cancel", g_variant_new("(u)", random_request_id()), [](int) {});
+    const char *what = command_.verb == Verb::app_restore ? "restore" : "backup";
+    screen_.line(std::string("cancelling the ") + what + "; interrupt again to leave at once");
+    // The request's own end tells the outcome, so the answer to this is not waited for.
+    client_->cancel_own([](GVariant *) {}, [this](const BusFailure &failure) { fail(failure); });
     return;
   }
   at_once_ = cancelling_;

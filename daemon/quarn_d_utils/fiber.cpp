@@ -111,23 +111,19 @@ thread_local quarn_fiber *running_fiber = nullptr;
 thread_local strand thread_strand;
 std::atomic<std::uint64_t> last_fiber_id{0};
 
-std::vector<std::unique_ptr<Stack>> &spare_stacks() {
-  // never destroyed: fibers may outlive main()
-  static thread_local auto *stacks = new std::vector<std::unique_ptr<Stack>>;
-  return *stacks;
-}
+thread_local std::vector<std::unique_ptr<Stack>> spare_stacks;
 
 std::unique_ptr<Stack> take_stack() {
-  if (spare_stacks().empty()) return std::make_unique<Stack>();
-  std::unique_ptr<Stack> stack = std::move(spare_stacks().back());
-  spare_stacks().pop_back();
+  if (spare_stacks.empty()) return std::make_unique<Stack>();
+  std::unique_ptr<Stack> stack = std::move(spare_stacks.back());
+  spare_stacks.pop_back();
   return stack;
 }
 
 void give_stack(std::unique_ptr<Stack> stack) {
-  if (spare_stacks().size() >= kSpareStacks) return;
+  if (spare_stacks.size() >= kSpareStacks) return;
   stack->trim(stack->bottom() + stack->size());
-  spare_stacks().push_back(std::move(stack));
+  spare_stacks.push_back(std::move(stack));
 }
 
 /** Come back when somebody switches to @p from again. */

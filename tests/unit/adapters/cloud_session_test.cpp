@@ -4,6 +4,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
@@ -15,6 +16,8 @@
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "mock_transport.h"
+#include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
@@ -304,6 +307,49 @@ TEST_F(CloudSessionTest, ManyThreadsShareOneAttempt) {
   answer(0, BACKUP_TRANS_ERROR_NONE);
   for (auto &worker : workers) EXPECT_TRUE(worker.get());
   EXPECT_EQ(request_count(), 1U);
+}
+
+// Whoever made the attempt is refused while others join it, look, or wait already.
+TEST_F(CloudSessionTest, ARefusalReachesEveryoneWheneverItComes) {
+  constexpr int kRounds = 200;
+  ON_CALL(transport, backup_trans_init).WillByDefault(Return(BACKUP_TRANS_ERROR_NOT_INITIALIZED));
+  std::atomic<bool> over{false};
+  std::thread worker([&over] {
+    while (!over) cloud_initialized();
+  });
+  for (int round = 0; round < kRounds; ++round) EXPECT_FALSE(cloud_initialized());
+  over = true;
+  worker.join();
+}
+
+TEST_F(CloudSessionTest, EveryRequestOnAFiberHasTheAnswer) {
+  constexpr int kRequests = 5;
+  int ready = 0;
+  for (int i = 0; i < kRequests; ++i) {
+    run_on_fiber([&ready] { ready += cloud_initialized() ? 1 : 0; });
+  }
+  EXPECT_EQ(ready, 0);
+  answer(0, BACKUP_TRANS_ERROR_NONE);
+  serve_until([&ready] { return ready == kRequests; });
+  EXPECT_EQ(request_count(), 1U);
+}
+
+TEST_F(CloudSessionTest, WhoWithdrawsLeavesTheAttemptToTheOthers) {
+  std::uint64_t first = 0;
+  std::vector<std::string> results;
+  run_on_fiber([&] {
+    first = fiber_id(current_fiber());
+    results.emplace_back(cloud_initialized() ? "first ready" : "first not");
+  });
+  run_on_fiber([&] { results.emplace_back(cloud_initialized() ? "second ready" : "second not"); });
+  EXPECT_TRUE(withdraw_waits(first));
+  serve_until([&results] { return results.size() == 1; });
+  run_on_fiber([&] { results.emplace_back(cloud_initialized() ? "third ready" : "third not"); });
+  EXPECT_EQ(request_count(), 1U) << "the third shares it";
+  answer(0, BACKUP_TRANS_ERROR_NONE);
+  serve_until([&results] { return results.size() == 3; });
+  EXPECT_EQ(results, (std::vector<std::string>{"first not", "second ready", "third ready"}));
+  EXPECT_EQ(count_logged(DLOG_ERROR, kTimeOutText), 0);
 }
 
 TEST_F(CloudSessionTest, TheEndOfTheProcessEndsTheWait) {

@@ -38,7 +38,12 @@ constexpr char kDaemonXml[] =
     "<arg type='u' direction='in'/><arg type='i' direction='out'/></method>"
     "<method name='make_app_data'><arg type='s' direction='in'/><arg type='i' direction='out'/>"
     "</method>"
+    "</interface>"
+    "<interface name='org.orvane.Quarn.Packages'>"
+    "<method name='CancelOwn'><arg type='u' direction='out'/></method>"
     "</interface></node>";
+
+constexpr char kPackagesPath[] = "/org/orvane/Quarn/Packages";
 
 using NodeInfo = Handle<GDBusNodeInfo, &g_dbus_node_info_unref>;
 
@@ -145,6 +150,8 @@ FakeDaemon::FakeDaemon(const PrivateBus &bus) : connection_(bus.connect()) {
   const NodeInfo node(g_dbus_node_info_new_for_xml(kDaemonXml, nullptr));
   object_ = g_dbus_connection_register_object(connection_.get(), kQuarnObjectPath,
                                               node->interfaces[0], &table, this, nullptr, nullptr);
+  packages_object_ = g_dbus_connection_register_object(
+      connection_.get(), kPackagesPath, node->interfaces[1], &table, this, nullptr, nullptr);
   GErrorPtr error;
   const GVariantPtr reply(g_dbus_connection_call_sync(
       connection_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
@@ -171,6 +178,7 @@ void FakeDaemon::die() {
   if (g_dbus_connection_is_closed(connection_.get()) == FALSE) {
     g_dbus_connection_flush_sync(connection_.get(), nullptr, nullptr);
     g_dbus_connection_unregister_object(connection_.get(), object_);
+    g_dbus_connection_unregister_object(connection_.get(), packages_object_);
     if (status_filter_ != 0) g_dbus_connection_remove_filter(connection_.get(), status_filter_);
     status_filter_ = 0;
     g_dbus_connection_close_sync(connection_.get(), nullptr, nullptr);

@@ -95,6 +95,7 @@ class FakeDaemon {
 
   Handle<GDBusConnection, &g_object_unref> connection_;
   guint object_ = 0;
+  guint packages_object_ = 0;
   guint status_filter_ = 0;
   GVariantPtr status_;
   GVariantPtr kept_;

@@ -261,14 +261,11 @@ TEST_F(Quarnctl, AnInterruptCancelsTheBackupAndWaitsForItsEnd) {
       backup->reply(0);
     });
   });
-  daemon.on("manual_backup_cancel", [&](const IncomingCall &call) {
-    EXPECT_NE(call.req_id(), req);
-    call.call_back("manual_backup_cancel_result", g_variant_new("(iu)", 0, call.req_id()),
-                   [&, call] {
-                     call.reply(0);
-                     call.call_back("manual_backup_status",
-                                    status_arguments(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, req));
-                   });
+  daemon.on("CancelOwn", [&](const IncomingCall &call) {
+    EXPECT_EQ(call.client(), backup->client()) << "the connection that asked for the backup";
+    call.reply_value(g_variant_new("(u)", 1U));
+    call.call_back("manual_backup_status",
+                   status_arguments(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, req));
   });
   const Outcome outcome = run.wait();
   EXPECT_EQ(outcome.exit, QUARN_CANCELLED);
@@ -284,18 +281,56 @@ TEST_F(Quarnctl, ASecondInterruptLeavesAtOnce) {
     call.reply(0);
     run.signal(SIGINT);
   });
-  daemon.on("manual_backup_cancel", [&](const IncomingCall &call) {
-    call.reply(0);
+  daemon.on("CancelOwn", [&](const IncomingCall &call) {
+    call.reply_value(g_variant_new("(u)", 1U));
     run.signal(SIGINT);
   });
   EXPECT_EQ(run.wait().exit, kInterrupted);
-  EXPECT_EQ(daemon.calls().back(), "manual_backup_cancel");
+  EXPECT_EQ(daemon.calls(), (std::vector<std::string>{"manual_backup_start", "CancelOwn"}))
+      << "nobody else's backup is cancelled";
+}
+
+TEST_F(Quarnctl, AnInterruptWithdrawsAnApplicationsRequest) {
+  for (const char *verb : {"backup", "restore"}) {
+    FakeDaemon daemon(bus());
+    QuarnctlRun run(bus(), {"app", verb, "org.example.notes"});
+    std::unique_ptr<IncomingCall> request;
+    const std::string name = verb;
+    daemon.on("app_data_" + name + "_start", [&](const IncomingCall &call) {
+      request = std::make_unique<IncomingCall>(call);
+      run.signal(SIGTERM);
+    });
+    daemon.on("CancelOwn", [&](const IncomingCall &call) {
+      call.reply_value(g_variant_new("(u)", 1U));
+      request->call_back(("app_data_" + name + "_complete").c_str(),
+                         text_arguments(QUARN_CANCELLED, "org.example.notes", request->req_id()),
+                         [&] { request->reply(0); });
+    });
+    const Outcome outcome = run.wait();
+    EXPECT_EQ(outcome.exit, QUARN_CANCELLED);
+    EXPECT_EQ(outcome.out, "cancelling the " + name + "; interrupt again to leave at once\n");
+    EXPECT_EQ(outcome.err, "quarnctl: " + name + " of org.example.notes failed: cancelled (17)\n");
+  }
+}
+
+TEST_F(Quarnctl, AWithdrawalThatIsRefusedEndsIt) {
+  FakeDaemon daemon(bus());
+  QuarnctlRun run(bus(), {"backup"});
+  daemon.on("manual_backup_start", [&](const IncomingCall &call) {
+    call.reply(0);
+    run.signal(SIGINT);
+  });
+  daemon.on("CancelOwn", [&](const IncomingCall &call) {
+    call.reply_error("org.freedesktop.DBus.Error.AccessDenied", "not you");
+  });
+  const Outcome outcome = run.wait();
+  EXPECT_EQ(outcome.err, "quarnctl: the bus does not allow the call: not you\n");
 }
 
 TEST_F(Quarnctl, AnInterruptEndsARequestThatCannotBeCancelled) {
   FakeDaemon daemon(bus());
-  QuarnctlRun run(bus(), {"app", "restore", "org.example.notes"});
-  daemon.on("app_data_restore_start", [&](const IncomingCall &) { run.signal(SIGTERM); });
+  QuarnctlRun run(bus(), {"app", "export", "org.example.notes"});
+  daemon.on("make_app_data", [&](const IncomingCall &) { run.signal(SIGTERM); });
   const Outcome outcome = run.wait();
   EXPECT_EQ(outcome.exit, kInterrupted);
   EXPECT_EQ(outcome.err, "quarnctl: interrupted\n");
