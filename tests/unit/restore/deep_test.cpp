@@ -108,7 +108,7 @@ TEST_F(DeepTest, ARollbackNeedsFewDescriptors) {
   const rlimit few = {128, before.rlim_max};
   ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &few), 0);
   EXPECT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
-  std::filesystem::remove_all(at("data/d"));
+  EXPECT_TRUE(delete_directory_util(at("data/d").c_str()));
   const rollback_result result = put_snapshot_back(kPkg, root.c_str());
   ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
   EXPECT_EQ(result, rollback_result::whole);
