@@ -9,6 +9,7 @@
 
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_end.h"
+#include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
@@ -57,6 +58,14 @@ gboolean cancel_backups(gpointer) {
   return G_SOURCE_REMOVE;
 }
 
+gboolean withdraw_requests(gpointer) {
+  for (const std::string &caller : take_quarn_turn_lines()) {
+    LOGI("withdrawal from the next process");
+    quarnd_cancel_own(caller);
+  }
+  return G_SOURCE_REMOVE;
+}
+
 gboolean leave_when_idle(gpointer) {
   end_quarn_when_idle();
   return G_SOURCE_REMOVE;
@@ -66,6 +75,10 @@ gboolean leave_when_idle(gpointer) {
 int take_signal(int signo) {
   if (signo == kCancelSignal) {
     g_idle_add_full(G_PRIORITY_DEFAULT, cancel_backups, nullptr, nullptr);
+    return kNoEnd;
+  }
+  if (signo == kWithdrawSignal) {
+    g_idle_add_full(G_PRIORITY_DEFAULT, withdraw_requests, nullptr, nullptr);
     return kNoEnd;
   }
   LOGI("SIGNAL %d received", signo);
@@ -91,7 +104,7 @@ void end_by_signal(int) {
 void install_signal_handlers() {
   if (!signals_watched) return;
   for (const int signo : {SIGINT, SIGHUP, SIGTERM, SIGQUIT}) signal(signo, signal_handler);
-  signal(kCancelSignal, signal_handler);
+  for (const int signo : {kCancelSignal, kWithdrawSignal}) signal(signo, signal_handler);
 }
 
 bool request_pending() { return backup_request_outstanding() || quarnd_calls_deferred(); }

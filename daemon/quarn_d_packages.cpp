@@ -2,7 +2,9 @@
 
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_turn.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_dbus_server.h"
 #include "quarn_log.h"
 
 const char kPackagesIntrospection[] =
@@ -23,7 +25,10 @@ guint packages_registration = 0;
 void on_method(GDBusConnection *, const gchar *sender, const gchar *, const gchar *, const gchar *,
                GVariant *, GDBusMethodInvocation *invocation, gpointer) {
   cancel_quarn_terminate();
-  const std::uint32_t count = quarnd_cancel_own(sender == nullptr ? "" : sender);
+  const std::string caller = sender == nullptr ? "" : sender;
+  // What it asked an earlier process for ends there, and is not counted here.
+  if (tell_quarn_predecessor(caller, kWithdrawSignal)) LOGI("withdrawal passed on");
+  const std::uint32_t count = quarnd_cancel_own(caller);
   g_dbus_method_invocation_return_value(invocation, g_variant_new("(u)", count));
 }
 

@@ -7,6 +7,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <chrono>
@@ -21,12 +22,15 @@ namespace {
 
 constexpr mode_t kLockMode = 0600;
 constexpr std::size_t kWaiterStackSize = 131072;
+constexpr std::size_t kReadSize = 4096;
 
 // Never destroyed: threads wait here when the process ends.
 std::mutex &turn_mutex = *new std::mutex;
 std::condition_variable &turn_changed = *new std::condition_variable;
 std::atomic<bool> turn{true};
 int lock_fd = -1;
+/** How far the lines in the lock's file have been read. */
+off_t lines_taken = 0;
 void (*turn_observer)() = nullptr;
 
 /** A record lock: it belongs to the process, goes with it, and tells who holds it. */
@@ -90,14 +94,20 @@ bool start_waiter() {
 void begin_quarn_turn(const char *lock_file, void (*on_turn)()) {
   turn_observer = on_turn;
   if (lock_fd < 0) {
-    lock_fd = open(lock_file, O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode);
+    // Never opened a second time: closing that one would give the lock away.
+    lock_fd = open(lock_file, O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode);
   }
   if (lock_fd < 0) {
     LOGE("cannot open %s : %d", lock_file, errno);
     return;
   }
+  lines_taken = std::max<off_t>(lseek(lock_fd, 0, SEEK_END), 0);
   struct flock lock = whole_file();
-  if (fcntl(lock_fd, F_SETLK, &lock) == 0) return;
+  if (fcntl(lock_fd, F_SETLK, &lock) == 0) {
+    // Nobody is left who would read them.
+    if (ftruncate(lock_fd, 0) == 0) lines_taken = 0;
+    return;
+  }
   if (errno != EACCES && errno != EAGAIN) {
     LOGE("cannot lock %s : %d", lock_file, errno);
     return;
@@ -112,6 +122,32 @@ bool is_quarn_turn() { return turn; }
 bool wait_for_quarn_turn(int ms) {
   std::unique_lock<std::mutex> lock(turn_mutex);
   return turn_changed.wait_for(lock, std::chrono::milliseconds(ms), [] { return turn.load(); });
+}
+
+bool tell_quarn_predecessor(const std::string &line, int signo) {
+  if (turn || lock_fd < 0) return false;
+  const std::string text = line + "\n";
+  if (write(lock_fd, text.data(), text.size()) != static_cast<ssize_t>(text.size())) {
+    LOGE("cannot tell the earlier process : %d", errno);
+    return false;
+  }
+  return signal_quarn_predecessor(signo);
+}
+
+std::vector<std::string> take_quarn_turn_lines() {
+  std::vector<std::string> lines;
+  std::string text;
+  char buffer[kReadSize];
+  ssize_t count = 0;
+  while (lock_fd >= 0 && (count = pread(lock_fd, buffer, sizeof buffer, lines_taken)) > 0) {
+    text.append(buffer, static_cast<std::size_t>(count));
+    lines_taken += count;
+  }
+  std::size_t begin = 0;
+  for (std::size_t end; (end = text.find('\n', begin)) != std::string::npos; begin = end + 1) {
+    lines.push_back(text.substr(begin, end - begin));
+  }
+  return lines;
 }
 
 bool signal_quarn_predecessor(int signo) {

@@ -9,6 +9,9 @@
 #ifndef QUARN_D_TURN_H
 #define QUARN_D_TURN_H
 
+#include <string>
+#include <vector>
+
 /**
  * Ask for the turn without waiting for it. Once, on the main thread.
  * @param lock_file a file in a folder that only the daemon's user can enter
@@ -21,6 +24,15 @@ bool is_quarn_turn();
 
 /** Wait up to @p ms. @return is_quarn_turn(). Any thread but the main one. */
 bool wait_for_quarn_turn(int ms);
+
+/**
+ * Leave a line for the process whose turn it is, and send it a signal.
+ * @return false when it is one's own. Main thread.
+ */
+bool tell_quarn_predecessor(const std::string &line, int signo);
+
+/** The lines that later processes have left since the last look, or since the start. Main thread. */
+std::vector<std::string> take_quarn_turn_lines();
 
 /** Send a signal to the process whose turn it is. @return false when it is one's own. Any thread.
  */

@@ -13,6 +13,8 @@
 
 /** What a process sends its predecessor to cancel the backups that run there. */
 inline constexpr int kCancelSignal = SIGUSR1;
+/** And to withdraw what the callers have asked for whose names it has left. */
+inline constexpr int kWithdrawSignal = SIGUSR2;
 
 /** The introspection document: tabs between its elements. */
 extern const char quarn_introspection_xml[];

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <csignal>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "log_capture.h"
@@ -88,6 +89,12 @@ void quarnd_dbus_leave() {
 }
 bool calls_deferred = false;
 bool quarnd_calls_deferred() { return calls_deferred; }
+std::vector<std::string> turn_lines;
+std::vector<std::string> take_quarn_turn_lines() { return std::exchange(turn_lines, {}); }
+std::uint32_t quarnd_cancel_own(const std::string &sender) {
+  step(("cancel_own " + sender).c_str());
+  return 0;
+}
 void quarnd_dispatch_deferred() { step("dispatch_deferred"); }
 bool prepare_staging_directory() { return true; }
 void begin_quarn_turn(const char *lock_file, void (*observer)()) {
@@ -316,6 +323,17 @@ TEST_F(Main, CancelFromTheNextProcessIsCarriedOutOnTheMainThread) {
   }
   EXPECT_TRUE(manual_backup_canceled);
   EXPECT_EQ(captured_texts(), (Texts{"cancel from the next process", "cancel_backup"}));
+}
+
+TEST_F(Main, WithdrawalsFromTheNextProcessAreCarriedOutOnTheMainThread) {
+  quarn_run();
+  restart();
+  turn_lines = {":1.5", ":1.7"};
+  EXPECT_LT(hooks.take(kWithdrawSignal), 0);
+  EXPECT_EQ(steps, Texts{});
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+  EXPECT_EQ(steps, (Texts{"cancel_own :1.5", "cancel_own :1.7"}));
 }
 
 TEST_F(Main, CallsThatWaitForTheEarlierProcessKeepTheDaemonAndFollowIt) {

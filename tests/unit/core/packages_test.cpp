@@ -11,6 +11,8 @@
 #include "private_bus.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_turn.h"
+#include "quarn_dbus_server.h"
 
 namespace {
 
@@ -20,6 +22,11 @@ std::uint32_t withdrawn = 0;
 
 }  // namespace
 
+bool predecessor = false;
+bool tell_quarn_predecessor(const std::string &line, int signo) {
+  if (predecessor) steps.push_back("pass on " + line + (signo == kWithdrawSignal ? "" : "?"));
+  return predecessor;
+}
 void cancel_quarn_terminate() { steps.emplace_back("cancel"); }
 std::uint32_t quarnd_cancel_own(const std::string &sender) {
   steps.push_back(sender);
@@ -75,6 +82,15 @@ TEST_F(Packages, CancelOwnWithdrawsForTheCallerAndSaysHowMany) {
   EXPECT_EQ(call("CancelOwn"), "(3,)");
   EXPECT_EQ(steps,
             (std::vector<std::string>{"cancel", g_dbus_connection_get_unique_name(client_.get())}));
+}
+
+TEST_F(Packages, CancelOwnReachesAnEarlierProcessThatStillFinishes) {
+  predecessor = true;
+  EXPECT_EQ(call("CancelOwn"), "(" + std::to_string(withdrawn) + ",)");
+  predecessor = false;
+  const std::string caller = g_dbus_connection_get_unique_name(client_.get());
+  EXPECT_EQ(steps, (std::vector<std::string>{"cancel", "pass on " + caller, caller}));
+  EXPECT_EQ(count_logged(DLOG_INFO, "withdrawal passed on"), 1);
 }
 
 TEST_F(Packages, OtherMethodsAreUnknown) {

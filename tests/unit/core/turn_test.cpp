@@ -35,7 +35,7 @@ class Folder {
   std::string path_ = "/tmp/quarn-turn-XXXXXX";
 };
 
-/** A process that holds the lock until its pipe is closed; it counts SIGUSR1. */
+/** A process that holds the lock until its pipe is closed; it tells of SIGUSR1 and of lines. */
 class Holder {
  public:
   explicit Holder(const std::string &lock) {
@@ -66,10 +66,17 @@ class Holder {
 
  private:
   static void on_signal(int) { static_cast<void>(!write(told_fd, "C", 1)); }
+  /** The process only waits, so that a handler may do what otherwise its loop does. */
+  static void on_lines(int) {
+    for (const std::string &line : take_quarn_turn_lines()) {
+      static_cast<void>(!write(told_fd, line.data(), line.size()));
+    }
+  }
   [[noreturn]] void hold(const std::string &lock) {
     close(hold_[1]);
     told_fd = tell_[1];
     std::signal(SIGUSR1, on_signal);
+    std::signal(SIGUSR2, on_lines);
     begin_quarn_turn(lock.c_str(), nullptr);
     if (is_quarn_turn()) on_signal_ready();
     char nothing = 0;
@@ -129,10 +136,29 @@ void wait_for_the_turn() {
   _exit(::testing::Test::HasFailure() ? 1 : 0);
 }
 
+void leave_lines() {
+  const Folder folder;
+  Holder holder(folder.lock());
+  begin_quarn_turn(folder.lock().c_str(), on_turn);
+  check(tell_quarn_predecessor("a", SIGUSR2), "it can be told");
+  check(holder.read_told() == 'a', "it reads the line");
+  check(tell_quarn_predecessor("b", SIGUSR2), "it can be told again");
+  check(holder.read_told() == 'b', "each line is read once");
+  check(take_quarn_turn_lines().size() == 2, "what was left since one's own start is seen as well");
+  check(take_quarn_turn_lines().empty(), "once");
+  holder.let_go();
+  check(wait_for_quarn_turn(kDeadlineMs) || is_quarn_turn(), "the turn comes");
+  check(!tell_quarn_predecessor("c", SIGUSR2), "nobody is before it any more");
+  unlink(folder.lock().c_str());
+  _exit(0);
+}
+
 void go_without_a_lock() {
   begin_quarn_turn("/nowhere/at/all/lock", on_turn);
   check(is_quarn_turn(), "it is always one's turn");
   check(!signal_quarn_predecessor(SIGUSR1), "nobody is known");
+  check(!tell_quarn_predecessor("a", SIGUSR2), "nor told");
+  check(take_quarn_turn_lines().empty(), "and nobody tells");
   _exit(0);
 }
 
@@ -147,6 +173,10 @@ TEST_F(TurnDeathTest, IsThereWhenNobodyElseHasIt) {
 
 TEST_F(TurnDeathTest, ComesWhenTheEarlierProcessEnds) {
   EXPECT_EXIT(wait_for_the_turn(), ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(TurnDeathTest, HasLinesOfThoseWhoWaitForIt) {
+  EXPECT_EXIT(leave_lines(), ::testing::ExitedWithCode(0), "");
 }
 
 TEST_F(TurnDeathTest, IsAlwaysThereWithoutALock) {
