@@ -59,6 +59,7 @@ void await_candidates() {
   // what is not known to be installed counts as what is to come
   list_installed_packages(&installed);
   await_archives(serial_num_user_select, pkg_list_to_be_restored, installed);
+  note_restore_mode_waits(serial_num_user_select);
 }
 
 int switch_on(int client, const std::string &serial_num, const char *pkg_list, RecordPtr record) {

@@ -1,6 +1,7 @@
 """What a backup removes from the cloud, and what it leaves there for a restore."""
 import json
 import os
+import signal
 import subprocess
 import sys
 import unittest
@@ -109,6 +110,19 @@ class CleanUp(TestCase):
         client.until(lambda: self.stops(client) and is_back(), "the data is back")
         self.backup()
         self.assertEqual(set(self.entries()), {HERE, GONE})
+
+    def test_a_mode_whose_daemon_is_killed_keeps_the_backup_from_the_nights(self):
+        self.restore_on(SERIAL, [GONE])
+        os.kill(self.device.daemon_pid(), signal.SIGKILL)
+        self.device.wait_for_daemon_end()
+        for _ in range(2):
+            self.nightly()
+            self.assert_kept()
+        client = self.restore_on(SERIAL, [GONE])
+        client.call("restore_enable", GLib.Variant("(iissu)", (0, 0, "", "[]", 8)))
+        client.until(lambda: self.stops(client), "the mode ends")
+        self.nightly()
+        self.assert_removed()
 
     def test_the_mode_for_another_device_keeps_nothing_of_this_one(self):
         self.restore_on(OTHER, [GONE])
