@@ -82,6 +82,7 @@ class Session {
   void last_time();
   void backup();
   void preview_backup(const std::set<std::string> &kept);
+  void preview_failed(int result);
   void preview_set(const std::string &text);
   void confirm_removal(const BackupSet &set, const std::vector<std::string> &removed);
   void start_backup();
@@ -281,7 +282,7 @@ void Session::last_time() {
 void Session::backup() {
   if (command_.yes) return start_backup();
   previewing_ = true;
-  // What cannot be found out now is not asked about: the backup finds it out as well.
+  // A daemon that cannot tell is not asked further: the backup finds out as well what is wrong.
   client_->read_kept_packages(
       [this](GVariant *answer) {
         if (done_ || !previewing_) return;
@@ -302,12 +303,27 @@ void Session::preview_backup(const std::set<std::string> &kept) {
         set_.serial = status.serial;
         on_answer_ = [this] {
           if (!callback_) return;
-          if (callback_->result != QUARN_OK) return start_backup();
+          if (callback_->result != QUARN_OK) return preview_failed(callback_->result);
           preview_set(callback_->text);
         };
         client_->call(
             "get_app_list", g_variant_new("(iu)", kCloudClient, req_id_), "(i)", [](GVariant *) {},
             [this](const BusFailure &) { start_backup(); });
+      },
+      [this](const BusFailure &) { start_backup(); });
+}
+
+void Session::preview_failed(int result) {
+  if (result == QUARN_NO_SESSION) return finish_with(result, "backup", "");
+  client_->read_status(
+      [this](GVariant *answer) {
+        if (done_ || !previewing_) return;
+        const std::string problem = read_status(answer).cloud_problem;
+        // The cloud holds no list yet: there is nothing to remove.
+        if (problem.empty()) return start_backup();
+        // The backup would end so as well, after having tried as long again.
+        finish_for(problem, QUARN_LIST_CHECK_FAILED, "backup failed",
+                   "backup failed: " + result_words(QUARN_LIST_CHECK_FAILED));
       },
       [this](const BusFailure &) { start_backup(); });
 }

@@ -140,6 +140,19 @@ bool is_supported_format(json_object *root) {
   return version != nullptr && json_object_get_int64(version) == kSupportedFormat;
 }
 
+/** This device's entry goes on, with the time of this run and without its packages. */
+void take_own_entry(backup_context *ctx, own_entry *own) {
+  ctx->model_entry = own->entry.release();
+  ctx->json_objects.push_back(ctx->model_entry);
+  json_object_array_put_idx(ctx->model_list, own->index, ctx->model_entry);
+  get_previous_package_list_info(ctx, own->packages);
+  ctx->backup_info = member(ctx->model_entry, kBackupInfo, json_type_object);
+  set_timestamp(ctx->backup_info);
+  json_object_object_del(ctx->model_entry, kPkgList);
+  ctx->pkg_list = generate_new_json_array(ctx);
+  json_object_object_add(ctx->model_entry, kPkgList, ctx->pkg_list);
+}
+
 /** Create the file where it is for us alone, or see that it is a plain one of ours. */
 bool prepare_file(const std::string &path) {
   const UniqueFd fd = safe_open(path.c_str(), O_WRONLY | O_CREAT | O_NONBLOCK, kPrivateFile);
@@ -278,15 +291,7 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
     return QUARN_OK;
   }
 
-  ctx->model_entry = own.entry.release();
-  ctx->json_objects.push_back(ctx->model_entry);
-  json_object_array_put_idx(ctx->model_list, own.index, ctx->model_entry);
-  get_previous_package_list_info(ctx, own.packages);
-  ctx->backup_info = member(ctx->model_entry, kBackupInfo, json_type_object);
-  set_timestamp(ctx->backup_info);
-  json_object_object_del(ctx->model_entry, kPkgList);
-  ctx->pkg_list = generate_new_json_array(ctx);
-  json_object_object_add(ctx->model_entry, kPkgList, ctx->pkg_list);
+  take_own_entry(ctx, &own);
   return QUARN_OK;
 }
 

@@ -159,6 +159,29 @@ void report_package(backup_context *ctx, backup_outcome outcome, std::uint64_t s
   report_progress(ctx, backup_stage::archiving, ctx->cur_pkg_id.c_str(), outcome, size, limit);
 }
 
+void begin_package(backup_context *ctx, const package_values &values) {
+  ++ctx->packages_examined;
+  ctx->zip_made = false;
+  ctx->cur_pkg_id = values.id.get();
+  ctx->cur_version = values.version.get();
+  ctx->cur_pkg_type = values.type.get();
+  ctx->cur_root_path = values.root.get();
+  ctx->cur_backup_enabled = true;
+  ctx->cur_crc = 0;
+}
+
+/** A package whose archive a restore is still to have is not backed up over it. */
+bool leave_to_restore(backup_context *ctx) {
+  if (ctx->for_pellix ||
+      claim_on_archive(ctx->serial_number, ctx->cur_pkg_id) != archive_claim::whole) {
+    return false;
+  }
+  LOGI("backup of (%s) waits for its restore", ctx->cur_pkg_id.c_str());
+  report_package(ctx, backup_outcome::restoring);
+  keep_unexamined(ctx, ctx->cur_pkg_id.c_str());
+  return true;
+}
+
 /** A size that is too large may be that of a folder that cannot be measured. */
 void report_oversize(backup_context *ctx, backup_outcome outcome, std::uint64_t size,
                      std::uint64_t limit) {
@@ -311,22 +334,8 @@ bool foreach_package_info_callback(package_info_h info, void *user_data) {
     return true;
   }
 
-  ++ctx->packages_examined;
-  ctx->zip_made = false;
-  ctx->cur_pkg_id = values.id.get();
-  ctx->cur_version = values.version.get();
-  ctx->cur_pkg_type = values.type.get();
-  ctx->cur_root_path = values.root.get();
-  ctx->cur_backup_enabled = true;
-  ctx->cur_crc = 0;
-
-  if (!ctx->for_pellix &&
-      claim_on_archive(ctx->serial_number, ctx->cur_pkg_id) == archive_claim::whole) {
-    LOGI("backup of (%s) waits for its restore", ctx->cur_pkg_id.c_str());
-    report_package(ctx, backup_outcome::restoring);
-    keep_unexamined(ctx, ctx->cur_pkg_id.c_str());
-    return true;
-  }
+  begin_package(ctx, values);
+  if (leave_to_restore(ctx)) return true;
 
   ret = package_info_foreach_app_from_package(info, PACKAGE_INFO_ALLAPP, check_backup_enabled, ctx);
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {

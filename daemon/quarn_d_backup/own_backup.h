@@ -14,7 +14,7 @@
 #include <string>
 
 /** Setting: the CRC-32 of the serial number whose backup is this device's own, an integer; -1
- * while a backup that was found is undecided on. */
+ * while a backup that was found is undecided on, -2 while restore mode waits for packages of it. */
 inline constexpr char kOwnBackupKey[] = "db/private/quarn/own_backup";
 
 /**
@@ -28,6 +28,12 @@ void note_own_backup(const std::string &serial);
 void note_found_backup();
 /** The time of the last backup is about to be forgotten; what it tells of is not. */
 void keep_knowledge_of_last_backup();
+/**
+ * Restore mode waits for packages of the device @p serial. When that is this
+ * device, and the daemon ends before the mode does, nothing of the backup is
+ * known to be superfluous by then.
+ */
+void note_restore_mode_waits(const std::string &serial);
 /** Restore mode was used to its end: the user had what was wanted of the backup. */
 void note_restore_mode_used();
 

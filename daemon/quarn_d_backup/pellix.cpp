@@ -3,6 +3,7 @@
 
 #include "platform_smack.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
@@ -65,7 +66,9 @@ char *get_app_list_for_pellix() {
     LOGE("package_manager_foreach_package_info() failed %d", ret);
     return nullptr;
   }
-  if (!save_app_list_to_file(ctx.get())) return nullptr;
+  const bool saved = save_app_list_to_file(ctx.get());
+  note_request_end(notes_of(ctx.get()).cause);
+  if (!saved) return nullptr;
   CString text;
   if (!read_data_from_file(list_path.c_str(), out(text))) {
     LOGE("cannot read app list file...");

@@ -62,6 +62,7 @@ void await_candidates() {
   // what is not known to be installed counts as what is to come
   list_installed_packages(&installed);
   await_archives(serial_num_user_select, pkg_list_to_be_restored, installed);
+  note_restore_mode_waits(serial_num_user_select);
 }
 
 /** The answer to a request in whose place another came while it waited for the session. */

@@ -284,7 +284,7 @@ class KilledRestore(CrashTest):
 
     def test_a_backup_packs_a_half_restored_package_as_it_was_before_the_restore(self):
         self.kill_half_way()
-        self.device.quarnctl("backup")
+        self.device.quarnctl("backup", "--yes")
         self.assertEqual(tree(self.root), self.present)
         archive = os.path.join(self.device.cloud, SERIAL, PACKAGE, "1.0.0", PACKAGE + ".zip")
         with zipfile.ZipFile(archive) as packed:

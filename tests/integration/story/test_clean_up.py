@@ -1,6 +1,8 @@
 """What a backup removes from the cloud, and what it leaves there for a restore."""
 import json
 import os
+import shutil
+import signal
 import subprocess
 import sys
 import unittest
@@ -15,6 +17,8 @@ OTHER = "350000000000002"
 GONE = "org.example.gone"
 HERE = "org.example.here"
 OWN_BACKUP = "db/private/quarn/own_backup"
+#: Bytes that an application list has at the most.
+BOUND = 4 << 20
 LAST_TIME = "db/private/quarn/last_time"
 
 
@@ -109,6 +113,19 @@ class CleanUp(TestCase):
         client.until(lambda: self.stops(client) and is_back(), "the data is back")
         self.backup()
         self.assertEqual(set(self.entries()), {HERE, GONE})
+
+    def test_a_mode_whose_daemon_is_killed_keeps_the_backup_from_the_nights(self):
+        self.restore_on(SERIAL, [GONE])
+        os.kill(self.device.daemon_pid(), signal.SIGKILL)
+        self.device.wait_for_daemon_end()
+        for _ in range(2):
+            self.nightly()
+            self.assert_kept()
+        client = self.restore_on(SERIAL, [GONE])
+        client.call("restore_enable", GLib.Variant("(iissu)", (0, 0, "", "[]", 8)))
+        client.until(lambda: self.stops(client), "the mode ends")
+        self.nightly()
+        self.assert_removed()
 
     def test_the_mode_for_another_device_keeps_nothing_of_this_one(self):
         self.restore_on(OTHER, [GONE])
@@ -208,6 +225,77 @@ class Causes(TestCase):
         self.assertEqual(failed.stderr,
                          "quarnctl: backup failed: this device has no room left (12)\n")
         self.assertEqual(os.listdir(self.device.cloud), [])
+
+    def other_devices_list(self, size):
+        """An application list of another device, of that many bytes."""
+        folder = os.path.join(self.device.cloud, "app_list")
+        os.makedirs(folder, exist_ok=True)
+        text = ('{"format_ver":1,"model_list":[{"backup_info":{"serial_number":"%s"},'
+                '"pkg_list":[],"x":"%s"}]}')
+        text %= OTHER, "x" * (size - len(text) - len(OTHER) + 4)
+        self.assertEqual(len(text), size)
+        with open(os.path.join(folder, "app_list.txt"), "w") as file:
+            file.write(text)
+        return text
+
+    def test_a_failed_upload_says_that_no_list_was_written(self):
+        self.device.quarnctl("backup")
+        path = os.path.join(self.device.cloud, SERIAL, HERE, "1.0")
+        shutil.rmtree(path)
+        with open(path, "w"):
+            pass
+        with open(self.device.app_path(HERE, "data/file"), "w") as file:
+            file.write("changed")
+        failed = self.device.quarnctl("backup", check=False)
+        self.assertEqual(failed.returncode, 12, failed.stdout + failed.stderr)
+        self.assertIn("quarnctl: no list was written: what this backup sent of changed packages "
+                      "cannot be restored yet; the next backup sends it again\n", failed.stderr)
+        self.assertIn("the cloud answered with an error\n", failed.stderr)
+        document = json.loads(self.device.quarnctl("backup", "--json", check=False).stdout)
+        self.assertEqual((document["cloud_problem"], document["list_written"]), ("server", False))
+        os.unlink(path)
+        self.device.quarnctl("backup")
+
+    def test_a_list_near_its_bound_is_noted_and_one_beyond_it_stands(self):
+        subprocess.run(["mount", "-o", "remount,size=64m", self.staging], check=True)
+        self.other_devices_list(BOUND - 2000)
+        noted = self.device.quarnctl("backup")
+        self.assertIn("quarnctl: note: the application list is nearly full: 4.0 MiB of at most "
+                      "4.0 MiB", noted.stderr)
+        text = self.device.quarnctl("list").stdout
+        self.assertIn(HERE, text)
+        before = self.other_devices_list(BOUND)
+        with open(self.device.app_path(HERE, "data/file"), "w") as file:
+            file.write("changed")
+        failed = self.device.quarnctl("backup", check=False)
+        self.assertEqual(failed.returncode, 42, failed.stdout + failed.stderr)
+        self.assertEqual(failed.stderr, "quarnctl: backup failed: the application list is larger "
+                                        "than what devices can read (42)\n")
+        self.assertNotIn("uploading", failed.stdout)
+        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
+            self.assertEqual(file.read(), before)
+
+    def test_packages_that_are_not_backed_up_are_told_apart(self):
+        deep = self.device.app_path(HERE, "data")
+        at = os.open(deep, os.O_RDONLY)
+        for _ in range(401):
+            os.mkdir("d", dir_fd=at)
+            at, above = os.open("d", os.O_RDONLY, dir_fd=at), at
+            os.close(above)
+        os.close(at)
+        for package, keys in (("org.example.external", {"storage": "external"}),
+                              ("org.example.disabled", {"metadata": {"backup": "disable"}})):
+            self.device.install(make_source(self.path(package), package, "1.0",
+                                            {"data/file": b"x"}, **keys))
+        self.device.install(make_source(self.path("broken"), "org.example.broken", "1.0",
+                                        {"data/file": b"x"}))
+        shutil.rmtree(self.device.app_path("org.example.broken", "shared/trusted"))
+        document = json.loads(self.device.quarnctl("backup", "--json").stdout)
+        self.assertEqual({one["package"]: one["reason"] for one in document["packages"]},
+                         {HERE: "too-deep", "org.example.external": "external",
+                          "org.example.disabled": "disabled",
+                          "org.example.broken": "unreadable"})
+        subprocess.run(["rm", "-rf", os.path.join(deep, "d")], check=True)
 
     def test_a_list_of_another_form_is_said_to_be_that_and_nothing_is_sent(self):
         folder = os.path.join(self.device.cloud, "app_list")

@@ -150,6 +150,35 @@ TEST_F(Claims, AnInstalledPackageThatIsWaitedForIsBackedUpUntilItIsRemoved) {
   expect_kept();
 }
 
+/** Restore mode was on when the daemon was killed: its list is gone, the knowledge is not. */
+TEST_F(Claims, AModeThatTheDaemonDidNotOutliveKeepsTheBackupFromNightlyRuns) {
+  note_restore_mode_waits(kSerial);
+  EXPECT_EQ(settings_[kOwnBackupKey], -2);
+  EXPECT_TRUE(knows_own_backup(kSerial)) << "this process knows what it waits for";
+  wait_for_kept();
+  automatic();
+  manual();
+  expect_kept();
+  EXPECT_EQ(settings_[kOwnBackupKey], -2);
+  // the next process: nothing is waited for here
+  note_restore_mode_used();
+  settings_[kOwnBackupKey] = -2;
+  await_no_archives();
+  EXPECT_FALSE(knows_own_backup(kSerial));
+  automatic();
+  automatic();
+  expect_kept();
+  manual();
+  expect_gone();
+  EXPECT_TRUE(knows_own_backup(kSerial));
+}
+
+TEST_F(Claims, AModeForAnotherDevicesBackupLeavesTheKnowledgeOfOnesOwn) {
+  const double before = settings_[kOwnBackupKey];
+  note_restore_mode_waits("350000000000002");
+  EXPECT_EQ(settings_[kOwnBackupKey], before);
+}
+
 TEST_F(Claims, AHoldKeepsThePackageUntilTheLastOneGoes) {
   auto first = std::make_unique<archive_hold>(kSerial, "org.kept");
   archive_hold second(kSerial, "org.kept");

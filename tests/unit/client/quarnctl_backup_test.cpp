@@ -119,10 +119,8 @@ TEST_F(QuarnctlBackup, ThatRemovesNothingAsksNothing) {
 }
 
 TEST_F(QuarnctlBackup, WhatCannotBeFoundOutIsNotAskedAbout) {
-  for (const auto &[error, text] : {std::pair{1, "none"},
-                                    {33, "failed"},
-                                    {0, "not a list"},
-                                    {0, R"({"format_ver":1,"model_list":[]})"}}) {
+  for (const auto &[error, text] :
+       {std::pair{1, "none"}, {0, "not a list"}, {0, R"({"format_ver":1,"model_list":[]})"}}) {
     answer_list(error, text);
     EXPECT_EQ(quarnctl(*bus_, {"backup"}).exit, 0) << text;
   }
@@ -133,6 +131,25 @@ TEST_F(QuarnctlBackup, WhatCannotBeFoundOutIsNotAskedAbout) {
   daemon_.serve_kept_packages(g_variant_new_parsed("@as []"));
   EXPECT_EQ(quarnctl(*bus_, {"backup"}).exit, 0);
   EXPECT_EQ(daemon_.calls().back(), "manual_backup_start");
+}
+
+TEST_F(QuarnctlBackup, AListThatCannotBeHadEndsItAsTheRunWouldEnd) {
+  answer_list(1, "none");
+  for (const auto &[problem, error] :
+       {std::pair{"network",
+                  "the cloud's application list could not be checked, or a request was "
+                  "not accepted (13): the cloud cannot be reached"},
+        {"device-full", "this device has no room left (13)"}}) {
+    serve(true, problem);
+    const Outcome outcome = quarnctl(*bus_, {"backup"});
+    EXPECT_EQ(outcome.exit, 13);
+    EXPECT_EQ(outcome.err, std::string("quarnctl: backup failed: ") + error + "\n");
+  }
+  answer_list(33, "failed");
+  const Outcome outcome = quarnctl(*bus_, {"backup"});
+  EXPECT_EQ(outcome.exit, 33);
+  EXPECT_EQ(outcome.err, "quarnctl: backup failed: no Wi-Fi, or no session with the cloud (33)\n");
+  EXPECT_FALSE(started());
 }
 
 TEST_F(QuarnctlBackup, OnATerminalItIsAsked) {
