@@ -66,10 +66,13 @@ class Loop : public ::testing::Test {
   }
 };
 
-/** What a waiting request may keep; the sanitizers keep books on every byte that was used. */
+// What a request uses before it waits, and what it may keep then. The sanitizers keep books on
+// every byte that was used, and give nothing back.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr std::size_t kBytesBefore = 16384;
 constexpr std::size_t kBytesOfWaiting = 2097152;
 #else
+constexpr std::size_t kBytesBefore = 131072;
 constexpr std::size_t kBytesOfWaiting = 12288;
 #endif
 
@@ -411,7 +414,7 @@ TEST_F(Loop, FiveHundredWaitingRequestsTakeLittleMemory) {
   on_main_loop([&] {
     for (std::size_t i = 0; i < kRequests; ++i) {
       run_on_fiber([&] {
-        use_stack(kFiberStackSize / 2);  // what went before the wait is given back
+        use_stack(kBytesBefore);  // what went before the wait is given back
         run_nested_loop(mark.get());
         ++over;
       });
