@@ -102,12 +102,16 @@ class Policy(unittest.TestCase):
         status, text = self.call_as(CLIENT_USER, "org.freedesktop.DBus.Properties.GetAll",
                                     path="/org/orvane/Quarn/Status", arguments=("org.x",))
         self.assertNotIn("AccessDenied", text)
+        status, text = self.call_as(CLIENT_USER, "org.orvane.Quarn.Packages.CancelOwn",
+                                    path="/org/orvane/Quarn/Packages")
+        self.assertNotIn("AccessDenied", text)
         status, text = self.call_as(CLIENT_USER, "org.example.Other.method")
         self.assertNotEqual(status, 0)
         self.assertIn("AccessDenied", text)
 
     def test_4_strangers_may_not_call(self):
         for method, path in ((self.CALLBACK, PATH),
+                             ("org.orvane.Quarn.Packages.CancelOwn", "/org/orvane/Quarn/Packages"),
                              ("org.freedesktop.DBus.Properties.GetAll", "/org/orvane/Quarn/Status")):
             status, text = self.call_as(STRANGER, method, path=path,
                                         arguments=self.ARGUMENTS[:2])
