@@ -111,6 +111,20 @@ loop.run()
                    or self.starts(device) > 1, "its end is noticed")
         self.assertEqual(self.starts(device), 1)
 
+    def test_a_daemon_that_is_told_to_end_before_it_can_hear_of_it_loses_no_call(self):
+        """The bus keeps the call that it was started for, and waits for the next one's name."""
+        device = self.device_with(self.NAMED.replace(
+            "loop =", "if count < 4:\n    os.kill(os.getpid(), (15, 1, 15)[count - 1])\nloop =") %
+            "os._exit(0)")
+        device.exec(*START)
+        self.assertEqual(self.starts(device), 4)
+
+    def test_a_daemon_that_is_always_told_to_end_is_given_up(self):
+        device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nkill -TERM $$\n')
+        result = device.exec(*START, check=False)
+        self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
+        self.assertEqual(self.starts(device), 6)
+
     def test_a_daemon_that_fails_before_it_has_its_name_is_not_started_again(self):
         device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nexit 255\n')
         result = device.exec(*START, check=False)
