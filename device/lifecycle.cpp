@@ -383,6 +383,15 @@ void stop_daemon(Running *self) {
     kill(static_cast<pid_t>(pid), SIGKILL);
 }
 
+/** The daemon beside this program, or an installed one; empty when there is none. */
+std::string daemon_program() {
+  const std::string beside = program_directory() + "/quarnd";
+  for (const char *program : {beside.c_str(), QUARN_INSTALLED_DAEMON, "/usr/sbin/quarnd"}) {
+    if (access(program, X_OK) == 0) return program;
+  }
+  return "";
+}
+
 /** @param lock of the start, held until the supervisor can be found: a start may be killed */
 [[noreturn]] void supervise(const std::string &device, int tell, int lock) {
   int status = DEVICE_FAILED;
@@ -591,17 +600,6 @@ void request_daemon(const std::string &device) {
   g_variant_unref(answer);
 }
 
-std::string find_daemon() {
-  std::string program = program_directory() + "/quarnd";
-  for (const char *installed : {QUARN_INSTALLED_DAEMON, "/usr/sbin/quarnd"}) {
-    if (access(program.c_str(), X_OK) != 0) program = installed;
-  }
-  if (access(program.c_str(), X_OK) != 0) {
-    throw Failure("no quarnd beside this program nor in its place of installation");
-  }
-  return program;
-}
-
 /** Run the daemon to its end. @return its status as waitpid() tells it */
 int run_daemon(const std::string &program, const std::string &device) {
   const pid_t self = getpid();
@@ -751,7 +749,10 @@ int verb_exec(const Arguments &arguments) {
 
 int verb_daemon(const Arguments &arguments) {
   if (arguments.size() != 1) wrong_use();
-  const std::string program = find_daemon();
+  const std::string program = daemon_program();
+  if (program.empty()) {
+    throw Failure("no quarnd beside this program nor in its place of installation");
+  }
   const std::string &device = arguments[0];
   set_environment(device);
   int status = run_daemon(program, device);

@@ -50,13 +50,20 @@ def kill_supervisor(device):
 class FakeDaemon(TestCase):
     """Devices whose quarnd is a script of the test's own beside a copy of the tool."""
 
+    WRAPPER = """#!/bin/sh
+test "$1" = --recover && exit 0
+exec "$(dirname "$0")/script"
+"""
+
     def device_with(self, script):
         os.mkdir(self.path("bin"))
         shutil.copy2(os.path.join(BIN_DIR, "quarn-device"), self.path("bin"))
         if script is not None:
-            with open(self.path("bin", "quarnd"), "w") as file:
-                file.write(script)
-            os.chmod(self.path("bin", "quarnd"), 0o755)
+            # What is run once at the device's start is no start of the daemon.
+            for name, text in (("script", script), ("quarnd", self.WRAPPER)):
+                with open(self.path("bin", name), "w") as file:
+                    file.write(text)
+                os.chmod(self.path("bin", name), 0o755)
         device = self.new_device()
         device.tool = self.path("bin", "quarn-device")
         device.start()
