@@ -618,6 +618,33 @@ void request_daemon(const std::string &device) {
   g_variant_unref(answer);
 }
 
+/** Run the daemon to its end. @return its status as waitpid() tells it */
+int run_daemon(const std::string &program, const std::string &device) {
+  const pid_t self = getpid();
+  const pid_t pid = fork();
+  if (pid < 0) throw Failure("cannot start the daemon: " + reason());
+  if (pid == 0) {
+    prctl(PR_SET_PDEATHSIG, SIGTERM);
+    if (getppid() != self) _exit(DEVICE_FAILED);
+    execl(program.c_str(), "quarnd", nullptr);
+    std::fprintf(stderr, "quarn-device: cannot run %s: %s\n", program.c_str(),
+                 std::strerror(errno));
+    _exit(DEVICE_OK);
+  }
+  int status = 0;
+  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  }
+  embedded::drop_power_locks(device, pid);
+  return status;
+}
+
+/** Told to end before it could hear of it: nothing was begun, and nobody was answered. */
+bool ended_unprepared(int status) {
+  if (!WIFSIGNALED(status)) return false;
+  const int number = WTERMSIG(status);
+  return number == SIGTERM || number == SIGINT || number == SIGHUP || number == SIGQUIT;
+}
+
 }  // namespace
 
 void write_file(const std::string &path, const std::string &text) {
@@ -744,23 +771,13 @@ int verb_daemon(const Arguments &arguments) {
   if (program.empty()) {
     throw Failure("no quarnd beside this program nor in its place of installation");
   }
-  set_environment(arguments[0]);
   const std::string &device = arguments[0];
-  const pid_t self = getpid();
-  const pid_t pid = fork();
-  if (pid < 0) throw Failure("cannot start the daemon: " + reason());
-  if (pid == 0) {
-    prctl(PR_SET_PDEATHSIG, SIGTERM);
-    if (getppid() != self) _exit(DEVICE_FAILED);
-    execl(program.c_str(), "quarnd", nullptr);
-    std::fprintf(stderr, "quarn-device: cannot run %s: %s\n", program.c_str(),
-                 std::strerror(errno));
-    _exit(DEVICE_OK);
+  set_environment(device);
+  int status = run_daemon(program, device);
+  // The bus still waits for the name, with the calls that the daemon was started for.
+  for (int i = 0; i < kMaxRestarts && ended_unprepared(status); ++i) {
+    status = run_daemon(program, device);
   }
-  int status = 0;
-  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-  }
-  embedded::drop_power_locks(device, pid);
   // What a service manager does for a daemon that ends with a failure status. The bus starts it,
   // so that a caller of this very moment does not start another one.
   if (may_restart(device, WIFEXITED(status) && WEXITSTATUS(status) != 0)) request_daemon(device);

@@ -163,11 +163,12 @@ class Churn(TestCase):
 
     # ---- what clients do ----
 
-    def send(self, method, types=None, *values, package=None):
+    def send(self, method, types=None, *values, package=None, **where):
         number = len(self.requests) + 1
         values = [number if value == "NUMBER" else value for value in values]
         client = self.random.choice(self.clients)
-        call = client.start(method, GLib.Variant(types, tuple(values)) if types else None)
+        call = client.start(method, GLib.Variant(types, tuple(values)) if types else None,
+                            **where)
         request = Request(number, client, method, package, call)
         request.unsure = self.network != "wifi"
         self.requests.append(request)
@@ -181,6 +182,10 @@ class Churn(TestCase):
 
     def cancel(self):
         self.send("manual_backup_cancel", "(u)", "NUMBER")
+
+    def cancel_own(self):
+        self.send("CancelOwn", path="/org/orvane/Quarn/Packages",
+                  interface="org.orvane.Quarn.Packages")
 
     def app_backup(self):
         package = self.any_package()
@@ -366,8 +371,8 @@ class Churn(TestCase):
         self.sort_callbacks()
         self.collect_jobs()
 
-    ACTIONS = ((backup, 8), (cancel, 4), (app_backup, 12), (app_restore, 12), (export, 6),
-               (app_list, 4), (restore_mode, 4), (restore_mode_off, 3), (last_time, 6),
+    ACTIONS = ((backup, 8), (cancel, 4), (cancel_own, 2), (app_backup, 12), (app_restore, 12),
+               (export, 6), (app_list, 4), (restore_mode, 4), (restore_mode_off, 3), (last_time, 6),
                (activation, 6), (automatic, 3), (install, 14), (remove, 6), (write, 30), (flap, 5),
                (conditions, 3), (clock, 1), (end_daemon, 3), (kill_daemon, 2))
 

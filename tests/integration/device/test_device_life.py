@@ -50,13 +50,20 @@ def kill_supervisor(device):
 class FakeDaemon(TestCase):
     """Devices whose quarnd is a script of the test's own beside a copy of the tool."""
 
+    WRAPPER = """#!/bin/sh
+test "$1" = --recover && exit 0
+exec "$(dirname "$0")/script"
+"""
+
     def device_with(self, script):
         os.mkdir(self.path("bin"))
         shutil.copy2(os.path.join(BIN_DIR, "quarn-device"), self.path("bin"))
         if script is not None:
-            with open(self.path("bin", "quarnd"), "w") as file:
-                file.write(script)
-            os.chmod(self.path("bin", "quarnd"), 0o755)
+            # What is run once at the device's start is no start of the daemon.
+            for name, text in (("script", script), ("quarnd", self.WRAPPER)):
+                with open(self.path("bin", name), "w") as file:
+                    file.write(text)
+                os.chmod(self.path("bin", name), 0o755)
         device = self.new_device()
         device.tool = self.path("bin", "quarn-device")
         device.start()
@@ -110,6 +117,20 @@ loop.run()
         wait_until(lambda: not os.path.exists(os.path.join(device.path, "run/restarts"))
                    or self.starts(device) > 1, "its end is noticed")
         self.assertEqual(self.starts(device), 1)
+
+    def test_a_daemon_that_is_told_to_end_before_it_can_hear_of_it_loses_no_call(self):
+        """The bus keeps the call that it was started for, and waits for the next one's name."""
+        device = self.device_with(self.NAMED.replace(
+            "loop =", "if count < 4:\n    os.kill(os.getpid(), (15, 1, 15)[count - 1])\nloop =") %
+            "os._exit(0)")
+        device.exec(*START)
+        self.assertEqual(self.starts(device), 4)
+
+    def test_a_daemon_that_is_always_told_to_end_is_given_up(self):
+        device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nkill -TERM $$\n')
+        result = device.exec(*START, check=False)
+        self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
+        self.assertEqual(self.starts(device), 6)
 
     def test_a_daemon_that_fails_before_it_has_its_name_is_not_started_again(self):
         device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nexit 255\n')
