@@ -88,8 +88,10 @@ bool calls_deferred = false;
 bool quarnd_calls_deferred() { return calls_deferred; }
 void quarnd_dispatch_deferred() { step("dispatch_deferred"); }
 bool prepare_staging_directory() { return true; }
-void begin_quarn_turn(const char *lock_file, void (*observer)()) {
+void end_quarn_turn() { step("end_turn"); }
+void begin_quarn_turn(const char *lock_file, bool (*prepare)(), void (*observer)()) {
   step("begin_turn");
+  EXPECT_EQ(prepare, prepare_staging_directory);
   EXPECT_STREQ(lock_file, "/tmp/quarn/lock");
   on_turn = observer;
 }
@@ -210,6 +212,7 @@ TEST_F(Main, RunsItsStepsInOrder) {
                                      "dbus_deinit",
                                      "ecore_shutdown ~",
                                      "loop_shutdown",
+                                     "end_turn",
                                      "Good-Bye from Quarn"}));
 }
 
@@ -271,10 +274,11 @@ TEST_F(Main, SignalTellsTheClientsTearsDownOnceAndEndsWithZero) {
     hooks.end(SIGTERM);
   };
   EXPECT_EQ(quarn_run(), 0);
-  EXPECT_EQ(captured_texts(),
-            (Texts{"end_requests", "quit_nested_loops", "loop_quit", "dbus_leave", "end_requests",
-                   "deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport",
-                   "dbus_deinit", "ecore_shutdown ~", "loop_shutdown", "Good-Bye from Quarn"}));
+  EXPECT_EQ(
+      captured_texts(),
+      (Texts{"end_requests", "quit_nested_loops", "loop_quit", "dbus_leave", "end_requests",
+             "deinit_backup_resource", "quarnd_dbus_deinit ~", "status_unexport", "dbus_deinit",
+             "ecore_shutdown ~", "loop_shutdown", "end_turn", "Good-Bye from Quarn"}));
 }
 
 TEST_F(Main, ProcessThatDoesNotEndTellsItsClientsLast) {
