@@ -175,20 +175,24 @@ int quarn_run() {
   signals_watched = quarn_loop_watch_signals(
       {take_signal, quarn_dbus_stop_waiting, end_by_signal, tell_waiting_clients, kSignalGrace});
   install_signal_handlers();
-  if (prepare_staging_directory()) begin_quarn_turn(kLockName, quarnd_dispatch_deferred);
+  begin_quarn_turn(kLockName, prepare_staging_directory, quarnd_dispatch_deferred);
   init_quarn();
   init_backup_req_dispatch_thread();
   LOGI("== main loop begin ==");
   quarn_loop_begin();
   leave_clients();
   deinit_quarn();
+  end_quarn_turn();
   LOGI("Good-Bye from Quarn");
   return quarn_exit_code;
 }
 
 int quarn_recover() {
   LOGI("recovery of what an interrupted restore or backup has left");
-  recover_device();
+  begin_quarn_turn(kLockName, prepare_staging_directory, nullptr);
+  // A daemon that works at this moment has done it at its own start.
+  if (is_quarn_turn()) recover_device();
+  end_quarn_turn();
   return 0;
 }
 

@@ -2,8 +2,8 @@
 
 #include <fcntl.h>
 #include <glib.h>
-#include <poll.h>
 #include <pthread.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -13,7 +13,9 @@
 #include <chrono>
 #include <condition_variable>
 #include <csignal>
+#include <cstring>
 #include <mutex>
+#include <string>
 
 #include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
@@ -28,9 +30,12 @@ constexpr std::size_t kReadSize = 4096;
 std::mutex &turn_mutex = *new std::mutex;
 std::condition_variable &turn_changed = *new std::condition_variable;
 std::atomic<bool> turn{true};
-int lock_fd = -1;
+const char *lock_path = nullptr;
+bool (*prepare_folder)() = nullptr;
+// Not closed when it is replaced: another thread may be looking at it.
+std::atomic<int> lock_fd{-1};
 /** How far the lines in the lock's file have been read. */
-off_t lines_taken = 0;
+std::atomic<off_t> lines_taken{0};
 void (*turn_observer)() = nullptr;
 
 /** A record lock: it belongs to the process, goes with it, and tells who holds it. */
@@ -61,13 +66,49 @@ void take_turn() {
   g_idle_add_full(G_PRIORITY_DEFAULT, tell_observer, nullptr, nullptr);
 }
 
-void *wait_for_lock(void *) {
-  struct flock lock = whole_file();
-  while (fcntl(lock_fd, F_SETLKW, &lock) != 0) {
-    if (errno == EINTR) continue;
-    LOGE("cannot wait for the earlier process : %d", errno);
-    break;
+bool open_lock() {
+  constexpr int kAttempts = 5;  // the folder may be removed by the earlier process meanwhile
+  for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    if (prepare_folder != nullptr && !prepare_folder()) return false;
+    lock_fd = open(lock_path, O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode);
+    if (lock_fd >= 0) {
+      // Older lines were for others.
+      lines_taken = std::max<off_t>(lseek(lock_fd, 0, SEEK_END), 0);
+      return true;
+    }
+    if (errno != ENOENT) break;
   }
+  LOGE("cannot open %s : %d", lock_path, errno);
+  return false;
+}
+
+/** False for a lock that the earlier process has removed: others lock another file by now. */
+bool is_in_place() {
+  struct stat status {};
+  return fstat(lock_fd, &status) == 0 && status.st_nlink > 0;
+}
+
+enum class Lock { kHeld, kBusy, kFailed };
+
+/** @p how is F_SETLK or F_SETLKW. */
+Lock take_lock(int how) {
+  do {
+    if (!open_lock()) return Lock::kFailed;
+    struct flock lock = whole_file();
+    int result = 0;
+    while ((result = fcntl(lock_fd, how, &lock)) != 0 && errno == EINTR) {
+    }
+    if (result != 0 && (errno == EACCES || errno == EAGAIN)) return Lock::kBusy;
+    if (result != 0) {
+      LOGE("cannot lock %s : %d", lock_path, errno);
+      return Lock::kFailed;
+    }
+  } while (!is_in_place());
+  return Lock::kHeld;
+}
+
+void *wait_for_lock(void *) {
+  take_lock(F_SETLKW);
   take_turn();
   return nullptr;
 }
@@ -91,30 +132,22 @@ bool start_waiter() {
 
 }  // namespace
 
-void begin_quarn_turn(const char *lock_file, void (*on_turn)()) {
+void begin_quarn_turn(const char *lock_file, bool (*prepare)(), void (*on_turn)()) {
+  lock_path = lock_file;
+  prepare_folder = prepare;
   turn_observer = on_turn;
-  if (lock_fd < 0) {
-    // Never opened a second time: closing that one would give the lock away.
-    lock_fd = open(lock_file, O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode);
-  }
-  if (lock_fd < 0) {
-    LOGE("cannot open %s : %d", lock_file, errno);
-    return;
-  }
-  lines_taken = std::max<off_t>(lseek(lock_fd, 0, SEEK_END), 0);
-  struct flock lock = whole_file();
-  if (fcntl(lock_fd, F_SETLK, &lock) == 0) {
-    // Nobody is left who would read them.
-    if (ftruncate(lock_fd, 0) == 0) lines_taken = 0;
-    return;
-  }
-  if (errno != EACCES && errno != EAGAIN) {
-    LOGE("cannot lock %s : %d", lock_file, errno);
-    return;
-  }
+  if (take_lock(F_SETLK) != Lock::kBusy) return;
   LOGI("an earlier process still works");
   turn = false;
   if (!start_waiter()) take_turn();
+}
+
+void end_quarn_turn() {
+  if (!turn || lock_fd < 0) return;
+  unlink(lock_path);
+  // Stays when anything else lies there.
+  const std::string folder(lock_path, std::strrchr(lock_path, '/'));
+  rmdir(folder.c_str());
 }
 
 bool is_quarn_turn() { return turn; }

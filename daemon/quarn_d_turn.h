@@ -14,10 +14,14 @@
 
 /**
  * Ask for the turn without waiting for it. Once, on the main thread.
- * @param lock_file a file in a folder that only the daemon's user can enter
+ * @param lock_file a file in a folder that only the daemon's user can enter; borrowed for good
+ * @param prepare   makes that folder; any thread
  * @param on_turn   called once on the main thread when the turn comes later; not when it is there
  */
-void begin_quarn_turn(const char *lock_file, void (*on_turn)());
+void begin_quarn_turn(const char *lock_file, bool (*prepare)(), void (*on_turn)());
+
+/** The last thing that a process does: what it has made for its turn is removed. */
+void end_quarn_turn();
 
 /** Any thread. */
 bool is_quarn_turn();

@@ -197,13 +197,13 @@ TEST_F(Quarnctl, ADaemonThatGaveItsNameUpIsStillHeard) {
   FakeDaemon daemon(bus());
   daemon.on("manual_backup_start", [&](const IncomingCall &call) {
     daemon.give_name_up();
-    call.call_back("manual_backup_status", status_arguments(0, QUARN_BACKUP_RUNNING, call.req_id()),
-                   [call] {
-                     call.reply(0);
-                     call.call_back("manual_backup_status",
-                                    status_arguments(QUARN_TRANSFER_FAILED, QUARN_BACKUP_FAILED,
-                                                     call.req_id()));
-                   });
+    call.call_back(
+        "manual_backup_status", status_arguments(0, QUARN_BACKUP_RUNNING, call.req_id()), [call] {
+          call.reply(0);
+          call.call_back(
+              "manual_backup_status",
+              status_arguments(QUARN_TRANSFER_FAILED, QUARN_BACKUP_FAILED, call.req_id()));
+        });
   });
   EXPECT_EQ(quarnctl(bus(), {"backup"}).exit, QUARN_TRANSFER_FAILED);
 }

@@ -412,13 +412,14 @@ class EarlierProcess {
  public:
   EarlierProcess() {
     EXPECT_NE(mkdtemp(folder_.data()), nullptr);
+    lock_ = folder_ + "/lock";
     int ready[2];
     EXPECT_EQ(pipe2(ready, O_CLOEXEC), 0);
     EXPECT_EQ(pipe2(hold_, O_CLOEXEC), 0);
     pid_ = fork();
     if (pid_ == 0) {
       close(hold_[1]);
-      begin_quarn_turn(lock().c_str(), nullptr);
+      begin_quarn_turn(lock().c_str(), nullptr, nullptr);
       char byte = 'R';
       if (write(ready[1], &byte, 1) == 1) static_cast<void>(!read(hold_[0], &byte, 1));
       _exit(0);
@@ -428,7 +429,7 @@ class EarlierProcess {
     close(ready[0]);
     close(ready[1]);
     close(hold_[0]);
-    begin_quarn_turn(lock().c_str(), quarnd_dispatch_deferred);
+    begin_quarn_turn(lock_.c_str(), nullptr, quarnd_dispatch_deferred);
     EXPECT_FALSE(is_quarn_turn());
   }
   ~EarlierProcess() {
@@ -447,7 +448,8 @@ class EarlierProcess {
   }
 
  private:
-  std::string lock() const { return folder_ + "/lock"; }
+  const std::string &lock() const { return lock_; }
+  std::string lock_;
   std::string folder_ = "/tmp/quarn-server-XXXXXX";
   int hold_[2] = {-1, -1};
   pid_t pid_ = 0;

@@ -97,8 +97,10 @@ std::uint32_t quarnd_cancel_own(const std::string &sender) {
 }
 void quarnd_dispatch_deferred() { step("dispatch_deferred"); }
 bool prepare_staging_directory() { return true; }
-void begin_quarn_turn(const char *lock_file, void (*observer)()) {
+void end_quarn_turn() { step("end_turn"); }
+void begin_quarn_turn(const char *lock_file, bool (*prepare)(), void (*observer)()) {
   step("begin_turn");
+  EXPECT_EQ(prepare, prepare_staging_directory);
   EXPECT_STREQ(lock_file, "/tmp/quarn/lock");
   on_turn = observer;
 }
@@ -228,6 +230,7 @@ TEST_F(Main, RunsItsStepsInOrder) {
                                      "dbus_deinit",
                                      "ecore_shutdown ~",
                                      "loop_shutdown",
+                                     "end_turn",
                                      "Good-Bye from Quarn"}));
 }
 
@@ -293,7 +296,7 @@ TEST_F(Main, SignalTellsTheClientsTearsDownOnceAndEndsWithZero) {
             (Texts{"end_requests", "quit_nested_loops", "loop_quit", "dbus_leave", "end_requests",
                    "deinit_backup_resource", "quarnd_dbus_deinit ~", "packages_unexport",
                    "status_unexport", "dbus_deinit", "ecore_shutdown ~", "loop_shutdown",
-                   "Good-Bye from Quarn"}));
+                   "end_turn", "Good-Bye from Quarn"}));
 }
 
 TEST_F(Main, ProcessThatDoesNotEndTellsItsClientsLast) {
