@@ -9,6 +9,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/own_file.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -17,6 +18,8 @@ namespace {
 
 constexpr char kStagedArchiveDir[] = "/shared/data/";
 constexpr char kStagedArchiveSuffix[] = "_upload.zip";
+// Begins as the snapshot's name does, with which every walk leaves it out.
+constexpr char kAsideDir[] = "/shared/data/quarn_tmp_rst_dir.";
 constexpr char kStagingDirectory[] = "/tmp/quarn";
 constexpr mode_t kPrivateDirectory = 0700;
 
@@ -149,12 +152,19 @@ bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id) {
 }
 
 std::string staged_archive_path(const std::string &root_path, const std::string &pkg_id) {
-  return root_path + kStagedArchiveDir + pkg_id + kStagedArchiveSuffix;
+  const std::string path = root_path + kStagedArchiveDir + pkg_id + kStagedArchiveSuffix;
+  std::string aside = root_path + kAsideDir + pkg_id + kStagedArchiveSuffix;
+  struct stat status = {};
+  if (safe_lstat(aside.c_str(), &status) == 0 && is_own_file(status)) return aside;
+  const bool taken = safe_lstat(path.c_str(), &status) == 0 && !is_own_file(status);
+  return taken ? aside : path;
 }
 
 void delete_staged_file(const std::string &path) {
   static std::mutex deletion_mutex;
   const std::lock_guard<std::mutex> lock(deletion_mutex);
+  struct stat status = {};
+  if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
   if (file_exist(path.c_str())) delete_file(path.c_str());
 }
 

@@ -10,6 +10,7 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/own_file.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
@@ -413,6 +414,7 @@ bool recover_interrupted_restore(const char *pkgid, const char *root) {
   const restore_files files(pkgid, root);
   struct stat status = {};
   if (safe_lstat(files.snapshot.c_str(), &status) != 0) return false;
+  if (!is_own_file(status)) return false;  // the application's own, of the same name
   const std::lock_guard<std::mutex> lock(package_data_mutex);
   if (is_complete_snapshot(files)) {
     LOGI("restore of (%s) was interrupted, so its data will be put back", pkgid);

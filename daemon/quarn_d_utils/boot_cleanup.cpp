@@ -1,5 +1,6 @@
 #include "quarn_d_utils/boot_cleanup.h"
 
+#include "quarn_d_utils/own_file.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
@@ -8,6 +9,7 @@
 namespace {
 
 constexpr char kSharedDataDir[] = "/shared/data/";
+constexpr char kAsideDir[] = "/shared/data/quarn_tmp_rst_dir.";
 constexpr const char *kArchiveSuffixes[] = {"_upload.zip", "_download.zip"};
 
 void (*boot_recovery)() = nullptr;
@@ -22,7 +24,7 @@ timespec file_clock_now() {
 // staged or downloaded an archive of its own.
 bool left_by_an_earlier_process(const char *path) {
   struct stat status {};
-  if (safe_lstat(path, &status) != 0) return false;
+  if (safe_lstat(path, &status) != 0 || !is_own_file(status)) return false;
   const timespec &changed = status.st_ctim;
   return changed.tv_sec < quarn_process_start.tv_sec ||
          (changed.tv_sec == quarn_process_start.tv_sec &&
@@ -65,9 +67,11 @@ bool boot_foreach_package_info_callback(package_info_h info, void *) {
   }
 
   for (const char *suffix : kArchiveSuffixes) {
-    const std::string archive = std::string(root.get()) + kSharedDataDir + pkg_id.get() + suffix;
-    if (file_exist(archive.c_str()) && left_by_an_earlier_process(archive.c_str())) {
-      delete_file(archive.c_str());
+    for (const char *dir : {kSharedDataDir, kAsideDir}) {
+      const std::string archive = std::string(root.get()) + dir + pkg_id.get() + suffix;
+      if (file_exist(archive.c_str()) && left_by_an_earlier_process(archive.c_str())) {
+        delete_file(archive.c_str());
+      }
     }
   }
   return true;
