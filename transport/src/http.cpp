@@ -314,6 +314,8 @@ class Engine {
   bool load_library() {
     if (loaded_) return true;
     loaded_ = load(&curl_);
+    if (!loaded_ && !told_) g_warning("cloud transport: %s cannot be loaded", kLibraries[0]);
+    told_ = true;
     // After the TLS library's own handler was registered, thus to run before it.
     if (loaded_) std::atexit([] { get().stop_at_exit(); });
     return loaded_;
@@ -599,6 +601,7 @@ class Engine {
   Curl curl_;
   CURLM *multi_ = nullptr;
   bool loaded_ = false;
+  bool told_ = false;  // that it could not be loaded
   bool running_ = false;
   bool stopping_ = false;
   std::deque<ExchangePtr> incoming_;

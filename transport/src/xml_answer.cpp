@@ -1,5 +1,6 @@
 #include "xml_answer.h"
 
+#include <glib.h>
 #include <libxml/parser.h>
 #include <libxml/xmlreader.h>
 
@@ -20,7 +21,9 @@ std::atomic<bool> missed{false};
 
 bool library_serves() {
   if (missing_xml_library() == nullptr) return true;
-  missed = true;
+  if (!missed.exchange(true)) {
+    g_warning("cloud transport: %s cannot be loaded", missing_xml_library());
+  }
   return false;
 }
 
