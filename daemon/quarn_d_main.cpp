@@ -176,6 +176,7 @@ int quarn_run() {
       {take_signal, quarn_dbus_stop_waiting, end_by_signal, tell_waiting_clients, kSignalGrace});
   install_signal_handlers();
   begin_quarn_turn(kLockName, prepare_staging_directory, quarnd_dispatch_deferred);
+  if (is_quarn_turn()) sweep_staging_directory(kLockName);
   init_quarn();
   init_backup_req_dispatch_thread();
   LOGI("== main loop begin ==");
@@ -191,7 +192,10 @@ int quarn_recover() {
   LOGI("recovery of what an interrupted restore or backup has left");
   begin_quarn_turn(kLockName, prepare_staging_directory, nullptr);
   // A daemon that works at this moment has done it at its own start.
-  if (is_quarn_turn()) recover_device();
+  if (is_quarn_turn()) {
+    sweep_staging_directory(kLockName);
+    recover_device();
+  }
   end_quarn_turn();
   return 0;
 }

@@ -332,9 +332,9 @@ void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *p
     call.reply_int(QUARN_REFUSED);
     return;
   }
-  int result = QUARN_FAILED;
-  run_on_thread_stack([&] { result = quarnd_make_app_data(pkg_id, uid); });
-  call.reply_int(result);
+  if (refuse_beyond_bounds(call)) return;
+  const auto counted = count_waiting(call.sender());
+  call.reply_int(quarnd_make_app_data(pkg_id, uid));
 }
 
 /** The one dispatcher; @p given is null when the call has no arguments. */

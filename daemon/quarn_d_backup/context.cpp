@@ -14,12 +14,12 @@
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/tree_place.h"
+#include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kStagedArchiveDir[] = "/shared/data/";
-constexpr char kStagedArchiveSuffix[] = "_upload.zip";
 constexpr char kStagingDirectory[] = "/tmp/quarn";
 constexpr mode_t kPrivateDirectory = 0700;
 
@@ -163,12 +163,20 @@ bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id) {
 }
 
 std::string staged_archive_path(const std::string &root_path, const std::string &pkg_id) {
-  return root_path + kStagedArchiveDir + pkg_id + kStagedArchiveSuffix;
+  const WorkingFiles files(pkg_id, root_path);
+  struct stat status = {};
+  if (safe_lstat(files.upload_aside().c_str(), &status) == 0 && is_own_file(status)) {
+    return files.upload_aside();
+  }
+  const bool taken = safe_lstat(files.upload().c_str(), &status) == 0 && !is_own_file(status);
+  return taken ? files.upload_aside() : files.upload();
 }
 
 void delete_staged_file(const std::string &path) {
   static std::mutex deletion_mutex;
   const std::lock_guard<std::mutex> lock(deletion_mutex);
+  struct stat status = {};
+  if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
   if (file_exist(path.c_str())) delete_file(path.c_str());
 }
 
@@ -190,4 +198,21 @@ bool prepare_staging_directory() {
     return false;
   }
   return true;
+}
+
+void sweep_staging_directory(const char *keep) {
+  struct stat status = {};
+  if (safe_lstat(kStagingDirectory, &status) != 0 || !is_own_file(status)) return;
+  const UniqueFd dir = safe_open(kStagingDirectory, O_RDONLY | O_DIRECTORY);
+  std::vector<TreeEntry> entries;
+  if (!dir || !list_tree_entries(dir.get(), &entries)) return;
+  for (const TreeEntry &entry : entries) {
+    const std::string path = std::string(kStagingDirectory) + "/" + entry.name;
+    if (path == keep) continue;
+    if (is_directory(path.c_str())) {
+      clear_directory(path.c_str(), true);
+    } else {
+      unlinkat(dir.get(), entry.name.c_str(), 0);
+    }
+  }
 }

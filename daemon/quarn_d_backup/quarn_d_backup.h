@@ -223,6 +223,8 @@ void release_staged_archive(backup_context *ctx, const std::string &pkg_id);
 
 /** Make the directory of staged lists; false when what lies there is not ours alone. */
 bool prepare_staging_directory();
+/** Remove what an ended process has left there, all but @p keep. Before anything is staged. */
+void sweep_staging_directory(const char *keep);
 
 /* ---- pipeline.cpp: worker --------------------------------------------------- */
 

@@ -20,9 +20,13 @@ inline constexpr char kStagedListLease[] = "/app_list";
 
 /** True when @p ctx holds the right to a package's staged archive. */
 bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id);
-/** Where a package's archive is staged. */
+/**
+ * Where a package's archive is staged: under its usual name, or beside it where the application has
+ * a file of that name.
+ */
 std::string staged_archive_path(const std::string &root_path, const std::string &pkg_id);
-/** Delete a staged file if it is there; a run and its callbacks may both come to it. */
+/** Delete a staged file if it is there, and no other's; a run and its callbacks may both come to
+ * it. */
 void delete_staged_file(const std::string &path);
 /** Bytes of a staged file, 0 when there is none. */
 std::uint64_t staged_file_size(const std::string &path);

@@ -1,8 +1,3 @@
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <memory>
 #include <utility>
 
@@ -17,12 +12,6 @@
 #include "quarn_log.h"
 
 namespace {
-
-constexpr char kExportDir[] = "/tmp/";
-constexpr char kExportSuffix[] = "_tmp.zip";
-constexpr char kStagingTemplate[] = "/tmp/quarn_export_XXXXXX";
-constexpr char kStagedName[] = "/export.zip";
-constexpr mode_t kExportMode = 0600;
 
 /** The CPU lock for the length of a request. */
 class PowerLock {
@@ -274,31 +263,6 @@ int serve(const char *id, void *record, Work work, Answer answer) {
   return QUARN_OK;
 }
 
-/** A folder that nobody else can put anything into; removed with what is left in it. */
-class StagingDir {
- public:
-  StagingDir() : path_(kStagingTemplate) {
-    if (mkdtemp(path_.data()) == nullptr) path_.clear();
-  }
-  ~StagingDir() {
-    if (!path_.empty()) clear_directory(path_.c_str(), true);
-  }
-  StagingDir(const StagingDir &) = delete;
-  StagingDir &operator=(const StagingDir &) = delete;
-  const std::string &path() const { return path_; }
-
- private:
-  std::string path_;
-};
-
-/** Give the archive to the client under its public name, over whatever lies there. */
-bool hand_over(const std::string &archive, const std::string &target, uid_t client_uid) {
-  const UniqueFd file(open(archive.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-  return file && fchmod(file.get(), kExportMode) == 0 &&
-         fchown(file.get(), client_uid, static_cast<gid_t>(-1)) == 0 &&
-         rename(archive.c_str(), target.c_str()) == 0;
-}
-
 }  // namespace
 
 int quarnd_backup_app_data(const char *pkg_id, void *record) {
@@ -309,33 +273,4 @@ int quarnd_backup_app_data(const char *pkg_id, void *record) {
 int quarnd_restore_app_data(const char *pkg_id, void *record) {
   LOGI("quarnd_restore_app_data");
   return serve(pkg_id, record, restore, quarn_dbus_app_restore_complete);
-}
-
-int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
-  if (pkg_id == nullptr || !is_safe_path_component(pkg_id)) {
-    LOGE("cannot get root path info of (%s)...", pkg_id == nullptr ? "" : pkg_id);
-    return QUARN_REFUSED;
-  }
-  const std::string target = std::string(kExportDir) + pkg_id + kExportSuffix;
-  if (file_exist(target.c_str())) delete_file(target.c_str());
-  std::string root;
-  if (get_string_app_root_path(pkg_id, root) != QUARN_OK) {
-    LOGE("cannot get root path info of (%s)...", pkg_id);
-    return QUARN_REFUSED;
-  }
-  reset_backup_path_info();
-  int zip_result = QUARN_OK;
-  const StagingDir staging;
-  const std::string archive = staging.path() + kStagedName;
-  if (staging.path().empty()) {
-    zip_result = QUARN_UNREADABLE;
-  } else {
-    make_zip_data(pkg_id, root.c_str(), archive.c_str(), &zip_result);
-  }
-  if (zip_result == QUARN_OK && !hand_over(archive, target, client_uid)) {
-    LOGE("fail to hand over %s : %d", target.c_str(), errno);
-    zip_result = QUARN_UNREADABLE;
-  }
-  LOGI("quarnd_make_app_data zip_result = %d", zip_result);
-  return zip_result;
 }

@@ -28,9 +28,11 @@ int quarnd_backup_app_data(const char *pkg_id, void *record);
 /** Restore one package now; waits in a nested loop. @return 0, or 1: unknown package */
 int quarnd_restore_app_data(const char *pkg_id, void *record);
 /**
- * Pack one package's data as /tmp/PKGID_tmp.zip, mode 0600, in place of an earlier one.
+ * Pack one package's data as /tmp/PKGID_tmp.zip, mode 0600, in place of an earlier one; waits in
+ * a nested loop for the thread that packs.
  * @param client_uid user that shall own the archive
- * @return 0, 36 without a root path, or what packing gave; the archive is there with 0 only
+ * @return 0, 36 without a root path, 17 when the daemon ends, or what packing gave; with 36 the
+ *         archive is there too, and lacks what could not be packed
  */
 int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid);
 

@@ -31,8 +31,8 @@ bool is_part_name(const char *name) {
 }
 
 /** A file that nobody but the daemon has made, and that has no other name. */
-bool is_own_file(const struct stat &status) {
-  return S_ISREG(status.st_mode) && status.st_uid == geteuid() && status.st_nlink == 1;
+bool is_own_single_file(const struct stat &status) {
+  return S_ISREG(status.st_mode) && is_own_file(status) && status.st_nlink == 1;
 }
 
 constexpr mode_t kPrivateFile = 0600;
@@ -42,7 +42,7 @@ void sweep_file(const std::string &path, mode_t modes = ALLPERMS) {
   const std::lock_guard<std::mutex> lock(claimed_mutex);
   struct stat status = {};
   if (claimed().count(path) != 0 || safe_lstat(path.c_str(), &status) != 0) return;
-  if (is_own_file(status) && (status.st_mode & ALLPERMS & ~modes) == 0) delete_file(path.c_str());
+  if (is_own_single_file(status) && (status.st_mode & ALLPERMS & ~modes) == 0) delete_file(path.c_str());
 }
 
 /** Remove a part of a download when no transfer holds it. */
@@ -57,7 +57,7 @@ void sweep_part(int dir, const char *name) {
 }  // namespace
 
 bool is_own_leftover(const char *name, const struct stat &status) {
-  return is_part_name(name) && is_own_file(status);
+  return is_part_name(name) && is_own_single_file(status);
 }
 
 bool is_own_leftover(const std::string &path) {
@@ -77,6 +77,7 @@ void sweep_working_files(const std::string &pkg_id, const std::string &root) {
   const WorkingFiles files(pkg_id, root);
   const std::lock_guard<std::mutex> lock(package_data_mutex);
   sweep_file(files.upload());
+  sweep_file(files.upload_aside());
   sweep_file(files.download());
   sweep_file(files.table(), kPrivateFile);
   const UniqueFd dir = safe_open(files.folder().c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK);

@@ -11,8 +11,15 @@
 #define QUARN_D_UTILS_WORKING_FILES_H
 
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <string>
+
+/**
+ * True for what this daemon, or an earlier one, made: an application may give a file of its own any
+ * name, but cannot give it away.
+ */
+inline bool is_own_file(const struct stat &status) { return status.st_uid == geteuid(); }
 
 /**
  * True for what the transport makes beside a download where the file system
@@ -31,10 +38,13 @@ class WorkingFiles {
         upload_(folder_ + "/" + pkg_id + "_upload.zip"),
         download_(folder_ + "/" + pkg_id + "_download.zip"),
         table_(folder_ + "/" + pkg_id + ".perm"),
-        snapshot_(folder_ + "/quarn_tmp_rst_dir") {}
+        snapshot_(folder_ + "/quarn_tmp_rst_dir"),
+        upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip") {}
 
   const std::string &folder() const { return folder_; } /**< where all of them lie */
   const std::string &upload() const { return upload_; }
+  /** Where the archive is staged whose name an application's own file has. */
+  const std::string &upload_aside() const { return upload_aside_; }
   const std::string &download() const { return download_; }
   /** The table on its way into an archive or out of one; the application's own may have the name.
    */
@@ -55,6 +65,7 @@ class WorkingFiles {
   std::string download_;
   std::string table_;
   std::string snapshot_;
+  std::string upload_aside_;
 };
 
 /** From now on @p path is this process's own: its sweep leaves it alone. */

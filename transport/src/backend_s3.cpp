@@ -11,6 +11,7 @@
 
 #include "http_store.h"
 #include "remote_path.h"
+#include "xml_answer.h"
 
 namespace transport {
 namespace {
@@ -80,13 +81,17 @@ Outcome outcome(const HttpAnswer &answer, const char *what) {
   Outcome result = outcome_of(answer, what);
   if (!answer.complete() || answer.good()) return result;
   explain(parse_s3_error(answer.body), &result);
+  if (const char *missing = xml_missing_for_answers()) {
+    result.message += std::string(" (") + missing + " cannot be loaded)";
+  }
   if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) result.code = BACKUP_TRANS_ERROR_SERVER;
   return result;
 }
 
 bool is_absent_object(const HttpAnswer &answer) {
   // An answer without a body, to a HEAD, does not tell a missing bucket from a missing object.
-  return is_absent(answer) && parse_s3_error(answer.body).code != "NoSuchBucket";
+  return is_absent(answer) && parse_s3_error(answer.body).code != "NoSuchBucket" &&
+         xml_missing_for_answers() == nullptr;
 }
 
 bool is_ip_address(const std::string &host) { return g_hostname_is_ip_address(host.c_str()) != 0; }

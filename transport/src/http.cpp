@@ -29,6 +29,7 @@
 #include "http_date.h"
 #include "symbols.h"
 #include "upload_queue.h"
+#include "xml_answer.h"
 
 namespace transport {
 namespace {
@@ -260,6 +261,12 @@ class Engine {
       exchange->answer.problem = cancelled();
       return exchange->answer;
     }
+    if (const char *missing = xml_missing_for_answers()) {
+      ticket.set_waker(nullptr);
+      exchange->answer.problem =
+          failure(BACKUP_TRANS_ERROR_NETWORK, std::string(missing) + " cannot be loaded");
+      return std::move(exchange->answer);
+    }
     {
       Lock lock(mutex_);
       if (start()) {
@@ -267,8 +274,9 @@ class Engine {
         curl_.multi_wakeup(multi_);
         finished_.wait(lock, [&] { return exchange->done; });
       } else {
-        exchange->answer.problem =
-            failure(BACKUP_TRANS_ERROR_NETWORK, "the HTTP library cannot be loaded");
+        exchange->answer.problem = failure(
+            BACKUP_TRANS_ERROR_NETWORK, loaded_ ? "the HTTP library cannot be started"
+                                                : std::string(kLibraries[0]) + " cannot be loaded");
       }
     }
     ticket.set_waker(nullptr);
@@ -306,6 +314,8 @@ class Engine {
   bool load_library() {
     if (loaded_) return true;
     loaded_ = load(&curl_);
+    if (!loaded_ && !told_) g_warning("cloud transport: %s cannot be loaded", kLibraries[0]);
+    told_ = true;
     // After the TLS library's own handler was registered, thus to run before it.
     if (loaded_) std::atexit([] { get().stop_at_exit(); });
     return loaded_;
@@ -591,6 +601,7 @@ class Engine {
   Curl curl_;
   CURLM *multi_ = nullptr;
   bool loaded_ = false;
+  bool told_ = false;  // that it could not be loaded
   bool running_ = false;
   bool stopping_ = false;
   std::deque<ExchangePtr> incoming_;

@@ -1,7 +1,12 @@
 #include "xml_answer.h"
 
+#include <glib.h>
 #include <libxml/parser.h>
 #include <libxml/xmlreader.h>
+
+#include <atomic>
+
+#include "lazy_xml.h"
 
 namespace transport {
 namespace {
@@ -12,6 +17,16 @@ struct ReaderFree {
   void operator()(xmlTextReader *reader) const { xmlFreeTextReader(reader); }
 };
 
+std::atomic<bool> missed{false};
+
+bool library_serves() {
+  if (missing_xml_library() == nullptr) return true;
+  if (!missed.exchange(true)) {
+    g_warning("cloud transport: %s cannot be loaded", missing_xml_library());
+  }
+  return false;
+}
+
 // No server has a reason to send one, and entities are what bombs are made of.
 bool has_document_type(const std::string &text) {
   return text.find("<!DOCTYPE") != std::string::npos;
@@ -21,7 +36,7 @@ bool has_document_type(const std::string &text) {
 
 bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)> &root,
               const std::function<void(const xmlNode *)> &child) {
-  if (has_document_type(text)) return false;
+  if (!library_serves() || has_document_type(text)) return false;
   const std::unique_ptr<xmlTextReader, ReaderFree> reader(
       xmlReaderForMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr, kOptions));
   if (reader == nullptr) return false;
@@ -42,12 +57,14 @@ bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)
 }
 
 XmlAnswer parse_xml(const std::string &text) {
-  if (has_document_type(text)) return nullptr;
+  if (text.empty() || !library_serves() || has_document_type(text)) return nullptr;
   XmlAnswer document(
       xmlReadMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr, kOptions));
   if (document && document->intSubset != nullptr) document.reset();
   return document;
 }
+
+const char *xml_missing_for_answers() { return missed ? missing_xml_library() : nullptr; }
 
 std::string xml_text(const xmlNode *node) {
   xmlChar *content = xmlNodeGetContent(node);

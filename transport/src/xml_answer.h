@@ -30,6 +30,12 @@ XmlAnswer parse_xml(const std::string &text);
 bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)> &root,
               const std::function<void(const xmlNode *)> &child);
 
+/**
+ * The library's name once an answer had to be read and it could not be loaded; null before. Then
+ * nothing that an answer says is known, and no request that follows from it may be made.
+ */
+const char *xml_missing_for_answers();
+
 /** Everything that @p node says, as it stands. */
 std::string xml_text(const xmlNode *node);
 

@@ -1,8 +1,10 @@
 """The main job on real input: what stands in the cloud after each kind of run."""
+import http.server
 import json
 import os
 import subprocess
 import sys
+import threading
 import unittest
 import zipfile
 
@@ -243,7 +245,7 @@ class BackupStory(TestCase):
             os.stat(os.path.join(self.device.cloud, self.archive("org.example.beta"))).st_ino, kept)
         self.assertIn("fail to make zip data for org.example.beta", self.device.log())
 
-    def test_a_hostile_rules_file_backs_everything_up(self):
+    def test_a_rules_file_that_is_none_backs_everything_up_and_one_that_hides_its_rules_nothing(self):
         bomb = ('<?xml version="1.0"?><!DOCTYPE b [<!ENTITY a "aaaaaaaaaa">'
                 + "".join('<!ENTITY a%d "%s">' % (i, ("&a%d;" % (i - 1) if i else "&a;") * 10)
                           for i in range(12))
@@ -256,10 +258,103 @@ class BackupStory(TestCase):
             self.device.install(make_source(self.path("r%d" % index), name, "1.0.0",
                                             {"data/x": b"x" * 100, "res/backup.path.xml": rules}))
         self.backup()
-        for index in range(6):
+        hidden = os.path.join(self.device.cloud, self.archive("org.example.rules0"))
+        self.assertFalse(os.path.exists(hidden), "what its entities exclude is not known")
+        self.assertIn("rules file of (org.example.rules0) cannot be used: it needs entities",
+                      self.device.log())
+        for index in range(1, 6):
             path = os.path.join(self.device.cloud, self.archive("org.example.rules%d" % index))
             with zipfile.ZipFile(path) as archive:
                 self.assertIn("data/x", archive.namelist())
+
+    def device_without(self, *libraries):
+        """Another device, on which these cannot be loaded."""
+        self.device.stop()
+        folder = self.path("no-libraries")
+        os.makedirs(folder)
+        for library in libraries:
+            open(os.path.join(folder, library), "w").close()
+        device = self.new_device(serial="350000000000002")
+        device.call("start", env=dict(os.environ, LD_LIBRARY_PATH=folder))
+        return device
+
+    def test_without_the_library_that_reads_rules_nothing_of_their_package_is_sent(self):
+        device = self.device_without("libxml2.so.2")
+        rules = b'<backup><exclude path="data/secret"/></backup>'
+        device.install(make_source(self.path("ruled"), "org.example.ruled", "1.0.0",
+                                   {"data/secret": b"s", "res/backup.path.xml": rules}))
+        device.install(make_source(self.path("plain"), "org.example.plain", "1.0.0",
+                                   {"data/a": b"a"}))
+        self.backup(device)
+        sent = {name for name in objects(device) if name.endswith(".zip")}
+        self.assertEqual(sent, {"350000000000002/org.example.plain/1.0.0/org.example.plain.zip"})
+        self.assertIn("rules file of (org.example.ruled) cannot be used: libxml2.so.2 cannot be "
+                      "loaded", device.log())
+        self.assertEqual(device.quarnctl("app", "backup", "org.example.ruled",
+                                         check=False).returncode, 36)
+
+    def test_without_the_library_of_the_network_a_run_fails_and_names_it(self):
+        device = self.device_without("libcurl.so.4", "libcurl-gnutls.so.4")
+        device.install(make_source(self.path("plain"), "org.example.plain", "1.0.0",
+                                   {"data/a": b"a"}))
+        device.set("cloud", "webdav+http://127.0.0.1:9/store")
+        result = device.quarnctl("backup", check=False)
+        self.assertNotEqual(result.returncode, 0)
+        self.assertIn("libcurl.so.4 cannot be loaded", device.logs())
+
+    def test_without_the_library_that_reads_answers_a_missing_bucket_is_no_missing_list(self):
+        asked = []
+
+        class Store(http.server.BaseHTTPRequestHandler):
+            def answer(self):
+                asked.append(self.command)
+                self.rfile.read(int(self.headers.get("Content-Length") or 0))
+                body = b"<Error><Code>NoSuchBucket</Code></Error>"
+                self.send_response(404)
+                self.send_header("Content-Type", "application/xml")
+                self.send_header("Content-Length", str(len(body)))
+                self.end_headers()
+                if self.command != "HEAD":
+                    self.wfile.write(body)
+
+            do_GET = do_PUT = do_POST = do_HEAD = do_DELETE = answer
+
+            def log_message(self, *_):
+                pass
+
+        server = http.server.ThreadingHTTPServer(("127.0.0.1", 0), Store)
+        self.addCleanup(server.server_close)
+        self.addCleanup(server.shutdown)
+        threading.Thread(target=server.serve_forever, daemon=True).start()
+        device = self.device_without("libxml2.so.2")
+        device.install(make_source(self.path("plain"), "org.example.plain", "1.0.0",
+                                   {"data/a": b"a"}))
+        device.call("set", "cloud", "s3+http://127.0.0.1:%d/bucket" % server.server_port,
+                    "--user", "key", input="secret\n")
+        self.assertNotEqual(device.quarnctl("backup", check=False).returncode, 0)
+        self.assertIn("GET", asked)
+        self.assertNotIn("PUT", asked)
+        self.assertIn("libxml2.so.2 cannot be loaded", device.logs())
+
+    def test_the_applications_files_with_names_of_ours_survive_a_backup_and_a_start(self):
+        names = ["org.example.alpha_upload.zip", "org.example.alpha_download.zip",
+                 "org.example.alpha.perm", "quarn_tmp_rst_dir"]
+        for name in names:
+            path = self.device.app_path("org.example.alpha", "shared/data/" + name)
+            with open(path, "w") as file:
+                file.write("own " + name)
+            os.chown(path, 5000, 5000)
+        self.backup()
+        self.device.stop()
+        self.device.start()
+        with open(self.device.app_path("org.example.alpha", "data/a.txt"), "r+b") as file:
+            file.write(b"changed")
+        self.backup()
+        folder = self.device.app_path("org.example.alpha", "shared/data")
+        self.assertEqual(sorted(os.listdir(folder)), sorted(names))
+        for name in names:
+            with open(os.path.join(folder, name)) as file:
+                self.assertEqual(file.read(), "own " + name)
 
     def test_symbolic_links_out_of_the_application_are_recorded_but_not_read(self):
         os.symlink("/etc/shadow", self.device.app_path("org.example.alpha", "data/link"))

@@ -100,6 +100,19 @@ TEST_F(BootCleanupTest, BothArchivesOfAnInterruptedRunAreDeletedAndNothingElse) 
   EXPECT_EQ(captured_log().front().level, DLOG_INFO);
 }
 
+TEST_F(BootCleanupTest, AnApplicationsOwnFilesOfTheseNamesStay) {
+  for (const fs::path &path : {upload(), download()}) {
+    make_file(path);
+    ASSERT_EQ(chown(path.c_str(), 5000, 5000), 0);
+  }
+  const fs::path aside =
+      make_file(shared / ("quarn_tmp_rst_dir." + std::string(kPkgId) + "_upload.zip"));
+  boot_cleanup_backup_items();
+  EXPECT_TRUE(fs::exists(upload()));
+  EXPECT_TRUE(fs::exists(download()));
+  EXPECT_FALSE(fs::exists(aside)) << "which is the daemon's, made beside such a file";
+}
+
 TEST_F(BootCleanupTest, ASecondSweepDoesNothing) {
   EXPECT_CALL(platform, package_manager_foreach_package_info).Times(1);
   boot_cleanup_backup_items();

@@ -1,9 +1,13 @@
+#include <sys/stat.h>
+
 #include <filesystem>
+#include <map>
 #include <thread>
 
 #include "backup_device.h"
 #include "poll_hook.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/bounds.h"
 
 using ::testing::Contains;
 using ::testing::ElementsAre;
@@ -738,6 +742,66 @@ TEST_F(Progress, TellsWhyAPackageWasNotUploaded) {
   automatic();
   EXPECT_EQ(of("org.same").outcome, backup_outcome::unchanged);
   EXPECT_EQ(of("org.same").size, cloud_.objects[same.object()].size());
+}
+
+TEST_F(Pipeline, AnApplicationsFilesWithTheNamesOfWorkingFilesAreLeftAlone) {
+  const FakePackage &app = install("org.app");
+  const std::string shared = app.root + "/shared/data/";
+  const std::vector<std::string> own = {"org.app_upload.zip", "org.app_download.zip",
+                                        "org.app.perm", "quarn_tmp_rst_dir"};
+  std::map<std::string, ino_t> inodes;
+  for (const std::string &name : own) {
+    write_text(shared + name, "own " + name);
+    ASSERT_EQ(chown((shared + name).c_str(), kAppUid, kAppGid), 0);
+    struct stat status = {};
+    ASSERT_EQ(lstat((shared + name).c_str(), &status), 0);
+    inodes[name] = status.st_ino;
+  }
+  for (int run = 0; run < 2; ++run) {
+    automatic();
+    EXPECT_EQ(cloud_.objects.count(app.object()), 1U);
+    EXPECT_EQ(cloud_.objects[app.object()].find("shared/data/org.app_upload.zip"),
+              std::string::npos);
+    std::size_t files = 0;
+    for (const auto &entry : std::filesystem::directory_iterator(shared)) {
+      ++files;
+      const std::string name = entry.path().filename();
+      EXPECT_EQ(read_text(entry.path()), "own " + name);
+      struct stat status = {};
+      ASSERT_EQ(lstat(entry.path().c_str(), &status), 0);
+      EXPECT_EQ(status.st_ino, inodes[name]) << name;
+      EXPECT_EQ(status.st_uid, kAppUid) << name;
+    }
+    EXPECT_EQ(files, own.size());
+    write_text(app.root + "/data/more", "changed");
+  }
+}
+
+TEST_F(Progress, TellsWhichBoundAPackageGoesBeyond) {
+  const FakePackage &many = install("org.many", "1", "");
+  for (std::uint64_t i = 0; i <= kBackupBounds.members; ++i) {
+    ASSERT_EQ(mknod((many.root + "/shared/data/" + std::to_string(i)).c_str(), S_IFREG | 0600, 0),
+              0);
+  }
+  const FakePackage &names = install("org.names", "1", "");
+  std::string below = names.root + "/data";
+  for (int i = 0; i < 17; ++i) below += "/" + std::string(200, 'p');
+  std::filesystem::create_directories(below);
+  for (int i = 0; i < 5200; ++i) {
+    ASSERT_EQ(mknod((below + "/" + std::to_string(i)).c_str(), S_IFREG | 0600, 0), 0);
+  }
+  automatic();
+  EXPECT_EQ(of("org.many").outcome, backup_outcome::too_many_files);
+  EXPECT_EQ(of("org.many").size, kBackupBounds.members + 1);
+  EXPECT_EQ(of("org.many").limit, kBackupBounds.members);
+  EXPECT_EQ(of("org.names").outcome, backup_outcome::table_too_large);
+  EXPECT_EQ(of("org.names").limit, kBackupBounds.table);
+  for (const FakePackage *package : {&many, &names}) {
+    EXPECT_EQ(cloud_.objects.count(package->object()), 0U);
+    EXPECT_FALSE(exists(package->staged()));
+    EXPECT_EQ(count_logged(DLOG_ERROR, "fail to make zip data for " + package->id), 1);
+  }
+  EXPECT_EQ(seen_progress.back().result, 0) << "of the others";
 }
 
 TEST_F(Progress, TellsThatARulesFileCannotBeUsed) {

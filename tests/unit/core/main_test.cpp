@@ -88,6 +88,7 @@ void quarnd_dbus_leave() {
   step("dbus_leave");
 }
 bool calls_deferred = false;
+bool turn_is_there = true;
 bool quarnd_calls_deferred() { return calls_deferred; }
 std::vector<std::string> turn_lines;
 std::vector<std::string> take_quarn_turn_lines() { return std::exchange(turn_lines, {}); }
@@ -97,6 +98,8 @@ std::uint32_t quarnd_cancel_own(const std::string &sender) {
 }
 void quarnd_dispatch_deferred() { step("dispatch_deferred"); }
 bool prepare_staging_directory() { return true; }
+void sweep_staging_directory(const char *keep) { step((std::string("sweep but ") + keep).c_str()); }
+bool is_quarn_turn() { return turn_is_there; }
 void end_quarn_turn() { step("end_turn"); }
 void begin_quarn_turn(const char *lock_file, bool (*prepare)(), void (*observer)()) {
   step("begin_turn");
@@ -213,7 +216,7 @@ TEST_F(Main, RunsItsStepsInOrder) {
   EXPECT_EQ(captured_texts(), (Texts{"Quarn Daemon start",
                                      "account",
                                      "watch_signals",
-                                     "begin_turn",
+                                     "begin_turn", "sweep but /tmp/quarn/lock",
                                      "progress_init",
                                      "loop_init",
                                      "dbus_init",

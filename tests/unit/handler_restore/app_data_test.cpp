@@ -1,6 +1,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <chrono>
 #include <cstring>
 #include <filesystem>
 #include <thread>
@@ -515,6 +517,17 @@ class ExportTest : public AppDataTest {
     EXPECT_EQ(status.st_uid, kClient);
     EXPECT_GT(status.st_size, 0);
   }
+  /** Let packing go on only once the main loop has served what sets go. */
+  void hold_packing() {
+    ON_CALL(platform, smack_getlabel)
+        .WillByDefault([this](const char *, char **label, smack_label_type) {
+          const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+          while (!go && std::chrono::steady_clock::now() < end) std::this_thread::yield();
+          *label = strdup("User");
+          return 0;
+        });
+  }
+  std::atomic<bool> go{false};
   static int staging_directories() {
     int count = 0;
     for (const auto &item : std::filesystem::directory_iterator("/tmp")) {
@@ -578,11 +591,68 @@ TEST_F(ExportTest, AnImpossiblePackageIsRefused) {
   expect_error("cannot get root path info of (../etc/x)...");
 }
 
-TEST_F(ExportTest, AnIncompleteArchiveIsNotHandedOver) {
+TEST_F(ExportTest, AnIncompleteArchiveIsHandedOverAndToldToBeSuch) {
+  const int before = staging_directories();
   std::filesystem::remove_all(at("shared/trusted"));
   EXPECT_EQ(make(), 36);
   expect_info("quarnd_make_app_data zip_result = 36");
+  expect_exported();
+  const std::string command = std::string("unzip -l ") + kTarget + " | grep -q data/settings.ini";
+  EXPECT_EQ(std::system(command.c_str()), 0);
+  EXPECT_EQ(staging_directories(), before);
+}
+
+TEST_F(ExportTest, APackageWithoutItsSharedDataKeepsNoneOfTheDaemons) {
+  std::filesystem::remove_all(at("shared/data"));
+  EXPECT_EQ(make(), 36);
+  expect_exported();
+  EXPECT_FALSE(exists(at("shared/data")));
+}
+
+TEST_F(ExportTest, WhatWasNotEvenBegunIsNotHandedOver) {
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  EXPECT_EQ(make(), 36);
   EXPECT_FALSE(exists(kTarget));
+}
+
+TEST_F(ExportTest, OthersAreServedWhileAPackageIsPacked) {
+  hold_packing();
+  later([&] { go = true; });
+  EXPECT_EQ(make(), 0);
+  EXPECT_TRUE(go);
+}
+
+TEST_F(ExportTest, ASecondRequestIsServedInsideTheFirst) {
+  int inner = -1;
+  hold_packing();
+  later([&] {
+    go = true;
+    inner = make();
+  });
+  EXPECT_EQ(make(), 0);
+  EXPECT_EQ(inner, 0);
+  expect_exported();
+}
+
+TEST_F(ExportTest, TheDaemonIsNotIdleWhileAPackageIsPacked) {
+  bool idle = true;
+  hold_packing();
+  later([&] {
+    idle = is_idle_status();
+    go = true;
+  });
+  EXPECT_EQ(make(), 0);
+  EXPECT_FALSE(idle);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(ExportTest, TheDaemonsEndEndsAnExport) {
+  const int before = staging_directories();
+  outside.ending = true;
+  EXPECT_EQ(make(), 17);
+  EXPECT_FALSE(exists(kTarget));
+  EXPECT_EQ(staging_directories(), before);
+  expect_info("quarnd_make_app_data zip_result = 17");
 }
 
 }  // namespace

@@ -622,6 +622,18 @@ TEST_F(SnapshotTest, RecoveryLeavesALinkInTheSnapshotsPlace) {
   EXPECT_TRUE(exists(base));
 }
 
+TEST_F(SnapshotTest, RecoveryLeavesWhatTheApplicationCallsTheSame) {
+  write_text(snapshot(), "the application's own");
+  ASSERT_EQ(chown(snapshot().c_str(), kAppUid, kAppGid), 0);
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_EQ(read_text(snapshot()), "the application's own");
+  ASSERT_EQ(unlink(snapshot().c_str()), 0);
+  std::filesystem::create_directories(snapshot() + "/mine");
+  ASSERT_EQ(chown(snapshot().c_str(), kAppUid, kAppGid), 0);
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_TRUE(exists(snapshot() + "/mine"));
+}
+
 TEST_F(SnapshotTest, RecoveryVisitsEveryInstalledPackage) {
   make_old_data();
   const Tree before = tree();

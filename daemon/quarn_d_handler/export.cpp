@@ -1,0 +1,124 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <memory>
+#include <string>
+#include <thread>
+
+#include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr char kExportDir[] = "/tmp/";
+constexpr char kExportSuffix[] = "_tmp.zip";
+constexpr char kStagingTemplate[] = "/tmp/quarn/export_XXXXXX";
+constexpr char kStagedName[] = "/export.zip";
+constexpr mode_t kExportMode = 0600;
+
+/** A folder that nobody else can put anything into; removed with what is left in it. */
+class StagingDir {
+ public:
+  StagingDir() : path_(kStagingTemplate) {
+    if (!prepare_staging_directory() || mkdtemp(path_.data()) == nullptr) path_.clear();
+  }
+  ~StagingDir() {
+    if (!path_.empty()) clear_directory(path_.c_str(), true);
+  }
+  StagingDir(const StagingDir &) = delete;
+  StagingDir &operator=(const StagingDir &) = delete;
+  const std::string &path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+/** Give the archive to the client under its public name, over whatever lies there. */
+bool hand_over(const std::string &archive, const std::string &target, uid_t client_uid) {
+  const UniqueFd file(open(archive.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  return file && fchmod(file.get(), kExportMode) == 0 &&
+         fchown(file.get(), client_uid, static_cast<gid_t>(-1)) == 0 &&
+         rename(archive.c_str(), target.c_str()) == 0;
+}
+
+/** What the thread that packs and the request that waits for it share. */
+struct ExportJob {
+  GMainLoopPtr loop;
+  std::atomic<bool> unwanted{false};
+  bool packed = false; /**< of the main thread */
+  int result = QUARN_OK;
+};
+using ExportJobPtr = std::shared_ptr<ExportJob>;
+
+gboolean wake(gpointer data) {
+  const auto &job = *static_cast<ExportJobPtr *>(data);
+  job->packed = true;
+  g_main_loop_quit(job->loop.get());
+  return G_SOURCE_REMOVE;
+}
+
+void drop_reference(gpointer data) { delete static_cast<ExportJobPtr *>(data); }
+
+/**
+ * Pack beside the main loop: an export may have any size, and others are served meanwhile. The
+ * daemon is not idle before that has ended.
+ * @return what packing gave, or 17 when the daemon ends
+ */
+int pack(const std::string &pkg_id, const std::string &root, const std::string &archive) {
+  request_power_lock(true);
+  const auto job = std::make_shared<ExportJob>();
+  job->loop.reset(new_wait_loop());
+  std::thread worker([job, pkg_id, root, archive] {
+    make_zip_data(pkg_id.c_str(), root.c_str(), archive.c_str(), &job->result, kNoBounds, nullptr,
+                  &job->unwanted);
+    g_idle_add_full(G_PRIORITY_DEFAULT, wake, new ExportJobPtr(job), drop_reference);
+  });
+  run_nested_loop(job->loop.get());
+  job->unwanted = true;
+  worker.join();
+  request_power_lock(false);
+  return job->packed ? job->result : QUARN_CANCELLED;
+}
+
+/** Everything between an earlier export's removal and the answer. */
+int export_package(const std::string &pkg_id, const std::string &root, const std::string &target,
+                   unsigned int client_uid) {
+  const StagingDir staging;
+  if (staging.path().empty()) return QUARN_UNREADABLE;
+  const std::string archive = staging.path() + kStagedName;
+  const int result = pack(pkg_id, root, archive);
+  // one that lacks a file is told to be such, and is the client's as well
+  const bool made = result == QUARN_OK || (result == QUARN_REFUSED && file_exist(archive.c_str()));
+  if (made && !hand_over(archive, target, client_uid)) {
+    LOGE("fail to hand over %s : %d", target.c_str(), errno);
+    return QUARN_UNREADABLE;
+  }
+  return result;
+}
+
+}  // namespace
+
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
+  if (pkg_id == nullptr || !is_safe_path_component(pkg_id)) {
+    LOGE("cannot get root path info of (%s)...", pkg_id == nullptr ? "" : pkg_id);
+    return QUARN_REFUSED;
+  }
+  const std::string target = std::string(kExportDir) + pkg_id + kExportSuffix;
+  if (file_exist(target.c_str())) delete_file(target.c_str());
+  std::string root;
+  if (get_string_app_root_path(pkg_id, root) != QUARN_OK) {
+    LOGE("cannot get root path info of (%s)...", pkg_id);
+    return QUARN_REFUSED;
+  }
+  reset_backup_path_info();
+  const int zip_result = export_package(pkg_id, root, target, client_uid);
+  LOGI("quarnd_make_app_data zip_result = %d", zip_result);
+  return zip_result;
+}
