@@ -41,10 +41,8 @@ void put_label_back(int fd, const char *label, const char *key) {
   if (label == nullptr || label[0] == '\0') return;
   CString current;
   // By way of this process's own descriptors reading costs no walk.
-  if (smack_getlabel(own_fd_path(fd).c_str(), out(current), SMACK_LABEL_ACCESS) == 0 &&
-      current != nullptr && std::strcmp(current.get(), label) == 0) {
-    return;
-  }
+  const int result = smack_getlabel(own_fd_path(fd).c_str(), out(current), SMACK_LABEL_ACCESS);
+  if (result == 0 && current != nullptr && std::strcmp(current.get(), label) == 0) return;
   const std::string path = fd_path(fd);
   if (security_server_label_access(path.c_str(), label) != SECURITY_SERVER_SUCCESS &&
       smack_setlabel(path.c_str(), label, SMACK_LABEL_ACCESS) != 0) {

@@ -1,0 +1,118 @@
+// A tree that the writer packs is taken by the snapshot, the restore and the rollback.
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/safe_path.h"
+#include "restore_fixture.h"
+
+namespace {
+
+class DeepTest : public RestoreTest {
+ protected:
+  /** Folders one in the other below "data", and a file in each of the last two. */
+  void make_deep(int levels, const std::string &name, const std::string &content) {
+    int at_fd = open(at("data").c_str(), O_PATH | O_DIRECTORY);
+    for (int level = 0; level < levels; ++level) {
+      if (level >= levels - 2) make_file(at_fd, content);
+      ASSERT_EQ(mkdirat(at_fd, name.c_str(), 0755), 0);
+      const int next = openat(at_fd, name.c_str(), O_RDONLY | O_DIRECTORY);
+      ASSERT_EQ(fchown(next, kAppUid, kAppGid), 0);
+      set_label("/proc/self/fd/" + std::to_string(next) + "/.", kDataLabel);
+      close(at_fd);
+      at_fd = next;
+    }
+    make_file(at_fd, content);
+    close(at_fd);
+  }
+  static void make_file(int dir, const std::string &content) {
+    const int file = openat(dir, "file", O_WRONLY | O_CREAT | O_TRUNC, 0640);
+    ASSERT_EQ(write(file, content.data(), content.size()), static_cast<ssize_t>(content.size()));
+    ASSERT_EQ(fchown(file, kAppUid, kAppGid), 0);
+    close(file);
+    set_label("/proc/self/fd/" + std::to_string(dir) + "/file", kDataLabel);
+  }
+  /** What the deepest file holds, as far as there is one. */
+  std::string deepest() const {
+    UniqueFd here(open(at("data").c_str(), O_RDONLY | O_DIRECTORY));
+    while (true) {
+      const DirPtr dir = safe_opendir_at(here.get(), ".");
+      UniqueFd next;
+      while (const dirent *entry = readdir(dir.get())) {
+        if (entry->d_type == DT_DIR && entry->d_name[0] != '.')
+          next.reset(openat(here.get(), entry->d_name, O_RDONLY | O_DIRECTORY));
+      }
+      if (!next) break;
+      here = std::move(next);
+    }
+    char text[64] = {};
+    const UniqueFd file(openat(here.get(), "file", O_RDONLY));
+    return file && read(file.get(), text, sizeof(text) - 1) > 0 ? text : "";
+  }
+  int restore(const std::string &archive) {
+    const std::unique_ptr<pkg_restore_context> ctx(new_context());
+    ctx->wait_for_result = true;
+    restore_app_data("app", ctx.get());
+    std::filesystem::copy_file(archive, download(),
+                               std::filesystem::copy_options::overwrite_existing);
+    answer();
+    return ctx->result;
+  }
+};
+
+TEST_F(DeepTest, WhatTheWriterPacksIsRestored) {
+  make_deep(kMaxDirDepth - 1, "d", "saved");
+  int error = 0;
+  const std::string archive = base + "/deep.zip";
+  make_zip_data(kPkg, root.c_str(), archive.c_str(), &error);
+  ASSERT_EQ(error, 0);
+  std::filesystem::remove_all(at("data/d"));
+  make_deep(kMaxDirDepth - 1, "d", "present");
+  EXPECT_EQ(restore(archive), 0);
+  EXPECT_EQ(deepest(), "saved");
+  EXPECT_FALSE(exists(snapshot()));
+}
+
+TEST_F(DeepTest, WhatTheWriterPacksIsRolledBack) {
+  make_deep(kMaxDirDepth - 1, "d", "present");
+  const Tree before = tree_of(root);
+  make_archive(base + "/broken.zip", {{"data/d/d/file", "new"}, {"data/new", "new"}}, "not json");
+  EXPECT_EQ(restore(base + "/broken.zip"), 36);
+  EXPECT_EQ(tree_of(root) == before, true);
+  EXPECT_EQ(deepest(), "present");
+  EXPECT_FALSE(exists(snapshot()));
+}
+
+TEST_F(DeepTest, PathsThatAreTooLongInTheSnapshotAreRolledBack) {
+  // With the snapshot's folder in front of it the path is longer than the kernel takes at once.
+  const std::string name(99, 'n');
+  const int levels = static_cast<int>((4090 - at("data").size() - 5) / 100);
+  make_deep(levels, name, "present");
+  EXPECT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  const Tree before = tree_of(at("data"));
+  unpacked_file("data/new", "new");
+  EXPECT_EQ(put_snapshot_back(kPkg, root.c_str()), rollback_result::whole);
+  EXPECT_TRUE(tree_of(at("data")) == before);
+  EXPECT_EQ(deepest(), "present");
+  EXPECT_FALSE(exists(snapshot()));
+}
+
+TEST_F(DeepTest, ARollbackNeedsFewDescriptors) {
+  make_deep(kMaxDirDepth - 1, "d", "present");
+  rlimit before = {};
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit few = {128, before.rlim_max};
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &few), 0);
+  EXPECT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  EXPECT_TRUE(delete_directory_util(at("data/d").c_str()));
+  const rollback_result result = put_snapshot_back(kPkg, root.c_str());
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(result, rollback_result::whole);
+  EXPECT_EQ(deepest(), "present");
+}
+
+}  // namespace
