@@ -282,6 +282,34 @@ class KilledRestore(CrashTest):
         now = tree(self.root)
         self.assertTrue(now == self.present, self.difference(now))
 
+    def test_the_device_recovers_without_an_account(self):
+        self.kill_half_way()
+        self.device.stop()
+        self.device.set("account", "none")
+        self.device.start()
+        self.assertEqual(self.leftovers(), [])
+        now = tree(self.root)
+        self.assertTrue(now == self.present, self.difference(now))
+
+    def test_what_the_application_wrote_since_stays(self):
+        self.kill_half_way()
+        note = os.path.join(self.root, "data/written-since")
+        with open(note, "w") as file:
+            file.write("newer than the restore")
+        os.chown(note, 5000, 5000)
+        before = {path: entry for path, entry in tree(self.root).items()
+                  if "quarn_tmp_rst_dir" not in path}
+        self.device.stop()
+        self.device.start()
+        now = {path: entry for path, entry in tree(self.root).items()
+               if "quarn_tmp_rst_dir" not in path and not path.endswith((".zip", ".perm"))}
+        before = {path: entry for path, entry in before.items()
+                  if not path.endswith((".zip", ".perm"))}
+        self.assertEqual(now, before)
+        self.assertGreater(self.count("shared/data/quarn_tmp_rst_dir"), FILES // 2)
+        self.device.quarnctl("app", "restore", PACKAGE)
+        self.assertEqual(self.leftovers(), [])
+
     def test_a_backup_packs_a_half_restored_package_as_it_was_before_the_restore(self):
         self.kill_half_way()
         self.device.quarnctl("backup")

@@ -348,6 +348,73 @@ TEST_F(PipelineTest, ProgressIsToldStepByStep) {
   EXPECT_EQ(progress.back().size, 0U);
 }
 
+TEST_F(PipelineTest, APartOfADownloadHindersNoRestore) {
+  make_old_data();
+  const std::string part =
+      unpacked_file("shared/data/.quarn-part-0123456789abcdef01234567", "part of an archive");
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  bool copied = false;
+  const AtStep step("snapshot-complete", [&] {
+    copied = exists(snapshot() + "/shared/data/.quarn-part-0123456789abcdef01234567");
+  });
+  answer();
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_FALSE(copied);
+  EXPECT_EQ(read_text(part), "part of an archive");
+}
+
+TEST_F(PipelineTest, AFileOfTheApplicationsOwnThatIsNamedLikeAPartIsData) {
+  make_old_data();
+  file("shared/data/.quarn-part-0123456789abcdef01234567", "its own");
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data, "not json");
+  answer();
+  EXPECT_EQ(ctx->result, 36);
+  EXPECT_EQ(tree_of(root), before);
+}
+
+TEST_F(PipelineTest, WhatCouldNotBePutBackIsToldAndNotSnapshotOver) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  const auto block = [this] {
+    std::filesystem::remove_all(at("data/settings.ini"));
+    std::filesystem::create_directories(at("data/settings.ini"));
+    std::filesystem::create_symlink("/nowhere", at("data/settings.ini/link"));
+  };
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data, "not json");
+  {
+    const AtStep step("rollback-cleared", block);
+    answer();
+  }
+  EXPECT_EQ(ctx->result, 36);
+  EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
+  EXPECT_EQ(read_text(snapshot() + "/data/settings.ini"), "old settings");
+
+  // as long as that is so, a further restore changes nothing
+  ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(ctx->result, 36);
+  EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
+  EXPECT_EQ(read_text(snapshot() + "/data/settings.ini"), "old settings");
+
+  std::filesystem::remove_all(at("data/settings.ini"));
+  ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(tree_of(root), before) << "it is tried again first";
+  make_archive(download(), new_data);
+  answer();
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+}
+
 /* ---- from the phone-transfer companion ---- */
 
 class CompanionTest : public PipelineTest {
