@@ -293,7 +293,9 @@ class KilledRestore(CrashTest):
 
     def test_what_the_application_wrote_since_stays(self):
         self.kill_half_way()
-        note = os.path.join(self.root, "data/written-since")
+        note = os.path.join(self.root, "data/folder3/file3")
+        if os.path.exists(note):
+            os.unlink(note)
         with open(note, "w") as file:
             file.write("newer than the restore")
         os.chown(note, 5000, 5000)
