@@ -504,6 +504,7 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
 }
 
 UniqueFd create_archive(const char *zip_path) {
+  claim_working_file(zip_path);
   if (file_exist(zip_path)) delete_file(zip_path);
   return safe_open(zip_path, O_RDWR | O_CREAT | O_EXCL, kArchiveMode);
 }
