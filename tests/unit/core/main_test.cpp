@@ -216,7 +216,8 @@ TEST_F(Main, RunsItsStepsInOrder) {
   EXPECT_EQ(captured_texts(), (Texts{"Quarn Daemon start",
                                      "account",
                                      "watch_signals",
-                                     "begin_turn", "sweep but /tmp/quarn/lock",
+                                     "begin_turn",
+                                     "sweep but /tmp/quarn/lock",
                                      "progress_init",
                                      "loop_init",
                                      "dbus_init",
@@ -381,7 +382,14 @@ TEST_F(Main, CanBeStartedAgainAfterItsTearDown) {
 TEST_F(Main, TheRecoveryNeedsNoAccountAndNoBus) {
   account = false;
   EXPECT_EQ(quarn_recover(), 0);
-  EXPECT_EQ(steps, Texts{"recovery"});
+  EXPECT_EQ(steps, (Texts{"begin_turn", "sweep but /tmp/quarn/lock", "recovery", "end_turn"}));
+}
+
+TEST_F(Main, TheRecoveryIsLeftToADaemonThatWorks) {
+  turn_is_there = false;
+  EXPECT_EQ(quarn_recover(), 0);
+  turn_is_there = true;
+  EXPECT_EQ(steps, (Texts{"begin_turn", "end_turn"}));
 }
 
 TEST_F(Main, OnlyTheRecoveryIsMadeWhenItIsAskedFor) {

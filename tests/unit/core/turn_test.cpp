@@ -222,12 +222,14 @@ TEST_F(TurnDeathTest, ComesWhenTheEarlierProcessEnds) {
 
 TEST_F(TurnDeathTest, HasLinesOfThoseWhoWaitForIt) {
   EXPECT_EXIT(leave_lines(), ::testing::ExitedWithCode(0), "");
-  TEST_F(TurnDeathTest, IsNotHadByALockThatWasRemoved) {
-    EXPECT_EXIT(wait_for_a_lock_that_is_removed(), ::testing::ExitedWithCode(0), "");
-  }
+}
 
-  TEST_F(TurnDeathTest, IsAlwaysThereWithoutALock) {
-    EXPECT_EXIT(go_without_a_lock(), ::testing::ExitedWithCode(0), "");
-  }
+TEST_F(TurnDeathTest, IsNotHadByALockThatWasRemoved) {
+  EXPECT_EXIT(wait_for_a_lock_that_is_removed(), ::testing::ExitedWithCode(0), "");
+}
+
+TEST_F(TurnDeathTest, IsAlwaysThereWithoutALock) {
+  EXPECT_EXIT(go_without_a_lock(), ::testing::ExitedWithCode(0), "");
+}
 
 }  // namespace

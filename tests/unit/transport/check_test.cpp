@@ -1,5 +1,6 @@
 #include "check.h"
 
+#include <glib.h>
 #include <gmock/gmock.h>
 
 #include <atomic>
