@@ -185,8 +185,9 @@ void wait_for_the_turn() {
 
 void leave_lines() {
   const Folder folder;
-  Holder holder(folder.lock());
-  begin_quarn_turn(folder.lock().c_str(), nullptr, on_turn);
+  const std::string lock = folder.lock();
+  Holder holder(lock);
+  begin_quarn_turn(lock.c_str(), nullptr, on_turn);
   check(tell_quarn_predecessor("a", SIGUSR2), "it can be told");
   check(holder.read_told() == 'a', "it reads the line");
   check(tell_quarn_predecessor("b", SIGUSR2), "it can be told again");
@@ -194,7 +195,7 @@ void leave_lines() {
   holder.let_go();
   check(wait_for_quarn_turn(kDeadlineMs) || is_quarn_turn(), "the turn comes");
   check(!tell_quarn_predecessor("c", SIGUSR2), "nobody is before it any more");
-  unlink(folder.lock().c_str());
+  unlink(lock.c_str());
   _exit(0);
 }
 
