@@ -757,8 +757,8 @@ void Session::end_watch(bool mode_ended) {
 
 void Session::daemon_ended() {
   if (done_ || explaining_ || !called_) return;
-  // One that ended before the backup was asked for is started again by that.
-  if (previewing_) return;
+  // One that ended with the list told is started again by the backup.
+  if (previewing_ && callback_) return;
   if (watching_ && all_told()) return end_watch(false);
   if (watching_) {
     std::string missing;

@@ -16,6 +16,7 @@ using quarn_client::json_parse;
 using quarn_client::json_string;
 
 constexpr int kUnconfirmed = 65;
+constexpr int kDaemonEnded = 70;
 constexpr int kInterrupted = 130;
 constexpr unsigned short kColumns = 200;
 
@@ -93,6 +94,17 @@ TEST_F(QuarnctlBackup, ThatWouldRemoveAPackageIsNotBegunWhereNobodyCanBeAsked) {
             "quarnctl: the backup would remove 1 package that is not installed from the cloud: "
             "org.gone; quarnctl backup --yes does, quarnctl restore on --from 1 gets them back as "
             "they are installed\n");
+  EXPECT_FALSE(started());
+}
+
+TEST_F(QuarnctlBackup, ADaemonThatDiesWithTheListUntoldIsToldAtOnce) {
+  daemon_.on("get_app_list", [this](const IncomingCall &call) {
+    call.reply(0);
+    daemon_.die();
+  });
+  const Outcome outcome = quarnctl(*bus_, {"backup"});
+  EXPECT_EQ(outcome.exit, kDaemonEnded);
+  EXPECT_EQ(outcome.err, "quarnctl: the daemon ended before it had answered\n");
   EXPECT_FALSE(started());
 }
 
