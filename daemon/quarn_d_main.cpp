@@ -89,6 +89,7 @@ int take_signal(int signo) {
 
 void tell_waiting_clients() {
   quarn_dbus_end_requests();
+  quarnd_dbus_answer_all();
   quarn_dbus_flush(kLastFlush);
 }
 

@@ -83,6 +83,10 @@ void quarn_dbus_flush(unsigned int ms) {
   EXPECT_LT(ms, 1000u);
   step("flush");
 }
+void quarnd_dbus_answer_all() {
+  EXPECT_TRUE(waiting_stopped);
+  step("answer_all");
+}
 void quarnd_dbus_leave() {
   EXPECT_TRUE(waiting_stopped);
   step("dbus_leave");
@@ -306,8 +310,9 @@ TEST_F(Main, SignalTellsTheClientsTearsDownOnceAndEndsWithZero) {
 TEST_F(Main, ProcessThatDoesNotEndTellsItsClientsLast) {
   quarn_run();
   restart();
+  hooks.begin_end();
   hooks.last();
-  EXPECT_EQ(steps, (Texts{"end_requests", "flush"}));
+  EXPECT_EQ(steps, (Texts{"end_requests", "answer_all", "flush"}));
 }
 
 TEST_F(Main, ServiceManagersAnswerToTheNameGivenUpLeavesTimeForTheWork) {
