@@ -157,7 +157,11 @@ void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
-void recover_device() { step("recovery"); }
+void (*in_recovery)() = nullptr;
+void recover_device() {
+  step("recovery");
+  if (in_recovery != nullptr) in_recovery();
+}
 int quarnd_restore_enable(int on, int client, const char *, const char *, void *record) {
   EXPECT_EQ(on, 0);
   EXPECT_EQ(client, 0);
@@ -388,6 +392,14 @@ TEST_F(Main, TheRecoveryNeedsNoAccountAndNoBus) {
   account = false;
   EXPECT_EQ(quarn_recover(), 0);
   EXPECT_EQ(steps, (Texts{"begin_turn", "sweep but /tmp/quarn/lock", "recovery", "end_turn"}));
+}
+
+TEST_F(Main, TheRecoveryIsNotEndedByWhatADaemonTellsItsPredecessor) {
+  in_recovery = [] {
+    for (const int signo : {SIGUSR1, SIGUSR2}) EXPECT_EQ(handler_of(signo), SIG_IGN) << signo;
+  };
+  quarn_recover();
+  in_recovery = nullptr;
 }
 
 TEST_F(Main, TheRecoveryIsLeftToADaemonThatWorks) {
