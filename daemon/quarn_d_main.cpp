@@ -89,6 +89,7 @@ int take_signal(int signo) {
 
 void tell_waiting_clients() {
   quarn_dbus_end_requests();
+  quarnd_dbus_answer_all();
   quarn_dbus_flush(kLastFlush);
 }
 
@@ -99,6 +100,11 @@ void end_by_signal(int) {
   quarn_dbus_end_requests();
   quit_nested_loops();
   quarn_loop_quit();
+}
+
+/** What other processes send must not end one that does not listen. */
+void ignore_messages() {
+  for (const int signo : {kCancelSignal, kWithdrawSignal}) signal(signo, SIG_IGN);
 }
 
 void install_signal_handlers() {
@@ -172,6 +178,7 @@ int quarn_run() {
     LOGI("no signed-in. Daemon stop");
     return 0;
   }
+  ignore_messages();
   signals_watched = quarn_loop_watch_signals(
       {take_signal, quarn_dbus_stop_waiting, end_by_signal, tell_waiting_clients, kSignalGrace});
   install_signal_handlers();
@@ -190,6 +197,7 @@ int quarn_run() {
 
 int quarn_recover() {
   LOGI("recovery of what an interrupted restore or backup has left");
+  ignore_messages();
   begin_quarn_turn(kLockName, prepare_staging_directory, nullptr);
   // A daemon that works at this moment has done it at its own start.
   if (is_quarn_turn()) {

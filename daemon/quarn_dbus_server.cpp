@@ -20,6 +20,7 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 
@@ -89,6 +90,9 @@ constexpr int kBusTimeout = 5000;
 /** Milliseconds for the last answers to be written. */
 constexpr unsigned int kFlushLimit = 500;
 
+/** Milliseconds that the bus may take to answer when the process is about to be left. */
+constexpr int kLastRelease = 50;
+
 guint registration_id = 0;
 guint filter_id = 0;
 guint name_owner_id = 0;
@@ -100,10 +104,12 @@ void (*bus_acquired_hook)(GDBusConnection *connection) = nullptr;
 /** One call, and the way its one answer goes. */
 class MethodCall {
  public:
-  MethodCall(const char *sender, const char *interface_name, const char *method_name)
+  MethodCall(const char *sender, const char *interface_name, const char *method_name,
+             guint32 serial)
       : sender_(sender == nullptr ? "" : sender),
         interface_(interface_name),
-        method_(method_name) {}
+        method_(method_name),
+        serial_(serial) {}
   MethodCall(const MethodCall &) = delete;
   MethodCall &operator=(const MethodCall &) = delete;
   virtual ~MethodCall() = default;
@@ -117,11 +123,14 @@ class MethodCall {
   const std::string &sender() const { return sender_; }
   const std::string &interface_name() const { return interface_; }
   const std::string &method() const { return method_; }
+  /** The number that the sender has given it. */
+  guint32 serial() const { return serial_; }
 
  private:
   std::string sender_;
   std::string interface_;
   std::string method_;
+  guint32 serial_;
 };
 
 /** A call that GDBus handed over. */
@@ -129,7 +138,9 @@ class InvokedCall : public MethodCall {
  public:
   InvokedCall(const char *sender, const char *interface_name, const char *method_name,
               GDBusMethodInvocation *invocation)
-      : MethodCall(sender, interface_name, method_name), invocation_(invocation) {}
+      : MethodCall(sender, interface_name, method_name,
+                   g_dbus_message_get_serial(g_dbus_method_invocation_get_message(invocation))),
+        invocation_(invocation) {}
   void reply(GVariant *value) override {
     g_dbus_method_invocation_return_value(invocation_, value);
   }
@@ -149,7 +160,7 @@ class RawCall : public MethodCall {
  public:
   RawCall(GDBusConnection *connection, GDBusMessage *message)
       : MethodCall(g_dbus_message_get_sender(message), g_dbus_message_get_interface(message),
-                   g_dbus_message_get_member(message)),
+                   g_dbus_message_get_member(message), g_dbus_message_get_serial(message)),
         connection_(connection),
         message_(message) {}
   void reply(GVariant *value) override {
@@ -339,6 +350,7 @@ void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *p
 
 /** The one dispatcher; @p given is null when the call has no arguments. */
 void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
+  if (!begin_quarn_call(call.sender(), call.serial())) return;
   cancel_quarn_terminate();
 
   // A reference of our own: those of the call go with its answer.
@@ -375,9 +387,8 @@ void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
   } else if (call.is("make_app_data")) {
     with_parameters([&] { on_make_app_data(call, connection, parameters); });
   } else {
-    const GString_ text(g_strdup_printf("Method %s is not implemented on interface %s",
-                                        call.method().c_str(), call.interface_name().c_str()));
-    call.refuse(G_DBUS_ERROR_UNKNOWN_METHOD, text.get());
+    call.refuse(G_DBUS_ERROR_UNKNOWN_METHOD,
+                unknown_method_text(call.method(), call.interface_name()));
   }
 }
 
@@ -468,6 +479,12 @@ std::string signature_of(const GDBusMethodInfo *method) {
   return signature;
 }
 
+quarn_call_form form_of(const GDBusMethodInfo *method, const std::string &given) {
+  if (method == nullptr) return quarn_call_form::unknown_method;
+  if (given == signature_of(method)) return quarn_call_form::right;
+  return given.empty() ? quarn_call_form::without_arguments : quarn_call_form::other_arguments;
+}
+
 /**
  * GDBus refuses methods that are not in the introspection data, and calls with
  * other arguments than those, before the dispatcher hears of them. Yet any call
@@ -475,16 +492,21 @@ std::string signature_of(const GDBusMethodInfo *method) {
  */
 GDBusMessage *filter_calls(GDBusConnection *connection, GDBusMessage *message, gboolean incoming,
                            gpointer user_data) {
-  if (incoming == FALSE ||
-      g_dbus_message_get_message_type(message) != G_DBUS_MESSAGE_TYPE_METHOD_CALL ||
-      g_strcmp0(g_dbus_message_get_path(message), kQuarnObjectPath) != 0 ||
+  if (incoming == FALSE) {
+    note_quarn_answer(message);
+    return message;
+  }
+  if (g_dbus_message_get_message_type(message) != G_DBUS_MESSAGE_TYPE_METHOD_CALL) return message;
+  if (g_strcmp0(g_dbus_message_get_path(message), kQuarnObjectPath) != 0 ||
       g_strcmp0(g_dbus_message_get_interface(message), kQuarnInterface) != 0) {
+    note_quarn_call(message, quarn_call_form::of_other_object);
     return message;
   }
   const auto *node = static_cast<const GDBusNodeInfo *>(user_data);
   const GDBusMethodInfo *method =
       g_dbus_interface_info_lookup_method(node->interfaces[0], g_dbus_message_get_member(message));
   const std::string given = g_dbus_message_get_signature(message);
+  note_quarn_call(message, form_of(method, given));
   if (method != nullptr && given == signature_of(method)) return message;
   if (method != nullptr && !given.empty()) {
     pass_to_main_thread(connection, message, false);
@@ -599,6 +621,16 @@ void quarnd_dbus_leave() {
   bool drained = false;
   g_idle_add_full(G_PRIORITY_LOW, set_flag, &drained, nullptr);
   while (!drained) g_main_context_iteration(nullptr, TRUE);
+}
+
+void quarnd_dbus_answer_all() {
+  if (quarn_dbus_connection == nullptr) return;
+  // Not by the owner's id, which is the main thread's. What comes before the bus' answer is noted.
+  const GVariantPtr released(g_dbus_connection_call_sync(
+      quarn_dbus_connection, "org.freedesktop.DBus", "/org/freedesktop/DBus",
+      "org.freedesktop.DBus", "ReleaseName", g_variant_new("(s)", kQuarnBusName), nullptr,
+      G_DBUS_CALL_FLAGS_NONE, kLastRelease, nullptr, nullptr));
+  answer_quarn_calls();
 }
 
 void quarnd_dbus_deinit(unsigned int owner_id) {

@@ -2,7 +2,7 @@
  * @file quarn_dbus_server.h
  * @brief The bus name, the introspection data and the one method dispatcher.
  *
- * Main thread only.
+ * Main thread only, where not told otherwise.
  */
 #ifndef QUARN_DBUS_SERVER_H
 #define QUARN_DBUS_SERVER_H
@@ -35,6 +35,13 @@ void quarnd_dispatch_deferred();
  * that is not begun by begin_quarn_end(), after quarn_dbus_stop_waiting().
  */
 void quarnd_dbus_leave();
+
+/**
+ * The process leaves while the main thread is in the middle of something: give
+ * the bus name up, and answer every call that was delivered and has no answer.
+ * Any thread, after quarn_dbus_stop_waiting().
+ */
+void quarnd_dbus_answer_all();
 
 /** Serve nothing any more and give the bus name up; returns when every answer has left. */
 void quarnd_dbus_deinit(unsigned int owner_id);

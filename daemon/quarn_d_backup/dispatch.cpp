@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <mutex>
 #include <string>
+#include <utility>
 
 #include "backup_transport.h"
 #include "quarn_common.h"
@@ -46,6 +47,9 @@ std::atomic<std::size_t> waiting_entries{0};
 /** Requests that were made and are not finished. */
 std::atomic<int> outstanding_requests{0};
 
+/** An automatic backup is queued or runs; with the list's mutex. */
+bool automatic_outstanding = false;
+
 std::atomic<int (*)()> wifi_probe{nullptr};
 
 std::atomic<backup_end_observer> end_observer{nullptr};
@@ -66,6 +70,11 @@ Taken take_request(void **client) {
   const auto *record = static_cast<const client_cb_data *>(*client);
   running = {record != nullptr, false, record != nullptr ? record->sender : ""};
   return Taken::kRequest;
+}
+
+void forget_automatic() {
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  automatic_outstanding = false;
 }
 
 /** Clients whose reservation was cancelled learn it here, not on the main thread. */
@@ -119,6 +128,7 @@ void *backup_req_dispatch_thread(void *) {
       g_is_backing_up = true;
       run_request(client);
       settle_running_backup();
+      if (client == nullptr) forget_automatic();
       g_is_backing_up = false;
       request_power_lock(false);
       end_request();
@@ -173,9 +183,13 @@ void init_backup_req_dispatch_thread() {
 }
 
 void request_backup(void *client) {
-  ++outstanding_requests;
   {
     const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    if (client == nullptr && std::exchange(automatic_outstanding, true)) {
+      LOGI("auto backup is requested already");
+      return;
+    }
+    ++outstanding_requests;
     backup_req_list.push_back(client);
     ++waiting_entries;
   }

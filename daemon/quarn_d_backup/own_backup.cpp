@@ -78,10 +78,13 @@ void keep_knowledge_of_last_backup() {
 }
 
 void note_restore_mode_waits(const std::string &serial) {
+  if (serial != own_serial()) waits_here = false;
   if (serial != own_serial() || !knows_own_backup(serial)) return;
   store_mark(kWaitedFor);
   waits_here = true;
 }
+
+void note_restore_mode_withdrawn() { waits_here = false; }
 
 void note_restore_mode_used() {
   waits_here = false;

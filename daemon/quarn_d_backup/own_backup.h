@@ -34,6 +34,8 @@ void keep_knowledge_of_last_backup();
  * known to be superfluous by then.
  */
 void note_restore_mode_waits(const std::string &serial);
+/** It waits no more, and was not used: as if the daemon had ended before the mode. */
+void note_restore_mode_withdrawn();
 /** Restore mode was used to its end: the user had what was wanted of the backup. */
 void note_restore_mode_used();
 

@@ -189,7 +189,7 @@ extern std::atomic<bool> g_is_backing_up;
 
 /** Start the worker; once, on the main thread. */
 void init_backup_req_dispatch_thread();
-/** Queue a request; null is an automatic backup. Any thread. */
+/** Queue a request; null is an automatic backup, of which one at a time is enough. Any thread. */
 void request_backup(void *client);
 /**
  * Abort transfers and drop every queued manual request. Each dropped client is

@@ -16,7 +16,7 @@ std::uint32_t quarnd_cancel_own(const std::string &sender) {
   const bool mode_on = pellix_restore_running != 0 || cloud_restore_running != 0;
   if (mode_on && restore_record_is_of(sender)) {
     set_restore_stop_result(QUARN_CANCELLED);
-    quarnd_restore_enable(0, 0, "", "", nullptr);
+    quarnd_withdraw_restore_mode();
     ++count;
   }
   LOGI("%u requests of (%s) are withdrawn", count, sender.c_str());

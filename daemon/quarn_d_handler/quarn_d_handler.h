@@ -48,6 +48,8 @@ extern char cloud_restore_running;
  */
 int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
                           void *record);
+/** Restore mode off, because its client does not want it any more: it was not used. */
+void quarnd_withdraw_restore_mode();
 /**
  * Replace the candidate list by a JSON array of package ids. Anything else
  * than an array of texts is an empty list; impossible ids are left out.

@@ -65,6 +65,12 @@ void await_candidates() {
   note_restore_mode_waits(serial_num_user_select);
 }
 
+/** What is waited for is neither there nor given up: only a backup by hand may remove it. */
+void stop_waiting_unused() {
+  await_no_archives();
+  note_restore_mode_withdrawn();
+}
+
 /** The answer to a request in whose place another came while it waited for the session. */
 int superseded_result(RecordPtr record) {
   if (pellix_restore_running) return QUARN_REFUSED;
@@ -81,7 +87,7 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   }
   run_on_thread_stack(recover_interrupted_restores);
   pkg_list_to_be_restored = std::move(list);
-  if (pkg_list_to_be_restored.empty() || client == kPellixClient) await_no_archives();
+  if (pkg_list_to_be_restored.empty()) await_no_archives();
   if (pkg_list_to_be_restored.empty()) {
     LOGI("there is no package should be restored");
     return QUARN_OK;
@@ -91,7 +97,11 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   init_icon_hide_delay_timer_list();
   current_restore_client = client;
   serial_num_user_select = serial_num;
-  if (client == kCloudClient) await_candidates();
+  if (client == kCloudClient) {
+    await_candidates();
+  } else {
+    stop_waiting_unused();
+  }
   const unsigned int this_change = ++mode_changes;
   if (client == kPellixClient) {
     start_monitor(client, serial_num, std::move(record));
@@ -107,7 +117,10 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   if (session && !superseded) start_monitor(client, serial_num, std::move(record));
   request_power_lock(false);
   if (withdrawn) {
-    if (!superseded) pkg_list_to_be_restored.clear();
+    if (!superseded) {
+      pkg_list_to_be_restored.clear();
+      stop_waiting_unused();
+    }
     send_restore_stop(record.release(), QUARN_CANCELLED);
     return QUARN_CANCELLED;
   }
@@ -117,10 +130,14 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   return QUARN_OK;
 }
 
-int switch_off() {
+int switch_off(bool used) {
   ++mode_changes;
-  await_no_archives();
-  if (cloud_restore_running) note_restore_mode_used();
+  if (used) {
+    await_no_archives();
+    if (cloud_restore_running) note_restore_mode_used();
+  } else {
+    stop_waiting_unused();
+  }
   current_restore_client = kCloudClient;
   if (stop_install_monitor()) {
     LOGI("stop install event monitor");
@@ -148,9 +165,14 @@ int quarnd_restore_enable(int on, int client, const char *serial_num, const char
     LOGE("restore mode by pellix is already running");
     return QUARN_REFUSED;
   }
-  const int result = on == 0 ? switch_off()
+  const int result = on == 0 ? switch_off(true)
                              : switch_on(client, serial_num == nullptr ? "" : serial_num,
                                          pkg_list == nullptr ? "" : pkg_list, std::move(owned));
   note_restore_mode_change();
   return result;
+}
+
+void quarnd_withdraw_restore_mode() {
+  switch_off(false);
+  note_restore_mode_change();
 }

@@ -3,7 +3,9 @@
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_dbus_client.h"
@@ -15,13 +17,17 @@ constexpr int kPellixClient = 1;
 constexpr char kFailed[] = "failed";
 constexpr char kNone[] = "none";
 constexpr int kMostLoggedBytes = 65536;
+/** How often a download is begun again that was aborted for somebody else's sake. */
+constexpr int kMaxTimesAborted = 8;
 
 /** One request for the list in the cloud. */
 struct list_request {
   std::string local_path;
   std::string cloud_path;
   void *invocation;
+  int times_aborted = 0;
 };
+using RequestPtr = std::unique_ptr<list_request>;
 
 /**
  * A file of the request's own beside the staged list: the staged one is a
@@ -63,10 +69,31 @@ CString read_list(const std::string &path, request_cause *cause) {
   return text;
 }
 
+void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char *unused);
+
+/** Hand the request to the transport, which has it then. */
+int request_list(RequestPtr &request) {
+  const int result = backup_trans_download_file_ors_async(
+      cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
+      __get_app_list_resp_cb, BACKUP_TRANS_OPTION_NONE);
+  if (result == BACKUP_TRANS_ERROR_NONE) static_cast<void>(request.release());
+  return result;
+}
+
+/** The transport aborts everything at once, also what others wait for. */
+bool begin_list_again(RequestPtr &request) {
+  if (waits_are_ended() || !wifi_connected()) return false;
+  if (++request->times_aborted > kMaxTimesAborted) return false;
+  if (request_list(request) != BACKUP_TRANS_ERROR_NONE) return false;
+  LOGI("download of app list was aborted with others, so it is requested again");
+  return true;
+}
+
 void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char * /*unused*/) {
   if (user_data == nullptr) LOGE("cb user_data is NULL...");
   g_assert(user_data != nullptr);
-  const std::unique_ptr<list_request> request(static_cast<list_request *>(user_data));
+  RequestPtr request(static_cast<list_request *>(user_data));
+  if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_list_again(request)) return;
   CString text;
   request_cause cause = cause_of_transfer(error, request->local_path);
   if (error != BACKUP_TRANS_ERROR_NONE) {
@@ -105,11 +132,7 @@ int get_app_list(int client, void *invocation) {
   request->cloud_path = kCloudAppListPath;
   request->invocation = invocation;
   int result = BACKUP_TRANS_ERROR_LOCAL_FILE;
-  if (prepare_staging_directory()) {
-    result = backup_trans_download_file_ors_async(cloud_handler(), request->cloud_path.c_str(),
-                                                  request->local_path.c_str(), request.get(),
-                                                  __get_app_list_resp_cb, BACKUP_TRANS_OPTION_NONE);
-  }
+  if (prepare_staging_directory()) result = request_list(request);
   if (result != BACKUP_TRANS_ERROR_NONE) {
     LOGE("backup_trans_download_file_ors_async failed... %d", result);
     note_request_end(cause_of_transfer(result, request->local_path));
@@ -119,6 +142,5 @@ int get_app_list(int client, void *invocation) {
   }
   // Until the client has its answer the daemon is not idle.
   request_power_lock(true);
-  static_cast<void>(request.release());
   return QUARN_OK;
 }

@@ -1,5 +1,6 @@
 """The daemon's end: no call that is sent is lost, and every accepted request ends once."""
 import contextlib
+import fcntl
 import os
 import random
 import signal
@@ -222,6 +223,50 @@ class Signals(EndTest):
                          [("app_data_restore_complete", (CANCELLED, PACKAGES[1], 2))])
         self.assertEqual(self.client.callbacks("get_app_list_cb"),
                          [("get_app_list_cb", (CANCELLED, "failed", 3))])
+
+    def test_calls_that_the_daemon_has_not_come_to_are_answered(self):
+        """Its main thread is in the middle of something that does not end within the second."""
+        self.install()
+        self.client.call("last_bu_time")
+        with open(os.path.join(self.device.path, "state/.lock")) as lock:
+            fcntl.flock(lock, fcntl.LOCK_EX)
+            calls = {
+                "backup_enable": integer(1), "set_activation": integer(1), "last_bu_time": None,
+                "auto_backup_start": GLib.Variant("(s)", ("",)),
+                "get_app_list": GLib.Variant("(iu)", (0, 1)),
+                "manual_backup_start": request(2), "manual_backup_cancel": request(3),
+                "app_data_backup_start": package(PACKAGES[0], 4),
+                "app_data_restore_start": package(PACKAGES[1], 5),
+                "make_app_data": GLib.Variant("(s)", (PACKAGES[0],)),
+                "restore_enable": GLib.Variant("(iissu)", (1, 0, "350000000000001",
+                                                           '["%s"]' % PACKAGES[0], 6)),
+                "fly": None}
+            calls = {method: self.client.start(method, arguments)
+                     for method, arguments in calls.items()}
+            calls["manual"] = self.client.start("manual_backup_start")
+            calls["CancelOwn"] = self.client.start("CancelOwn",
+                                                   path="/org/orvane/Quarn/Packages",
+                                                   interface="org.orvane.Quarn.Packages")
+            self.client.owner()
+            self.assert_at_once(self.end())
+            self.client.until(lambda: all(call.done for call in calls.values()), "the replies")
+        self.assertGreater(calls.pop("last_bu_time").reply[0], 0)
+        self.assertEqual(calls.pop("fly").error,
+                         "GDBus.Error:org.freedesktop.DBus.Error.UnknownMethod: "
+                         "Method fly is not implemented on interface org.orvane.Quarn")
+        self.assertEqual({method: call.error or call.reply for method, call in calls.items()},
+                         {"backup_enable": (CANCELLED,), "set_activation": (CANCELLED,),
+                          "auto_backup_start": (), "get_app_list": (CANCELLED,),
+                          "manual_backup_start": (0,), "manual_backup_cancel": (0,),
+                          "app_data_backup_start": (0,), "app_data_restore_start": (0,),
+                          "make_app_data": (CANCELLED,), "restore_enable": (36,),
+                          "manual": (-1,), "CancelOwn": (0,)})
+        self.assertEqual(sorted(self.client.callbacks()),
+                         [("app_data_backup_complete", (CANCELLED, PACKAGES[0], 4)),
+                          ("app_data_restore_complete", (CANCELLED, PACKAGES[1], 5)),
+                          ("get_app_list_cb", (CANCELLED, "failed", 1)),
+                          ("manual_backup_cancel_result", (CANCELLED, 3)),
+                          ("manual_backup_status", (CANCELLED, 6, 2))])
 
     def test_running_and_queued_backups_are_told(self):
         self.install()

@@ -83,6 +83,10 @@ void quarn_dbus_flush(unsigned int ms) {
   EXPECT_LT(ms, 1000u);
   step("flush");
 }
+void quarnd_dbus_answer_all() {
+  EXPECT_TRUE(waiting_stopped);
+  step("answer_all");
+}
 void quarnd_dbus_leave() {
   EXPECT_TRUE(waiting_stopped);
   step("dbus_leave");
@@ -153,7 +157,11 @@ void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
-void recover_device() { step("recovery"); }
+void (*in_recovery)() = nullptr;
+void recover_device() {
+  step("recovery");
+  if (in_recovery != nullptr) in_recovery();
+}
 int quarnd_restore_enable(int on, int client, const char *, const char *, void *record) {
   EXPECT_EQ(on, 0);
   EXPECT_EQ(client, 0);
@@ -306,8 +314,9 @@ TEST_F(Main, SignalTellsTheClientsTearsDownOnceAndEndsWithZero) {
 TEST_F(Main, ProcessThatDoesNotEndTellsItsClientsLast) {
   quarn_run();
   restart();
+  hooks.begin_end();
   hooks.last();
-  EXPECT_EQ(steps, (Texts{"end_requests", "flush"}));
+  EXPECT_EQ(steps, (Texts{"end_requests", "answer_all", "flush"}));
 }
 
 TEST_F(Main, ServiceManagersAnswerToTheNameGivenUpLeavesTimeForTheWork) {
@@ -383,6 +392,14 @@ TEST_F(Main, TheRecoveryNeedsNoAccountAndNoBus) {
   account = false;
   EXPECT_EQ(quarn_recover(), 0);
   EXPECT_EQ(steps, (Texts{"begin_turn", "sweep but /tmp/quarn/lock", "recovery", "end_turn"}));
+}
+
+TEST_F(Main, TheRecoveryIsNotEndedByWhatADaemonTellsItsPredecessor) {
+  in_recovery = [] {
+    for (const int signo : {SIGUSR1, SIGUSR2}) EXPECT_EQ(handler_of(signo), SIG_IGN) << signo;
+  };
+  quarn_recover();
+  in_recovery = nullptr;
 }
 
 TEST_F(Main, TheRecoveryIsLeftToADaemonThatWorks) {

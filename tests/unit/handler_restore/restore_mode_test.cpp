@@ -26,6 +26,35 @@ class RestoreModeTest : public HandlerTest {
   static Outside::Answer stop(unsigned int req_id) {
     return {"restore_enable_cb", 0, "restore_stop", req_id};
   }
+  /** The settings have the mark that tells whose the backup is, and nothing else. */
+  void keep_mark() {
+    ON_CALL(platform, vconf_get_dbl).WillByDefault(Return(VCONF_ERROR));
+    ON_CALL(platform, vconf_set_int).WillByDefault([this](auto, int value) {
+      mark = value;
+      return VCONF_OK;
+    });
+    ON_CALL(platform, vconf_get_int).WillByDefault([this](auto, int *value) {
+      *value = mark;
+      return VCONF_OK;
+    });
+  }
+
+  int mark = 0;
+};
+
+class RestoreModeTestWithMark : public RestoreModeTest {
+ protected:
+  static constexpr int kWaitedFor = -2;
+  RestoreModeTestWithMark() {
+    keep_mark();
+    note_own_backup(kSerial);
+  }
+  /** Nobody waits any more, and what was waited for is not known to be superfluous. */
+  void expect_unused() const {
+    EXPECT_TRUE(claimed_packages(kSerial).empty());
+    EXPECT_EQ(mark, kWaitedFor);
+    EXPECT_FALSE(knows_own_backup(kSerial));
+  }
 };
 
 /* ---- the list ---- */
@@ -102,16 +131,7 @@ TEST_F(RestoreModeTest, AnEmptyListAndTheCompanionsModeClaimNothing) {
 }
 
 TEST_F(RestoreModeTest, AModeThatWasUsedIsADecisionOnTheBackup) {
-  ON_CALL(platform, vconf_get_dbl).WillByDefault(Return(VCONF_ERROR));
-  int mark = 0;
-  ON_CALL(platform, vconf_set_int).WillByDefault([&](auto, int value) {
-    mark = value;
-    return VCONF_OK;
-  });
-  ON_CALL(platform, vconf_get_int).WillByDefault([&](auto, int *value) {
-    *value = mark;
-    return VCONF_OK;
-  });
+  keep_mark();
   off();
   EXPECT_EQ(mark, 0) << "there was none";
   EXPECT_EQ(on(1), 0);
@@ -338,6 +358,40 @@ TEST_F(RestoreModeTest, AWithdrawnRequestDoesNotSwitchTheModeOn) {
   EXPECT_TRUE(pkg_list_to_be_restored.empty());
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
   EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(RestoreModeTestWithMark, AModeThatWasWithdrawnIsNoDecisionOnTheBackup) {
+  EXPECT_EQ(on(0), 0);
+  EXPECT_TRUE(knows_own_backup(kSerial));
+  EXPECT_EQ(quarnd_cancel_own(":1.7"), 1U);
+  expect_unused();
+}
+
+TEST_F(RestoreModeTestWithMark, NorIsOneThatWasWithdrawnWhileTheSessionStarted) {
+  session.ready = false;
+  run_on_fiber([&] {
+    const std::uint64_t own = fiber_id(current_fiber());
+    session.meanwhile = [this, own] {
+      const GMainLoopPtr answer(new_wait_loop());
+      later([own] { EXPECT_TRUE(withdraw_waits(own)); });
+      run_nested_loop(answer.get());
+    };
+    EXPECT_EQ(on(0), 17);
+  });
+  run_main_context();
+  expect_unused();
+}
+
+TEST_F(RestoreModeTestWithMark, NorIsOneInWhosePlaceAnotherCame) {
+  EXPECT_EQ(on(0), 0);
+  EXPECT_EQ(on(1), 0);
+  off();
+  expect_unused();
+  mark = 0;
+  note_own_backup(kSerial);
+  EXPECT_EQ(on(0), 0);
+  EXPECT_EQ(on(0, "350000000000002"), 0);
+  expect_unused();
 }
 
 TEST_F(RestoreModeTest, AListThatRunsEmptyEndsTheMode) {

@@ -6,6 +6,7 @@
 #include <filesystem>
 
 #include "quarn_d_backup/list_bound.h"
+#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/request_cause.h"
 #include "restore_fixture.h"
@@ -18,6 +19,14 @@ class AppListTest : public RestoreTest {
  protected:
   using Answers = std::vector<Outside::Answer>;
   int ask(int client) { return get_app_list(client, make_record(9)); }
+  ~AppListTest() override { stop_wifi_monitor(); }
+  void connect_to_wifi() {
+    ON_CALL(platform, connection_get_type).WillByDefault([](auto, auto *type) {
+      *type = CONNECTION_TYPE_WIFI;
+      return 0;
+    });
+    EXPECT_EQ(start_wifi_monitor(), 1);
+  }
   static Answers answered(int err, const std::string &text) {
     return {{"get_app_list_cb", err, text, 9}};
   }
@@ -52,6 +61,39 @@ TEST_F(AppListTest, ADownloadErrorIsAnsweredWithOneAndNone) {
   answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT);
   EXPECT_EQ(outside.answers, answered(1, "none"));
   expect_error("__get_app_list_resp_cb failed...err_code[12]");
+}
+
+TEST_F(AppListTest, ADownloadThatWasAbortedWithOthersIsBegunAgain) {
+  connect_to_wifi();
+  ASSERT_EQ(ask(0), 0);
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_TRUE(outside.answers.empty());
+  EXPECT_FALSE(is_idle_status());
+  ASSERT_EQ(downloads.size(), 1U);
+  write_text(downloads[0].local, "[]");
+  answer();
+  EXPECT_EQ(outside.answers, answered(0, "[]"));
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(AppListTest, ADownloadThatIsAbortedWithoutEndIsGivenUp) {
+  connect_to_wifi();
+  ASSERT_EQ(ask(0), 0);
+  for (int times = 0; times < 9; ++times) {
+    EXPECT_TRUE(outside.answers.empty());
+    ASSERT_EQ(downloads.size(), 1U);
+    answer(BACKUP_TRANS_ERROR_CANCELLED);
+  }
+  EXPECT_EQ(outside.answers, answered(1, "none"));
+  EXPECT_TRUE(downloads.empty());
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(AppListTest, ADownloadThatWasAbortedForWantOfWifiIsNot) {
+  ASSERT_EQ(ask(0), 0);
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_EQ(outside.answers, answered(1, "none"));
+  EXPECT_TRUE(downloads.empty());
 }
 
 TEST_F(AppListTest, AMissingFileIsAnsweredWithOneAndNone) {
