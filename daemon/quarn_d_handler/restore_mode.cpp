@@ -107,7 +107,10 @@ int switch_on(int client, const std::string &serial_num, const char *pkg_list, R
   if (session && !superseded) start_monitor(client, serial_num, std::move(record));
   request_power_lock(false);
   if (withdrawn) {
-    if (!superseded) pkg_list_to_be_restored.clear();
+    if (!superseded) {
+      pkg_list_to_be_restored.clear();
+      await_no_archives();
+    }
     send_restore_stop(record.release(), QUARN_CANCELLED);
     return QUARN_CANCELLED;
   }

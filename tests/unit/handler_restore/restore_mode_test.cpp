@@ -336,6 +336,7 @@ TEST_F(RestoreModeTest, AWithdrawnRequestDoesNotSwitchTheModeOn) {
   EXPECT_EQ(reply, 17);
   EXPECT_EQ(cloud_restore_running, 0);
   EXPECT_TRUE(pkg_list_to_be_restored.empty());
+  EXPECT_TRUE(claimed_packages(kSerial).empty()) << "what is waited for no longer is not kept";
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
   EXPECT_TRUE(is_idle_status());
 }
