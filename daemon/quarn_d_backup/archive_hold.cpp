@@ -1,10 +1,12 @@
 #include "quarn_d_backup/archive_hold.h"
 
+#include <algorithm>
 #include <map>
 #include <mutex>
 #include <utility>
 
 #include "platform_package_manager.h"
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
@@ -127,15 +129,17 @@ void note_awaited_package_removed(const std::string &package) {
 }
 
 archive_claim claim_on_archive(const std::string &serial, const std::string &package) {
+  const archive_claim owed = owed_claim(serial, package);
   claims &all = all_claims();
   const std::lock_guard<std::mutex> lock(all.mutex);
-  return claim_of(all, serial, package);
+  return std::max(owed, claim_of(all, serial, package));
 }
 
 std::vector<std::string> claimed_packages(const std::string &serial) {
+  const std::vector<std::string> owed = owed_packages(serial);
+  std::set<std::string> packages(owed.begin(), owed.end());
   claims &all = all_claims();
   const std::lock_guard<std::mutex> lock(all.mutex);
-  std::set<std::string> packages;
   if (serial == all.awaited_serial) {
     for (const auto &awaited : all.awaited) packages.insert(awaited.first);
   }
@@ -154,6 +158,7 @@ bool packages_kept_by_backup(std::set<std::string> *kept) {
   CString serial;
   get_device_info(out(model), out(serial));
   if (!serial || !walk_packages(kept, false)) return false;
+  forget_owed_of_removed_packages();
   for (const std::string &package : claimed_packages(serial.get())) kept->insert(package);
   return true;
 }

@@ -3,6 +3,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_backup/package_trouble.h"
 #include "quarn_d_backup/run_notes.h"
@@ -170,10 +171,31 @@ void begin_package(backup_context *ctx, const package_values &values) {
   ctx->cur_crc = 0;
 }
 
+/** Nothing is owed of what the cloud does not list. */
+void settle_owed_archive(backup_context *ctx) {
+  const std::string &serial = ctx->serial_number;
+  if (look_for_owed_archive(serial, ctx->cur_pkg_id, ctx->cur_root_path) == archive_claim::none) {
+    return;
+  }
+  bool this_version = false;
+  bool others = false;
+  for (const pkg_information &previous : ctx->previous_pkg_list) {
+    if (previous.pkg_id != ctx->cur_pkg_id || previous.crc == 0) continue;
+    (previous.version == ctx->cur_version ? this_version : others) = true;
+  }
+  if (this_version && owed_claim(serial, ctx->cur_pkg_id) == archive_claim::whole) return;
+  if (others) {
+    owe_other_versions(serial, ctx->cur_pkg_id, ctx->cur_root_path);
+  } else {
+    forget_owed_archive(serial, ctx->cur_pkg_id, ctx->cur_root_path);
+  }
+}
+
 /** A package whose archive a restore is still to have is not backed up over it. */
 bool leave_to_restore(backup_context *ctx) {
-  if (ctx->for_pellix ||
-      claim_on_archive(ctx->serial_number, ctx->cur_pkg_id) != archive_claim::whole) {
+  if (ctx->for_pellix) return false;
+  settle_owed_archive(ctx);
+  if (claim_on_archive(ctx->serial_number, ctx->cur_pkg_id) != archive_claim::whole) {
     return false;
   }
   LOGI("backup of (%s) waits for its restore", ctx->cur_pkg_id.c_str());
@@ -288,6 +310,7 @@ int make_backup_items(backup_context *ctx) {
   forget_single_uploads();
   if (!create_app_list_info(ctx)) return QUARN_FAILED;
   look_for_unknown_backup(ctx);
+  forget_owed_of_removed_packages();
   const int ret = package_manager_foreach_package_info(foreach_package_info_callback, ctx);
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_manager_foreach_package_info() failed %d", ret);

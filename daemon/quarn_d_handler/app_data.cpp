@@ -1,6 +1,7 @@
 #include <memory>
 #include <utility>
 
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
@@ -188,6 +189,10 @@ int back_up(const std::string &pkg_id, package_info_h info, void *record) {
   result = visit_applications(info, _package_cb_for_backup, ctx.get());
   if (ctx->upload_remain == 0 && waits_are_ended()) return QUARN_CANCELLED;
   const int uploaded = wait_for_upload(ctx.get());
+  if (result == QUARN_OK && uploaded == QUARN_OK) {
+    // somebody has decided that the data as it is now is to be in the cloud
+    forget_owed_archive(facts.serial, pkg_id, facts.root);
+  }
   return result != QUARN_OK ? result : uploaded;
 }
 

@@ -1,6 +1,7 @@
 #include <algorithm>
 #include <memory>
 
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -59,6 +60,19 @@ void skip(const char *package, int reason) {
   report_restore_end(package, restore_outcome::skipped, reason);
 }
 
+/** Until it is restored, no backup puts the new package's data in the archive's place. */
+void note_owed(const char *package, const std::string &root) {
+  constexpr int kCloudClient = 0;
+  if (current_restore_client != kCloudClient) return;
+  note_owed_archive(serial_num_user_select, package, root);
+}
+
+/** Nor is anything to be restored of a package that takes no part in backup. */
+void skip_for_good(const char *package, const std::string &root, int reason) {
+  forget_owed_archive(serial_num_user_select, package, root);
+  skip(package, reason);
+}
+
 /** Whether a new package can be restored; the reason why not is logged where there is one. */
 bool is_restorable(package_info_h info, const char *package, std::string *root) {
   int result = PACKAGE_MANAGER_ERROR_NONE;
@@ -73,6 +87,7 @@ bool is_restorable(package_info_h info, const char *package, std::string *root) 
     skip(package, QUARN_FAILED);
     return false;
   }
+  note_owed(package, *root);
   if (get_dir_available_size(root->c_str()) < kMinimumFreeSpace) {
     LOGE("fail : available space is too small");
     skip(package, QUARN_SKIPPED);
@@ -85,7 +100,7 @@ bool is_restorable(package_info_h info, const char *package, std::string *root) 
     skip(package, QUARN_FAILED);
     return false;
   }
-  if (preload) skip(package, QUARN_PRELOADED);
+  if (preload) skip_for_good(package, *root, QUARN_PRELOADED);
   return !preload;
 }
 
@@ -116,7 +131,7 @@ void restore_new_package(package_info_h info, const char *package) {
     LOGI("backup enabled for (%s)", package);
   } else {
     LOGI("backup disabled for (%s)", package);
-    skip(package, QUARN_DISABLED);
+    skip_for_good(package, ctx->root, QUARN_DISABLED);
   }
   result = package_info_foreach_app_from_package(info, PACKAGE_INFO_ALLAPP, installed_app_info_cb,
                                                  ctx.get());
@@ -149,6 +164,7 @@ void package_event_cb(const char * /*type*/, const char *package,
   // No backup comes in between: it would put the new package's data in the archive's place.
   const archive_hold archive(serial_num_user_select, package);
   if (!package_to_be_restored(package) || already_installed_package(package)) return;
+  note_owed(package, "");
   PackageInfoPtr info;
   if (package_manager_get_package_info(package, out(info)) != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_manager_get_package_info() failed");

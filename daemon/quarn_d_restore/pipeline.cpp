@@ -2,6 +2,7 @@
 #include <list>
 #include <memory>
 
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
@@ -138,6 +139,7 @@ void start_next(const std::string &pkgid);
 void finish_restore(pkg_restore_context *ctx, restore_outcome outcome, std::uint64_t size = 0) {
   const std::string pkgid = ctx->pkgid;
   const bool monitored = !ctx->wait_for_result;
+  if (outcome == restore_outcome::restored) forget_owed_archive(ctx->serial, pkgid, ctx->root);
   report_restore_end(pkgid, outcome, ctx->result, size);
   check_package_restore_complete(ctx);
   if (monitored) count_outstanding_restore(-1);
@@ -184,6 +186,9 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
     LOGE("download app data of (%s) failed...err_code[%d]", ctx->pkgid.c_str(), error);
     note_request_end(cause_of_transfer(error, request->local_path));
     ctx->result = QUARN_TRANSFER_FAILED;
+    if (error == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) {
+      owe_other_versions(ctx->serial, ctx->pkgid, ctx->root);
+    }
   } else if (ctx->abandoned) {
     LOGI("restore of (%s) was cancelled", ctx->pkgid.c_str());
     ctx->result = QUARN_CANCELLED;

@@ -39,7 +39,8 @@ class WorkingFiles {
         download_(folder_ + "/" + pkg_id + "_download.zip"),
         table_(folder_ + "/" + pkg_id + ".perm"),
         snapshot_(folder_ + "/quarn_tmp_rst_dir"),
-        upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip") {}
+        upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip"),
+        owed_(snapshot_ + ".owed") {}
 
   const std::string &folder() const { return folder_; } /**< where all of them lie */
   const std::string &upload() const { return upload_; }
@@ -49,6 +50,8 @@ class WorkingFiles {
   /** The table on its way into an archive or out of one; the application's own may have the name.
    */
   const std::string &table() const { return table_; }
+  /** Says that a restore has not brought the data back yet; outlives the process. */
+  const std::string &owed() const { return owed_; }
 
   /**
    * True for both archives, for every path that begins with the snapshot's,
@@ -66,6 +69,7 @@ class WorkingFiles {
   std::string table_;
   std::string snapshot_;
   std::string upload_aside_;
+  std::string owed_;
 };
 
 /** From now on @p path is this process's own: its sweep leaves it alone. */

@@ -129,6 +129,11 @@ class Device:
     def log(self):
         return read_text(os.path.join(self.path, "log/quarnd.log"))
 
+    def log_of_daemons(self):
+        """Without what the device's start recovers, which is no daemon."""
+        return "".join(line for line in self.log().splitlines(True)
+                       if "quarn_recover(" not in line)
+
     def logs(self):
         folder = os.path.join(self.path, "log")
         return "".join(read_text(os.path.join(folder, name)) for name in os.listdir(folder))

@@ -106,7 +106,7 @@ class Process(BusTest):
         self.assertEqual(self.finished(self.run_daemon()), 0)
         self.assertIsNone(self.client.owner())
         self.assertEqual(owners, [])
-        self.assertEqual(self.lines()[0], "Quarn Daemon start")
+        self.assert_lines_in_order(["Quarn Daemon start", "no signed-in. Daemon stop"])
         self.assertEqual(self.lines()[-1], "no signed-in. Daemon stop")
 
     def test_set_activation_zero_quits_when_idle_and_replies_first(self):

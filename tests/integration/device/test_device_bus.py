@@ -68,7 +68,7 @@ class Bus(TestCase):
                                         INTERFACE + ".Status", path=STATUS))
         result = self.quarnctl_as(STRANGER, "backup")
         self.assertEqual(result.returncode, 77, result.stdout + result.stderr)
-        self.assertEqual(self.device.log(), "")
+        self.assertEqual(self.device.log_of_daemons(), "")
 
     def test_the_client_user_may_call_nothing_else_of_the_daemon(self):
         self.assert_denied(self.call_as(CLIENT_USER, "org.freedesktop.DBus.Peer.Ping"))

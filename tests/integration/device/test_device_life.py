@@ -200,7 +200,7 @@ class Daemon(TestCase):
         device.start()
         result = device.call("fire", "78", check=False)
         self.assertEqual((result.returncode, result.stderr), (1, "quarn-device: no alarm 78\n"))
-        self.assertEqual(device.log(), "")
+        self.assertEqual(device.log_of_daemons(), "")
 
     def test_log_shows_and_follows(self):
         device = self.new_device()
@@ -225,13 +225,13 @@ class Daemon(TestCase):
         """Neither from the file nor from what shows it, even a file of earlier days."""
         name = "\x1b]0;owned\x07\x1b[2J\u009b31m\x7f\n"
         device = self.new_device()
+        log = os.path.join(device.path, "log/quarnd.log")
+        with open(log, "ab") as file:
+            file.write(b"an old line \x1b[5m\n")
         device.start()
         device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {
             "data/" + name: b"x", "data/" + os.fsdecode(b"\x9b31m"): ("->", "anywhere"),
             "data/link" + name: ("->", "to" + name)}))
-        log = os.path.join(device.path, "log/quarnd.log")
-        with open(log, "ab") as file:
-            file.write(b"an old line \x1b[5m\n")
         follower = subprocess.Popen([device.tool, "log", device.path, "--follow"],
                                     stdout=subprocess.PIPE, stderr=subprocess.DEVNULL)
         self.addCleanup(follower.wait)

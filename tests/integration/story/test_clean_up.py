@@ -127,6 +127,67 @@ class CleanUp(TestCase):
         self.nightly()
         self.assert_removed()
 
+    def content(self, package):
+        with open(self.device.app_path(package, "data/file"), "rb") as file:
+            return file.read()
+
+    def fail_to_restore(self):
+        """The package is installed where there is no Wi-Fi, so its restore is not even begun."""
+        client = self.restore_on(SERIAL, [GONE])
+        self.device.set("network", "none")
+        self.install(self.device, GONE, b"as it comes from the shop")
+        client.until(lambda: self.stops(client), "the mode ends")
+        self.assertEqual(self.content(GONE), b"as it comes from the shop")
+        self.device.set("network", "wifi")
+        wait_until(lambda: json.loads(self.device.quarnctl("status", "--json").stdout)
+                   ["wifi_connected"], "the daemon knows of it")
+
+    def test_what_a_failed_restore_did_not_bring_is_not_backed_up_over(self):
+        before = self.entries()[GONE]
+        self.fail_to_restore()
+        for _ in range(2):
+            result = self.backup("--json")
+            outcome = [one for one in json.loads(result.stdout)["packages"]
+                       if one["package"] == GONE]
+            self.assertEqual([(one["outcome"], one["reason"]) for one in outcome],
+                             [("skipped", "restoring")])
+            self.device.quarnctl("deactivate")
+            self.device.wait_for_daemon_end()
+            self.nightly()
+        self.assertEqual(self.entries()[GONE], before)
+        self.device.quarnctl("app", "restore", GONE)
+        self.assertEqual(self.content(GONE), b"of " + GONE.encode())
+        self.assertEqual(os.listdir(self.device.app_path(GONE, "shared/data")), [])
+        with open(self.device.app_path(GONE, "data/file"), "wb") as file:
+            file.write(b"newer")
+        self.backup()
+        self.assertNotEqual(self.entries()[GONE]["crc"], before["crc"])
+
+    def test_a_restore_whose_daemon_is_killed_is_not_backed_up_over(self):
+        self.restore_on(SERIAL, [GONE])
+        # nobody listens there, so the download is tried again for a while
+        self.device.call("set", "cloud", "webdav+http://127.0.0.1:9/nowhere", "--user", "ada",
+                         input="x\n")
+        self.install(self.device, GONE, b"as it comes from the shop")
+        self.device.wait_for_log("request download for (%s)" % GONE)
+        os.kill(self.device.daemon_pid(), signal.SIGKILL)
+        self.device.wait_for_daemon_end()
+        self.device.set("cloud", "file://" + self.device.cloud)
+        self.backup()
+        self.assert_kept()
+        self.device.quarnctl("app", "restore", GONE)
+        self.assertEqual(self.content(GONE), b"of " + GONE.encode())
+
+    def test_backing_up_just_the_package_replaces_what_a_failed_restore_left(self):
+        self.fail_to_restore()
+        self.device.quarnctl("app", "backup", GONE)
+        self.backup()
+        self.device.remove(GONE)
+        client = self.restore_on(SERIAL, [GONE])
+        self.install(self.device, GONE, b"once more from the shop")
+        client.until(lambda: self.stops(client), "the mode ends")
+        self.assertEqual(self.content(GONE), b"as it comes from the shop")
+
     def test_the_mode_for_another_device_keeps_nothing_of_this_one(self):
         self.restore_on(OTHER, [GONE])
         self.backup("--yes")

@@ -3,6 +3,7 @@
 #include <memory>
 
 #include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/own_backup.h"
 #include "run_fixture.h"
 
@@ -120,6 +121,67 @@ TEST_F(Claims, APackageThatHasJustBeenInstalledIsNotBackedUpOverTheArchiveItWait
   }
   automatic();
   EXPECT_EQ(cloud_.count_requests("upload " + fresh.object()), 2) << "now it is a package as any";
+}
+
+TEST_F(Claims, APackageWhoseRestoreFailedIsNotBackedUpOverItsArchive) {
+  const FakePackage &fresh = install("org.kept", "1.5", "as it comes from the shop");
+  note_owed_archive(kSerial, "org.kept", fresh.root);
+  for (int run = 0; run < 2; ++run) {
+    manual();
+    expect_kept();
+    automatic();
+    expect_kept();
+  }
+  EXPECT_EQ(step_of("org.kept").outcome, backup_outcome::restoring);
+  forget_owed_archive(kSerial, "org.kept", fresh.root);
+  automatic();
+  EXPECT_NE(cloud_.objects[kept_], content_) << "now it is a package as any";
+}
+
+TEST_F(Claims, WhatIsOwedIsKnownToTheNextDaemonAndGoesWithThePackage) {
+  const FakePackage &fresh = install("org.kept", "1.5", "as it comes from the shop");
+  const std::string note = fresh.root + "/shared/data/quarn_tmp_rst_dir.owed";
+  for (const std::string text : {"", "w350000000000001"}) {
+    write_text(note, text);
+    manual();
+    expect_kept();
+  }
+  remove("org.kept");
+  manual();
+  expect_gone();
+}
+
+TEST_F(Claims, WhatIsOwedToAnotherDevicesBackupIsNothingToThisOne) {
+  const FakePackage &fresh = install("org.kept", "1.5", "as it comes from the shop");
+  note_owed_archive("350000000000002", "org.kept", fresh.root);
+  manual();
+  EXPECT_NE(cloud_.objects[kept_], content_);
+}
+
+TEST_F(Claims, WhereAnotherVersionCameTheOneThatIsOwedStaysBesideIt) {
+  const FakePackage &fresh = install("org.kept", "2.0", "newer");
+  note_owed_archive(kSerial, "org.kept", fresh.root);
+  for (const char *content : {"newer", "newer still"}) {
+    write_text(fresh.root + "/data/file.txt", content);
+    manual();
+    EXPECT_EQ(step_of("org.kept").outcome, backup_outcome::uploaded);
+    expect_kept();
+  }
+  forget_owed_archive(kSerial, "org.kept", fresh.root);
+  write_text(fresh.root + "/data/file.txt", "the newest");
+  manual();
+  EXPECT_FALSE(in_cloud(kept_));
+}
+
+TEST_F(Claims, NothingIsOwedOfWhatTheCloudDoesNotList) {
+  const FakePackage &fresh = install("org.fresh");
+  note_owed_archive(kSerial, "org.fresh", fresh.root);
+  automatic();
+  EXPECT_TRUE(in_cloud(fresh.object()));
+  write_text(fresh.root + "/data/file.txt", "later");
+  steps().clear();
+  automatic();
+  EXPECT_EQ(step_of("org.fresh").outcome, backup_outcome::uploaded);
 }
 
 TEST_F(Claims, TheVersionThatIsWaitedForSurvivesTheUploadOfAnother) {

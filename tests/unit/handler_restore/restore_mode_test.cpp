@@ -275,7 +275,7 @@ TEST_F(RestoreModeTest, WhatADeadDaemonLeftIsPutBack) {
   });
   for (const int client : {0, 1}) {
     ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
-    file("data/settings.ini", "half of a restore");
+    unpacked_file("data/settings.ini", "half of a restore");
     EXPECT_EQ(on(client), 0);
     EXPECT_EQ(tree_of(root), before);
   }
@@ -356,6 +356,7 @@ TEST_F(RestoreModeTest, AWithdrawnRequestDoesNotSwitchTheModeOn) {
   EXPECT_EQ(reply, 17);
   EXPECT_EQ(cloud_restore_running, 0);
   EXPECT_TRUE(pkg_list_to_be_restored.empty());
+  EXPECT_TRUE(claimed_packages(kSerial).empty()) << "what is waited for no longer is not kept";
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
   EXPECT_TRUE(is_idle_status());
 }

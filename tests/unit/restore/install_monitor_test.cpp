@@ -5,6 +5,7 @@
 
 #include <cstring>
 
+#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "restore_fixture.h"
@@ -57,6 +58,9 @@ class MonitorTest : public RestoreTest {
     free_space = 0;
     timer_delays.clear();
     ends.clear();
+    for (const std::string &package : owed_packages(kSerial)) {
+      forget_owed_archive(kSerial, package, "");
+    }
     set_restore_disable([] {
       ++disabled;
       return 0;
@@ -168,7 +172,21 @@ TEST_F(MonitorTest, NoBackupTouchesTheArchiveFromTheEventToTheRestoresEnd) {
   await_no_archives();
   EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::whole) << "the mode may end before it";
   answer(BACKUP_TRANS_ERROR_NETWORK);
+  forget_owed_archive(kSerial, kPkg, root);
   EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::none);
+}
+
+TEST_F(MonitorTest, WhatARestoreOnInstallationDidNotBringIsOwed) {
+  serial_num_user_select = kSerial;
+  const auto owed = [this] { return look_for_owed_archive(kSerial, kPkg, root); };
+  install();
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::whole);
+  EXPECT_TRUE(exists(root + "/shared/data/quarn_tmp_rst_dir.owed")) << "for the next daemon";
+  EXPECT_EQ(claimed_packages(kSerial), std::vector<std::string>{kPkg});
+  forget_owed_archive(kSerial, kPkg, root);
+  EXPECT_FALSE(exists(root + "/shared/data/quarn_tmp_rst_dir.owed"));
+  EXPECT_EQ(owed(), archive_claim::none);
 }
 
 TEST_F(MonitorTest, AnInstallThatIsNotRestoredClaimsNothingAnyMore) {
