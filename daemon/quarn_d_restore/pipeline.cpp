@@ -47,8 +47,25 @@ std::uint64_t archive_size(const std::string &path) {
 }
 
 void remove_download(const std::string &path) {
-  if (file_exist(path.c_str())) delete_file(path.c_str());
+  struct stat status = {};
+  if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
+  if (S_ISREG(status.st_mode)) delete_file(path.c_str());
 }
+
+/** The application's own file of the table's name is not in the way while this lives. */
+class OwnTableAside {
+ public:
+  explicit OwnTableAside(const restore_files &files)
+      : files_(files), done_(set_own_table_aside(files)) {}
+  ~OwnTableAside() { put_own_table_back(files_); }
+  OwnTableAside(const OwnTableAside &) = delete;
+  OwnTableAside &operator=(const OwnTableAside &) = delete;
+  explicit operator bool() const { return done_; }
+
+ private:
+  const restore_files &files_;
+  const bool done_;
+};
 
 gboolean terminate_when_idle(gpointer /*data*/) {
   // The client that waits for the end hears of it first.
@@ -91,7 +108,9 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
     ctx->result = QUARN_REFUSED;
     return restore_outcome::incomplete;
   }
-  int result = temp_backup_initial_app_data(pkgid, root);
+  const restore_files files(pkgid, root);
+  const OwnTableAside own_table(files);
+  int result = own_table ? temp_backup_initial_app_data(pkgid, root) : QUARN_REFUSED;
   if (result != QUARN_OK) {
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
     ctx->result = result;
@@ -239,7 +258,12 @@ int restore_from_cloud(pkg_restore_context *ctx) {
   auto request = std::make_unique<download_request>();
   request->cloud_path =
       "/" + ctx->serial + "/" + ctx->pkgid + "/" + ctx->version + "/" + ctx->pkgid + ".zip";
-  request->local_path = restore_files(ctx->pkgid, ctx->root).download;
+  request->local_path = WorkingFiles(ctx->pkgid, ctx->root).download_place();
+  if (request->local_path.empty()) {
+    LOGE("there is no place for the archive of (%s)", ctx->pkgid.c_str());
+    ctx->result = QUARN_LIST_CHECK_FAILED;
+    return QUARN_FAILED;
+  }
   request->ctx = ctx;
   ctx->archive = archive_hold(ctx->serial, ctx->pkgid);
   LOGI("request download for (%s)", ctx->pkgid.c_str());
@@ -277,6 +301,13 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
   const std::lock_guard<std::mutex> lock(package_data_mutex);
   if (recover_package_data(pkgid, ctx.root.c_str()) == recovery_result::kept) {
     // What is still to be put back would go over what is unpacked now.
+    LOGE("fail to restore for (%s)", pkgid);
+    done.unpacked = QUARN_REFUSED;
+    return done;
+  }
+  const restore_files files(ctx.pkgid, ctx.root);
+  const OwnTableAside own_table(files);
+  if (!own_table) {
     LOGE("fail to restore for (%s)", pkgid);
     done.unpacked = QUARN_REFUSED;
     return done;

@@ -45,10 +45,7 @@ void recover_all_of_package(const char *pkgid, const char *root) {
   show_hidden_icon(pkgid, root);
 }
 
-}  // namespace
-
-recovery_result recover_package_data(const char *pkgid, const char *root) {
-  const restore_files files(pkgid, root);
+recovery_result recover_snapshot(const char *pkgid, const char *root, const restore_files &files) {
   std::string written;
   switch (state_of_snapshot(files)) {
     case snapshot_state::none:
@@ -71,6 +68,15 @@ recovery_result recover_package_data(const char *pkgid, const char *root) {
   LOGI("restore of (%s) was interrupted, so its data will be put back", pkgid);
   return put_snapshot_back(pkgid, root) == rollback_result::whole ? recovery_result::put_back
                                                                   : recovery_result::kept;
+}
+
+}  // namespace
+
+recovery_result recover_package_data(const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  const recovery_result result = recover_snapshot(pkgid, root, files);
+  put_own_table_back(files);
+  return result;
 }
 
 bool recover_interrupted_restore(const char *pkgid, const char *root) {

@@ -39,13 +39,22 @@ class WorkingFiles {
         download_(folder_ + "/" + pkg_id + "_download.zip"),
         table_(folder_ + "/" + pkg_id + ".perm"),
         snapshot_(folder_ + "/quarn_tmp_rst_dir"),
-        upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip") {}
+        upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip"),
+        download_aside_(snapshot_ + "." + pkg_id + "_download.zip") {}
 
   const std::string &folder() const { return folder_; } /**< where all of them lie */
   const std::string &upload() const { return upload_; }
   /** Where the archive is staged whose name an application's own file has. */
   const std::string &upload_aside() const { return upload_aside_; }
   const std::string &download() const { return download_; }
+  /** Where an archive is downloaded to when the application's own file has that name. */
+  const std::string &download_aside() const { return download_aside_; }
+  /** The one of both that is to be used; empty when the application has both. */
+  std::string download_place() const;
+  /** Everything of ours that is not an archive begins with this, the snapshot as a rule. */
+  const std::string &snapshot() const { return snapshot_; }
+  /** The snapshot's place: beside the usual one where that is the application's own. */
+  std::string snapshot_place() const;
   /** The table on its way into an archive or out of one; the application's own may have the name.
    */
   const std::string &table() const { return table_; }
@@ -66,6 +75,7 @@ class WorkingFiles {
   std::string table_;
   std::string snapshot_;
   std::string upload_aside_;
+  std::string download_aside_;
 };
 
 /** From now on @p path is this process's own: its sweep leaves it alone. */

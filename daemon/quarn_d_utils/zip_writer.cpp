@@ -18,7 +18,6 @@ std::mutex package_data_mutex;
 namespace {
 
 constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
-constexpr char kSnapshotDir[] = "/shared/data/quarn_tmp_rst_dir";
 constexpr char kTableDir[] = "/shared/data/";
 constexpr char kTableSuffix[] = ".perm";
 constexpr int kLevel = 1;
@@ -514,7 +513,7 @@ UniqueFd create_archive(const char *zip_path) {
  * lies in the data directories is part of the old and part of the new.
  */
 bool is_half_restored(const char *pkg_id, const char *root) {
-  const std::string snapshot = std::string(root) + kSnapshotDir;
+  const std::string snapshot = WorkingFiles(pkg_id, root).snapshot_place();
   const std::string table = snapshot + kTableDir + pkg_id + kTableSuffix;
   struct stat status = {};
   // An application can make neither of root's.

@@ -494,7 +494,7 @@ TEST_F(AppDataTest, WhatADeadDaemonLeftIsPutBackWhenTheRestoreIsRequested) {
   make_old_data();
   const Tree before = tree_of(root);
   ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
-  file("data/settings.ini", "half of a restore");
+  unpacked_file("data/settings.ini", "half of a restore");
   opted_out = true;
   EXPECT_EQ(restore(), 0);
   EXPECT_EQ(tree_of(root), before);

@@ -255,7 +255,7 @@ TEST_F(RestoreModeTest, WhatADeadDaemonLeftIsPutBack) {
   });
   for (const int client : {0, 1}) {
     ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
-    file("data/settings.ini", "half of a restore");
+    unpacked_file("data/settings.ini", "half of a restore");
     EXPECT_EQ(on(client), 0);
     EXPECT_EQ(tree_of(root), before);
   }
