@@ -1,6 +1,7 @@
 #include <algorithm>
 #include <list>
 #include <memory>
+#include <optional>
 
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/hidden_icon.h"
@@ -9,6 +10,7 @@
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -22,6 +24,8 @@ namespace {
 constexpr int kCloudClient = 0;
 /** How often a download is begun again that was aborted for somebody else's sake. */
 constexpr int kMaxTimesAborted = 8;
+/** Milliseconds between two looks at whether a package is packed still. */
+constexpr guint kPackedCheckMs = 50;
 
 /** One download, from its request to its answer. */
 struct download_request {
@@ -95,12 +99,11 @@ restore_outcome roll_back(pkg_restore_context *ctx, int result) {
   return restore_outcome::incomplete;
 }
 
-/** Replace the package's data by the archive's, or leave it as it is. */
+/** Replace the package's data by the archive's, or leave it as it is. The caller holds its lock. */
 restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive,
                                      std::uint64_t size) {
   const char *pkgid = ctx->pkgid.c_str();
   const char *root = ctx->root.c_str();
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
   report_restore_step(ctx->pkgid, restore_stage::snapshot, size);
   if (recover_package_data(pkgid, root) == recovery_result::kept) {
     // A further snapshot would take the place of what is still to be put back.
@@ -166,6 +169,7 @@ void finish_restore(pkg_restore_context *ctx, restore_outcome outcome, std::uint
 }
 
 void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data, char *unused);
+void finish_download(RequestPtr request, backup_trans_error_code error);
 
 /** Hand the request to the transport, which has it then. */
 int request_download(RequestPtr &request) {
@@ -195,7 +199,23 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
   g_assert(user_data != nullptr);
   RequestPtr request(static_cast<download_request *>(user_data));
   if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_download_again(request)) return;
+  finish_download(std::move(request), error);
+}
+
+gboolean finish_delayed_download(gpointer data) {
+  finish_download(RequestPtr(static_cast<download_request *>(data)), BACKUP_TRANS_ERROR_NONE);
+  return G_SOURCE_REMOVE;
+}
+
+void finish_download(RequestPtr request, backup_trans_error_code error) {
   pkg_restore_context *ctx = request->ctx;
+  const bool wanted = error == BACKUP_TRANS_ERROR_NONE && !ctx->abandoned;
+  std::optional<PackageDataLock> lock;
+  if (wanted && !lock.emplace(ctx->pkgid, PackageUse::kChangeUnlessPacked)) {
+    // An export of the package may last, and nobody would be served meanwhile.
+    g_timeout_add(kPackedCheckMs, finish_delayed_download, request.release());
+    return;
+  }
   running.erase(std::find(running.begin(), running.end(), ctx->pkgid));
   restore_outcome outcome = restore_outcome::failed;
   std::uint64_t size = 0;
@@ -211,6 +231,7 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
     size = archive_size(request->local_path);
     outcome = restore_from_archive(ctx, request->local_path, size);
   }
+  lock.reset();
   remove_download(request->local_path);
   finish_restore(ctx, outcome, size);
 }
@@ -298,7 +319,7 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
     return done;
   }
   const std::string archive = companion_archive(ctx);
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  const PackageDataLock lock(ctx.pkgid, PackageUse::kChange);
   if (recover_package_data(pkgid, ctx.root.c_str()) == recovery_result::kept) {
     // What is still to be put back would go over what is unpacked now.
     LOGE("fail to restore for (%s)", pkgid);

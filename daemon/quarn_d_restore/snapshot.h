@@ -5,7 +5,7 @@
  * A snapshot is incomplete until its table has its name, then complete: the
  * data may be half replaced. It is released by the table's removal, or told
  * when the application has gone on with its data: then it is only kept. Main
- * thread or the backup worker; the caller holds package_data_mutex.
+ * thread or the backup worker; the caller holds the package's lock.
  */
 #ifndef QUARN_D_RESTORE_SNAPSHOT_H
 #define QUARN_D_RESTORE_SNAPSHOT_H

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "backup_transport.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
@@ -97,7 +98,7 @@ void claim_working_file(const std::string &path) {
 
 void sweep_working_files(const std::string &pkg_id, const std::string &root) {
   const WorkingFiles files(pkg_id, root);
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  const PackageDataLock lock(pkg_id, PackageUse::kChange);
   sweep_file(files.upload());
   sweep_file(files.upload_aside());
   sweep_file(files.download());

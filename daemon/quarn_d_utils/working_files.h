@@ -85,7 +85,7 @@ void claim_working_file(const std::string &path);
  * Remove what an ended process has left of a package: archives in transit, a
  * table, parts of downloads. What the application owns stays, whatever its
  * name. No clock is asked: what this process uses it has claimed, and a
- * transfer that lives holds a lock on its file. Takes package_data_mutex.
+ * transfer that lives holds a lock on its file. Takes the PackageDataLock.
  */
 void sweep_working_files(const std::string &pkg_id, const std::string &root);
 

@@ -7,13 +7,12 @@
 
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
-
-std::mutex package_data_mutex;
 
 namespace {
 
@@ -602,7 +601,7 @@ void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table
 void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
                    const archive_bounds &bounds, archive_excess *excess,
                    const std::atomic<bool> *stop) {
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  const PackageDataLock lock(pkg_id, PackageUse::kPack);
   if (!may_be_packed(pkg_id, root)) {
     *error = QUARN_REFUSED;
     return;

@@ -2,15 +2,18 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <csignal>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <thread>
 
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package_lock.h"
 #include "restore_fixture.h"
 
 using ::testing::_;
@@ -348,17 +351,67 @@ TEST_F(PipelineTest, AnArchiveIsNeverPackedFromAMixture) {
   ASSERT_EQ(restore(ctx.get()), 0);
   make_archive(download(), new_data);
   bool held = false;
-  // from another thread: this one may hold it itself
+  std::thread packing;
+  std::atomic<bool> packed{false};
+  int error = 0;
   const AtStep step("unpacked", [&] {
-    std::thread([&] {
-      held = !package_data_mutex.try_lock();
-      if (!held) package_data_mutex.unlock();
-    }).join();
+    packing = std::thread([&] {
+      make_zip_data(kPkg, root.c_str(), (base + "/packed.zip").c_str(), &error);
+      packed = true;
+    });
+    // another package is not in its way
+    { const PackageDataLock other("org.example.other", PackageUse::kPack); }
+    held = !packed;
   });
   answer();
+  packing.join();
   EXPECT_TRUE(held);
-  EXPECT_TRUE(package_data_mutex.try_lock());
-  package_data_mutex.unlock();
+  EXPECT_EQ(error, 0) << "not refused as half restored";
+  EXPECT_EQ(ctx->result, 0);
+}
+
+TEST_F(PipelineTest, TheMainLoopGoesOnWhileThePackageIsPacked) {
+  make_old_data();
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  std::promise<void> locked;
+  std::promise<void> go;
+  std::thread packing([&] {
+    const PackageDataLock lock(kPkg, PackageUse::kPack);
+    locked.set_value();
+    go.get_future().wait();
+  });
+  locked.get_future().wait();
+  answer();  // returns
+  EXPECT_EQ(ctx->pending, 1);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "old settings");
+  EXPECT_FALSE(is_idle_status());
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str())) << "nor does this wait";
+  auto second = waiting_context();
+  ASSERT_EQ(restore(second.get()), 0);
+  EXPECT_TRUE(downloads.empty()) << "the first uses the files still";
+  go.set_value();
+  packing.join();
+  while (ctx->pending != 0) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(PipelineTest, ARestoreThatIsAbandonedWhileItsPackageIsPackedChangesNothing) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  auto lock = std::make_unique<PackageDataLock>(kPkg, PackageUse::kPack);
+  answer();
+  ctx.release()->abandoned = true;
+  while (!is_idle_status()) g_main_context_iteration(nullptr, TRUE);
+  lock.reset();
+  EXPECT_EQ(tree_of(root), before);
 }
 
 TEST_F(PipelineTest, WhatADeadDaemonLeftIsPutBackBeforeThePackageIsRestoredAgain) {
