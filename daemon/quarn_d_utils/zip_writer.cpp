@@ -503,7 +503,11 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
 
 UniqueFd create_archive(const char *zip_path) {
   claim_working_file(zip_path);
-  if (file_exist(zip_path)) delete_file(zip_path);
+  struct stat status {};
+  // What the application has there is not made way for.
+  if (safe_lstat(zip_path, &status) == 0 && is_own_file(status) && S_ISREG(status.st_mode)) {
+    delete_file(zip_path);
+  }
   return safe_open(zip_path, O_RDWR | O_CREAT | O_EXCL, kArchiveMode);
 }
 
