@@ -8,6 +8,7 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -213,6 +214,23 @@ int wait_for_restore(std::unique_ptr<pkg_restore_context> ctx) {
   return ctx->result;
 }
 
+gboolean end_wait(gpointer loop) {
+  g_main_loop_quit(static_cast<GMainLoop *>(loop));
+  return G_SOURCE_REMOVE;
+}
+
+/** Leave the main loop to others until nobody packs the package. */
+void wait_while_packed(const std::string &pkg_id) {
+  constexpr guint kCheckMs = 50;
+  while (package_is_packed(pkg_id) && !waits_are_ended()) {
+    const GMainLoopPtr loop(new_wait_loop());
+    g_timeout_add_full(
+        G_PRIORITY_DEFAULT, kCheckMs, end_wait, g_main_loop_ref(loop.get()),
+        [](gpointer waited) { g_main_loop_unref(static_cast<GMainLoop *>(waited)); });
+    run_nested_loop(loop.get());
+  }
+}
+
 int restore(const std::string &pkg_id, package_info_h info, void *record) {
   package_facts facts;
   int result = refuse_preloaded(info);
@@ -234,6 +252,9 @@ int restore(const std::string &pkg_id, package_info_h info, void *record) {
   result = visit_applications(info, _check_restore_enabled, ctx.get());
   if (result == QUARN_OK) result = refuse_disabled(pkg_id, ctx->backup_enabled);
   if (result != QUARN_OK) return result;
+  // The companion's archive is unpacked at once, where nothing can wait any more.
+  if (current_restore_client != 0) wait_while_packed(pkg_id);
+  if (waits_are_ended()) return QUARN_CANCELLED;
   result = visit_applications(info, _package_cb_for_restore, ctx.get());
   const int restored = wait_for_restore(std::move(ctx));
   return result != QUARN_OK ? result : restored;

@@ -60,7 +60,8 @@ bool note_hidden_icon(const char *pkgid, const char *root) {
 void forget_hidden_icon(const char *pkgid, const char *root) {
   const std::lock_guard<std::mutex> lock(hidden_mutex);
   hidden_here().erase(pkgid);
-  remove_note(restore_files(pkgid, root));
+  const restore_files files(pkgid, root);
+  if (is_noted(files)) remove_note(files);
 }
 
 void show_hidden_icon(const char *pkgid, const char *root) {

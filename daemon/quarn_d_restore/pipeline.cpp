@@ -1,6 +1,7 @@
 #include <algorithm>
 #include <list>
 #include <memory>
+#include <optional>
 
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_lifecycle.h"
@@ -10,6 +11,7 @@
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -23,6 +25,8 @@ namespace {
 constexpr int kCloudClient = 0;
 /** How often a download is begun again that was aborted for somebody else's sake. */
 constexpr int kMaxTimesAborted = 8;
+/** Milliseconds between two looks at whether a package is packed still. */
+constexpr guint kPackedCheckMs = 50;
 
 /** One download, from its request to its answer. */
 struct download_request {
@@ -48,8 +52,25 @@ std::uint64_t archive_size(const std::string &path) {
 }
 
 void remove_download(const std::string &path) {
-  if (file_exist(path.c_str())) delete_file(path.c_str());
+  struct stat status = {};
+  if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
+  if (S_ISREG(status.st_mode)) delete_file(path.c_str());
 }
+
+/** The application's own file of the table's name is not in the way while this lives. */
+class OwnTableAside {
+ public:
+  explicit OwnTableAside(const restore_files &files)
+      : files_(files), done_(set_own_table_aside(files)) {}
+  ~OwnTableAside() { put_own_table_back(files_); }
+  OwnTableAside(const OwnTableAside &) = delete;
+  OwnTableAside &operator=(const OwnTableAside &) = delete;
+  explicit operator bool() const { return done_; }
+
+ private:
+  const restore_files &files_;
+  const bool done_;
+};
 
 gboolean terminate_when_idle(gpointer /*data*/) {
   // The client that waits for the end hears of it first.
@@ -79,12 +100,11 @@ restore_outcome roll_back(pkg_restore_context *ctx, int result) {
   return restore_outcome::incomplete;
 }
 
-/** Replace the package's data by the archive's, or leave it as it is. */
+/** Replace the package's data by the archive's, or leave it as it is. The caller holds its lock. */
 restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive,
                                      std::uint64_t size) {
   const char *pkgid = ctx->pkgid.c_str();
   const char *root = ctx->root.c_str();
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
   report_restore_step(ctx->pkgid, restore_stage::snapshot, size);
   if (recover_package_data(pkgid, root) == recovery_result::kept) {
     // A further snapshot would take the place of what is still to be put back.
@@ -92,7 +112,9 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
     ctx->result = QUARN_REFUSED;
     return restore_outcome::incomplete;
   }
-  int result = temp_backup_initial_app_data(pkgid, root);
+  const restore_files files(pkgid, root);
+  const OwnTableAside own_table(files);
+  int result = own_table ? temp_backup_initial_app_data(pkgid, root) : QUARN_REFUSED;
   if (result != QUARN_OK) {
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
     ctx->result = result;
@@ -149,6 +171,7 @@ void finish_restore(pkg_restore_context *ctx, restore_outcome outcome, std::uint
 }
 
 void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data, char *unused);
+void finish_download(RequestPtr request, backup_trans_error_code error);
 
 /** Hand the request to the transport, which has it then. */
 int request_download(RequestPtr &request) {
@@ -178,7 +201,23 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
   g_assert(user_data != nullptr);
   RequestPtr request(static_cast<download_request *>(user_data));
   if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_download_again(request)) return;
+  finish_download(std::move(request), error);
+}
+
+gboolean finish_delayed_download(gpointer data) {
+  finish_download(RequestPtr(static_cast<download_request *>(data)), BACKUP_TRANS_ERROR_NONE);
+  return G_SOURCE_REMOVE;
+}
+
+void finish_download(RequestPtr request, backup_trans_error_code error) {
   pkg_restore_context *ctx = request->ctx;
+  const bool wanted = error == BACKUP_TRANS_ERROR_NONE && !ctx->abandoned;
+  std::optional<PackageDataLock> lock;
+  if (wanted && !lock.emplace(ctx->pkgid, PackageUse::kChangeUnlessPacked)) {
+    // An export of the package may last, and nobody would be served meanwhile.
+    g_timeout_add(kPackedCheckMs, finish_delayed_download, request.release());
+    return;
+  }
   running.erase(std::find(running.begin(), running.end(), ctx->pkgid));
   restore_outcome outcome = restore_outcome::failed;
   std::uint64_t size = 0;
@@ -197,6 +236,7 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
     size = archive_size(request->local_path);
     outcome = restore_from_archive(ctx, request->local_path, size);
   }
+  lock.reset();
   remove_download(request->local_path);
   finish_restore(ctx, outcome, size);
 }
@@ -244,7 +284,12 @@ int restore_from_cloud(pkg_restore_context *ctx) {
   auto request = std::make_unique<download_request>();
   request->cloud_path =
       "/" + ctx->serial + "/" + ctx->pkgid + "/" + ctx->version + "/" + ctx->pkgid + ".zip";
-  request->local_path = restore_files(ctx->pkgid, ctx->root).download;
+  request->local_path = WorkingFiles(ctx->pkgid, ctx->root).download_place();
+  if (request->local_path.empty()) {
+    LOGE("there is no place for the archive of (%s)", ctx->pkgid.c_str());
+    ctx->result = QUARN_LIST_CHECK_FAILED;
+    return QUARN_FAILED;
+  }
   request->ctx = ctx;
   ctx->archive = archive_hold(ctx->serial, ctx->pkgid);
   LOGI("request download for (%s)", ctx->pkgid.c_str());
@@ -279,9 +324,16 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
     return done;
   }
   const std::string archive = companion_archive(ctx);
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  const PackageDataLock lock(ctx.pkgid, PackageUse::kChange);
   if (recover_package_data(pkgid, ctx.root.c_str()) == recovery_result::kept) {
     // What is still to be put back would go over what is unpacked now.
+    LOGE("fail to restore for (%s)", pkgid);
+    done.unpacked = QUARN_REFUSED;
+    return done;
+  }
+  const restore_files files(ctx.pkgid, ctx.root);
+  const OwnTableAside own_table(files);
+  if (!own_table) {
     LOGE("fail to restore for (%s)", pkgid);
     done.unpacked = QUARN_REFUSED;
     return done;

@@ -90,7 +90,7 @@ int restore_symlnk(const char *pkgid, const char *root, json_object *table);
 /** Empty the three data directories but for the snapshot. */
 void clear_app_dir(const char *pkgid, const char *root);
 
-/* ---- snapshot.cpp: the caller holds package_data_mutex, where not told otherwise ---- */
+/* ---- snapshot.cpp: the caller holds the PackageDataLock, where not told otherwise ---- */
 
 /** Copy the package's data aside. @return 0, 36, or what writing the table gave */
 int temp_backup_initial_app_data(const char *pkgid, const char *root);
@@ -109,7 +109,8 @@ bool discard_snapshot(const char *pkgid, const char *root);
 /**
  * Undo what a daemon that died in a restore of the package left: a complete
  * snapshot is put back, an incomplete one removed. Where the application has
- * written since, its data stays and the snapshot is kept. Takes package_data_mutex.
+ * written since, its data stays and the snapshot is kept. Takes the
+ * PackageDataLock; a package that is packed at the moment was found whole.
  * @return true when all data was put back
  */
 bool recover_interrupted_restore(const char *pkgid, const char *root);

@@ -3,6 +3,7 @@
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
@@ -40,15 +41,15 @@ void recover_package(const char *pkgid, const char *root) {
 }
 
 void recover_all_of_package(const char *pkgid, const char *root) {
-  recover_interrupted_restore(pkgid, root);
+  {
+    const PackageDataLock lock(pkgid, PackageUse::kChange);
+    recover_package_data(pkgid, root);
+  }
   sweep_working_files(pkgid, root);
   show_hidden_icon(pkgid, root);
 }
 
-}  // namespace
-
-recovery_result recover_package_data(const char *pkgid, const char *root) {
-  const restore_files files(pkgid, root);
+recovery_result recover_snapshot(const char *pkgid, const char *root, const restore_files &files) {
   std::string written;
   switch (state_of_snapshot(files)) {
     case snapshot_state::none:
@@ -73,9 +74,18 @@ recovery_result recover_package_data(const char *pkgid, const char *root) {
                                                                   : recovery_result::kept;
 }
 
+}  // namespace
+
+recovery_result recover_package_data(const char *pkgid, const char *root) {
+  const restore_files files(pkgid, root);
+  const recovery_result result = recover_snapshot(pkgid, root, files);
+  put_own_table_back(files);
+  return result;
+}
+
 bool recover_interrupted_restore(const char *pkgid, const char *root) {
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
-  return recover_package_data(pkgid, root) == recovery_result::put_back;
+  const PackageDataLock lock(pkgid, PackageUse::kChangeUnlessPacked);
+  return lock && recover_package_data(pkgid, root) == recovery_result::put_back;
 }
 
 void recover_interrupted_restores() { visit_packages(visit_package<recover_package>); }

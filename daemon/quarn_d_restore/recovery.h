@@ -11,13 +11,13 @@ enum class recovery_result {
   told,     /**< the application has gone on with its data, which stays; the snapshot is kept */
   kept      /**< not all could be put back yet: the snapshot still counts */
 };
-/** Mend one package. The caller holds package_data_mutex. */
+/** Mend one package. The caller holds its PackageDataLock. */
 recovery_result recover_package_data(const char *pkgid, const char *root);
 
 /**
  * Everything for every installed package: interrupted restores, working files,
  * icons that were hidden. For a process that does nothing else, or before
- * anything else; needs neither account nor bus. Takes package_data_mutex.
+ * anything else; needs neither account nor bus. Waits for each PackageDataLock.
  */
 void recover_device();
 

@@ -13,27 +13,30 @@
 /** The data directories and working files of one package. */
 struct restore_files {
   restore_files(const std::string &pkgid, const std::string &root)
-      : dirs{root + "/data", root + "/shared/data", root + "/shared/trusted"},
+      : own(pkgid, root),
+        dirs{root + "/data", root + "/shared/data", root + "/shared/trusted"},
         upload(dirs[1] + "/" + pkgid + "_upload.zip"),
         download(dirs[1] + "/" + pkgid + "_download.zip"),
         table(dirs[1] + "/" + pkgid + ".perm"),
-        snapshot(dirs[1] + "/quarn_tmp_rst_dir"),
+        snapshot(own.snapshot_place()),
         snapshot_table(snapshot + "/shared/data/" + pkgid + ".perm"),
         unfinished_table(snapshot + "/table"),
         stamps(snapshot + "/stamps"),
         unpacked(snapshot + "/unpacked"),
         told(snapshot + "/told"),
-        aside(snapshot + ".kept"),
-        hidden_icon(snapshot + ".icon") {}
+        aside(own.snapshot() + ".kept"),
+        table_aside(own.snapshot() + ".table"),
+        hidden_icon(own.snapshot() + ".icon") {}
 
   /** True for an archive in transit. */
   bool is_archive(const std::string &path) const { return path == upload || path == download; }
   /** True for what the walks over the data directories leave alone. */
   bool is_skipped(const std::string &path) const {
-    return is_archive(path) || path.compare(0, snapshot.size(), snapshot) == 0 ||
-           is_own_leftover(path);
+    const std::string &ours = own.snapshot();
+    return is_archive(path) || path.compare(0, ours.size(), ours) == 0 || is_own_leftover(path);
   }
 
+  const WorkingFiles own;
   const std::array<std::string, 3> dirs; /**< in the order in which they are always visited */
   const std::string upload;
   const std::string download;
@@ -45,6 +48,7 @@ struct restore_files {
   const std::string unpacked;         /**< which files the restore has unpacked */
   const std::string told;        /**< the table of a snapshot that counts no more, but is kept */
   const std::string aside;       /**< such a snapshot while a further restore runs, and after it */
+  const std::string table_aside; /**< holds the application's own file of the table's name */
   const std::string hidden_icon; /**< lies there while the package's icon is hidden */
 };
 

@@ -167,7 +167,7 @@ class Clearing {
         }
       } else if (!S_ISREG(status.st_mode)) {
         LOGE("this is unexpected type : %s", path_.c_str());
-      } else if (!is_known() && unlinkat(dir, name, 0) != 0) {
+      } else if (!is_known() && !is_applications_table(status) && unlinkat(dir, name, 0) != 0) {
         LOGE("fail to delete file : %s", path_.c_str());
         cleared_ = false;
       }
@@ -180,6 +180,11 @@ class Clearing {
     LOGE("fail to delete dir : %s", path_.c_str());
     // What is refused, a link, is not the archive's.
     if (!is_empty_directory(path_.c_str())) cleared_ = false;
+  }
+
+  /** What the application calls like the table was set aside while there could be a table. */
+  bool is_applications_table(const struct stat &status) const {
+    return path_ == files_.table && !is_own_file(status);
   }
 
   bool is_known() const {

@@ -20,6 +20,7 @@ constexpr mode_t kSnapshotMode = 0700;
 constexpr std::size_t kSmallFile = 64 << 10;
 constexpr mode_t kCopyMode = 0600;
 constexpr mode_t kFolderMode = 0755;
+constexpr char kAsideName[] = "/table";
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
 
 struct TableRelease {
@@ -50,7 +51,8 @@ bool unlink_path(const std::string &path) {
   return parent && (unlinkat(parent.get(), name.c_str(), 0) == 0 || errno == ENOENT);
 }
 
-bool remove_any(const std::string &path) {
+/** Remove what is the daemon's own; what the application calls the same stays. */
+bool remove_own(const std::string &path) {
   std::string name;
   const UniqueFd parent = safe_open_parent(path.c_str(), &name);
   if (!parent) return false;
@@ -58,6 +60,7 @@ bool remove_any(const std::string &path) {
   if (fstatat(parent.get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
     return errno == ENOENT;
   }
+  if (!is_own_file(status)) return false;
   if (!S_ISDIR(status.st_mode)) return unlinkat(parent.get(), name.c_str(), 0) == 0;
   return delete_tree_at(parent.get(), name.c_str(), path, OtherTypes::kRemoved);
 }
@@ -65,8 +68,7 @@ bool remove_any(const std::string &path) {
 /** An empty snapshot folder; one that is only kept makes way. */
 bool make_snapshot_dir(const restore_files &files) {
   if (state_of_snapshot(files) == snapshot_state::told) {
-    remove_any(files.aside);
-    if (!rename_path(files.snapshot, files.aside)) return false;
+    if (!remove_own(files.aside) || !rename_path(files.snapshot, files.aside)) return false;
   }
   if (!remove_snapshot(files)) return false;
   std::string name;
@@ -285,10 +287,43 @@ snapshot_state state_of_snapshot(const restore_files &files) {
   return file_exist(files.told.c_str()) ? snapshot_state::told : snapshot_state::incomplete;
 }
 
-bool remove_snapshot(const restore_files &files) { return remove_any(files.snapshot); }
+bool remove_snapshot(const restore_files &files) { return remove_own(files.snapshot); }
+
+bool set_own_table_aside(const restore_files &files) {
+  struct stat status = {};
+  if (safe_lstat(files.table.c_str(), &status) != 0) return errno == ENOENT;
+  // No archive's table takes a directory's place, so there is nothing to save it from.
+  if (is_own_file(status) || S_ISDIR(status.st_mode)) return true;
+  std::string name;
+  const UniqueFd parent = safe_open_parent(files.table_aside.c_str(), &name);
+  if (!parent || (mkdirat(parent.get(), name.c_str(), kSnapshotMode) != 0 && errno != EEXIST)) {
+    return false;
+  }
+  return safe_lstat(files.table_aside.c_str(), &status) == 0 && is_own_snapshot(status) &&
+         rename_path(files.table, files.table_aside + kAsideName) &&
+         sync_directory(files.table_aside) && sync_directory(files.dirs[1]);
+}
+
+void put_own_table_back(const restore_files &files) {
+  struct stat status = {};
+  if (safe_lstat(files.table_aside.c_str(), &status) != 0 || !is_own_snapshot(status)) return;
+  const std::string aside = files.table_aside + kAsideName;
+  const bool written_since = safe_lstat(files.table.c_str(), &status) == 0 && !is_own_file(status);
+  if (!written_since && safe_lstat(aside.c_str(), &status) == 0 &&
+      !rename_path(aside, files.table)) {
+    LOGE("fail copy : from %s to %s", aside.c_str(), files.table.c_str());
+    return;
+  }
+  sync_directory(files.dirs[1]);
+  if (!remove_own(files.table_aside)) {
+    LOGE("fail to delete dir : %s", files.table_aside.c_str());
+  }
+}
 
 void forget_told_snapshot(const restore_files &files) {
-  if (!remove_any(files.aside)) LOGE("fail to delete dir : %s", files.aside.c_str());
+  struct stat status = {};
+  if (safe_lstat(files.aside.c_str(), &status) != 0 || !is_own_file(status)) return;
+  if (!remove_own(files.aside)) LOGE("fail to delete dir : %s", files.aside.c_str());
 }
 
 bool keep_told_snapshot(const restore_files &files) {

@@ -5,7 +5,7 @@
  * A snapshot is incomplete until its table has its name, then complete: the
  * data may be half replaced. It is released by the table's removal, or told
  * when the application has gone on with its data: then it is only kept. Main
- * thread or the backup worker; the caller holds package_data_mutex.
+ * thread or the backup worker; the caller holds the package's lock.
  */
 #ifndef QUARN_D_RESTORE_SNAPSHOT_H
 #define QUARN_D_RESTORE_SNAPSHOT_H
@@ -53,8 +53,16 @@ bool application_has_written(const restore_files &files, std::string *path);
 bool keep_told_snapshot(const restore_files &files);
 /** Remove a told snapshot that made way for a further restore, which has succeeded. */
 void forget_told_snapshot(const restore_files &files);
-/** Remove whatever lies in the snapshot's place. @return true when nothing does any more */
+/** Remove what is ours in the snapshot's place. @return true when nothing lies there any more */
 bool remove_snapshot(const restore_files &files);
+
+/**
+ * Take the application's own file out of the way of the table that an archive
+ * holds. @return false when it could not be moved
+ */
+bool set_own_table_aside(const restore_files &files);
+/** Put it back, in place of a table. May be repeated; nothing when there is none. */
+void put_own_table_back(const restore_files &files);
 
 /** The fingerprint of a file's present content, as the stamps have it. */
 std::uint64_t file_stamp(const struct stat &status);

@@ -124,14 +124,7 @@ std::uint64_t get_dir_backup_size(const char *dir, const char *pkg_id, const cha
 /* ---- zip_writer.cpp, zip_reader.cpp -------------------------------------- */
 
 /**
- * Held while a package's data is packed, unpacked or put back, so that an
- * archive never mixes two states. Any thread; held for the length of one
- * archive only, never while waiting for an event.
- */
-extern std::mutex package_data_mutex;
-
-/**
- * Pack one package's data. Takes package_data_mutex. The rules of the calling
+ * Pack one package's data. Takes its PackageDataLock. The rules of the calling
  * thread apply. Nothing is made below a root that has gone, and a package that
  * goes meanwhile fails. The first member beyond one of @p bounds ends the work.
  * @param[out] error  set on failure only: 31 archive not opened, 36 any entry failed
@@ -161,7 +154,7 @@ struct unzip_report {
 
 /**
  * Unpack an archive below @p destination: files are created new, mode 0600,
- * whatever lay in their place. Does not take package_data_mutex. Entries that
+ * whatever lay in their place. Takes no PackageDataLock. Entries that
  * are refused or fail are logged and left out; @p report tells how many.
  * Entries that name a folder make it, and cost nothing where that is refused.
  * @return 0, 14, or 31 for an archive that cannot be opened, is empty, or

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "backup_transport.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
@@ -19,6 +20,9 @@
 namespace {
 
 constexpr std::string_view kPartPrefix = BACKUP_TRANS_TEMPORARY_PREFIX;
+
+/** Added to the snapshot's name when the application has that name. */
+constexpr char kBeside[] = ".snapshot";
 
 std::mutex claimed_mutex;
 std::set<std::string> &claimed() {
@@ -33,6 +37,12 @@ bool is_part_name(const char *name) {
 /** A file that nobody but the daemon has made, and that has no other name. */
 bool is_own_single_file(const struct stat &status) {
   return S_ISREG(status.st_mode) && is_own_file(status) && status.st_nlink == 1;
+}
+
+/** True when something lies at @p path that the daemon has not made. */
+bool is_applications(const std::string &path) {
+  struct stat status = {};
+  return safe_lstat(path.c_str(), &status) == 0 && !is_own_file(status);
 }
 
 constexpr mode_t kPrivateFile = 0600;
@@ -68,6 +78,19 @@ bool is_own_leftover(const std::string &path) {
          is_own_leftover(name, status);
 }
 
+std::string WorkingFiles::download_place() const {
+  if (!is_applications(download_)) return download_;
+  return is_applications(download_aside_) ? "" : download_aside_;
+}
+
+std::string WorkingFiles::snapshot_place() const {
+  const std::string beside = snapshot_ + kBeside;
+  struct stat status = {};
+  // One that lies there counts, also when the application has made room meanwhile.
+  const bool used = safe_lstat(beside.c_str(), &status) == 0 && is_own_file(status);
+  return used || is_applications(snapshot_) ? beside : snapshot_;
+}
+
 void claim_working_file(const std::string &path) {
   const std::lock_guard<std::mutex> lock(claimed_mutex);
   claimed().insert(path);
@@ -75,10 +98,11 @@ void claim_working_file(const std::string &path) {
 
 void sweep_working_files(const std::string &pkg_id, const std::string &root) {
   const WorkingFiles files(pkg_id, root);
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  const PackageDataLock lock(pkg_id, PackageUse::kChange);
   sweep_file(files.upload());
   sweep_file(files.upload_aside());
   sweep_file(files.download());
+  sweep_file(files.download_aside());
   sweep_file(files.table(), kPrivateFile);
   const UniqueFd dir = safe_open(files.folder().c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK);
   std::vector<TreeEntry> entries;

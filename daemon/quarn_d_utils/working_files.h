@@ -40,6 +40,7 @@ class WorkingFiles {
         table_(folder_ + "/" + pkg_id + ".perm"),
         snapshot_(folder_ + "/quarn_tmp_rst_dir"),
         upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip"),
+        download_aside_(snapshot_ + "." + pkg_id + "_download.zip"),
         owed_(snapshot_ + ".owed") {}
 
   const std::string &folder() const { return folder_; } /**< where all of them lie */
@@ -47,6 +48,14 @@ class WorkingFiles {
   /** Where the archive is staged whose name an application's own file has. */
   const std::string &upload_aside() const { return upload_aside_; }
   const std::string &download() const { return download_; }
+  /** Where an archive is downloaded to when the application's own file has that name. */
+  const std::string &download_aside() const { return download_aside_; }
+  /** The one of both that is to be used; empty when the application has both. */
+  std::string download_place() const;
+  /** Everything of ours that is not an archive begins with this, the snapshot as a rule. */
+  const std::string &snapshot() const { return snapshot_; }
+  /** The snapshot's place: beside the usual one where that is the application's own. */
+  std::string snapshot_place() const;
   /** The table on its way into an archive or out of one; the application's own may have the name.
    */
   const std::string &table() const { return table_; }
@@ -69,6 +78,7 @@ class WorkingFiles {
   std::string table_;
   std::string snapshot_;
   std::string upload_aside_;
+  std::string download_aside_;
   std::string owed_;
 };
 
@@ -79,7 +89,7 @@ void claim_working_file(const std::string &path);
  * Remove what an ended process has left of a package: archives in transit, a
  * table, parts of downloads. What the application owns stays, whatever its
  * name. No clock is asked: what this process uses it has claimed, and a
- * transfer that lives holds a lock on its file. Takes package_data_mutex.
+ * transfer that lives holds a lock on its file. Takes the PackageDataLock.
  */
 void sweep_working_files(const std::string &pkg_id, const std::string &root);
 

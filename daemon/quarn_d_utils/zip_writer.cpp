@@ -7,18 +7,16 @@
 
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
-std::mutex package_data_mutex;
-
 namespace {
 
 constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
-constexpr char kSnapshotDir[] = "/shared/data/quarn_tmp_rst_dir";
 constexpr char kTableDir[] = "/shared/data/";
 constexpr char kTableSuffix[] = ".perm";
 constexpr int kLevel = 1;
@@ -505,7 +503,11 @@ bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth) {
 
 UniqueFd create_archive(const char *zip_path) {
   claim_working_file(zip_path);
-  if (file_exist(zip_path)) delete_file(zip_path);
+  struct stat status {};
+  // What the application has there is not made way for.
+  if (safe_lstat(zip_path, &status) == 0 && is_own_file(status) && S_ISREG(status.st_mode)) {
+    delete_file(zip_path);
+  }
   return safe_open(zip_path, O_RDWR | O_CREAT | O_EXCL, kArchiveMode);
 }
 
@@ -514,7 +516,7 @@ UniqueFd create_archive(const char *zip_path) {
  * lies in the data directories is part of the old and part of the new.
  */
 bool is_half_restored(const char *pkg_id, const char *root) {
-  const std::string snapshot = std::string(root) + kSnapshotDir;
+  const std::string snapshot = WorkingFiles(pkg_id, root).snapshot_place();
   const std::string table = snapshot + kTableDir + pkg_id + kTableSuffix;
   struct stat status = {};
   // An application can make neither of root's.
@@ -603,7 +605,7 @@ void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table
 void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
                    const archive_bounds &bounds, archive_excess *excess,
                    const std::atomic<bool> *stop) {
-  const std::lock_guard<std::mutex> lock(package_data_mutex);
+  const PackageDataLock lock(pkg_id, PackageUse::kPack);
   if (!may_be_packed(pkg_id, root)) {
     *error = QUARN_REFUSED;
     return;

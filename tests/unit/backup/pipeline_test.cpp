@@ -777,6 +777,20 @@ TEST_F(Pipeline, AnApplicationsFilesWithTheNamesOfWorkingFilesAreLeftAlone) {
   }
 }
 
+TEST_F(Pipeline, WhereTheApplicationHasBothNamesOfAnArchiveNothingIsDeleted) {
+  const FakePackage &app = install("org.app");
+  const std::string shared = app.root + "/shared/data/";
+  const std::vector<std::string> own = {"org.app_upload.zip",
+                                        "quarn_tmp_rst_dir.org.app_upload.zip"};
+  for (const std::string &name : own) {
+    write_text(shared + name, "own " + name);
+    ASSERT_EQ(chown((shared + name).c_str(), kAppUid, kAppGid), 0);
+  }
+  automatic();
+  for (const std::string &name : own) EXPECT_EQ(read_text(shared + name), "own " + name);
+  EXPECT_EQ(cloud_.objects.count(app.object()), 0U);
+}
+
 TEST_F(Progress, TellsWhichBoundAPackageGoesBeyond) {
   const FakePackage &many = install("org.many", "1", "");
   for (std::uint64_t i = 0; i <= kBackupBounds.members; ++i) {

@@ -1,14 +1,19 @@
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <csignal>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <thread>
 
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package_lock.h"
 #include "restore_fixture.h"
 
 using ::testing::_;
@@ -346,17 +351,67 @@ TEST_F(PipelineTest, AnArchiveIsNeverPackedFromAMixture) {
   ASSERT_EQ(restore(ctx.get()), 0);
   make_archive(download(), new_data);
   bool held = false;
-  // from another thread: this one may hold it itself
+  std::thread packing;
+  std::atomic<bool> packed{false};
+  int error = 0;
   const AtStep step("unpacked", [&] {
-    std::thread([&] {
-      held = !package_data_mutex.try_lock();
-      if (!held) package_data_mutex.unlock();
-    }).join();
+    packing = std::thread([&] {
+      make_zip_data(kPkg, root.c_str(), (base + "/packed.zip").c_str(), &error);
+      packed = true;
+    });
+    // another package is not in its way
+    { const PackageDataLock other("org.example.other", PackageUse::kPack); }
+    held = !packed;
   });
   answer();
+  packing.join();
   EXPECT_TRUE(held);
-  EXPECT_TRUE(package_data_mutex.try_lock());
-  package_data_mutex.unlock();
+  EXPECT_EQ(error, 0) << "not refused as half restored";
+  EXPECT_EQ(ctx->result, 0);
+}
+
+TEST_F(PipelineTest, TheMainLoopGoesOnWhileThePackageIsPacked) {
+  make_old_data();
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  std::promise<void> locked;
+  std::promise<void> go;
+  std::thread packing([&] {
+    const PackageDataLock lock(kPkg, PackageUse::kPack);
+    locked.set_value();
+    go.get_future().wait();
+  });
+  locked.get_future().wait();
+  answer();  // returns
+  EXPECT_EQ(ctx->pending, 1);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "old settings");
+  EXPECT_FALSE(is_idle_status());
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str())) << "nor does this wait";
+  auto second = waiting_context();
+  ASSERT_EQ(restore(second.get()), 0);
+  EXPECT_TRUE(downloads.empty()) << "the first uses the files still";
+  go.set_value();
+  packing.join();
+  while (ctx->pending != 0) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(PipelineTest, ARestoreThatIsAbandonedWhileItsPackageIsPackedChangesNothing) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  make_archive(download(), new_data);
+  auto lock = std::make_unique<PackageDataLock>(kPkg, PackageUse::kPack);
+  answer();
+  ctx.release()->abandoned = true;
+  while (!is_idle_status()) g_main_context_iteration(nullptr, TRUE);
+  lock.reset();
+  EXPECT_EQ(tree_of(root), before);
 }
 
 TEST_F(PipelineTest, WhatADeadDaemonLeftIsPutBackBeforeThePackageIsRestoredAgain) {
@@ -435,6 +490,117 @@ TEST_F(PipelineTest, AFileOfTheApplicationsOwnThatIsNamedLikeAPartIsData) {
   make_archive(download(), new_data, "not json");
   answer();
   EXPECT_EQ(ctx->result, 36);
+  EXPECT_EQ(tree_of(root), before);
+}
+
+/** Files and folders of the application's own with every name that the daemon uses. */
+class OwnNamesTest : public PipelineTest {
+ protected:
+  OwnNamesTest() {
+    make_old_data();
+    for (const char *name :
+         {"quarn_tmp_rst_dir.kept", "quarn_tmp_rst_dir.icon", "org.example.notes_upload.zip",
+          "org.example.notes_download.zip", "org.example.notes.perm"}) {
+      file(std::string("shared/data/") + name, std::string("its own ") + name, 0640);
+    }
+  }
+  void make_folder_of_that_name() {
+    dir("shared/data/quarn_tmp_rst_dir", 0700);
+    file("shared/data/quarn_tmp_rst_dir/shared/data/org.example.notes.perm", "{}");
+  }
+  /** What has one of those names; the rest is the restore's. */
+  Tree own() const {
+    Tree found;
+    for (const auto &[name, object] : tree_of(root)) {
+      if (name.find("quarn_tmp") != std::string::npos ||
+          name.find("org.example.notes") != std::string::npos) {
+        found[name] = object;
+      }
+    }
+    return found;
+  }
+  /** Through a restore that succeeds, and one that fails once everything was unpacked. */
+  void expect_they_survive() {
+    const Tree before = own();
+    const Tree all = tree_of(root);
+    for (const bool good : {false, true}) {
+      auto ctx = waiting_context();
+      ASSERT_EQ(restore(ctx.get()), 0);
+      ASSERT_EQ(downloads.size(), 1U);
+      make_archive(downloads[0].local, new_data, good ? nullptr : "not json");
+      answer();
+      EXPECT_EQ(ctx->result, good ? 0 : 36);
+      EXPECT_EQ(own(), before);
+      if (!good) {
+        EXPECT_EQ(tree_of(root), all);
+      }
+    }
+    EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  }
+};
+
+TEST_F(OwnNamesTest, SurviveARestoreWithAFileInTheSnapshotsPlace) {
+  file("shared/data/quarn_tmp_rst_dir", "its own");
+  expect_they_survive();
+}
+
+TEST_F(OwnNamesTest, SurviveARestoreWithAFolderInTheSnapshotsPlace) {
+  make_folder_of_that_name();
+  expect_they_survive();
+}
+
+TEST_F(OwnNamesTest, SurviveARestoreThatIsKilledAtAnyStepAndItsRecovery) {
+  make_folder_of_that_name();
+  ON_CALL(platform, package_manager_foreach_package_info)
+      .WillByDefault([](package_manager_package_info_cb callback, void *data) {
+        callback(nullptr, data);
+        return 0;
+      });
+  ON_CALL(platform, package_info_get_package).WillByDefault([](auto, char **id) {
+    *id = strdup(kPkg);
+    return 0;
+  });
+  ON_CALL(platform, package_info_get_root_path).WillByDefault([this](auto, char **path) {
+    *path = strdup(root.c_str());
+    return 0;
+  });
+  const Tree before = own();
+  const std::string kept = base + "/kept.zip";
+  make_archive(kept, new_data);
+  for (int steps = 0;; ++steps) {
+    const pid_t child = fork();
+    if (child == 0) {
+      static int left = 0;
+      left = steps;
+      restore_step_hook = [](const char *) {
+        if (left-- == 0) _exit(1);
+      };
+      auto ctx = waiting_context();
+      restore(ctx.get());
+      std::filesystem::copy_file(kept, downloads[0].local);
+      answer();
+      _exit(ctx->result == 0 ? 0 : 2);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    recover_device();
+    ASSERT_EQ(own(), before) << steps;
+    if (status == 0) break;
+    ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 1) << steps;
+    const std::string content = read_text(at("data/settings.ini"));
+    ASSERT_TRUE(content == "old settings" || content == "new settings") << steps;
+    ASSERT_LT(steps, 500);
+  }
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+}
+
+TEST_F(OwnNamesTest, BothNamesOfADownloadTakenIsARefusal) {
+  file("shared/data/quarn_tmp_rst_dir.org.example.notes_download.zip", "its own");
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  EXPECT_EQ(restore(ctx.get()), 42);
+  EXPECT_EQ(ctx->result, 13);
+  expect_error("there is no place for the archive of (org.example.notes)");
   EXPECT_EQ(tree_of(root), before);
 }
 
@@ -568,6 +734,18 @@ TEST_F(CompanionTest, WhatWasUnpackedHasItsAttributesThoughAnEntryIsCorrupt) {
   EXPECT_EQ(read_text(at(new_data.back().name)), new_data.back().content);
   EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
   EXPECT_EQ(progress.back().result, 31);
+}
+
+TEST_F(CompanionTest, AFileOfTheApplicationsOwnThatIsNamedLikeTheTableStays) {
+  make_old_data();
+  file("shared/data/org.example.notes.perm", "its own", 0640);
+  const Tree before = tree_of(root);
+  make_archive(archive(), new_data);
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 0);
+  const std::string table = "shared/data/org.example.notes.perm";
+  EXPECT_EQ(tree_of(root).at(table), before.at(table));
+  EXPECT_EQ(progress.back().outcome, Outcome::restored);
 }
 
 TEST_F(CompanionTest, AMissingArchiveCarriesTheUnpackCode) {

@@ -229,15 +229,47 @@ TEST_F(SnapshotTest, ALinkInItsPlaceIsRemovedAndNotFollowed) {
   EXPECT_TRUE(std::filesystem::is_directory(std::filesystem::symlink_status(snapshot())));
 }
 
-TEST_F(SnapshotTest, AnApplicationsDirectoryInItsPlaceIsReplaced) {
+TEST_F(SnapshotTest, AnApplicationsDirectoryInItsPlaceStaysAndIsNeverTheSnapshot) {
   file("data/a", "x");
+  dir("shared/data/quarn_tmp_rst_dir");
   file("shared/data/quarn_tmp_rst_dir/data/planted", "evil");
   file("shared/data/quarn_tmp_rst_dir/shared/data/org.example.notes.perm", "{}");
+  const Tree before = tree();
   ASSERT_EQ(take(), 0);
-  EXPECT_FALSE(exists(snapshot() + "/data/planted"));
+  EXPECT_EQ(read_text(snapshot() + "/data/planted"), "evil");
+  EXPECT_EQ(read_text(snapshot() + ".snapshot/data/a"), "x");
   struct stat status = {};
-  ASSERT_EQ(lstat(snapshot().c_str(), &status), 0);
+  ASSERT_EQ(lstat((snapshot() + ".snapshot").c_str(), &status), 0);
   EXPECT_EQ(status.st_uid, 0U);
+  unpacked_file("data/a", "half of a restore");
+  EXPECT_TRUE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, WhereTheApplicationHasBothNamesNothingIsTouched) {
+  file("data/a", "x");
+  file("shared/data/quarn_tmp_rst_dir", "its own");
+  dir("shared/data/quarn_tmp_rst_dir.snapshot", 0700);
+  file("shared/data/quarn_tmp_rst_dir.snapshot/inner", "its own");
+  const Tree before = tree();
+  EXPECT_EQ(take(), 36);
+  discard_snapshot(kPkg, root.c_str());
+  recover_interrupted_restore(kPkg, root.c_str());
+  EXPECT_EQ(tree(), before);
+}
+
+TEST_F(SnapshotTest, OneBesideTheUsualPlaceCountsWhenThatIsFreeAgain) {
+  file("data/a", "x");
+  file("shared/data/quarn_tmp_rst_dir", "its own");
+  ASSERT_EQ(take(), 0);
+  unpacked_file("data/a", "half of a restore");
+  ASSERT_EQ(unlink(snapshot().c_str()), 0);
+  int error = 0;
+  make_zip_data(kPkg, root.c_str(), (base + "/archive.zip").c_str(), &error);
+  EXPECT_EQ(error, 36) << "a half restored package is not packed";
+  EXPECT_TRUE(recover_interrupted_restore(kPkg, root.c_str()));
+  EXPECT_EQ(read_text(at("data/a")), "x");
+  EXPECT_FALSE(exists(snapshot() + ".snapshot"));
 }
 
 TEST_F(SnapshotTest, ALinkInAFolderInItsPlaceHindersNothing) {

@@ -1,0 +1,52 @@
+#include "quarn_d_utils/package_lock.h"
+
+#include <condition_variable>
+#include <mutex>
+#include <optional>
+
+namespace {
+
+/** Which package is packed and which is changed. */
+struct Uses {
+  std::mutex mutex;
+  std::condition_variable ended;
+  std::optional<std::string> packed;
+  std::optional<std::string> changed;
+};
+
+Uses &uses() {
+  static auto *all = new Uses;
+  return *all;
+}
+
+}  // namespace
+
+PackageDataLock::PackageDataLock(const std::string &pkg_id, PackageUse use)
+    : packs_(use == PackageUse::kPack), held_(true) {
+  Uses &all = uses();
+  std::unique_lock<std::mutex> lock(all.mutex);
+  std::optional<std::string> &mine = packs_ ? all.packed : all.changed;
+  const std::optional<std::string> &other = packs_ ? all.changed : all.packed;
+  while (mine || other == pkg_id) {
+    if (use == PackageUse::kChangeUnlessPacked && other == pkg_id) {
+      held_ = false;
+      return;
+    }
+    all.ended.wait(lock);
+  }
+  mine = pkg_id;
+}
+
+PackageDataLock::~PackageDataLock() {
+  if (!held_) return;
+  Uses &all = uses();
+  const std::lock_guard<std::mutex> lock(all.mutex);
+  (packs_ ? all.packed : all.changed).reset();
+  all.ended.notify_all();
+}
+
+bool package_is_packed(const std::string &pkg_id) {
+  Uses &all = uses();
+  const std::lock_guard<std::mutex> lock(all.mutex);
+  return all.packed == pkg_id;
+}
