@@ -4,8 +4,8 @@
  *
  * "/org/orvane/Quarn/Status" serves the interface "org.orvane.Quarn.Status":
  * properties with change signals, nothing to call. Its further interface
- * "org.orvane.Quarn.CleanUp" is read at every look and walks over the packages. It is beside the daemon's
- * own object, whose one interface stays as it is.
+ * "org.orvane.Quarn.CleanUp" is read at every look and walks over the packages. It is beside the
+ * daemon's own object, whose one interface stays as it is.
  */
 #ifndef QUARN_D_STATUS_H
 #define QUARN_D_STATUS_H

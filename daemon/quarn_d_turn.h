@@ -35,7 +35,8 @@ bool wait_for_quarn_turn(int ms);
  */
 bool tell_quarn_predecessor(const std::string &line, int signo);
 
-/** The lines that later processes have left since the last look, or since the start. Main thread. */
+/** The lines that later processes have left since the last look, or since the start. Main thread.
+ */
 std::vector<std::string> take_quarn_turn_lines();
 
 /** Send a signal to the process whose turn it is. @return false when it is one's own. Any thread.

@@ -8,8 +8,8 @@
 #include <string>
 #include <thread>
 
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"

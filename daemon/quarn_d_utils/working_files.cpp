@@ -52,7 +52,8 @@ void sweep_file(const std::string &path, mode_t modes = ALLPERMS) {
   const std::lock_guard<std::mutex> lock(claimed_mutex);
   struct stat status = {};
   if (claimed().count(path) != 0 || safe_lstat(path.c_str(), &status) != 0) return;
-  if (is_own_single_file(status) && (status.st_mode & ALLPERMS & ~modes) == 0) delete_file(path.c_str());
+  if (is_own_single_file(status) && (status.st_mode & ALLPERMS & ~modes) == 0)
+    delete_file(path.c_str());
 }
 
 /** Remove a part of a download when no transfer holds it. */
