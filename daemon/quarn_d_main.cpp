@@ -43,6 +43,8 @@ constexpr unsigned int kLastFlush = 50;
  * has asked it to end because it gave its bus name up; it is killed at 90 s.
  */
 constexpr int kServiceGrace = 80000;
+/** Milliseconds between the questions of a process whose requests wait for its turn. */
+constexpr guint kTurnAskMs = 250;
 constexpr int kNoEnd = -1;
 constexpr int kAtOnce = 0;
 constexpr char kLockName[] = "/tmp/quarn/lock";
@@ -58,10 +60,21 @@ gboolean cancel_backups(gpointer) {
   return G_SOURCE_REMOVE;
 }
 
-gboolean withdraw_requests(gpointer) {
-  for (const std::string &caller : take_quarn_turn_lines()) {
+/** Make room for a process that has requests and waits: this one may have the bus name back. */
+void leave_for_the_next() {
+  // Restore mode waits for installations, of which another process would know nothing.
+  if (pellix_restore_running != 0 || cloud_restore_running != 0) return;
+  request_quarn_terminate(0.0, false);
+}
+
+gboolean take_lines(gpointer) {
+  for (const std::string &line : take_quarn_turn_lines()) {
+    if (line == kLeaveLine) {
+      leave_for_the_next();
+      continue;
+    }
     LOGI("withdrawal from the next process");
-    quarnd_cancel_own(caller);
+    quarnd_cancel_own(line);
   }
   return G_SOURCE_REMOVE;
 }
@@ -78,7 +91,7 @@ int take_signal(int signo) {
     return kNoEnd;
   }
   if (signo == kWithdrawSignal) {
-    g_idle_add_full(G_PRIORITY_DEFAULT, withdraw_requests, nullptr, nullptr);
+    g_idle_add_full(G_PRIORITY_DEFAULT, take_lines, nullptr, nullptr);
     return kNoEnd;
   }
   LOGI("SIGNAL %d received", signo);
@@ -114,6 +127,13 @@ void install_signal_handlers() {
 }
 
 bool request_pending() { return backup_request_outstanding() || quarnd_calls_deferred(); }
+
+/** An idle process keeps its turn for as long as it has the bus name. */
+gboolean ask_for_turn(gpointer) {
+  if (is_quarn_turn()) return G_SOURCE_REMOVE;
+  if (request_pending()) tell_quarn_predecessor(kLeaveLine, kWithdrawSignal);
+  return G_SOURCE_CONTINUE;
+}
 
 int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
 
@@ -186,6 +206,7 @@ int quarn_run() {
   if (is_quarn_turn()) sweep_staging_directory(kLockName);
   init_quarn();
   init_backup_req_dispatch_thread();
+  if (!is_quarn_turn()) g_timeout_add(kTurnAskMs, ask_for_turn, nullptr);
   LOGI("== main loop begin ==");
   quarn_loop_begin();
   leave_clients();

@@ -57,7 +57,7 @@ void copy_object(const fs::path &from, const fs::path &to, const CopyRules &rule
       if (rules.keep_existing) return;
       throw Failure(to.string() + " is in the way");
     }
-    if (!exists && mkdir(to.c_str(), 0700) != 0) {
+    if (!exists && mkdir(to.c_str(), 0700) != 0 && !(rules.keep_existing && errno == EEXIST)) {
       throw Failure("cannot make " + to.string() + ": " + reason());
     }
     for (const fs::directory_entry &entry : fs::directory_iterator(from)) {
@@ -67,15 +67,20 @@ void copy_object(const fs::path &from, const fs::path &to, const CopyRules &rule
     return;
   }
   if (exists && rules.keep_existing) return;
-  if (S_ISLNK(source.st_mode)) {
-    fs::copy_symlink(from, to);
-    dress(to, source.st_mode, true, rules.label);
-  } else if (S_ISREG(source.st_mode)) {
-    fs::copy_file(from, to);
-    dress(to, source.st_mode, false, rules.label);
-  } else {
+  const bool link = S_ISLNK(source.st_mode);
+  if (!link && !S_ISREG(source.st_mode)) {
     throw Failure(from.string() + " is neither file, directory nor link");
   }
+  std::error_code error;
+  if (link) {
+    fs::copy_symlink(from, to, error);
+  } else {
+    fs::copy_file(from, to, error);
+  }
+  // A restore may have put it there since the look.
+  if (error == std::errc::file_exists && rules.keep_existing) return;
+  if (error) throw Failure("cannot make " + to.string() + ": " + error.message());
+  dress(to, source.st_mode, link, rules.label);
 }
 
 /** The folders above an application's data belong to it as well. */

@@ -94,7 +94,16 @@ void quarnd_dbus_leave() {
 bool calls_deferred = false;
 bool turn_is_there = true;
 bool quarnd_calls_deferred() { return calls_deferred; }
+char pellix_restore_running = 0;
+char cloud_restore_running = 0;
 std::vector<std::string> turn_lines;
+bool tell_quarn_predecessor(const std::string &line, int signo) {
+  step(("tell " + line + (signo == kWithdrawSignal ? "" : "?")).c_str());
+  return true;
+}
+void request_quarn_terminate(double delay, bool restart) {
+  step(delay == 0.0 && !restart ? "terminate" : "terminate?");
+}
 std::vector<std::string> take_quarn_turn_lines() { return std::exchange(turn_lines, {}); }
 std::uint32_t quarnd_cancel_own(const std::string &sender) {
   step(("cancel_own " + sender).c_str());
@@ -350,6 +359,43 @@ TEST_F(Main, WithdrawalsFromTheNextProcessAreCarriedOutOnTheMainThread) {
   while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
   }
   EXPECT_EQ(steps, (Texts{"cancel_own :1.5", "cancel_own :1.7"}));
+}
+
+TEST_F(Main, IdleProcessLeavesForTheRequestsOfTheNext) {
+  quarn_run();
+  restart();
+  const auto leave = [] {
+    turn_lines = {kLeaveLine};
+    hooks.take(kWithdrawSignal);
+    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+    }
+    return std::exchange(steps, {});
+  };
+  EXPECT_EQ(leave(), Texts{"terminate"});
+  for (char *const mode : {&pellix_restore_running, &cloud_restore_running}) {
+    *mode = 1;
+    EXPECT_EQ(leave(), Texts{}) << "restore mode is this process's";
+    *mode = 0;
+  }
+}
+
+TEST_F(Main, ProcessWhoseRequestsWaitAsksTheEarlierOneToLeaveUntilItsTurnComes) {
+  turn_is_there = false;
+  backups_outstanding = false;
+  in_loop = [] {
+    steps.clear();
+    backups_outstanding = true;
+    while (std::count(steps.begin(), steps.end(), "tell leave") < 2) {
+      g_main_context_iteration(nullptr, TRUE);
+    }
+    // The one that finds the turn there is the last.
+    turn_is_there = true;
+    steps.clear();
+    g_main_context_iteration(nullptr, TRUE);
+    EXPECT_EQ(std::count(steps.begin(), steps.end(), "tell leave"), 0);
+  };
+  EXPECT_EQ(quarn_run(), 0);
+  backups_outstanding = false;
 }
 
 TEST_F(Main, CallsThatWaitForTheEarlierProcessKeepTheDaemonAndFollowIt) {
