@@ -477,8 +477,11 @@ class Churn(TestCase):
 
     def settle(self):
         """A new daemon, which finds what the last one left, and one more of everything."""
-        self.end_daemon()
-        self.device.wait_for_daemon_end()
+        def ended():
+            self.end_daemon()
+            return not self.daemon_pids()
+        # One may wait in the queue for the bus name behind another.
+        wait_until(ended, "the daemons end")
         # Only what a run uploads is cleaned of its other versions.
         for application in self.applications.values():
             if application.installed:
