@@ -20,7 +20,7 @@ import zlib
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path[:0] = [os.path.join(HERE, ".."), os.path.join(HERE, "../bus")]
 from bus_client import NAME, Client, GLib  # noqa: E402
-from quarn_test import TestCase, make_source, read_text  # noqa: E402
+from quarn_test import TestCase, make_source, read_text, wait_until  # noqa: E402
 
 SERIAL = "350000000000001"
 APPLICATION_USER = 5000
