@@ -393,6 +393,8 @@ TEST_F(RestoreModeTestWithMark, NorIsOneInWhosePlaceAnotherCame) {
   EXPECT_EQ(on(0), 0);
   EXPECT_EQ(on(0, "350000000000002"), 0);
   expect_unused();
+  off();
+  run_main_context();
 }
 
 TEST_F(RestoreModeTest, AListThatRunsEmptyEndsTheMode) {
