@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <glib.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -74,8 +75,8 @@ class Holder {
 
  private:
   static void on_signal(int) { static_cast<void>(!write(told_fd, "C", 1)); }
-  /** The process only waits, so that a handler may do what otherwise its loop does. */
-  static void on_lines(int) {
+  static void on_lines(int) { static_cast<void>(!write(lines_fd, "L", 1)); }
+  static void tell_lines() {
     for (const std::string &line : take_quarn_turn_lines()) {
       static_cast<void>(!write(told_fd, line.data(), line.size()));
     }
@@ -84,23 +85,32 @@ class Holder {
     close(hold_[1]);
     told_fd = tell_[1];
     std::signal(SIGUSR1, on_signal);
+    int lines[2] = {-1, -1};
+    if (pipe2(lines, O_CLOEXEC) != 0) _exit(1);
+    lines_fd = lines[1];
     std::signal(SIGUSR2, on_lines);
     char nothing = 0;
     if (read(hold_[0], &nothing, 1) != 1) _exit(1);
     begin_quarn_turn(lock.c_str(), nullptr, nullptr);
     if (is_quarn_turn()) on_signal_ready();
-    while (read(hold_[0], &nothing, 1) < 0 && errno == EINTR) {
+    for (;;) {
+      pollfd ready[] = {{hold_[0], POLLIN, 0}, {lines[0], POLLIN, 0}};
+      if (poll(ready, 2, -1) < 0) continue;
+      if ((ready[1].revents & POLLIN) != 0 && read(lines[0], &nothing, 1) == 1) tell_lines();
+      if (ready[0].revents != 0) break;
     }
     _exit(0);
   }
   static void on_signal_ready() { static_cast<void>(!write(told_fd, "H", 1)); }
   static int told_fd;
+  static int lines_fd;
   int hold_[2] = {-1, -1};
   int tell_[2] = {-1, -1};
   pid_t pid_ = 0;
 };
 
 int Holder::told_fd = -1;
+int Holder::lines_fd = -1;
 
 bool turn_told = false;
 void on_turn() { turn_told = true; }
