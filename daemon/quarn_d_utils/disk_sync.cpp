@@ -5,9 +5,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <condition_variable>
-#include <deque>
-#include <mutex>
+#include <algorithm>
+#include <atomic>
 #include <system_error>
 #include <thread>
 #include <utility>
@@ -20,72 +19,35 @@ namespace {
 
 /** Waiting files share the disk's flushes, so a few at once cost little more than one. */
 constexpr std::size_t kThreads = 4;
-/** Descriptors that may wait; with the first of them writing begins already. */
-constexpr std::size_t kMaxWaiting = 64;
+/**
+ * More files are brought to the disk all at once. Each by itself waits for a flush of the disk's
+ * cache, of which two thousand took longer than everything else that a restore does.
+ */
+constexpr std::size_t kFew = 128;
 
-/** Syncs what it is given in threads of its own. */
-class SyncPool {
- public:
-  SyncPool() {
-    try {
-      for (std::size_t i = 0; i < kThreads; ++i) threads_.emplace_back([this] { work(); });
-    } catch (const std::system_error &) {  // with fewer of them, or none, it only takes longer
+/** Sync a few objects in threads. @return true when everything is on the disk */
+bool sync_each(const std::vector<UniqueFd> &objects) {
+  std::atomic<std::size_t> next{0};
+  std::atomic<bool> synced{true};
+  const auto work = [&] {
+    for (std::size_t at = next++; at < objects.size(); at = next++) {
+      if (fsync(objects[at].get()) != 0) synced = false;
     }
+  };
+  std::vector<std::thread> threads;
+  try {
+    while (threads.size() + 1 < std::min(kThreads, objects.size())) threads.emplace_back(work);
+  } catch (const std::system_error &) {  // with fewer of them, or none, it only takes longer
   }
-  ~SyncPool() { finish(); }
-  SyncPool(const SyncPool &) = delete;
-  SyncPool &operator=(const SyncPool &) = delete;
+  work();
+  for (auto &thread : threads) thread.join();
+  return synced;
+}
 
-  void add(UniqueFd object) {
-    if (threads_.empty()) {
-      if (fsync(object.get()) != 0) fail();
-      return;
-    }
-    std::unique_lock<std::mutex> lock(mutex_);
-    changed_.wait(lock, [this] { return waiting_.size() < kMaxWaiting; });
-    waiting_.push_back(std::move(object));
-    changed_.notify_all();
-  }
-  void fail() {
-    const std::lock_guard<std::mutex> lock(mutex_);
-    failed_ = true;
-  }
-  /** @return true when everything is on the disk */
-  bool finish() {
-    {
-      const std::lock_guard<std::mutex> lock(mutex_);
-      ended_ = true;
-      changed_.notify_all();
-    }
-    for (auto &thread : threads_) {
-      if (thread.joinable()) thread.join();
-    }
-    return !failed_;
-  }
-
- private:
-  void work() {
-    while (true) {
-      UniqueFd object;
-      {
-        std::unique_lock<std::mutex> lock(mutex_);
-        changed_.wait(lock, [this] { return ended_ || !waiting_.empty(); });
-        if (waiting_.empty()) return;
-        object = std::move(waiting_.front());
-        waiting_.pop_front();
-        changed_.notify_all();
-      }
-      if (fsync(object.get()) != 0) fail();
-    }
-  }
-
-  std::mutex mutex_;
-  std::condition_variable changed_;
-  std::deque<UniqueFd> waiting_;
-  bool ended_ = false;
-  bool failed_ = false;
-  std::vector<std::thread> threads_;
-};
+bool sync_file_system(const std::string &dir) {
+  const UniqueFd handle = safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY);
+  return handle && syncfs(handle.get()) == 0;
+}
 
 /** What is done with each file and directory of a walk. */
 class SyncWalk {
@@ -93,16 +55,18 @@ class SyncWalk {
   SyncWalk(std::string path, std::function<bool(const std::string &)> skipped)
       : path_(std::move(path)), skipped_(std::move(skipped)) {}
 
-  /** Visit everything; @p visit takes each descriptor. @return false when a place was not reached
+  /**
+   * Visit everything; @p visit takes each descriptor, and ends the walk when it answers false.
+   * @return true when every place was reached
    */
-  bool run(const std::function<void(UniqueFd)> &visit) {
+  bool run(const std::function<bool(UniqueFd)> &visit) {
     TreePlace place(safe_open(path_.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
     if (!place) return false;
     std::string path = path_;
     bool whole = true;
     std::vector<std::vector<std::string>> pending;
     pending.push_back(scan(place.fd(), path, visit, &whole));
-    while (true) {
+    while (!stopped_) {
       if (pending.back().empty()) {
         pending.pop_back();
         if (pending.empty()) return whole;
@@ -119,12 +83,18 @@ class SyncWalk {
       path += "/" + name;
       pending.push_back(scan(place.fd(), path, visit, &whole));
     }
+    return false;
   }
 
  private:
+  std::vector<std::string> stopped() {
+    stopped_ = true;
+    return {};
+  }
+
   /** One directory: its files and then itself. @return the directories in it */
   std::vector<std::string> scan(int dir, const std::string &path,
-                                const std::function<void(UniqueFd)> &visit, bool *whole) const {
+                                const std::function<bool(UniqueFd)> &visit, bool *whole) {
     std::vector<TreeEntry> entries;
     std::vector<std::string> folders;
     if (!list_tree_entries(dir, &entries)) *whole = false;
@@ -134,7 +104,7 @@ class SyncWalk {
       if (entry.type != DT_DIR) {
         UniqueFd file = safe_open_file_at(dir, entry.name.c_str(), &status);
         if (file) {
-          visit(std::move(file));
+          if (!visit(std::move(file))) return stopped();
           continue;
         }
         if (fstatat(dir, entry.name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) continue;
@@ -145,7 +115,7 @@ class SyncWalk {
     }
     UniqueFd itself(openat(dir, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (itself) {
-      visit(std::move(itself));
+      if (!visit(std::move(itself))) return stopped();
     } else {
       *whole = false;
     }
@@ -154,19 +124,24 @@ class SyncWalk {
 
   const std::string path_;
   const std::function<bool(const std::string &)> skipped_;
+  bool stopped_ = false;
 };
 
 }  // namespace
 
 bool sync_tree(const std::string &dir, const std::function<bool(const std::string &)> &skipped) {
   SyncWalk walk(dir, skipped);
-  // Everything is on its way before the first wait: one commit then serves many files.
-  bool whole = walk.run([](const UniqueFd &object) {
-    sync_file_range(object.get(), 0, 0, SYNC_FILE_RANGE_WRITE);  // only files; it is a hint
+  std::vector<UniqueFd> few;
+  const bool reached = walk.run([&](UniqueFd object) {
+    few.push_back(std::move(object));
+    return few.size() <= kFew;
   });
-  SyncPool pool;
-  if (!walk.run([&](UniqueFd object) { pool.add(std::move(object)); })) whole = false;
-  return pool.finish() && whole;
+  if (few.size() > kFew) return sync_file_system(dir);
+  // Everything is on its way before the first wait: one commit then serves many files.
+  for (const UniqueFd &object : few) {
+    sync_file_range(object.get(), 0, 0, SYNC_FILE_RANGE_WRITE);  // only files; it is a hint
+  }
+  return sync_each(few) && reached;
 }
 
 bool sync_directory(const std::string &dir) {

@@ -14,17 +14,27 @@ using ::testing::Return;
 extern "C" {
 int __real_fsync(int fd);
 int __wrap_fsync(int fd);
+int __real_syncfs(int fd);
+int __wrap_syncfs(int fd);
 }
 
 namespace {
 
 /** The disk takes nothing while this is set. */
 std::atomic<bool> disk_fails{false};
+std::atomic<int> file_system_syncs{0};
 
 }  // namespace
 
 int __wrap_fsync(int fd) {
   if (!disk_fails) return __real_fsync(fd);
+  errno = EIO;
+  return -1;
+}
+
+int __wrap_syncfs(int fd) {
+  ++file_system_syncs;
+  if (!disk_fails) return __real_syncfs(fd);
   errno = EIO;
   return -1;
 }
@@ -55,7 +65,7 @@ class FailureTest : public RestoreTest {
   }
   void expect_untouched() const { EXPECT_EQ(tree_of(root), before); }
 
-  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
+  std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
                                        {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
                                        {"data/added/deep/file", "added"},
                                        {"shared/data/pictures/one.jpg", "n", 0644},
@@ -180,6 +190,27 @@ TEST_F(FailureTest, DiskThatDoesNotTakeTheSnapshot) {
   disk_fails = false;
   expect_error("fail to make backup for (org.example.notes) before restore. err : 36");
   expect_untouched();
+}
+
+TEST_F(FailureTest, DiskThatDoesNotTakeManyFiles) {
+  for (int i = 0; i < 200; ++i) {
+    new_data.push_back({"data/many/" + std::to_string(i), std::to_string(i)});
+  }
+  file_system_syncs = 0;
+  {
+    const AtStep fails("restored", [] { disk_fails = true; });
+    const AtStep works("rollback", [] { disk_fails = false; });
+    EXPECT_EQ(restore(), 36);
+  }
+  expect_error("data of (org.example.notes) is not on the disk, so its snapshot is kept");
+  expect_untouched();
+  EXPECT_GT(file_system_syncs, 0);
+}
+
+TEST_F(FailureTest, AFewFilesAreSyncedWithoutWhatElseTheFileSystemHas) {
+  file_system_syncs = 0;
+  EXPECT_EQ(restore(), 0);
+  EXPECT_EQ(file_system_syncs, 0);
 }
 
 TEST_F(FailureTest, TableThatIsMissing) {
