@@ -20,7 +20,8 @@ enum class Stage {
   kStaying,
   kDraining,  /**< the name is given up, what has arrived is dispatched */
   kReturning, /**< the name is being asked for again */
-  kNameless   /**< another process has it; this one finishes its work */
+  kNameless,  /**< another process has it; this one finishes its work */
+  kLeaving    /**< the loop was quit, whatever is still asked for */
 };
 
 Stage stage = Stage::kStaying;
@@ -46,6 +47,7 @@ void stay() {
 }
 
 gboolean decide(gpointer) {
+  if (stage == Stage::kLeaving) return G_SOURCE_REMOVE;
   // One that has to go anyway has answered what came, and goes.
   if ((wanted || leave_when_idle) && is_idle_status()) {
     quarn_loop_quit();
@@ -87,7 +89,7 @@ void set_quarn_bus_name(const quarn_bus_name &name) {
 
 void begin_quarn_end() {
   wanted = true;
-  if (stage == Stage::kDraining || stage == Stage::kReturning) return;
+  if (stage == Stage::kDraining || stage == Stage::kReturning || stage == Stage::kLeaving) return;
   if (stage == Stage::kNameless || bus_name.give_up == nullptr) {
     quarn_loop_quit();
     return;
@@ -116,6 +118,8 @@ void end_quarn_when_idle() {
   leave_when_idle = true;
   watch_for_idle();
 }
+
+void leave_quarn_for_good() { stage = Stage::kLeaving; }
 
 bool is_answer_to_given_up_name(int signo) {
   return signo == SIGTERM && answer_expected.exchange(false);

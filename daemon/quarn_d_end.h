@@ -33,6 +33,12 @@ void note_quarn_name(bool owned);
 void end_quarn_when_idle();
 
 /**
+ * The process leaves whatever comes: an end that has begun is not taken back
+ * any more, for a name that it got then would bring calls that nobody answers.
+ */
+void leave_quarn_for_good();
+
+/**
  * Whether a signal is what the service manager sends a service for giving its
  * bus name up: it is no wish that the process should end. True once. Any thread.
  */

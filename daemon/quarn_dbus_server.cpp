@@ -613,6 +613,7 @@ void quarnd_dispatch_deferred() {
 }
 
 void quarnd_dbus_leave() {
+  leave_quarn_for_good();
   // The bus keeps the calls for a process that it has started until that process has the name.
   while (!name_settled) g_main_context_iteration(nullptr, TRUE);
   give_up_name();

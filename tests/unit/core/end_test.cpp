@@ -121,6 +121,18 @@ TEST_F(End, WorkThatHasArrivedKeepsTheDaemon) {
   EXPECT_EQ(lifecycle_quits, 0);
 }
 
+TEST_F(End, ProcessThatLeavesMeanwhileDoesNotAskForTheNameAgain) {
+  request_quarn_terminate(0.0, false);
+  cancel_quarn_terminate();
+  lifecycle_idle = false;
+  leave_quarn_for_good();
+  run_what_waits();
+  request_quarn_terminate(0.0, false);
+  run_what_waits();
+  EXPECT_EQ(steps, Texts{"give up"});
+  EXPECT_EQ(lifecycle_quits, 0);
+}
+
 TEST_F(End, WithTheNameBackTheNextEndBeginsAnew) {
   end_with_work_waiting();
   note_quarn_name(true);
