@@ -26,6 +26,7 @@ enum class Stage {
 Stage stage = Stage::kStaying;
 bool wanted = false;
 bool leave_when_idle = false;
+bool may_return = true;
 guint idle_check = 0;
 quarn_bus_name bus_name{nullptr, nullptr};
 
@@ -39,6 +40,8 @@ bool is_service() {
 }
 
 void stay() {
+  // Nobody would serve what the bus then delivers.
+  if (!may_return) return;
   LOGI("termination cancelled");
   stage = Stage::kReturning;
   wanted = false;
@@ -80,6 +83,7 @@ void set_quarn_bus_name(const quarn_bus_name &name) {
   stage = Stage::kStaying;
   wanted = false;
   leave_when_idle = false;
+  may_return = true;
   if (idle_check != 0) g_source_remove(idle_check);
   idle_check = 0;
   answer_expected = false;
@@ -100,6 +104,8 @@ void begin_quarn_end() {
 }
 
 void withdraw_quarn_end() { wanted = false; }
+
+void forbid_quarn_return() { may_return = false; }
 
 void note_quarn_name(bool owned) {
   if (stage != Stage::kReturning) return;

@@ -29,6 +29,9 @@ void withdraw_quarn_end();
 /** The answer of the bus to a request for the name. */
 void note_quarn_name(bool owned);
 
+/** The process is left now, whatever has arrived: from here on the name is not taken back. */
+void forbid_quarn_return();
+
 /** End as soon as the daemon is idle, without anyone asking for it. */
 void end_quarn_when_idle();
 

@@ -613,6 +613,8 @@ void quarnd_dispatch_deferred() {
 }
 
 void quarnd_dbus_leave() {
+  // An end that has begun by itself decides while what has arrived is dispatched here.
+  forbid_quarn_return();
   // The bus keeps the calls for a process that it has started until that process has the name.
   while (!name_settled) g_main_context_iteration(nullptr, TRUE);
   give_up_name();

@@ -558,6 +558,20 @@ TEST_F(Server, EndTakesTheNameBackForACallThatHadArrived) {
   EXPECT_EQ(std::count(steps.begin(), steps.end(), "quit"), 0);
 }
 
+TEST_F(Server, SignalDuringAnEndDoesNotTakeTheNameBackForACallThatHadArrived) {
+  const auto outcome = std::make_shared<CallOutcome>();
+  inside_handler = [] { withdraw_quarn_end(); };
+  client_->start_call("backup_enable", "(1,)", outcome);
+  client_->call_bus("GetId");
+  begin_quarn_end();
+  quarnd_dbus_leave();
+  g_dbus_connection_flush_sync(quarn_dbus_connection, nullptr, nullptr);
+  // Objects go next: what the bus delivered now would be answered by nobody.
+  EXPECT_EQ(client_->call("backup_enable", "(2,)").error_name,
+            "org.freedesktop.DBus.Error.ServiceUnknown");
+  EXPECT_EQ(outcome->reply, "(0,)");
+}
+
 TEST_F(Server, EndWithoutACallQuitsTheLoopWithoutTheName) {
   begin_quarn_end();
   EXPECT_TRUE(run_until([] { return !steps.empty(); }));

@@ -106,6 +106,16 @@ TEST_F(End, CallThatHasArrivedKeepsTheDaemonAndTheNameIsTakenBack) {
   EXPECT_EQ(count_logged(DLOG_INFO, "termination cancelled"), 1);
 }
 
+TEST_F(End, OnceTheProcessIsLeftTheNameIsNotTakenBack) {
+  request_quarn_terminate(0.0, false);
+  cancel_quarn_terminate();
+  lifecycle_idle = false;
+  forbid_quarn_return();
+  run_what_waits();
+  EXPECT_EQ(steps, Texts{"give up"});
+  EXPECT_EQ(count_logged(DLOG_INFO, "termination cancelled"), 0);
+}
+
 TEST_F(End, DeactivationThatHasArrivedLetsTheEndGoOn) {
   request_quarn_terminate(0.0, false);
   cancel_quarn_terminate();
