@@ -4,6 +4,8 @@
 
 #include <cerrno>
 #include <cstring>
+#include <string_view>
+#include <unordered_set>
 
 #include "lazy_xml.h"
 #include "quarn_d_utils/quarn_d_utils.h"
@@ -36,6 +38,52 @@ bool has_name(const xmlNode *node, const char *name) {
 }
 
 thread_local rules_state loaded_state = rules_state::none;
+
+/**
+ * The rules of one list by their text: an application may have thousands of
+ * rules and of files, and each file is asked about. It follows its list, which
+ * only grows until it is told to forget it.
+ */
+class RuleIndex {
+ public:
+  explicit RuleIndex(const std::vector<std::string> *list) : list_(list) {}
+
+  /** The list is being made anew, perhaps in the same place. */
+  void forget() {
+    rules_.clear();
+    first_ = nullptr;
+    count_ = 0;
+  }
+
+  /** Whether a rule names @p path, or a folder (with its slash) that it lies in. */
+  bool names(std::string_view path) {
+    follow();
+    if (rules_.empty()) return false;
+    if (rules_.count(path) != 0) return true;
+    for (std::size_t i = 0; i < path.size(); ++i) {
+      if (path[i] == '/' && rules_.count(path.substr(0, i + 1)) != 0) return true;
+    }
+    return false;
+  }
+
+ private:
+  void follow() {
+    if (list_->empty()) return forget();
+    if (list_->data() == first_ && list_->size() == count_) return;
+    rules_.clear();
+    rules_.insert(list_->begin(), list_->end());
+    first_ = list_->data();
+    count_ = list_->size();
+  }
+
+  const std::vector<std::string> *list_;
+  const std::string *first_ = nullptr;
+  std::size_t count_ = 0;
+  std::unordered_set<std::string_view> rules_;
+};
+
+thread_local RuleIndex included_rules(&backup_include_list);
+thread_local RuleIndex excluded_rules(&backup_exclude_list);
 
 /** The rules file's text; no more of it than kMaxRulesSize. @return loaded, ignored or too_large */
 rules_state read_rules(const char *path, std::string *text) {
@@ -188,6 +236,8 @@ RulesDoc load_rules(const char *path, rules_state *state) {
 void reset_backup_path_info() {
   backup_include_list.clear();
   backup_exclude_list.clear();
+  included_rules.forget();
+  excluded_rules.forget();
   xml_has_include_field = false;
   loaded_state = rules_state::none;
 }
@@ -232,14 +282,8 @@ bool is_child_file(const char *parent, const char *path) {
 }
 
 bool is_backup_file(const char *path) {
-  for (const auto &excluded : backup_exclude_list) {
-    if (excluded == path || is_child_file(excluded.c_str(), path)) return false;
-  }
-  if (!xml_has_include_field) return true;
-  for (const auto &included : backup_include_list) {
-    if (included == path || is_child_file(included.c_str(), path)) return true;
-  }
-  return false;
+  if (excluded_rules.names(path)) return false;
+  return !xml_has_include_field || included_rules.names(path);
 }
 
 std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, const char *root) {
