@@ -8,6 +8,7 @@
 #include <unordered_set>
 
 #include "lazy_xml.h"
+#include "quarn_d_utils/log_budget.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
@@ -162,33 +163,41 @@ void collect_rules(const xmlNode *element, const char *root) {
   }
 }
 
-std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path, int depth) {
+/** One walk: an application may have any number of links, and of what cannot be packed. */
+struct Walk {
+  WorkingFiles working;
+  LogBudget links;
+  LogBudget failures;
+};
+
+std::uint64_t measure(DirPtr dir, Walk *walk, std::string *path, int depth) {
   std::uint64_t sum = 0;
   while (const dirent *entry = readdir(dir.get())) {
     if (is_dot_entry(entry->d_name)) continue;
     const PathStep step(path, entry->d_name);
-    if (working.contain(*path)) continue;
+    if (walk->working.contain(*path)) continue;
     struct stat status = {};
     const int result = fstatat(dirfd(dir.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
     if (result != 0) {
-      LOGE("error : lstat for %d %s", result, path->c_str());
+      if (walk->failures.take()) LOGE("error : lstat for %d %s", result, path->c_str());
     } else if (S_ISDIR(status.st_mode)) {
       DirPtr child;
       if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), entry->d_name);
       if (child == nullptr) {
-        LOGE("error : cannot open this path %s", path->c_str());
+        if (walk->failures.take()) LOGE("error : cannot open this path %s", path->c_str());
         sum += kUnmeasurableSize;
       } else {
-        sum += measure(std::move(child), working, path, depth + 1);
+        sum += measure(std::move(child), walk, path, depth + 1);
       }
     } else if (S_ISREG(status.st_mode)) {
       if (is_backup_file(path->c_str())) sum += static_cast<std::uint64_t>(status.st_size);
     } else if (S_ISLNK(status.st_mode)) {
-      if (is_backup_file(path->c_str())) {
-        sum += static_cast<std::uint64_t>(status.st_size);
+      if (!is_backup_file(path->c_str())) continue;
+      sum += static_cast<std::uint64_t>(status.st_size);
+      if (walk->links.take()) {
         LOGI("size of lnk file %s : %d", path->c_str(), static_cast<int>(status.st_size));
       }
-    } else {
+    } else if (walk->failures.take()) {
       LOGE("this is unexpected type : %s", path->c_str());
     }
   }
@@ -292,7 +301,7 @@ std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, cons
     LOGE("error : cannot open this path %s", dir_path);
     return kUnmeasurableSize;
   }
-  const WorkingFiles working(pkg_id, root);
+  Walk walk{WorkingFiles(pkg_id, root), LogBudget(dir_path), LogBudget(dir_path)};
   std::string path = dir_path;
-  return measure(std::move(dir), working, &path, 1);
+  return measure(std::move(dir), &walk, &path, 1);
 }

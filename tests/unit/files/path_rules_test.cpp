@@ -78,6 +78,23 @@ TEST_F(PathRules, ThousandsOfRulesMakeNoFileDearer) {
   EXPECT_LT(many, 50 * few) << "a thousand times as many rules";
 }
 
+TEST_F(PathRules, AnyNumberOfLinksAndOfOddFilesIsToldInFewLines) {
+  root_.dir("data/links");
+  root_.dir("data/pipes");
+  for (int i = 0; i < 250; ++i) {
+    root_.link("data/links/" + std::to_string(i), "12345");
+    ASSERT_EQ(mkfifo((root_ / ("data/pipes/" + std::to_string(i))).c_str(), 0600), 0);
+  }
+  EXPECT_EQ(size(), 250U * 5);
+  const std::string left_out = "150 more such lines on " + (root_ / "data") + " are left out";
+  EXPECT_EQ(count_logged(DLOG_WARN, left_out), 2);
+  EXPECT_EQ(captured_log().size(), 202U);
+  clear_captured_log();
+  // The next walk tells its own.
+  EXPECT_EQ(size(), 250U * 5);
+  EXPECT_EQ(captured_log().size(), 202U);
+}
+
 TEST_F(PathRules, RulesOfTheNextPackageReplaceThoseOfTheLast) {
   for (const char *name : {"a", "b", "c"}) {
     reset_backup_path_info();
