@@ -20,6 +20,7 @@
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
+#include "quarn_d_utils/kernel_settings.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
@@ -198,6 +199,7 @@ int quarn_run() {
     LOGI("no signed-in. Daemon stop");
     return 0;
   }
+  tell_kernel_settings();
   ignore_messages();
   signals_watched = quarn_loop_watch_signals(
       {take_signal, quarn_dbus_stop_waiting, end_by_signal, tell_waiting_clients, kSignalGrace});

@@ -50,8 +50,15 @@ class Failure : public std::runtime_error {
   const int code;
 };
 
-/** The absolute path of an existing device; fails when DIR is none. */
+/** The absolute path of an existing device; fails when DIR is none, or one that others can change.
+ */
 std::string open_device(const std::string &dir);
+
+/** Fails where anybody but this user could change what lies in @p path. */
+void check_own_folder(const std::string &path);
+
+/** What the device keeps is nobody else's to read, nor to lock; the way to its bus stays open. */
+void close_folders(const std::string &device);
 
 /** The directory that this program lies in. */
 std::string program_directory();

@@ -675,6 +675,7 @@ int verb_start(const Arguments &arguments) {
   if ((device + "/").compare(0, sizeof kAppsPath, std::string(kAppsPath) + "/") == 0) {
     throw Failure(std::string("a device cannot lie below ") + kAppsPath + ", which it covers");
   }
+  close_folders(device);
   end_leftovers(device, "");
   forget_tmp_entries(device);
   embedded::sweep_state(device);

@@ -109,7 +109,16 @@ std::string open_device(const std::string &dir) {
   if (stat((device + "/state/device.ini").c_str(), &status) != 0) {
     throw Failure("no device in " + dir);
   }
+  for (const char *folder : {"", "/state", "/run", "/root"}) check_own_folder(device + folder);
   return device;
+}
+
+void check_own_folder(const std::string &path) {
+  struct stat status {};
+  if (lstat(path.c_str(), &status) != 0) throw Failure("cannot look at " + path + ": " + reason());
+  if (!S_ISDIR(status.st_mode)) throw Failure(path + " is no directory");
+  if (status.st_uid != geteuid()) throw Failure(path + " is not this user's own");
+  if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) throw Failure("others may write to " + path);
 }
 
 int main(int argc, char **argv) {

@@ -29,6 +29,8 @@ constexpr char kDefaultModel[] = "Orvane Embedded";
 constexpr char kDefaultAccount[] = "user";
 constexpr gint64 kFireMicroseconds = 20000000;
 constexpr std::int64_t kMillisInSecond = 1000;
+/** Others pass through to the bus. */
+constexpr mode_t kDeviceMode = 0711;
 constexpr gulong kFirePauseMicroseconds = 5000;
 
 /** An IMEI: 14 digits of the device's own and their check digit. */
@@ -151,6 +153,24 @@ void set_clock(const std::string &device, const std::string &value) {
 
 }  // namespace
 
+void close_folders(const std::string &device) {
+  struct Place {
+    const char *name;
+    mode_t most;
+  };
+  constexpr Place kPlaces[] = {
+      {"state", 0700}, {"log", 0700}, {"cloud", 0700}, {"run", 0711}, {"state/.lock", 0600}};
+  for (const Place &place : kPlaces) {
+    const std::string path = device + "/" + place.name;
+    struct stat status {};
+    if (lstat(path.c_str(), &status) != 0 || S_ISLNK(status.st_mode)) continue;
+    const mode_t mode = status.st_mode & 07777;
+    if ((mode & ~place.most) != 0 && chmod(path.c_str(), mode & place.most) != 0) {
+      throw Failure("cannot close " + path + ": " + reason());
+    }
+  }
+}
+
 int verb_create(const Arguments &arguments) {
   if (arguments.empty() || arguments[0].empty() || arguments[0][0] == '-') wrong_use();
   std::string model = kDefaultModel;
@@ -188,6 +208,10 @@ int verb_create(const Arguments &arguments) {
   if (fs::exists(dir, error) && !(fs::is_directory(dir, error) && fs::is_empty(dir, error))) {
     throw Failure(arguments[0] + " is there already and not empty");
   }
+  const bool made = fs::create_directories(dir, error);
+  if (error) throw Failure("cannot make " + dir.string() + ": " + error.message());
+  check_own_folder(dir);
+  if (made) chmod(dir.c_str(), kDeviceMode);
   for (const char *folder : {"root/opt/usr/apps", "root/tmp", "run", "log", "cloud",
                              "state/packages", "state/apps", "state/.tmp"}) {
     fs::create_directories(dir / folder, error);
@@ -195,7 +219,7 @@ int verb_create(const Arguments &arguments) {
   }
   const std::string device = fs::canonical(dir).string();
   chmod((device + "/root/tmp").c_str(), 01777);
-  chmod((device + "/cloud").c_str(), 0700);
+  close_folders(device);
 
   set_fact(device, embedded::kModel, model);
   set_fact(device, embedded::kSerial, serial.empty() ? new_serial() : serial);

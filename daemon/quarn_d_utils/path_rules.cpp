@@ -4,8 +4,11 @@
 
 #include <cerrno>
 #include <cstring>
+#include <string_view>
+#include <unordered_set>
 
 #include "lazy_xml.h"
+#include "quarn_d_utils/log_budget.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
@@ -36,6 +39,52 @@ bool has_name(const xmlNode *node, const char *name) {
 }
 
 thread_local rules_state loaded_state = rules_state::none;
+
+/**
+ * The rules of one list by their text: an application may have thousands of
+ * rules and of files, and each file is asked about. It follows its list, which
+ * only grows until it is told to forget it.
+ */
+class RuleIndex {
+ public:
+  explicit RuleIndex(const std::vector<std::string> *list) : list_(list) {}
+
+  /** The list is being made anew, perhaps in the same place. */
+  void forget() {
+    rules_.clear();
+    first_ = nullptr;
+    count_ = 0;
+  }
+
+  /** Whether a rule names @p path, or a folder (with its slash) that it lies in. */
+  bool names(std::string_view path) {
+    follow();
+    if (rules_.empty()) return false;
+    if (rules_.count(path) != 0) return true;
+    for (std::size_t i = 0; i < path.size(); ++i) {
+      if (path[i] == '/' && rules_.count(path.substr(0, i + 1)) != 0) return true;
+    }
+    return false;
+  }
+
+ private:
+  void follow() {
+    if (list_->empty()) return forget();
+    if (list_->data() == first_ && list_->size() == count_) return;
+    rules_.clear();
+    rules_.insert(list_->begin(), list_->end());
+    first_ = list_->data();
+    count_ = list_->size();
+  }
+
+  const std::vector<std::string> *list_;
+  const std::string *first_ = nullptr;
+  std::size_t count_ = 0;
+  std::unordered_set<std::string_view> rules_;
+};
+
+thread_local RuleIndex included_rules(&backup_include_list);
+thread_local RuleIndex excluded_rules(&backup_exclude_list);
 
 /** The rules file's text; no more of it than kMaxRulesSize. @return loaded, ignored or too_large */
 rules_state read_rules(const char *path, std::string *text) {
@@ -114,33 +163,41 @@ void collect_rules(const xmlNode *element, const char *root) {
   }
 }
 
-std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path, int depth) {
+/** One walk: an application may have any number of links, and of what cannot be packed. */
+struct Walk {
+  WorkingFiles working;
+  LogBudget links;
+  LogBudget failures;
+};
+
+std::uint64_t measure(DirPtr dir, Walk *walk, std::string *path, int depth) {
   std::uint64_t sum = 0;
   while (const dirent *entry = readdir(dir.get())) {
     if (is_dot_entry(entry->d_name)) continue;
     const PathStep step(path, entry->d_name);
-    if (working.contain(*path)) continue;
+    if (walk->working.contain(*path)) continue;
     struct stat status = {};
     const int result = fstatat(dirfd(dir.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
     if (result != 0) {
-      LOGE("error : lstat for %d %s", result, path->c_str());
+      if (walk->failures.take()) LOGE("error : lstat for %d %s", result, path->c_str());
     } else if (S_ISDIR(status.st_mode)) {
       DirPtr child;
       if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), entry->d_name);
       if (child == nullptr) {
-        LOGE("error : cannot open this path %s", path->c_str());
+        if (walk->failures.take()) LOGE("error : cannot open this path %s", path->c_str());
         sum += kUnmeasurableSize;
       } else {
-        sum += measure(std::move(child), working, path, depth + 1);
+        sum += measure(std::move(child), walk, path, depth + 1);
       }
     } else if (S_ISREG(status.st_mode)) {
       if (is_backup_file(path->c_str())) sum += static_cast<std::uint64_t>(status.st_size);
     } else if (S_ISLNK(status.st_mode)) {
-      if (is_backup_file(path->c_str())) {
-        sum += static_cast<std::uint64_t>(status.st_size);
+      if (!is_backup_file(path->c_str())) continue;
+      sum += static_cast<std::uint64_t>(status.st_size);
+      if (walk->links.take()) {
         LOGI("size of lnk file %s : %d", path->c_str(), static_cast<int>(status.st_size));
       }
-    } else {
+    } else if (walk->failures.take()) {
       LOGE("this is unexpected type : %s", path->c_str());
     }
   }
@@ -188,6 +245,8 @@ RulesDoc load_rules(const char *path, rules_state *state) {
 void reset_backup_path_info() {
   backup_include_list.clear();
   backup_exclude_list.clear();
+  included_rules.forget();
+  excluded_rules.forget();
   xml_has_include_field = false;
   loaded_state = rules_state::none;
 }
@@ -232,14 +291,8 @@ bool is_child_file(const char *parent, const char *path) {
 }
 
 bool is_backup_file(const char *path) {
-  for (const auto &excluded : backup_exclude_list) {
-    if (excluded == path || is_child_file(excluded.c_str(), path)) return false;
-  }
-  if (!xml_has_include_field) return true;
-  for (const auto &included : backup_include_list) {
-    if (included == path || is_child_file(included.c_str(), path)) return true;
-  }
-  return false;
+  if (excluded_rules.names(path)) return false;
+  return !xml_has_include_field || included_rules.names(path);
 }
 
 std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, const char *root) {
@@ -248,7 +301,7 @@ std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, cons
     LOGE("error : cannot open this path %s", dir_path);
     return kUnmeasurableSize;
   }
-  const WorkingFiles working(pkg_id, root);
+  Walk walk{WorkingFiles(pkg_id, root), LogBudget(dir_path), LogBudget(dir_path)};
   std::string path = dir_path;
-  return measure(std::move(dir), working, &path, 1);
+  return measure(std::move(dir), &walk, &path, 1);
 }

@@ -20,6 +20,8 @@ namespace embedded {
 namespace {
 
 constexpr mode_t kStateMode = 0644;
+// Whoever can open it can hold it.
+constexpr mode_t kLockMode = 0600;
 // Temporary files have a folder of their own: the one that is watched sees whole files only.
 constexpr char kTemporaryFolder[] = ".tmp";
 constexpr char kLockFile[] = ".lock";
@@ -140,7 +142,7 @@ bool write_state(const std::string &device, const std::string &file, GKeyFile *c
 StateLock::StateLock(const std::string &device)
     : fd_(device.empty() ? -1
                          : open(state_path(device, kLockFile).c_str(),
-                                O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kStateMode)) {
+                                O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode)) {
   if (fd_ >= 0 && TEMP_FAILURE_RETRY(flock(fd_, LOCK_EX)) != 0) {
     close(fd_);
     fd_ = -1;

@@ -21,6 +21,7 @@
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
+#include "quarn_d_utils/kernel_settings.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
@@ -69,6 +70,11 @@ int quarn_exit_code = 0;
 bool server_util_is_account_exist() {
   step("account");
   return account;
+}
+int tell_kernel_settings(const char *settings) {
+  EXPECT_STREQ(settings, "/proc/sys");
+  step("kernel_settings");
+  return 0;
 }
 bool quarn_loop_watch_signals(const quarn_signal_watch &watch) {
   step("watch_signals");
@@ -232,6 +238,7 @@ TEST_F(Main, RunsItsStepsInOrder) {
   EXPECT_EQ(quarn_run(), 0);
   EXPECT_EQ(captured_texts(), (Texts{"Quarn Daemon start",
                                      "account",
+                                     "kernel_settings",
                                      "watch_signals",
                                      "begin_turn",
                                      "sweep but /tmp/quarn/lock",

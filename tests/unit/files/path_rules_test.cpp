@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <chrono>
+#include <ctime>
 #include <thread>
 
 #include "fault.h"
@@ -50,6 +51,75 @@ class PathRules : public ::testing::Test {
 
   TempDir root_;
 };
+
+/** Nanoseconds of this thread that it takes to ask about many files. */
+std::int64_t time_of_questions() {
+  timespec before{};
+  timespec after{};
+  clock_gettime(CLOCK_THREAD_CPUTIME_ID, &before);
+  for (int i = 0; i < 3000; ++i) {
+    EXPECT_TRUE(is_backup_file(("/opt/usr/apps/one/data/deep/file" + std::to_string(i)).c_str()));
+  }
+  clock_gettime(CLOCK_THREAD_CPUTIME_ID, &after);
+  return (after.tv_sec - before.tv_sec) * 1000000000L + after.tv_nsec - before.tv_nsec;
+}
+
+TEST_F(PathRules, ThousandsOfRulesMakeNoFileDearer) {
+  const auto use_rules = [](int count) {
+    reset_backup_path_info();
+    for (int i = 0; i < count; ++i) {
+      backup_exclude_list.push_back("/opt/usr/apps/one/data/deep/cache" + std::to_string(i) + "/");
+    }
+  };
+  use_rules(8);
+  const std::int64_t few = time_of_questions();
+  use_rules(8000);
+  const std::int64_t many = time_of_questions();
+  EXPECT_LT(many, 50 * few) << "a thousand times as many rules";
+}
+
+TEST_F(PathRules, AnyNumberOfLinksAndOfOddFilesIsToldInFewLines) {
+  root_.dir("data/links");
+  root_.dir("data/pipes");
+  for (int i = 0; i < 250; ++i) {
+    root_.link("data/links/" + std::to_string(i), "12345");
+    ASSERT_EQ(mkfifo((root_ / ("data/pipes/" + std::to_string(i))).c_str(), 0600), 0);
+  }
+  EXPECT_EQ(size(), 250U * 5);
+  const std::string left_out = "150 more such lines on " + (root_ / "data") + " are left out";
+  EXPECT_EQ(count_logged(DLOG_WARN, left_out), 2);
+  EXPECT_EQ(captured_log().size(), 202U);
+  clear_captured_log();
+  // The next walk tells its own.
+  EXPECT_EQ(size(), 250U * 5);
+  EXPECT_EQ(captured_log().size(), 202U);
+}
+
+TEST_F(PathRules, RulesOfTheNextPackageReplaceThoseOfTheLast) {
+  for (const char *name : {"a", "b", "c"}) {
+    reset_backup_path_info();
+    backup_exclude_list.push_back(std::string("/root/data/") + name);
+    for (const char *other : {"a", "b", "c"}) {
+      const std::string path = std::string("/root/data/") + other;
+      EXPECT_EQ(is_backup_file(path.c_str()), std::string(name) != other);
+    }
+  }
+}
+
+TEST_F(PathRules, AFolderIsNamedWithItsSlashAlone) {
+  backup_exclude_list = {"/root/data/cache/", "/root/data/logs"};
+  EXPECT_FALSE(is_backup_file("/root/data/cache/"));
+  EXPECT_FALSE(is_backup_file("/root/data/cache/deep/er/file"));
+  EXPECT_TRUE(is_backup_file("/root/data/cache"));
+  EXPECT_TRUE(is_backup_file("/root/data/cache2/file"));
+  EXPECT_FALSE(is_backup_file("/root/data/logs"));
+  EXPECT_TRUE(is_backup_file("/root/data/logs/file"));
+  xml_has_include_field = true;
+  EXPECT_FALSE(is_backup_file("/root/data/kept/file"));
+  backup_include_list = {"/root/data/kept/", "/root/data/cache/"};
+  EXPECT_TRUE(is_backup_file("/root/data/kept/file"));
+  EXPECT_FALSE(is_backup_file("/root/data/cache/file")) << "what is excluded stays so";
+}
 
 TEST_F(PathRules, WithoutARulesFileEverythingIsTaken) {
   root_.file("data/a", "12345");
