@@ -26,7 +26,7 @@ bool cloud_ready = true;
 int list_result = 0;
 int callback_result = 0;
 std::int64_t present_time = 0;
-int marker = 0;
+client_cb_data marker{7, ":1.1"};
 void *const record = &marker;
 
 std::string number(long long value) { return std::to_string(value); }
