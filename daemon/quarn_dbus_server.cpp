@@ -1,6 +1,7 @@
 #include "quarn_dbus_server.h"
 
 #include <gio/gio.h>
+#include <malloc.h>
 
 #include <algorithm>
 #include <atomic>
@@ -475,6 +476,10 @@ struct Passed {
 /** Calls that the bus library answers and that have no answer yet. */
 unsigned int forwarded_calls = 0;
 
+bool wants_no_reply(GDBusMessage *call) {
+  return (g_dbus_message_get_flags(call) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0;
+}
+
 struct Forwarded {
   MessagePtr call;
 };
@@ -482,6 +487,7 @@ struct Forwarded {
 void on_library_answer(GObject *bus, GAsyncResult *result, gpointer data) {
   const std::unique_ptr<Forwarded> forwarded(static_cast<Forwarded *>(data));
   --forwarded_calls;
+  if (wants_no_reply(forwarded->call.get())) return;
   GErrorPtr error;
   const MessagePtr reply(
       g_dbus_connection_send_message_with_reply_finish(G_DBUS_CONNECTION(bus), result, out(error)));
@@ -490,7 +496,8 @@ void on_library_answer(GObject *bus, GAsyncResult *result, gpointer data) {
     answer.reset(g_dbus_message_new_method_reply(forwarded->call.get()));
     g_dbus_message_set_body(answer.get(), g_dbus_message_get_body(reply.get()));
   } else {
-    const GString_ name(g_dbus_error_encode_gerror(error.get()));
+    GString_ name(g_dbus_error_get_remote_error(error.get()));
+    if (!name) name.reset(g_dbus_error_encode_gerror(error.get()));
     g_dbus_error_strip_remote_error(error.get());
     answer.reset(
         g_dbus_message_new_method_error_literal(forwarded->call.get(), name.get(), error->message));
@@ -522,6 +529,7 @@ void serve_raw(RawCall &call, GDBusConnection *connection, GDBusMessage *message
   if (form == quarn_call_form::of_other_object) return forward_to_library(connection, message);
   if (form == quarn_call_form::too_large) {
     cancel_quarn_terminate();
+    malloc_trim(0);  // what held the arguments
     return call.refuse(G_DBUS_ERROR_INVALID_ARGS, kArgumentsTooLarge);
   }
   if (form == quarn_call_form::other_arguments) {
@@ -602,6 +610,8 @@ bool is_own_message(GDBusConnection *connection, GDBusMessage *message) {
 /** The same call without its arguments, which nobody is to hold while it waits. */
 MessagePtr without_body(GDBusMessage *message) {
   MessagePtr copy(g_dbus_message_copy(message, nullptr));
+  // What cannot be copied (it brings descriptors) is kept as it is.
+  if (!copy) return MessagePtr(G_DBUS_MESSAGE(g_object_ref(message)));
   g_dbus_message_set_body(copy.get(), nullptr);
   return copy;
 }

@@ -412,6 +412,17 @@ TEST_F(Main, CallsThatWaitForTheEarlierProcessKeepTheDaemonAndFollowIt) {
   EXPECT_EQ(on_turn, quarnd_dispatch_deferred);
 }
 
+TEST_F(Main, CallsThatAreNotJudgedYetAndAnswersThatAreAwaitedKeepTheDaemon) {
+  quarn_run();
+  backups_outstanding = false;
+  for (bool *const work : {&calls_unjudged, &answers_awaited}) {
+    EXPECT_FALSE(pending_probe());
+    *work = true;
+    EXPECT_TRUE(pending_probe());
+    *work = false;
+  }
+}
+
 TEST_F(Main, InitTwiceLogsAndAsksForTheBusOnce) {
   init_quarn();
   EXPECT_EQ(quarn_started, 1);
