@@ -1,7 +1,6 @@
 #include "quarn_dbus_server.h"
 
 #include <gio/gio.h>
-#include <malloc.h>
 
 #include <algorithm>
 #include <atomic>
@@ -529,7 +528,6 @@ void serve_raw(RawCall &call, GDBusConnection *connection, GDBusMessage *message
   if (form == quarn_call_form::of_other_object) return forward_to_library(connection, message);
   if (form == quarn_call_form::too_large) {
     cancel_quarn_terminate();
-    malloc_trim(0);  // what held the arguments
     return call.refuse(G_DBUS_ERROR_INVALID_ARGS, kArgumentsTooLarge);
   }
   if (form == quarn_call_form::other_arguments) {
