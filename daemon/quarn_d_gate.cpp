@@ -94,11 +94,6 @@ EntryPtr entry_of(GDBusConnection *connection, const std::string &sender) {
   auto entry = std::make_shared<connection_entry>();
   entry->age = ++last_age;
   entry->connection = connection;
-  if (connection != nullptr) {
-    entry->subscription = g_dbus_connection_signal_subscribe(
-        connection, kBusName, kBusName, "NameOwnerChanged", kBusPath, sender.c_str(),
-        G_DBUS_SIGNAL_FLAGS_NONE, on_left, nullptr, nullptr);
-  }
   const std::lock_guard<std::mutex> lock(entries_mutex);
   entries[sender] = entry;
   return entry;
@@ -112,6 +107,15 @@ void drain(const EntryPtr &entry) {
   }
 }
 
+/** Hear of a connection's end; after its answers, which nothing is to delay. */
+void watch(const std::string &sender, const EntryPtr &entry) {
+  const auto found = entries.find(sender);
+  if (entry->connection == nullptr || found == entries.end() || found->second != entry) return;
+  entry->subscription = g_dbus_connection_signal_subscribe(
+      entry->connection, kBusName, kBusName, "NameOwnerChanged", kBusPath, sender.c_str(),
+      G_DBUS_SIGNAL_FLAGS_NONE, on_left, nullptr, nullptr);
+}
+
 void take_answer(const std::string &sender, const EntryPtr &entry, const quarn_caller &caller) {
   {
     const std::lock_guard<std::mutex> lock(entries_mutex);
@@ -119,8 +123,11 @@ void take_answer(const std::string &sender, const EntryPtr &entry, const quarn_c
     entry->told = true;
   }
   drain(entry);
-  // It is asked for again, should it call again.
-  if (!caller.known) drop(sender);
+  if (caller.known) {
+    watch(sender, entry);
+  } else {
+    drop(sender);  // it is asked for again, should it call again
+  }
 }
 
 struct question {

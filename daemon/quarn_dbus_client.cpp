@@ -51,8 +51,10 @@ std::set<GCancellable *> &awaited = *new std::set<GCancellable *>;
 /** Milliseconds between the looks whether others have waited for long enough. */
 constexpr guint kPatienceCheckMs = 1000;
 std::atomic<callback_patience> patience{nullptr};
-std::atomic<std::int64_t> waited_us{0};
-std::atomic<std::int64_t> waiting_since_us{0};
+/** Guards the two that follow. */
+std::mutex &time_mutex = *new std::mutex;
+std::int64_t waited_us = 0;
+std::int64_t waiting_since_us = 0; /**< of the wait that stands; 0: none */
 
 std::thread::id main_thread;
 /** By client, the fibers of the main thread that wait for its answer; of all in the other. */
@@ -129,10 +131,20 @@ using SentCallPtr = std::shared_ptr<SentCall>;
 /** Counts the time of a wait that nothing else is done in. */
 class TimedWait {
  public:
-  TimedWait() { waiting_since_us = g_get_monotonic_time(); }
-  ~TimedWait() { waited_us += g_get_monotonic_time() - waiting_since_us.exchange(0); }
+  TimedWait() : since_us_(g_get_monotonic_time()) {
+    const std::lock_guard<std::mutex> lock(time_mutex);
+    waiting_since_us = since_us_;
+  }
+  ~TimedWait() {
+    const std::lock_guard<std::mutex> lock(time_mutex);
+    waited_us += g_get_monotonic_time() - since_us_;
+    waiting_since_us = 0;
+  }
   TimedWait(const TimedWait &) = delete;
   TimedWait &operator=(const TimedWait &) = delete;
+
+ private:
+  const std::int64_t since_us_;
 };
 
 /** Off the main thread: nothing else is done here meanwhile. */
@@ -392,8 +404,8 @@ bool quarn_dbus_answers_awaited() { return requests_awaiting != 0; }
 void quarn_dbus_set_patience(callback_patience exhausted) { patience = exhausted; }
 
 std::int64_t quarn_dbus_time_waited() {
-  const std::int64_t since = waiting_since_us;
-  return waited_us + (since == 0 ? 0 : g_get_monotonic_time() - since);
+  const std::lock_guard<std::mutex> lock(time_mutex);
+  return waited_us + (waiting_since_us == 0 ? 0 : g_get_monotonic_time() - waiting_since_us);
 }
 
 bool quarn_dbus_waiting_stopped() { return waiting_stopped; }
