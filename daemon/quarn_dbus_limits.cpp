@@ -22,6 +22,10 @@ std::string excess_of_name(const char *what, const char *text) {
 
 }  // namespace
 
+std::size_t most_argument_bytes(const char *member) {
+  return g_strcmp0(member, "restore_enable") == 0 ? kMostListArgumentBytes : kMostArgumentBytes;
+}
+
 std::size_t most_elements_of(const char *text) {
   std::size_t commas = 0;
   bool quoted = false;

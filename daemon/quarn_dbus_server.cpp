@@ -528,6 +528,8 @@ void serve_raw(RawCall &call, GDBusConnection *connection, GDBusMessage *message
   if (form == quarn_call_form::of_other_object) return forward_to_library(connection, message);
   if (form == quarn_call_form::too_large) {
     cancel_quarn_terminate();
+    LOGE("refused : %s of (%s) : %s", call.method().c_str(), call.sender().c_str(),
+         kArgumentsTooLarge);
     return call.refuse(G_DBUS_ERROR_INVALID_ARGS, kArgumentsTooLarge);
   }
   if (form == quarn_call_form::other_arguments) {
@@ -616,7 +618,8 @@ MessagePtr without_body(GDBusMessage *message) {
 
 quarn_call_form form_of_call(const GDBusNodeInfo *node, GDBusMessage *message) {
   GVariant *const body = g_dbus_message_get_body(message);
-  if (body != nullptr && g_variant_get_size(body) > kMostArgumentBytes) {
+  if (body != nullptr &&
+      g_variant_get_size(body) > most_argument_bytes(g_dbus_message_get_member(message))) {
     return quarn_call_form::too_large;
   }
   if (g_strcmp0(g_dbus_message_get_path(message), kQuarnObjectPath) != 0 ||

@@ -372,11 +372,17 @@ TEST_F(Callers, ListsAndNamesAreBoundedBeforeARecordIsMade) {
 TEST_F(Callers, ArgumentsThatNobodyWouldReadAreNotKept) {
   told_ = {true, 0, {}, ""};
   const std::string large(kMostArgumentBytes, 'a');
+  const std::string list(kMostListArgumentBytes, 'a');
   for (const char *interface : {"org.orvane.Quarn", "org.example.Other"}) {
     const CallOutcome outcome = client_->call("auto_backup_start", "('" + large + "',)", interface);
     EXPECT_EQ(outcome.error_name, kInvalid);
-    EXPECT_EQ(outcome.error_text, "The arguments are larger than 524288 bytes");
+    EXPECT_EQ(outcome.error_text, "The arguments are too large");
   }
+  EXPECT_EQ(client_->call("restore_enable", "(1, 0, '', '" + list + "', uint32 1)").error_text,
+            "The arguments are too large");
+  EXPECT_EQ(count_logged(DLOG_ERROR, "refused : restore_enable of (" + client_->name() +
+                                         ") : The arguments are too large"),
+            1);
   told_ = application("");
   ScriptedClient stranger;
   EXPECT_EQ(stranger.call("auto_backup_start", "('" + large + "',)").error_name, kDenied);
