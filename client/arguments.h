@@ -19,7 +19,7 @@ enum exit_code : int {
   EXIT_DAEMON_ENDED = 70, /**< the daemon ended before it had answered */
   EXIT_TIMED_OUT = 75,    /**< no answer in time */
   EXIT_PROTOCOL = 76,     /**< an answer that this program cannot use */
-  EXIT_DENIED = 77,       /**< the bus does not allow the call */
+  EXIT_DENIED = 77,       /**< this user may not ask for it */
   EXIT_INTERRUPTED = 130  /**< left on an interrupt without waiting for the end */
 };
 

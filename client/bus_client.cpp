@@ -116,8 +116,13 @@ BusFailure failure_of(GError *error) {
   const auto is = [error](GDBusError code) {
     return g_error_matches(error, G_DBUS_ERROR, code) != FALSE;
   };
-  if (is(G_DBUS_ERROR_ACCESS_DENIED) || is(G_DBUS_ERROR_AUTH_FAILED)) {
-    return {BusFailure::Kind::denied, "the bus does not allow the call: " + text};
+  if (is(G_DBUS_ERROR_ACCESS_DENIED)) {
+    return {
+        BusFailure::Kind::denied,
+        std::string("not permitted: this needs root, or to be in the group ") + QUARN_CLIENT_GROUP};
+  }
+  if (is(G_DBUS_ERROR_AUTH_FAILED)) {
+    return {BusFailure::Kind::denied, "the bus does not accept this user: " + text};
   }
   if (is(G_DBUS_ERROR_NO_REPLY)) {
     return {BusFailure::Kind::daemon_ended, "the daemon ended before it had answered"};

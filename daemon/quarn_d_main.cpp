@@ -57,6 +57,7 @@ bool ended_by_signal = false;
 gboolean cancel_backups(gpointer) {
   LOGI("cancel from the next process");
   manual_backup_canceled = true;
+  quarnd_cancel_starting_backups(nullptr);
   cancel_backup(nullptr);
   return G_SOURCE_REMOVE;
 }
@@ -129,6 +130,11 @@ void install_signal_handlers() {
 
 bool request_pending() { return backup_request_outstanding() || quarnd_calls_deferred(); }
 
+/** Whether a call or a request stands, or its client's answer is waited for. */
+bool work_pending() {
+  return request_pending() || quarnd_calls_unjudged() || quarn_dbus_answers_awaited();
+}
+
 /** An idle process keeps its turn for as long as it has the bus name. */
 gboolean ask_for_turn(gpointer) {
   if (is_quarn_turn()) return G_SOURCE_REMOVE;
@@ -146,7 +152,7 @@ void export_objects(GDBusConnection *connection) {
 /** Lower floors learn how to ask the upper ones. */
 void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
-  set_pending_request_probe(request_pending);
+  set_pending_request_probe(work_pending);
   set_restore_disable(disable_restore);
   set_boot_recovery(recover_device);
   set_bus_acquired_hook(export_objects);

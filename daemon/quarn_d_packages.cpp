@@ -1,5 +1,6 @@
 #include "quarn_d_packages.h"
 
+#include "quarn_d_gate.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
@@ -21,15 +22,30 @@ namespace {
 GDBusConnection *packages_connection = nullptr;
 guint packages_registration = 0;
 
-/** GDBus has compared name and arguments with the introspection data. */
-void on_method(GDBusConnection *, const gchar *sender, const gchar *, const gchar *, const gchar *,
-               GVariant *, GDBusMethodInvocation *invocation, gpointer) {
-  cancel_quarn_terminate();
-  const std::string caller = sender == nullptr ? "" : sender;
+void withdraw_own(const quarn_caller &who, GDBusMethodInvocation *invocation) {
+  const std::string sender = g_dbus_method_invocation_get_sender(invocation);
+  const quarn_subject subject =
+      subject_of_call(g_dbus_method_invocation_get_interface_name(invocation),
+                      g_dbus_method_invocation_get_method_name(invocation), nullptr);
+  const caller_verdict verdict = judge_call(who, sender, subject, false);
+  if (!verdict.allowed) {
+    g_dbus_method_invocation_return_error_literal(invocation, G_DBUS_ERROR,
+                                                  G_DBUS_ERROR_ACCESS_DENIED,
+                                                  refusal_text(subject, verdict).c_str());
+    return;
+  }
   // What it asked an earlier process for ends there, and is not counted here.
-  if (tell_quarn_predecessor(caller, kWithdrawSignal)) LOGI("withdrawal passed on");
-  const std::uint32_t count = quarnd_cancel_own(caller);
+  if (tell_quarn_predecessor(sender, kWithdrawSignal)) LOGI("withdrawal passed on");
+  const std::uint32_t count = quarnd_cancel_own(sender);
   g_dbus_method_invocation_return_value(invocation, g_variant_new("(u)", count));
+}
+
+/** GDBus has compared name and arguments with the introspection data. */
+void on_method(GDBusConnection *connection, const gchar *sender, const gchar *, const gchar *,
+               const gchar *, GVariant *, GDBusMethodInvocation *invocation, gpointer) {
+  cancel_quarn_terminate();
+  with_caller(connection, sender == nullptr ? "" : sender,
+              [invocation](const quarn_caller &caller) { withdraw_own(caller, invocation); });
 }
 
 constexpr GDBusInterfaceVTable kPackagesTable = {on_method, nullptr, nullptr, {}};

@@ -9,6 +9,7 @@
 #include "platform_device.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -49,6 +50,8 @@ const char kStatusIntrospection[] =
     "</node>";
 
 namespace {
+
+constexpr char kKeptPackages[] = "KeptPackages";
 
 GDBusConnection *status_connection = nullptr;
 guint status_registration = 0;
@@ -123,13 +126,7 @@ GVariant *value_of(const std::string &property) {
   return nullptr;
 }
 
-GVariant *get_property(GDBusConnection *, const gchar *, const gchar *, const gchar *,
-                       const gchar *property, GError **, gpointer) {
-  return value_of(property);
-}
-
-GVariant *get_kept_packages(GDBusConnection *, const gchar *, const gchar *, const gchar *,
-                            const gchar *, GError **error, gpointer) {
+GVariant *kept_packages(GError **error) {
   std::set<std::string> kept;
   if (!packages_kept_by_backup(&kept)) {
     g_set_error_literal(error, G_DBUS_ERROR, G_DBUS_ERROR_FAILED,
@@ -142,9 +139,68 @@ GVariant *get_kept_packages(GDBusConnection *, const gchar *, const gchar *, con
   return g_variant_builder_end(&builder);
 }
 
-const GDBusInterfaceVTable kCleanUpTable = {nullptr, get_kept_packages, nullptr, {nullptr}};
+/** A property of either interface, floating; null with @p error. */
+GVariant *read_property(const std::string &property, GError **error) {
+  return property == kKeptPackages ? kept_packages(error) : value_of(property);
+}
 
-const GDBusInterfaceVTable kStatusTable = {nullptr, get_property, nullptr, {nullptr}};
+/** All of the properties of @p interface_info that can be read. */
+GVariant *read_properties(const GDBusInterfaceInfo *interface_info) {
+  GVariantBuilder builder;
+  g_variant_builder_init(&builder, G_VARIANT_TYPE("a{sv}"));
+  for (GDBusPropertyInfo **info = interface_info->properties; *info != nullptr; ++info) {
+    GVariant *value = read_property((*info)->name, nullptr);
+    if (value != nullptr) g_variant_builder_add(&builder, "{sv}", (*info)->name, value);
+  }
+  return g_variant_builder_end(&builder);
+}
+
+/** GDBus has made sure that interface and property are there. */
+void answer_reading(GDBusMethodInvocation *invocation, const GDBusInterfaceInfo *interface_info) {
+  GVariant *const parameters = g_dbus_method_invocation_get_parameters(invocation);
+  const GDBusPropertyInfo *const one = g_dbus_method_invocation_get_property_info(invocation);
+  if (one == nullptr || g_variant_n_children(parameters) == 1) {
+    g_dbus_method_invocation_return_value(
+        invocation, g_variant_new("(@a{sv})", read_properties(interface_info)));
+    return;
+  }
+  GErrorPtr error;
+  GVariant *const value = read_property(one->name, out(error));
+  if (value == nullptr) {
+    g_dbus_method_invocation_return_gerror(invocation, error.get());
+  } else {
+    g_dbus_method_invocation_return_value(invocation, g_variant_new("(v)", value));
+  }
+}
+
+/** Reads are calls here: GDBus itself would answer them without knowing who asks. */
+void on_reading(GDBusConnection *connection, const gchar *sender, const gchar *, const gchar *,
+                const gchar *, GVariant *, GDBusMethodInvocation *invocation, gpointer data) {
+  const auto *interface_info = static_cast<const GDBusInterfaceInfo *>(data);
+  const std::string caller = sender == nullptr ? "" : sender;
+  with_caller(connection, caller, [=](const quarn_caller &who) {
+    const quarn_subject subject =
+        subject_of_call(g_dbus_method_invocation_get_interface_name(invocation),
+                        g_dbus_method_invocation_get_method_name(invocation), nullptr);
+    const caller_verdict verdict = judge_call(who, caller, subject, false);
+    if (verdict.allowed) return answer_reading(invocation, interface_info);
+    g_dbus_method_invocation_return_error_literal(invocation, G_DBUS_ERROR,
+                                                  G_DBUS_ERROR_ACCESS_DENIED,
+                                                  refusal_text(subject, verdict).c_str());
+  });
+}
+
+const GDBusInterfaceVTable kReadTable = {on_reading, nullptr, nullptr, {nullptr}};
+
+/** Serve one interface of @p node. @return its registration, 0 with @p error */
+guint serve_interface(GDBusConnection *connection, GDBusInterfaceInfo *interface_info,
+                      GError **error) {
+  return g_dbus_connection_register_object(
+      connection, kStatusObjectPath, interface_info, &kReadTable,
+      g_dbus_interface_info_ref(interface_info),
+      [](gpointer held) { g_dbus_interface_info_unref(static_cast<GDBusInterfaceInfo *>(held)); },
+      error);
+}
 
 constexpr const char *kChanging[] = {"AutoBackup",     "WifiConnected", "ScreenOff",
                                      "ConditionAlarm", "NextAlarm",     "LastBackup",
@@ -189,13 +245,9 @@ void quarnd_status_export(GDBusConnection *connection) {
     LOGE("status object is not available: %s", error->message);
     return;
   }
-  status_registration =
-      g_dbus_connection_register_object(connection, kStatusObjectPath, node->interfaces[0],
-                                        &kStatusTable, nullptr, nullptr, out(error));
+  status_registration = serve_interface(connection, node->interfaces[0], out(error));
   if (status_registration != 0) {
-    clean_up_registration =
-        g_dbus_connection_register_object(connection, kStatusObjectPath, node->interfaces[1],
-                                          &kCleanUpTable, nullptr, nullptr, out(error));
+    clean_up_registration = serve_interface(connection, node->interfaces[1], out(error));
   }
   g_dbus_node_info_unref(node);
   if (status_registration == 0) {

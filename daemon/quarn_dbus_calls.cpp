@@ -1,13 +1,16 @@
 #include "quarn_dbus_calls.h"
 
+#include <iterator>
 #include <map>
 #include <mutex>
 #include <utility>
 
 #include "quarn_common.h"
+#include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
+#include "quarn_dbus_limits.h"
 #include "quarn_log.h"
 
 namespace {
@@ -118,11 +121,37 @@ void answer(GDBusMessage *message, quarn_call_form form) {
       return refuse(message, "org.freedesktop.DBus.Error.UnknownMethod",
                     unknown_method_text(text_or_empty(g_dbus_message_get_member(message)),
                                         text_or_empty(g_dbus_message_get_interface(message))));
+    case quarn_call_form::too_large:
+      return refuse(message, "org.freedesktop.DBus.Error.InvalidArgs", kArgumentsTooLarge);
     case quarn_call_form::of_other_object:
       // What its caller has asked for ends all the same.
       if (is(message, "CancelOwn")) return reply(message, g_variant_new("(u)", 0U));
       return refuse(message, "org.freedesktop.DBus.Error.Failed", "The daemon ends");
   }
+}
+
+/** Milliseconds that the bus may take to tell of a caller when the process is about to be left. */
+constexpr int kLastQuestion = 50;
+
+/** Refuses what its caller may not ask for, or what nobody would do. @return whether it did */
+bool refuse_unlooked(GDBusMessage *message, quarn_call_form form) {
+  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
+  GVariant *const arguments =
+      form == quarn_call_form::right ? g_dbus_message_get_body(message) : nullptr;
+  const quarn_subject subject =
+      subject_of_call(text_or_empty(g_dbus_message_get_interface(message)),
+                      text_or_empty(g_dbus_message_get_member(message)), arguments);
+  const caller_verdict verdict =
+      judge_call(ask_caller_now(quarn_dbus_connection, sender, kLastQuestion), sender, subject,
+                 cloud_restore_running != 0);
+  if (!verdict.allowed) {
+    refuse(message, "org.freedesktop.DBus.Error.AccessDenied", refusal_text(subject, verdict));
+    return true;
+  }
+  const std::string excess = excess_of_arguments(subject.member, arguments);
+  if (excess.empty()) return false;
+  refuse(message, "org.freedesktop.DBus.Error.InvalidArgs", excess);
+  return true;
 }
 
 }  // namespace
@@ -159,6 +188,12 @@ void answer_quarn_calls() {
     const std::lock_guard<std::mutex> lock(calls_mutex);
     answered_all = true;
     left.swap(calls);
+  }
+  for (auto call = left.begin(); call != left.end();) {
+    // What is begun has passed.
+    const bool refused =
+        !call->second.begun && refuse_unlooked(call->second.message.get(), call->second.form);
+    call = refused ? left.erase(call) : std::next(call);
   }
   for (const auto &[key, call] : left) {
     if (!call.begun && call.form == quarn_call_form::right) accept_unlooked(call.message.get());

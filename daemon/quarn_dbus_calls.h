@@ -18,7 +18,8 @@ enum class quarn_call_form {
   without_arguments, /**< and it needs some */
   other_arguments,
   unknown_method,
-  of_other_object /**< or of another interface */
+  of_other_object, /**< or of another interface */
+  too_large        /**< its arguments were thrown away */
 };
 
 /** A call was delivered. Bus thread. */

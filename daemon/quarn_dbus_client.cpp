@@ -5,9 +5,15 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
+#include <thread>
+#include <utility>
+#include <vector>
 
 #include "quarn_common.h"
+#include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_log.h"
 
 GDBusConnection *quarn_dbus_connection = nullptr;
@@ -39,34 +45,68 @@ struct accepted_request {
 std::mutex &requests_mutex = *new std::mutex;
 std::map<const void *, accepted_request> &requests = *new std::map<const void *, accepted_request>;
 std::atomic<bool> waiting_stopped{false};
-GCancellable *const waiting = g_cancellable_new();
+/** Of each callback whose answer is waited for. */
+std::set<GCancellable *> &awaited = *new std::set<GCancellable *>;
+
+/** Milliseconds between the looks whether others have waited for long enough. */
+constexpr guint kPatienceCheckMs = 1000;
+std::atomic<callback_patience> patience{nullptr};
+/** Guards the two that follow. */
+std::mutex &time_mutex = *new std::mutex;
+std::int64_t waited_us = 0;
+std::int64_t waiting_since_us = 0; /**< of the wait that stands; 0: none */
+
+std::thread::id main_thread;
+/** By client, the fibers of the main thread that wait for its answer; of all in the other. */
+std::map<std::string, std::size_t> &answers_of_client = *new std::map<std::string, std::size_t>;
+std::size_t answers_of_all = 0;
+/** Of these, what a request's own fiber waits for. */
+std::size_t requests_awaiting = 0;
 
 using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
 using ContextPtr = Handle<GMainContext, &g_main_context_unref>;
 
+using LoopPtr = Handle<GMainLoop, &g_main_loop_unref>;
+using CancellablePtr = Handle<GCancellable, &g_object_unref>;
+using ResultPtr = Handle<GAsyncResult, &g_object_unref>;
+using SourcePtr = Handle<GSource, &g_source_unref>;
+
+gboolean keep_looking(gpointer) { return G_SOURCE_CONTINUE; }
+
 /** A callback that was sent, and its answer. */
-class SentCall {
+class SentCall : public std::enable_shared_from_this<SentCall> {
  public:
-  SentCall() : context_(g_main_context_new()) {}
+  /** @param context where the answer arrives; null: the main thread's */
+  explicit SentCall(GMainContext *context)
+      : context_(context), cancellable_(g_cancellable_new()), loop_(new_wait_loop()) {}
   SentCall(const SentCall &) = delete;
   SentCall &operator=(const SentCall &) = delete;
-  ~SentCall() { g_clear_object(&result_); }
-
-  /** @p message is on its way when this returns. */
-  void send(GDBusMessage *message) {
-    g_main_context_push_thread_default(context_.get());
-    g_dbus_connection_send_message_with_reply(quarn_dbus_connection, message,
-                                              G_DBUS_SEND_MESSAGE_FLAGS_NONE, kClientTimeout,
-                                              nullptr, waiting, on_reply, this);
-    g_main_context_pop_thread_default(context_.get());
+  ~SentCall() {
+    const std::lock_guard<std::mutex> lock(requests_mutex);
+    awaited.erase(cancellable_.get());
   }
 
-  GVariantPtr wait(GErrorPtr *error) {
-    g_main_context_push_thread_default(context_.get());
-    while (result_ == nullptr) g_main_context_iteration(context_.get(), TRUE);
-    g_main_context_pop_thread_default(context_.get());
-    const MessagePtr reply(g_dbus_connection_send_message_with_reply_finish(quarn_dbus_connection,
-                                                                            result_, out(*error)));
+  /** @p message is on its way when this returns. Under requests_mutex. */
+  void send(GDBusMessage *message) {
+    awaited.insert(cancellable_.get());
+    if (context_ != nullptr) g_main_context_push_thread_default(context_);
+    g_dbus_connection_send_message_with_reply(
+        quarn_dbus_connection, message, G_DBUS_SEND_MESSAGE_FLAGS_NONE, kClientTimeout, nullptr,
+        cancellable_.get(), on_reply, new std::shared_ptr<SentCall>(shared_from_this()));
+    if (context_ != nullptr) g_main_context_pop_thread_default(context_);
+  }
+
+  bool is_answered() const { return result_ != nullptr; }
+  GMainLoop *loop() const { return loop_.get(); }
+  void give_up() { g_cancellable_cancel(cancellable_.get()); }
+
+  GVariantPtr take_answer(GErrorPtr *error) {
+    if (!result_) {
+      error->reset(g_error_new_literal(G_IO_ERROR, G_IO_ERROR_CANCELLED, "the process ends"));
+      return nullptr;
+    }
+    const MessagePtr reply(g_dbus_connection_send_message_with_reply_finish(
+        quarn_dbus_connection, result_.get(), out(*error)));
     if (!reply || g_dbus_message_to_gerror(reply.get(), out(*error)) != FALSE) return nullptr;
     GVariant *body = g_dbus_message_get_body(reply.get());
     return GVariantPtr(body == nullptr ? g_variant_ref_sink(g_variant_new_tuple(nullptr, 0))
@@ -74,12 +114,87 @@ class SentCall {
   }
 
  private:
-  static void on_reply(GObject *, GAsyncResult *result, gpointer self) {
-    static_cast<SentCall *>(self)->result_ = G_ASYNC_RESULT(g_object_ref(result));
+  static void on_reply(GObject *, GAsyncResult *result, gpointer data) {
+    const std::unique_ptr<std::shared_ptr<SentCall>> call(
+        static_cast<std::shared_ptr<SentCall> *>(data));
+    (*call)->result_.reset(G_ASYNC_RESULT(g_object_ref(result)));
+    g_main_loop_quit((*call)->loop_.get());
   }
 
-  ContextPtr context_;
-  GAsyncResult *result_ = nullptr;
+  GMainContext *context_;
+  CancellablePtr cancellable_;
+  LoopPtr loop_;
+  ResultPtr result_;
+};
+using SentCallPtr = std::shared_ptr<SentCall>;
+
+/** Counts the time of a wait that nothing else is done in. */
+class TimedWait {
+ public:
+  TimedWait() : since_us_(g_get_monotonic_time()) {
+    const std::lock_guard<std::mutex> lock(time_mutex);
+    waiting_since_us = since_us_;
+  }
+  ~TimedWait() {
+    const std::lock_guard<std::mutex> lock(time_mutex);
+    waited_us += g_get_monotonic_time() - since_us_;
+    waiting_since_us = 0;
+  }
+  TimedWait(const TimedWait &) = delete;
+  TimedWait &operator=(const TimedWait &) = delete;
+
+ private:
+  const std::int64_t since_us_;
+};
+
+/** Off the main thread: nothing else is done here meanwhile. */
+void wait_in_place(SentCall *call, GMainContext *context, const std::string &sender) {
+  const TimedWait timed;
+  const SourcePtr look(g_timeout_source_new(kPatienceCheckMs));
+  g_source_set_callback(look.get(), keep_looking, nullptr, nullptr);
+  g_source_attach(look.get(), context);
+  g_main_context_push_thread_default(context);
+  bool given_up = false;
+  while (!call->is_answered()) {
+    const callback_patience exhausted = patience;
+    if (!given_up && exhausted != nullptr && exhausted(sender)) {
+      LOGE("(%s) does not answer its callback : others go on", sender.c_str());
+      given_up = true;
+      call->give_up();
+    }
+    if (!call->is_answered()) g_main_context_iteration(context, TRUE);
+  }
+  g_main_context_pop_thread_default(context);
+  g_source_destroy(look.get());
+}
+
+/** Counts a fiber that waits for a client's answer. Main thread. */
+class AwaitedAnswer {
+ public:
+  AwaitedAnswer(std::string client, bool of_request)
+      : client_(std::move(client)), of_request_(of_request) {
+    ++answers_of_client[client_];
+    ++answers_of_all;
+    if (of_request_) ++requests_awaiting;
+  }
+  ~AwaitedAnswer() {
+    const auto entry = answers_of_client.find(client_);
+    if (--entry->second == 0) answers_of_client.erase(entry);
+    --answers_of_all;
+    if (of_request_) --requests_awaiting;
+  }
+  AwaitedAnswer(const AwaitedAnswer &) = delete;
+  AwaitedAnswer &operator=(const AwaitedAnswer &) = delete;
+
+  static bool may_begin(const std::string &client) {
+    const auto entry = answers_of_client.find(client);
+    return answers_of_all < kMostAnswersAwaited &&
+           (entry == answers_of_client.end() || entry->second < kMostAnswersOfClient);
+  }
+
+ private:
+  const std::string client_;
+  const bool of_request_;
 };
 
 MessagePtr make_message(const client_cb_data &client, const char *method, GVariant *arguments) {
@@ -111,26 +226,10 @@ void send_only(GDBusMessage *message) {
   }
 }
 
-/** Call @p method of the client that @p record names; consumes a floating @p payload. */
-int call_client(const client_cb_data &record, const char *method, GVariant *payload, bool is_last) {
-  const GVariantPtr arguments(g_variant_ref_sink(payload));
+/** The integer that a client has answered. */
+int result_of(SentCall *call) {
   GErrorPtr error;
-  GVariantPtr reply;
-  std::unique_lock<std::mutex> lock(requests_mutex);
-  if (!take_turn(&record, is_last)) return QUARN_FAILED;
-  if (can_be_called(record)) {
-    const MessagePtr message = make_message(record, method, arguments.get());
-    if (waiting_stopped) {
-      send_only(message.get());
-      return QUARN_FAILED;
-    }
-    SentCall call;
-    call.send(message.get());
-    lock.unlock();
-    reply = call.wait(&error);
-  } else {
-    lock.unlock();
-  }
+  const GVariantPtr reply = call->take_answer(&error);
   if (error) {
     LOGE("g_dbus_connection_call_sync() Fail(%s)", error->message);
     return QUARN_FAILED;
@@ -142,6 +241,77 @@ int call_client(const client_cb_data &record, const char *method, GVariant *payl
   gint32 result = QUARN_FAILED;
   g_variant_get(reply.get(), kReplyFormat, &result);
   return result;
+}
+
+/** How a callback came to leave. */
+struct Departure {
+  SentCallPtr call; /**< null: its answer is not waited for */
+  bool tried = false;
+};
+
+/** Send a callback. @p context: where its answer is waited for. */
+Departure depart(const client_cb_data &record, const char *method, GVariant *arguments,
+                 bool is_last, bool to_be_awaited, GMainContext *context) {
+  const std::lock_guard<std::mutex> lock(requests_mutex);
+  if (!take_turn(&record, is_last)) return {};
+  if (!can_be_called(record)) return {nullptr, true};
+  const MessagePtr message = make_message(record, method, arguments);
+  if (waiting_stopped || !to_be_awaited) {
+    send_only(message.get());
+    return {};
+  }
+  auto call = std::make_shared<SentCall>(context);
+  call->send(message.get());
+  return {std::move(call), true};
+}
+
+int failed_departure(const Departure &departure) {
+  if (departure.tried) LOGE("g_dbus_connection_call_sync 'Launch' error");
+  return QUARN_FAILED;
+}
+
+int call_in_place(const client_cb_data &record, const char *method, GVariant *arguments,
+                  bool is_last) {
+  const ContextPtr context(g_main_context_new());
+  const std::string sender = record.sender;
+  const Departure left = depart(record, method, arguments, is_last, true, context.get());
+  if (!left.call) return failed_departure(left);
+  wait_in_place(left.call.get(), context.get(), sender);
+  return result_of(left.call.get());
+}
+
+/** Takes @p owned, the record when this is its last callback, until the client has answered. */
+int call_on_main_thread(const client_cb_data &record, const char *method, GVariant *arguments,
+                        bool is_last, std::unique_ptr<client_cb_data> owned) {
+  const std::string sender = record.sender;
+  const bool room = AwaitedAnswer::may_begin(sender);
+  if (!room) LOGE("(%s) has too many callbacks to answer : not waited for", sender.c_str());
+  const Departure left = depart(record, method, arguments, is_last, room, nullptr);
+  if (!left.call) return failed_departure(left);
+  const bool of_request = current_fiber() != nullptr;
+  const auto wait = [call = left.call, sender, of_request] {
+    const AwaitedAnswer counted(sender, of_request);
+    wait_for_answer(call->loop());
+    return result_of(call.get());
+  };
+  if (of_request) return wait();
+  // Nobody here may wait: whatever called this serves everybody.
+  const std::shared_ptr<client_cb_data> kept(std::move(owned));
+  run_on_fiber([wait, kept] { wait(); });
+  return QUARN_FAILED;
+}
+
+/**
+ * Call @p method of the client that @p record names; consumes a floating @p payload, and the
+ * record when this is its last callback.
+ */
+int call_client(client_cb_data *record, const char *method, GVariant *payload, bool is_last) {
+  std::unique_ptr<client_cb_data> owned(is_last ? record : nullptr);
+  const GVariantPtr arguments(g_variant_ref_sink(payload));
+  if (std::this_thread::get_id() != main_thread) {
+    return call_in_place(*record, method, arguments.get(), is_last);
+  }
+  return call_on_main_thread(*record, method, arguments.get(), is_last, std::move(owned));
 }
 
 /** The last callback of a request that is cut short. */
@@ -177,19 +347,9 @@ client_cb_data *as_record(void *record) {
   return static_cast<client_cb_data *>(record);
 }
 
-/** Deletes the record of a request that has received its last callback. */
-class LastCallback {
- public:
-  LastCallback(client_cb_data *record, bool is_last) : record_(is_last ? record : nullptr) {}
-
- private:
-  std::unique_ptr<client_cb_data> record_;
-};
-
 /** A callback of "(isu)" err, msg, req_id. */
 int send_message_callback(const char *method, int err, const char *msg, client_cb_data *record,
                           bool is_last) {
-  const LastCallback last(record, is_last);
   GString_ made;
   const char *text = msg;
   if (text == nullptr || g_utf8_validate(text, -1, nullptr) == FALSE) {
@@ -200,7 +360,7 @@ int send_message_callback(const char *method, int err, const char *msg, client_c
   // message.
   GVariant *borrowed = g_variant_new_from_data(G_VARIANT_TYPE_STRING, text, std::strlen(text) + 1,
                                                TRUE, nullptr, nullptr);
-  return call_client(*record, method, g_variant_new("(i@su)", err, borrowed, record->req_id),
+  return call_client(record, method, g_variant_new("(i@su)", err, borrowed, record->req_id),
                      is_last);
 }
 
@@ -228,11 +388,24 @@ void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void
 }
 
 void quarn_dbus_stop_waiting() {
+  std::vector<CancellablePtr> standing;
   {
     const std::lock_guard<std::mutex> lock(requests_mutex);
     waiting_stopped = true;
+    for (GCancellable *call : awaited) standing.emplace_back(G_CANCELLABLE(g_object_ref(call)));
   }
-  g_cancellable_cancel(waiting);
+  for (const CancellablePtr &call : standing) g_cancellable_cancel(call.get());
+}
+
+void quarn_dbus_note_main_thread() { main_thread = std::this_thread::get_id(); }
+
+bool quarn_dbus_answers_awaited() { return requests_awaiting != 0; }
+
+void quarn_dbus_set_patience(callback_patience exhausted) { patience = exhausted; }
+
+std::int64_t quarn_dbus_time_waited() {
+  const std::lock_guard<std::mutex> lock(time_mutex);
+  return waited_us + (waiting_since_us == 0 ? 0 : g_get_monotonic_time() - waiting_since_us);
 }
 
 bool quarn_dbus_waiting_stopped() { return waiting_stopped; }
@@ -283,8 +456,7 @@ int quarn_dbus_manual_backup_status(int err, int status, void *record) {
   client_cb_data *const data = as_record(record);
   if (data == nullptr) return QUARN_FAILED;
   const bool is_last = status != QUARN_BACKUP_RUNNING;
-  const LastCallback last(data, is_last);
-  return call_client(*data, "manual_backup_status",
+  return call_client(data, "manual_backup_status",
                      g_variant_new("(iiu)", err, status, data->req_id), is_last);
 }
 
@@ -292,8 +464,7 @@ int quarn_dbus_manual_backup_cancel_result(int err, void *record) {
   LOGI("in quarn_dbus_manual_backup_cancel_result");
   client_cb_data *const data = as_record(record);
   if (data == nullptr) return QUARN_FAILED;
-  const LastCallback last(data, true);
-  return call_client(*data, "manual_backup_cancel_result", g_variant_new("(iu)", err, data->req_id),
+  return call_client(data, "manual_backup_cancel_result", g_variant_new("(iu)", err, data->req_id),
                      true);
 }
 

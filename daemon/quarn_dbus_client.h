@@ -2,15 +2,20 @@
  * @file quarn_dbus_client.h
  * @brief Calls back to clients, and published signals.
  *
- * Any thread: every call blocks its caller until the client has answered or
- * the time-out has passed, or until quarn_dbus_stop_waiting(). Failures are
- * logged and end in #QUARN_FAILED.
+ * Any thread: every call keeps its caller until the client has answered or
+ * the time-out has passed, or until quarn_dbus_stop_waiting(). On the main
+ * thread that is its fiber only, while the loop goes on; what calls from no
+ * fiber there goes on at once, with #QUARN_FAILED, and the answer is taken when
+ * it comes. On another thread a callback patience may end the wait. Callbacks
+ * leave in the order of the calls. Failures are logged and end in
+ * #QUARN_FAILED.
  */
 #ifndef QUARN_DBUS_CLIENT_H
 #define QUARN_DBUS_CLIENT_H
 
 #include <gio/gio.h>
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -47,6 +52,25 @@ void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void
 void quarn_dbus_stop_waiting();
 /** True after quarn_dbus_stop_waiting(). */
 bool quarn_dbus_waiting_stopped();
+
+/** The calling thread is the one whose loop must never stand still. */
+void quarn_dbus_note_main_thread();
+/** True while requests wait on the main thread for their clients' answers to callbacks. */
+bool quarn_dbus_answers_awaited();
+/** Answers that are awaited on the main thread at the most; beyond it a callback is only sent. */
+inline constexpr std::size_t kMostAnswersAwaited = 512;
+/** Of these, one client's. */
+inline constexpr std::size_t kMostAnswersOfClient = 64;
+
+/**
+ * Asked every second off the main thread while a client does not answer.
+ * @return true when others have waited for long enough: the wait then ends
+ */
+using callback_patience = bool (*)(const std::string &sender);
+/** @param exhausted null: as long as the time-out */
+void quarn_dbus_set_patience(callback_patience exhausted);
+/** Microseconds that were spent off the main thread on waiting for answers. Any thread. */
+std::int64_t quarn_dbus_time_waited();
 
 /** Tell each accepted request that has not had its last callback that it is cancelled. */
 void quarn_dbus_end_requests();

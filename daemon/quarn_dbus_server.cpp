@@ -12,6 +12,7 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_end.h"
+#include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
@@ -22,6 +23,7 @@
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
+#include "quarn_dbus_limits.h"
 #include "quarn_log.h"
 
 const char quarn_introspection_xml[] =
@@ -105,11 +107,12 @@ void (*bus_acquired_hook)(GDBusConnection *connection) = nullptr;
 class MethodCall {
  public:
   MethodCall(const char *sender, const char *interface_name, const char *method_name,
-             guint32 serial)
+             guint32 serial, quarn_caller caller)
       : sender_(sender == nullptr ? "" : sender),
-        interface_(interface_name),
-        method_(method_name),
-        serial_(serial) {}
+        interface_(interface_name == nullptr ? "" : interface_name),
+        method_(method_name == nullptr ? "" : method_name),
+        serial_(serial),
+        caller_(std::move(caller)) {}
   MethodCall(const MethodCall &) = delete;
   MethodCall &operator=(const MethodCall &) = delete;
   virtual ~MethodCall() = default;
@@ -125,21 +128,24 @@ class MethodCall {
   const std::string &method() const { return method_; }
   /** The number that the sender has given it. */
   guint32 serial() const { return serial_; }
+  const quarn_caller &caller() const { return caller_; }
 
  private:
   std::string sender_;
   std::string interface_;
   std::string method_;
   guint32 serial_;
+  quarn_caller caller_;
 };
 
 /** A call that GDBus handed over. */
 class InvokedCall : public MethodCall {
  public:
   InvokedCall(const char *sender, const char *interface_name, const char *method_name,
-              GDBusMethodInvocation *invocation)
+              GDBusMethodInvocation *invocation, const quarn_caller &caller)
       : MethodCall(sender, interface_name, method_name,
-                   g_dbus_message_get_serial(g_dbus_method_invocation_get_message(invocation))),
+                   g_dbus_message_get_serial(g_dbus_method_invocation_get_message(invocation)),
+                   caller),
         invocation_(invocation) {}
   void reply(GVariant *value) override {
     g_dbus_method_invocation_return_value(invocation_, value);
@@ -158,9 +164,9 @@ using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
 /** A call that GDBus would have answered by itself, without telling anyone. */
 class RawCall : public MethodCall {
  public:
-  RawCall(GDBusConnection *connection, GDBusMessage *message)
+  RawCall(GDBusConnection *connection, GDBusMessage *message, const quarn_caller &caller)
       : MethodCall(g_dbus_message_get_sender(message), g_dbus_message_get_interface(message),
-                   g_dbus_message_get_member(message), g_dbus_message_get_serial(message)),
+                   g_dbus_message_get_member(message), g_dbus_message_get_serial(message), caller),
         connection_(connection),
         message_(message) {}
   void reply(GVariant *value) override {
@@ -190,8 +196,16 @@ class RawCall : public MethodCall {
   GDBusMessage *message_;
 };
 
+/** Whose bounds a call counts against, beside its connection's: one caller may have many. */
+waiting_parties parties_of(const MethodCall &call) {
+  const quarn_caller &caller = call.caller();
+  if (!caller.known || caller.uid == 0) return {};
+  return {"user " + std::to_string(caller.uid),
+          caller.label.empty() ? "" : "label " + caller.label};
+}
+
 client_cb_data *make_record(const MethodCall &call, guint32 req_id) {
-  return new client_cb_data{req_id, call.sender(), count_waiting(call.sender())};
+  return new client_cb_data{req_id, call.sender(), count_waiting(call.sender(), parties_of(call))};
 }
 
 /** A request that ends what others wait for is accepted however many wait. */
@@ -201,7 +215,7 @@ client_cb_data *make_uncounted_record(const MethodCall &call, guint32 req_id) {
 
 /** Refuse a request that may wait where too many do. */
 bool refuse_beyond_bounds(MethodCall &call) {
-  if (may_wait(call.sender())) return false;
+  if (may_wait(call.sender(), parties_of(call))) return false;
   LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
   call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "Too many requests are waiting");
   return true;
@@ -226,21 +240,6 @@ void serve(MethodCall &call, client_cb_data *record, int reply_at_end, Work work
   quarn_dbus_end_requests();
   delete record;
   call.reply_int(reply_at_end);
-}
-
-/** The user that a client runs as, told by the bus. */
-bool get_client_uid(GDBusConnection *connection, const std::string &sender, guint32 *uid) {
-  GErrorPtr error;
-  const GVariantPtr reply(g_dbus_connection_call_sync(
-      connection, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
-      "GetConnectionUnixUser", g_variant_new("(s)", sender.c_str()), G_VARIANT_TYPE("(u)"),
-      G_DBUS_CALL_FLAGS_NONE, kBusTimeout, nullptr, out(error)));
-  if (!reply) {
-    LOGE("cannot get user of (%s) : %s", sender.c_str(), error ? error->message : "");
-    return false;
-  }
-  g_variant_get(reply.get(), "(u)", uid);
-  return true;
 }
 
 void on_set_activation(MethodCall &call, GVariant *parameters) {
@@ -331,25 +330,20 @@ void on_app_data_restore_start(MethodCall &call, GVariant *parameters) {
         [pkg_id](void *record) { return quarnd_restore_app_data(pkg_id, record); });
 }
 
-void on_make_app_data(MethodCall &call, GDBusConnection *connection, GVariant *parameters) {
+void on_make_app_data(MethodCall &call, GVariant *parameters) {
   const char *pkg_id = nullptr;
   g_variant_get(parameters, "(&s)", &pkg_id);
-  guint32 uid = 0;
   if (quarn_dbus_waiting_stopped() || waits_are_ended()) {
     call.reply_int(QUARN_CANCELLED);
     return;
   }
-  if (!get_client_uid(connection, call.sender(), &uid)) {
-    call.reply_int(QUARN_REFUSED);
-    return;
-  }
   if (refuse_beyond_bounds(call)) return;
-  const auto counted = count_waiting(call.sender());
-  call.reply_int(quarnd_make_app_data(pkg_id, uid));
+  const auto counted = count_waiting(call.sender(), parties_of(call));
+  call.reply_int(quarnd_make_app_data(pkg_id, call.caller().uid));
 }
 
 /** The one dispatcher; @p given is null when the call has no arguments. */
-void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
+void dispatch(MethodCall &call, GVariant *given) {
   if (!begin_quarn_call(call.sender(), call.serial())) return;
   cancel_quarn_terminate();
 
@@ -385,7 +379,7 @@ void dispatch(GDBusConnection *connection, MethodCall &call, GVariant *given) {
   } else if (call.is("app_data_restore_start")) {
     with_parameters([&] { on_app_data_restore_start(call, parameters); });
   } else if (call.is("make_app_data")) {
-    with_parameters([&] { on_make_app_data(call, connection, parameters); });
+    with_parameters([&] { on_make_app_data(call, parameters); });
   } else {
     call.refuse(G_DBUS_ERROR_UNKNOWN_METHOD,
                 unknown_method_text(call.method(), call.interface_name()));
@@ -415,7 +409,7 @@ bool must_wait(const MethodCall &call, GVariant *parameters) {
 bool wait_for_turn(MethodCall &call) {
   cancel_quarn_terminate();
   if (refuse_beyond_bounds(call)) return false;
-  const auto counted = count_waiting(call.sender());
+  const auto counted = count_waiting(call.sender(), parties_of(call));
   const LoopPtr loop(new_wait_loop());
   waits_for_turn.push_back(loop.get());
   run_nested_loop(loop.get());
@@ -423,15 +417,45 @@ bool wait_for_turn(MethodCall &call) {
   return true;
 }
 
-void _dbus_handle_method_call(GDBusConnection *connection, const gchar *sender, const gchar *,
-                              const gchar *interface_name, const gchar *method_name,
-                              GVariant *parameters, GDBusMethodInvocation *invocation, gpointer) {
+/**
+ * Whether the caller may have what it asks for; else it is refused here, and nothing but the
+ * pending end is touched.
+ */
+bool admit(MethodCall &call, GVariant *parameters) {
+  const quarn_subject subject = subject_of_call(call.interface_name(), call.method(), parameters);
+  const caller_verdict verdict =
+      judge_call(call.caller(), call.sender(), subject, cloud_restore_running != 0);
+  const std::string excess =
+      verdict.allowed ? excess_of_arguments(call.method(), parameters) : std::string();
+  if (verdict.allowed && excess.empty()) return true;
+  if (call.interface_name() == kQuarnInterface) cancel_quarn_terminate();
+  if (!verdict.allowed) {
+    call.refuse(G_DBUS_ERROR_ACCESS_DENIED, refusal_text(subject, verdict));
+    return false;
+  }
+  LOGE("refused : %s of (%s) : %s", call.method().c_str(), call.sender().c_str(), excess.c_str());
+  call.refuse(G_DBUS_ERROR_INVALID_ARGS, excess);
+  return false;
+}
+
+void serve_invoked(const quarn_caller &caller, GDBusMethodInvocation *invocation) {
   // The invocation, ours until it is answered, owns all of these.
-  run_on_fiber([=] {
-    InvokedCall call(sender, interface_name, method_name, invocation);
-    if (must_wait(call, parameters) && !wait_for_turn(call)) return;
-    dispatch(connection, call, parameters);
-  });
+  InvokedCall call(g_dbus_method_invocation_get_sender(invocation),
+                   g_dbus_method_invocation_get_interface_name(invocation),
+                   g_dbus_method_invocation_get_method_name(invocation), invocation, caller);
+  GVariant *const parameters = g_dbus_method_invocation_get_parameters(invocation);
+  if (!admit(call, parameters)) return;
+  if (must_wait(call, parameters) && !wait_for_turn(call)) return;
+  dispatch(call, parameters);
+}
+
+void _dbus_handle_method_call(GDBusConnection *connection, const gchar *sender, const gchar *,
+                              const gchar *, const gchar *, GVariant *,
+                              GDBusMethodInvocation *invocation, gpointer) {
+  with_caller(connection, sender == nullptr ? "" : sender,
+              [invocation](const quarn_caller &caller) {
+                run_on_fiber([caller, invocation] { serve_invoked(caller, invocation); });
+              });
 }
 
 constexpr GDBusInterfaceVTable kMethodTable = {_dbus_handle_method_call, nullptr, nullptr, {}};
@@ -444,28 +468,104 @@ using ConnectionPtr = Handle<GDBusConnection, &g_object_unref>;
 struct Passed {
   ConnectionPtr connection;
   MessagePtr message;
-  bool answer; /**< else GDBus answers it, and only the terminate timer is of interest */
+  quarn_call_form form;
   std::atomic<bool> complete{false}; /**< hands all of it to the main thread */
 };
 
-gboolean on_passed(gpointer data) {
-  const auto *passed = static_cast<const Passed *>(data);
-  if (passed->complete.load(std::memory_order_acquire) && passed->answer) {
-    RawCall call(passed->connection.get(), passed->message.get());
-    dispatch(passed->connection.get(), call, nullptr);
+/** Calls that the bus library answers and that have no answer yet. */
+unsigned int forwarded_calls = 0;
+
+bool wants_no_reply(GDBusMessage *call) {
+  return (g_dbus_message_get_flags(call) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0;
+}
+
+struct Forwarded {
+  MessagePtr call;
+};
+
+void on_library_answer(GObject *bus, GAsyncResult *result, gpointer data) {
+  const std::unique_ptr<Forwarded> forwarded(static_cast<Forwarded *>(data));
+  --forwarded_calls;
+  if (wants_no_reply(forwarded->call.get())) return;
+  GErrorPtr error;
+  const MessagePtr reply(
+      g_dbus_connection_send_message_with_reply_finish(G_DBUS_CONNECTION(bus), result, out(error)));
+  MessagePtr answer;
+  if (reply && g_dbus_message_to_gerror(reply.get(), out(error)) == FALSE) {
+    answer.reset(g_dbus_message_new_method_reply(forwarded->call.get()));
+    g_dbus_message_set_body(answer.get(), g_dbus_message_get_body(reply.get()));
   } else {
-    cancel_quarn_terminate();
+    GString_ name(g_dbus_error_get_remote_error(error.get()));
+    if (!name) name.reset(g_dbus_error_encode_gerror(error.get()));
+    g_dbus_error_strip_remote_error(error.get());
+    answer.reset(
+        g_dbus_message_new_method_error_literal(forwarded->call.get(), name.get(), error->message));
   }
+  g_dbus_connection_send_message(G_DBUS_CONNECTION(bus), answer.get(),
+                                 G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr, nullptr);
+}
+
+/**
+ * Let the bus library answer a call that is none of ours: it does so only for what
+ * comes from the bus, so that it is sent to this connection itself.
+ */
+void forward_to_library(GDBusConnection *connection, GDBusMessage *call) {
+  const MessagePtr message(g_dbus_message_new_method_call(
+      g_dbus_connection_get_unique_name(connection), g_dbus_message_get_path(call),
+      g_dbus_message_get_interface(call), g_dbus_message_get_member(call)));
+  g_dbus_message_set_body(message.get(), g_dbus_message_get_body(call));
+  ++forwarded_calls;
+  g_dbus_connection_send_message_with_reply(
+      connection, message.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, kBusTimeout, nullptr, nullptr,
+      on_library_answer, new Forwarded{MessagePtr(G_DBUS_MESSAGE(g_object_ref(call)))});
+}
+
+std::string type_text(const char *signature) { return std::string("(") + signature + ")"; }
+
+/** A call of an admitted caller that GDBus was not given, or has not the words for. */
+void serve_raw(RawCall &call, GDBusConnection *connection, GDBusMessage *message,
+               quarn_call_form form) {
+  if (form == quarn_call_form::of_other_object) return forward_to_library(connection, message);
+  if (form == quarn_call_form::too_large) {
+    cancel_quarn_terminate();
+    LOGE("refused : %s of (%s) : %s", call.method().c_str(), call.sender().c_str(),
+         kArgumentsTooLarge);
+    return call.refuse(G_DBUS_ERROR_INVALID_ARGS, kArgumentsTooLarge);
+  }
+  if (form == quarn_call_form::other_arguments) {
+    cancel_quarn_terminate();
+    return call.refuse(G_DBUS_ERROR_INVALID_ARGS,
+                       "Arguments of type " + type_text(g_dbus_message_get_signature(message)) +
+                           " are not those of " + call.method());
+  }
+  dispatch(call, nullptr);
+}
+
+using SharedMessage = std::shared_ptr<GDBusMessage>;
+
+gboolean on_passed(gpointer data) {
+  auto *passed = static_cast<Passed *>(data);
+  if (!passed->complete.load(std::memory_order_acquire)) return G_SOURCE_REMOVE;
+  const quarn_call_form form = passed->form;
+  GDBusConnection *const connection = passed->connection.get();
+  const SharedMessage message(passed->message.release(), &g_object_unref);
+  const char *const sender = g_dbus_message_get_sender(message.get());
+  with_caller(connection, sender == nullptr ? "" : sender,
+              [connection, message, form](const quarn_caller &caller) {
+                RawCall call(connection, message.get(), caller);
+                if (admit(call, nullptr)) serve_raw(call, connection, message.get(), form);
+              });
   return G_SOURCE_REMOVE;
 }
 
 void delete_passed(gpointer data) { delete static_cast<Passed *>(data); }
 
-void pass_to_main_thread(GDBusConnection *connection, GDBusMessage *message, bool answer) {
+/** Takes @p message. */
+void pass_to_main_thread(GDBusConnection *connection, MessagePtr message, quarn_call_form form) {
   auto passed = std::make_unique<Passed>();
   passed->connection.reset(G_DBUS_CONNECTION(g_object_ref(connection)));
-  passed->message.reset(G_DBUS_MESSAGE(g_object_ref(message)));
-  passed->answer = answer;
+  passed->message = std::move(message);
+  passed->form = form;
   passed->complete.store(true, std::memory_order_release);
   // The priority of GDBus' own calls, so that all keep the order in which they came.
   g_idle_add_full(G_PRIORITY_DEFAULT, on_passed, passed.release(), delete_passed);
@@ -485,10 +585,57 @@ quarn_call_form form_of(const GDBusMethodInfo *method, const std::string &given)
   return given.empty() ? quarn_call_form::without_arguments : quarn_call_form::other_arguments;
 }
 
+/** Whether a call of another object or interface has a handler that asks who calls. */
+bool has_own_handler(GDBusMessage *message) {
+  struct entry {
+    const char *path, *interface_name, *member, *signature;
+  };
+  static constexpr entry kHandled[] = {
+      {"/org/orvane/Quarn/Packages", "org.orvane.Quarn.Packages", "CancelOwn", ""},
+      {"/org/orvane/Quarn/Status", "org.freedesktop.DBus.Properties", "Get", "ss"},
+      {"/org/orvane/Quarn/Status", "org.freedesktop.DBus.Properties", "GetAll", "s"}};
+  return std::any_of(std::begin(kHandled), std::end(kHandled), [message](const entry &handled) {
+    return g_strcmp0(g_dbus_message_get_path(message), handled.path) == 0 &&
+           g_strcmp0(g_dbus_message_get_interface(message), handled.interface_name) == 0 &&
+           g_strcmp0(g_dbus_message_get_member(message), handled.member) == 0 &&
+           g_strcmp0(g_dbus_message_get_signature(message), handled.signature) == 0;
+  });
+}
+
+bool is_own_message(GDBusConnection *connection, GDBusMessage *message) {
+  return g_strcmp0(g_dbus_message_get_sender(message),
+                   g_dbus_connection_get_unique_name(connection)) == 0;
+}
+
+/** The same call without its arguments, which nobody is to hold while it waits. */
+MessagePtr without_body(GDBusMessage *message) {
+  MessagePtr copy(g_dbus_message_copy(message, nullptr));
+  // What cannot be copied (it brings descriptors) is kept as it is.
+  if (!copy) return MessagePtr(G_DBUS_MESSAGE(g_object_ref(message)));
+  g_dbus_message_set_body(copy.get(), nullptr);
+  return copy;
+}
+
+quarn_call_form form_of_call(const GDBusNodeInfo *node, GDBusMessage *message) {
+  GVariant *const body = g_dbus_message_get_body(message);
+  if (body != nullptr &&
+      g_variant_get_size(body) > most_argument_bytes(g_dbus_message_get_member(message))) {
+    return quarn_call_form::too_large;
+  }
+  if (g_strcmp0(g_dbus_message_get_path(message), kQuarnObjectPath) != 0 ||
+      g_strcmp0(g_dbus_message_get_interface(message), kQuarnInterface) != 0) {
+    return quarn_call_form::of_other_object;
+  }
+  return form_of(
+      g_dbus_interface_info_lookup_method(node->interfaces[0], g_dbus_message_get_member(message)),
+      g_dbus_message_get_signature(message));
+}
+
 /**
- * GDBus refuses methods that are not in the introspection data, and calls with
- * other arguments than those, before the dispatcher hears of them. Yet any call
- * keeps the daemon alive, and the answers are ours. Runs on the bus thread.
+ * GDBus answers much by itself: methods that are not in the introspection data,
+ * calls with other arguments than those, objects that do not exist, what every
+ * object has. Yet any call keeps the daemon alive, the answers are ours, and
+ * nobody is told anything before it is known who asks. Runs on the bus thread.
  */
 GDBusMessage *filter_calls(GDBusConnection *connection, GDBusMessage *message, gboolean incoming,
                            gpointer user_data) {
@@ -497,23 +644,15 @@ GDBusMessage *filter_calls(GDBusConnection *connection, GDBusMessage *message, g
     return message;
   }
   if (g_dbus_message_get_message_type(message) != G_DBUS_MESSAGE_TYPE_METHOD_CALL) return message;
-  if (g_strcmp0(g_dbus_message_get_path(message), kQuarnObjectPath) != 0 ||
-      g_strcmp0(g_dbus_message_get_interface(message), kQuarnInterface) != 0) {
-    note_quarn_call(message, quarn_call_form::of_other_object);
-    return message;
-  }
-  const auto *node = static_cast<const GDBusNodeInfo *>(user_data);
-  const GDBusMethodInfo *method =
-      g_dbus_interface_info_lookup_method(node->interfaces[0], g_dbus_message_get_member(message));
-  const std::string given = g_dbus_message_get_signature(message);
-  note_quarn_call(message, form_of(method, given));
-  if (method != nullptr && given == signature_of(method)) return message;
-  if (method != nullptr && !given.empty()) {
-    pass_to_main_thread(connection, message, false);
-    return message;
-  }
-  pass_to_main_thread(connection, message, true);
-  g_object_unref(message);
+  if (is_own_message(connection, message)) return message;
+  const quarn_call_form form = form_of_call(static_cast<const GDBusNodeInfo *>(user_data), message);
+  MessagePtr owned(message);
+  if (form == quarn_call_form::too_large) owned = without_body(owned.get());
+  note_quarn_call(owned.get(), form);
+  const bool of_library = form == quarn_call_form::right ||
+                          (form == quarn_call_form::of_other_object && has_own_handler(message));
+  if (of_library) return owned.release();
+  pass_to_main_thread(connection, std::move(owned), form);
   return nullptr;
 }
 
@@ -586,6 +725,7 @@ void take_name_back() {
 void set_bus_acquired_hook(void (*hook)(GDBusConnection *connection)) { bus_acquired_hook = hook; }
 
 unsigned int quarnd_dbus_init() {
+  quarn_dbus_note_main_thread();
   GErrorPtr error;
   GDBusNodeInfo *node = g_dbus_node_info_new_for_xml(quarn_introspection_xml, out(error));
   if (node == nullptr) {
@@ -608,6 +748,8 @@ unsigned int quarnd_dbus_init() {
 
 bool quarnd_calls_deferred() { return !waits_for_turn.empty(); }
 
+bool quarnd_calls_unjudged() { return callers_are_asked_for() || forwarded_calls != 0; }
+
 void quarnd_dispatch_deferred() {
   for (GMainLoop *loop : waits_for_turn) g_main_loop_quit(loop);
 }
@@ -621,7 +763,8 @@ void quarnd_dbus_leave() {
   // What arrived before the bus had answered has a higher priority than this mark.
   bool drained = false;
   g_idle_add_full(G_PRIORITY_LOW, set_flag, &drained, nullptr);
-  while (!drained) g_main_context_iteration(nullptr, TRUE);
+  // What waits to learn who called is served as well.
+  while (!drained || quarnd_calls_unjudged()) g_main_context_iteration(nullptr, TRUE);
 }
 
 void quarnd_dbus_answer_all() {
@@ -644,6 +787,7 @@ void quarnd_dbus_deinit(unsigned int owner_id) {
     filter_id = 0;
     registration_id = 0;
     closed_handler = 0;
+    forget_callers();
   }
   if (owner_id != 0 && owner_id != kNoOwner) give_up_name();
   // The process may end right after this; answers that were given must have left.

@@ -29,6 +29,8 @@ unsigned int quarnd_dbus_init();
 
 /** True while calls wait for an earlier process to end. */
 bool quarnd_calls_deferred();
+/** True while calls wait for what the bus has to tell of them. */
+bool quarnd_calls_unjudged();
 /** The earlier process has ended: dispatch the calls that wait for it. */
 void quarnd_dispatch_deferred();
 

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gio/gio.h>
 #include <glib-unix.h>
+#include <grp.h>
 #include <poll.h>
 #include <pwd.h>
 #include <sched.h>
@@ -157,20 +158,33 @@ void bind_over(const std::string &source, const char *target) {
   }
 }
 
+/** Inside, the text @p added is at the end of the machine's file @p path, which stays as it is. */
+void show_with(const std::string &device, const char *path, const std::string &added) {
+  std::ifstream present(path);
+  std::string text((std::istreambuf_iterator<char>(present)), {});
+  if (!text.empty() && text.back() != '\n') text += '\n';
+  const std::string file = device + "/run/" + fs::path(path).filename().string();
+  write_file(file, text + added);
+  bind_over(file, path);
+}
+
 /**
- * The bus serves only users that the machine knows: inside, the applications' user is known.
+ * The bus serves only users and groups that the machine knows: inside, the applications' user and
+ * the clients' group are known.
  */
-void show_app_user(const std::string &device) {
+void show_users(const std::string &device) {
   constexpr uid_t kAppUser = 5000;
-  constexpr char kUsers[] = "/etc/passwd";
-  if (getpwuid(kAppUser) != nullptr) return;
-  std::ifstream present(kUsers);
-  std::string users((std::istreambuf_iterator<char>(present)), {});
-  if (!users.empty() && users.back() != '\n') users += '\n';
-  const std::string id = std::to_string(kAppUser);
-  const std::string file = device + "/run/passwd";
-  write_file(file, users + "quarn-app:x:" + id + ":" + id + "::/nonexistent:/usr/sbin/nologin\n");
-  bind_over(file, kUsers);
+  constexpr char kClientGroup[] = "quarn";
+  constexpr gid_t kClientGroupNumber = 5999;
+  if (getpwuid(kAppUser) == nullptr) {
+    const std::string id = std::to_string(kAppUser);
+    show_with(device, "/etc/passwd",
+              "quarn-app:x:" + id + ":" + id + "::/nonexistent:/usr/sbin/nologin\n");
+  }
+  if (getgrnam(kClientGroup) == nullptr) {
+    show_with(device, "/etc/group",
+              std::string(kClientGroup) + ":x:" + std::to_string(kClientGroupNumber) + ":\n");
+  }
 }
 
 /** A mount namespace of the device's own. False when this process may not make one. */
@@ -193,7 +207,7 @@ bool enter_own_namespace(const std::string &device) {
   bind_over(device + "/root/tmp", kTmpPath);
   show_tmp_entry(device, kHostTmpFd, tmp_entry(device));
   show_tmp_entry(device, kHostTmpFd, tmp_entry(program_directory()));
-  show_app_user(device);
+  show_users(device);
   return true;
 }
 

@@ -28,8 +28,17 @@ constexpr int kTurnCheckMs = 100;
 // The worker has no end and may be anywhere when the process exits: what it
 // waits on and reads is never destroyed.
 std::mutex &backup_req_list_mutex = *new std::mutex;
-std::vector<void *> &backup_req_list = *new std::vector<void *>;
-std::vector<void *> &cancelled_clients = *new std::vector<void *>;  // with the list's mutex
+
+struct queued_request {
+  void *client;               /**< null: an automatic backup */
+  std::int64_t waited_before; /**< what the worker had waited for clients when it was made */
+};
+std::vector<queued_request> &backup_req_list = *new std::vector<queued_request>;
+/** With the list's mutex. */
+std::vector<queued_request> &cancelled_clients = *new std::vector<queued_request>;
+
+/** Microseconds that clients which do not answer may hold up another's request, all together. */
+constexpr std::int64_t kLongestHoldUp = 60000000;
 
 /** The manual run that a cancel meets. */
 struct running_manual {
@@ -64,7 +73,7 @@ enum class Taken { kNothing, kRequest };
 Taken take_request(void **client) {
   const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
   if (backup_req_list.empty()) return Taken::kNothing;
-  *client = backup_req_list.front();
+  *client = backup_req_list.front().client;
   backup_req_list.erase(backup_req_list.begin());
   --waiting_entries;
   const auto *record = static_cast<const client_cb_data *>(*client);
@@ -77,15 +86,33 @@ void forget_automatic() {
   automatic_outstanding = false;
 }
 
+/** Whether somebody else than @p sender has waited for unanswered callbacks for long enough. */
+bool others_held_up(const std::string &sender) {
+  const std::int64_t waited = quarn_dbus_time_waited();
+  const auto held_up = [&](const queued_request &request) {
+    const auto *record = static_cast<const client_cb_data *>(request.client);
+    const bool others = record == nullptr || record->sender != sender;
+    return others && waited - request.waited_before >= kLongestHoldUp;
+  };
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  return std::any_of(backup_req_list.begin(), backup_req_list.end(), held_up) ||
+         std::any_of(cancelled_clients.begin(), cancelled_clients.end(), held_up);
+}
+
+bool take_cancelled_client(void **client) {
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  if (cancelled_clients.empty()) return false;
+  *client = cancelled_clients.front().client;
+  cancelled_clients.erase(cancelled_clients.begin());
+  --waiting_entries;
+  return true;
+}
+
 /** Clients whose reservation was cancelled learn it here, not on the main thread. */
 void answer_cancelled_clients() {
-  std::vector<void *> clients;
-  {
-    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
-    clients.swap(cancelled_clients);
-    waiting_entries -= clients.size();
-  }
-  for (void *client : clients) {
+  void *client = nullptr;
+  // One by one: whoever is still to be told counts among those that are held up.
+  while (take_cancelled_client(&client)) {
     quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
     end_request();
   }
@@ -142,14 +169,15 @@ void *backup_req_dispatch_thread(void *) {
 /** Under the list's mutex: take the manual requests out that @p meant says. @return how many */
 template <typename Meant>
 std::uint32_t drop_reservations(Meant meant) {
-  const auto dropped =
-      std::stable_partition(backup_req_list.begin(), backup_req_list.end(), [&meant](void *client) {
-        return client == nullptr || !meant(*static_cast<const client_cb_data *>(client));
+  const auto dropped = std::stable_partition(
+      backup_req_list.begin(), backup_req_list.end(), [&meant](const queued_request &request) {
+        return request.client == nullptr ||
+               !meant(*static_cast<const client_cb_data *>(request.client));
       });
   std::uint32_t count = 0;
-  for (auto client = dropped; client != backup_req_list.end(); ++client, ++count) {
+  for (auto request = dropped; request != backup_req_list.end(); ++request, ++count) {
     LOGI("reservation for manual backup is canceled");
-    cancelled_clients.push_back(*client);
+    cancelled_clients.push_back(*request);
   }
   backup_req_list.erase(dropped, backup_req_list.end());
   return count;
@@ -173,6 +201,7 @@ void set_backup_end_observer(backup_end_observer observer) { end_observer = obse
 
 void init_backup_req_dispatch_thread() {
   LOGI("init_backup_req_dispatch_thread");
+  quarn_dbus_set_patience(others_held_up);
   pthread_t worker = {};
   const int ret = pthread_create(&worker, nullptr, backup_req_dispatch_thread, nullptr);
   if (ret != 0) {
@@ -190,7 +219,7 @@ void request_backup(void *client) {
       return;
     }
     ++outstanding_requests;
-    backup_req_list.push_back(client);
+    backup_req_list.push_back({client, quarn_dbus_time_waited()});
     ++waiting_entries;
   }
   wake_worker();

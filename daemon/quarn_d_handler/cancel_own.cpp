@@ -9,7 +9,7 @@
 #include "quarn_log.h"
 
 std::uint32_t quarnd_cancel_own(const std::string &sender) {
-  std::uint32_t count = cancel_backups_of(sender);
+  std::uint32_t count = quarnd_cancel_starting_backups(&sender) + cancel_backups_of(sender);
   for (const std::uint64_t fiber : fibers_of_caller(sender)) {
     if (withdraw_waits(fiber)) ++count;
   }

@@ -19,4 +19,11 @@
  */
 std::uint32_t quarnd_cancel_own(const std::string &sender);
 
+/**
+ * Cancel the manual backups whose clients are being told that they are taken.
+ * @param sender whose; null: everybody's
+ * @return how many were cancelled
+ */
+std::uint32_t quarnd_cancel_starting_backups(const std::string *sender);
+
 #endif

@@ -1,6 +1,11 @@
+#include <algorithm>
+#include <string>
+#include <vector>
+
 #include "platform_settings.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/fiber.h"
@@ -16,7 +21,24 @@ enum list_client : unsigned int { CLIENT_CLOUD = 0, CLIENT_COMPANION = 1 };
 
 constexpr char kFailed[] = "failed";
 
+/** A manual backup that is taken, while its client is told so; it lives on its fiber's stack. */
+struct starting_backup {
+  std::string sender;
+  bool cancelled = false;
+};
+std::vector<starting_backup *> starting;
+
 }  // namespace
+
+std::uint32_t quarnd_cancel_starting_backups(const std::string *sender) {
+  std::uint32_t count = 0;
+  for (starting_backup *backup : starting) {
+    if (backup->cancelled || (sender != nullptr && backup->sender != *sender)) continue;
+    backup->cancelled = true;
+    ++count;
+  }
+  return count;
+}
 
 int quarnd_backup_enable(int on) {
   vconf_set_int(kBackupStatusKey, on != 0 ? 1 : 0);
@@ -51,7 +73,16 @@ int quarnd_get_app_list(int client, void *record) {
 int quarnd_manual_backup(void *record) {
   LOGI("request for manual backup");
   manual_backup_canceled = false;
+  // Others are served until the client has answered, and may cancel it.
+  starting_backup own{static_cast<const client_cb_data *>(record)->sender};
+  starting.push_back(&own);
   quarn_dbus_manual_backup_status(QUARN_OK, QUARN_BACKUP_RUNNING, record);
+  starting.erase(std::find(starting.begin(), starting.end(), &own));
+  if (own.cancelled) {
+    LOGI("reservation for manual backup is canceled");
+    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, record);
+    return QUARN_OK;
+  }
   request_backup(record);
   return QUARN_OK;
 }
@@ -59,6 +90,7 @@ int quarnd_manual_backup(void *record) {
 int quarnd_manual_backup_cancel(void *record) {
   LOGI("quarnd_manual_backup_cancel");
   manual_backup_canceled = true;
+  quarnd_cancel_starting_backups(nullptr);
   cancel_backup(record);
   quarn_dbus_manual_backup_cancel_result(QUARN_OK, record);
   return QUARN_OK;

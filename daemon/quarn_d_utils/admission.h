@@ -15,15 +15,26 @@
 
 inline constexpr std::size_t kMaxWaitingOfCaller = 64;
 inline constexpr std::size_t kMaxWaiting = 512;
+/** Of one user other than root over all its connections: half of all stays for others. */
+inline constexpr std::size_t kMaxWaitingOfUser = 256;
+/** Of one application, which a security label names, over all its connections. */
+inline constexpr std::size_t kMaxWaitingOfLabel = 64;
+
+/** Whose requests a connection's are besides; empty: nobody's that is bounded. */
+struct waiting_parties {
+  std::string user;
+  std::string label;
+};
 
 /** True when another request of @p caller, a unique bus name, may be accepted. Any thread. */
-bool may_wait(const std::string &caller);
+bool may_wait(const std::string &caller, const waiting_parties &parties = {});
 
 /**
  * Count a request that the running fiber, if it is one, works on.
  * @return it counts until this goes, on any thread
  */
-std::shared_ptr<const void> count_waiting(const std::string &caller);
+std::shared_ptr<const void> count_waiting(const std::string &caller,
+                                          const waiting_parties &parties = {});
 
 /** Requests that count. Any thread. */
 std::size_t waiting_requests();

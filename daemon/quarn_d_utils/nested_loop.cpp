@@ -13,6 +13,7 @@ namespace {
 struct fiber_wait {
   GMainLoop *loop;
   quarn_fiber *fiber;
+  bool withdrawable;
   bool ended = false; /**< its loop was not quit, but nobody waits for that any more */
 };
 
@@ -66,8 +67,8 @@ void unwatch_waits() {
   wait_source = nullptr;
 }
 
-void wait_on_fiber(GMainLoop *loop) {
-  fiber_wait wait{loop, current_fiber()};
+void wait_on_fiber(GMainLoop *loop, bool withdrawable) {
+  fiber_wait wait{loop, current_fiber(), withdrawable};
   waits.push_back(&wait);
   watch_waits();
   while (!is_over(&wait)) suspend_fiber();
@@ -82,7 +83,7 @@ GMainLoop *new_wait_loop() { return g_main_loop_new(nullptr, TRUE); }
 void run_nested_loop(GMainLoop *loop) {
   if (waits_are_ended()) return;
   if (current_fiber() != nullptr) {
-    wait_on_fiber(loop);
+    wait_on_fiber(loop, true);
     return;
   }
   while (!refuse_nested_loops && g_main_loop_is_running(loop) != FALSE) {
@@ -90,11 +91,15 @@ void run_nested_loop(GMainLoop *loop) {
   }
 }
 
+void wait_for_answer(GMainLoop *loop) {
+  if (!refuse_nested_loops && current_fiber() != nullptr) wait_on_fiber(loop, false);
+}
+
 bool waits_are_ended() { return refuse_nested_loops || fiber_is_withdrawn(current_fiber()); }
 
 bool withdraw_waits(std::uint64_t fiber) {
   const auto found = std::find_if(waits.begin(), waits.end(), [fiber](const fiber_wait *wait) {
-    return fiber_id(wait->fiber) == fiber;
+    return fiber_id(wait->fiber) == fiber && wait->withdrawable;
   });
   if (found == waits.end() || is_over(*found)) return false;
   (*found)->ended = true;

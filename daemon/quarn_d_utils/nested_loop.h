@@ -28,6 +28,13 @@ GMainLoop *new_wait_loop();
 bool waits_are_ended();
 
 /**
+ * Wait for a client's answer to a callback: as run_nested_loop(), but nobody
+ * withdraws it, for what was asked for is settled then. Off a fiber it returns
+ * at once.
+ */
+void wait_for_answer(GMainLoop *loop);
+
+/**
  * End the wait of a fiber, and refuse all that it would begin later.
  * @param fiber a fiber_id()
  * @return false when it does not wait, or what it waits for has come

@@ -89,6 +89,11 @@ int quarn_dbus_manual_backup_status(int err, int status, void *record) {
   return 0;
 }
 
+std::atomic<std::int64_t> time_waited_for_clients{0};
+callback_patience patience_of_worker = nullptr;
+void quarn_dbus_set_patience(callback_patience exhausted) { patience_of_worker = exhausted; }
+std::int64_t quarn_dbus_time_waited() { return time_waited_for_clients; }
+
 /* ---- cloud ---- */
 
 FakeCloud::FakeCloud() {

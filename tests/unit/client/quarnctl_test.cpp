@@ -324,7 +324,7 @@ TEST_F(Quarnctl, AWithdrawalThatIsRefusedEndsIt) {
     call.reply_error("org.freedesktop.DBus.Error.AccessDenied", "not you");
   });
   const Outcome outcome = run.wait();
-  EXPECT_EQ(outcome.err, "quarnctl: the bus does not allow the call: not you\n");
+  EXPECT_EQ(outcome.err, "quarnctl: not permitted: this needs root, or to be in the group quarn\n");
 }
 
 TEST_F(Quarnctl, AnInterruptEndsARequestThatCannotBeCancelled) {
@@ -438,7 +438,8 @@ TEST_F(Quarnctl, ABusThatGoesAwayIsTold) {
 
 TEST_F(Quarnctl, ErrorsOfTheBusHaveTheirOwnExitCodes) {
   const std::vector<std::tuple<std::string, int, std::string>> cases = {
-      {"org.freedesktop.DBus.Error.AccessDenied", kDenied, "the bus does not allow the call: no"},
+      {"org.freedesktop.DBus.Error.AccessDenied", kDenied,
+       "not permitted: this needs root, or to be in the group quarn"},
       {"org.freedesktop.DBus.Error.NotSupported", kUnusable, "the daemon refused the call: no"},
       {"org.freedesktop.DBus.Error.UnknownMethod", kUnusable, "the daemon refused the call: no"},
       {"org.freedesktop.DBus.Error.NoReply", kDaemonEnded,

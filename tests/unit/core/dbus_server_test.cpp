@@ -14,6 +14,7 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_end.h"
+#include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
@@ -22,6 +23,7 @@
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
+#include "quarn_dbus_limits.h"
 
 namespace {
 
@@ -78,7 +80,8 @@ guint __wrap_g_bus_own_name(GBusType type, const gchar *name, GBusNameOwnerFlags
 }
 }
 
-bool is_idle_status() { return true; }
+char cloud_restore_running = 0;
+bool is_idle_status() { return !quarnd_calls_unjudged(); }
 void quarn_loop_quit() { steps.emplace_back("quit"); }
 void init_last_backup_time() { note("init_last_backup_time"); }
 void request_quarn_terminate(double delay, bool restart) {
@@ -154,6 +157,245 @@ class Server : public ::testing::Test {
   unsigned int owner_id_ = 0;
   std::unique_ptr<ScriptedClient> client_;
 };
+
+constexpr char kTooMany[] = "org.freedesktop.DBus.Error.LimitsExceeded";
+
+/* ---- who may call ---- */
+
+constexpr char kDenied[] = "org.freedesktop.DBus.Error.AccessDenied";
+constexpr char kInvalid[] = "org.freedesktop.DBus.Error.InvalidArgs";
+constexpr gid_t kGroup = 7001;
+
+/** The bus tells what the test says, when the test says it. */
+class Callers : public Server {
+ protected:
+  void SetUp() override {
+    Server::SetUp();
+    set_client_group(kGroup);
+    set_caller_source([this](const std::string &, caller_work answer) {
+      if (held_) {
+        questions_.push_back(std::move(answer));
+      } else {
+        answer(told_);
+      }
+    });
+    // What the test before has made known.
+    forget_callers();
+  }
+  void TearDown() override {
+    set_caller_source(nullptr);
+    Server::TearDown();
+  }
+  static quarn_caller application(const std::string &label) { return {true, 5000, {5000}, label}; }
+
+  quarn_caller told_;
+  bool held_ = false;
+  std::vector<caller_work> questions_;
+};
+
+const std::vector<std::pair<const char *, const char *>> kEverything = {
+    {"set_activation", "(0,)"},
+    {"backup_enable", "(1,)"},
+    {"restore_enable", "(1, 0, '35', '[\"a\"]', uint32 1)"},
+    {"restore_enable", "(0, 0, '', '', uint32 1)"},
+    {"last_bu_time", "()"},
+    {"get_app_list", "(0, uint32 1)"},
+    {"auto_backup_start", "('',)"},
+    {"manual_backup_start", "(uint32 1,)"},
+    {"manual_backup_cancel", "(uint32 1,)"},
+    {"app_data_backup_start", "('org.example.notes', uint32 1)"},
+    {"app_data_restore_start", "('org.example.notes', uint32 1)"},
+    {"make_app_data", "('org.example.notes',)"},
+    {"fly", "('high',)"},
+    {"fly", "()"},
+    {"set_activation", "()"},
+    {"set_activation", "('one',)"}};
+
+TEST_F(Callers, WhoMayNothingIsRefusedEverythingAndTouchesOnlyThePendingEnd) {
+  const quarn_caller strangers[] = {{true, 7001, {100}, ""},
+                                    {true, 5000, {5000}, ""},
+                                    {true, 5000, {5000}, "_"},
+                                    {true, 7001, {100}, "org.example.notes"},
+                                    {}};
+  for (const quarn_caller &stranger : strangers) {
+    told_ = stranger;
+    forget_callers();
+    for (const auto &[method, arguments] : kEverything) {
+      steps.clear();
+      clear_captured_log();
+      const CallOutcome outcome = client_->call(method, arguments);
+      EXPECT_EQ(outcome.error_name, kDenied) << method << arguments << stranger.label;
+      EXPECT_EQ(steps, Texts{"cancel"}) << method << arguments;
+      EXPECT_EQ(captured_log().size(), 1U) << "one line";
+      EXPECT_EQ(captured_log().front().text.rfind(
+                    "refused : " + std::string(method) + " of (" + client_->name() + ") : ", 0),
+                0U);
+    }
+    for (const char *interface : {"org.freedesktop.DBus.Introspectable", "org.example.Other",
+                                  "org.freedesktop.DBus.Peer", "org.freedesktop.DBus.Properties"}) {
+      steps.clear();
+      EXPECT_EQ(client_->call("Introspect", "()", interface).error_name, kDenied) << interface;
+      EXPECT_TRUE(steps.empty());
+    }
+  }
+}
+
+TEST_F(Callers, AnApplicationAsksForItsOwnPackageAndNoOther) {
+  told_ = application("org.example.notes");
+  for (const char *method : {"app_data_backup_start", "app_data_restore_start"}) {
+    EXPECT_EQ(client_->call(method, "('org.example.notes', uint32 1)").reply, "(0,)");
+    steps.clear();
+    EXPECT_EQ(client_->call(method, "('org.example.other', uint32 1)").error_name, kDenied);
+    EXPECT_EQ(steps, Texts{"cancel"});
+  }
+  EXPECT_EQ(client_->call("make_app_data", "('org.example.notes',)").reply, "(0,)");
+  EXPECT_EQ(steps.back(), "make_app_data org.example.notes 5000") << "and the archive is its own";
+  const CallOutcome refused = client_->call("make_app_data", "('org.example.other',)");
+  EXPECT_EQ(refused.error_name, kDenied);
+  EXPECT_EQ(refused.error_text,
+            "make_app_data is refused: an application may ask for its own package only");
+  EXPECT_EQ(client_->call("backup_enable", "(0,)").error_text,
+            "backup_enable is refused: it is for root and the group quarn");
+}
+
+TEST_F(Callers, TheCompanionAsksForItsListAndItsRestoreMode) {
+  told_ = application("com.velmor.pellix-efl");
+  EXPECT_EQ(client_->call("get_app_list", "(1, uint32 1)").reply, "(0,)");
+  EXPECT_EQ(client_->call("get_app_list", "(0, uint32 1)").error_name, kDenied);
+  EXPECT_EQ(client_->call("restore_enable", "(1, 1, '', '[]', uint32 1)").reply, "(0,)");
+  EXPECT_EQ(client_->call("restore_enable", "(1, 0, '', '[]', uint32 1)").error_name, kDenied);
+  EXPECT_EQ(client_->call("restore_enable", "(0, 1, '', '', uint32 1)").reply, "(0,)");
+  cloud_restore_running = 1;
+  EXPECT_EQ(client_->call("restore_enable", "(0, 1, '', '', uint32 1)").error_name, kDenied);
+  cloud_restore_running = 0;
+  EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").error_name, kDenied);
+}
+
+TEST_F(Callers, AMemberOfTheGroupMayEverything) {
+  told_ = {true, 7001, {100, kGroup}, ""};
+  for (const auto &[method, arguments] : kEverything) {
+    EXPECT_NE(client_->call(method, arguments).error_name, kDenied) << method;
+  }
+  EXPECT_NE(client_->call("Introspect", "()", "org.freedesktop.DBus.Introspectable").reply, "");
+}
+
+TEST_F(Callers, CallsThatWaitForTheAnswerKeepTheirOrderAndHoldUpNobody) {
+  held_ = true;
+  const char *const methods[] = {"backup_enable", "fly", "backup_enable"};
+  std::vector<std::shared_ptr<CallOutcome>> outcomes;
+  for (std::size_t i = 0; i < std::size(methods); ++i) {
+    outcomes.push_back(std::make_shared<CallOutcome>());
+    client_->start_call(methods[i], i == 1 ? "()" : "(" + number(static_cast<int>(i)) + ",)",
+                        outcomes.back());
+  }
+  EXPECT_TRUE(run_until([this] { return !questions_.empty(); }));
+  EXPECT_TRUE(quarnd_calls_unjudged());
+  held_ = false;
+  told_ = {true, 0, {}, ""};
+  ScriptedClient other;
+  EXPECT_EQ(other.call("set_activation", "(1,)").reply, "(0,)");
+  EXPECT_EQ(questions_.size(), 1U);
+  steps.clear();
+  questions_.front()({true, 0, {}, ""});
+  EXPECT_TRUE(run_until([&] { return outcomes.back()->finished; }));
+  EXPECT_EQ(steps, (Texts{"cancel", "backup_enable 0", "cancel", "cancel", "backup_enable 2"}));
+  EXPECT_FALSE(quarnd_calls_unjudged());
+}
+
+gboolean run_work(gpointer work) {
+  (*static_cast<std::function<void()> *>(work))();
+  return G_SOURCE_REMOVE;
+}
+
+TEST_F(Callers, LeavingWaitsForTheAnswerAndServesWhatHadArrived) {
+  held_ = true;
+  const auto outcome = std::make_shared<CallOutcome>();
+  client_->start_call("backup_enable", "(1,)", outcome);
+  EXPECT_TRUE(run_until([this] { return !questions_.empty(); }));
+  std::function<void()> answer = [this] { questions_.front()({true, 0, {}, ""}); };
+  g_timeout_add(50, run_work, &answer);
+  quarnd_dbus_leave();
+  EXPECT_EQ(steps, (Texts{"cancel", "backup_enable 1"}));
+  EXPECT_TRUE(run_until([&] { return outcome->finished; }));
+  EXPECT_EQ(outcome->reply, "(0,)");
+}
+
+TEST_F(Callers, AUserAndAnApplicationAreBoundedOverAllTheirConnections) {
+  std::vector<RecordPtr> records;
+  kept_records = &records;
+  std::vector<std::unique_ptr<ScriptedClient>> clients;
+  const auto ask = [&](const std::string &label) {
+    told_ = application(label);
+    constexpr std::size_t kOfAConnection = 8;
+    if (records.size() % kOfAConnection == 0) clients.push_back(std::make_unique<ScriptedClient>());
+    return clients.back()->call("app_data_backup_start", "('" + label + "', uint32 1)").error_name;
+  };
+  for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_EQ(ask("org.example.a"), "") << i;
+  EXPECT_EQ(ask("org.example.a"), kTooMany) << "however many connections it has";
+  for (const char *label : {"org.example.b", "org.example.c", "org.example.d"}) {
+    for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_EQ(ask(label), "") << i;
+  }
+  EXPECT_EQ(records.size(), kMaxWaitingOfUser);
+  EXPECT_EQ(ask("org.example.e"), kTooMany) << "all applications together";
+  told_ = {true, 0, {}, ""};
+  ScriptedClient root;
+  EXPECT_EQ(root.call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
+}
+
+TEST_F(Callers, ListsAndNamesAreBoundedBeforeARecordIsMade) {
+  told_ = {true, 0, {}, ""};
+  const auto list = [](std::size_t packages) {
+    std::string text = "[\"a\"";
+    for (std::size_t i = 1; i < packages; ++i) text += ",\"a\"";
+    return "(1, 0, '35', '" + text + "]', uint32 1)";
+  };
+  EXPECT_EQ(client_->call("restore_enable", list(kMostCandidates)).reply, "(0,)");
+  steps.clear();
+  CallOutcome outcome = client_->call("restore_enable", list(kMostCandidates + 1));
+  EXPECT_EQ(outcome.error_name, kInvalid);
+  EXPECT_EQ(outcome.error_text, "pkg_list has more than 4096 packages");
+  const std::string long_id(kMostListBytes, 'a');
+  outcome = client_->call("restore_enable", "(1, 0, '35', '[\"" + long_id + "\"]', uint32 1)");
+  EXPECT_EQ(outcome.error_text, "pkg_list has more than 262144 bytes");
+  const std::string name(kMostNameBytes + 1, 'a');
+  outcome = client_->call("restore_enable", "(1, 0, '" + name + "', '[]', uint32 1)");
+  EXPECT_EQ(outcome.error_text, "serial_num has more than 255 bytes");
+  for (const char *method : {"app_data_backup_start", "app_data_restore_start"}) {
+    outcome = client_->call(method, "('" + name + "', uint32 1)");
+    EXPECT_EQ(outcome.error_text, "pkg_id has more than 255 bytes");
+  }
+  outcome = client_->call("make_app_data", "('" + name + "',)");
+  EXPECT_EQ(outcome.error_name, kInvalid);
+  EXPECT_EQ(steps, Texts(6, "cancel"));
+}
+
+TEST_F(Callers, ArgumentsThatNobodyWouldReadAreNotKept) {
+  told_ = {true, 0, {}, ""};
+  const std::string large(kMostArgumentBytes, 'a');
+  const std::string list(kMostListArgumentBytes, 'a');
+  for (const char *interface : {"org.orvane.Quarn", "org.example.Other"}) {
+    const CallOutcome outcome = client_->call("auto_backup_start", "('" + large + "',)", interface);
+    EXPECT_EQ(outcome.error_name, kInvalid);
+    EXPECT_EQ(outcome.error_text, "The arguments are too large");
+  }
+  EXPECT_EQ(client_->call("restore_enable", "(1, 0, '', '" + list + "', uint32 1)").error_text,
+            "The arguments are too large");
+  EXPECT_EQ(count_logged(DLOG_ERROR, "refused : restore_enable of (" + client_->name() +
+                                         ") : The arguments are too large"),
+            1);
+  told_ = application("");
+  ScriptedClient stranger;
+  EXPECT_EQ(stranger.call("auto_backup_start", "('" + large + "',)").error_name, kDenied);
+}
+
+TEST(Elements, AreCountedWithoutParsingAndNeverTooFew) {
+  EXPECT_EQ(most_elements_of(""), 1U);
+  EXPECT_EQ(most_elements_of("[\"a\",\"b\"]"), 2U);
+  EXPECT_EQ(most_elements_of("[\"a,b\",\"c\\\",d\",\"e\"]"), 3U);
+  EXPECT_EQ(most_elements_of("[\"a\\"), 1U);
+}
+
+/* ---- what it dispatches ---- */
 
 TEST_F(Server, StartLogsItsSteps) {
   bool called = false;
@@ -270,8 +512,6 @@ TEST_F(Server, EachCallIsAnsweredWhenItsOwnEventComes) {
     EXPECT_EQ(outcomes[answered]->reply, "(0,)");
   }
 }
-
-constexpr char kTooMany[] = "org.freedesktop.DBus.Error.LimitsExceeded";
 
 /** Every request that waits, and its arguments. */
 const std::vector<std::pair<const char *, const char *>> kWaiting = {
@@ -553,6 +793,7 @@ TEST_F(Server, EndTakesTheNameBackForACallThatHadArrived) {
   clear_captured_log();
   begin_quarn_end();
   EXPECT_TRUE(run_until(acquired));
+  EXPECT_TRUE(run_until([&] { return outcome->finished; }));
   EXPECT_EQ(outcome->reply, "(0,)");
   EXPECT_EQ(client_->call("backup_enable", "(2,)").reply, "(0,)");
   EXPECT_EQ(std::count(steps.begin(), steps.end(), "quit"), 0);

@@ -175,6 +175,26 @@ TEST(Admission, AllTogetherHaveFiveHundredAndTwelve) {
   EXPECT_TRUE(may_wait(":1.1000"));
 }
 
+TEST(Admission, AUserAndALabelHaveTheirsOverAllConnections) {
+  std::vector<std::shared_ptr<const void>> waiting;
+  const auto take = [&waiting](const waiting_parties &parties) {
+    const std::string caller = ":1." + std::to_string(waiting.size());
+    if (!may_wait(caller, parties)) return false;
+    waiting.push_back(count_waiting(caller, parties));
+    return true;
+  };
+  for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_TRUE(take({"user", "label"})) << i;
+  EXPECT_FALSE(take({"user", "label"}));
+  EXPECT_TRUE(take({"user", "other label"}));
+  while (waiting.size() < kMaxWaitingOfUser) ASSERT_TRUE(take({"user", ""}));
+  EXPECT_FALSE(take({"user", ""}));
+  EXPECT_TRUE(take({"other user", ""}));
+  while (waiting.size() < kMaxWaiting) ASSERT_TRUE(take({}));
+  EXPECT_FALSE(take({}));
+  waiting.clear();
+  EXPECT_TRUE(take({"user", "label"})) << "all are given back";
+}
+
 TEST(Admission, KnowsTheFibersOfACaller) {
   std::shared_ptr<const void> waiting;
   std::uint64_t number = 0;

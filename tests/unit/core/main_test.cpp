@@ -100,6 +100,10 @@ void quarnd_dbus_leave() {
 bool calls_deferred = false;
 bool turn_is_there = true;
 bool quarnd_calls_deferred() { return calls_deferred; }
+bool calls_unjudged = false;
+bool quarnd_calls_unjudged() { return calls_unjudged; }
+bool answers_awaited = false;
+bool quarn_dbus_answers_awaited() { return answers_awaited; }
 char pellix_restore_running = 0;
 char cloud_restore_running = 0;
 std::vector<std::string> turn_lines;
@@ -111,6 +115,7 @@ void request_quarn_terminate(double delay, bool restart) {
   step(delay == 0.0 && !restart ? "terminate" : "terminate?");
 }
 std::vector<std::string> take_quarn_turn_lines() { return std::exchange(turn_lines, {}); }
+std::uint32_t quarnd_cancel_starting_backups(const std::string *) { return 0; }
 std::uint32_t quarnd_cancel_own(const std::string &sender) {
   step(("cancel_own " + sender).c_str());
   return 0;
@@ -412,6 +417,17 @@ TEST_F(Main, CallsThatWaitForTheEarlierProcessKeepTheDaemonAndFollowIt) {
   calls_deferred = true;
   EXPECT_TRUE(pending_probe());
   EXPECT_EQ(on_turn, quarnd_dispatch_deferred);
+}
+
+TEST_F(Main, CallsThatAreNotJudgedYetAndAnswersThatAreAwaitedKeepTheDaemon) {
+  quarn_run();
+  backups_outstanding = false;
+  for (bool *const work : {&calls_unjudged, &answers_awaited}) {
+    EXPECT_FALSE(pending_probe());
+    *work = true;
+    EXPECT_TRUE(pending_probe());
+    *work = false;
+  }
 }
 
 TEST_F(Main, InitTwiceLogsAndAsksForTheBusOnce) {

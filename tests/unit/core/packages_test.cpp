@@ -9,6 +9,7 @@
 
 #include "log_capture.h"
 #include "private_bus.h"
+#include "quarn_d_gate.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
@@ -41,11 +42,16 @@ class Packages : public ::testing::Test {
     private_bus_address();
     steps.clear();
     clear_captured_log();
+    set_caller_source([this](const std::string &, caller_work answer) { answer(told_); });
     connection_ = connect_to_private_bus();
     client_ = connect_to_private_bus();
     quarnd_packages_export(connection_.get());
   }
-  void TearDown() override { quarnd_packages_unexport(); }
+  void TearDown() override {
+    quarnd_packages_unexport();
+    forget_callers();
+    set_caller_source(nullptr);
+  }
 
   struct Outcome {
     bool finished = false;
@@ -73,6 +79,7 @@ class Packages : public ::testing::Test {
     return outcome.text;
   }
 
+  quarn_caller told_{true, 0, {}, ""};
   ConnectionHandle connection_;
   ConnectionHandle client_;
 };
@@ -91,6 +98,22 @@ TEST_F(Packages, CancelOwnReachesAnEarlierProcessThatStillFinishes) {
   const std::string caller = g_dbus_connection_get_unique_name(client_.get());
   EXPECT_EQ(steps, (std::vector<std::string>{"cancel", "pass on " + caller, caller}));
   EXPECT_EQ(count_logged(DLOG_INFO, "withdrawal passed on"), 1);
+}
+
+TEST_F(Packages, AnApplicationWithdrawsItsOwnAndAStrangerNothing) {
+  told_ = {true, 5000, {5000}, "org.example.notes"};
+  withdrawn = 1;
+  EXPECT_EQ(call("CancelOwn"), "(1,)");
+  steps.clear();
+  clear_captured_log();
+  forget_callers();
+  told_ = {true, 5000, {5000}, ""};
+  EXPECT_EQ(call("CancelOwn"), "org.freedesktop.DBus.Error.AccessDenied");
+  EXPECT_EQ(steps, std::vector<std::string>{"cancel"});
+  EXPECT_EQ(captured_texts(),
+            std::vector<std::string>{"refused : CancelOwn of (" +
+                                     std::string(g_dbus_connection_get_unique_name(client_.get())) +
+                                     ") : its security label is no package's"});
 }
 
 TEST_F(Packages, OtherMethodsAreUnknown) {

@@ -196,6 +196,23 @@ void ScriptedClient::keep_silent(const std::string &method) {
   silent_[method] = true;
 }
 
+void ScriptedClient::answer_silent() {
+  std::vector<GDBusMethodInvocation *> late;
+  {
+    const std::lock_guard<std::mutex> lock(mutex_);
+    late.swap(unanswered_);
+    silent_.clear();
+  }
+  for (GDBusMethodInvocation *invocation : late) {
+    const Handle<GDBusMessage, &g_object_unref> answer(
+        g_dbus_message_new_method_reply(g_dbus_method_invocation_get_message(invocation)));
+    g_dbus_message_set_body(answer.get(), parse("(0,)"));
+    g_dbus_connection_send_message(connection_.get(), answer.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE,
+                                   nullptr, nullptr);
+    g_object_unref(invocation);
+  }
+}
+
 bool ScriptedClient::wait_for_callbacks(std::size_t count) const {
   std::unique_lock<std::mutex> lock(mutex_);
   return changed_.wait_for(lock, std::chrono::seconds(kDeadlineSeconds),

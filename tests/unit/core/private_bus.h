@@ -57,6 +57,8 @@ class ScriptedClient {
   void answer(const std::string &method, const std::string &reply);
   /** Never answer @p method. */
   void keep_silent(const std::string &method);
+  /** Answer, late, what was not answered. */
+  void answer_silent();
   /** Wait for that many callbacks. */
   bool wait_for_callbacks(std::size_t count) const;
 

@@ -1,12 +1,15 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <functional>
+#include <utility>
 #include <vector>
 
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/quarn_d_utils.h"
@@ -26,7 +29,7 @@ bool cloud_ready = true;
 int list_result = 0;
 int callback_result = 0;
 std::int64_t present_time = 0;
-int marker = 0;
+client_cb_data marker{7, ":1.1"};
 void *const record = &marker;
 
 std::string number(long long value) { return std::to_string(value); }
@@ -61,7 +64,10 @@ int quarn_dbus_get_app_list_cb(int err, const char *msg, void *data) {
   note("get_app_list_cb " + number(err) + " " + msg, data);
   return callback_result;
 }
+/** Done while the client is told that its backup is taken: others are served meanwhile. */
+std::function<void()> while_told;
 int quarn_dbus_manual_backup_status(int err, int status, void *data) {
+  if (status == QUARN_BACKUP_RUNNING && while_told) std::exchange(while_told, nullptr)();
   note("status " + number(err) + " " + number(status) +
            " cancelled=" + (manual_backup_canceled ? "1" : "0"),
        data);
@@ -151,6 +157,27 @@ TEST_F(Requests, ManualBackupIsQueuedForAClientThatCannotBeReached) {
   callback_result = 42;
   EXPECT_EQ(quarnd_manual_backup(record), 0);
   EXPECT_EQ(steps.back(), "request_backup cancelled=0");
+}
+
+TEST_F(Requests, ManualBackupThatIsCancelledWhileItsClientIsToldIsNeverQueued) {
+  while_told = [] { EXPECT_EQ(quarnd_manual_backup_cancel(record), 0); };
+  EXPECT_EQ(quarnd_manual_backup(record), 0);
+  EXPECT_EQ(steps, (Texts{"cancel_backup cancelled=1", "cancel_result 0", "status 0 2 cancelled=1",
+                          "status 17 6 cancelled=1"}));
+  EXPECT_EQ(count_logged(DLOG_INFO, "reservation for manual backup is canceled"), 1);
+}
+
+TEST_F(Requests, ManualBackupIsWithdrawnWhileItsClientIsToldByThatClientAlone) {
+  const std::string own = ":1.1";
+  const std::string other = ":1.2";
+  while_told = [&] {
+    EXPECT_EQ(quarnd_cancel_starting_backups(&other), 0U);
+    EXPECT_EQ(quarnd_cancel_starting_backups(&own), 1U);
+    EXPECT_EQ(quarnd_cancel_starting_backups(&own), 0U) << "once";
+  };
+  EXPECT_EQ(quarnd_manual_backup(record), 0);
+  EXPECT_EQ(steps.back(), "status 17 6 cancelled=0");
+  EXPECT_EQ(quarnd_cancel_starting_backups(nullptr), 0U);
 }
 
 TEST_F(Requests, ManualBackupCancelIsAcknowledgedAtOnceEvenWhenNothingRuns) {

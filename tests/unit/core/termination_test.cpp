@@ -19,6 +19,7 @@ bool idle = true;
 
 }  // namespace
 
+char cloud_restore_running = 0;
 bool is_idle_status() { return idle; }
 void init_last_backup_time() {}
 int quarnd_backup_enable(int) { return 0; }

@@ -1,0 +1,304 @@
+#include "quarn_d_gate.h"
+
+#include <grp.h>
+#include <pwd.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <deque>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <utility>
+#include <vector>
+
+#include "quarn_common.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_log.h"
+
+namespace {
+
+constexpr char kBusName[] = "org.freedesktop.DBus";
+constexpr char kBusPath[] = "/org/freedesktop/DBus";
+/** Milliseconds that the bus may take to tell who calls. */
+constexpr int kBusTimeout = 5000;
+constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
+constexpr std::size_t kLookUpRoom = 4096;
+constexpr int kGroupsAtFirst = 32;
+
+/** What is known of one connection, and what waits to know it. */
+struct connection_entry {
+  quarn_caller caller;
+  bool asked = false;
+  bool told = false;
+  std::deque<caller_work> waiting;
+  GDBusConnection *connection = nullptr;
+  guint subscription = 0;
+  std::uint64_t age = 0;
+};
+using EntryPtr = std::shared_ptr<connection_entry>;
+
+// The process may be left while other threads look.
+std::mutex &entries_mutex = *new std::mutex;  // the main thread writes, under it
+std::map<std::string, EntryPtr> &entries = *new std::map<std::string, EntryPtr>;
+std::uint64_t last_age = 0;
+caller_source &source = *new caller_source;
+std::optional<gid_t> given_group;
+
+void drop(const std::string &sender) {
+  EntryPtr dropped;
+  {
+    const std::lock_guard<std::mutex> lock(entries_mutex);
+    const auto found = entries.find(sender);
+    if (found == entries.end()) return;
+    dropped = std::move(found->second);
+    entries.erase(found);
+  }
+  if (dropped->subscription != 0) {
+    g_dbus_connection_signal_unsubscribe(dropped->connection, dropped->subscription);
+  }
+}
+
+void on_left(GDBusConnection *, const gchar *, const gchar *, const gchar *, const gchar *,
+             GVariant *parameters, gpointer) {
+  if (g_variant_is_of_type(parameters, G_VARIANT_TYPE("(sss)")) == FALSE) return;
+  const char *name = nullptr;
+  const char *owner = nullptr;
+  g_variant_get(parameters, "(&s&s&s)", &name, nullptr, &owner);
+  if (*owner != '\0') return;
+  const auto found = entries.find(name);
+  // Who has left while it is asked for is told of by the answer.
+  if (found != entries.end() && found->second->told) drop(name);
+}
+
+/** Room for another: the one that is known longest and has nothing waiting. */
+void make_room() {
+  if (entries.size() < kMostCallersKnown) return;
+  const std::string *oldest = nullptr;
+  std::uint64_t age = 0;
+  for (const auto &[name, entry] : entries) {
+    if (!entry->told || !entry->waiting.empty()) continue;
+    if (oldest == nullptr || entry->age < age) {
+      oldest = &name;
+      age = entry->age;
+    }
+  }
+  if (oldest != nullptr) drop(std::string(*oldest));
+}
+
+EntryPtr entry_of(GDBusConnection *connection, const std::string &sender) {
+  const auto found = entries.find(sender);
+  if (found != entries.end()) return found->second;
+  make_room();
+  auto entry = std::make_shared<connection_entry>();
+  entry->age = ++last_age;
+  entry->connection = connection;
+  const std::lock_guard<std::mutex> lock(entries_mutex);
+  entries[sender] = entry;
+  return entry;
+}
+
+void drain(const EntryPtr &entry) {
+  while (!entry->waiting.empty()) {
+    const caller_work work = std::move(entry->waiting.front());
+    entry->waiting.pop_front();
+    work(entry->caller);
+  }
+}
+
+/** Hear of a connection's end; after its answers, which nothing is to delay. */
+void watch(const std::string &sender, const EntryPtr &entry) {
+  const auto found = entries.find(sender);
+  if (entry->connection == nullptr || found == entries.end() || found->second != entry) return;
+  entry->subscription = g_dbus_connection_signal_subscribe(
+      entry->connection, kBusName, kBusName, "NameOwnerChanged", kBusPath, sender.c_str(),
+      G_DBUS_SIGNAL_FLAGS_NONE, on_left, nullptr, nullptr);
+}
+
+void take_answer(const std::string &sender, const EntryPtr &entry, const quarn_caller &caller) {
+  {
+    const std::lock_guard<std::mutex> lock(entries_mutex);
+    entry->caller = caller;
+    entry->told = true;
+  }
+  drain(entry);
+  if (caller.known) {
+    watch(sender, entry);
+  } else {
+    drop(sender);  // it is asked for again, should it call again
+  }
+}
+
+struct question {
+  std::string sender;
+  EntryPtr entry;
+};
+
+void on_credentials(GObject *bus, GAsyncResult *result, gpointer data) {
+  const std::unique_ptr<question> asked(static_cast<question *>(data));
+  GErrorPtr error;
+  const GVariantPtr reply(
+      g_dbus_connection_call_finish(G_DBUS_CONNECTION(bus), result, out(error)));
+  if (!reply) LOGE("cannot get user of (%s) : %s", asked->sender.c_str(), error->message);
+  take_answer(asked->sender, asked->entry, reply ? read_credentials(reply.get()) : quarn_caller{});
+}
+
+void ask(GDBusConnection *connection, const std::string &sender, const EntryPtr &entry) {
+  entry->asked = true;
+  if (source) {
+    source(sender,
+           [sender, entry](const quarn_caller &caller) { take_answer(sender, entry, caller); });
+    return;
+  }
+  g_dbus_connection_call(connection, kBusName, kBusPath, kBusName, "GetConnectionCredentials",
+                         g_variant_new("(s)", sender.c_str()), G_VARIANT_TYPE("(a{sv})"),
+                         G_DBUS_CALL_FLAGS_NONE, kBusTimeout, nullptr, on_credentials,
+                         new question{sender, entry});
+}
+
+/** The groups of a user, for a bus that does not tell a process' own. */
+std::vector<gid_t> groups_of_user(uid_t uid) {
+  std::vector<char> room(kLookUpRoom);
+  struct passwd user {};
+  struct passwd *found = nullptr;
+  if (getpwuid_r(uid, &user, room.data(), room.size(), &found) != 0 || found == nullptr) return {};
+  std::vector<gid_t> groups(kGroupsAtFirst);
+  int count = kGroupsAtFirst;
+  if (getgrouplist(user.pw_name, user.pw_gid, groups.data(), &count) < 0) {
+    groups.resize(static_cast<std::size_t>(count));
+    if (getgrouplist(user.pw_name, user.pw_gid, groups.data(), &count) < 0) return {};
+  }
+  groups.resize(static_cast<std::size_t>(count));
+  return groups;
+}
+
+std::string text_of_bytes(GVariant *bytes) {
+  gsize length = 0;
+  const auto *text =
+      static_cast<const char *>(g_variant_get_fixed_array(bytes, &length, sizeof(char)));
+  std::string label(text, text == nullptr ? 0 : length);
+  // The bus ends it with a NUL.
+  if (!label.empty() && label.back() == '\0') label.pop_back();
+  return label.find('\0') == std::string::npos ? label : "";
+}
+
+gid_t look_up_client_group() {
+  char *end = nullptr;
+  constexpr int kDecimal = 10;
+  const unsigned long number = std::strtoul(kClientGroup, &end, kDecimal);
+  if (end != kClientGroup && *end == '\0') return static_cast<gid_t>(number);
+  std::vector<char> room(kLookUpRoom);
+  struct group group {};
+  struct group *found = nullptr;
+  while (getgrnam_r(kClientGroup, &group, room.data(), room.size(), &found) == ERANGE) {
+    room.resize(room.size() * 2);
+  }
+  return found == nullptr ? kNoGroup : found->gr_gid;
+}
+
+}  // namespace
+
+void with_caller(GDBusConnection *connection, const std::string &sender, caller_work work) {
+  const EntryPtr entry = entry_of(connection, sender);
+  entry->waiting.push_back(std::move(work));
+  if (entry->told) {
+    drain(entry);
+  } else if (!entry->asked) {
+    ask(connection, sender, entry);
+  }
+}
+
+bool callers_are_asked_for() {
+  for (const auto &[sender, entry] : entries) {
+    if (!entry->waiting.empty()) return true;
+  }
+  return false;
+}
+
+quarn_caller known_caller(const std::string &sender) {
+  const std::lock_guard<std::mutex> lock(entries_mutex);
+  const auto found = entries.find(sender);
+  return found == entries.end() ? quarn_caller{} : found->second->caller;
+}
+
+quarn_caller ask_caller_now(GDBusConnection *connection, const std::string &sender, int ms) {
+  quarn_caller caller = known_caller(sender);
+  if (caller.known) return caller;
+  const GVariantPtr reply(g_dbus_connection_call_sync(
+      connection, kBusName, kBusPath, kBusName, "GetConnectionCredentials",
+      g_variant_new("(s)", sender.c_str()), G_VARIANT_TYPE("(a{sv})"), G_DBUS_CALL_FLAGS_NONE, ms,
+      nullptr, nullptr));
+  return reply ? read_credentials(reply.get()) : quarn_caller{};
+}
+
+quarn_caller read_credentials(GVariant *reply) {
+  quarn_caller caller;
+  const GVariantPtr values(g_variant_get_child_value(reply, 0));
+  guint32 uid = 0;
+  if (g_variant_lookup(values.get(), "UnixUserID", "u", &uid) == FALSE) return caller;
+  caller.known = true;
+  caller.uid = uid;
+  if (uid == 0) return caller;
+  const GVariantPtr groups(
+      g_variant_lookup_value(values.get(), "UnixGroupIDs", G_VARIANT_TYPE("au")));
+  if (groups) {
+    gsize count = 0;
+    const auto *ids = static_cast<const guint32 *>(
+        g_variant_get_fixed_array(groups.get(), &count, sizeof(guint32)));
+    caller.groups.assign(ids, ids + count);
+  } else {
+    caller.groups = groups_of_user(uid);
+  }
+  const GVariantPtr label(
+      g_variant_lookup_value(values.get(), "LinuxSecurityLabel", G_VARIANT_TYPE_BYTESTRING));
+  if (label) caller.label = text_of_bytes(label.get());
+  return caller;
+}
+
+quarn_subject subject_of_call(const std::string &interface_name, const std::string &member,
+                              GVariant *arguments) {
+  quarn_subject subject{interface_name, member, "", -1, false};
+  if (arguments == nullptr || interface_name != kQuarnInterface) return subject;
+  const auto has_form = [arguments](const char *form) {
+    return g_variant_is_of_type(arguments, G_VARIANT_TYPE(form)) != FALSE;
+  };
+  if (member == "restore_enable" && has_form("(iissu)")) {
+    gint32 on = 0;
+    g_variant_get_child(arguments, 0, "i", &on);
+    g_variant_get_child(arguments, 1, "i", &subject.client);
+    subject.switches_on = on != 0;
+  } else if (member == "get_app_list" && has_form("(iu)")) {
+    g_variant_get_child(arguments, 0, "i", &subject.client);
+  } else if (has_form("(s)") || has_form("(su)")) {
+    const char *text = nullptr;
+    g_variant_get_child(arguments, 0, "&s", &text);
+    subject.package = text;
+  }
+  return subject;
+}
+
+caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
+                          const quarn_subject &subject, bool cloud_mode) {
+  caller_verdict verdict =
+      may_call(caller, caller.uid == 0 ? kNoGroup : client_group(), subject, cloud_mode);
+  if (!verdict.allowed) {
+    LOGE("refused : %s of (%s) : %s", subject.member.c_str(), sender.c_str(),
+         verdict.reason.c_str());
+  }
+  return verdict;
+}
+
+std::string refusal_text(const quarn_subject &subject, const caller_verdict &verdict) {
+  return subject.member + " is refused: " + verdict.reason;
+}
+
+gid_t client_group() { return given_group ? *given_group : look_up_client_group(); }
+
+void forget_callers() {
+  while (!entries.empty()) drop(std::string(entries.begin()->first));
+}
+
+void set_caller_source(caller_source asked) { source = std::move(asked); }
+
+void set_client_group(gid_t group) { given_group = group; }

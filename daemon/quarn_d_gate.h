@@ -1,0 +1,72 @@
+/**
+ * @file quarn_d_gate.h
+ * @brief What the bus tells of the callers, asked for once a connection.
+ *
+ * A call waits for the answer without holding anything up; calls of one
+ * connection keep their order. What is known of a connection is forgotten when
+ * it leaves the bus. Main thread, where not told otherwise.
+ */
+#ifndef QUARN_D_GATE_H
+#define QUARN_D_GATE_H
+
+#include <gio/gio.h>
+
+#include <functional>
+#include <string>
+
+#include "quarn_d_callers.h"
+
+/** Connections that are remembered at the most. */
+inline constexpr std::size_t kMostCallersKnown = 256;
+
+using caller_work = std::function<void(const quarn_caller &caller)>;
+
+/**
+ * Do @p work when it is known who @p sender is: at once, or later from the main
+ * loop. A caller that the bus does not tell of comes with `known` false.
+ */
+void with_caller(GDBusConnection *connection, const std::string &sender, caller_work work);
+
+/** True while calls wait to learn who made them: the daemon is not idle then. */
+bool callers_are_asked_for();
+
+/** What is known of a connection; `known` is false when nothing is. Any thread. */
+quarn_caller known_caller(const std::string &sender);
+
+/**
+ * The same, asking the bus in place for what is not known.
+ * @param ms how long the bus may take
+ */
+quarn_caller ask_caller_now(GDBusConnection *connection, const std::string &sender, int ms);
+
+/** Read a reply of the bus' GetConnectionCredentials, "(a{sv})". Any thread. */
+quarn_caller read_credentials(GVariant *reply);
+
+/** What a call asks for. @param arguments may be null. Any thread. */
+quarn_subject subject_of_call(const std::string &interface_name, const std::string &member,
+                              GVariant *arguments);
+
+/**
+ * The verdict on a call. A refusal is logged with its caller and method.
+ * @param cloud_mode as for may_call()
+ */
+caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
+                          const quarn_subject &subject, bool cloud_mode);
+
+/** The error text of a refusal. */
+std::string refusal_text(const quarn_subject &subject, const caller_verdict &verdict);
+
+/** Number of the clients' group, -1 when the system has none. Any thread. */
+gid_t client_group();
+
+/** Forget everything; for a connection that is left. */
+void forget_callers();
+
+/** Who is asked instead of the bus; the answer may come at any time, on the main thread. */
+using caller_source = std::function<void(const std::string &sender, caller_work answer)>;
+/** @param source null: the bus */
+void set_caller_source(caller_source source);
+/** The group that counts instead of the system's; for tests. */
+void set_client_group(gid_t group);
+
+#endif

@@ -1,0 +1,286 @@
+"""An application, a stranger and a client that never answers, against everybody else's daemon."""
+import os
+import signal
+import subprocess
+import sys
+import time
+import unittest
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+sys.path.insert(0, os.path.join(HERE, "../../integration"))
+sys.path.insert(0, os.path.join(HERE, "../../integration/bus"))
+from bus_client import INTERFACE, NAME, PATH, Client  # noqa: E402
+from gi.repository import GLib  # noqa: E402
+from quarn_test import BIN_DIR, TestCase, make_source, read_text, wait_until  # noqa: E402
+
+APPLICATION = 5000
+STRANGER = 65534
+NOTES = "org.example.notes"
+COMPANION = "com.velmor.pellix-efl"
+STATUS = "/org/orvane/Quarn/Status"
+PACKAGES = "/org/orvane/Quarn/Packages"
+DENIED = "org.freedesktop.DBus.Error.AccessDenied"
+INVALID = "org.freedesktop.DBus.Error.InvalidArgs"
+MEMORY_LIMIT_KB = 20480
+#: Bytes of the largest message.
+LARGEST = 20000000
+#: Seconds that unanswered callbacks may hold up another client's run, and what a slow machine adds.
+HOLD_UP = 60
+SLOWNESS = 45
+
+#: Makes each call of its arguments, (path, interface, method, arguments as text), from a connection
+#: of its own, as the user that runs it, and prints the name of the error that each ends with.
+CALLER = """
+import ast, sys
+import gi
+gi.require_version("Gio", "2.0")
+from gi.repository import Gio, GLib
+for path, interface, method, arguments in ast.literal_eval(sys.argv[3]):
+    bus = Gio.DBusConnection.new_for_address_sync(
+        sys.argv[1], Gio.DBusConnectionFlags.AUTHENTICATION_CLIENT |
+        Gio.DBusConnectionFlags.MESSAGE_BUS_CONNECTION, None, None)
+    try:
+        bus.call_sync(sys.argv[2], path, interface, method,
+                      GLib.Variant.parse(None, arguments, None, None), None,
+                      Gio.DBusCallFlags.NONE, 60000, None)
+        print(method, "answered")
+    except GLib.Error as error:
+        print(method, Gio.dbus_error_get_remote_error(error))
+"""
+
+#: What an application or a stranger would like to have.
+WISHES = [
+    (PATH, INTERFACE, "make_app_data", "('%s',)" % NOTES),
+    (PATH, INTERFACE, "app_data_backup_start", "('%s', uint32 1)" % NOTES),
+    (PATH, INTERFACE, "app_data_restore_start", "('%s', uint32 1)" % NOTES),
+    (PATH, INTERFACE, "get_app_list", "(1, uint32 1)"),
+    (PATH, INTERFACE, "get_app_list", "(0, uint32 1)"),
+    (PATH, INTERFACE, "restore_enable", "(1, 0, '35', '[\"%s\"]', uint32 1)" % NOTES),
+    (PATH, INTERFACE, "restore_enable", "(0, 0, '', '', uint32 1)"),
+    (PATH, INTERFACE, "backup_enable", "(0,)"),
+    (PATH, INTERFACE, "set_activation", "(0,)"),
+    (PATH, INTERFACE, "last_bu_time", "()"),
+    (PATH, INTERFACE, "manual_backup_start", "(uint32 1,)"),
+    (PATH, INTERFACE, "manual_backup_cancel", "(uint32 1,)"),
+    (PATH, INTERFACE, "auto_backup_start", "('',)"),
+    (PATH, INTERFACE, "fly", "()"),
+    (PATH, INTERFACE, "set_activation", "()"),
+    (PACKAGES, INTERFACE + ".Packages", "CancelOwn", "()"),
+    (STATUS, "org.freedesktop.DBus.Properties", "GetAll", "('%s.Status',)" % INTERFACE),
+    (STATUS, "org.freedesktop.DBus.Properties", "Get", "('%s.Status', 'SerialNumber')" % INTERFACE),
+    (STATUS, "org.freedesktop.DBus.Properties", "Get", "('%s.CleanUp', 'KeptPackages')" % INTERFACE),
+    (STATUS, "org.freedesktop.DBus.Introspectable", "Introspect", "()"),
+    (PATH, "org.freedesktop.DBus.Peer", "Ping", "()")]
+
+
+def request(number):
+    return GLib.Variant("(u)", (number,))
+
+
+class Attack(TestCase):
+    def setUp(self):
+        self.device = self.new_device(serial="350000000000001")
+        for path in (self.directory, self.device.path):
+            os.chmod(path, 0o755)
+        self.device.start()
+        self.clients = []
+        self.device.install(make_source(self.path(NOTES), NOTES, "1.0.0", {"data/note": b"mine"}))
+
+    def tearDown(self):
+        for client in self.clients:
+            if not client.connection.is_closed():
+                client.close()
+
+    def new_client(self, mute=False):
+        client = Client(self.device.bus_address())
+        client.hold = lambda method, arguments: mute
+        self.clients.append(client)
+        return client
+
+    def is_sanitized(self):
+        with open(os.path.join(BIN_DIR, "quarnd"), "rb") as file:
+            return b"__asan_init" in (content := file.read()) or b"__tsan_init" in content
+
+    def memory_kb(self):
+        for line in read_text("/proc/%d/smaps_rollup" % self.device.daemon_pid()).splitlines():
+            if line.startswith("Pss:"):
+                return int(line.split()[1])
+        raise AssertionError("no memory use of the daemon")
+
+    def refused(self, user, wishes=None, destination=NAME):
+        """What each wish of that user ends with."""
+        result = subprocess.run(
+            [sys.executable, "-c", CALLER, self.device.bus_address(), destination,
+             repr(wishes or WISHES)], capture_output=True, text=True, user=user, group=user,
+            extra_groups=[])
+        self.assertEqual(result.stderr, "")
+        return [line.split(" ", 1) for line in result.stdout.splitlines()]
+
+
+class Outsiders(Attack):
+    def test_have_none_of_their_wishes(self):
+        self.device.setting("db/private/quarn/backup_status", "1")
+        self.device.install(make_source(self.path(COMPANION), COMPANION, "1.0.0", {}))
+        self.device.quarnctl("backup")
+        for user in (APPLICATION, STRANGER):
+            self.assertEqual(self.refused(user), [[wish[2], DENIED] for wish in WISHES])
+        self.assertEqual(self.device.setting("db/private/quarn/backup_status"), "1")
+        self.assertFalse(os.path.exists(os.path.join(self.device.path, "root/tmp",
+                                                     NOTES + "_tmp.zip")))
+        self.assertEqual(os.listdir(self.device.app_path(COMPANION, "shared/data")), [])
+        with open(self.device.app_path(NOTES, "data/note"), "rb") as file:
+            self.assertEqual(file.read(), b"mine")
+
+    def test_nor_while_the_daemon_has_given_its_name_up(self):
+        client = self.new_client()
+        client.call("last_bu_time")
+        owner = client.owner()
+        for user in (APPLICATION, STRANGER):
+            self.assertEqual(self.refused(user, destination=owner),
+                             [[wish[2], DENIED] for wish in WISHES])
+
+    def test_do_not_keep_root_from_being_served(self):
+        client = self.new_client()
+        client.call("last_bu_time")
+        flood = [subprocess.Popen(
+            [sys.executable, "-c", CALLER, self.device.bus_address(), NAME, repr(WISHES * 40)],
+            stdout=subprocess.DEVNULL, user=APPLICATION, group=APPLICATION, extra_groups=[])
+            for _ in range(2)]
+        served = 0
+        while any(process.poll() is None for process in flood):
+            client.call("last_bu_time")
+            served += 1
+        self.assertGreater(served, 10)
+        self.assertEqual([process.wait() for process in flood], [0, 0])
+        if not self.is_sanitized():
+            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+
+
+class TooMuch(Attack):
+    def test_three_million_candidates_are_refused_and_the_daemon_goes_on(self):
+        client = self.new_client()
+        client.call("last_bu_time")
+        daemon = self.device.daemon_pid()
+        for ids in (["a"] * 3000000, ["a" * 300000], ["p%d" % i for i in range(4097)]):
+            text = "[" + ",".join('"%s"' % each for each in ids) + "]"
+            arguments = GLib.Variant("(iissu)", (1, 0, "35", text, 1))
+            self.assertEqual(client.error_of("restore_enable", arguments)[0], INVALID)
+        for method in ("app_data_backup_start", "app_data_restore_start"):
+            arguments = GLib.Variant("(su)", ("a" * LARGEST, 1))
+            self.assertEqual(client.error_of(method, arguments)[0], INVALID)
+        self.assertEqual(client.error_of("make_app_data", GLib.Variant("(s)", ("a" * 256,)))[0],
+                         INVALID)
+        self.assertEqual(client.callbacks(), [])
+        self.assertEqual(self.device.daemon_pid(), daemon)
+        if not self.is_sanitized():
+            # The room into which the bus library has read the largest message stays, and that of its
+            # copy; the hundreds of megabytes that its packages would take are never made.
+            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB + 2 * LARGEST // 1024)
+
+    def test_what_an_honest_client_sends_is_taken(self):
+        client = self.new_client()
+        text = "[" + ",".join('"org.example.package.of.a.long.name.%04d"' % i
+                              for i in range(4096)) + "]"
+        arguments = GLib.Variant("(iissu)", (1, 0, "35", text, 1))
+        self.assertEqual(client.call("restore_enable", arguments), (0,))
+        if not self.is_sanitized():
+            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+
+
+class NeverAnswering(Attack):
+    """A client that takes its callbacks and says nothing to them."""
+
+    CALLS = (("manual_backup_cancel", request(1)),
+             ("app_data_backup_start", GLib.Variant("(su)", ("org.example.none", 2))),
+             ("app_data_restore_start", GLib.Variant("(su)", ("org.example.none", 3))),
+             ("get_app_list", GLib.Variant("(iu)", (2, 4))),
+             ("manual_backup_start", request(5)))
+
+    def hold_many(self, clients=20, rounds=2):
+        mute = [self.new_client(mute=True) for _ in range(clients)]
+        calls = []
+        for client in mute:
+            calls += [client.start(method, arguments) for method, arguments in self.CALLS * rounds]
+        for client in mute:
+            client.until(lambda c=client: len(c.held) == rounds * len(self.CALLS), "its callbacks")
+        return mute, calls
+
+    def test_holds_up_nobody_on_the_main_thread(self):
+        mute, calls = self.hold_many()
+        self.assertFalse(any(call.done for call in calls), "their handlers wait")
+        honest = self.new_client()
+        begin = time.monotonic()
+        honest.call("last_bu_time")
+        for method, arguments in self.CALLS[:4]:
+            honest.call(method, arguments)
+        self.assertEqual(len(honest.callbacks()), 4)
+        self.assertLess(time.monotonic() - begin, SLOWNESS)
+        self.device.quarnctl("status")
+        self.device.quarnctl("backup")
+        if not self.is_sanitized():
+            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        # And it is served itself, as soon as it answers.
+        for client in mute:
+            client.release()
+        honest.until(lambda: all(call.done for call in calls), "the replies")
+        self.assertEqual([call.error for call in calls], [None] * len(calls))
+
+    def test_gets_its_replies_when_the_daemon_is_ended(self):
+        mute, calls = self.hold_many(clients=6)
+        honest = self.new_client()
+        waiting = honest.start("manual_backup_start", request(7))
+        daemon = self.device.daemon_pid()
+        begin = time.monotonic()
+        os.kill(daemon, signal.SIGTERM)
+        honest.until(lambda: not os.path.exists("/proc/%d" % daemon), "the process ends")
+        self.assertLess(time.monotonic() - begin, 1 + 4)
+        honest.until(lambda: waiting.done and all(call.done for call in calls), "the replies")
+        self.assertEqual([call.error for call in calls + [waiting]], [None] * (len(calls) + 1))
+
+    def test_leaves_without_a_trace(self):
+        mute, _ = self.hold_many(clients=4)
+        for client in mute:
+            client.close()
+        honest = self.new_client()
+        self.assertEqual(honest.call("set_activation", GLib.Variant("(i)", (0,))), (0,))
+        self.device.quarnctl("backup")
+        # What waited for them has gone with them: the daemon is idle and ends.
+        def has_ended():
+            honest.call("set_activation", GLib.Variant("(i)", (0,)))
+            return "Good-Bye from Quarn" in self.device.log()
+
+        wait_until(has_ended, "the daemon ends")
+
+    def test_is_cancelled_though_it_has_not_answered_that_it_is_taken(self):
+        mute = self.new_client(mute=True)
+        mute.start("manual_backup_start", request(1))
+        mute.until(lambda: mute.held, "it is told that it is taken")
+        honest = self.new_client()
+        honest.call("manual_backup_cancel", request(2))
+        mute.release()
+        mute.until(lambda: len(mute.callbacks()) == 2, "the last status")
+        self.assertEqual(mute.callbacks("manual_backup_status"),
+                         [("manual_backup_status", (0, 2, 1)),
+                          ("manual_backup_status", (17, 6, 1))])
+        self.assertNotIn("now manual backup start!", self.device.log())
+
+    def test_holds_up_another_run_for_a_minute_and_no_longer(self):
+        mute = [self.new_client(mute=True) for _ in range(3)]
+        for client in mute:
+            # Silent to its outcome only, on the worker.
+            client.hold = lambda method, arguments: arguments[1] != 2
+            client.call("manual_backup_start", request(1))
+        honest = self.new_client()
+        begin = time.monotonic()
+        honest.call("manual_backup_start", request(1))
+        honest.until(lambda: len(honest.callbacks()) == 2, "its outcome",
+                     deadline=HOLD_UP + SLOWNESS)
+        self.assertLess(time.monotonic() - begin, HOLD_UP + SLOWNESS)
+        self.assertEqual(honest.callbacks()[-1], ("manual_backup_status", (0, 4, 1)))
+        for client in mute:
+            self.assertEqual(client.callbacks()[-1], ("manual_backup_status", (0, 4, 1)))
+        self.assertIn(" does not answer its callback : others go on", self.device.log())
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)
