@@ -306,6 +306,8 @@ void Session::preview_backup(const std::set<std::string> &kept) {
           if (callback_->result != QUARN_OK) return preview_failed(callback_->result);
           preview_set(callback_->text);
         };
+        // A cloud that cannot be reached is tried for two minutes.
+        screen_.bar(stage_text("backup", "checking"));
         client_->call(
             "get_app_list", g_variant_new("(iu)", kCloudClient, req_id_), "(i)", [](GVariant *) {},
             [this](const BusFailure &) { start_backup(); });

@@ -10,6 +10,8 @@
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/single_upload.h"
+#include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
@@ -131,7 +133,9 @@ void __get_app_list_from_cloud_cb(backup_trans_error_code error, void *user_data
     checked = true;
   } else {
     LOGE("backup_trans_download_file_ors failed... %d", error);
-    note_cause(ctx, cause_of_transfer(error, record->local_path));
+    note_cause(ctx, error == BACKUP_TRANS_ERROR_TOO_LARGE
+                        ? request_cause::list_too_large
+                        : cause_of_transfer(error, record->local_path));
   }
   // nobody waits for an abandoned run's list
   if (!ctx->abandoned) ctx->cloud_app_list_text = std::move(text);
@@ -145,11 +149,18 @@ void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
 
 /** Hand the upload to the transport, which has the record then. */
 int request_upload(std::unique_ptr<app_data_upload> &record) {
+  // before the request: on the worker its answer may be here first
+  backup_context *const single = record->ctx->single_package ? record->ctx.get() : nullptr;
+  if (single != nullptr) notes_of(single).single_upload = record.get();
   const int ret = backup_trans_upload_file_ors_async(
       cloud_handler(), record->local_path.c_str(), record->remote_path.c_str(),
       __upload_app_data_resp_cb, _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE, record.get(),
       nullptr);
-  if (ret == BACKUP_TRANS_ERROR_NONE) static_cast<void>(record.release());
+  if (ret == BACKUP_TRANS_ERROR_NONE) {
+    static_cast<void>(record.release());
+  } else if (single != nullptr) {
+    notes_of(single).single_upload = nullptr;
+  }
   return ret;
 }
 
@@ -177,6 +188,7 @@ void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
   }
   if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_upload_again(record)) return;
   backup_context *ctx = record->ctx.get();
+  if (ctx->single_package) notes_of(ctx).single_upload = nullptr;
   backup_outcome outcome = backup_outcome::uploaded;
   if (error == BACKUP_TRANS_ERROR_NONE) {
     LOGI("backup trans success : upload for (%s)", record->pkg_id.c_str());
@@ -405,6 +417,14 @@ void __backup_trans_pkg_child_list_resp_cb(backup_trans_error_code error, void *
 
 }  // namespace
 
+void abandon_single_upload(backup_context *ctx) {
+  ctx->abandoned = true;
+  void *const upload = notes_of(ctx).single_upload;
+  if (upload != nullptr && abort_transfer(upload)) {
+    LOGI("upload of (%s) is ended, for nobody waits for it", ctx->cur_pkg_id.c_str());
+  }
+}
+
 void forget_single_uploads() {
   const std::lock_guard<std::mutex> lock(single_uploads_mutex);
   single_uploads().clear();
@@ -423,9 +443,9 @@ int get_app_list_from_cloud(backup_context *ctx) {
   record->local_path = kLocalAppListPath;
   record->remote_path = kCloudAppListPath;
   ctx->app_list_downloading = true;
-  const int ret = backup_trans_download_file_ors_async(
-      cloud_handler(), record->remote_path.c_str(), record->local_path.c_str(), record.get(),
-      __get_app_list_from_cloud_cb, BACKUP_TRANS_OPTION_BASIS);
+  const int ret = download_bounded_async(record->remote_path.c_str(), record->local_path.c_str(),
+                                         record.get(), __get_app_list_from_cloud_cb,
+                                         BACKUP_TRANS_OPTION_BASIS, kMaxAppListSize);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
     static_cast<void>(record.release());
     return QUARN_OK;
@@ -445,8 +465,8 @@ int download_app_list_info_from_cloud(char **text) {
   // a run may have its own list staged at this very moment
   const std::string path =
       std::string(kLocalAppListPath) + kWaitedForSuffix + std::to_string(++requests);
-  int ret = backup_trans_download_file_ors(cloud_handler(), kCloudAppListPath, path.c_str(),
-                                           BACKUP_TRANS_OPTION_NONE);
+  int ret =
+      download_bounded(kCloudAppListPath, path.c_str(), BACKUP_TRANS_OPTION_NONE, kMaxAppListSize);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
     CString content;
     if (read_app_list_file(path, &content)) {

@@ -31,6 +31,8 @@ struct run_notes {
   bool list_understood = true;
   /** A backup that this device did not make, as far as it knows: all of it stays. */
   bool keep_all_listed = false;
+  /** The upload of a run of one package, while the transport has it. Main thread. */
+  void *single_upload = nullptr;
   std::size_t packages_seen = 0; /**< by the walk, preloaded ones too */
   /** Ids and versions in the list that was made. */
   std::set<std::string> listed;

@@ -3,8 +3,10 @@
 
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_backup/single_upload.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
@@ -159,7 +161,7 @@ int wait_for_upload(backup_context *ctx) {
   const GMainLoopPtr left(ctx->wait_loop.exchange(nullptr));
   if (ctx->upload_remain > 0) {
     // Withdrawn, or the daemon ends. The run lives on until its answer comes, if it comes.
-    ctx->abandoned = true;
+    abandon_single_upload(ctx);
     return QUARN_CANCELLED;
   }
   return ctx->result;
@@ -206,8 +208,7 @@ int wait_for_restore(std::unique_ptr<pkg_restore_context> ctx) {
     const GMainLoopPtr left(std::exchange(ctx->main_loop, nullptr));
     if (left != nullptr) {
       // Withdrawn, or the daemon ends, and the download still has its context.
-      ctx->abandoned = true;
-      static_cast<void>(ctx.release());
+      abandon_restore(ctx.release());
       return QUARN_CANCELLED;
     }
   }

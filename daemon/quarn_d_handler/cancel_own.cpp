@@ -4,6 +4,7 @@
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/restore_record.h"
+#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_log.h"
@@ -13,10 +14,12 @@ std::uint32_t quarnd_cancel_own(const std::string &sender) {
   for (const std::uint64_t fiber : fibers_of_caller(sender)) {
     if (withdraw_waits(fiber)) ++count;
   }
+  count += withdraw_app_lists(sender);
   const bool mode_on = pellix_restore_running != 0 || cloud_restore_running != 0;
   if (mode_on && restore_record_is_of(sender)) {
     set_restore_stop_result(QUARN_CANCELLED);
     quarnd_withdraw_restore_mode();
+    abort_monitored_downloads();
     ++count;
   }
   LOGI("%u requests of (%s) are withdrawn", count, sender.c_str());

@@ -1,9 +1,13 @@
+#include <algorithm>
 #include <memory>
+#include <vector>
 
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/request_cause.h"
@@ -16,7 +20,6 @@ namespace {
 constexpr int kPellixClient = 1;
 constexpr char kFailed[] = "failed";
 constexpr char kNone[] = "none";
-constexpr int kMostLoggedBytes = 65536;
 /** How often a download is begun again that was aborted for somebody else's sake. */
 constexpr int kMaxTimesAborted = 8;
 
@@ -26,8 +29,12 @@ struct list_request {
   std::string cloud_path;
   void *invocation;
   int times_aborted = 0;
+  bool withdrawn = false; /**< its client wants it no more */
 };
 using RequestPtr = std::unique_ptr<list_request>;
+
+/** Downloads that the transport has. */
+std::vector<list_request *> transferring;
 
 /**
  * A file of the request's own beside the staged list: the staged one is a
@@ -63,8 +70,12 @@ CString read_list(const std::string &path, request_cause *cause) {
     LOGE("couldn't read app list...");
     return nullptr;
   }
-  // a line is copied several times on its way
-  LOGI("app list : %.*s", kMostLoggedBytes, text.get());
+  if (g_utf8_validate(text.get(), -1, nullptr) == FALSE) {
+    // no list, and nothing that the bus could carry
+    LOGE("couldn't read app list...");
+    return nullptr;
+  }
+  LOGI("app list : %s", text.get());
   *cause = request_cause::none;
   return text;
 }
@@ -73,16 +84,16 @@ void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char
 
 /** Hand the request to the transport, which has it then. */
 int request_list(RequestPtr &request) {
-  const int result = backup_trans_download_file_ors_async(
-      cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
-      __get_app_list_resp_cb, BACKUP_TRANS_OPTION_NONE);
-  if (result == BACKUP_TRANS_ERROR_NONE) static_cast<void>(request.release());
+  const int result = download_bounded_async(
+      request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
+      __get_app_list_resp_cb, BACKUP_TRANS_OPTION_NONE, kMaxAppListSize);
+  if (result == BACKUP_TRANS_ERROR_NONE) transferring.push_back(request.release());
   return result;
 }
 
 /** The transport aborts everything at once, also what others wait for. */
 bool begin_list_again(RequestPtr &request) {
-  if (waits_are_ended() || !wifi_connected()) return false;
+  if (request->withdrawn || waits_are_ended() || !wifi_connected()) return false;
   if (++request->times_aborted > kMaxTimesAborted) return false;
   if (request_list(request) != BACKUP_TRANS_ERROR_NONE) return false;
   LOGI("download of app list was aborted with others, so it is requested again");
@@ -93,11 +104,14 @@ void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char
   if (user_data == nullptr) LOGE("cb user_data is NULL...");
   g_assert(user_data != nullptr);
   RequestPtr request(static_cast<list_request *>(user_data));
+  const auto known = std::find(transferring.begin(), transferring.end(), request.get());
+  if (known != transferring.end()) transferring.erase(known);
   if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_list_again(request)) return;
   CString text;
   request_cause cause = cause_of_transfer(error, request->local_path);
   if (error != BACKUP_TRANS_ERROR_NONE) {
     LOGE("__get_app_list_resp_cb failed...err_code[%d]", error);
+    if (error == BACKUP_TRANS_ERROR_TOO_LARGE) cause = request_cause::list_too_large;
   } else {
     LOGI("backup trans success : app list download");
     text = read_list(request->local_path, &cause);
@@ -105,7 +119,9 @@ void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char
   // before the answer: the client asks for it then
   note_request_end(cause);
   remove_list(request->local_path);
-  if (text == nullptr) {
+  if (text == nullptr && request->withdrawn) {
+    quarn_dbus_get_app_list_cb(QUARN_CANCELLED, kFailed, request->invocation);
+  } else if (text == nullptr) {
     quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kNone, request->invocation);
   } else {
     quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), request->invocation);
@@ -143,4 +159,17 @@ int get_app_list(int client, void *invocation) {
   // Until the client has its answer the daemon is not idle.
   request_power_lock(true);
   return QUARN_OK;
+}
+
+std::uint32_t withdraw_app_lists(const std::string &sender) {
+  std::uint32_t count = 0;
+  const std::vector<list_request *> all = transferring;
+  for (list_request *request : all) {
+    const auto *client = static_cast<const client_cb_data *>(request->invocation);
+    if (request->withdrawn || client == nullptr || client->sender != sender) continue;
+    request->withdrawn = true;
+    abort_transfer(request);
+    ++count;
+  }
+  return count;
 }

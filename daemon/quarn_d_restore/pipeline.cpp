@@ -10,7 +10,10 @@
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/archive_check.h"
+#include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
@@ -34,9 +37,12 @@ struct download_request {
   std::string cloud_path;
   pkg_restore_context *ctx;
   int times_aborted = 0;
+  bool withdrawn = false; /**< nobody waits for it any more */
 };
 using RequestPtr = std::unique_ptr<download_request>;
 
+/** Downloads that the transport has. */
+std::vector<download_request *> transferring;
 /** Packages whose archive is on its way. */
 std::vector<std::string> running;
 /** Further restores of such a package: they use the same files, so they wait. */
@@ -175,10 +181,10 @@ void finish_download(RequestPtr request, backup_trans_error_code error);
 
 /** Hand the request to the transport, which has it then. */
 int request_download(RequestPtr &request) {
-  const int result = backup_trans_download_file_ors_async(
-      cloud_handler(), request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
-      __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE);
-  if (result == BACKUP_TRANS_ERROR_NONE) static_cast<void>(request.release());
+  const int result = download_bounded_async(
+      request->cloud_path.c_str(), request->local_path.c_str(), request.get(),
+      __app_data_download_resp_cb, BACKUP_TRANS_OPTION_NONE, kMaxArchiveFileSize);
+  if (result == BACKUP_TRANS_ERROR_NONE) transferring.push_back(request.release());
   return result;
 }
 
@@ -187,7 +193,7 @@ int request_download(RequestPtr &request) {
  * download of a restore that is still wanted is begun again.
  */
 bool begin_download_again(RequestPtr &request) {
-  if (request->ctx->abandoned || !wifi_connected()) return false;
+  if (request->ctx->abandoned || request->withdrawn || !wifi_connected()) return false;
   if (++request->times_aborted > kMaxTimesAborted) return false;
   const std::string pkgid = request->ctx->pkgid;
   if (request_download(request) != BACKUP_TRANS_ERROR_NONE) return false;
@@ -200,6 +206,8 @@ void __app_data_download_resp_cb(backup_trans_error_code error, void *user_data,
   if (user_data == nullptr) LOGE("cb user_data is NULL...");
   g_assert(user_data != nullptr);
   RequestPtr request(static_cast<download_request *>(user_data));
+  const auto known = std::find(transferring.begin(), transferring.end(), request.get());
+  if (known != transferring.end()) transferring.erase(known);
   if (error == BACKUP_TRANS_ERROR_CANCELLED && begin_download_again(request)) return;
   finish_download(std::move(request), error);
 }
@@ -221,7 +229,8 @@ void finish_download(RequestPtr request, backup_trans_error_code error) {
   running.erase(std::find(running.begin(), running.end(), ctx->pkgid));
   restore_outcome outcome = restore_outcome::failed;
   std::uint64_t size = 0;
-  if (error != BACKUP_TRANS_ERROR_NONE) {
+  const bool given_up = ctx->abandoned && error == BACKUP_TRANS_ERROR_CANCELLED;
+  if (error != BACKUP_TRANS_ERROR_NONE && !given_up) {
     LOGE("download app data of (%s) failed...err_code[%d]", ctx->pkgid.c_str(), error);
     note_request_end(cause_of_transfer(error, request->local_path));
     ctx->result = QUARN_TRANSFER_FAILED;
@@ -310,6 +319,7 @@ std::string companion_archive(const pkg_restore_context &ctx) {
 /** What a restore from the companion came to. */
 struct companion_restore {
   int unpacked = QUARN_OK; /**< what the unpacking gave: 0 also when entries are missing */
+  bool begun = false;      /**< something may have been unpacked */
   bool whole = false;      /**< every entry was unpacked */
   bool attributes = false; /**< everything that was unpacked has its attributes */
   std::uint64_t size = 0;
@@ -341,7 +351,20 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
   done.size = archive_size(archive);
   report_restore_step(ctx.pkgid, restore_stage::unpacking, done.size);
   unzip_report report;
-  done.unpacked = unzip_data(pkgid, ctx.root.c_str(), archive.c_str(), &report);
+  archived_table table = archived_table::none;
+  done.unpacked = unzip_data_with_table(pkgid, ctx.root.c_str(), archive.c_str(), &report, &table);
+  if (done.unpacked == QUARN_NO_FILE_INFO) {
+    // Nothing could undo an unpacking whose files then have no attributes: it is not begun.
+    if (table == archived_table::none) {
+      LOGE("there isn't file-info file...");
+    } else {
+      LOGE("cannot read json info...");
+    }
+    LOGE("fail to restore for (%s)", pkgid);
+    done.unpacked = QUARN_OK;
+    return done;
+  }
+  done.begun = done.unpacked == QUARN_OK || report.extracted > 0;
   if (done.unpacked != QUARN_OK) return done;
   done.whole = report.complete();
   if (!done.whole) {
@@ -368,14 +391,13 @@ int restore_from_companion(pkg_restore_context *ctx) {
   if (done.unpacked != QUARN_OK) ctx->result = done.unpacked;
   LOGI("restore_app_data for %s complete", ctx->pkgid.c_str());
   int reported = done.unpacked;
-  if (reported == QUARN_OK && !done.whole) reported = QUARN_UNREADABLE;
+  if (reported == QUARN_OK && done.begun && !done.whole) reported = QUARN_UNREADABLE;
   if (reported == QUARN_OK && !done.attributes) reported = QUARN_REFUSED;
-  const bool begun = done.unpacked == QUARN_OK;
   report_restore_end(ctx->pkgid,
                      reported == QUARN_OK ? restore_outcome::restored
-                     : begun              ? restore_outcome::incomplete
+                     : done.begun         ? restore_outcome::incomplete
                                           : restore_outcome::failed,
-                     reported, begun ? done.size : 0);
+                     reported, done.begun ? done.size : 0);
   check_package_restore_complete(ctx);
   return done.unpacked;
 }
@@ -386,6 +408,22 @@ int restore_app_data(const char * /*appid*/, pkg_restore_context *ctx) {
   recover_interrupted_restore(ctx->pkgid.c_str(), ctx->root.c_str());
   return current_restore_client == kCloudClient ? restore_from_cloud(ctx)
                                                 : restore_from_companion(ctx);
+}
+
+void abandon_restore(pkg_restore_context *ctx) {
+  ctx->abandoned = true;
+  const auto request = std::find_if(transferring.begin(), transferring.end(),
+                                    [ctx](const download_request *one) { return one->ctx == ctx; });
+  if (request != transferring.end()) abort_transfer(*request);
+}
+
+void abort_monitored_downloads() {
+  const std::vector<download_request *> all = transferring;
+  for (download_request *request : all) {
+    if (request->ctx->wait_for_result) continue;
+    request->withdrawn = true;
+    abort_transfer(request);
+  }
 }
 
 void check_package_restore_complete(pkg_restore_context *ctx) {

@@ -5,18 +5,18 @@
 
 #include "platform_security_server.h"
 #include "platform_smack.h"
+#include "quarn_d_restore/archive_table.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/table_text.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
 namespace {
 
 using Transaction = Handle<security_server_transaction, &security_server_perm_abort>;
-
-constexpr char kLinkListKey[] = "quarn_symbolic_info";
 
 /** What stays the same in the walk over one package. */
 struct walk_context {
@@ -137,18 +137,14 @@ JsonPtr take_table(const std::string &path) {
     LOGE("there isn't file-info file...");
     return nullptr;
   }
-  char *raw = nullptr;
-  const bool read = read_data_from_file(path.c_str(), &raw);
-  const CString text(raw);
-  if (!read) {
-    LOGE("cannot read file-info file...");
-    delete_file(path.c_str());
-    return nullptr;
-  }
-  JsonPtr table(parse_file_info_table(text.get()));
+  archive_table found = read_archive_table(path.c_str());
   delete_file(path.c_str());
-  if (table == nullptr) LOGE("cannot read json info...");
-  return table;
+  if (!found.readable) {
+    LOGE("cannot read file-info file...");
+  } else if (found.table == nullptr) {
+    LOGE("cannot read json info...");
+  }
+  return std::move(found.table);
 }
 
 /** Everything below each data directory takes the directory's own label. */

@@ -7,11 +7,11 @@
 #include "platform_smack.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/table_text.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kSymbolicInfoKey[] = "quarn_symbolic_info";
 constexpr char kRealNameKey[] = "real_name";
 constexpr char kLinkKey[] = "lnk";
 constexpr char kPermKey[] = "perm";
@@ -117,7 +117,7 @@ void ready_file_info_table(file_info_table_h **table) {
   auto *made = new (std::nothrow) file_info_table_h;
   if (made == nullptr) return;
   made->symbolic_list = list.get();
-  add_constant(root.get(), kSymbolicInfoKey, list.release());
+  add_constant(root.get(), kLinkListKey, list.release());
   made->root = root.release();
   *table = made;
 }

@@ -6,12 +6,15 @@
 #include <cstdlib>
 #include <cstring>
 #include <iterator>
+#include <utility>
 #include <vector>
 
 #include "quarn_common.h"
+#include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/table_reader.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
@@ -405,13 +408,88 @@ int depth_of(const char *name) {
 }
 
 /**
- * What an archive announces must be what a backup can hold; the entries are held to it later.
+ * What an archive announces, entry by entry: it must be what a backup can hold. It is counted
+ * before anything is written, and again with the writing, for the file may be somebody else's.
+ */
+class Announced {
+ public:
+  /** @return why the archive is refused, null when it is not */
+  const char *add(const unz_file_info64 &info, const char *name) {
+    ++entries_;
+    names_ += info.size_filename;
+    size_ += std::min<std::uint64_t>(info.uncompressed_size, kMaxUnpackedSize + 1);
+    if (entries_ > kMaxArchiveEntries || size_ > kMaxUnpackedSize) {
+      return "it unpacks to more than a backup can hold";
+    }
+    if (names_ > kMaxUnpackedSize) return "its names are longer than a backup's can be";
+    if (depth_of(name) > kMaxDirDepth) return "its directories are deeper than a backup's can be";
+    return nullptr;
+  }
+
+ private:
+  std::uint64_t entries_ = 0;
+  std::uint64_t size_ = 0;
+  std::uint64_t names_ = 0;
+};
+
+constexpr char kTableTooLarge[] = "its table is larger than a backup's can be";
+
+/** Shows a table to those who look at it, as far as it was announced. */
+class TableLook : public ByteSink {
+ public:
+  TableLook(TableText *table, std::uint64_t announced) : table_(table), left_(announced) {}
+  bool write(const unsigned char *data, std::size_t size) override {
+    if (size > left_) return false;
+    left_ -= size;
+    return table_->take(reinterpret_cast<const char *>(data), size);
+  }
+
+ private:
+  TableText *table_;
+  std::uint64_t left_;
+};
+
+/** Whether inflated, or as it is, an entry's bytes reach @p sink whole. */
+bool read_entry(const Archive &from, const unz_file_info64 &info, ByteSink *sink) {
+  EntrySource source(from.file.get(), from.handle.get(), info.compressed_size);
+  CodecTotals totals;
+  CodecResult result = CodecResult::kCorrupt;
+  if (info.compression_method == kStored) {
+    result = copy_stored(&source, sink, &totals);
+  } else if (const auto codec = make_codec(CodecUse::kInflate)) {
+    result = codec->inflate(&source, sink, &totals);
+  }
+  return result == CodecResult::kDone && totals.plain == info.uncompressed_size &&
+         totals.crc == info.crc;
+}
+
+/**
+ * Look at the archive's current entry, which is its table.
+ * @param closely whether each of its values is to be JSON as well
+ */
+table_state look_at_table(const Archive &from, const unz_file_info64 &info, bool closely) {
+  if (info.uncompressed_size > kArchiveTableBounds.text) return table_state::beyond;
+  unzFile archive = from.handle.get();
+  if (unzOpenCurrentFile2(archive, nullptr, nullptr, kRaw) != UNZ_OK) return table_state::malformed;
+  TableReader reader(false);
+  TableText table(kArchiveTableBounds, closely ? &reader : nullptr);
+  TableLook look(&table, info.uncompressed_size);
+  const bool arrived = read_entry(from, info, &look);
+  unzCloseCurrentFile(archive);
+  if (table.end() == table_state::beyond) return table_state::beyond;
+  return arrived ? table.end() : table_state::malformed;
+}
+
+/**
+ * Look at everything that an archive announces, and at its table; the entries are held to it later.
+ * @param[in,out] found asks for a close look at the table where it is not null
  * @return why it is refused, null when it is not
  */
-const char *announces_too_much(unzFile archive) {
-  std::uint64_t entries = 0;
-  std::uint64_t size = 0;
-  std::uint64_t names = 0;
+const char *look_at_archive(const Archive &from, const char *pkg_id, archived_table *found) {
+  const std::string table_name = std::string("shared/data/") + pkg_id + ".perm";
+  unzFile archive = from.handle.get();
+  Announced announced;
+  std::vector<std::pair<unz64_file_pos, unz_file_info64>> tables;
   std::vector<char> name(kMaxNameSize + 1);
   for (int at = unzGoToFirstFile(archive); at == UNZ_OK; at = unzGoToNextFile(archive)) {
     unz_file_info64 info = {};
@@ -419,22 +497,29 @@ const char *announces_too_much(unzFile archive) {
         UNZ_OK) {
       break;
     }
-    ++entries;
-    names += info.size_filename;
-    size += std::min<std::uint64_t>(info.uncompressed_size, kMaxUnpackedSize + 1);
-    if (entries > kMaxArchiveEntries || size > kMaxUnpackedSize) {
-      return "it unpacks to more than a backup can hold";
+    if (const char *why = announced.add(info, name.data())) return why;
+    unz64_file_pos place = {};
+    if (table_name == name.data() && unzGetFilePos64(archive, &place) == UNZ_OK) {
+      tables.emplace_back(place, info);
     }
-    if (names > kMaxUnpackedSize) return "its names are longer than a backup's can be";
-    if (depth_of(name.data()) > kMaxDirDepth) {
-      return "its directories are deeper than a backup's can be";
-    }
+  }
+  if (found != nullptr) *found = archived_table::none;
+  for (auto &[place, info] : tables) {
+    if (unzGoToFilePos64(archive, &place) != UNZ_OK) continue;
+    const table_state state = look_at_table(from, info, found != nullptr);
+    if (state == table_state::beyond) return kTableTooLarge;
+    if (found == nullptr) continue;
+    *found = state == table_state::whole ? archived_table::whole : archived_table::malformed;
   }
   return nullptr;
 }
 
-/** One entry, under the names and with the messages of its steps. 14 when memory is out. */
-int unpack_entry(Unpacker *unpacker, const Archive &from, CString *name, unzip_report *report) {
+/**
+ * One entry, under the names and with the messages of its steps. 14 when memory is out, 31 when
+ * the archive is not any more what it announced.
+ */
+int unpack_entry(Unpacker *unpacker, const Archive &from, Announced *announced, CString *name,
+                 unzip_report *report) {
   unzFile archive = from.handle.get();
   const int opened = unzOpenCurrentFile2(archive, nullptr, nullptr, kRaw);
   if (opened != UNZ_OK) {
@@ -461,6 +546,11 @@ int unpack_entry(Unpacker *unpacker, const Archive &from, CString *name, unzip_r
     ++report->failed;
     return QUARN_OK;
   }
+  if (announced->add(info, name->get()) != nullptr) {
+    LOGE("archive was changed while it was read");
+    ++report->failed;
+    return QUARN_UNREADABLE;
+  }
   EntrySource source(from.file.get(), archive, info.compressed_size);
   switch (unpacker->extract(&source, info, name->get())) {
     case Extracted::kDone:
@@ -479,39 +569,59 @@ int unpack_entry(Unpacker *unpacker, const Archive &from, CString *name, unzip_r
   return QUARN_OK;
 }
 
-}  // namespace
-
-int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
-               unzip_report *report) {
-  *report = {};
-  const Archive archive = open_archive(zip_path);
-  if (archive.handle == nullptr) {
-    LOGE("unzOpen() failed, unzf is NULL");
-    return QUARN_UNREADABLE;
-  }
-  if (const char *why = announces_too_much(archive.handle.get())) {
-    LOGE("refused archive %s: %s", zip_path, why);
-    return QUARN_UNREADABLE;
-  }
-  int at = unzGoToFirstFile(archive.handle.get());
-  if (at != UNZ_OK) {
-    LOGE("unzGoToFirstFile() failed, unz_err = [%d]", at);
-    return QUARN_UNREADABLE;
-  }
+/** Everything of an archive that was looked at; its first entry is the current one. */
+int unpack_entries(const char *pkg_id, const char *destination, const Archive &archive,
+                   unzip_report *report) {
   Unpacker unpacker(pkg_id, destination);
+  Announced announced;
   CString name;
   unz_global_info64 global = {};
   unzGetGlobalInfo64(archive.handle.get(), &global);
   std::uint64_t visited = 0;
-  for (; at == UNZ_OK; at = unzGoToNextFile(archive.handle.get())) {
+  for (int at = UNZ_OK; at == UNZ_OK; at = unzGoToNextFile(archive.handle.get())) {
     ++visited;
-    const int result = unpack_entry(&unpacker, archive, &name, report);
+    const int result = unpack_entry(&unpacker, archive, &announced, &name, report);
     unzCloseCurrentFile(archive.handle.get());
     if (result != QUARN_OK) return result;
   }
   // a directory that breaks off hides entries
   if (visited < global.number_entry) ++report->failed;
   return QUARN_OK;
+}
+
+/** @param[in,out] table must be whole where it is not null */
+int unpack_archive(const char *pkg_id, const char *destination, const char *zip_path,
+                   unzip_report *report, archived_table *table) {
+  *report = {};
+  const Archive archive = open_archive(zip_path);
+  if (archive.handle == nullptr) {
+    LOGE("unzOpen() failed, unzf is NULL");
+    return QUARN_UNREADABLE;
+  }
+  if (const char *why = look_at_archive(archive, pkg_id, table)) {
+    LOGE("refused archive %s: %s", zip_path, why);
+    return QUARN_UNREADABLE;
+  }
+  const int first = unzGoToFirstFile(archive.handle.get());
+  if (first != UNZ_OK) {
+    LOGE("unzGoToFirstFile() failed, unz_err = [%d]", first);
+    return QUARN_UNREADABLE;
+  }
+  if (table != nullptr && *table != archived_table::whole) return QUARN_NO_FILE_INFO;
+  return unpack_entries(pkg_id, destination, archive, report);
+}
+
+}  // namespace
+
+int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
+               unzip_report *report) {
+  return unpack_archive(pkg_id, destination, zip_path, report, nullptr);
+}
+
+int unzip_data_with_table(const char *pkg_id, const char *destination, const char *zip_path,
+                          unzip_report *report, archived_table *table) {
+  *table = archived_table::none;
+  return unpack_archive(pkg_id, destination, zip_path, report, table);
 }
 
 int unzip_data(const char *pkg_id, const char *destination, const char *zip_path) {

@@ -50,6 +50,16 @@ extern "C" {
 /** Seconds after which a transient failure is no longer repeated. */
 #define BACKUP_TRANS_RETRY_TOTAL_SECONDS 120
 
+/**
+ * Bytes a second that a transfer must move on the average of each
+ * #BACKUP_TRANS_LEAST_RATE_SECONDS, both directions counted; a slower one is a
+ * network error, which is repeated as others are. 1000 is slow, and no fault.
+ * With its limit of the size, or the size of what is sent, that bounds the time
+ * of every transfer.
+ */
+#define BACKUP_TRANS_LEAST_RATE 512
+#define BACKUP_TRANS_LEAST_RATE_SECONDS 60
+
 /** Children that one listing answer holds at the most. */
 #define BACKUP_TRANS_MAX_LIST_COUNT 100
 
@@ -76,7 +86,8 @@ typedef enum {
   BACKUP_TRANS_ERROR_CANCELLED = 15,      /**< ended by backup_trans_cancel_request() */
   BACKUP_TRANS_ERROR_SERVER = 16,         /**< any other answer of the store */
   BACKUP_TRANS_ERROR_LOCAL_FILE = 17,     /**< a file on the device cannot be read or written */
-  BACKUP_TRANS_ERROR_CERTIFICATE = 18     /**< the server is not the one it says it is */
+  BACKUP_TRANS_ERROR_CERTIFICATE = 18,    /**< the server is not the one it says it is */
+  BACKUP_TRANS_ERROR_TOO_LARGE = 19       /**< the object is larger than the caller's limit */
 } backup_trans_error_code;
 
 /** What a person should look at when a store cannot be used. */
@@ -178,8 +189,29 @@ int backup_trans_download_file_ors_async(backup_trans_handle_h handle, const cha
                                          backup_trans_download_cb callback, int options);
 
 /**
- * The same, waiting for the result. Not for the main thread of a process whose
- * main loop must go on; it does not depend on the main context.
+ * The same with a limit: an object of more than @p max_size bytes ends it with
+ * #BACKUP_TRANS_ERROR_TOO_LARGE as soon as that is known, is not asked for again,
+ * and leaves nothing on the device. A caller that knows what it downloads says
+ * so: a server can send what it likes.
+ *
+ * Libraries of earlier releases have neither this nor the next, nor
+ * backup_trans_abort_request(); a caller that is to work with one of them looks
+ * them up, or refers to them weakly.
+ *
+ * @param max_size bytes; 0: any number
+ */
+int backup_trans_download_limited_ors_async(backup_trans_handle_h handle, const char *remote_path,
+                                            const char *local_path, void *user_data,
+                                            backup_trans_download_cb callback, int options,
+                                            uint64_t max_size);
+
+/** Both: with a limit, and waiting for the result as backup_trans_download_file_ors() does. */
+int backup_trans_download_limited_ors(backup_trans_handle_h handle, const char *remote_path,
+                                      const char *local_path, int options, uint64_t max_size);
+
+/**
+ * The same as backup_trans_download_file_ors_async(), waiting for the result. Not for the main
+ * thread of a process whose main loop must go on; it does not depend on the main context.
  */
 int backup_trans_download_file_ors(backup_trans_handle_h handle, const char *remote_path,
                                    const char *local_path, int options);
@@ -244,6 +276,14 @@ backup_trans_cause backup_trans_last_cause(void);
  * otherwise. A NULL handle is accepted and nothing happens.
  */
 void backup_trans_cancel_request(backup_trans_handle_h handle);
+
+/**
+ * The same for one request, or for all that were given this @p user_data, and
+ * for no other.
+ * @return #BACKUP_TRANS_ERROR_NONE when there was one that had not ended,
+ *         #BACKUP_TRANS_ERROR_ARGUMENT otherwise, and where @p user_data is NULL
+ */
+int backup_trans_abort_request(backup_trans_handle_h handle, void *user_data);
 
 /** A few words for people about a result; static. */
 const char *backup_trans_error_text(backup_trans_error_code error);

@@ -215,11 +215,12 @@ class FileBackend : public Backend {
     Outcome outcome = open_object(attempt.ticket, path, &object, &size);
     if (outcome.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT && version != nullptr) version->reset();
     if (!outcome.ok()) return outcome;
+    if (size > target.limit()) return too_large();
     if (!target.begin()) return local_failure("cannot make a local file", errno);
     const Checksum checksum = new_checksum();
     uint64_t copied = 0;
     outcome = copy(attempt.ticket, object.get(), target.fd(), checksum.get(), &copied,
-                   Direction::from_store);
+                   Direction::from_store, size);
     if (!outcome.ok()) return outcome;
     if (copied != size)
       return failure(BACKUP_TRANS_ERROR_SERVER, "the object changed while it was read");
@@ -366,8 +367,14 @@ class FileBackend : public Backend {
     return success();
   }
 
+  static Outcome too_large() {
+    return failure(BACKUP_TRANS_ERROR_TOO_LARGE, "the object is larger than it may be");
+  }
+
+  // An object that somebody writes may become longer for as long as it is read: no more than
+  // @p most bytes of it are, and one.
   static Outcome copy(Ticket &ticket, int from, int to, GChecksum *checksum, uint64_t *copied,
-                      Direction direction) {
+                      Direction direction, uint64_t most = UINT64_MAX) {
     const std::unique_ptr<char[]> buffer(new char[kBufferBytes]);
     const bool upload = direction == Direction::to_store;
     for (off_t offset = 0;;) {
@@ -378,7 +385,7 @@ class FileBackend : public Backend {
         return upload ? local_failure("cannot read the local file", errno)
                       : store_failure("cannot read the object", errno);
       }
-      if (count == 0) return success();
+      if (count == 0 || *copied > most) return success();
       for (ssize_t done = 0; done < count;) {
         const ssize_t written =
             write(to, buffer.get() + done, static_cast<std::size_t>(count - done));

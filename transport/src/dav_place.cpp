@@ -45,6 +45,7 @@ bool DavPlace::read_end(Ticket &ticket, uint64_t size, std::string *end) const {
   request.headers = {"Range: bytes=" + std::to_string(size - length) + "-" +
                      std::to_string(size - 1)};
   // A server that knows no ranges sends everything, which has the same end.
+  request.sink_limit = size;
   request.sink = [&](const char *data, std::size_t count) {
     end->append(data, count);
     if (end->size() > length) end->erase(0, end->size() - length);

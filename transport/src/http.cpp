@@ -27,6 +27,7 @@
 
 #include "checksum.h"
 #include "http_date.h"
+#include "least_rate.h"
 #include "symbols.h"
 #include "upload_queue.h"
 #include "xml_answer.h"
@@ -129,10 +130,14 @@ struct Exchange {
   int64_t received = 0;  // bytes of headers and body
   int64_t moved = 0;     // bytes sent and received when it was last looked at
   UploadQueue queue;
+  LeastRate rate;
   Clock::time_point moved_at;
   Clock::time_point began_at;
   bool local_failure = false;
   bool too_long = false;
+  bool too_large = false;        // for the request's sink
+  std::size_t header_bytes = 0;  // of every answer so far
+  uint64_t sunk = 0;
   char error[CURL_ERROR_SIZE] = "";
   // Guarded by the engine's mutex.
   bool done = false;
@@ -173,6 +178,11 @@ std::size_t take_header(char *buffer, std::size_t size, std::size_t count, void 
   Exchange &exchange = *static_cast<Exchange *>(data);
   const std::string line(buffer, size * count);
   exchange.received += static_cast<int64_t>(line.size());
+  exchange.header_bytes += line.size();
+  if (exchange.header_bytes > kMaxHeaderBytes) {
+    exchange.too_long = true;
+    return 0;
+  }
   if (line.compare(0, 5, "HTTP/") == 0) {
     // The answer after a 100 is another one.
     exchange.answer.headers.clear();
@@ -190,20 +200,32 @@ std::size_t take_header(char *buffer, std::size_t size, std::size_t count, void 
   return line.size();
 }
 
+// A length that was announced need not be waited for.
+bool is_too_large(const Exchange &exchange, std::size_t more) {
+  const uint64_t limit = exchange.request->sink_limit;
+  return exchange.sunk + more > limit ||
+         g_ascii_strtoull(exchange.answer.header("content-length").c_str(), nullptr, kDecimal) >
+             limit;
+}
+
 std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *data) {
   Exchange &exchange = *static_cast<Exchange *>(data);
   const std::size_t length = size * count;
   exchange.received += static_cast<int64_t>(length);
-  if (exchange.request->sink && exchange.answer.status >= 200 && exchange.answer.status <= 299) {
+  const bool success = exchange.answer.status >= 200 && exchange.answer.status <= 299;
+  if (exchange.request->sink && success) {
+    exchange.too_large = is_too_large(exchange, length);
+    if (exchange.too_large) return 0;
+    exchange.sunk += length;
     if (exchange.request->sink(buffer, length)) return length;
     exchange.local_failure = true;
     return 0;
   }
-  if (exchange.answer.body.size() + length > kMaxAnswerBytes) {
-    exchange.too_long = true;
-    return 0;
-  }
-  exchange.answer.body.append(buffer, length);
+  exchange.sunk += length;
+  exchange.too_long = exchange.sunk > kMaxAnswerBytes;
+  if (exchange.too_long) return 0;
+  const std::size_t room = success ? length : kMaxErrorBytes - exchange.answer.body.size();
+  exchange.answer.body.append(buffer, std::min(length, room));
   return length;
 }
 
@@ -430,28 +452,41 @@ class Engine {
   void note_progress(Exchange &exchange, Clock::time_point now) {
     curl_off_t sent = 0;
     curl_.easy_getinfo(exchange.easy, CURLINFO_SIZE_UPLOAD_T, &sent);
-    if (sent + exchange.received != exchange.moved) {
-      exchange.moved = sent + exchange.received;
-      exchange.moved_at = now;
+    int64_t moved = sent + exchange.received - exchange.moved;
+    if (moved != 0) {
+      exchange.moved += moved;
       exchange.queue.restart();
-    } else if (exchange.request->has_body && exchange.queue.look(queued_of(exchange))) {
-      exchange.moved_at = now;
+    } else if (exchange.request->has_body) {
+      moved = exchange.queue.look(queued_of(exchange));
     }
+    if (moved != 0) exchange.moved_at = now;
+    exchange.rate.note(moved, waits_for_answer(exchange, sent), now);
+  }
+
+  // How long the server thinks is for the stall to tell.
+  static bool waits_for_answer(const Exchange &exchange, curl_off_t sent) {
+    if (exchange.received > 0) return false;
+    const HttpRequest &request = *exchange.request;
+    const uint64_t size = request.body_fd >= 0 ? request.body_size : request.body.size();
+    return !request.has_body || (static_cast<uint64_t>(sent) >= size && exchange.queue.is_empty());
   }
 
   // Also tells when to look again.
-  static bool overdue(const Exchange &exchange, Clock::time_point now, int *patience) {
+  static bool overdue(Exchange &exchange, Clock::time_point now, int *patience) {
     auto end = exchange.moved_at + kStallTime;
     const std::chrono::seconds limit(exchange.request->seconds);
     if (limit.count() > 0) end = std::min(end, exchange.began_at + limit);
+    end = std::min(end, exchange.rate.judged_at());
     *patience = std::min(*patience, milliseconds_until(end, now));
     if (exchange.request->has_body && !exchange.queue.is_known())
       *patience = std::min(*patience, kLookMs);
-    return now >= end;
+    return now >= end && !(end == exchange.rate.judged_at() && exchange.rate.goes_on(now));
   }
 
   void give_up(const ExchangePtr &exchange, std::list<ExchangePtr> *active) {
-    exchange->answer.problem = failure(BACKUP_TRANS_ERROR_NETWORK, "the server went silent");
+    exchange->answer.problem =
+        failure(BACKUP_TRANS_ERROR_NETWORK,
+                exchange->rate.is_kept() ? "the server went silent" : "the server is too slow");
     exchange->answer.problem.transient = true;
     const Lock lock(mutex_);
     end(*exchange);
@@ -487,6 +522,7 @@ class Engine {
     const HttpRequest &request = *exchange.request;
     exchange.began_at = now;
     exchange.moved_at = now;
+    exchange.rate.begin(now);
     exchange.easy = curl_.easy_init();
     for (const std::string &header : request.headers)
       exchange.headers = curl_.slist_append(exchange.headers, header.c_str());
@@ -572,6 +608,8 @@ class Engine {
     if (code == CURLE_OK) return success();
     if (exchange.local_failure)
       return failure(BACKUP_TRANS_ERROR_LOCAL_FILE, "the local file cannot be read or written");
+    if (exchange.too_large)
+      return failure(BACKUP_TRANS_ERROR_TOO_LARGE, "the object is larger than it may be");
     if (exchange.too_long)
       return failure(BACKUP_TRANS_ERROR_SERVER, "the server's answer is too long");
     std::string text = exchange.error[0] != '\0' ? exchange.error : curl_.easy_strerror(code);

@@ -25,6 +25,12 @@ constexpr std::chrono::seconds kStallTime{30};
 
 /** Answers that are kept in memory are cut off with an error beyond this. */
 constexpr std::size_t kMaxAnswerBytes = 16 * 1024 * 1024;
+/** Of one that is no success so much is kept: it says why, and no more. */
+constexpr std::size_t kMaxErrorBytes = 64 * 1024;
+/** The same for the headers of all answers to one request. */
+constexpr std::size_t kMaxHeaderBytes = 256 * 1024;
+/** The same for what is only read through, where the request has no limit of its own. */
+constexpr uint64_t kMaxReadBytes = uint64_t{256} * 1024 * 1024;
 
 struct HttpRequest {
   std::string method;
@@ -45,6 +51,7 @@ struct HttpRequest {
 
   /** Receives the body of a 2xx answer instead of HttpAnswer::body; false: local failure. */
   std::function<bool(const char *data, std::size_t size)> sink;
+  uint64_t sink_limit = kMaxReadBytes; /**< bytes; a longer body is an error of the server */
 };
 
 struct HttpAnswer {

@@ -55,6 +55,7 @@ bool has_size(const HttpAnswer &answer, uint64_t size) { return told_size(answer
 Received receive(Ticket &ticket, HttpRequest request, GChecksumType type, LocalTarget &target) {
   Received received;
   Checksum checksum(type);
+  request.sink_limit = target.limit();
   request.sink = [&](const char *data, std::size_t size) {
     checksum.add(data, size);
     received.size += size;

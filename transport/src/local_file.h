@@ -49,6 +49,10 @@ class LocalTarget {
   /** Find its directory, which must exist. @return false with errno */
   bool open(const std::string &path);
 
+  /** Most bytes that it may have; 0: any number. */
+  void set_limit(uint64_t limit) { limit_ = limit; }
+  uint64_t limit() const { return limit_ == 0 ? UINT64_MAX : limit_; }
+
   /** Start, or start over, with an empty file that nobody sees. @return false with errno */
   bool begin();
 
@@ -67,6 +71,7 @@ class LocalTarget {
  private:
   UniqueFd folder_;
   std::string name_;
+  uint64_t limit_ = 0;
   std::unique_ptr<StagedFile> staged_;
 };
 

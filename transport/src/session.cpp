@@ -201,6 +201,14 @@ class Session {
     if (is_handle(handle)) cancel_all(handle);
   }
 
+  bool abort(backup_trans_handle_h handle, const void *user_data) {
+    const Lock lock(mutex_);
+    if (!is_handle(handle) || user_data == nullptr) return false;
+    return cancel_those([&](const RequestPtr &request) {
+      return request->handle == handle && request->user_data == user_data;
+    });
+  }
+
   // The store that serves a request made now; null with the code of the refusal.
   std::shared_ptr<Backend> store_for(backup_trans_handle_h handle, int *code) {
     const Lock lock(mutex_);
@@ -346,20 +354,27 @@ class Session {
 
   // Everything of @p handle, or of every handle.
   void cancel_all(backup_trans_handle_h handle) {
-    const auto concerned = [handle](const RequestPtr &request) {
+    cancel_those([handle](const RequestPtr &request) {
       return handle == nullptr || request->handle == handle;
-    };
+    });
+  }
+
+  // @return whether there was one
+  bool cancel_those(const std::function<bool(const RequestPtr &)> &concerned) {
+    bool found = false;
     for (auto it = waiting_.begin(); it != waiting_.end();) {
       if (!concerned(*it)) {
         ++it;
         continue;
       }
+      found = true;
       (*it)->ticket.cancel();
       end(*it, Result{cancelled(), {}, {}});
       it = waiting_.erase(it);
     }
     for (const RequestPtr &request : running_) {
       if (!concerned(request) || request->ended || !request->ticket.cancel()) continue;
+      found = true;
       // Its worker ends it after having tidied up; a stuck one must not keep the caller waiting.
       if (request->waited_for) {
         ended_.notify_all();
@@ -367,6 +382,7 @@ class Session {
         end_later_at_the_latest(request);
       }
     }
+    return found;
   }
 
   bool start_worker() {
@@ -574,21 +590,36 @@ backup_trans_handle_h backup_trans_create_handle(void) { return Session::get().c
 int backup_trans_download_file_ors_async(backup_trans_handle_h handle, const char *remote_path,
                                          const char *local_path, void *user_data,
                                          backup_trans_download_cb callback, int options) {
+  return backup_trans_download_limited_ors_async(handle, remote_path, local_path, user_data,
+                                                 callback, options, 0);
+}
+
+int backup_trans_download_limited_ors_async(backup_trans_handle_h handle, const char *remote_path,
+                                            const char *local_path, void *user_data,
+                                            backup_trans_download_cb callback, int options,
+                                            uint64_t max_size) {
   RequestPtr request;
   const int code = transport::new_download(handle, remote_path, local_path, options, &request);
   if (code != BACKUP_TRANS_ERROR_NONE) return code;
   if (callback == nullptr) return BACKUP_TRANS_ERROR_ARGUMENT;
   request->user_data = user_data;
   request->download_cb = callback;
+  request->target.set_limit(max_size);
   return Session::get().accept(request);
 }
 
 int backup_trans_download_file_ors(backup_trans_handle_h handle, const char *remote_path,
                                    const char *local_path, int options) {
+  return backup_trans_download_limited_ors(handle, remote_path, local_path, options, 0);
+}
+
+int backup_trans_download_limited_ors(backup_trans_handle_h handle, const char *remote_path,
+                                      const char *local_path, int options, uint64_t max_size) {
   RequestPtr request;
   int code = transport::new_download(handle, remote_path, local_path, options, &request);
   if (code != BACKUP_TRANS_ERROR_NONE) return code;
   request->waited_for = true;
+  request->target.set_limit(max_size);
   code = Session::get().accept(request);
   return code == BACKUP_TRANS_ERROR_NONE ? Session::get().wait_for(request) : code;
 }
@@ -665,6 +696,11 @@ backup_trans_cause backup_trans_last_cause(void) { return Session::get().last_ca
 
 void backup_trans_cancel_request(backup_trans_handle_h handle) { Session::get().cancel(handle); }
 
+int backup_trans_abort_request(backup_trans_handle_h handle, void *user_data) {
+  return Session::get().abort(handle, user_data) ? BACKUP_TRANS_ERROR_NONE
+                                                 : BACKUP_TRANS_ERROR_ARGUMENT;
+}
+
 const char *backup_trans_error_text(backup_trans_error_code error) {
   switch (error) {
     case BACKUP_TRANS_ERROR_NONE:
@@ -691,6 +727,8 @@ const char *backup_trans_error_text(backup_trans_error_code error) {
       return "a file on the device cannot be read or written";
     case BACKUP_TRANS_ERROR_CERTIFICATE:
       return "the server is not the one it says it is";
+    case BACKUP_TRANS_ERROR_TOO_LARGE:
+      return "larger than it may be";
   }
   return "unknown error";
 }

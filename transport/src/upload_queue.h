@@ -25,14 +25,17 @@ class UploadQueue {
   /** Was the queue looked at since then? */
   bool is_known() const { return held_.has_value(); }
 
+  /** Has everything been taken, as far as is known? */
+  bool is_empty() const { return held_.value_or(1) == 0; }
+
   /**
    * @param held bytes in the queue now
-   * @return whether the network took bytes since the last look that may be this exchange's
+   * @return how many the network took since the last look that may be this exchange's
    */
-  bool look(int held) {
+  int look(int held) {
     if (!held_) own_ = held;
     const int taken = std::max(held_.value_or(held) - held, 0);
-    const bool moved = taken > 0 && own_ > 0;
+    const int moved = std::min(taken, own_);
     own_ = std::min(std::max(own_ - taken, 0), held);
     held_ = held;
     return moved;

@@ -5,16 +5,11 @@
 #ifndef QUARN_EMBEDDED_PRINTABLE_H
 #define QUARN_EMBEDDED_PRINTABLE_H
 
-#include <string>
+#include "quarn_printable.h"
 
 namespace embedded {
 
-/**
- * @p text in one line that no terminal obeys: line ends and tabs become `\n`,
- * `\r` and `\t`, other bytes that are no printable UTF-8 `\x1b`, and characters
- * that are not printed `\u{85}`. Everything else stays as it is. Any thread.
- */
-std::string printable(const std::string &text);
+inline std::string printable(const std::string &text) { return quarn_printable(text); }
 
 }  // namespace embedded
 

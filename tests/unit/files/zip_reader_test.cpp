@@ -8,7 +8,10 @@
 #include "codec_choice.h"
 #include "fault.h"
 #include "log_capture.h"
+#include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_log.h"
+#include "quarn_printable.h"
 #include "temp_dir.h"
 #include "zip_bytes.h"
 
@@ -57,9 +60,12 @@ class ZipReader : public ::testing::TestWithParam<ArchiveCodec> {
               QUARN_OK);
     expect_report(2, 0, 1);
     EXPECT_THAT(captured_texts(),
-                ElementsAre(message, "extract_file_from_zip() failed " + entry.name));
+                ElementsAre(message, "extract_file_from_zip() failed " + logged(entry.name)));
     EXPECT_EQ(content_of(root_ / "data/first"), "1");
     EXPECT_EQ(content_of(root_ / "data/last"), "2");
+  }
+  static std::string logged(const std::string &name) {
+    return quarn_shortened(name, kMaxLoggedArgument);
   }
   void expect_report(unsigned int extracted, unsigned int refused, unsigned int failed) const {
     EXPECT_EQ(report_.extracted, extracted);
@@ -389,12 +395,12 @@ TEST_P(ZipReader, ADirectoryInTheFilesPlaceStays) {
 
 TEST_P(ZipReader, ANameThatIsTooLongFails) {
   const std::string name = "data/" + std::string(300, 'n');
-  expect_failed(deflated_entry(name, "x"), "fopen() failed, file is NULL " + root_ / name);
+  expect_failed(deflated_entry(name, "x"), "fopen() failed, file is NULL " + logged(root_ / name));
 }
 
 TEST_P(ZipReader, ADirectoryNameThatIsTooLongFails) {
   const std::string name = "data/" + std::string(300, 'n') + "/a";
-  expect_failed(deflated_entry(name, "x"), "fopen() failed, file is NULL " + root_ / name);
+  expect_failed(deflated_entry(name, "x"), "fopen() failed, file is NULL " + logged(root_ / name));
 }
 
 /* ---- hostile content --------------------------------------------------------- */
@@ -548,6 +554,85 @@ TEST_P(ZipReader, ATableThatOnlyEarlierReleasesMadeIsTaken) {
                     deflated_entry("shared/data/org.example.notes.perm", table)}),
             QUARN_OK);
   expect_report(2, 0, 0);
+}
+
+constexpr char kTableName[] = "shared/data/org.example.notes.perm";
+
+TEST_P(ZipReader, AnEntryThatIsThousandsOfLevelsDeepIsRefusedBeforeAnythingIsMade) {
+  std::string name = "data";
+  for (int depth = 0; depth < 30000; ++depth) name += "/d";
+  for (const std::string &deep : {name + "/a", name + "/"}) {
+    clear_captured_log();
+    EXPECT_EQ(unpack({deflated_entry("data/first", "x"), stored_entry(deep, "")}),
+              QUARN_UNREADABLE);
+    EXPECT_THAT(captured_texts(),
+                ElementsAre("refused archive " + archive_ +
+                            ": its directories are deeper than a backup's can be"));
+    EXPECT_THAT(files(), IsEmpty());
+    EXPECT_FALSE(exists(root_ / "data"));
+  }
+}
+
+TEST_P(ZipReader, ATableBeyondItsBoundsIsRefusedBeforeAnythingIsWritten) {
+  std::string members = "{";
+  std::string links;
+  for (int i = 0; i < 400000; ++i) {
+    members += "\"\":0,";
+    links += "0,";
+  }
+  const std::vector<std::pair<const char *, std::string>> tables = {
+      {"text", "{" + std::string(std::size_t{50} << 20, ' ') + "}"},
+      {"members", members + "\"a\":0}"},
+      {"links", R"({"quarn_symbolic_info":[)" + links + "0]}"},
+      {"values", R"({"a":[)" + std::string(1000, ',') + "]}"},
+      {"depth", "{\"a\":" + std::string(30000, '[')},
+      {"attributes", R"({"a":{"3":")" + std::string(4096, 'x') + "\"}}"},
+  };
+  for (const auto &[what, table] : tables) {
+    clear_captured_log();
+    EXPECT_EQ(unpack({deflated_entry("data/a", "x"), deflated_entry(kTableName, table)}),
+              QUARN_UNREADABLE)
+        << what;
+    EXPECT_THAT(captured_texts(), ElementsAre("refused archive " + archive_ +
+                                              ": its table is larger than a backup's can be"))
+        << what;
+    EXPECT_THAT(files(), IsEmpty()) << what;
+    EXPECT_FALSE(exists(root_ / "data")) << what;
+  }
+}
+
+TEST_P(ZipReader, ATableThatIsNoneCostsNothingWhereTheUnpackingCanBeUndone) {
+  EXPECT_EQ(unpack({deflated_entry("data/a", "x"), deflated_entry(kTableName, "not json")}),
+            QUARN_OK);
+  expect_report(2, 0, 0);
+}
+
+TEST_P(ZipReader, WithoutAWholeTableNothingIsUnpackedWhereThatCannotBeUndone) {
+  const auto found = [&](const std::vector<ZipEntry> &entries) {
+    archive_ = place_.file("archive.zip", zip_bytes(entries));
+    archived_table table = archived_table::none;
+    const int result =
+        unzip_data_with_table(kPackage, root_.path().c_str(), archive_.c_str(), &report_, &table);
+    EXPECT_EQ(result, table == archived_table::whole ? QUARN_OK : QUARN_NO_FILE_INFO);
+    EXPECT_EQ(exists(root_ / "data/a"), result == QUARN_OK);
+    return table;
+  };
+  const ZipEntry data = deflated_entry("data/a", "x");
+  EXPECT_EQ(found({data}), archived_table::none);
+  for (const char *text : {"not json", "", "[]", "{", R"({"a": tru})", R"({"a": {"0": 1})"}) {
+    EXPECT_EQ(found({data, deflated_entry(kTableName, text)}), archived_table::malformed) << text;
+  }
+  ZipEntry corrupt = deflated_entry(kTableName, "{}");
+  corrupt.crc ^= 1;
+  EXPECT_EQ(found({data, corrupt}), archived_table::malformed);
+  ZipEntry longer = deflated_entry(kTableName, "{}" + std::string(1000, ' '));
+  longer.size = 100;
+  EXPECT_EQ(found({data, longer}), archived_table::malformed);
+  EXPECT_EQ(found({data, deflated_entry(kTableName, "{}"), deflated_entry(kTableName, "{")}),
+            archived_table::malformed)
+      << "the last one stays";
+  EXPECT_EQ(found({data, stored_entry(kTableName, R"({"data/a": {"0": 420}})")}),
+            archived_table::whole);
 }
 
 /* ---- failures ---------------------------------------------------------------- */

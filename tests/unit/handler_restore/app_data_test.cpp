@@ -433,6 +433,31 @@ TEST_P(Withdrawn, WhileItsTransferRuns) {
   EXPECT_TRUE(is_idle_status());
 }
 
+TEST_P(Withdrawn, ItsTransferEndsAndAnothersGoesOn) {
+  std::vector<void *> aborted;
+  ON_CALL(transport, backup_trans_abort_request).WillByDefault([&](auto, void *data) {
+    aborted.push_back(data);
+    return 0;
+  });
+  start_on_fiber(kOwn, 7);
+  ASSERT_TRUE(transfers());
+  void *const own = uploads.empty() ? downloads[0].user_data : uploads[0].user_data;
+  EXPECT_EQ(quarnd_cancel_own(kOther), 0U);
+  run_main_context();
+  EXPECT_TRUE(aborted.empty());
+  EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
+  run_main_context();
+  EXPECT_EQ(aborted, std::vector<void *>{own});
+  if (uploads.empty()) {
+    answer(BACKUP_TRANS_ERROR_CANCELLED);
+  } else {
+    answer_upload(BACKUP_TRANS_ERROR_CANCELLED);
+  }
+  run_main_context();
+  EXPECT_FALSE(transfers()) << "it is not begun again";
+  EXPECT_TRUE(is_idle_status());
+}
+
 TEST_P(Withdrawn, WhileItWaitsForAnothersRequest) {
   start_on_fiber(kOther, 8);
   start_on_fiber(kOwn, 7);

@@ -6,6 +6,7 @@
 #include <filesystem>
 
 #include "quarn_d_backup/list_bound.h"
+#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/request_cause.h"
@@ -94,6 +95,43 @@ TEST_F(AppListTest, ADownloadThatWasAbortedForWantOfWifiIsNot) {
   answer(BACKUP_TRANS_ERROR_CANCELLED);
   EXPECT_EQ(outside.answers, answered(1, "none"));
   EXPECT_TRUE(downloads.empty());
+}
+
+TEST_F(AppListTest, AListThatItsClientWithdrawsIsEndedAndNotBegunAgain) {
+  connect_to_wifi();
+  ASSERT_EQ(ask(0), 0);
+  EXPECT_CALL(transport, backup_trans_abort_request).Times(1);
+  EXPECT_EQ(withdraw_app_lists(":1.99"), 0U);
+  EXPECT_EQ(withdraw_app_lists(":1.7"), 1U);
+  EXPECT_EQ(withdraw_app_lists(":1.7"), 0U) << "it is on its way to its end";
+  EXPECT_TRUE(outside.answers.empty());
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_TRUE(downloads.empty());
+  EXPECT_EQ(outside.answers, answered(17, "failed"));
+  EXPECT_TRUE(is_idle_status());
+  EXPECT_EQ(withdraw_app_lists(":1.7"), 0U);
+}
+
+TEST_F(AppListTest, ADownloadIsLimitedToWhatCanBeRead) {
+  ASSERT_EQ(ask(0), 0);
+  EXPECT_EQ(transport.last_max_size, kMaxAppListSize);
+}
+
+TEST_F(AppListTest, WhatIsNoTextIsNoList) {
+  ASSERT_EQ(ask(0), 0);
+  write_text(downloads[0].local, "{\"a\": \"\xff\"}");
+  answer();
+  EXPECT_EQ(outside.answers, answered(1, "none"));
+  expect_error("couldn't read app list...");
+}
+
+TEST_F(AppListTest, TheLogHasTheBeginningOfAList) {
+  ASSERT_EQ(ask(0), 0);
+  const std::string list = "{\n" + std::string(1U << 20, 'x');
+  write_text(downloads[0].local, list);
+  answer();
+  EXPECT_EQ(outside.answers, answered(0, list));
+  expect_info("app list : {\\n" + std::string(254, 'x') + "...");
 }
 
 TEST_F(AppListTest, AMissingFileIsAnsweredWithOneAndNone) {

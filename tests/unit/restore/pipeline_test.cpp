@@ -10,7 +10,9 @@
 #include <thread>
 
 #include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
@@ -274,6 +276,50 @@ TEST_F(PipelineTest, AnAbandonedRestoreLeavesTheDataAsItIs) {
   EXPECT_EQ(tree_of(root), before);
   EXPECT_FALSE(exists(download()));
   expect_info("restore of (org.example.notes) was cancelled");
+}
+
+TEST_F(PipelineTest, TheDownloadOfAnAbandonedRestoreIsEndedAndNoOther) {
+  connect_to_wifi();
+  make_old_data();
+  const Tree before = tree_of(root);
+  auto ctx = waiting_context();
+  ASSERT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(transport.last_max_size, kMaxArchiveFileSize);
+  EXPECT_CALL(transport, backup_trans_abort_request).Times(1);
+  abandon_restore(ctx.release());
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_TRUE(downloads.empty()) << "it is not begun again";
+  EXPECT_EQ(tree_of(root), before);
+  expect_info("restore of (org.example.notes) was cancelled");
+}
+
+TEST_F(PipelineTest, AnAbandonedRestoreThatWaitsForAnotherLeavesThatAlone) {
+  auto first = waiting_context();
+  auto second = waiting_context();
+  ASSERT_EQ(restore(first.get()), 0);
+  ASSERT_EQ(restore(second.get()), 0);
+  EXPECT_CALL(transport, backup_trans_abort_request).Times(0);
+  abandon_restore(second.release());
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(first->result, 12);
+  EXPECT_TRUE(downloads.empty());
+}
+
+TEST_F(PipelineTest, WithAWithdrawnModeItsDownloadsEndAndNoRequests) {
+  connect_to_wifi();
+  make_old_data();
+  pkg_restore_context *monitored = new_context();
+  ASSERT_EQ(restore(monitored), 0);
+  EXPECT_CALL(transport, backup_trans_abort_request).Times(1);
+  abort_monitored_downloads();
+  answer(BACKUP_TRANS_ERROR_CANCELLED);
+  EXPECT_TRUE(downloads.empty());
+  EXPECT_EQ(shown, std::vector<std::string>{kPkg});
+  auto requested = waiting_context();
+  ASSERT_EQ(restore(requested.get()), 0);
+  abort_monitored_downloads();
+  answer(BACKUP_TRANS_ERROR_NETWORK);
+  EXPECT_EQ(requested->result, 12);
 }
 
 TEST_F(PipelineTest, ADownloadAbortedForAnothersSakeIsBegunAgain) {
@@ -680,7 +726,8 @@ TEST_F(CompanionTest, RestoresAtOnceAndKeepsTheArchive) {
 
 TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAtMinusOne) {
   make_old_data();
-  make_archive(archive(), new_data, "not json");
+  auto entries = new_data;
+  make_archive(archive(), entries, R"({"data": {"0": 493, "1": 5000, "2": 5000, "3": "app"}})");
   auto ctx = context(true);
   EXPECT_EQ(restore(ctx.get()), 0);
   EXPECT_EQ(ctx->result, 0);
@@ -690,6 +737,44 @@ TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAt
   EXPECT_EQ(read_text(at("data/settings.ini")), "new settings") << "nothing is rolled back";
   EXPECT_EQ(progress.back().outcome, Outcome::incomplete);
   EXPECT_EQ(progress.back().result, 36);
+}
+
+TEST_F(CompanionTest, WithoutAUsableTableNothingIsUnpacked) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  make_archive(archive(), new_data, "not json");
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 0);
+  EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(ctx->pending, -1);
+  expect_error("cannot read json info...");
+  expect_error("fail to restore for (org.example.notes)");
+  expect_info("restore_app_data for org.example.notes complete");
+  EXPECT_EQ(tree_of(root), before);
+  EXPECT_EQ(progress.back().outcome, Outcome::failed);
+  EXPECT_EQ(progress.back().result, 36);
+}
+
+TEST_F(CompanionTest, AnArchiveBeyondTheBoundsIsRefusedWholeAndLeavesTheDataAsItIs) {
+  make_old_data();
+  const Tree before = tree_of(root);
+  std::string deep = "data";
+  for (int depth = 0; depth < 30000; ++depth) deep += "/d";
+  auto entries = new_data;
+  entries.push_back({deep + "/a", "x"});
+  make_plain_archive(archive(), entries);
+  auto ctx = context(true);
+  EXPECT_EQ(restore(ctx.get()), 31);
+  EXPECT_EQ(ctx->result, 31);
+  expect_error("refused archive " + archive() +
+               ": its directories are deeper than a backup's can be");
+  EXPECT_EQ(tree_of(root), before);
+  const std::string table = "{" + std::string(std::size_t{50} << 20, ' ') + "}";
+  make_archive(archive(), new_data, table.c_str());
+  EXPECT_EQ(restore(ctx.get()), 31);
+  expect_error("refused archive " + archive() + ": its table is larger than a backup's can be");
+  EXPECT_EQ(tree_of(root), before);
+  EXPECT_EQ(progress.back().outcome, Outcome::failed);
 }
 
 /** Everything below the root is the application's, labelled, and no table is left. */

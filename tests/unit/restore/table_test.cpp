@@ -1,5 +1,11 @@
+#include <malloc.h>
+#include <unistd.h>
+
+#include <filesystem>
 #include <set>
 
+#include "quarn_d_restore/archive_table.h"
+#include "quarn_d_utils/table_reader.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -94,6 +100,82 @@ TEST(TableTest, MoreKindsOfAttributesThanAreRememberedAreKeptApart) {
     json_object *entry = json_object_object_get(table.get(), std::to_string(i).c_str());
     EXPECT_EQ(json_object_get_int(json_object_object_get(entry, "0")), i);
   }
+}
+
+TEST(TableTest, IsReadFromAFileAsFromAText) {
+  const std::string path = "/tmp/quarn_table_test." + std::to_string(getpid());
+  std::string text = "{\"quarn_symbolic_info\": []";
+  for (int i = 0; i < 5000; ++i) {
+    text += ", \"data/file" + std::to_string(i) + "\": {\"0\": " + std::to_string(i) +
+            ", \"3\": \"a\"}";
+  }
+  write_text(path, text + "}");
+  const archive_table read = read_archive_table(path.c_str());
+  EXPECT_TRUE(read.readable);
+  const JsonPtr whole(parse_file_info_table((text + "}").c_str()));
+  EXPECT_TRUE(json_object_equal(read.table.get(), whole.get()));
+  write_text(path, text);
+  const archive_table cut = read_archive_table(path.c_str());
+  EXPECT_TRUE(cut.readable);
+  EXPECT_EQ(cut.table, nullptr);
+  std::filesystem::remove(path);
+  EXPECT_FALSE(read_archive_table(path.c_str()).readable);
+}
+
+TEST(TableTest, WhatIsBeyondItsBoundsCostsNoMemory) {
+  const std::string path = "/tmp/quarn_table_test." + std::to_string(getpid());
+  std::string members = "{";
+  for (int i = 0; i < 4000000; ++i) members += "\"" + std::to_string(i) + "\":[],";
+  for (const std::string &text :
+       {members, "{\"a\":[" + std::string(40U << 20, ','),
+        "{\"a\":\"" + std::string(40U << 20, 'x'), "{" + std::string(50U << 20, ' ') + "}",
+        "{\"" + std::string(40U << 20, 'k')}) {
+    write_text(path, text);
+    const std::size_t before = mallinfo2().uordblks;
+    const archive_table read = read_archive_table(path.c_str());
+    EXPECT_TRUE(read.readable);
+    EXPECT_EQ(read.table, nullptr);
+    EXPECT_LT(mallinfo2().uordblks, before + (1U << 20));
+  }
+  std::filesystem::remove(path);
+}
+
+TEST(TableTest, AWholeOneMayBeReadInPiecesOfAnySize) {
+  const std::string text =
+      R"( {"quarn_symbolic_info": [{"real_name": "data\/l", "lnk": "\"]}", "perm": {"0": 1}}, 7],)"
+      R"( "data\/\u00e4 \"q\"": {"0": 420, "3": "a}"}, "b": null , "c":-1.5e3,"d":[1,{}] } more)";
+  for (std::size_t piece = 1; piece < text.size(); ++piece) {
+    TableReader reader;
+    TableText table(kArchiveTableBounds, &reader);
+    for (std::size_t at = 0; at < text.size(); at += piece) {
+      ASSERT_TRUE(table.take(text.data() + at, std::min(piece, text.size() - at))) << at;
+    }
+    EXPECT_EQ(table.end(), table_state::whole) << piece;
+    const JsonPtr whole(json_tokener_parse(text.c_str()));
+    EXPECT_TRUE(json_object_equal(reader.take().get(), whole.get())) << piece;
+  }
+}
+
+TEST(TableTest, TheBoundsAreCounted) {
+  const auto state = [](const std::string &text, const table_bounds &bounds) {
+    TableText table(bounds);
+    table.take(text.data(), text.size());
+    return table.end();
+  };
+  const std::string three = R"({"quarn_symbolic_info":[{},{}],"a":{}})";
+  EXPECT_EQ(state(three, {three.size(), 3}), table_state::whole);
+  EXPECT_EQ(state(three, {three.size() - 1, 3}), table_state::beyond);
+  EXPECT_EQ(state(three, {three.size(), 2}), table_state::beyond);
+  EXPECT_EQ(state(R"({"a":[[[[1]]]]})", kNoTableBounds), table_state::whole);
+  EXPECT_EQ(state(R"({"a":[[[[[1]]]]]})", kNoTableBounds), table_state::beyond);
+  EXPECT_EQ(state(R"({"a":")" + std::string(2046, 'x') + R"("})", kNoTableBounds),
+            table_state::whole);
+  EXPECT_EQ(state(R"({"a":")" + std::string(2047, 'x') + R"("})", kNoTableBounds),
+            table_state::beyond);
+  EXPECT_EQ(state(R"({"a":[1}})", kNoTableBounds), table_state::malformed);
+  EXPECT_EQ(state("{'a':1}", kNoTableBounds), table_state::malformed);
+  EXPECT_EQ(state("{\"a\":[1/*,*/]}", kNoTableBounds), table_state::malformed);
+  EXPECT_EQ(state(std::string("{\"a\0\":1}", 9), kNoTableBounds), table_state::malformed);
 }
 
 }  // namespace

@@ -49,6 +49,21 @@ int backup_trans_download_file_ors(backup_trans_handle_h handle, const char *rem
                                                                  options);
 }
 
+int backup_trans_download_limited_ors_async(backup_trans_handle_h handle, const char *remote_path,
+                                            const char *local_path, void *user_data,
+                                            backup_trans_download_cb callback, int options,
+                                            uint64_t max_size) {
+  MockTransport::current().last_max_size = max_size;
+  return backup_trans_download_file_ors_async(handle, remote_path, local_path, user_data, callback,
+                                              options);
+}
+
+int backup_trans_download_limited_ors(backup_trans_handle_h handle, const char *remote_path,
+                                      const char *local_path, int options, uint64_t max_size) {
+  MockTransport::current().last_max_size = max_size;
+  return backup_trans_download_file_ors(handle, remote_path, local_path, options);
+}
+
 int backup_trans_upload_file_ors_async(backup_trans_handle_h handle, const char *local_path,
                                        const char *remote_path, backup_trans_upload_cb callback,
                                        int64_t timestamp_ms, int options, void *user_data,
@@ -76,6 +91,10 @@ backup_trans_cause backup_trans_last_cause(void) {
 
 void backup_trans_cancel_request(backup_trans_handle_h handle) {
   return MockTransport::current().backup_trans_cancel_request(handle);
+}
+
+int backup_trans_abort_request(backup_trans_handle_h handle, void *user_data) {
+  return MockTransport::current().backup_trans_abort_request(handle, user_data);
 }
 
 }  // extern "C"

@@ -41,6 +41,10 @@ class MockTransport {
               (backup_trans_handle_h, const char *, void *, backup_trans_delete_cb));
   MOCK_METHOD(backup_trans_cause, backup_trans_last_cause, ());
   MOCK_METHOD(void, backup_trans_cancel_request, (backup_trans_handle_h));
+  MOCK_METHOD(int, backup_trans_abort_request, (backup_trans_handle_h, void *));
+
+  /** What the latest download was limited to; its other arguments are those of the mock above. */
+  uint64_t last_max_size = 0;
 };
 
 #endif

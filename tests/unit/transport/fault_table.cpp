@@ -156,6 +156,12 @@ void add_connection_faults(Table *table) {
   table->add_once_and_for_ever("stalled at byte 60000 of the answer",
                                at(Spoil::stall_response, kInBody), true);
   table->add("slow, 1 kB/s", at(Spoil::slow, 0)).last = 1;
+  table->add_once_and_for_ever("a byte in 20 s from byte 20 of the answer",
+                               at(Spoil::trickle, kInHead), true);
+  table->add_once_and_for_ever("a byte in 20 s from byte 300 of the answer",
+                               at(Spoil::trickle, kInListing), true);
+  table->add_once_and_for_ever("a byte in 20 s from byte 60000 of the answer",
+                               at(Spoil::trickle, kInBody), true);
 }
 
 // Says all that it knows to whoever listens.
@@ -369,6 +375,30 @@ const Cells kCells[] = {
      {{"success 1 new", nullptr, nullptr, nullptr, "success 1 whole", "success 1 whole",
        "success 1 gone"}},
      {{"success 1 new", nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, "success 1 new"}}},
+    {"a byte in 20 s from byte 20 of the answer, request done, once",
+     {{"success 2 new", "success 2 new", "success 2 new", "success 1 new", "success 2 whole",
+       "success 2 whole", "success 2 gone"}},
+     {{"success 2 new", nullptr, nullptr, nullptr, "success 2 whole", "success 2 whole",
+       "success 2 gone"}},
+     {{"success 2 new", nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, "success 2 new"}}},
+    {"a byte in 20 s from byte 20 of the answer, request done",
+     {{"network 4 old", "success 2 new", "server 4 old", "success 1 new", "network 4 kept",
+       "network 4 none", "success 2 gone"}},
+     {{"success 2 new", nullptr, nullptr, nullptr, "network 4 kept", "network 4 none",
+       "success 2 gone"}},
+     {{"success 2 new", nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, "success 2 new"}}},
+    {"a byte in 20 s from byte 300 of the answer, request done, once",
+     {{nullptr, nullptr, nullptr, nullptr, "success 2 whole", "success 2 whole"}},
+     {{nullptr, nullptr, nullptr, nullptr, "success 2 whole", "success 2 whole"}}},
+    {"a byte in 20 s from byte 300 of the answer, request done",
+     {{nullptr, nullptr, nullptr, nullptr, "network 3 kept", "network 3 none"}},
+     {{nullptr, nullptr, nullptr, nullptr, "network 3 kept", "network 3 none"}}},
+    {"a byte in 20 s from byte 60000 of the answer, request done, once",
+     {{nullptr, nullptr, nullptr, nullptr, "success 2 whole"}},
+     {{nullptr, nullptr, nullptr, nullptr, "success 2 whole"}}},
+    {"a byte in 20 s from byte 60000 of the answer, request done",
+     {{nullptr, nullptr, nullptr, nullptr, "network 2 kept"}},
+     {{nullptr, nullptr, nullptr, nullptr, "network 2 kept"}}},
     {"401",
      {{"authentication 1 old", "authentication 1 old", "authentication 1 old", nullptr,
        "authentication 1 kept", "authentication 1 none", "authentication 1 old"}},

@@ -187,6 +187,22 @@ AnswerPtr Cloud::download(const std::string &remote, const std::string &local, i
                   options));
 }
 
+AnswerPtr Cloud::download_limited(const std::string &remote, const std::string &local,
+                                  uint64_t most) {
+  AnswerPtr answer = note();
+  auto *owned = new AnswerPtr(answer);
+  latest_ = owned;
+  return keep(answer, owned,
+              backup_trans_download_limited_ors_async(
+                  handle, remote.c_str(), local.c_str(), owned,
+                  [](backup_trans_error_code error, void *user_data, char *message) {
+                    const AnswerPtr taken = take(user_data, error);
+                    taken->has_info = message != nullptr;
+                    if (message != nullptr) taken->message = message;
+                  },
+                  BACKUP_TRANS_OPTION_NONE, most));
+}
+
 AnswerPtr Cloud::list(const std::string &folder, int start, int count) {
   AnswerPtr answer = note();
   auto *owned = new AnswerPtr(answer);

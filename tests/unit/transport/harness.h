@@ -94,6 +94,10 @@ class Cloud {
   AnswerPtr upload(const std::string &local, const std::string &remote,
                    int64_t timestamp_ms = 1700000000123, const char *content_type = nullptr);
   AnswerPtr download(const std::string &remote, const std::string &local, int options = 0);
+  /** Of at most so many bytes. */
+  AnswerPtr download_limited(const std::string &remote, const std::string &local, uint64_t most);
+  /** The user data of the latest request. */
+  void *latest() const { return latest_; }
   AnswerPtr list(const std::string &folder, int start = 0, int count = 100);
   AnswerPtr remove(const std::string &folder);
 
@@ -115,6 +119,7 @@ class Cloud {
 
  private:
   AnswerPtr note();
+  void *latest_ = nullptr;
 
   TempDir dir_;
   std::string config_path_;

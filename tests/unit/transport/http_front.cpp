@@ -460,13 +460,14 @@ bool Front::serve_one(Connection &connection) {
   if (stops_early) return false;
   request.body = pending.substr(head_size, size - head_size);
   pending.erase(0, size);
-  const bool answers = fault.spoil != Spoil::answer &&
-                       (fault.at > 0 || takes_effect || fault.spoil == Spoil::nothing ||
-                        fault.spoil == Spoil::edit || fault.spoil == Spoil::slow);
+  const bool answers =
+      fault.spoil != Spoil::answer &&
+      (fault.at > 0 || takes_effect || fault.spoil == Spoil::nothing ||
+       fault.spoil == Spoil::edit || fault.spoil == Spoil::slow || fault.spoil == Spoil::endless);
   Response response;
   if (answers || takes_effect) response = service_.serve(request);
   if (fault.spoil == Spoil::answer) response = fault.answer;
-  if (fault.spoil == Spoil::edit) fault.edit(&response);
+  if (fault.edit) fault.edit(&response);
   return send(connection, fault, wire_text(request, std::move(response)));
 }
 
@@ -485,6 +486,19 @@ bool Front::send(Connection &connection, const Fault &fault, const std::string &
       connection.write_all(text.data(), size);
       stall(connection);
       return false;
+    case Spoil::trickle:
+      connection.write_all(text.data(), size);
+      for (std::size_t at = size; at < text.size(); ++at) {
+        pass(kTrickleTime);
+        if (!connection.write_all(text.data() + at, 1) || connection.wait_for_end(0)) return false;
+      }
+      return true;
+    case Spoil::endless: {
+      const std::string more(kBufferBytes, text.empty() ? 'x' : text.back());
+      bool taken = connection.write_all(text.data(), size);
+      while (taken) taken = connection.write_all(more.data(), more.size());
+      return false;
+    }
     case Spoil::slow:
       for (std::size_t at = 0; at < text.size(); at += kSlowBytes) {
         if (!connection.write_all(text.data() + at, std::min(kSlowBytes, text.size() - at)))

@@ -67,10 +67,13 @@ enum class Spoil {
   cut_response,   /**< the connection is closed after Fault::at bytes of the answer */
   stall_request,  /**< no more is read after Fault::at bytes of the request */
   stall_response, /**< no more is sent after Fault::at bytes of the answer */
-  slow            /**< request and answer go at kSlowBytes a second */
+  slow,           /**< request and answer go at kSlowBytes a second */
+  trickle,        /**< the answer goes on with a byte every kTrickleTime after Fault::at bytes */
+  endless         /**< it goes on as fast as it can, without its length, after Fault::at bytes */
 };
 
 constexpr std::size_t kSlowBytes = 1000;
+constexpr std::chrono::seconds kTrickleTime{20};
 
 struct Fault {
   Spoil spoil = Spoil::nothing;

@@ -1,11 +1,10 @@
-#include "state/printable.h"
+#include "quarn_printable.h"
 
 #include <glib.h>
 
 #include <algorithm>
 #include <cstdio>
 
-namespace embedded {
 namespace {
 
 constexpr unsigned char kFirstPrintable = 0x20;
@@ -46,8 +45,8 @@ std::string escaped(gunichar code) {
 
 }  // namespace
 
-std::string printable(const std::string &text) {
-  if (std::all_of(text.begin(), text.end(), is_plain)) return text;
+std::string quarn_printable(std::string_view text) {
+  if (std::all_of(text.begin(), text.end(), is_plain)) return std::string(text);
   std::string result;
   for (std::size_t at = 0; at < text.size();) {
     const auto byte = static_cast<unsigned char>(text[at]);
@@ -70,4 +69,17 @@ std::string printable(const std::string &text) {
   return result;
 }
 
-}  // namespace embedded
+std::string quarn_shortened(std::string_view text, std::size_t size) {
+  constexpr unsigned char kContinuationMask = 0xc0;
+  constexpr unsigned char kContinuation = 0x80;
+  constexpr std::size_t kLongestTail = 3;  // continuation bytes of one character
+  if (text.size() <= size) return std::string(text);
+  std::size_t end = size;
+  while (end > 0 && size - end < kLongestTail &&
+         (static_cast<unsigned char>(text[end]) & kContinuationMask) == kContinuation) {
+    --end;
+  }
+  const bool starts_character =
+      (static_cast<unsigned char>(text[end]) & kContinuationMask) != kContinuation;
+  return std::string(text.substr(0, starts_character ? end : size)) + "...";
+}
