@@ -131,7 +131,7 @@ class Outsiders(Attack):
         with open(self.device.app_path(NOTES, "data/note"), "rb") as file:
             self.assertEqual(file.read(), b"mine")
 
-    def test_nor_while_the_daemon_has_given_its_name_up(self):
+    def test_nor_by_the_name_of_the_daemons_own_connection(self):
         client = self.new_client()
         client.call("last_bu_time")
         owner = client.owner()
