@@ -8,6 +8,7 @@
 
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_log.h"
 
 namespace {
 
@@ -44,8 +45,9 @@ static_assert(sizeof(DeflateMemory) <= kCodecMemory && sizeof(InflateMemory) <= 
 
 // The library's output depends, rarely and by a byte or two, on where its memory lies (measured:
 // one process in forty differs under address randomisation, none of 900 at a fixed address). An
-// archive that differs would be uploaded again, so the memory lies at one of a few fixed places.
-// Where they are taken, or are no addresses, any memory does.
+// archive that differs would be uploaded again, so what deflates lies at one of a few fixed places.
+// Where they are taken, or are no addresses, any memory does, which is told. What inflates, and
+// holds what a server has sent, lies where the system likes: its output is the data.
 constexpr std::uint64_t kFirstPlace = 0x200000000000;
 constexpr std::uint64_t kPlaceDistance = 16U << 20;
 constexpr int kPlaces = 16;
@@ -69,13 +71,19 @@ void *map_at_fixed_place([[maybe_unused]] std::size_t size) {
 #endif
 }
 
+void *map_anywhere(std::size_t size) {
+  void *const mapped =
+      mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  return mapped == MAP_FAILED ? nullptr : mapped;
+}
+
 /** Zeroed memory for a T, or null. */
 template <typename T>
 class CodecMemory {
  public:
-  explicit CodecMemory(bool wanted) {
+  CodecMemory(bool wanted, void *(*map)(std::size_t size)) {
     if (!wanted) return;
-    mapped_ = static_cast<T *>(map_at_fixed_place(sizeof(T)));
+    mapped_ = static_cast<T *>(map(sizeof(T)));
     if (mapped_ == nullptr) allocated_.reset(static_cast<T *>(std::calloc(1, sizeof(T))));
   }
   ~CodecMemory() {
@@ -84,6 +92,7 @@ class CodecMemory {
   CodecMemory(const CodecMemory &) = delete;
   CodecMemory &operator=(const CodecMemory &) = delete;
 
+  bool is_mapped() const { return mapped_ != nullptr; }
   T *get() const { return mapped_ != nullptr ? mapped_ : allocated_.get(); }
   T *operator->() const { return get(); }
   bool operator!=(std::nullptr_t) const { return get() != nullptr; }
@@ -96,8 +105,12 @@ class CodecMemory {
 class IsalCodec : public Codec {
  public:
   explicit IsalCodec(CodecUse use)
-      : out_(use == CodecUse::kDeflate), in_(use == CodecUse::kInflate) {
+      : out_(use == CodecUse::kDeflate, map_at_fixed_place),
+        in_(use == CodecUse::kInflate, map_anywhere) {
     if (out_ != nullptr) {
+      if (!out_.is_mapped()) {
+        LOGW("the codec's memory has none of its places: the same data may be uploaded again");
+      }
       isal_deflate_init(&out_->stream);
       out_->stream.level = kLevel;
       out_->stream.level_buf = out_->level;
