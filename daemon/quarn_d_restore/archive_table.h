@@ -12,7 +12,10 @@ struct archive_table {
   JsonPtr table;         /**< null for no JSON object, or one beyond kArchiveTableBounds */
 };
 
-/** Read a table, piece by piece: what is in memory is what it says, never its text. */
+/**
+ * Read a table, piece by piece: what is in memory is what it says of objects,
+ * to be looked up with get_file_info_from_backup(), never its text.
+ */
 archive_table read_archive_table(const char *path);
 
 #endif

@@ -10,6 +10,7 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/table_reader.h"
 #include "quarn_log.h"
 
 namespace {
@@ -54,6 +55,7 @@ int get_file_info_from_backup(json_object *table, const char * /*pkgid*/, const 
     LOGI("cannot get file info : %s", path);
     return QUARN_UNREADABLE;
   }
+  entry = attributes_in_table(table, entry);
   json_object *value = member(entry, kModeKey, json_type_int);
   if (value == nullptr) {
     LOGE("cannot get permission info...");

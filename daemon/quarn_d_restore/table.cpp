@@ -22,7 +22,7 @@ archive_table read_archive_table(const char *path) {
   const UniqueFd file = safe_open(path, O_RDONLY | O_NONBLOCK);
   struct stat status = {};
   if (!file || fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) return read;
-  TableReader reader;
+  TableReader reader(TableUse::lookup);
   TableText table(kArchiveTableBounds, &reader);
   char piece[kPiece];
   ssize_t count = 0;

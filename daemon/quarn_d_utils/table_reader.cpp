@@ -2,8 +2,17 @@
 
 #include <cstring>
 
-TableReader::TableReader(bool kept)
-    : tokener_(json_tokener_new()), table_(json_object_new_object()), kept_(kept) {}
+json_object *attributes_in_table(json_object *table, json_object *member) {
+  if (json_object_is_type(member, json_type_string) == 0) return member;
+  json_object *made = json_tokener_parse(json_object_get_string(member));
+  json_object_set_userdata(table, made, [](json_object *, void *old) {
+    json_object_put(static_cast<json_object *>(old));
+  });
+  return made;
+}
+
+TableReader::TableReader(TableUse use)
+    : tokener_(json_tokener_new()), table_(json_object_new_object()), use_(use) {}
 
 /** @return false when @p text is not one JSON value */
 bool TableReader::parse(std::string_view text, JsonPtr *value) {
@@ -28,11 +37,17 @@ bool TableReader::attributes(std::string_view text, JsonPtr *value) {
     }
   }
   if (!parse(text, value)) return false;
-  if (json_object_is_type(value->get(), json_type_object) != 0) {
-    known_[next_].text = text;
-    known_[next_].object.reset(json_object_get(value->get()));
-    next_ = (next_ + 1) % kRemembered;
+  if (json_object_is_type(value->get(), json_type_object) == 0) {
+    // a text is no attributes, and must not be taken for them
+    if (use_ != TableUse::all) value->reset(json_object_new_int(0));
+    return true;
   }
+  Known &next = known_[made_++ % kRemembered];
+  if (use_ == TableUse::lookup && made_ > kObjects) {
+    value->reset(json_object_new_string_len(text.data(), static_cast<int>(text.size())));
+  }
+  next.text = text;
+  next.object.reset(json_object_get(value->get()));
   return true;
 }
 
@@ -58,7 +73,7 @@ bool TableReader::decode_key(std::string_view quoted) {
 bool TableReader::member(std::string_view key, std::string_view value) {
   JsonPtr made;
   if (table_ == nullptr || !decode_key(key) || !attributes(value, &made)) return false;
-  if (!kept_) return true;
+  if (use_ == TableUse::check) return true;
   // one that replaces the list takes it along
   if (key_ == kLinkListKey) links_ = nullptr;
   return json_object_object_add(table_.get(), key_.c_str(), made.release()) == 0;
@@ -74,5 +89,5 @@ void TableReader::links() {
 bool TableReader::link(std::string_view element) {
   JsonPtr made;
   if (links_ == nullptr || !parse(element, &made)) return false;
-  return !kept_ || json_object_array_add(links_, made.release()) == 0;
+  return use_ != TableUse::all || json_object_array_add(links_, made.release()) == 0;
 }

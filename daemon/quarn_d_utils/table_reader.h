@@ -8,11 +8,23 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/table_text.h"
 
+/** What is kept of a table. */
+enum class TableUse {
+  check,  /**< nothing: every value is made, and released */
+  lookup, /**< attributes, to be looked up with attributes_in_table(); no links */
+  all
+};
+
+/**
+ * A member of a table that was read to be looked up. It is the table's, until
+ * the next is looked up.
+ */
+json_object *attributes_in_table(json_object *table, json_object *member);
+
 /** The JSON values of a table, each made by the library on its own. One thread at a time. */
 class TableReader : public TableSink {
  public:
-  /** @param kept false: every value is made, and nothing of it is kept */
-  explicit TableReader(bool kept = true);
+  explicit TableReader(TableUse use = TableUse::all);
   bool member(std::string_view key, std::string_view value) override;
   bool link(std::string_view element) override;
   void links() override;
@@ -23,6 +35,9 @@ class TableReader : public TableSink {
  private:
   /** So many different attributes are remembered. */
   static constexpr std::size_t kRemembered = 8;
+  /** After so many different ones, to be looked up, the others stay texts: a tenth of the memory.
+   */
+  static constexpr std::size_t kObjects = 512;
   struct Known {
     std::string text;
     JsonPtr object;
@@ -36,9 +51,9 @@ class TableReader : public TableSink {
   JsonPtr table_;
   json_object *links_ = nullptr;  // the table's
   Known known_[kRemembered];
-  std::size_t next_ = 0;
+  std::size_t made_ = 0;
   std::string key_;
-  const bool kept_;
+  const TableUse use_;
 };
 
 #endif

@@ -55,12 +55,10 @@ bool TableText::take(const char *data, std::size_t size) {
       const std::size_t taken = take_item(data + at, size - at);
       if (place_ == Place::ended) return false;
       at += taken;
-    } else if (is_space(data[at])) {
-      ++at;
-    } else if (!take_sign(data[at])) {
-      return false;
-    } else if (!in_item_) {
-      ++at;
+    } else {
+      if (!is_space(data[at]) && !take_sign(data[at])) return false;
+      // what begins an item is left to it
+      if (!in_item_) ++at;
     }
   }
   return true;

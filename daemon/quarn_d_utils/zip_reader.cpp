@@ -471,7 +471,7 @@ table_state look_at_table(const Archive &from, const unz_file_info64 &info, bool
   if (info.uncompressed_size > kArchiveTableBounds.text) return table_state::beyond;
   unzFile archive = from.handle.get();
   if (unzOpenCurrentFile2(archive, nullptr, nullptr, kRaw) != UNZ_OK) return table_state::malformed;
-  TableReader reader(false);
+  TableReader reader(TableUse::check);
   TableText table(kArchiveTableBounds, closely ? &reader : nullptr);
   TableLook look(&table, info.uncompressed_size);
   const bool arrived = read_entry(from, info, &look);
