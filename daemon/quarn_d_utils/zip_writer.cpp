@@ -12,6 +12,7 @@
 #include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
+#include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
 namespace {
@@ -32,11 +33,12 @@ constexpr uLong kMadeByDefault = 0;
  */
 class ArchiveFile {
  public:
-  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) {}
+  /** @param fd borrowed; negative for none */
+  explicit ArchiveFile(int fd) : fd_(fd) {}
   ArchiveFile(const ArchiveFile &) = delete;
   ArchiveFile &operator=(const ArchiveFile &) = delete;
 
-  bool is_open() const { return static_cast<bool>(fd_); }
+  bool is_open() const { return fd_ >= 0; }
 
   /** One more entry was written. */
   void count_entry() { ++entries_; }
@@ -122,7 +124,8 @@ class ArchiveFile {
 
   bool finish() {
     const bool written = flush() && (entries_ < kNotInEnd || add_zip64_end());
-    return close(fd_.release()) == 0 && written;
+    // some file systems tell only here that there was no room
+    return close(fcntl(fd_, F_DUPFD_CLOEXEC, 0)) == 0 && written;
   }
 
   /**
@@ -133,8 +136,7 @@ class ArchiveFile {
     char end[kEndSize];
     if (start_ < sizeof end) return false;
     const ZPOS64_T at = start_ - sizeof end;
-    const ssize_t count =
-        TEMP_FAILURE_RETRY(pread(fd_.get(), end, sizeof end, static_cast<off_t>(at)));
+    const ssize_t count = TEMP_FAILURE_RETRY(pread(fd_, end, sizeof end, static_cast<off_t>(at)));
     if (count != static_cast<ssize_t>(sizeof end)) return false;
     const std::uint64_t directory_size = number(end + kEndDirectorySize);
     const std::uint64_t directory = number(end + kEndDirectory);
@@ -168,8 +170,7 @@ class ArchiveFile {
 
   bool write_at(const char *data, std::size_t size, ZPOS64_T offset) {
     while (size > 0) {
-      const ssize_t count =
-          TEMP_FAILURE_RETRY(pwrite(fd_.get(), data, size, static_cast<off_t>(offset)));
+      const ssize_t count = TEMP_FAILURE_RETRY(pwrite(fd_, data, size, static_cast<off_t>(offset)));
       if (count <= 0) {
         failed_ = true;
         return false;
@@ -181,7 +182,7 @@ class ArchiveFile {
     return true;
   }
 
-  UniqueFd fd_;
+  const int fd_;
   const std::unique_ptr<char[]> buffer_{new char[kBuffer]};  // the file's bytes from start_ on
   std::size_t filled_ = 0;
   ZPOS64_T start_ = 0;     // bytes before it are in the file
@@ -600,50 +601,87 @@ void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table
   insert_file_info_table_to_zip(table, zip, pkg_id, root, error);
 }
 
-}  // namespace
+/** What an archive is to be like, and what came of it. */
+struct PackRequest {
+  const char *pkg_id;
+  const char *root;
+  const char *zip_path; /**< empty for an archive without a name */
+  int *error;
+  const archive_bounds &bounds;
+  archive_excess *excess;
+  const std::atomic<bool> *stop;
+};
 
-void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
-                   const archive_bounds &bounds, archive_excess *excess,
-                   const std::atomic<bool> *stop) {
-  const PackageDataLock lock(pkg_id, PackageUse::kPack);
-  if (!may_be_packed(pkg_id, root)) {
-    *error = QUARN_REFUSED;
-    return;
-  }
-  const PackageRoot package(root);
-  package.create_directory_of(zip_path);
-  file_info_table_h *made = nullptr;
-  ready_file_info_table(&made);
-  const std::unique_ptr<file_info_table_h, ReleaseTable> table(made);
-  if (table == nullptr) {
-    LOGE("file_info_table is NULL");
-    *error = QUARN_REFUSED;
-    return;
-  }
-  ArchiveFile file(create_archive(zip_path));
-  zlib_filefunc64_def functions = file.functions();
-  zipFile zip =
-      file.is_open() ? zipOpen2_64(zip_path, APPEND_STATUS_CREATE, nullptr, &functions) : nullptr;
-  if (zip == nullptr) {
-    LOGE("zipOpen() failed, zf is NULL");
-    *error = QUARN_UNREADABLE;
-    return;
-  }
-  Packing current(&file, zip_path, bounds, stop);
+/** Pack into the open archive, whose library handle is @p zip. */
+void pack_into(const PackRequest &request, const PackageRoot &package, file_info_table_h *table,
+               ArchiveFile *file, zipFile zip) {
+  Packing current(file, request.zip_path, request.bounds, request.stop);
   packing = &current;
-  pack_all(pkg_id, root, zip, table.get(), error);
+  pack_all(request.pkg_id, request.root, zip, table, request.error);
   if (package.has_gone(current.data_dirs)) {
-    LOGE("(%s) was removed while it was packed", pkg_id);
-    *error = QUARN_REFUSED;
+    LOGE("(%s) was removed while it was packed", request.pkg_id);
+    *request.error = QUARN_REFUSED;
   }
   const int closed = zipClose(zip, nullptr);
   packing = nullptr;
   archive_codec.reset();
   if (closed != ZIP_OK) {
     LOGE("zipClose() failed, zip_err = [%d]", closed);
-    *error = QUARN_REFUSED;
+    *request.error = QUARN_REFUSED;
   }
-  if (excess != nullptr) *excess = current.excess();
+  if (request.excess != nullptr) *request.excess = current.excess();
+}
+
+/** @param archive where it is packed into; made at its name if it is none */
+void pack_package(const PackRequest &request, UniqueFd *archive) {
+  const PackageDataLock lock(request.pkg_id, PackageUse::kPack);
+  if (!may_be_packed(request.pkg_id, request.root)) {
+    *request.error = QUARN_REFUSED;
+    return;
+  }
+  const PackageRoot package(request.root);
+  if (!*archive) package.create_directory_of(request.zip_path);
+  file_info_table_h *made = nullptr;
+  ready_file_info_table(&made);
+  const std::unique_ptr<file_info_table_h, ReleaseTable> table(made);
+  if (table == nullptr) {
+    LOGE("file_info_table is NULL");
+    *request.error = QUARN_REFUSED;
+    return;
+  }
+  if (!*archive) *archive = create_archive(request.zip_path);
+  ArchiveFile file(archive->get());
+  zlib_filefunc64_def functions = file.functions();
+  zipFile zip = file.is_open()
+                    ? zipOpen2_64(request.zip_path, APPEND_STATUS_CREATE, nullptr, &functions)
+                    : nullptr;
+  if (zip == nullptr) {
+    LOGE("zipOpen() failed, zf is NULL");
+    *request.error = QUARN_UNREADABLE;
+    return;
+  }
+  pack_into(request, package, table.get(), &file, zip);
+}
+
+}  // namespace
+
+UniqueFd make_archive(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                      const archive_bounds &bounds, archive_excess *excess,
+                      const std::atomic<bool> *stop) {
+  UniqueFd archive;
+  pack_package({pkg_id, root, zip_path, error, bounds, excess, stop}, &archive);
+  return archive;
+}
+
+void fill_archive(const char *pkg_id, const char *root, UniqueFd *archive, int *error,
+                  const archive_bounds &bounds, archive_excess *excess) {
+  pack_package({pkg_id, root, "", error, bounds, excess, nullptr}, archive);
+}
+
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                   const archive_bounds &bounds, archive_excess *excess,
+                   const std::atomic<bool> *stop) {
+  make_archive(pkg_id, root, zip_path, error, bounds, excess, stop);
 }
 
 bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,

@@ -1,3 +1,5 @@
+#include <cerrno>
+#include <cstdio>
 #include <filesystem>
 
 #include "backup_device.h"
@@ -13,9 +15,13 @@ namespace {
 constexpr int kRefused = BACKUP_TRANS_ERROR_NOT_INITIALIZED;
 constexpr int kServer = BACKUP_TRANS_ERROR_SERVER;
 
+/** Nothing can be renamed, as where it is a mount point. */
+bool stuck_files = false;
+
 class Cloud : public BackupDevice {
  protected:
   Cloud() : ctx_(new backup_context) { ctx_->serial_number = kSerial; }
+  ~Cloud() override { stuck_files = false; }
 
   void refuse_all() {
     cloud_.refuse = [](Op, const std::string &) { return kRefused; };
@@ -119,6 +125,7 @@ TEST_F(Cloud, RefusedListDownloadTruncatesAnEarlierText) {
 
 TEST_F(Cloud, ListIsNotRequestedWithoutAStagingDirectory) {
   write_text("/tmp/quarn", "a file");
+  stuck_files = true;
   EXPECT_NE(get_app_list_from_cloud(ctx_.get()), 0);
   EXPECT_EQ(error("cannot use staging directory /tmp/quarn"), 1);
   EXPECT_THAT(cloud_.requests(), IsEmpty());
@@ -178,6 +185,7 @@ TEST_F(Cloud, SynchronousDownloadThatCannotBeRead) {
 
 TEST_F(Cloud, SynchronousDownloadWithoutAStagingDirectory) {
   write_text("/tmp/quarn", "a file");
+  stuck_files = true;
   char *text = nullptr;
   EXPECT_NE(download_app_list_info_from_cloud(&text), 0);
   EXPECT_THAT(cloud_.requests(), IsEmpty());
@@ -789,3 +797,12 @@ TEST_F(MissingRecord, OfAVersionListingAndDeletion) {
 }
 
 }  // namespace
+
+extern "C" {
+int __real_renameat2(int from, const char *source, int to, const char *target, unsigned int flags);
+int __wrap_renameat2(int from, const char *source, int to, const char *target, unsigned int flags) {
+  if (!stuck_files) return __real_renameat2(from, source, to, target, flags);
+  errno = EBUSY;
+  return -1;
+}
+}
