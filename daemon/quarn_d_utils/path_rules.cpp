@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "lazy_xml.h"
+#include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
@@ -114,6 +115,14 @@ void collect_rules(const xmlNode *element, const char *root) {
   }
 }
 
+/** What lies there, whoever may enter the directory. */
+int look_at(int dir, const char *name, struct stat *status) {
+  const int found = fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+  if (found == 0 || errno != EACCES) return found;
+  const ActAsRoot root;
+  return fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+}
+
 std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path, int depth) {
   std::uint64_t sum = 0;
   while (const dirent *entry = readdir(dir.get())) {
@@ -121,12 +130,14 @@ std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path
     const PathStep step(path, entry->d_name);
     if (working.contain(*path)) continue;
     struct stat status = {};
-    const int result = fstatat(dirfd(dir.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
+    const int result = look_at(dirfd(dir.get()), entry->d_name, &status);
     if (result != 0) {
       LOGE("error : lstat for %d %s", result, path->c_str());
     } else if (S_ISDIR(status.st_mode)) {
       DirPtr child;
-      if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), entry->d_name);
+      if (depth < kMaxDirDepth) {
+        child = open_directory_as_package(dirfd(dir.get()), entry->d_name, user_of_package());
+      }
       if (child == nullptr) {
         LOGE("error : cannot open this path %s", path->c_str());
         sum += kUnmeasurableSize;
@@ -250,5 +261,6 @@ std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, cons
   }
   const WorkingFiles working(pkg_id, root);
   std::string path = dir_path;
-  return measure(std::move(dir), working, &path, 1);
+  const ActAsPackage acting;
+  return acting ? measure(std::move(dir), working, &path, 1) : kUnmeasurableSize;
 }

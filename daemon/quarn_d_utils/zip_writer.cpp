@@ -7,6 +7,8 @@
 
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/package_directory.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_state.h"
@@ -169,6 +171,8 @@ class ArchiveFile {
   }
 
   bool write_at(const char *data, std::size_t size, ZPOS64_T offset) {
+    // the archive is the daemon's own, and so is the room that it takes
+    const ActAsRoot root;
     while (size > 0) {
       const ssize_t count = TEMP_FAILURE_RETRY(pwrite(fd_, data, size, static_cast<off_t>(offset)));
       if (count <= 0) {
@@ -382,6 +386,7 @@ struct Walk {
   zipFile zip;
   file_info_table_h *table;
   int *error;
+  const package_user user = user_of_package();
 };
 
 bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth);
@@ -406,19 +411,44 @@ void admit_in_table(Walk *walk, const std::string &path) {
   *walk->error = QUARN_REFUSED;
 }
 
+/** What lies there, whoever may enter the directory. */
+int look_at(int parent, const char *name, struct stat *status) {
+  const int found = fstatat(parent, name, status, AT_SYMLINK_NOFOLLOW);
+  if (found == 0 || errno != EACCES) return found;
+  const ActAsRoot root;
+  return fstatat(parent, name, status, AT_SYMLINK_NOFOLLOW);
+}
+
+/** Open a regular file with the rights of the application, as safe_open_file_at() does. */
+UniqueFd open_file(const Walk &walk, int parent, const char *name, struct stat *status) {
+  constexpr int kFlags = O_RDONLY | O_NONBLOCK | O_NOCTTY;
+  UniqueFd fd = open_as_package(parent, name, kFlags | O_NOATIME, 0, walk.user, status);
+  if (!fd && errno == EPERM) fd = open_as_package(parent, name, kFlags, 0, walk.user, status);
+  if (!fd || !S_ISREG(status->st_mode)) return {};
+  return fd;
+}
+
+/** Walk a directory below another, and record it behind what it holds. */
 bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, int depth) {
   if (depth >= kMaxDirDepth && packing != nullptr && packing->refuses_depth(depth + 1)) {
     LOGE("archive is full at %s", path->c_str());
     *walk->error = QUARN_REFUSED;
     return false;
   }
-  const DirPtr dir = depth < kMaxDirDepth ? safe_opendir_at(parent, name) : nullptr;
+  struct stat status {};
+  const DirPtr dir =
+      depth < kMaxDirDepth ? open_directory_as_package(parent, name, walk->user, &status) : nullptr;
   if (dir == nullptr) {
     LOGE("error : cannot open this path %s", path->c_str());
     *walk->error = QUARN_REFUSED;
     return false;
   }
-  return walk_dir(walk, dir.get(), path, depth);
+  if (!walk_dir(walk, dir.get(), path, depth)) return false;
+  if (packing_ended() || !admit(walk, *path, 0)) return true;
+  add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error,
+                         dirfd(dir.get()));
+  admit_in_table(walk, *path);
+  return true;
 }
 
 /** Record a file and pack it, when it could be opened. */
@@ -448,7 +478,7 @@ bool walk_regular(Walk *walk, int parent, const char *name, const std::string &p
   *noted = is_backup_file(path.c_str());
   if (!*noted) return true;
   struct stat status {};
-  const UniqueFd fd = safe_open_file_at(parent, name, &status);
+  const UniqueFd fd = open_file(*walk, parent, name, &status);
   if (fd) add_regular(walk, path, fd, status);
   return static_cast<bool>(fd);
 }
@@ -458,30 +488,31 @@ bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, 
   bool noted = false;
   if (entry.d_type == DT_REG && walk_regular(walk, parent, name, *path, &noted)) return noted;
   struct stat status {};
-  const int found = fstatat(parent, name, &status, AT_SYMLINK_NOFOLLOW);
+  const int found = look_at(parent, name, &status);
   if (found != 0) {
     LOGE("error : lstat for %d %s", found, path->c_str());
     *walk->error = QUARN_REFUSED;
     return false;
   }
-  if (S_ISDIR(status.st_mode)) {
-    if (!walk_subdir(walk, parent, name, path, depth + 1)) return false;
-    if (packing_ended() || !admit(walk, *path, 0)) return true;
-    add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error);
-    admit_in_table(walk, *path);
-    return true;
-  }
+  if (S_ISDIR(status.st_mode)) return walk_subdir(walk, parent, name, path, depth + 1);
   if (S_ISREG(status.st_mode)) {
     if (!is_backup_file(path->c_str())) return false;
     struct stat opened {};
-    const UniqueFd fd = safe_open_file_at(parent, name, &opened);
+    const UniqueFd fd = open_file(*walk, parent, name, &opened);
+    if (!fd && errno == EACCES && status.st_uid != kAppUid && status.st_nlink == 1) {
+      // its other name may be gone, and it then looks like any file
+      LOGE("refused : %s is another owner's file, and its application may not read it",
+           path->c_str());
+      *walk->error = QUARN_REFUSED;
+      return true;
+    }
     add_regular(walk, *path, fd, fd ? opened : status);
     return true;
   }
   if (S_ISLNK(status.st_mode)) {
     if (!is_backup_file(path->c_str()) || !admit(walk, *path, 0)) return false;
     add_sym_info_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status,
-                                    walk->error);
+                                    walk->error, parent);
     admit_in_table(walk, *path);
     return true;
   }
@@ -697,13 +728,23 @@ bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, co
     packing->data_dirs.emplace_back(fcntl(dirfd(opened.get()), F_DUPFD_CLOEXEC, 0));
   }
   std::string path = dir;
+  const ActAsPackage acting(walk.user);
+  if (!acting) {
+    LOGE("cannot act as user %u : %d", walk.user.uid, errno);
+    *error = QUARN_REFUSED;
+    return false;
+  }
   return walk_dir(&walk, opened.get(), &path, 0);
 }
 
 bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error) {
-  const UniqueFd fd = safe_open(file, O_RDONLY | O_NONBLOCK);
   struct stat status {};
-  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) {
+  std::string name;
+  const UniqueFd parent = safe_open_parent(file, &name);
+  const UniqueFd fd = parent ? open_as_package(parent.get(), name.c_str(), O_RDONLY | O_NONBLOCK, 0,
+                                               user_of_package(), &status)
+                             : UniqueFd();
+  if (!fd || !S_ISREG(status.st_mode)) {
     LOGE("fopen() failed, file is NULL");
     *error = QUARN_REFUSED;
     return false;
