@@ -826,7 +826,9 @@ TEST_F(MissingRecord, OfAListDownload) {
 }
 
 TEST_F(MissingRecord, OfAnArchiveUpload) {
-  upload(install("org.app"));
+  const FakePackage &app = install("org.app");
+  write_text(app.staged(), "an archive");
+  upload(app);
   EXPECT_DEBUG_DEATH(call_without_record(uploaded_), "user_data");
   expect_logged("cb user_data is NULL...");
   uploaded_(BACKUP_TRANS_ERROR_CANCELLED, record_, nullptr);
