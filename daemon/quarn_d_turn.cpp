@@ -66,17 +66,38 @@ void take_turn() {
   g_idle_add_full(G_PRIORITY_DEFAULT, tell_observer, nullptr, nullptr);
 }
 
+/** What anybody else could open, by this name or another, they could hold the lock of. */
+bool is_ours_alone(int fd) {
+  struct stat status {};
+  return fstat(fd, &status) == 0 && S_ISREG(status.st_mode) && status.st_uid == geteuid() &&
+         status.st_nlink <= 1 && (status.st_mode & (S_IRWXG | S_IRWXO)) == 0;
+}
+
+/** Remove a thing of any kind; a directory that is not empty stays. */
+bool make_way(const char *path) {
+  return unlink(path) == 0 || (errno == EISDIR && rmdir(path) == 0) || errno == ENOENT;
+}
+
 bool open_lock() {
   constexpr int kAttempts = 5;  // the folder may be removed by the earlier process meanwhile
   for (int attempt = 0; attempt < kAttempts; ++attempt) {
     if (prepare_folder != nullptr && !prepare_folder()) return false;
-    lock_fd = open(lock_path, O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kLockMode);
-    if (lock_fd >= 0) {
+    const int fd = open(
+        lock_path, O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, kLockMode);
+    if (fd >= 0 && is_ours_alone(fd)) {
+      lock_fd = fd;
       // Older lines were for others.
       lines_taken = std::max<off_t>(lseek(lock_fd, 0, SEEK_END), 0);
       return true;
     }
-    if (errno != ENOENT) break;
+    const int error = errno;
+    if (fd >= 0) close(fd);
+    if (fd < 0 && error == ENOENT) continue;
+    // What lies there is not the daemon's, who is alone in its folder.
+    if ((fd < 0 && error != ELOOP && error != EISDIR && error != ENXIO) || !make_way(lock_path)) {
+      errno = error;
+      break;
+    }
   }
   LOGE("cannot open %s : %d", lock_path, errno);
   return false;

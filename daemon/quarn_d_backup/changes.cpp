@@ -1,3 +1,5 @@
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <cstring>
 
@@ -9,10 +11,13 @@
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/file_crc.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/working_files.h"
+#include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
 namespace {
@@ -247,8 +252,9 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
 
   int error = QUARN_OK;
   archive_excess excess;
-  make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), archive_path.c_str(), &error,
-                kBackupBounds, &excess);
+  // What is summed up, measured and sent is what was made, whatever its name leads to by then.
+  const UniqueFd archive = make_archive(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(),
+                                        archive_path.c_str(), &error, kBackupBounds, &excess);
   if (error != QUARN_OK) {
     LOGE("fail to make zip data for %s", ctx->cur_pkg_id.c_str());
     delete_staged_file(archive_path);
@@ -261,18 +267,21 @@ int make_staged_archive(backup_context *ctx, const std::string &archive_path) {
     return error;
   }
 
-  ctx->cur_crc = static_cast<std::int32_t>(get_file_crc(archive_path.c_str()));
+  struct stat made = {};
+  fstat(archive.get(), &made);
+  const auto size = static_cast<std::uint64_t>(made.st_size);
+  note_working_file(archive_path, archive.get());
+  ctx->cur_crc = static_cast<std::int32_t>(get_open_file_crc(archive.get()));
   // 0 is what an unreadable archive and an unknown one have in common
   if (ctx->cur_crc != 0 && ctx->cur_crc == get_previous_crc_value(ctx)) {
     LOGI("same backup for (%s) already exist in cloud!(crc : %d)", ctx->cur_pkg_id.c_str(),
          ctx->cur_crc);
-    const std::uint64_t size = staged_file_size(archive_path);
     delete_staged_file(archive_path);
     report_package(ctx, backup_outcome::unchanged, size);
     return QUARN_UNCHANGED;
   }
   LOGI("app data of (%s) was changed, so will be backed up", ctx->cur_pkg_id.c_str());
-  ctx->bytes_to_upload += staged_file_size(archive_path);
+  ctx->bytes_to_upload += size;
   if (!ctx->single_package) add_to_app_data_upload_list(ctx);
   report_package(ctx, backup_outcome::none);
   return QUARN_OK;

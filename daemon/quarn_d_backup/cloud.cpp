@@ -1,4 +1,7 @@
+#include <sys/stat.h>
+
 #include <cassert>
+#include <cerrno>
 #include <memory>
 #include <mutex>
 #include <set>
@@ -13,6 +16,8 @@
 #include "quarn_d_backup/single_upload.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
 namespace {
@@ -149,13 +154,23 @@ void __upload_app_data_resp_cb(backup_trans_error_code error, void *user_data,
 
 /** Hand the upload to the transport, which has the record then. */
 int request_upload(std::unique_ptr<app_data_upload> &record) {
+  // The archive lies in its application's folder. The transport opens it while it is held here.
+  const UniqueFd archive = open_working_file(record->local_path);
+  struct stat status = {};
+  if (!archive || fstat(archive.get(), &status) != 0) {
+    if (errno == ESTALE) {
+      LOGE("archive of (%s) was exchanged, so it is not sent", record->pkg_id.c_str());
+    }
+    return BACKUP_TRANS_ERROR_LOCAL_FILE;
+  }
+  record->size = static_cast<std::uint64_t>(status.st_size);
+  const std::string held = own_fd_path(archive.get());
   // before the request: on the worker its answer may be here first
   backup_context *const single = record->ctx->single_package ? record->ctx.get() : nullptr;
   if (single != nullptr) notes_of(single).single_upload = record.get();
   const int ret = backup_trans_upload_file_ors_async(
-      cloud_handler(), record->local_path.c_str(), record->remote_path.c_str(),
-      __upload_app_data_resp_cb, _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE, record.get(),
-      nullptr);
+      cloud_handler(), held.c_str(), record->remote_path.c_str(), __upload_app_data_resp_cb,
+      _get_current_timestamp(), BACKUP_TRANS_OPTION_NONE, record.get(), nullptr);
   if (ret == BACKUP_TRANS_ERROR_NONE) {
     static_cast<void>(record.release());
   } else if (single != nullptr) {

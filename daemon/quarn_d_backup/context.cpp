@@ -12,6 +12,7 @@
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/own_place.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
@@ -21,7 +22,6 @@
 namespace {
 
 constexpr char kStagingDirectory[] = "/tmp/quarn";
-constexpr mode_t kPrivateDirectory = 0700;
 
 /** How long a run that waits for a lease does not look at cancel and Wi-Fi. */
 constexpr std::chrono::milliseconds kLookInterval{100};
@@ -186,18 +186,9 @@ std::uint64_t staged_file_size(const std::string &path) {
 }
 
 bool prepare_staging_directory() {
-  struct stat status = {};
-  const bool made = safe_mkdir_with_parents(kStagingDirectory, kPrivateDirectory) == 0;
-  const UniqueFd dir = made ? safe_open(kStagingDirectory, O_RDONLY | O_DIRECTORY) : UniqueFd();
-  if (!dir || fstat(dir.get(), &status) != 0 || status.st_uid != geteuid()) {
-    LOGE("cannot use staging directory %s", kStagingDirectory);
-    return false;
-  }
-  if ((status.st_mode & (S_IRWXG | S_IRWXO)) != 0 && fchmod(dir.get(), kPrivateDirectory) != 0) {
-    LOGE("cannot use staging directory %s", kStagingDirectory);
-    return false;
-  }
-  return true;
+  if (make_own_directory(kStagingDirectory)) return true;
+  LOGE("cannot use staging directory %s", kStagingDirectory);
+  return false;
 }
 
 void sweep_staging_directory(const char *keep) {

@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 
@@ -27,7 +28,7 @@ backup_outcome look_below(DIR *dir, int depth) {
       continue;
     }
     if (depth >= kMaxDirDepth) return backup_outcome::too_deep;
-    const DirPtr child = safe_opendir_at(dirfd(dir), entry->d_name);
+    const DirPtr child = open_directory_as_package(dirfd(dir), entry->d_name, user_of_package());
     found = worse(
         found, child == nullptr ? backup_outcome::unreadable : look_below(child.get(), depth + 1));
     if (found == backup_outcome::too_deep) return found;

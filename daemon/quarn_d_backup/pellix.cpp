@@ -1,12 +1,18 @@
 #include <fcntl.h>
+#include <glib.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <cerrno>
+
+#include "backup_transport.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
+#include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
 namespace {
@@ -14,38 +20,87 @@ namespace {
 constexpr char kSharedDataDir[] = "/shared/data/";
 constexpr char kListName[] = "app_list.txt";
 constexpr char kArchiveSuffix[] = ".zip";
+constexpr mode_t kPrivateFile = 0600;
 constexpr mode_t kArchiveMode = 0777;  // the companion's own rules decide who reads it
+
+/** Known as ours wherever working files are swept and passed over. */
+std::string hidden_name() {
+  const GString_ random(g_uuid_string_random());
+  return std::string(BACKUP_TRANS_TEMPORARY_PREFIX) + random.get();
+}
 
 std::string companion_dir() { return std::string(kAppsDir) + kPellixPackage + kSharedDataDir; }
 
-/** Give the archive to the companion; what an application put in its place is left alone. */
-bool hand_over_archive(const std::string &path) {
-  const UniqueFd fd = safe_open(path.c_str(), O_RDONLY | O_NONBLOCK);
+/** Let nobody but the companion into its folder, before anything of another's lies there. */
+bool close_companion_dir() {
+  const UniqueFd dir = safe_open(companion_dir().c_str(), O_RDONLY | O_DIRECTORY);
   struct stat status = {};
-  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode) || status.st_nlink != 1) {
-    LOGE("cannot open archive %s", path.c_str());
-    return false;
+  if (!dir || fstat(dir.get(), &status) != 0) return false;
+  // a folder that is not the companion's own may be its group's
+  const bool by_group = status.st_uid != kAppUid && status.st_gid == kAppGid;
+  const mode_t others = by_group ? S_IRWXO : S_IRWXG | S_IRWXO;
+  return (status.st_mode & others) == 0 ||
+         fchmod(dir.get(), status.st_mode & ALLPERMS & ~others) == 0;
+}
+
+/** A file in the open folder that nobody can find; with a name where there are none without. */
+UniqueFd make_hidden_file(int dir, std::string *name) {
+  UniqueFd file(openat(dir, ".", O_TMPFILE | O_RDWR | O_CLOEXEC, kPrivateFile));
+  if (file || (errno != EOPNOTSUPP && errno != EISDIR && errno != EINVAL)) return file;
+  *name = hidden_name();
+  return UniqueFd(
+      openat(dir, name->c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kPrivateFile));
+}
+
+/** Name what is open as @p file, over a file or link that may lie there; not over a folder. */
+bool publish(int dir, int file, std::string *hidden, const std::string &name) {
+  if (hidden->empty()) {
+    *hidden = hidden_name();
+    const std::string held = own_fd_path(file);
+    if (linkat(AT_FDCWD, held.c_str(), dir, hidden->c_str(), AT_SYMLINK_FOLLOW) != 0) return false;
   }
-  const std::string held = fd_path(fd.get());
+  if (renameat(dir, hidden->c_str(), dir, name.c_str()) != 0) return false;
+  hidden->clear();
+  return true;
+}
+
+/** Give the archive to the companion. */
+void hand_over_archive(int archive, const std::string &path) {
+  const std::string held = fd_path(archive);
   if (smack_setlabel(held.c_str(), kPellixPackage, SMACK_LABEL_ACCESS) != 0) {
     LOGE("smack_setlabel failed for %s", path.c_str());
   }
-  if (chmod(held.c_str(), kArchiveMode) != 0) LOGE("chmod failed");
-  return true;
+  if (fchmod(archive, kArchiveMode) != 0) LOGE("chmod failed");
+}
+
+/** Pack the current package. @return true when the archive lies at its name */
+bool pack_for_companion(backup_context *ctx, const std::string &name) {
+  const std::string path = companion_dir() + name;
+  const UniqueFd dir = safe_open(companion_dir().c_str(), O_RDONLY | O_DIRECTORY);
+  if (file_exist(path.c_str())) delete_file(path.c_str());
+  std::string hidden;
+  UniqueFd archive = dir ? make_hidden_file(dir.get(), &hidden) : UniqueFd();
+  if (!archive) {
+    LOGE("cannot make archive %s", path.c_str());
+    return false;
+  }
+  int error = QUARN_OK;
+  fill_archive(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), &archive, &error,
+               kBackupBounds);
+  const bool packed = error == QUARN_OK;
+  const bool published = packed && publish(dir.get(), archive.get(), &hidden, name);
+  if (packed && !published) LOGE("cannot put archive %s in its place", path.c_str());
+  if (!hidden.empty()) unlinkat(dir.get(), hidden.c_str(), 0);
+  if (published) hand_over_archive(archive.get(), path);
+  return published;
 }
 
 void make_companion_archive(backup_context *ctx) {
   if (check_current_backup_size(ctx) != QUARN_OK) return;
-  const std::string path =
-      companion_dir() + ctx->cur_pkg_id + "_" + ctx->cur_version + kArchiveSuffix;
-  int error = QUARN_OK;
-  make_zip_data(ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(), path.c_str(), &error,
-                kBackupBounds);
-  if (error != QUARN_OK || !hand_over_archive(path)) {
-    delete_staged_file(path);
-    return;
-  }
-  json_object_array_add(ctx->app_data_path, json_object_new_string(path.c_str()));
+  const std::string name = ctx->cur_pkg_id + "_" + ctx->cur_version + kArchiveSuffix;
+  if (!pack_for_companion(ctx, name)) return;
+  json_object_array_add(ctx->app_data_path,
+                        json_object_new_string((companion_dir() + name).c_str()));
 }
 
 }  // namespace
@@ -61,16 +116,23 @@ char *get_app_list_for_pellix() {
     LOGE("no directory for app list file %s", list_path.c_str());
     return nullptr;
   }
+  if (!close_companion_dir()) {
+    LOGE("cannot close %s to others", companion_dir().c_str());
+    return nullptr;
+  }
   const int ret = package_manager_foreach_package_info(foreach_package_info_callback, ctx.get());
   if (ret != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_manager_foreach_package_info() failed %d", ret);
     return nullptr;
   }
+  const char *document = json_object_get_string(ctx->app_list_root.get());
+  const std::string written = document == nullptr ? "" : document;
   const bool saved = save_app_list_to_file(ctx.get());
   note_request_end(notes_of(ctx.get()).cause);
   if (!saved) return nullptr;
   CString text;
-  if (!read_data_from_file(list_path.c_str(), out(text))) {
+  // another text is not this list: the folder is the companion's
+  if (!read_data_from_file(list_path.c_str(), out(text)) || written != text.get()) {
     LOGE("cannot read app list file...");
     text.reset();
   }

@@ -221,7 +221,7 @@ bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id);
 /** Give it back; nothing happens when @p ctx does not hold it. Any thread. */
 void release_staged_archive(backup_context *ctx, const std::string &pkg_id);
 
-/** Make the directory of staged lists; false when what lies there is not ours alone. */
+/** Make the directory of staged lists, whatever lies there; false when it cannot be had. */
 bool prepare_staging_directory();
 /** Remove what an ended process has left there, all but @p keep. Before anything is staged. */
 void sweep_staging_directory(const char *keep);

@@ -12,7 +12,9 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/own_place.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
 namespace {
@@ -40,12 +42,13 @@ class StagingDir {
   std::string path_;
 };
 
-/** Give the archive to the client under its public name, over whatever lies there. */
-bool hand_over(const std::string &archive, const std::string &target, uid_t client_uid) {
-  const UniqueFd file(open(archive.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-  return file && fchmod(file.get(), kExportMode) == 0 &&
-         fchown(file.get(), client_uid, static_cast<gid_t>(-1)) == 0 &&
-         rename(archive.c_str(), target.c_str()) == 0;
+/**
+ * Give the archive to the client under its public name, whatever lies there.
+ * @param file the archive, as it was made
+ */
+bool hand_over(int file, const std::string &archive, const std::string &target, uid_t client_uid) {
+  return fchmod(file, kExportMode) == 0 && fchown(file, client_uid, static_cast<gid_t>(-1)) == 0 &&
+         move_to_own_place(archive, target);
 }
 
 /** What the thread that packs and the request that waits for it share. */
@@ -54,6 +57,7 @@ struct ExportJob {
   std::atomic<bool> unwanted{false};
   bool packed = false; /**< of the main thread */
   int result = QUARN_OK;
+  UniqueFd archive;
 };
 using ExportJobPtr = std::shared_ptr<ExportJob>;
 
@@ -69,22 +73,26 @@ void drop_reference(gpointer data) { delete static_cast<ExportJobPtr *>(data); }
 /**
  * Pack beside the main loop: an export may have any size, and others are served meanwhile. The
  * daemon is not idle before that has ended.
+ * @param[out] made the archive, none where none was begun
  * @return what packing gave, or 17 when the daemon ends
  */
-int pack(const std::string &pkg_id, const std::string &root, const std::string &archive) {
+int pack(const std::string &pkg_id, const std::string &root, const std::string &archive,
+         UniqueFd *made) {
   request_power_lock(true);
   const auto job = std::make_shared<ExportJob>();
   job->loop.reset(new_wait_loop());
   std::thread worker([job, pkg_id, root, archive] {
-    make_zip_data(pkg_id.c_str(), root.c_str(), archive.c_str(), &job->result, kNoBounds, nullptr,
-                  &job->unwanted);
+    job->archive = make_archive(pkg_id.c_str(), root.c_str(), archive.c_str(), &job->result,
+                                kNoBounds, nullptr, &job->unwanted);
     g_idle_add_full(G_PRIORITY_DEFAULT, wake, new ExportJobPtr(job), drop_reference);
   });
   run_nested_loop(job->loop.get());
   job->unwanted = true;
   worker.join();
   request_power_lock(false);
-  return job->packed ? job->result : QUARN_CANCELLED;
+  if (!job->packed) return QUARN_CANCELLED;
+  *made = std::move(job->archive);
+  return job->result;
 }
 
 /** Everything between an earlier export's removal and the answer. */
@@ -93,10 +101,11 @@ int export_package(const std::string &pkg_id, const std::string &root, const std
   const StagingDir staging;
   if (staging.path().empty()) return QUARN_UNREADABLE;
   const std::string archive = staging.path() + kStagedName;
-  const int result = pack(pkg_id, root, archive);
+  UniqueFd made;
+  const int result = pack(pkg_id, root, archive, &made);
   // one that lacks a file is told to be such, and is the client's as well
-  const bool made = result == QUARN_OK || (result == QUARN_REFUSED && file_exist(archive.c_str()));
-  if (made && !hand_over(archive, target, client_uid)) {
+  const bool whole = result == QUARN_OK || result == QUARN_REFUSED;
+  if (made && whole && !hand_over(made.get(), archive, target, client_uid)) {
     LOGE("fail to hand over %s : %d", target.c_str(), errno);
     return QUARN_UNREADABLE;
   }

@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/file_crc.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
@@ -297,20 +298,25 @@ bool read_data_from_file(const char *path, char **buffer) {
 }
 
 std::uint32_t get_file_crc(const char *path) {
-  const Buffer buffer = make_buffer(kChecksumChunk);
-  if (buffer == nullptr) {
-    LOGE("calloc() failed, buf is NULL");
-    return 0;
-  }
   struct stat status = {};
   const UniqueFd fd = open_regular(path, &status);
   if (!fd) {
     LOGE("fopen() failed, file is NULL");
     return 0;
   }
+  return get_open_file_crc(fd.get());
+}
+
+std::uint32_t get_open_file_crc(int fd) {
+  const Buffer buffer = make_buffer(kChecksumChunk);
+  if (buffer == nullptr) {
+    LOGE("calloc() failed, buf is NULL");
+    return 0;
+  }
   std::uint32_t crc = 0;
+  if (lseek(fd, 0, SEEK_SET) != 0) return crc;
   for (;;) {
-    const ssize_t count = read_some(fd.get(), buffer.get(), kChecksumChunk);
+    const ssize_t count = read_some(fd, buffer.get(), kChecksumChunk);
     if (count < 1) return crc;
     crc = codec_crc32(crc, buffer.get(), static_cast<std::size_t>(count));
   }

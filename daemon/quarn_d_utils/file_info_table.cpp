@@ -5,6 +5,7 @@
 #include <new>
 
 #include "platform_smack.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_text.h"
@@ -22,7 +23,6 @@ constexpr char kLabelKey[] = "3";
 
 constexpr mode_t kPermissionBits = 07777;
 constexpr std::size_t kTargetBuffer = 1024;
-constexpr int kNotOpen = -1;
 
 void add_constant(json_object *object, const char *key, json_object *value) {
   json_object_object_add_ex(object, key, value,
@@ -61,19 +61,38 @@ json_object *attribute_object(file_info_table_h *table, int permission, unsigned
   return json_object_get(shared.get());
 }
 
-/** The same for one entry, whatever of it can be read. */
+/** The label of an object, which may be one that only root may read. */
+int read_label(const char *object, bool is_link, char **label) {
+  const auto read = is_link ? smack_lgetlabel : smack_getlabel;
+  errno = 0;
+  const int result = read(object, label, SMACK_LABEL_ACCESS);
+  if (result == 0 || errno != EACCES) return result;
+  const ActAsRoot root;
+  return read(object, label, SMACK_LABEL_ACCESS);
+}
+
+/** The same for one entry, whatever of it can be read. @param object what its label is read of */
 json_object *attributes_of(file_info_table_h *table, const char *path, const struct stat &stat,
-                           int fd, int *error, bool *complete) {
-  int permission = 0;
-  unsigned int uid = 0;
-  unsigned int gid = 0;
+                           const char *object, int *error, bool *complete) {
   CString label;
-  *complete = get_file_info_from_file(path, stat, &permission, &uid, &gid, out(label), fd);
+  const int permission = static_cast<int>(stat.st_mode & kPermissionBits);
+  const unsigned int uid = stat.st_uid;
+  const unsigned int gid = stat.st_gid;
+  const int result = read_label(object, S_ISLNK(stat.st_mode), out(label));
+  *complete = result == 0;
+  if (result != 0) LOGE("error : cannot get smack label of %s (err=%d)", path, result);
   if (label == nullptr) {
     LOGE("error : cannot get smack label of %s", path);
     *error = QUARN_REFUSED;
   }
   return attribute_object(table, permission, uid, gid, label == nullptr ? "" : label.get());
+}
+
+UniqueFd open_link(int dir, const char *name) {
+  UniqueFd link(openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (link || errno != EACCES) return link;
+  const ActAsRoot root;
+  return UniqueFd(openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
 }
 
 /** Bytes of a text in the document, its quotes included. */
@@ -136,8 +155,7 @@ bool get_file_info_from_file(const char *path, const struct stat &stat, int *per
   *label = nullptr;
   const std::string opened = fd < 0 ? std::string() : own_fd_path(fd);
   const char *object = fd < 0 ? path : opened.c_str();
-  const int result = S_ISLNK(stat.st_mode) ? smack_lgetlabel(path, label, SMACK_LABEL_ACCESS)
-                                           : smack_getlabel(object, label, SMACK_LABEL_ACCESS);
+  const int result = read_label(object, S_ISLNK(stat.st_mode), label);
   if (result != 0) {
     LOGE("error : cannot get smack label of %s (err=%d)", path, result);
     return false;
@@ -148,7 +166,9 @@ bool get_file_info_from_file(const char *path, const struct stat &stat, int *per
 void add_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
                             const struct stat &stat, int *error, int fd) {
   bool complete = false;
-  json_object *attributes = attributes_of(table, path, stat, fd, error, &complete);
+  const std::string opened = fd < 0 ? std::string() : own_fd_path(fd);
+  json_object *attributes =
+      attributes_of(table, path, stat, fd < 0 ? path : opened.c_str(), error, &complete);
   if (!complete) *error = QUARN_REFUSED;
   const char *name = relative_name(root, path);
   json_object_object_add(table->root, name, attributes);
@@ -156,9 +176,10 @@ void add_to_file_info_table(file_info_table_h *table, const char *root, const ch
 }
 
 void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
-                                     const struct stat &stat, int *error) {
+                                     const struct stat &stat, int *error, int dir) {
   char target[kTargetBuffer] = {};
-  const UniqueFd link = safe_open(path, O_PATH);
+  const char *last = std::strrchr(path, '/') + 1;
+  const UniqueFd link = dir < 0 ? safe_open(path, O_PATH) : open_link(dir, last);
   const ssize_t length = link ? readlinkat(link.get(), "", target, sizeof(target)) : -1;
   if (length < 0) {
     LOGE("error : cannot read symbolic info of %s", path);
@@ -172,7 +193,8 @@ void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root,
   }
   LOGI("%s -> %s", path, target);
   bool complete = false;
-  json_object *attributes = attributes_of(table, path, stat, kNotOpen, error, &complete);
+  const std::string object = dir < 0 ? path : own_fd_path(dir) + "/" + last;
+  json_object *attributes = attributes_of(table, path, stat, object.c_str(), error, &complete);
   json_object *entry = json_object_new_object();
   const char *name = relative_name(root, path);
   add_constant(entry, kRealNameKey, json_object_new_string(name));

@@ -9,6 +9,7 @@
 
 #include "lazy_xml.h"
 #include "quarn_d_utils/log_budget.h"
+#include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_file.h"
 #include "quarn_d_utils/safe_path.h"
@@ -170,6 +171,14 @@ struct Walk {
   LogBudget failures;
 };
 
+/** What lies there, whoever may enter the directory. */
+int look_at(int dir, const char *name, struct stat *status) {
+  const int found = fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+  if (found == 0 || errno != EACCES) return found;
+  const ActAsRoot root;
+  return fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+}
+
 std::uint64_t measure(DirPtr dir, Walk *walk, std::string *path, int depth) {
   std::uint64_t sum = 0;
   while (const dirent *entry = readdir(dir.get())) {
@@ -177,12 +186,14 @@ std::uint64_t measure(DirPtr dir, Walk *walk, std::string *path, int depth) {
     const PathStep step(path, entry->d_name);
     if (walk->working.contain(*path)) continue;
     struct stat status = {};
-    const int result = fstatat(dirfd(dir.get()), entry->d_name, &status, AT_SYMLINK_NOFOLLOW);
+    const int result = look_at(dirfd(dir.get()), entry->d_name, &status);
     if (result != 0) {
       if (walk->failures.take()) LOGE("error : lstat for %d %s", result, path->c_str());
     } else if (S_ISDIR(status.st_mode)) {
       DirPtr child;
-      if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), entry->d_name);
+      if (depth < kMaxDirDepth) {
+        child = open_directory_as_package(dirfd(dir.get()), entry->d_name, user_of_package());
+      }
       if (child == nullptr) {
         if (walk->failures.take()) LOGE("error : cannot open this path %s", path->c_str());
         sum += kUnmeasurableSize;
@@ -303,5 +314,6 @@ std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, cons
   }
   Walk walk{WorkingFiles(pkg_id, root), LogBudget(dir_path), LogBudget(dir_path)};
   std::string path = dir_path;
-  return measure(std::move(dir), &walk, &path, 1);
+  const ActAsPackage acting;
+  return acting ? measure(std::move(dir), &walk, &path, 1) : kUnmeasurableSize;
 }

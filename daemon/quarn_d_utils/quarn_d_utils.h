@@ -96,9 +96,13 @@ bool get_file_info_from_file(const char *path, const struct stat &stat, int *per
  */
 void add_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
                             const struct stat &stat, int *error, int fd = -1);
-/** Add a symbolic link. *@p error becomes 36 on failure, else stays. */
+/**
+ * Add a symbolic link. *@p error becomes 36 on failure, else stays.
+ * @param dir the directory that the link is in, borrowed, when it is open: the link is then found
+ *            without another walk along the path; else negative
+ */
 void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
-                                     const struct stat &stat, int *error);
+                                     const struct stat &stat, int *error, int dir = -1);
 /** Write the table's JSON text and release its root. @return as write_string_to_file() */
 int save_file_info_table(file_info_table_h *table, const char *path);
 

@@ -4,13 +4,16 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstring>
+#include <map>
 #include <mutex>
-#include <set>
+#include <optional>
 #include <string_view>
 #include <vector>
 
 #include "backup_transport.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
@@ -24,9 +27,29 @@ constexpr std::string_view kPartPrefix = BACKUP_TRANS_TEMPORARY_PREFIX;
 /** Added to the snapshot's name when the application has that name. */
 constexpr char kBeside[] = ".snapshot";
 
+/** What tells a file from every other: none that nobody else may write keeps these and differs. */
+struct FileMark {
+  dev_t device = 0;
+  ino_t inode = 0;
+  off_t size = 0;
+  timespec changed = {};
+
+  FileMark() = default;
+  explicit FileMark(const struct stat &status)
+      : device(status.st_dev),
+        inode(status.st_ino),
+        size(status.st_size),
+        changed(status.st_mtim) {}
+  bool operator==(const FileMark &other) const {
+    return device == other.device && inode == other.inode && size == other.size &&
+           changed.tv_sec == other.changed.tv_sec && changed.tv_nsec == other.changed.tv_nsec;
+  }
+};
+
 std::mutex claimed_mutex;
-std::set<std::string> &claimed() {
-  static auto *paths = new std::set<std::string>;
+/** Paths that are this process's own, and what was made there. */
+std::map<std::string, std::optional<FileMark>> &claimed() {
+  static auto *paths = new std::map<std::string, std::optional<FileMark>>;
   return *paths;
 }
 
@@ -74,9 +97,10 @@ bool is_own_leftover(const char *name, const struct stat &status) {
 bool is_own_leftover(const std::string &path) {
   const std::size_t slash = path.rfind('/');
   const char *name = path.c_str() + (slash == std::string::npos ? 0 : slash + 1);
+  if (!is_part_name(name)) return false;
+  const ActAsRoot root;  // who walks may not enter every directory above
   struct stat status = {};
-  return is_part_name(name) && safe_lstat(path.c_str(), &status) == 0 &&
-         is_own_leftover(name, status);
+  return safe_lstat(path.c_str(), &status) == 0 && is_own_leftover(name, status);
 }
 
 std::string WorkingFiles::download_place() const {
@@ -94,7 +118,26 @@ std::string WorkingFiles::snapshot_place() const {
 
 void claim_working_file(const std::string &path) {
   const std::lock_guard<std::mutex> lock(claimed_mutex);
-  claimed().insert(path);
+  claimed()[path].reset();
+}
+
+void note_working_file(const std::string &path, int fd) {
+  struct stat status = {};
+  if (fstat(fd, &status) != 0) return;
+  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  claimed()[path] = FileMark(status);
+}
+
+UniqueFd open_working_file(const std::string &path) {
+  UniqueFd file = safe_open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY);
+  struct stat status = {};
+  if (!file || fstat(file.get(), &status) != 0) return {};
+  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  const auto known = claimed().find(path);
+  const bool noted = known != claimed().end() && known->second;
+  if (is_own_single_file(status) && (!noted || *known->second == FileMark(status))) return file;
+  errno = ESTALE;
+  return {};
 }
 
 void sweep_working_files(const std::string &pkg_id, const std::string &root) {

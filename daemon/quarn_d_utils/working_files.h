@@ -15,6 +15,8 @@
 
 #include <string>
 
+#include "quarn_d_utils/handles.h"
+
 /**
  * True for what this daemon, or an earlier one, made: an application may give a file of its own any
  * name, but cannot give it away.
@@ -84,6 +86,18 @@ class WorkingFiles {
 
 /** From now on @p path is this process's own: its sweep leaves it alone. */
 void claim_working_file(const std::string &path);
+
+/** Remember what @p fd, which was made at @p path, is by now: it is complete. */
+void note_working_file(const std::string &path, int fd);
+
+/**
+ * Open the daemon's own file at @p path for reading. The directory is an
+ * application's, who may put anything else there: only a regular file is
+ * opened that is this process's user's, with no other name, and that is the one
+ * which was noted last, if one was.
+ * @return none with errno, ESTALE for something else
+ */
+UniqueFd open_working_file(const std::string &path);
 
 /**
  * Remove what an ended process has left of a package: archives in transit, a

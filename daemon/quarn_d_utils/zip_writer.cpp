@@ -7,11 +7,14 @@
 
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/package_directory.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/rules_state.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
+#include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
 namespace {
@@ -32,11 +35,12 @@ constexpr uLong kMadeByDefault = 0;
  */
 class ArchiveFile {
  public:
-  explicit ArchiveFile(UniqueFd fd) : fd_(std::move(fd)) {}
+  /** @param fd borrowed; negative for none */
+  explicit ArchiveFile(int fd) : fd_(fd) {}
   ArchiveFile(const ArchiveFile &) = delete;
   ArchiveFile &operator=(const ArchiveFile &) = delete;
 
-  bool is_open() const { return static_cast<bool>(fd_); }
+  bool is_open() const { return fd_ >= 0; }
 
   /** One more entry was written. */
   void count_entry() { ++entries_; }
@@ -122,7 +126,8 @@ class ArchiveFile {
 
   bool finish() {
     const bool written = flush() && (entries_ < kNotInEnd || add_zip64_end());
-    return close(fd_.release()) == 0 && written;
+    // some file systems tell only here that there was no room
+    return close(fcntl(fd_, F_DUPFD_CLOEXEC, 0)) == 0 && written;
   }
 
   /**
@@ -133,8 +138,7 @@ class ArchiveFile {
     char end[kEndSize];
     if (start_ < sizeof end) return false;
     const ZPOS64_T at = start_ - sizeof end;
-    const ssize_t count =
-        TEMP_FAILURE_RETRY(pread(fd_.get(), end, sizeof end, static_cast<off_t>(at)));
+    const ssize_t count = TEMP_FAILURE_RETRY(pread(fd_, end, sizeof end, static_cast<off_t>(at)));
     if (count != static_cast<ssize_t>(sizeof end)) return false;
     const std::uint64_t directory_size = number(end + kEndDirectorySize);
     const std::uint64_t directory = number(end + kEndDirectory);
@@ -167,9 +171,10 @@ class ArchiveFile {
   }
 
   bool write_at(const char *data, std::size_t size, ZPOS64_T offset) {
+    // the archive is the daemon's own, and so is the room that it takes
+    const ActAsRoot root;
     while (size > 0) {
-      const ssize_t count =
-          TEMP_FAILURE_RETRY(pwrite(fd_.get(), data, size, static_cast<off_t>(offset)));
+      const ssize_t count = TEMP_FAILURE_RETRY(pwrite(fd_, data, size, static_cast<off_t>(offset)));
       if (count <= 0) {
         failed_ = true;
         return false;
@@ -181,7 +186,7 @@ class ArchiveFile {
     return true;
   }
 
-  UniqueFd fd_;
+  const int fd_;
   const std::unique_ptr<char[]> buffer_{new char[kBuffer]};  // the file's bytes from start_ on
   std::size_t filled_ = 0;
   ZPOS64_T start_ = 0;     // bytes before it are in the file
@@ -381,6 +386,7 @@ struct Walk {
   zipFile zip;
   file_info_table_h *table;
   int *error;
+  const package_user user = user_of_package();
 };
 
 bool walk_dir(Walk *walk, DIR *dir, std::string *path, int depth);
@@ -405,19 +411,44 @@ void admit_in_table(Walk *walk, const std::string &path) {
   *walk->error = QUARN_REFUSED;
 }
 
+/** What lies there, whoever may enter the directory. */
+int look_at(int parent, const char *name, struct stat *status) {
+  const int found = fstatat(parent, name, status, AT_SYMLINK_NOFOLLOW);
+  if (found == 0 || errno != EACCES) return found;
+  const ActAsRoot root;
+  return fstatat(parent, name, status, AT_SYMLINK_NOFOLLOW);
+}
+
+/** Open a regular file with the rights of the application, as safe_open_file_at() does. */
+UniqueFd open_file(const Walk &walk, int parent, const char *name, struct stat *status) {
+  constexpr int kFlags = O_RDONLY | O_NONBLOCK | O_NOCTTY;
+  UniqueFd fd = open_as_package(parent, name, kFlags | O_NOATIME, 0, walk.user, status);
+  if (!fd && errno == EPERM) fd = open_as_package(parent, name, kFlags, 0, walk.user, status);
+  if (!fd || !S_ISREG(status->st_mode)) return {};
+  return fd;
+}
+
+/** Walk a directory below another, and record it behind what it holds. */
 bool walk_subdir(Walk *walk, int parent, const char *name, std::string *path, int depth) {
   if (depth >= kMaxDirDepth && packing != nullptr && packing->refuses_depth(depth + 1)) {
     LOGE("archive is full at %s", path->c_str());
     *walk->error = QUARN_REFUSED;
     return false;
   }
-  const DirPtr dir = depth < kMaxDirDepth ? safe_opendir_at(parent, name) : nullptr;
+  struct stat status {};
+  const DirPtr dir =
+      depth < kMaxDirDepth ? open_directory_as_package(parent, name, walk->user, &status) : nullptr;
   if (dir == nullptr) {
     LOGE("error : cannot open this path %s", path->c_str());
     *walk->error = QUARN_REFUSED;
     return false;
   }
-  return walk_dir(walk, dir.get(), path, depth);
+  if (!walk_dir(walk, dir.get(), path, depth)) return false;
+  if (packing_ended() || !admit(walk, *path, 0)) return true;
+  add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error,
+                         dirfd(dir.get()));
+  admit_in_table(walk, *path);
+  return true;
 }
 
 /** Record a file and pack it, when it could be opened. */
@@ -447,7 +478,7 @@ bool walk_regular(Walk *walk, int parent, const char *name, const std::string &p
   *noted = is_backup_file(path.c_str());
   if (!*noted) return true;
   struct stat status {};
-  const UniqueFd fd = safe_open_file_at(parent, name, &status);
+  const UniqueFd fd = open_file(*walk, parent, name, &status);
   if (fd) add_regular(walk, path, fd, status);
   return static_cast<bool>(fd);
 }
@@ -457,30 +488,31 @@ bool walk_entry(Walk *walk, int parent, const dirent &entry, std::string *path, 
   bool noted = false;
   if (entry.d_type == DT_REG && walk_regular(walk, parent, name, *path, &noted)) return noted;
   struct stat status {};
-  const int found = fstatat(parent, name, &status, AT_SYMLINK_NOFOLLOW);
+  const int found = look_at(parent, name, &status);
   if (found != 0) {
     LOGE("error : lstat for %d %s", found, path->c_str());
     *walk->error = QUARN_REFUSED;
     return false;
   }
-  if (S_ISDIR(status.st_mode)) {
-    if (!walk_subdir(walk, parent, name, path, depth + 1)) return false;
-    if (packing_ended() || !admit(walk, *path, 0)) return true;
-    add_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status, walk->error);
-    admit_in_table(walk, *path);
-    return true;
-  }
+  if (S_ISDIR(status.st_mode)) return walk_subdir(walk, parent, name, path, depth + 1);
   if (S_ISREG(status.st_mode)) {
     if (!is_backup_file(path->c_str())) return false;
     struct stat opened {};
-    const UniqueFd fd = safe_open_file_at(parent, name, &opened);
+    const UniqueFd fd = open_file(*walk, parent, name, &opened);
+    if (!fd && errno == EACCES && status.st_uid != kAppUid && status.st_nlink == 1) {
+      // its other name may be gone, and it then looks like any file
+      LOGE("refused : %s is another owner's file, and its application may not read it",
+           path->c_str());
+      *walk->error = QUARN_REFUSED;
+      return true;
+    }
     add_regular(walk, *path, fd, fd ? opened : status);
     return true;
   }
   if (S_ISLNK(status.st_mode)) {
     if (!is_backup_file(path->c_str()) || !admit(walk, *path, 0)) return false;
     add_sym_info_to_file_info_table(walk->table, walk->root.c_str(), path->c_str(), status,
-                                    walk->error);
+                                    walk->error, parent);
     admit_in_table(walk, *path);
     return true;
   }
@@ -600,50 +632,87 @@ void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table
   insert_file_info_table_to_zip(table, zip, pkg_id, root, error);
 }
 
-}  // namespace
+/** What an archive is to be like, and what came of it. */
+struct PackRequest {
+  const char *pkg_id;
+  const char *root;
+  const char *zip_path; /**< empty for an archive without a name */
+  int *error;
+  const archive_bounds &bounds;
+  archive_excess *excess;
+  const std::atomic<bool> *stop;
+};
 
-void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
-                   const archive_bounds &bounds, archive_excess *excess,
-                   const std::atomic<bool> *stop) {
-  const PackageDataLock lock(pkg_id, PackageUse::kPack);
-  if (!may_be_packed(pkg_id, root)) {
-    *error = QUARN_REFUSED;
-    return;
-  }
-  const PackageRoot package(root);
-  package.create_directory_of(zip_path);
-  file_info_table_h *made = nullptr;
-  ready_file_info_table(&made);
-  const std::unique_ptr<file_info_table_h, ReleaseTable> table(made);
-  if (table == nullptr) {
-    LOGE("file_info_table is NULL");
-    *error = QUARN_REFUSED;
-    return;
-  }
-  ArchiveFile file(create_archive(zip_path));
-  zlib_filefunc64_def functions = file.functions();
-  zipFile zip =
-      file.is_open() ? zipOpen2_64(zip_path, APPEND_STATUS_CREATE, nullptr, &functions) : nullptr;
-  if (zip == nullptr) {
-    LOGE("zipOpen() failed, zf is NULL");
-    *error = QUARN_UNREADABLE;
-    return;
-  }
-  Packing current(&file, zip_path, bounds, stop);
+/** Pack into the open archive, whose library handle is @p zip. */
+void pack_into(const PackRequest &request, const PackageRoot &package, file_info_table_h *table,
+               ArchiveFile *file, zipFile zip) {
+  Packing current(file, request.zip_path, request.bounds, request.stop);
   packing = &current;
-  pack_all(pkg_id, root, zip, table.get(), error);
+  pack_all(request.pkg_id, request.root, zip, table, request.error);
   if (package.has_gone(current.data_dirs)) {
-    LOGE("(%s) was removed while it was packed", pkg_id);
-    *error = QUARN_REFUSED;
+    LOGE("(%s) was removed while it was packed", request.pkg_id);
+    *request.error = QUARN_REFUSED;
   }
   const int closed = zipClose(zip, nullptr);
   packing = nullptr;
   archive_codec.reset();
   if (closed != ZIP_OK) {
     LOGE("zipClose() failed, zip_err = [%d]", closed);
-    *error = QUARN_REFUSED;
+    *request.error = QUARN_REFUSED;
   }
-  if (excess != nullptr) *excess = current.excess();
+  if (request.excess != nullptr) *request.excess = current.excess();
+}
+
+/** @param archive where it is packed into; made at its name if it is none */
+void pack_package(const PackRequest &request, UniqueFd *archive) {
+  const PackageDataLock lock(request.pkg_id, PackageUse::kPack);
+  if (!may_be_packed(request.pkg_id, request.root)) {
+    *request.error = QUARN_REFUSED;
+    return;
+  }
+  const PackageRoot package(request.root);
+  if (!*archive) package.create_directory_of(request.zip_path);
+  file_info_table_h *made = nullptr;
+  ready_file_info_table(&made);
+  const std::unique_ptr<file_info_table_h, ReleaseTable> table(made);
+  if (table == nullptr) {
+    LOGE("file_info_table is NULL");
+    *request.error = QUARN_REFUSED;
+    return;
+  }
+  if (!*archive) *archive = create_archive(request.zip_path);
+  ArchiveFile file(archive->get());
+  zlib_filefunc64_def functions = file.functions();
+  zipFile zip = file.is_open()
+                    ? zipOpen2_64(request.zip_path, APPEND_STATUS_CREATE, nullptr, &functions)
+                    : nullptr;
+  if (zip == nullptr) {
+    LOGE("zipOpen() failed, zf is NULL");
+    *request.error = QUARN_UNREADABLE;
+    return;
+  }
+  pack_into(request, package, table.get(), &file, zip);
+}
+
+}  // namespace
+
+UniqueFd make_archive(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                      const archive_bounds &bounds, archive_excess *excess,
+                      const std::atomic<bool> *stop) {
+  UniqueFd archive;
+  pack_package({pkg_id, root, zip_path, error, bounds, excess, stop}, &archive);
+  return archive;
+}
+
+void fill_archive(const char *pkg_id, const char *root, UniqueFd *archive, int *error,
+                  const archive_bounds &bounds, archive_excess *excess) {
+  pack_package({pkg_id, root, "", error, bounds, excess, nullptr}, archive);
+}
+
+void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
+                   const archive_bounds &bounds, archive_excess *excess,
+                   const std::atomic<bool> *stop) {
+  make_archive(pkg_id, root, zip_path, error, bounds, excess, stop);
 }
 
 bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
@@ -659,13 +728,23 @@ bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, co
     packing->data_dirs.emplace_back(fcntl(dirfd(opened.get()), F_DUPFD_CLOEXEC, 0));
   }
   std::string path = dir;
+  const ActAsPackage acting(walk.user);
+  if (!acting) {
+    LOGE("cannot act as user %u : %d", walk.user.uid, errno);
+    *error = QUARN_REFUSED;
+    return false;
+  }
   return walk_dir(&walk, opened.get(), &path, 0);
 }
 
 bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error) {
-  const UniqueFd fd = safe_open(file, O_RDONLY | O_NONBLOCK);
   struct stat status {};
-  if (!fd || fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) {
+  std::string name;
+  const UniqueFd parent = safe_open_parent(file, &name);
+  const UniqueFd fd = parent ? open_as_package(parent.get(), name.c_str(), O_RDONLY | O_NONBLOCK, 0,
+                                               user_of_package(), &status)
+                             : UniqueFd();
+  if (!fd || !S_ISREG(status.st_mode)) {
     LOGE("fopen() failed, file is NULL");
     *error = QUARN_REFUSED;
     return false;

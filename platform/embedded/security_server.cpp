@@ -34,13 +34,30 @@ constexpr char kProc[] = "/proc/";
 
 std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
-bool relabel_folder(int fd, const std::string &label);
+/** What a transaction gives its label to. */
+struct Given {
+  const std::string &label;
+  uid_t owner; /**< of the folder that was named */
+};
 
-/** Label an entry, which may have vanished meanwhile; a link itself, not its target. */
-bool relabel_leaf(int dir, const char *name, bool is_file, const std::string &label) {
-  if (embedded::write_label_at(dir, name, label) == 0 || errno == ENOENT) return true;
+bool relabel_folder(int fd, const struct stat &folder, const Given &given);
+
+/**
+ * True for what is no second name of somebody else's file: it belongs to the owner of what was
+ * given, or that owner cannot have put it where it lies.
+ */
+bool is_given(const struct stat &status, const struct stat &folder, const Given &given) {
+  if (status.st_uid == given.owner) return true;
+  return status.st_nlink == 1 && folder.st_uid != given.owner &&
+         (folder.st_mode & (S_IWGRP | S_IWOTH)) == 0;
+}
+
+/** Label what is held as @p fd: a link itself, not its target. */
+bool relabel_leaf(int fd, const struct stat &status, const std::string &label) {
+  if (embedded::write_label(name_of(fd).c_str(), Links::kFollow, LabelKind::kAccess, label) == 0)
+    return true;
   // Where labels are user attributes, links and special files cannot have one.
-  return !is_file && errno == EPERM;
+  return !S_ISREG(status.st_mode) && errno == EPERM;
 }
 
 /** What only root may enter is not the application's: a service keeps its own things there. */
@@ -48,18 +65,16 @@ bool is_roots_own(const struct stat &folder) {
   return folder.st_uid == 0 && (folder.st_mode & (S_IRWXG | S_IRWXO)) == 0;
 }
 
-/** One entry of the folder that is open as @p dir; the type that a folder tells saves calls. */
-bool relabel_entry(int dir, const dirent &entry, const std::string &label) {
-  if (entry.d_type != DT_DIR && entry.d_type != DT_UNKNOWN)
-    return relabel_leaf(dir, entry.d_name, entry.d_type == DT_REG, label);
-  const int fd = openat(dir, entry.d_name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+/** One entry of the folder that is open as @p dir: what was looked at is what is labelled. */
+bool relabel_entry(int dir, const struct stat &folder, const char *name, const Given &given) {
+  const int fd = openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
   if (fd < 0) return errno == ENOENT;
   struct stat status {};
   bool done = fstat(fd, &status) == 0;
-  if (done && !S_ISDIR(status.st_mode)) {
-    done = relabel_leaf(dir, entry.d_name, S_ISREG(status.st_mode), label);
-  } else if (done && !is_roots_own(status)) {
-    done = relabel_folder(fd, label);
+  if (done && S_ISDIR(status.st_mode)) {
+    if (!is_roots_own(status)) done = relabel_folder(fd, status, given);
+  } else if (done && is_given(status, folder, given)) {
+    done = relabel_leaf(fd, status, given.label);
   }
   close(fd);
   return done;
@@ -69,9 +84,8 @@ bool relabel_entry(int dir, const dirent &entry, const std::string &label) {
  * Label the folder @p fd (an O_PATH descriptor) and everything below it. Folders are held while
  * their entries are labelled, so a link swapped in leads nowhere.
  */
-bool relabel_folder(int fd, const std::string &label) {
-  if (embedded::write_label(name_of(fd).c_str(), Links::kFollow, LabelKind::kAccess, label) != 0)
-    return false;
+bool relabel_folder(int fd, const struct stat &folder, const Given &given) {
+  if (!relabel_leaf(fd, folder, given.label)) return false;
   const int opened = openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   DIR *dir = opened < 0 ? nullptr : fdopendir(opened);
   if (dir == nullptr) {
@@ -82,15 +96,15 @@ bool relabel_folder(int fd, const std::string &label) {
   while (const dirent *entry = readdir(dir)) {
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
-    done = relabel_entry(opened, *entry, label) && done;
+    done = relabel_entry(opened, folder, entry->d_name, given) && done;
   }
   closedir(dir);
   return done;
 }
 
-int open_without_links(int base, const char *path) {
+int open_without_links(int base, const char *path, std::uint64_t more_flags = O_DIRECTORY) {
   open_how how{};
-  how.flags = O_PATH | O_DIRECTORY | O_CLOEXEC;
+  how.flags = O_PATH | O_CLOEXEC | more_flags;
   how.resolve = RESOLVE_NO_SYMLINKS;
   return static_cast<int>(syscall(SYS_openat2, base, path, &how, sizeof how));
 }
@@ -116,7 +130,23 @@ int open_folder(const std::string &path) {
 bool relabel(const std::string &path, const std::string &label) {
   const int fd = open_folder(path);
   if (fd < 0) return false;
-  const bool done = relabel_folder(fd, label);
+  struct stat folder {};
+  const bool done =
+      fstat(fd, &folder) == 0 && relabel_folder(fd, folder, Given{label, folder.st_uid});
+  close(fd);
+  return done;
+}
+
+/** One object, which a name that is not a descriptor's must lead to by no link of either kind. */
+bool label_one(const char *path, const std::string &label) {
+  if (starts_with(path, kProc))
+    return embedded::write_label(path, Links::kFollow, LabelKind::kAccess, label) == 0;
+  const int fd = open_without_links(AT_FDCWD, path, O_NOFOLLOW);
+  if (fd < 0) return false;
+  struct stat status {};
+  const bool alone = fstat(fd, &status) == 0 && (S_ISDIR(status.st_mode) || status.st_nlink == 1);
+  const bool done = alone && embedded::write_label(name_of(fd).c_str(), Links::kFollow,
+                                                   LabelKind::kAccess, label) == 0;
   close(fd);
   return done;
 }
@@ -126,9 +156,7 @@ bool relabel(const std::string &path, const std::string &label) {
 int security_server_label_access(const char *path, const char *label) {
   RETURN_FAULT();
   if (path == nullptr || label == nullptr) return SECURITY_SERVER_ERROR_INPUT_PARAM;
-  return embedded::write_label(path, Links::kFollow, LabelKind::kAccess, label) == 0
-             ? SECURITY_SERVER_SUCCESS
-             : SECURITY_SERVER_ERROR_SERVER;
+  return label_one(path, label) ? SECURITY_SERVER_SUCCESS : SECURITY_SERVER_ERROR_SERVER;
 }
 
 int security_server_perm_begin(security_server_perm_h *handle) {

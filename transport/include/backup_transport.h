@@ -221,7 +221,11 @@ int backup_trans_download_file_ors(backup_trans_handle_h handle, const char *rem
  *
  * The file is opened before the call returns: replacing or deleting the path
  * later does not change what is sent. It must be a regular file; a symbolic
- * link is refused with #BACKUP_TRANS_ERROR_LOCAL_FILE.
+ * link is refused with #BACKUP_TRANS_ERROR_LOCAL_FILE. The one exception is
+ * "/proc/self/fd/N", the name of a descriptor that the caller holds until the
+ * call has returned: by it the caller sends the file that it has looked at,
+ * whatever lies under the file's own name by then. Opening that path is all
+ * that it takes.
  *
  * @param timestamp_ms the object's time, milliseconds since the Unix epoch
  * @param options      #BACKUP_TRANS_OPTION_NONE

@@ -83,6 +83,14 @@ UniqueFd open_folder(const std::string &path) {
   return walk_folder(path);
 }
 
+/** The name of what the caller holds: the one link to follow, for nobody can put it elsewhere. */
+bool is_own_descriptor(const std::string &path) {
+  constexpr char kDescriptors[] = "/proc/self/fd/";
+  constexpr std::size_t kStart = sizeof kDescriptors - 1;
+  return path.size() > kStart && path.compare(0, kStart, kDescriptors) == 0 &&
+         path.find_first_not_of("0123456789", kStart) == std::string::npos;
+}
+
 }  // namespace
 
 UniqueFd open_local_parent(const std::string &path, std::string *name) {
@@ -96,12 +104,16 @@ UniqueFd open_local_parent(const std::string &path, std::string *name) {
 }
 
 bool LocalSource::open(const std::string &path) {
-  std::string name;
-  const UniqueFd folder = open_local_parent(path, &name);
-  if (!folder) return false;
   // A pipe would block the caller without O_NONBLOCK.
-  fd_.reset(openat(folder.get(), name.c_str(),
-                   O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  constexpr int kFlags = O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+  if (is_own_descriptor(path)) {
+    fd_.reset(::open(path.c_str(), kFlags));
+  } else {
+    std::string name;
+    const UniqueFd folder = open_local_parent(path, &name);
+    if (!folder) return false;
+    fd_.reset(openat(folder.get(), name.c_str(), kFlags | O_NOFOLLOW));
+  }
   struct stat status {};
   if (!fd_ || fstat(fd_.get(), &status) != 0) return false;
   if (!S_ISREG(status.st_mode)) {

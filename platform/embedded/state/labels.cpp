@@ -3,14 +3,12 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
-#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 
@@ -21,19 +19,6 @@ namespace embedded {
 namespace {
 
 constexpr char kOwnDescriptors[] = "/proc/self/fd/";
-
-#ifdef SYS_setxattrat
-constexpr long kSetxattrat = SYS_setxattrat;
-#else
-constexpr long kSetxattrat = 463;  // of Linux 6.13, on every architecture; newer than some headers
-#endif
-
-/** setxattrat()'s struct xattr_args. */
-struct XattrArguments {
-  alignas(8) std::uint64_t value;
-  std::uint32_t size;
-  std::uint32_t flags;
-};
 
 struct Attribute {
   const char *kernel;
@@ -211,20 +196,6 @@ int write_label(const char *path, Links links, LabelKind kind, const std::string
   // What cannot have the attribute has the floor label, and may be given that one.
   if (errno == EPERM && kind == LabelKind::kAccess && label == kFloorLabel) return 0;
   return -1;
-}
-
-int write_label_at(int dir, const char *name, const std::string &label) {
-  if (is_label(label)) {
-    const XattrArguments arguments = {reinterpret_cast<std::uintptr_t>(label.data()),
-                                      static_cast<std::uint32_t>(label.size()), 0};
-    const char *attribute = attribute_of(LabelKind::kAccess).kernel;
-    if (syscall(kSetxattrat, dir, name, AT_SYMLINK_NOFOLLOW, attribute, &arguments,
-                sizeof arguments) == 0) {
-      return 0;
-    }
-  }
-  const std::string path = kOwnDescriptors + std::to_string(dir) + "/" + name;
-  return write_label(path.c_str(), Links::kKeep, LabelKind::kAccess, label);
 }
 
 }  // namespace embedded

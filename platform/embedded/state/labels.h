@@ -35,12 +35,6 @@ bool is_label(const std::string &label);
 /** Read a label. @return 0, or -1 with errno (ENODATA: no label of a kind that has no floor) */
 int read_label(const char *path, Links links, LabelKind kind, std::string *label);
 
-/**
- * Write the access label of the entry @p name of the open folder @p dir, of a link itself.
- * @return 0, or -1 with errno
- */
-int write_label_at(int dir, const char *name, const std::string &label);
-
 /** Write a label. @return 0, or -1 with errno */
 int write_label(const char *path, Links links, LabelKind kind, const std::string &label);
 

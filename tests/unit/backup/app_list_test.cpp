@@ -1,10 +1,14 @@
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <csignal>
 #include <filesystem>
 #include <random>
+#include <thread>
 
 #include "backup_device.h"
 #include "quarn_d_backup/model_entries.h"
@@ -359,22 +363,110 @@ TEST_F(AppListDocument, OpenStagingDirectoryOfOursIsClosed) {
   EXPECT_EQ(status.st_mode & 07777, 0700U);
 }
 
-TEST_F(AppListDocument, StagingDirectoryThatIsALinkIsRefused) {
-  std::filesystem::create_directory(path("elsewhere"));
-  std::filesystem::create_symlink(path("elsewhere"), "/tmp/quarn");
+/** What may lie where the staging directory is to be. */
+class StagingSquat : public AppListDocument, public ::testing::WithParamInterface<const char *> {
+ protected:
+  static constexpr uid_t kOther = 5000;
+  static constexpr char kPlace[] = "/tmp/quarn";
+  StagingSquat() {
+    const std::string kind = GetParam();
+    std::filesystem::create_directory(path("elsewhere"));
+    if (kind == "file") {
+      write_text(kPlace, "another's");
+      EXPECT_EQ(chmod(kPlace, 0666), 0);
+    } else if (kind == "directory") {
+      std::filesystem::create_directory(kPlace);
+      write_text(std::string(kPlace) + "/app_list.txt", "another's");
+    } else if (kind == "link") {
+      std::filesystem::create_symlink(path("elsewhere"), kPlace);
+    } else if (kind == "pipe") {
+      EXPECT_EQ(mkfifo(kPlace, 0666), 0);
+    } else {
+      const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      sockaddr_un address = {AF_UNIX, "/tmp/quarn"};
+      EXPECT_EQ(bind(fd, reinterpret_cast<sockaddr *>(&address), sizeof address), 0);
+      close(fd);
+    }
+    EXPECT_EQ(lchown(kPlace, kOther, kOther), 0);
+    EXPECT_EQ(lstat(kPlace, &squat_), 0);
+  }
+  ~StagingSquat() override {
+    for (const std::string &aside : set_aside()) std::filesystem::remove_all(aside);
+  }
+  std::vector<std::string> set_aside() const {
+    std::vector<std::string> found;
+    for (const auto &entry : std::filesystem::directory_iterator("/tmp")) {
+      struct stat status = {};
+      if (entry.path().filename().string().rfind("quarn.aside.", 0) == 0 &&
+          lstat(entry.path().c_str(), &status) == 0 && status.st_ino == squat_.st_ino) {
+        found.push_back(entry.path().string());
+      }
+    }
+    return found;
+  }
+  struct stat squat_ = {};
+};
+
+TEST_P(StagingSquat, IsSetAsideAsItIs) {
   ASSERT_TRUE(create_app_list_info(ctx_.get()));
-  EXPECT_FALSE(save_app_list_to_file(ctx_.get()));
-  EXPECT_EQ(count_logged(DLOG_ERROR, "cannot use staging directory /tmp/quarn"), 1);
-  EXPECT_TRUE(std::filesystem::is_empty(path("elsewhere")));
+  saved();
+  struct stat status = {};
+  ASSERT_EQ(lstat(kPlace, &status), 0);
+  EXPECT_TRUE(S_ISDIR(status.st_mode));
+  EXPECT_EQ(status.st_uid, 0U);
+  EXPECT_EQ(status.st_mode & 07777, 0700U);
+  EXPECT_TRUE(std::filesystem::is_empty(path("elsewhere"))) << "it is not followed";
+  const std::vector<std::string> aside = set_aside();
+  ASSERT_EQ(aside.size(), 1U);
+  ASSERT_EQ(lstat(aside[0].c_str(), &status), 0);
+  EXPECT_EQ(status.st_uid, kOther);
+  EXPECT_EQ(status.st_mode, squat_.st_mode);
+  EXPECT_EQ(count_logged(DLOG_WARN, "quarn is not the daemon's and was set aside as " +
+                                        aside[0].substr(sizeof "/tmp")),
+            1);
 }
 
-TEST_F(AppListDocument, StagingDirectoryOfAnotherUserIsRefused) {
+TEST_P(StagingSquat, ThatComesBackAgainAndAgainStopsNothing) {
+  std::atomic<bool> stop{false};
+  std::thread squatter([&] {
+    while (!stop) {
+      if (mkdir(kPlace, 0777) == 0 && lchown(kPlace, kOther, kOther) != 0) return;
+    }
+  });
+  int had = 0;
+  for (int i = 0; i < 300; ++i) {
+    had += prepare_staging_directory();
+    rmdir(kPlace);
+  }
+  stop = true;
+  squatter.join();
+  EXPECT_EQ(had, 300);
+  std::filesystem::remove_all(kPlace);
+  for (const auto &entry : std::filesystem::directory_iterator("/tmp")) {
+    const bool aside = entry.path().filename().string().rfind("quarn.aside.", 0) == 0;
+    if (aside && entry.is_directory()) rmdir(entry.path().c_str());
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(Things, StagingSquat,
+                         ::testing::Values("file", "directory", "link", "pipe", "socket"),
+                         [](const auto &info) { return std::string(info.param); });
+
+TEST_F(AppListDocument, WhatOthersPutIntoTheStagingDirectoryWhileItWasOpenIsRemoved) {
   std::filesystem::create_directory("/tmp/quarn");
-  ASSERT_EQ(chown("/tmp/quarn", 5000, 5000), 0);
+  ASSERT_EQ(chmod("/tmp/quarn", 0777), 0);
+  std::filesystem::create_directories("/tmp/quarn/app_list.txt/in the way");
+  ASSERT_EQ(chown("/tmp/quarn/app_list.txt", 5000, 5000), 0);
+  const std::string secret = "/tmp/quarn_backup_test.secret";
+  write_text(secret, "untouched");
+  ASSERT_EQ(link(secret.c_str(), "/tmp/quarn/lock"), 0);
+  write_text("/tmp/quarn/ours", "stays");
   ASSERT_TRUE(create_app_list_info(ctx_.get()));
-  EXPECT_FALSE(save_app_list_to_file(ctx_.get()));
-  EXPECT_EQ(count_logged(DLOG_ERROR, "cannot use staging directory /tmp/quarn"), 1);
-  EXPECT_FALSE(exists(kLocalAppListPath));
+  saved();
+  EXPECT_FALSE(exists("/tmp/quarn/lock"));
+  EXPECT_EQ(read_text(secret), "untouched");
+  EXPECT_EQ(read_text("/tmp/quarn/ours"), "stays");
+  std::filesystem::remove(secret);
 }
 
 TEST_F(AppListDocument, FileThatCannotBeWrittenIsNoList) {

@@ -133,7 +133,9 @@ FakeCloud::FakeCloud() {
                             const char *) {
         int result = 0;
         if (!accept(Op::upload, remote, &result)) return result;
-        last_upload_local = local;
+        // an archive is named by the descriptor that holds it
+        const bool held = std::string(local).rfind("/proc/self/fd/", 0) == 0;
+        last_upload_local = held ? std::filesystem::read_symlink(local).string() : local;
         if (!exists(local)) return static_cast<int>(BACKUP_TRANS_ERROR_LOCAL_FILE);
         // the file is opened with the request
         const std::string content = read_text(local);

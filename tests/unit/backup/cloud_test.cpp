@@ -1,3 +1,8 @@
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
 #include <filesystem>
 
 #include "backup_device.h"
@@ -13,9 +18,13 @@ namespace {
 constexpr int kRefused = BACKUP_TRANS_ERROR_NOT_INITIALIZED;
 constexpr int kServer = BACKUP_TRANS_ERROR_SERVER;
 
+/** Nothing can be renamed, as where it is a mount point. */
+bool stuck_files = false;
+
 class Cloud : public BackupDevice {
  protected:
   Cloud() : ctx_(new backup_context) { ctx_->serial_number = kSerial; }
+  ~Cloud() override { stuck_files = false; }
 
   void refuse_all() {
     cloud_.refuse = [](Op, const std::string &) { return kRefused; };
@@ -119,6 +128,7 @@ TEST_F(Cloud, RefusedListDownloadTruncatesAnEarlierText) {
 
 TEST_F(Cloud, ListIsNotRequestedWithoutAStagingDirectory) {
   write_text("/tmp/quarn", "a file");
+  stuck_files = true;
   EXPECT_NE(get_app_list_from_cloud(ctx_.get()), 0);
   EXPECT_EQ(error("cannot use staging directory /tmp/quarn"), 1);
   EXPECT_THAT(cloud_.requests(), IsEmpty());
@@ -178,6 +188,7 @@ TEST_F(Cloud, SynchronousDownloadThatCannotBeRead) {
 
 TEST_F(Cloud, SynchronousDownloadWithoutAStagingDirectory) {
   write_text("/tmp/quarn", "a file");
+  stuck_files = true;
   char *text = nullptr;
   EXPECT_NE(download_app_list_info_from_cloud(&text), 0);
   EXPECT_THAT(cloud_.requests(), IsEmpty());
@@ -231,6 +242,68 @@ TEST_F(Cloud, ArchiveIsUploadedBelowDevicePackageAndVersion) {
   EXPECT_EQ(info("backup trans success : upload for (org.app)"), 1);
   EXPECT_FALSE(exists(app.staged()));
   EXPECT_FALSE(holds_staged_archive(ctx_.get(), "org.app"));
+}
+
+/** What an application may do with the archive of its package, which lies in its own folder. */
+class ExchangedArchive : public Cloud, public ::testing::WithParamInterface<const char *> {
+ protected:
+  void exchange(const std::string &archive) const {
+    const std::string kind = GetParam();
+    const std::string other = archive + ".other";
+    write_text(other, "another archive...");  // of the same size
+    if (kind == "own file") {
+      EXPECT_EQ(chown(other.c_str(), 5000, 5000), 0);
+    } else if (kind == "link to root's file") {
+      std::filesystem::remove(archive);
+      EXPECT_EQ(link(other.c_str(), archive.c_str()), 0);
+      return;
+    } else if (kind == "symbolic link") {
+      std::filesystem::remove(archive);
+      std::filesystem::create_symlink(other, archive);
+      return;
+    } else if (kind == "pipe") {
+      std::filesystem::remove(other);
+      EXPECT_EQ(mkfifo(other.c_str(), 0600), 0);
+    } else if (kind == "nothing") {
+      std::filesystem::remove(archive);
+      return;
+    }
+    std::filesystem::rename(other, archive);
+  }
+};
+
+TEST_P(ExchangedArchive, IsNotSent) {
+  const FakePackage &app = install("org.app");
+  ctx_->cur_pkg_id = app.id;
+  ctx_->cur_version = app.version;
+  ctx_->cur_pkg_type = app.type;
+  ctx_->cur_root_path = app.root;
+  ASSERT_EQ(make_app_data_zip(ctx_.get(), app.id.c_str()), 0);
+  exchange(app.staged());
+  upload(app);
+  cloud_.answer_all();
+  EXPECT_THAT(cloud_.requests(), IsEmpty());
+  EXPECT_TRUE(cloud_.objects.empty());
+  EXPECT_EQ(ctx_->result, 12);
+  EXPECT_EQ(ctx_->upload_remain, 0);
+  EXPECT_EQ(error("backup_trans_upload_file_ors_async failed... " +
+                  std::to_string(BACKUP_TRANS_ERROR_LOCAL_FILE)),
+            1);
+  EXPECT_FALSE(holds_staged_archive(ctx_.get(), "org.app"));
+}
+
+INSTANTIATE_TEST_SUITE_P(By, ExchangedArchive,
+                         ::testing::Values("own file", "root's file", "link to root's file",
+                                           "symbolic link", "pipe", "nothing"),
+                         [](const auto &info) { return "Case" + std::to_string(info.index); });
+
+TEST_F(Cloud, ArchiveThatIsExchangedDuringItsUploadIsSentAsItWas) {
+  const FakePackage &app = staged("org.app");
+  upload(app);
+  write_text(app.staged() + ".other", "something else");
+  std::filesystem::rename(app.staged() + ".other", app.staged());
+  cloud_.answer_all();
+  EXPECT_EQ(cloud_.objects["/350000000000001/org.app/1.0.0/org.app.zip"], "archive of org.app");
 }
 
 TEST_F(Cloud, FailedUploadFailsTheRunAndFreesTheArchive) {
@@ -753,7 +826,9 @@ TEST_F(MissingRecord, OfAListDownload) {
 }
 
 TEST_F(MissingRecord, OfAnArchiveUpload) {
-  upload(install("org.app"));
+  const FakePackage &app = install("org.app");
+  write_text(app.staged(), "an archive");
+  upload(app);
   EXPECT_DEBUG_DEATH(call_without_record(uploaded_), "user_data");
   expect_logged("cb user_data is NULL...");
   uploaded_(BACKUP_TRANS_ERROR_CANCELLED, record_, nullptr);
@@ -789,3 +864,12 @@ TEST_F(MissingRecord, OfAVersionListingAndDeletion) {
 }
 
 }  // namespace
+
+extern "C" {
+int __real_renameat2(int from, const char *source, int to, const char *target, unsigned int flags);
+int __wrap_renameat2(int from, const char *source, int to, const char *target, unsigned int flags) {
+  if (!stuck_files) return __real_renameat2(from, source, to, target, flags);
+  errno = EBUSY;
+  return -1;
+}
+}

@@ -96,6 +96,69 @@ TEST_F(Pellix, ArchiveIsLabelledAndOpenToTheCompanion) {
   EXPECT_EQ(status.st_mode & 07777, 0777U);
 }
 
+TEST_F(Pellix, FolderIsClosedToOthersBeforeTheFirstArchiveIsMade) {
+  install("org.a");
+  ASSERT_EQ(chown(kCompanionDir.c_str(), 5000, 5000), 0);
+  ASSERT_EQ(chmod(kCompanionDir.c_str(), 0777), 0);
+  struct stat packing = {};
+  ON_CALL(platform_, smack_getlabel)
+      .WillByDefault([&](const char *, char **label, smack_label_type) {
+        EXPECT_EQ(stat(kCompanionDir.c_str(), &packing), 0);
+        *label = strdup("_");
+        return 0;
+      });
+  EXPECT_NE(answered(), "");
+  EXPECT_EQ(packing.st_mode & 07777, 0700U);
+  EXPECT_EQ(packing.st_uid, 5000U);
+}
+
+TEST_F(Pellix, FolderOfAnotherOwnerStaysOpenToTheCompanionsGroup) {
+  install("org.a");
+  ASSERT_EQ(chown(kCompanionDir.c_str(), 0, 5000), 0);
+  ASSERT_EQ(chmod(kCompanionDir.c_str(), 0775), 0);
+  EXPECT_NE(answered(), "");
+  struct stat status = {};
+  ASSERT_EQ(stat(kCompanionDir.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0770U);
+  EXPECT_EQ(status.st_gid, 5000U);
+}
+
+TEST_F(Pellix, WhatLiesAtTheArchivesNameIsReplacedAndNotWrittenInto) {
+  const FakePackage &a = install("org.a");
+  const FakePackage &b = install("org.b");
+  const FakePackage &c = install("org.c");
+  const std::string victim = kCompanionDir + "/victim";
+  write_text(victim, "untouched");
+  ASSERT_EQ(link(victim.c_str(), archive(a).c_str()), 0);
+  ASSERT_EQ(symlink(victim.c_str(), archive(b).c_str()), 0);
+  ASSERT_EQ(mkfifo(archive(c).c_str(), 0666), 0);
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(a), archive(b), archive(c)));
+  EXPECT_EQ(read_text(victim), "untouched");
+  struct stat status = {};
+  ASSERT_EQ(lstat(victim.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0644U);
+  for (const FakePackage *package : {&a, &b, &c}) {
+    ASSERT_EQ(lstat(archive(*package).c_str(), &status), 0);
+    EXPECT_TRUE(S_ISREG(status.st_mode));
+    EXPECT_EQ(status.st_nlink, 1U);
+    EXPECT_EQ(status.st_mode & 07777, 0777U);
+  }
+}
+
+TEST_F(Pellix, FolderAtTheArchivesNameCostsThatPackageOnly) {
+  const FakePackage &a = install("org.a");
+  const FakePackage &b = install("org.b");
+  std::filesystem::create_directories(archive(a) + "/in the way");
+  EXPECT_THAT(archives_of(answered()), ElementsAre(archive(b)));
+  EXPECT_EQ(error("cannot put archive " + archive(a) + " in its place"), 1);
+  EXPECT_TRUE(exists(archive(a) + "/in the way"));
+  int left = 0;
+  for ([[maybe_unused]] const auto &entry : std::filesystem::directory_iterator(kCompanionDir)) {
+    ++left;
+  }
+  EXPECT_EQ(left, 2) << "nothing is left of what could not be named";
+}
+
 TEST_F(Pellix, LabelThatCannotBeSetIsLoggedAndTheArchiveIsNamed) {
   const FakePackage &a = install("org.a");
   label_result_ = -1;

@@ -218,6 +218,73 @@ void go_without_a_lock() {
   _exit(0);
 }
 
+enum class Squat { kFile, kLink, kHardLink, kPipe, kDirectory };
+
+/** Somebody else lies where the lock is to be, and keeps what can be kept of it. */
+void take_the_turn_in_spite_of(Squat squat) {
+  const Folder folder;
+  const std::string lock = folder.lock();
+  const std::string other = lock + ".other";
+  const int file = open(other.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+  check(file >= 0, "another's file is made");
+  switch (squat) {
+    case Squat::kFile:
+      check(rename(other.c_str(), lock.c_str()) == 0 && chmod(lock.c_str(), 0666) == 0, "a file");
+      break;
+    case Squat::kLink:
+      check(symlink(other.c_str(), lock.c_str()) == 0, "a link");
+      break;
+    case Squat::kHardLink:
+      check(link(other.c_str(), lock.c_str()) == 0, "a hard link");
+      break;
+    case Squat::kPipe:
+      check(mkfifo(lock.c_str(), 0600) == 0, "a pipe");
+      break;
+    case Squat::kDirectory:
+      check(mkdir(lock.c_str(), 0700) == 0, "a directory");
+      break;
+  }
+  const pid_t keeper = fork();
+  if (keeper == 0) {
+    struct flock whole {};
+    whole.l_type = F_WRLCK;
+    const int held = open(squat == Squat::kFile ? lock.c_str() : other.c_str(), O_RDWR);
+    if (fcntl(held, F_SETLK, &whole) != 0) _exit(1);
+    kill(getpid(), SIGSTOP);
+    _exit(0);
+  }
+  int status = 0;
+  waitpid(keeper, &status, WUNTRACED);
+  check(WIFSTOPPED(status), "the other's file is locked");
+  begin_quarn_turn(lock.c_str(), nullptr, on_turn);
+  const bool taken = is_quarn_turn();
+  struct stat made {};
+  const bool ours = lstat(lock.c_str(), &made) == 0 && S_ISREG(made.st_mode) &&
+                    made.st_nlink == 1 && (made.st_mode & 07777) == 0600;
+  kill(keeper, SIGKILL);
+  waitpid(keeper, &status, 0);
+  unlink(lock.c_str());
+  struct stat untouched {};
+  check(fstat(file, &untouched) == 0 && untouched.st_size == 0, "nothing is written to it");
+  unlink(other.c_str());
+  check(taken, "nobody else can hold the daemon's lock");
+  check(ours, "the lock is a file of the daemon's alone");
+  _exit(0);
+}
+
+class SquatDeathTest : public ::testing::TestWithParam<Squat> {
+ protected:
+  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
+};
+
+TEST_P(SquatDeathTest, NobodyElseHoldsTheTurn) {
+  EXPECT_EXIT(take_the_turn_in_spite_of(GetParam()), ::testing::ExitedWithCode(0), "");
+}
+
+INSTANTIATE_TEST_SUITE_P(Things, SquatDeathTest,
+                         ::testing::Values(Squat::kFile, Squat::kLink, Squat::kHardLink,
+                                           Squat::kPipe, Squat::kDirectory));
+
 class TurnDeathTest : public ::testing::Test {
  protected:
   void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }

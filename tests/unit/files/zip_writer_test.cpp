@@ -1,6 +1,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/fsuid.h>
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -377,7 +378,7 @@ TEST_P(ZipWriter, ADirectoryWhoseStatusCannotBeReadIsLeftOut) {
 
 TEST_P(ZipWriter, AFileThatCannotBeOpenedIsRecordedOnly) {
   root_.file("data/a", "x");
-  const Fault fault("openat", EACCES, 0, 2);  // by the name, and again by what it proves to be
+  const Fault fault("openat", EIO, 0, 2);  // by the name, and again by what it proves to be
   EXPECT_EQ(pack(), QUARN_REFUSED);
   EXPECT_EQ(errors("fopen() failed, file is NULL"), 1);
   EXPECT_THAT(names(), ElementsAre(kTableEntry));
@@ -387,7 +388,7 @@ TEST_P(ZipWriter, AFileThatCannotBeOpenedIsRecordedOnly) {
 TEST_P(ZipWriter, ADirectoryThatCannotBeOpenedIsLeftOut) {
   root_.file("data/dir/a", "x");
   root_.file("shared/data/b", "x");
-  const Fault fault("openat", EACCES);
+  const Fault fault("openat", EIO);
   EXPECT_EQ(pack(), QUARN_REFUSED);
   EXPECT_EQ(errors("error : cannot open this path " + root_ / "data/dir"), 1);
   EXPECT_THAT(names(), ElementsAre("shared/data/b", kTableEntry));
@@ -686,6 +687,99 @@ TEST_P(ZipWriter, AnotherOwnersFileIsNotPackedByALinkToIt) {
   EXPECT_EQ(pack(), QUARN_REFUSED);
   EXPECT_EQ(errors("refused : " + (root_ / "data/a") + " is a link to another owner's file"), 1);
   EXPECT_THAT(names(), UnorderedElementsAre("data/own", "shared/data/again", kTableEntry));
+}
+
+/** A package as it is on a device: its data is its application's. */
+class OwnedData : public ZipWriter {
+ protected:
+  void SetUp() override {
+    ZipWriter::SetUp();
+    for (const char *dir : {"data", "shared/data", "shared/trusted"}) own(dir, 0755);
+  }
+  void own(const std::string &name, mode_t mode, uid_t owner = kAppUid) const {
+    ASSERT_EQ(lchown((root_ / name).c_str(), owner, owner), 0);
+    ASSERT_EQ(chmod((root_ / name).c_str(), mode), 0);
+  }
+  void file(const std::string &name, mode_t mode, uid_t owner = kAppUid) const {
+    root_.file(name, "text of " + name);
+    own(name, mode, owner);
+  }
+  std::uint64_t measured() const {
+    return get_dir_backup_size((root_ / "data").c_str(), kPackage, root_.path().c_str());
+  }
+};
+
+INSTANTIATE_TEST_SUITE_P(Codec, OwnedData, ::testing::Values(ArchiveCodec::kIsal));
+
+TEST_P(OwnedData, WhatTheApplicationItselfHasClosedIsPacked) {
+  file("data/closed", 0000);
+  file("data/readable", 0400);
+  file("data/dir/one", 0644);
+  root_.link("data/dir/link", "one");
+  own("data/dir", 0555);
+  file("data/shut/two", 0600);
+  root_.dir("data/shut/deeper");
+  file("data/shut/deeper/three", 0000);
+  root_.link("data/shut/deeper/link", "three");
+  own("data/shut/deeper", 0400);
+  own("data/shut", 0000);
+  EXPECT_EQ(pack(), QUARN_OK);
+  EXPECT_THAT(names(),
+              UnorderedElementsAre("data/closed", "data/readable", "data/dir/one", "data/shut/two",
+                                   "data/shut/deeper/three", kTableEntry));
+  EXPECT_EQ(text("data/shut/deeper/three"), "text of data/shut/deeper/three");
+  EXPECT_TRUE(in_table("data/shut/deeper"));
+  EXPECT_NE(table().find("data\\/shut\\/deeper\\/link"), std::string::npos);
+  const std::string counted =
+      "text of data/closed"
+      "text of data/readable"
+      "text of data/dir/one"
+      "one"
+      "text of data/shut/two"
+      "text of data/shut/deeper/three"
+      "three";
+  EXPECT_EQ(measured(), counted.size());
+}
+
+TEST_P(OwnedData, AnotherOwnersFilesArePackedWhereTheApplicationCannotHavePutThem) {
+  file("data/system/settings", 0600, 0);
+  file("data/system/deeper/state", 0600, 1234);
+  own("data/system/deeper", 0750, 0);
+  own("data/system", 0755, 0);
+  file("data/open", 0644, 0);
+  EXPECT_EQ(pack(), QUARN_OK);
+  EXPECT_THAT(names(), UnorderedElementsAre("data/system/settings", "data/system/deeper/state",
+                                            "data/open", kTableEntry));
+}
+
+TEST_P(OwnedData, AnotherOwnersFileWhoseOtherNameIsGoneIsNotPacked) {
+  file("data/a", 0600, 0);
+  file("data/b", 0600);
+  EXPECT_EQ(pack(), QUARN_REFUSED);
+  EXPECT_EQ(errors("refused : " + (root_ / "data/a") +
+                   " is another owner's file, and its application may not read it"),
+            1);
+  EXPECT_THAT(names(), UnorderedElementsAre("data/b", kTableEntry));
+  EXPECT_FALSE(in_table("data/a"));
+}
+
+TEST_P(OwnedData, TheCallersIdentityIsItsOwnAgain) {
+  file("data/a", 0600);
+  EXPECT_EQ(pack(), QUARN_OK);
+  EXPECT_EQ(setfsuid(static_cast<uid_t>(-1)), 0);
+  EXPECT_EQ(setfsgid(static_cast<gid_t>(-1)), 0);
+}
+
+TEST_P(OwnedData, TheArchiveAmongTheDataIsRootsWhoeverReadsTheData) {
+  file("data/a", 0600);
+  const std::string archive = root_ / "shared/data/org.example.notes_upload.zip";
+  int error = 0;
+  make_zip_data(kPackage, root_.path().c_str(), archive.c_str(), &error);
+  EXPECT_EQ(error, QUARN_OK);
+  struct stat status = {};
+  ASSERT_EQ(lstat(archive.c_str(), &status), 0);
+  EXPECT_EQ(status.st_uid, 0U);
+  EXPECT_EQ(status.st_mode & 07777, 0600U);
 }
 
 TEST_P(ZipWriter, AnEntryThatCannotBeOpenedCostsThatFileOnly) {

@@ -596,11 +596,65 @@ TEST_F(ExportTest, ALinkThatLiesThereIsReplacedAndNotFollowed) {
   EXPECT_EQ(read_text(base + "/outside"), "untouched");
 }
 
-TEST_F(ExportTest, WhatCannotBeReplacedMakesItFail) {
-  std::filesystem::create_directories(std::string(kTarget) + "/in/the/way");
-  EXPECT_EQ(make(), 31);
-  expect_info("quarnd_make_app_data zip_result = 31");
+/** What somebody else may have put where the export is to be. */
+class ExportSquat : public ExportTest, public ::testing::WithParamInterface<const char *> {
+ protected:
+  ExportSquat() {
+    const std::string kind = GetParam();
+    write_text(base + "/outside", "untouched");
+    if (kind == "directory") {
+      std::filesystem::create_directories(std::string(kTarget) + "/in/the/way");
+    } else if (kind == "file") {
+      write_text(kTarget, "another's");
+    } else if (kind == "link") {
+      std::filesystem::create_symlink(base + "/outside", kTarget);
+    } else {
+      EXPECT_EQ(mkfifo(kTarget, 0666), 0);
+    }
+    EXPECT_EQ(lchown(kTarget, 5000, 5000), 0);
+    EXPECT_EQ(chmod("/tmp", 01777), 0);
+  }
+  ~ExportSquat() override {
+    for (const std::string &aside : set_aside()) std::filesystem::remove_all(aside);
+  }
+  static std::vector<std::string> set_aside() {
+    std::vector<std::string> found;
+    for (const auto &entry : std::filesystem::directory_iterator("/tmp")) {
+      if (entry.path().string().rfind(std::string(kTarget) + ".aside.", 0) == 0) {
+        found.push_back(entry.path().string());
+      }
+    }
+    return found;
+  }
+};
+
+TEST_P(ExportSquat, StopsNoExport) {
+  EXPECT_EQ(make(), 0);
+  expect_exported();
+  EXPECT_EQ(read_text(base + "/outside"), "untouched");
+  if (std::string(GetParam()) != "directory") return;
+  ASSERT_EQ(set_aside().size(), 1U);
+  EXPECT_TRUE(exists(set_aside()[0] + "/in/the/way")) << "it is left as it is";
 }
+
+TEST_P(ExportSquat, StopsNoExportOfAnyKindInTheStagingDirectorysPlace) {
+  std::filesystem::remove_all("/tmp/quarn");
+  std::filesystem::rename(kTarget, "/tmp/quarn");
+  EXPECT_EQ(make(), 0);
+  expect_exported();
+  EXPECT_EQ(read_text(base + "/outside"), "untouched");
+  for (const auto &entry : std::filesystem::directory_iterator("/tmp")) {
+    struct stat status = {};
+    if (entry.path().filename().string().rfind("quarn.aside.", 0) == 0 &&
+        lstat(entry.path().c_str(), &status) == 0 && status.st_uid == 5000) {
+      std::filesystem::remove_all(entry.path());
+    }
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(Things, ExportSquat,
+                         ::testing::Values("file", "directory", "link", "pipe"),
+                         [](const auto &info) { return std::string(info.param); });
 
 TEST_F(ExportTest, WithoutARootPathItIsRefusedAndTheEarlierArchiveIsGone) {
   write_text(kTarget, "earlier");

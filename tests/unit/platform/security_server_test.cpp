@@ -91,6 +91,36 @@ TEST_F(SecurityServer, LeavesOutWhatOnlyRootMayEnter) {
   EXPECT_EQ(label("tree/data/deep/app/file"), "new");
 }
 
+TEST_F(SecurityServer, LeavesOutSecondNamesOfOthersFiles) {
+  const auto own = [this](const char *name) {
+    ASSERT_EQ(lchown((dir_ / name).c_str(), 5000, 5000), 0);
+  };
+  for (const char *name : {"tree/data", "tree/data/file", "tree/data/deep"}) own(name);
+  dir_.file("outside/secret", "");
+  dir_.file("tree/data/mine", "");
+  own("tree/data/mine");
+  ASSERT_EQ(link((dir_ / "outside/secret").c_str(), (dir_ / "tree/data/second").c_str()), 0);
+  ASSERT_EQ(link((dir_ / "tree/data/mine").c_str(), (dir_ / "tree/data/deep/again").c_str()), 0);
+  dir_.file("tree/data/last", "");  // whose other name is gone
+  dir_.file("tree/data/service/file", "");
+  EXPECT_EQ(relabel(dir_ / "tree/data"), SECURITY_SERVER_SUCCESS);
+  EXPECT_EQ(label("outside/secret"), "_");
+  EXPECT_EQ(label("tree/data/last"), "_");
+  EXPECT_EQ(label("tree/data/mine"), "new");
+  EXPECT_EQ(label("tree/data/deep/again"), "new");
+  EXPECT_EQ(label("tree/data/service/file"), "new") << "the application cannot have put it there";
+}
+
+TEST_F(SecurityServer, LabelsNoObjectThroughALink) {
+  ASSERT_EQ(link((dir_ / "outside/file").c_str(), (dir_ / "tree/data/second").c_str()), 0);
+  for (const char *name : {"tree/data/link", "tree/data/folder/file", "tree/data/second"}) {
+    EXPECT_EQ(security_server_label_access((dir_ / name).c_str(), "one"),
+              SECURITY_SERVER_ERROR_SERVER)
+        << name;
+  }
+  EXPECT_EQ(label("outside/file"), "_");
+}
+
 TEST_F(SecurityServer, FollowsNoLinkInAPath) {
   dir_.link("way", "tree");
   EXPECT_EQ(relabel(dir_ / "tree/data/folder"), SECURITY_SERVER_ERROR_SERVER);

@@ -33,6 +33,33 @@ class LocalPath : public ::testing::Test {
   TempDir dir;
 };
 
+TEST_F(LocalPath, WhatTheCallerHoldsIsSentWhateverItsNameHasBecome) {
+  write_file(dir / "app/archive", "looked at");
+  const int held = open((dir / "app/archive").c_str(), O_RDONLY | O_CLOEXEC);
+  ASSERT_GE(held, 0);
+  ASSERT_EQ(unlink((dir / "app/archive").c_str()), 0);
+  write_file(dir / "app/archive", "something else");
+  LocalSource source;
+  EXPECT_TRUE(source.open("/proc/self/fd/" + std::to_string(held)));
+  close(held);
+  char text[32] = {};
+  EXPECT_EQ(read(source.fd(), text, sizeof text), 9);
+  EXPECT_STREQ(text, "looked at");
+}
+
+TEST_F(LocalPath, NoOtherWayThroughADescriptorsNameIsTaken) {
+  const int held = open((dir / "app").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  ASSERT_GE(held, 0);
+  const std::string name = "/proc/self/fd/" + std::to_string(held);
+  LocalSource source;
+  EXPECT_FALSE(source.open(name)) << "a folder";
+  EXPECT_FALSE(source.open(name + "/file"));
+  EXPECT_FALSE(source.open("/proc/self/fd/"));
+  EXPECT_FALSE(source.open("/proc/self/cwd"));
+  close(held);
+  EXPECT_FALSE(source.open(name)) << "nothing is held any more";
+}
+
 TEST_F(LocalPath, PlainPathsAreReached) {
   EXPECT_TRUE(reaches(dir / "real/file"));
   EXPECT_TRUE(reaches(dir / "app/absent"));
