@@ -3,6 +3,7 @@
 #include <glib.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
@@ -20,6 +21,7 @@
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
@@ -230,6 +232,7 @@ int quarn_recover() {
 }
 
 int main(int argc, char **argv) {
+  if (!drop_other_groups()) LOGE("fail to leave the groups of the process : %d", errno);
   const bool recovery = argc == 2 && std::strcmp(argv[1], "--recover") == 0;
   const int status = recovery ? quarn_recover() : quarn_run();
   std::fflush(nullptr);

@@ -1,0 +1,238 @@
+#include "quarn_d_utils/package_identity.h"
+
+#include <fcntl.h>
+#include <grp.h>
+#include <linux/capability.h>
+#include <sys/fsuid.h>
+#include <sys/syscall.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <string>
+#include <utility>
+
+#include "quarn_common.h"
+#include "quarn_d_utils/safe_path.h"
+
+namespace {
+
+constexpr char kAccessList[] = "system.posix_acl_access";
+constexpr auto kNobody = static_cast<unsigned int>(-1);  // asks and changes nothing
+constexpr int kPlaceFlags = O_PATH | O_NOFOLLOW | O_CLOEXEC;
+
+/** What this thread is at the moment; a thread's first answer is the kernel's. */
+package_user &identity() {
+  thread_local package_user current = {static_cast<uid_t>(setfsuid(kNobody)),
+                                       static_cast<gid_t>(setfsgid(kNobody))};
+  return current;
+}
+
+bool same_user(const package_user &a, const package_user &b) {
+  return a.uid == b.uid && a.gid == b.gid;
+}
+
+/** Become @p user. The calls themselves never tell whether they have worked. */
+bool become(const package_user &user) {
+  package_user &current = identity();
+  if (same_user(current, user)) return true;
+  // Root's own rights are needed for both, and end with the user.
+  if (user.uid == 0) setfsuid(user.uid);
+  setfsgid(user.gid);
+  if (user.uid != 0) setfsuid(user.uid);
+  current = {static_cast<uid_t>(setfsuid(kNobody)), static_cast<gid_t>(setfsgid(kNobody))};
+  return same_user(current, user);
+}
+
+/** Lifts the thread's file modes, not its owner: what it makes stays the package's. */
+class WithoutModes {
+ public:
+  WithoutModes() {
+    granted_ = syscall(SYS_capget, &header_, before_) == 0;
+    if (!granted_) return;
+    __user_cap_data_struct raised[2] = {before_[0], before_[1]};
+    for (const int capability : {CAP_DAC_OVERRIDE, CAP_DAC_READ_SEARCH, CAP_MAC_OVERRIDE}) {
+      __user_cap_data_struct &word = raised[CAP_TO_INDEX(capability)];
+      word.effective |= CAP_TO_MASK(capability) & word.permitted;
+    }
+    granted_ = syscall(SYS_capset, &header_, raised) == 0;
+  }
+  ~WithoutModes() {
+    const int error = errno;
+    if (granted_) syscall(SYS_capset, &header_, before_);
+    errno = error;
+  }
+  WithoutModes(const WithoutModes &) = delete;
+  WithoutModes &operator=(const WithoutModes &) = delete;
+  explicit operator bool() const { return granted_; }
+
+ private:
+  __user_cap_header_struct header_ = {_LINUX_CAPABILITY_VERSION_3, 0};
+  __user_cap_data_struct before_[2] = {};
+  bool granted_ = false;
+};
+
+UniqueFd refuse() {
+  errno = EACCES;
+  return {};
+}
+
+bool can_fill(int dir, const struct stat &status, const package_user &user) {
+  if (status.st_uid == user.uid || (status.st_mode & S_IWOTH) != 0) return true;
+  if ((status.st_mode & S_IWGRP) == 0) return false;  // that also bounds an access list
+  if (status.st_gid == user.gid) return true;
+  const ActAsRoot root;
+  const ssize_t list = getxattr(own_fd_path(dir).c_str(), kAccessList, nullptr, 0);
+  return list >= 0 || (errno != ENODATA && errno != EOPNOTSUPP);
+}
+
+/** True when root may make or remove a name there although the user may not. */
+bool is_changed_for(int dir, const package_user &user) {
+  struct stat status = {};
+  return fstat(dir, &status) == 0 && (status.st_uid == user.uid || !can_fill(dir, status, user));
+}
+
+/** True when the application cannot have put somebody else's object where it lies. */
+bool lies_by_others_doing(int dir, int object, const struct stat &status,
+                          const package_user &user) {
+  struct stat holder = {};
+  if (fstat(dir, &holder) != 0) return false;
+  if (!can_fill(dir, holder, user)) return S_ISDIR(status.st_mode) || status.st_nlink == 1;
+  // A folder has one name, and goes elsewhere only with the right to write it.
+  return S_ISDIR(status.st_mode) && holder.st_uid == user.uid && !can_fill(object, status, user);
+}
+
+/** What is refused to the user: by root, on the object that was looked at. */
+UniqueFd open_looked_at(int dir, const char *name, int flags, const package_user &user,
+                        struct stat *status) {
+  const ActAsRoot root;
+  if (!root) return refuse();
+  UniqueFd object(openat(dir, name, kPlaceFlags));
+  if (!object || fstat(object.get(), status) != 0) return {};
+  if ((flags & O_PATH) != 0) {
+    if ((flags & O_DIRECTORY) == 0 || S_ISDIR(status->st_mode)) return object;
+    errno = ENOTDIR;
+    return {};
+  }
+  if (!S_ISREG(status->st_mode) && !S_ISDIR(status->st_mode)) return refuse();
+  if (status->st_uid != user.uid && !lies_by_others_doing(dir, object.get(), *status, user)) {
+    return refuse();
+  }
+  UniqueFd opened(open(own_fd_path(object.get()).c_str(), (flags & ~O_NOFOLLOW) | O_CLOEXEC));
+  if (opened && fstat(opened.get(), status) != 0) return {};
+  return opened;
+}
+
+/** Do what the user was refused once more, without the modes, where that is right. */
+template <typename Call>
+int again_in(int dir, int other, const package_user &user, Call call) {
+  if (!is_changed_for(dir, user) || (other != dir && !is_changed_for(other, user))) {
+    errno = EACCES;
+    return -1;
+  }
+  const WithoutModes lifted;
+  if (!lifted) {
+    errno = EACCES;
+    return -1;
+  }
+  return call();
+}
+
+/** As the user first; @p call answers -1 for a failure. */
+template <typename Call>
+int as_package(int dir, int other, const package_user &user, Call call) {
+  const ActAsPackage acting(user);
+  if (!acting) {
+    errno = EPERM;
+    return -1;
+  }
+  const int result = call();
+  if (result >= 0 || errno != EACCES) return result;
+  return again_in(dir, other, user, call);
+}
+
+}  // namespace
+
+package_user user_of_package() { return {kAppUid, kAppGid}; }
+
+bool drop_other_groups() { return geteuid() != 0 || setgroups(0, nullptr) == 0; }
+
+FileIdentity::FileIdentity(package_user user) : before_(identity()), granted_(true) {
+  if (geteuid() == 0) granted_ = become(user);
+}
+
+FileIdentity::~FileIdentity() {
+  const int error = errno;
+  become(before_);
+  errno = error;
+}
+
+bool application_can_fill(int dir, const package_user &user) {
+  struct stat status = {};
+  return fstat(dir, &status) != 0 || can_fill(dir, status, user);
+}
+
+UniqueFd open_as_package(int dir, const char *name, int flags, mode_t mode,
+                         const package_user &user, struct stat *status) {
+  flags |= O_NOFOLLOW | O_CLOEXEC;
+  if ((flags & O_CREAT) != 0) flags |= O_EXCL;
+  UniqueFd fd;
+  if ((flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE) {
+    fd.reset(as_package(dir, dir, user, [&] { return openat(dir, name, flags, mode); }));
+  } else {
+    const ActAsPackage acting(user);
+    if (acting) fd.reset(openat(dir, name, flags));
+    if (!acting || (!fd && errno == EACCES)) {
+      struct stat looked_at = {};
+      return open_looked_at(dir, name, flags, user, status != nullptr ? status : &looked_at);
+    }
+  }
+  if (fd && status != nullptr && fstat(fd.get(), status) != 0) return {};
+  return fd;
+}
+
+UniqueFd open_below_as_package(int dir, const char *path, int flags, mode_t mode,
+                               const package_user &user, struct stat *status) {
+  const ActAsPackage acting(user);
+  if (acting && (flags & O_CREAT) == 0) {
+    UniqueFd fd = safe_open_below(dir, path, flags);
+    if (!fd && errno != EACCES) return {};
+    if (fd && status != nullptr && fstat(fd.get(), status) != 0) return {};
+    if (fd) return fd;
+  }
+  const std::string whole = path == nullptr ? "" : path;
+  if (whole.empty() || whole.front() == '/') {
+    errno = EINVAL;
+    return {};
+  }
+  UniqueFd held;
+  int at = dir;
+  for (std::size_t begin = 0;;) {
+    const std::size_t end = std::min(whole.find('/', begin), whole.size());
+    const std::string name = whole.substr(begin, end - begin);
+    if (name.empty() || name == "..") {
+      errno = EINVAL;
+      return {};
+    }
+    if (end == whole.size()) return open_as_package(at, name.c_str(), flags, mode, user, status);
+    UniqueFd next = open_as_package(at, name.c_str(), O_PATH | O_DIRECTORY, 0, user, nullptr);
+    if (!next) return {};
+    held = std::move(next);
+    at = held.get();
+    begin = end + 1;
+  }
+}
+
+int mkdir_as_package(int dir, const char *name, mode_t mode, const package_user &user) {
+  return as_package(dir, dir, user, [&] { return mkdirat(dir, name, mode); });
+}
+
+int unlink_as_package(int dir, const char *name, int flags, const package_user &user) {
+  return as_package(dir, dir, user, [&] { return unlinkat(dir, name, flags); });
+}
+
+int rename_as_package(int from, const char *old_name, int to, const char *name,
+                      const package_user &user) {
+  return as_package(from, to, user, [&] { return renameat(from, old_name, to, name); });
+}
