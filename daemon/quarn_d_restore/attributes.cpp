@@ -9,6 +9,7 @@
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_reader.h"
 #include "quarn_log.h"
@@ -104,6 +105,37 @@ int change_object_owner(int fd, uid_t uid, gid_t gid) {
   return fchownat(fd, "", uid, gid, AT_EMPTY_PATH);
 }
 
+namespace {
+
+/** Mode and owner, in the order that lets nothing run as another in between. */
+bool give_to_application(int fd, const struct stat &status, mode_t mode) {
+  if (status.st_uid == kAppUid && status.st_gid == kAppGid) {
+    // Its user's rights suffice, and would not for another's file.
+    const ActAsPackage acting;
+    if (change_object_mode(fd, status, mode) == 0) return true;
+    LOGE("chmod failed");
+    return false;
+  }
+  const ActAsRoot root;
+  // The set-id bits wait for the owner: the file must never run as the daemon's
+  // user, and a change of owner clears them anyway.
+  if (change_object_mode(fd, status, mode & ~kSetIdBits) < 0) {
+    LOGE("chmod failed");
+    return false;
+  }
+  if (change_object_owner(fd, kAppUid, kAppGid) < 0) {
+    LOGE("chown: error \n");
+    return false;
+  }
+  if ((mode & kSetIdBits) != 0 && change_object_mode(fd, status, mode) < 0) {
+    LOGE("chmod failed");
+    return false;
+  }
+  return true;
+}
+
+}  // namespace
+
 int restore_object_info(int fd, const struct stat &status, const char *path, const char *pkgid,
                         const char *root, json_object *table) {
   int stored_mode = 0;
@@ -114,26 +146,8 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
       QUARN_OK) {
     return 0;
   }
-  if (S_ISREG(status.st_mode) && status.st_nlink > 1) {
-    // what a restore unpacks has one name; by another the application would get any file
-    LOGE("refused : %s is a link to a file elsewhere", path);
+  if (!give_to_application(fd, status, static_cast<mode_t>(stored_mode) & kPermissionBits))
     return 0;
-  }
-  // The set-id bits wait for the owner: the file must never run as the daemon's
-  // user, and a change of owner clears them anyway.
-  const mode_t mode = static_cast<mode_t>(stored_mode) & kPermissionBits;
-  if (change_object_mode(fd, status, mode & ~kSetIdBits) < 0) {
-    LOGE("chmod failed");
-    return 0;
-  }
-  if (change_object_owner(fd, kAppUid, kAppGid) < 0) {
-    LOGE("chown: error \n");
-    return 0;
-  }
-  if ((mode & kSetIdBits) != 0 && change_object_mode(fd, status, mode) < 0) {
-    LOGE("chmod failed");
-    return 0;
-  }
   if (label[0] == '\0') {
     LOGE("error : there isn't smack info of %s", path);
     return 0;
@@ -141,6 +155,11 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
   const std::string own = own_fd_path(fd);
   CString current;
   int result = smack_getlabel(own.c_str(), out(current), SMACK_LABEL_ACCESS);
+  if (result != 0) {
+    // its mode or its label may be closed to the package's user by now
+    const ActAsRoot root_once;
+    result = smack_getlabel(own.c_str(), out(current), SMACK_LABEL_ACCESS);
+  }
   if (result != 0) {
     LOGE("error : cannot get smack label of %s (err=%d)", path, result);
     return 0;
@@ -150,6 +169,7 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
     LOGE("fail : unknown smack label...");
     return 0;
   }
+  const ActAsRoot root_again;
   result = security_server_label_access(fd_path(fd).c_str(), label);
   if (result != SECURITY_SERVER_SUCCESS) {
     LOGE("fail : security_server_label_access...(err=%d)", result);
@@ -160,10 +180,19 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
 }
 
 int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table) {
-  const UniqueFd object = safe_open(path, O_PATH | O_NOFOLLOW);
+  std::string name;
+  const UniqueFd parent = safe_open_parent(path, &name);
+  UniqueFd object;
   struct stat status = {};
+  if (parent) object.reset(openat(parent.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   // What cannot be opened is left without a type, so that its mode cannot be changed either.
   if (object && fstat(object.get(), &status) != 0) status = {};
+  const bool has_mode = S_ISREG(status.st_mode) || S_ISDIR(status.st_mode);
+  if (object && has_mode &&
+      !may_be_changed(parent.get(), object.get(), status, user_of_package())) {
+    LOGE("refused : %s is a link to a file elsewhere", path);
+    return 0;
+  }
   return restore_object_info(object.get(), status, path, pkgid, root, table);
 }
 

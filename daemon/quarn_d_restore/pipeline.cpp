@@ -9,11 +9,13 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/settle.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/cloud_transfer.h"
+#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_d_utils/safe_path.h"
@@ -85,6 +87,30 @@ gboolean terminate_when_idle(gpointer /*data*/) {
   return G_SOURCE_REMOVE;
 }
 
+/**
+ * What the restore works with must be where it was at its end too: else it would tell of success
+ * for a package that has gone, or that the application has kept its own folder in the place of
+ * the snapshot for.
+ */
+bool is_undisturbed(const char *pkgid, const HeldFolder &package, const HeldFolder &snapshot) {
+  if (!package.is_in_place()) {
+    LOGE("package (%s) was removed during its restore", pkgid);
+    return false;
+  }
+  if (!snapshot.is_in_place()) {
+    LOGE("snapshot of (%s) was moved during its restore", pkgid);
+    return false;
+  }
+  return true;
+}
+
+/** False for an archive that the application has put in the place of the downloaded one. */
+bool is_own_archive(const std::string &path) {
+  struct stat status = {};
+  if (safe_lstat(path.c_str(), &status) != 0) return true;  // the unpacking tells of it
+  return S_ISREG(status.st_mode) && is_own_file(status) && status.st_nlink == 1;
+}
+
 /** 0, or a code when the archive, or only a part of it, could not be unpacked. */
 int unpack(const pkg_restore_context &ctx, const std::string &archive) {
   unzip_report report;
@@ -107,11 +133,16 @@ restore_outcome roll_back(pkg_restore_context *ctx, int result) {
 }
 
 /** Replace the package's data by the archive's, or leave it as it is. The caller holds its lock. */
-restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string &archive,
-                                     std::uint64_t size) {
+restore_outcome restore_from_archive(pkg_restore_context *ctx, const HeldFolder &package,
+                                     const std::string &archive, std::uint64_t size) {
   const char *pkgid = ctx->pkgid.c_str();
   const char *root = ctx->root.c_str();
   report_restore_step(ctx->pkgid, restore_stage::snapshot, size);
+  if (!is_own_archive(archive)) {
+    LOGE("archive of (%s) was exchanged", pkgid);
+    ctx->result = QUARN_UNREADABLE;
+    return restore_outcome::failed;
+  }
   if (recover_package_data(pkgid, root) == recovery_result::kept) {
     // A further snapshot would take the place of what is still to be put back.
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, QUARN_REFUSED);
@@ -120,7 +151,8 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
   }
   const restore_files files(pkgid, root);
   const OwnTableAside own_table(files);
-  int result = own_table ? temp_backup_initial_app_data(pkgid, root) : QUARN_REFUSED;
+  std::optional<HeldFolder> snapshot;
+  int result = own_table ? take_snapshot(pkgid, root, &snapshot) : QUARN_REFUSED;
   if (result != QUARN_OK) {
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
     ctx->result = result;
@@ -140,7 +172,7 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const std::string
   if (!noted) LOGE("unpacked files of (%s) cannot be noted", pkgid);
   const bool restored = noted && restore_app_info(pkgid, root) != 0;
   if (restored) restore_step("restored");
-  if (!restored || !discard_snapshot(pkgid, root)) {
+  if (!restored || !is_undisturbed(pkgid, package, *snapshot) || !discard_snapshot(pkgid, root)) {
     LOGE("fail to restore for (%s)", pkgid);
     return roll_back(ctx, QUARN_REFUSED);
   }
@@ -242,8 +274,10 @@ void finish_download(RequestPtr request, backup_trans_error_code error) {
     ctx->result = QUARN_CANCELLED;
   } else {
     LOGI("backup trans success : download for (%s)", ctx->pkgid.c_str());
+    const HeldFolder package(ctx->root);
+    const HeldFile archive(request->local_path);
     size = archive_size(request->local_path);
-    outcome = restore_from_archive(ctx, request->local_path, size);
+    outcome = restore_from_archive(ctx, package, request->local_path, size);
   }
   lock.reset();
   remove_download(request->local_path);
@@ -335,6 +369,7 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
   }
   const std::string archive = companion_archive(ctx);
   const PackageDataLock lock(ctx.pkgid, PackageUse::kChange);
+  const HeldFolder package(ctx.root);
   if (recover_package_data(pkgid, ctx.root.c_str()) == recovery_result::kept) {
     // What is still to be put back would go over what is unpacked now.
     LOGE("fail to restore for (%s)", pkgid);
@@ -365,7 +400,10 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
     return done;
   }
   done.begun = done.unpacked == QUARN_OK || report.extracted > 0;
-  if (done.unpacked != QUARN_OK) return done;
+  if (done.unpacked != QUARN_OK) {
+    settle_unpacked_files(pkgid, ctx.root.c_str());
+    return done;
+  }
   done.whole = report.complete();
   if (!done.whole) {
     LOGE("%u entries of (%s) were not restored", report.refused + report.failed, pkgid);
@@ -373,6 +411,7 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
   // There is nothing to roll back to: what could be unpacked is the application's.
   report_restore_step(ctx.pkgid, restore_stage::attributes, done.size);
   done.attributes = restore_app_info(pkgid, ctx.root.c_str()) != 0;
+  if (!done.attributes) settle_unpacked_files(pkgid, ctx.root.c_str());
   if (done.attributes) {
     LOGI("restore completed for (%s)", pkgid);
   } else {

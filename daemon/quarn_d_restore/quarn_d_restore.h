@@ -14,6 +14,7 @@
 
 #include "platform_package_manager.h"
 #include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 /** The state of one package's restore; freed by the engine or by the waiting request. */
@@ -120,7 +121,9 @@ void recover_interrupted_restores();
 /** Told the name of each step of a restore; null but in tests. */
 extern void (*restore_step_hook)(const char *step);
 inline void restore_step(const char *step) {
-  if (restore_step_hook != nullptr) restore_step_hook(step);
+  if (restore_step_hook == nullptr) return;
+  const ActAsRoot root;
+  restore_step_hook(step);
 }
 
 /* ---- pipeline.cpp ---- */

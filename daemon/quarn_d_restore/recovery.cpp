@@ -3,6 +3,7 @@
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/working_files.h"
@@ -50,6 +51,7 @@ void recover_all_of_package(const char *pkgid, const char *root) {
 }
 
 recovery_result recover_snapshot(const char *pkgid, const char *root, const restore_files &files) {
+  const HeldFolder snapshot(files.snapshot);
   std::string written;
   switch (state_of_snapshot(files)) {
     case snapshot_state::none:
@@ -77,6 +79,7 @@ recovery_result recover_snapshot(const char *pkgid, const char *root, const rest
 }  // namespace
 
 recovery_result recover_package_data(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
   const recovery_result result = recover_snapshot(pkgid, root, files);
   put_own_table_back(files);

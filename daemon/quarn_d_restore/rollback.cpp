@@ -9,6 +9,8 @@
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/held_folder.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
@@ -77,6 +79,12 @@ void put_attributes_back(int fd, const struct stat &before, const char *key, jso
 
 enum class Objects { kAll, kDirectories };
 
+/** True for a folder in the data that is the application's, or that it cannot have put there. */
+bool is_packages_folder(int folder, const struct stat &status) {
+  const UniqueFd parent(openat(folder, "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  return parent && may_be_changed(parent.get(), folder, status, user_of_package());
+}
+
 /**
  * The attributes of what the table has below the directory @p top. Files get
  * theirs in the snapshot, where the application cannot put another file in
@@ -93,6 +101,10 @@ void put_all_attributes_back(json_object *table, const std::string &top, Objects
     struct stat status = {};
     if (!object || fstat(object.get(), &status) != 0) continue;
     if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode)) continue;
+    if (objects == Objects::kDirectories && !is_packages_folder(object.get(), status)) {
+      LOGE("refused : %s was put there from elsewhere", key);
+      continue;
+    }
     put_attributes_back(object.get(), status, key, entry);
   }
 }
@@ -108,13 +120,15 @@ class Clearing {
   /** @return true when no file is left that there was not */
   bool run() {
     LOGI("clearing app data backup directory");
+    const ActAsPackage acting(user_);
     for (const auto &dir : files_.dirs) clear(dir);
     return cleared_;
   }
 
  private:
   void clear(const std::string &dir) {
-    TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                    TreeAccess::kPackage);
     if (!place) {
       LOGE("error : cannot open this path %s", dir.c_str());
       return;
@@ -129,7 +143,7 @@ class Clearing {
         const std::string name = path_.substr(path_.rfind('/') + 1);
         path_.resize(path_.rfind('/'));
         // One that is empty now is not made again, and comes back with what it held.
-        static_cast<void>(unlinkat(place.fd(), name.c_str(), AT_REMOVEDIR));
+        static_cast<void>(unlink_as_package(place.fd(), name.c_str(), AT_REMOVEDIR, user_));
         continue;
       }
       const std::string name = std::move(pending.back().back());
@@ -156,10 +170,11 @@ class Clearing {
       restore_step("rollback-clear");
       const char *name = entry.name.c_str();
       struct stat status = {};
-      const int found = fstatat(dir, name, &status, AT_SYMLINK_NOFOLLOW);
+      const int found = status_as_package(dir, name, user_, &status);
       if (found != 0) {
         LOGE("error : lstat for %d %s", found, path_.c_str());
       } else if (S_ISDIR(status.st_mode)) {
+        if (is_snapshot(status)) continue;
         if (is_known()) {
           folders.push_back(std::move(entry.name));
         } else {
@@ -167,7 +182,8 @@ class Clearing {
         }
       } else if (!S_ISREG(status.st_mode)) {
         LOGE("this is unexpected type : %s", path_.c_str());
-      } else if (!is_known() && !is_applications_table(status) && unlinkat(dir, name, 0) != 0) {
+      } else if (!is_known() && !is_applications_table(status) &&
+                 unlink_as_package(dir, name, 0, user_) != 0) {
         LOGE("fail to delete file : %s", path_.c_str());
         cleared_ = false;
       }
@@ -176,10 +192,19 @@ class Clearing {
   }
 
   void clear_unknown_folder(int dir, const char *name) {
-    if (delete_tree_at(dir, name, path_)) return;
+    if (delete_tree_at(dir, name, path_, OtherTypes::kStay, TreeAccess::kPackage)) return;
     LOGE("fail to delete dir : %s", path_.c_str());
+    const ActAsRoot root;
     // What is refused, a link, is not the archive's.
     if (!is_empty_directory(path_.c_str())) cleared_ = false;
+  }
+
+  /** The snapshot, to which the application may have given another name. */
+  bool is_snapshot(const struct stat &status) const {
+    const HeldFolder *snapshot = HeldFolder::of(files_.snapshot.c_str());
+    struct stat held = {};
+    return snapshot != nullptr && snapshot->is_at(files_.snapshot.c_str()) &&
+           fstat(snapshot->fd(), &held) == 0 && is_same_object(held, status);
   }
 
   /** What the application calls like the table was set aside while there could be a table. */
@@ -194,6 +219,7 @@ class Clearing {
   const restore_files &files_;
   const std::string &root_;
   json_object *table_;
+  const package_user user_ = user_of_package();
   std::string path_;
   bool cleared_ = true;
 };
@@ -215,7 +241,8 @@ class MovingBack {
     }
     path_ = dir;
     const std::string original = target_path();
-    TreePlace target(safe_open(original.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    TreePlace target(open_held_as_package(original, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                     TreeAccess::kPackage);
     if (!target) {
       LOGE("error : cannot open this path %s", original.c_str());
       return false;
@@ -271,6 +298,7 @@ class MovingBack {
     std::vector<TreeEntry> entries;
     std::vector<std::string> folders;
     if (!list_tree_entries(from, &entries)) moved_ = false;
+    const bool closed = !is_open_to_root(to);
     for (TreeEntry &entry : entries) {
       const PathStep step(&path_, entry.name.c_str());
       if (is_own()) continue;
@@ -283,17 +311,27 @@ class MovingBack {
         folders.push_back(std::move(entry.name));
       } else if (!S_ISREG(status.st_mode)) {
         LOGE("this is unexpected type : %s", path_.c_str());
-      } else if (!move_file(from, to, entry.name.c_str(), status)) {
+      } else if (closed || !move_file(from, to, entry.name.c_str(), status)) {
         failed();
       }
     }
     return folders;
   }
 
+  /** The daemon replaces names only where the application may, or has no part in the folder. */
+  bool is_open_to_root(int folder) const {
+    struct stat status = {};
+    return fstat(folder, &status) == 0 &&
+           (status.st_uid == user_.uid || !application_can_fill(folder, user_));
+  }
+
   bool move_file(int from, int to, const char *name, const struct stat &status) {
     struct stat present = {};
     if (fstatat(to, name, &present, AT_SYMLINK_NOFOLLOW) == 0) {
-      if (S_ISDIR(present.st_mode) && !delete_tree_at(to, name, target_path())) return false;
+      if (S_ISDIR(present.st_mode) &&
+          !delete_tree_at(to, name, target_path(), OtherTypes::kStay, TreeAccess::kPackage)) {
+        return false;
+      }
       // Two names of one file: renaming one to the other would do nothing.
       if (present.st_ino == status.st_ino && present.st_dev == status.st_dev) {
         return unlinkat(from, name, 0) == 0;
@@ -307,8 +345,8 @@ class MovingBack {
   bool copy_file_back(int from, int to, const char *name) {
     struct stat status = {};
     const UniqueFd source = safe_open_file_at(from, name, &status);
-    unlinkat(to, name, 0);
-    UniqueFd copy(openat(to, name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, kCopyMode));
+    unlink_as_package(to, name, 0, user_);
+    UniqueFd copy = open_as_package(to, name, O_WRONLY | O_CREAT, kCopyMode, user_, nullptr);
     bool copied = source && copy;
     std::vector<char> chunk(kCopyChunk);
     while (copied) {
@@ -323,7 +361,7 @@ class MovingBack {
       put_attributes_back(copy.get(), status, key.c_str(), entry);
     }
     if (copied && close(copy.release()) == 0) return true;
-    if (copy) unlinkat(to, name, 0);
+    if (copy) unlink_as_package(to, name, 0, user_);
     return false;
   }
 
@@ -331,16 +369,48 @@ class MovingBack {
   bool move_whole(int from, int to, const char *name) {
     struct stat present = {};
     if (fstatat(to, name, &present, AT_SYMLINK_NOFOLLOW) == 0) {
-      if (S_ISDIR(present.st_mode) || unlinkat(to, name, 0) != 0) return false;
+      if (S_ISDIR(present.st_mode) || unlink_as_package(to, name, 0, user_) != 0) return false;
     }
+    if (!is_open_to_root(to)) return false;
     // The snapshot's table stays where it is until the end.
     if (files_.snapshot_table.compare(0, path_.size() + 1, path_ + "/") == 0) return false;
     return renameat(from, name, to, name) == 0;
   }
 
+  /**
+   * A folder that goes back to somebody else is closed to the application first, and emptied of
+   * what is not its own: whatever it has linked there would count as the other's from then on.
+   * Each of those files comes back from the snapshot.
+   */
+  void take_from_application(int folder) const {
+    json_object *entry = entry_of(table_, path_.substr(files_.snapshot.size() + 1));
+    json_object *owner = nullptr;
+    struct stat status = {};
+    if (entry == nullptr || !json_object_object_get_ex(entry, "1", &owner) ||
+        static_cast<uid_t>(json_object_get_int64(owner)) == user_.uid ||
+        fstat(folder, &status) != 0 || status.st_uid != user_.uid) {
+      return;
+    }
+    if (change_object_owner(folder, 0, 0) < 0 || change_object_mode(folder, status, S_IRWXU) < 0) {
+      LOGE("chown: error \n");
+      return;
+    }
+    std::vector<TreeEntry> entries;
+    list_tree_entries(folder, &entries);
+    for (const TreeEntry &one : entries) {
+      const char *name = one.name.c_str();
+      if (fstatat(folder, name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode) &&
+          status.st_uid != user_.uid) {
+        static_cast<void>(unlinkat(folder, name, 0));
+      }
+    }
+  }
+
   bool enter(TreePlace *source, TreePlace *target, const char *name) {
-    static_cast<void>(mkdirat(target->fd(), name, kFolderMode));  // as a rule it is there
+    // as a rule it is there
+    static_cast<void>(mkdir_as_package(target->fd(), name, kFolderMode, user_));
     if (!target->down(name)) return false;
+    take_from_application(target->fd());
     if (source->down(name)) return true;
     static_cast<void>(target->up());
     return false;
@@ -349,6 +419,7 @@ class MovingBack {
   const restore_files &files_;
   const std::string root_;
   json_object *table_;
+  const package_user user_ = user_of_package();
   std::string path_;
   bool moved_ = true;
 };
@@ -370,7 +441,9 @@ void bring_back_kept(const restore_files &files) {
 }  // namespace
 
 rollback_result put_snapshot_back(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
+  const HeldFolder snapshot(files.snapshot);
   if (state_of_snapshot(files) != snapshot_state::complete) {
     LOGE("there isn't a snapshot of (%s) to roll back to", pkgid);
     return rollback_result::none;
@@ -406,6 +479,7 @@ int rollback_to_initial_app_data(const char *pkgid, const char *root) {
 }
 
 int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
   const JsonPtr table =
       file_exist(files.snapshot_table.c_str()) ? read_table(files.snapshot_table) : nullptr;

@@ -10,6 +10,8 @@
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/disk_sync.h"
+#include "quarn_d_utils/held_folder.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
@@ -22,6 +24,7 @@ constexpr mode_t kCopyMode = 0600;
 constexpr mode_t kFolderMode = 0755;
 constexpr char kAsideName[] = "/table";
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
+constexpr std::size_t kOpenAtOnce = 32;
 
 struct TableRelease {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
@@ -62,19 +65,33 @@ bool remove_own(const std::string &path) {
   }
   if (!is_own_file(status)) return false;
   if (!S_ISDIR(status.st_mode)) return unlinkat(parent.get(), name.c_str(), 0) == 0;
-  return delete_tree_at(parent.get(), name.c_str(), path, OtherTypes::kRemoved);
+  return delete_tree_at(parent.get(), name.c_str(), path, OtherTypes::kRemoved, TreeAccess::kDaemon,
+                        &status);
+}
+
+/** Remove everything in a directory of the daemon's. */
+void delete_entries(int dir, const std::string &path) {
+  const UniqueFd opened(openat(dir, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  std::vector<TreeEntry> entries;
+  if (!opened || !list_tree_entries(opened.get(), &entries)) return;
+  for (const TreeEntry &entry : entries) {
+    const char *name = entry.name.c_str();
+    if (unlinkat(opened.get(), name, 0) == 0) continue;
+    delete_tree_at(opened.get(), name, path + "/" + entry.name, OtherTypes::kRemoved);
+  }
 }
 
 /** An empty snapshot folder; one that is only kept makes way. */
-bool make_snapshot_dir(const restore_files &files) {
+bool make_snapshot_dir(const restore_files &files, std::optional<HeldFolder> *held) {
   if (state_of_snapshot(files) == snapshot_state::told) {
     if (!remove_own(files.aside) || !rename_path(files.snapshot, files.aside)) return false;
   }
   if (!remove_snapshot(files)) return false;
   std::string name;
   const UniqueFd parent = safe_open_parent(files.snapshot.c_str(), &name);
-  return parent && mkdirat(parent.get(), name.c_str(), kSnapshotMode) == 0 &&
-         state_of_snapshot(files) == snapshot_state::incomplete;
+  if (!parent || mkdirat(parent.get(), name.c_str(), kSnapshotMode) != 0) return false;
+  held->emplace(files.snapshot);
+  return state_of_snapshot(files) == snapshot_state::incomplete;
 }
 
 /** Save the table under its name only when it is whole and everything it tells of is on disk. */
@@ -92,20 +109,60 @@ int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
   return sync_directory(folder_of(files.snapshot_table)) ? QUARN_OK : QUARN_REFUSED;
 }
 
+/** Copy what is left of a file, which may have changed its size meanwhile. */
+bool copy_rest(int from, int to, char *buffer, std::size_t size) {
+  while (true) {
+    const ssize_t count = TEMP_FAILURE_RETRY(read(from, buffer, size));
+    if (count <= 0) return count == 0;
+    if (write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
+  }
+}
+
 /** Copy all of a file's bytes: small ones through memory, which costs less than a set-up. */
 bool copy_bytes(int from, int to, off_t size) {
   char buffer[kSmallFile];
   if (size <= static_cast<off_t>(sizeof(buffer))) {
     const ssize_t count = read(from, buffer, sizeof(buffer));
-    return count == size && write(to, buffer, static_cast<std::size_t>(count)) == count;
+    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
+    return count == size || copy_rest(from, to, buffer, sizeof(buffer));
   }
   while (size > 0) {
     const ssize_t count =
         copy_file_range(from, nullptr, to, nullptr, static_cast<std::size_t>(size), 0);
-    if (count <= 0) return false;
+    if (count <= 0) return copy_rest(from, to, buffer, sizeof(buffer));
     size -= count;
   }
   return true;
+}
+
+/**
+ * What a walk has found under one name: a file that is open for reading, where that is allowed,
+ * or a descriptor that tells what else it is.
+ */
+struct Found {
+  TreeEntry *entry = nullptr;
+  UniqueFd object;
+  struct stat status = {};
+  bool readable = false;
+};
+
+/** Open an entry as the package's user. */
+Found find_entry(int dir, TreeEntry *entry) {
+  constexpr int kRead = O_RDONLY | O_NONBLOCK | O_NOCTTY;
+  const package_user user = user_of_package();
+  const char *name = entry->name.c_str();
+  Found found;
+  found.entry = entry;
+  if (entry->type == DT_REG || entry->type == DT_UNKNOWN) {
+    found.object = open_as_package(dir, name, kRead | O_NOATIME, 0, user, &found.status);
+    if (!found.object && errno == EPERM) {
+      found.object = open_as_package(dir, name, kRead, 0, user, &found.status);
+    }
+    found.readable = found.object && S_ISREG(found.status.st_mode);
+    if (found.readable) return found;
+  }
+  found.object = open_as_package(dir, name, O_PATH, 0, user, &found.status);
+  return found;
 }
 
 /** Copies one package's directories into its snapshot. */
@@ -121,7 +178,8 @@ class SnapshotCopy {
 
   /** @return true when everything below @p dir was recorded and copied */
   bool copy(const std::string &dir) {
-    TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+    TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                    TreeAccess::kPackage);
     if (!place) {
       LOGE("error : cannot open this path %s", dir.c_str());
       return false;
@@ -162,50 +220,81 @@ class SnapshotCopy {
       copied_ = false;
     }
     UniqueFd target;  // made with the first file that is copied into it
-    for (TreeEntry &entry : entries) {
-      const PathStep step(&path_, entry.name.c_str());
-      // by the names of this package, and by the folder that the copies go to
-      if (files_.is_skipped(path_) || path_.compare(0, snapshot_.size(), snapshot_) == 0) continue;
-      restore_step("snapshot-entry");
-      if (copy_entry(dir, entry, &target)) folders.push_back(std::move(entry.name));
+    for (std::size_t at = 0; at < entries.size();) {
+      restore_step("snapshot-folder");
+      for (const Found &found : find_some(dir, &entries, &at)) {
+        const PathStep step(&path_, found.entry->name.c_str());
+        restore_step("snapshot-entry");
+        if (copy_entry(found, &target)) folders.push_back(std::move(found.entry->name));
+      }
     }
     return folders;
   }
 
+  /** Open the next entries of a folder together, for a change of identity costs as much as one. */
+  std::vector<Found> find_some(int dir, std::vector<TreeEntry> *entries, std::size_t *at) {
+    const ActAsPackage acting;
+    std::vector<Found> some;
+    while (*at < entries->size() && some.size() < kOpenAtOnce) {
+      TreeEntry *entry = &(*entries)[(*at)++];
+      const PathStep step(&path_, entry->name.c_str());
+      // by the names of this package, and by the folder that the copies go to
+      if (files_.is_skipped(path_) || path_.compare(0, snapshot_.size(), snapshot_) == 0) continue;
+      some.push_back(find_entry(dir, entry));
+    }
+    return some;
+  }
+
   /** Record one entry and copy it when it is a file. @return true for a directory */
-  bool copy_entry(int dir, const TreeEntry &entry, UniqueFd *target) {
-    const char *name = entry.name.c_str();
-    struct stat status = {};
-    UniqueFd object;  // what the directory calls a file need not be looked at twice
-    if (entry.type == DT_REG) object = safe_open_file_at(dir, name, &status);
-    if (!object) {
-      const int found = fstatat(dir, name, &status, AT_SYMLINK_NOFOLLOW);
-      if (found != 0) {
-        LOGE("error : lstat for %d %s", found, path_.c_str());
-        return false;
-      }
+  bool copy_entry(const Found &found, UniqueFd *target) {
+    const struct stat &status = found.status;
+    if (!found.object) {
+      LOGE("error : lstat for %d %s", -1, path_.c_str());
+      return false;
     }
     if (!S_ISDIR(status.st_mode) && !S_ISREG(status.st_mode)) {
       LOGE("this is unexpected type : %s", path_.c_str());
       return false;
     }
-    // A path may be longer than the kernel takes: the label is read by a descriptor.
-    if (S_ISDIR(status.st_mode)) object.reset(openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    if (keep_unreadable(found, target)) return false;
     int error = QUARN_OK;
-    add_to_file_info_table(table_, root_.c_str(), path_.c_str(), status, &error, object.get());
+    add_to_file_info_table(table_, root_.c_str(), path_.c_str(), status, &error,
+                           found.object.get());
     if (error != QUARN_OK) copied_ = false;
     if (S_ISDIR(status.st_mode)) return true;
     // A table that lies in the data would make the snapshot look complete before it is.
-    if (path_ != files_.table) copy_regular(object, status, target, name);
+    if (path_ != files_.table) copy_regular(found, target);
     return false;
   }
 
-  void copy_regular(const UniqueFd &file, const struct stat &status, UniqueFd *target,
-                    const char *name) {
+  /**
+   * Keep a file by a second name: somebody else's, which the application cannot read, so that
+   * nothing of it may be copied or changed. It goes back as what it is.
+   */
+  bool keep_unreadable(const Found &found, UniqueFd *target) {
+    if (!S_ISREG(found.status.st_mode) || found.readable ||
+        found.status.st_uid == user_of_package().uid) {
+      return false;
+    }
     if (!*target) *target = make_folder(path_.substr(root_.size() + 1));
-    if (file && *target && copy_open_file(file, status, target->get(), name)) return;
+    if (*target && linkat(AT_FDCWD, own_fd_path(found.object.get()).c_str(), target->get(),
+                          found.entry->name.c_str(), AT_SYMLINK_FOLLOW) == 0) {
+      // known to the table, which has no attributes for it
+      json_object_object_add(table_->root, path_.c_str() + root_.size() + 1,
+                             json_object_new_object());
+      if (stamps_ != nullptr) stamps_->add(found.status);
+      return true;
+    }
+    return false;
+  }
+
+  void copy_regular(const Found &found, UniqueFd *target) {
+    if (!*target) *target = make_folder(path_.substr(root_.size() + 1));
+    if (found.readable && *target &&
+        copy_open_file(found.object, found.status, target->get(), found.entry->name.c_str())) {
+      return;
+    }
     const std::string copy = snapshot_ + path_.substr(root_.size());
-    if (*target && copy_file(path_.c_str(), copy.c_str())) return;
     LOGE("fail copy : from %s to %s", path_.c_str(), copy.c_str());
     copied_ = false;
   }
@@ -287,7 +376,14 @@ snapshot_state state_of_snapshot(const restore_files &files) {
   return file_exist(files.told.c_str()) ? snapshot_state::told : snapshot_state::incomplete;
 }
 
-bool remove_snapshot(const restore_files &files) { return remove_own(files.snapshot); }
+bool remove_snapshot(const restore_files &files) {
+  const HeldFolder snapshot(files.snapshot);
+  // The application may have given it another name: what it holds goes all the same.
+  if (snapshot && !snapshot.is_in_place() && state_of_snapshot(files) != snapshot_state::foreign) {
+    delete_entries(snapshot.fd(), files.snapshot);
+  }
+  return remove_own(files.snapshot);
+}
 
 bool set_own_table_aside(const restore_files &files) {
   struct stat status = {};
@@ -331,7 +427,9 @@ bool keep_told_snapshot(const restore_files &files) {
 }
 
 bool discard_snapshot(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
+  const HeldFolder snapshot(files.snapshot);
   // Without its table a half-deleted snapshot is never taken for a whole one.
   if (state_of_snapshot(files) == snapshot_state::complete) {
     const auto skipped = [&](const std::string &path) { return files.is_skipped(path); };
@@ -351,7 +449,7 @@ bool discard_snapshot(const char *pkgid, const char *root) {
   return true;
 }
 
-int temp_backup_initial_app_data(const char *pkgid, const char *root) {
+int take_snapshot(const char *pkgid, const char *root, std::optional<HeldFolder> *held) {
   const restore_files files(pkgid, root);
   file_info_table_h *raw = nullptr;
   ready_file_info_table(&raw);
@@ -361,7 +459,7 @@ int temp_backup_initial_app_data(const char *pkgid, const char *root) {
     return QUARN_REFUSED;
   }
   restore_step("snapshot");
-  if (!make_snapshot_dir(files)) {
+  if (!make_snapshot_dir(files, held)) {
     LOGE("fail to make snapshot directory : %s", files.snapshot.c_str());
     return QUARN_REFUSED;
   }
@@ -370,7 +468,7 @@ int temp_backup_initial_app_data(const char *pkgid, const char *root) {
   for (const auto &dir : files.dirs) {
     if (!copy.copy(dir)) {
       LOGE("fail to temp backup : %s", dir.c_str());
-      clear_directory(files.snapshot.c_str(), true);
+      remove_snapshot(files);
       return QUARN_REFUSED;
     }
   }
@@ -383,6 +481,12 @@ int temp_backup_initial_app_data(const char *pkgid, const char *root) {
   }
   restore_step("snapshot-complete");
   return QUARN_OK;
+}
+
+int temp_backup_initial_app_data(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
+  std::optional<HeldFolder> snapshot;
+  return take_snapshot(pkgid, root, &snapshot);
 }
 
 int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,

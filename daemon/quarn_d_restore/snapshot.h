@@ -13,11 +13,13 @@
 #include <sys/stat.h>
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/held_folder.h"
 
 enum class snapshot_state {
   none,
@@ -27,6 +29,13 @@ enum class snapshot_state {
   told        /**< kept for whoever wants it; the present data counts */
 };
 snapshot_state state_of_snapshot(const restore_files &files);
+
+/**
+ * Copy the package's data aside. Its root is held by the caller; @p held is the
+ * snapshot, in which everything that follows finds it, whatever the application
+ * does with the name. @return 0, 36, or what writing the table gave
+ */
+int take_snapshot(const char *pkgid, const char *root, std::optional<HeldFolder> *held);
 
 enum class rollback_result {
   none,  /**< there was no snapshot to roll back to */

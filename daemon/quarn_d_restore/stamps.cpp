@@ -9,8 +9,11 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/disk_sync.h"
+#include "quarn_d_utils/held_folder.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
-#include "quarn_d_utils/tree_place.h"
+#include "quarn_d_utils/tree_walk.h"
+#include "quarn_d_utils/unpacked_file.h"
 #include "quarn_d_utils/working_files.h"
 
 namespace {
@@ -55,6 +58,7 @@ class DataWalk {
   /** @p visit gets path and status, and goes on while it answers true. */
   template <typename Visit>
   void run(Visit visit) {
+    const ActAsPackage acting;
     for (const auto &dir : files_.dirs) {
       if (!walk(dir, visit)) return;
     }
@@ -63,25 +67,14 @@ class DataWalk {
  private:
   template <typename Visit>
   bool walk(const std::string &dir, Visit &visit) {
-    TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
-    if (!place) return true;
-    std::string path = dir;
-    std::vector<std::vector<std::string>> pending(1);
-    if (!scan(place.fd(), path, visit, &pending.back())) return false;
-    while (true) {
-      if (pending.back().empty()) {
-        pending.pop_back();
-        if (pending.empty() || !place.up()) return true;
-        path.resize(path.rfind('/'));
-        continue;
-      }
-      const std::string name = std::move(pending.back().back());
-      pending.back().pop_back();
-      if (!place.down(name.c_str())) continue;
-      path += "/" + name;
-      pending.emplace_back();
-      if (!scan(place.fd(), path, visit, &pending.back())) return false;
-    }
+    bool wanted = true;
+    walk_tree(TreePlace(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                        TreeAccess::kPackage),
+              dir, [&](int fd, const std::string &path, TreeFolders *folders) {
+                wanted = scan(fd, path, visit, folders);
+                return wanted;
+              });
+    return wanted;
   }
 
   template <typename Visit>
@@ -92,7 +85,7 @@ class DataWalk {
       const std::string path = folder + "/" + entry.name;
       if (files_.is_skipped(path) || path == files_.table) continue;
       struct stat status = {};
-      if (fstatat(dir, entry.name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) continue;
+      if (status_as_package(dir, entry.name.c_str(), user_of_package(), &status) != 0) continue;
       if (S_ISDIR(status.st_mode)) {
         folders->push_back(std::move(entry.name));
       } else if (S_ISREG(status.st_mode) && !is_own_leftover(entry.name.c_str(), status) &&
@@ -150,6 +143,7 @@ bool StampWriter::finish() {
 }
 
 bool note_unpacked_files(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
   StampWriter stamps(files.unpacked);
   DataWalk(files).run([&](const std::string &, const struct stat &status) {
@@ -168,10 +162,8 @@ bool application_has_written(const restore_files &files, std::string *path) {
   bool written = false;
   DataWalk(files).run([&](const std::string &file, const struct stat &status) {
     if (std::binary_search(known.begin(), known.end(), file_stamp(status))) return true;
-    // What the unpacking makes is the daemon's alone until all of it is noted.
-    if (!unpacked && status.st_uid == geteuid() && (status.st_mode & ALLPERMS) == kPrivateFile) {
-      return true;
-    }
+    // What the unpacking makes nobody opens until all of it is noted.
+    if (!unpacked && is_being_unpacked(status)) return true;
     *path = file;
     written = true;
     return false;

@@ -8,15 +8,23 @@
 #include "quarn_d_restore/archive_table.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/settle.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/held_folder.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_text.h"
-#include "quarn_d_utils/tree_place.h"
+#include "quarn_d_utils/tree_walk.h"
+#include "quarn_d_utils/unpacked_file.h"
 #include "quarn_log.h"
 
 namespace {
 
 using Transaction = Handle<security_server_transaction, &security_server_perm_abort>;
+
+constexpr mode_t kFolderMode = 0755;
+constexpr mode_t kSettledMode = 0600;
+constexpr char kLinkListKey[] = "quarn_symbolic_info";
 
 /** What stays the same in the walk over one package. */
 struct walk_context {
@@ -26,28 +34,33 @@ struct walk_context {
   restore_files files;
 };
 
-bool same_object(const struct stat &a, const struct stat &b) {
-  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
-}
-
 /** A directory of the walk, which follows: its name, and what was looked at. */
 using Found = std::vector<std::pair<std::string, struct stat>>;
 
 /** What an entry is, and a descriptor to change it by; none, with errno, when it is gone. */
-UniqueFd open_entry(int dir, const TreeEntry &entry, struct stat *status) {
-  UniqueFd object;
-  // The label of a file that is open is read without a walk to it.
-  if (entry.type == DT_REG) object = safe_open_file_at(dir, entry.name.c_str(), status);
-  if (object) return object;
-  object.reset(openat(dir, entry.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-  if (object && fstat(object.get(), status) != 0) return {};
-  return object;
+UniqueFd find_entry(int dir, const TreeEntry &entry, struct stat *status) {
+  return open_as_package(dir, entry.name.c_str(), O_PATH, 0, user_of_package(), status);
+}
+
+/** Give an object its attributes when it is the application's, not put there from elsewhere. */
+bool restore_object(const walk_context &ctx, int dir, int object, const struct stat &status,
+                    const std::string &path) {
+  if (!may_be_changed(dir, object, status, user_of_package())) {
+    LOGE("refused : %s is a link to a file elsewhere", path.c_str());
+    return false;
+  }
+  return restore_object_info(object, status, path.c_str(), ctx.pkgid, ctx.root, ctx.table) != 0;
+}
+
+bool is_empty_folder(const std::string &path) {
+  const ActAsRoot root;
+  return is_empty_directory(path.c_str());
 }
 
 int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, const std::string &path,
                   Found *found) {
   struct stat status = {};
-  const UniqueFd object = open_entry(dir, entry, &status);
+  const UniqueFd object = find_entry(dir, entry, &status);
   if (!object) {
     const bool vanished = errno == ENOENT;
     LOGE("error : lstat for %d %s", -1, path.c_str());
@@ -56,10 +69,8 @@ int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, cons
   if (S_ISLNK(status.st_mode)) return 1;
   if (S_ISDIR(status.st_mode)) {
     found->emplace_back(entry.name, status);
-    if (restore_object_info(object.get(), status, path.c_str(), ctx.pkgid, ctx.root, ctx.table)) {
-      return 1;
-    }
-    if (is_empty_directory(path.c_str())) {
+    if (restore_object(ctx, dir, object.get(), status, path)) return 1;
+    if (is_empty_folder(path)) {
       LOGI("it is empty folder : %s", path.c_str());
       return 1;
     }
@@ -67,9 +78,7 @@ int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, cons
     return 0;
   }
   if (S_ISREG(status.st_mode)) {
-    if (restore_object_info(object.get(), status, path.c_str(), ctx.pkgid, ctx.root, ctx.table)) {
-      return 1;
-    }
+    if (restore_object(ctx, dir, object.get(), status, path)) return 1;
     LOGE("fail to restore file info : %s", path.c_str());
     return 0;
   }
@@ -94,13 +103,15 @@ int restore_folder(const walk_context &ctx, int dir, std::string *path, Found *f
 bool enter_checked(TreePlace *place, const std::string &name, const struct stat &checked) {
   struct stat opened = {};
   if (!place->down(name.c_str())) return false;
-  if (fstat(place->fd(), &opened) == 0 && same_object(checked, opened)) return true;
+  if (fstat(place->fd(), &opened) == 0 && is_same_object(checked, opened)) return true;
   static_cast<void>(place->up());
   return false;
 }
 
 int walk_directory(const walk_context &ctx, const std::string &dir) {
-  TreePlace place(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
+  const ActAsPackage acting;
+  TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                  TreeAccess::kPackage);
   if (!place) {
     LOGE("error : cannot open this path %s", dir.c_str());
     return 0;
@@ -133,8 +144,15 @@ int walk_directory(const walk_context &ctx, const std::string &dir) {
 
 /** Read the table and remove its file; null with the reason logged. */
 JsonPtr take_table(const std::string &path) {
-  if (!file_exist(path.c_str())) {
+  const HeldFile table_file(path);
+  struct stat status = {};
+  if (safe_lstat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
     LOGE("there isn't file-info file...");
+    return nullptr;
+  }
+  if (!is_own_file(status) || status.st_nlink != 1) {  // the application has exchanged it
+    LOGE("cannot read file-info file...");
+    delete_file(path.c_str());
     return nullptr;
   }
   archive_table found = read_archive_table(path.c_str());
@@ -184,7 +202,28 @@ bool relabel_directories(const char *pkgid, const restore_files &files) {
   return true;
 }
 
+/** Give the unpacked files of one folder that have no attributes those of any new file. */
+bool settle_folder(int dir, const std::string &path, const restore_files &files, const char *label,
+                   TreeFolders *folders) {
+  const package_user user = user_of_package();
+  std::vector<TreeEntry> entries;
+  list_tree_entries(dir, &entries);
+  for (TreeEntry &entry : entries) {
+    if (files.is_skipped(path + "/" + entry.name)) continue;
+    struct stat status = {};
+    const UniqueFd object = open_as_package(dir, entry.name.c_str(), O_PATH, 0, user, &status);
+    if (object && S_ISDIR(status.st_mode)) folders->push_back(std::move(entry.name));
+    if (!object || !is_being_unpacked(status) || status.st_uid != user.uid) continue;
+    if (change_object_mode(object.get(), status, kSettledMode) < 0) LOGE("chmod failed");
+    if (label == nullptr) continue;
+    const ActAsRoot root;
+    static_cast<void>(smack_setlabel(own_fd_path(object.get()).c_str(), label, SMACK_LABEL_ACCESS));
+  }
+  return true;
+}
+
 bool restore_tree(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
   restore_step("table");
   const JsonPtr table = take_table(files.table);
@@ -242,12 +281,30 @@ bool stays_below(const std::string &name) {
   return framed.find("/../") == std::string::npos;
 }
 
+/** Make the folders that a link lies in, as the package's. */
+bool make_parents(const std::string &path) {
+  const HeldFolder *package = HeldFolder::of(path.c_str());
+  if (package == nullptr || !*package) return false;
+  const package_user user = user_of_package();
+  std::string below = package->below(path.c_str());
+  UniqueFd at = package->reopen(O_PATH | O_DIRECTORY);
+  for (std::size_t end = below.find('/'); at && end != std::string::npos; end = below.find('/')) {
+    const std::string name = below.substr(0, end);
+    below.erase(0, end + 1);
+    if (name.empty() || name == ".") continue;
+    static_cast<void>(mkdir_as_package(at.get(), name.c_str(), kFolderMode, user));
+    at = open_as_package(at.get(), name.c_str(), O_PATH | O_DIRECTORY, 0, user, nullptr);
+  }
+  return static_cast<bool>(at);
+}
+
 void make_link(const std::string &path, const stored_link &link) {
   std::string name;
   UniqueFd parent;
   UniqueFd object;
   struct stat status = {};
-  if (create_directory_of_file(path.c_str())) parent = safe_open_parent(path.c_str(), &name);
+  const ActAsPackage acting;
+  if (make_parents(path)) parent = safe_open_parent(path.c_str(), &name);
   if (parent && symlinkat(link.target, parent.get(), name.c_str()) == 0) {
     object.reset(openat(parent.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
   }
@@ -261,6 +318,7 @@ void make_link(const std::string &path, const stored_link &link) {
     LOGE("error : there isn't smack info of %s", path.c_str());
     return;
   }
+  const ActAsRoot root;
   const std::string labelled = fd_path(parent.get()) + "/" + name;
   const int result = smack_lsetlabel(labelled.c_str(), link.label, SMACK_LABEL_ACCESS);
   if (result != 0) LOGE("fail : smack_lsetlabel for %s (err=%d)", path.c_str(), result);
@@ -276,13 +334,33 @@ int restore_app_info(const char *pkgid, const char *root) {
   return 0;
 }
 
+void settle_unpacked_files(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
+  const restore_files files(pkgid, root);
+  for (const auto &dir : files.dirs) {
+    TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                    TreeAccess::kPackage);
+    CString label;
+    if (place &&
+        smack_getlabel(own_fd_path(place.fd()).c_str(), out(label), SMACK_LABEL_ACCESS) != 0) {
+      label.reset();
+    }
+    const ActAsPackage acting;
+    walk_tree(std::move(place), dir, [&](int fd, const std::string &path, TreeFolders *folders) {
+      return settle_folder(fd, path, files, label.get(), folders);
+    });
+  }
+}
+
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table) {
+  const HeldFolder package(root);
   const walk_context ctx{pkgid, root, table, restore_files(pkgid, root)};
   return walk_directory(ctx, dir);
 }
 
 int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table) {
+  const HeldFolder package(root);
   json_object *list = nullptr;
   if (!json_object_object_get_ex(table, kLinkListKey, &list) ||
       !json_object_is_type(list, json_type_array)) {
@@ -302,6 +380,7 @@ int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table)
 }
 
 void clear_app_dir(const char *pkgid, const char *root) {
+  const HeldFolder package(root);
   const restore_files files(pkgid, root);
   LOGI("clearing app data backup directory");
   clear_directory(files.dirs[0].c_str(), false);

@@ -116,9 +116,7 @@ UniqueFd open_looked_at(int dir, const char *name, int flags, const package_user
     return {};
   }
   if (!S_ISREG(status->st_mode) && !S_ISDIR(status->st_mode)) return refuse();
-  if (status->st_uid != user.uid && !lies_by_others_doing(dir, object.get(), *status, user)) {
-    return refuse();
-  }
+  if (!may_be_changed(dir, object.get(), *status, user)) return refuse();
   UniqueFd opened(open(own_fd_path(object.get()).c_str(), (flags & ~O_NOFOLLOW) | O_CLOEXEC));
   if (opened && fstat(opened.get(), status) != 0) return {};
   return opened;
@@ -222,6 +220,18 @@ UniqueFd open_below_as_package(int dir, const char *path, int flags, mode_t mode
     at = held.get();
     begin = end + 1;
   }
+}
+
+int status_as_package(int dir, const char *name, const package_user &user, struct stat *status) {
+  const ActAsPackage acting(user);
+  const int result = fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+  if (result == 0 || errno != EACCES) return result;
+  const ActAsRoot root;
+  return fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+}
+
+bool may_be_changed(int dir, int object, const struct stat &status, const package_user &user) {
+  return status.st_uid == user.uid || lies_by_others_doing(dir, object, status, user);
 }
 
 int mkdir_as_package(int dir, const char *name, mode_t mode, const package_user &user) {

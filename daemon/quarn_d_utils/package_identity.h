@@ -114,6 +114,17 @@ UniqueFd open_as_package(int dir, const char *name, int flags, mode_t mode,
 UniqueFd open_below_as_package(int dir, const char *path, int flags, mode_t mode,
                                const package_user &user, struct stat *status);
 
+/** lstat() of an entry, also in a folder that its user has closed to itself. @return 0 or -1 */
+int status_as_package(int dir, const char *name, const package_user &user, struct stat *status);
+
+/**
+ * True when root may change owner, mode or label of an open object (O_PATH is
+ * enough) that lies in the directory @p dir: the user's own, or one of somebody
+ * else's that open_as_package() would open.
+ * @param status of @p object
+ */
+bool may_be_changed(int dir, int object, const struct stat &status, const package_user &user);
+
 /**
  * mkdirat(), unlinkat() and renameat() as the package's user. On EACCES alone
  * they are done all the same, new folders still being that user's, where the

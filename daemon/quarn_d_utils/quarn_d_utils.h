@@ -157,8 +157,9 @@ struct unzip_report {
 };
 
 /**
- * Unpack an archive below @p destination: files are created new, mode 0600,
- * whatever lay in their place. Takes no PackageDataLock. Entries that
+ * Unpack an archive below @p destination: files are created new, the
+ * package's own and as unpacked_file.h says, whatever lay in their place; the table is
+ * root's, mode 0600. Takes no PackageDataLock. Entries that
  * are refused or fail are logged and left out; @p report tells how many.
  * Entries that name a folder make it, and cost nothing where that is refused.
  * @return 0, 14, or 31 for an archive that cannot be opened, is empty, or

@@ -10,6 +10,8 @@
 #include <cstring>
 #include <vector>
 
+#include "quarn_d_utils/held_folder.h"
+
 namespace {
 
 constexpr int kMaxLinks = 40;  // the kernel's own limit
@@ -54,11 +56,39 @@ UniqueFd fail(int error) {
 
 enum class Missing { kFails, kIsMade };
 
+constexpr int kPlace = O_PATH | O_DIRECTORY | O_CLOEXEC;
+
+/** Where the way to an absolute path begins: a held folder, or the root of all. */
+class Start {
+ public:
+  explicit Start(const char *path)
+      : folder_(HeldFolder::of(path)), path_(is_root() ? path : folder_->below(path)) {}
+  /** False below a held folder that there is not. */
+  explicit operator bool() const { return is_root() || static_cast<bool>(*folder_); }
+  bool is_root() const { return folder_ == nullptr; }
+  int dir() const { return is_root() ? AT_FDCWD : folder_->fd(); }
+  const char *path() const { return path_; }
+
+ private:
+  const HeldFolder *folder_;
+  const char *path_;
+};
+
+/** Open without a link on the way; none, with errno, also where there is a trusted one. */
+UniqueFd open_from_start(const char *path, int flags, mode_t mode) {
+  const Start start(path);
+  if (!start) return fail(ENOENT);
+  const std::uint64_t below = start.is_root() ? 0 : RESOLVE_BENEATH;
+  return UniqueFd(open_without_links(start.dir(), start.path(), flags, mode, below));
+}
+
 /** Walk to the directory @p path, following trusted links only. */
 UniqueFd walk_to_directory(const std::string &path, Missing missing, mode_t mode) {
-  UniqueFd current(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  const Start start(path.c_str());
+  if (!start) return fail(ENOENT);
+  UniqueFd current(openat(start.dir(), start.is_root() ? "/" : ".", kPlace));
   std::vector<std::string> rest;  // the next component is the last of it
-  push_components(&rest, path);
+  push_components(&rest, start.path());
   int links = 0;
   while (current && !rest.empty()) {
     const std::string name = std::move(rest.back());
@@ -81,7 +111,7 @@ UniqueFd walk_to_directory(const std::string &path, Missing missing, mode_t mode
       const std::string text(target, static_cast<std::size_t>(length));
       push_components(&rest, text);
       if (!text.empty() && text[0] == '/') {
-        current.reset(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+        current.reset(open("/", kPlace));
       }
       continue;
     }
@@ -149,8 +179,11 @@ UniqueFd walk_below(int dir, const char *path, Missing missing, mode_t mode, std
 
 UniqueFd safe_open(const char *path, int flags, mode_t mode) {
   if (path == nullptr || path[0] != '/') return fail(EINVAL);
+  if (const HeldFolder *held = HeldFolder::of(path); held != nullptr && held->is_at(path)) {
+    return held->reopen(flags);
+  }
   if (!openat2_missing) {
-    UniqueFd fd(open_without_links(AT_FDCWD, path, flags, mode, 0));
+    UniqueFd fd = open_from_start(path, flags, mode);
     if (fd || (errno != ELOOP && !no_openat2(errno))) return fd;
   }
   std::string parent;
@@ -170,7 +203,7 @@ UniqueFd safe_open_parent(const char *path, std::string *name) {
   std::string parent;
   if (!split_path(path, &parent, name)) return {};
   if (!openat2_missing) {
-    UniqueFd fd(open_without_links(AT_FDCWD, parent.c_str(), O_PATH | O_DIRECTORY, 0, 0));
+    UniqueFd fd = open_from_start(parent.c_str(), O_PATH | O_DIRECTORY, 0);
     // ENOTDIR: the parent itself may be a link that is to be followed
     if (fd || (errno != ELOOP && errno != ENOTDIR && !no_openat2(errno))) return fd;
   }

@@ -4,8 +4,9 @@
  *
  * A symbolic link in a path is followed only when root owns both the link and
  * the directory it lies in, and nobody else may write that directory: such a
- * link is the device maker's, any other could be an application's. All
- * functions set errno on failure and log nothing. Any thread.
+ * link is the device maker's, any other could be an application's. A path at or
+ * below a folder that the thread holds is reached from that folder, see
+ * held_folder.h. All functions set errno on failure and log nothing. Any thread.
  */
 #ifndef QUARN_D_UTILS_SAFE_PATH_H
 #define QUARN_D_UTILS_SAFE_PATH_H

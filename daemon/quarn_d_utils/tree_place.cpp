@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
@@ -16,18 +17,29 @@ namespace {
 
 constexpr int kFolderFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
 
-bool is_regular_at(int dir, const char *name) {
-  struct stat status = {};
-  return fstatat(dir, name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode);
+int status_of(int dir, const char *name, TreeAccess access, struct stat *status) {
+  if (access == TreeAccess::kDaemon) return fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
+  return status_as_package(dir, name, user_of_package(), status);
 }
 
-bool delete_entry(int dir, const char *name, OtherTypes others) {
-  if (others == OtherTypes::kRemoved) return unlinkat(dir, name, 0) == 0;
-  if (!is_regular_at(dir, name)) {
+UniqueFd open_folder(int dir, const char *name, TreeAccess access) {
+  if (access == TreeAccess::kDaemon) return UniqueFd(openat(dir, name, kFolderFlags));
+  return open_as_package(dir, name, kFolderFlags, 0, user_of_package(), nullptr);
+}
+
+int remove_name(int dir, const char *name, int flags, TreeAccess access) {
+  if (access == TreeAccess::kDaemon) return unlinkat(dir, name, flags);
+  return unlink_as_package(dir, name, flags, user_of_package());
+}
+
+bool delete_entry(int dir, const char *name, OtherTypes others, TreeAccess access) {
+  if (others == OtherTypes::kRemoved) return remove_name(dir, name, 0, access) == 0;
+  struct stat status = {};
+  if (status_of(dir, name, access, &status) != 0 || !S_ISREG(status.st_mode)) {
     LOGE("file is not exist");
     return false;
   }
-  if (unlinkat(dir, name, 0) == 0) return true;
+  if (remove_name(dir, name, 0, access) == 0) return true;
   LOGE("file was not deleted");
   return false;
 }
@@ -35,12 +47,14 @@ bool delete_entry(int dir, const char *name, OtherTypes others) {
 /** Removes one tree bottom up; a directory's folders are remembered while it is open. */
 class Removal {
  public:
-  Removal(int parent, std::string path, OtherTypes others)
-      : place_(UniqueFd(openat(parent, ".", kFolderFlags))),
+  Removal(int parent, std::string path, OtherTypes others, TreeAccess access)
+      : place_(open_folder(parent, ".", access), access),
         path_(std::move(path)),
-        others_(others) {}
+        others_(others),
+        access_(access) {}
 
-  bool run(const char *name) {
+  bool run(const char *name, const struct stat *looked_at) {
+    if (looked_at != nullptr && !is_at(name, *looked_at)) return false;
     if (!enter(name)) return false;
     while (true) {
       Level &level = levels_.back();
@@ -73,10 +87,19 @@ class Removal {
     levels_.back().deleted = false;
   }
 
+  /** Go into the folder that was looked at, and no other. */
+  bool is_at(const char *name, const struct stat &looked_at) {
+    struct stat opened = {};
+    if (!place_ || !place_.down(name)) return false;
+    entered_ = true;
+    return fstat(place_.fd(), &opened) == 0 && is_same_object(opened, looked_at);
+  }
+
   /** Go into a folder and delete what is no folder in it. */
   bool enter(const char *name) {
     std::vector<TreeEntry> entries;
-    if (!place_ || !place_.down(name) || !list_tree_entries(place_.fd(), &entries)) {
+    if (!place_ || !(std::exchange(entered_, false) || place_.down(name)) ||
+        !list_tree_entries(place_.fd(), &entries)) {
       const GErrorPtr error(g_error_new(G_FILE_ERROR, g_file_error_from_errno(errno),
                                         "Error opening directory “%s”: %s", path_.c_str(),
                                         g_strerror(errno)));
@@ -87,13 +110,13 @@ class Removal {
     level.name = name;
     for (TreeEntry &entry : entries) {
       struct stat status = {};
-      const bool folder = entry.type == DT_DIR || (entry.type == DT_UNKNOWN &&
-                                                   fstatat(place_.fd(), entry.name.c_str(), &status,
-                                                           AT_SYMLINK_NOFOLLOW) == 0 &&
-                                                   S_ISDIR(status.st_mode));
+      const bool folder = entry.type == DT_DIR ||
+                          (entry.type == DT_UNKNOWN &&
+                           status_of(place_.fd(), entry.name.c_str(), access_, &status) == 0 &&
+                           S_ISDIR(status.st_mode));
       if (folder) {
         level.folders.push_back(std::move(entry.name));
-      } else if (!delete_entry(place_.fd(), entry.name.c_str(), others_)) {
+      } else if (!delete_entry(place_.fd(), entry.name.c_str(), others_, access_)) {
         LOGE("fail to delete file : %s", (path_ + "/" + entry.name).c_str());
         level.deleted = false;
       }
@@ -107,7 +130,7 @@ class Removal {
     const Level level = std::move(levels_.back());
     levels_.pop_back();
     lost_ = !place_.up();
-    if (!lost_ && unlinkat(place_.fd(), level.name.c_str(), AT_REMOVEDIR) == 0) {
+    if (!lost_ && remove_name(place_.fd(), level.name.c_str(), AT_REMOVEDIR, access_) == 0) {
       return level.deleted;
     }
     LOGE("Directory delete was failed");
@@ -117,19 +140,21 @@ class Removal {
   TreePlace place_;
   std::string path_;
   const OtherTypes others_;
+  const TreeAccess access_;
   std::vector<Level> levels_;
+  bool entered_ = false;
   bool lost_ = false;
 };
 
 }  // namespace
 
-TreePlace::TreePlace(UniqueFd top) : here_(std::move(top)) {
+TreePlace::TreePlace(UniqueFd top, TreeAccess access) : here_(std::move(top)), access_(access) {
   struct stat status = {};
   if (here_ && fstat(here_.get(), &status) == 0) identity_ = {status.st_dev, status.st_ino};
 }
 
 bool TreePlace::down(const char *name) {
-  UniqueFd next(openat(here_.get(), name, kFolderFlags));
+  UniqueFd next = open_folder(here_.get(), name, access_);
   struct stat status = {};
   if (!next || fstat(next.get(), &status) != 0) return false;
   above_.push_back(identity_);
@@ -140,6 +165,10 @@ bool TreePlace::down(const char *name) {
 
 bool TreePlace::up() {
   UniqueFd next(openat(here_.get(), "..", kFolderFlags));
+  if (!next && errno == EACCES && access_ == TreeAccess::kPackage) {
+    const ActAsRoot root;  // back to where the walk has been, which is made sure of
+    next.reset(openat(here_.get(), "..", kFolderFlags));
+  }
   struct stat status = {};
   if (!next || fstat(next.get(), &status) != 0) return false;
   if (above_.empty() || above_.back().device != status.st_dev ||
@@ -166,6 +195,10 @@ bool list_tree_entries(int dir, std::vector<TreeEntry> *entries) {
   return true;
 }
 
-bool delete_tree_at(int parent, const char *name, const std::string &path, OtherTypes others) {
-  return Removal(parent, path, others).run(name);
+bool delete_tree_at(int parent, const char *name, const std::string &path, OtherTypes others,
+                    TreeAccess access, const struct stat *looked_at) {
+  Removal removal(parent, path, others, access);
+  if (access == TreeAccess::kDaemon) return removal.run(name, looked_at);
+  const ActAsPackage acting;
+  return acting && removal.run(name, looked_at);
 }

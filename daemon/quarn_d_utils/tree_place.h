@@ -5,12 +5,19 @@
 #ifndef QUARN_D_UTILS_TREE_PLACE_H
 #define QUARN_D_UTILS_TREE_PLACE_H
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <string>
 #include <vector>
 
 #include "quarn_d_utils/handles.h"
+
+/** Whose rights a walk goes by. */
+enum class TreeAccess {
+  kDaemon, /**< its own folders, or those that are nobody's in particular */
+  kPackage /**< the package's user first, see package_identity.h: an application's data */
+};
 
 /**
  * A directory that is open, and the way back to the one where the walk began.
@@ -19,7 +26,7 @@
 class TreePlace {
  public:
   /** @param top the directory to begin in, open for reading; none makes a place that is nowhere */
-  explicit TreePlace(UniqueFd top);
+  explicit TreePlace(UniqueFd top, TreeAccess access = TreeAccess::kDaemon);
 
   explicit operator bool() const { return static_cast<bool>(here_); }
   int fd() const { return here_.get(); }
@@ -37,6 +44,7 @@ class TreePlace {
     ino_t inode;
   };
   UniqueFd here_;
+  const TreeAccess access_;
   Identity identity_ = {};
   std::vector<Identity> above_;
 };
@@ -56,12 +64,19 @@ enum class OtherTypes {
   kRemoved /**< in what is the daemon's own */
 };
 
+/** True where a walk's next step is the directory that was looked at. */
+inline bool is_same_object(const struct stat &a, const struct stat &b) {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
+}
+
 /**
  * Remove the directory @p name of @p parent with everything in it, without a
  * limit to its depth. @p path is its path, for messages.
+ * @param looked_at when not null: only this very directory is removed
  * @return true when all of it is gone
  */
 bool delete_tree_at(int parent, const char *name, const std::string &path,
-                    OtherTypes others = OtherTypes::kStay);
+                    OtherTypes others = OtherTypes::kStay, TreeAccess access = TreeAccess::kDaemon,
+                    const struct stat *looked_at = nullptr);
 
 #endif

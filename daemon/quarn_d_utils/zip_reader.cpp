@@ -12,15 +12,17 @@
 #include "quarn_common.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_reader.h"
+#include "quarn_d_utils/unpacked_file.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr mode_t kFileMode = 0600;
+constexpr mode_t kTableMode = 0600;
 constexpr mode_t kFolderMode = 0755;
 constexpr int kStored = 0;
 constexpr int kRaw = 1;
@@ -201,13 +203,19 @@ CodecResult copy_stored(ByteSource *source, ByteSink *sink, CodecTotals *totals)
   return CodecResult::kDone;
 }
 
-/** Puts the entries of one archive below one root. */
+/**
+ * Puts the entries of one archive below one root. While it lives the thread acts as the package's
+ * user, to whom all but the table belongs from the beginning.
+ */
 class Unpacker {
  public:
   Unpacker(const char *pkg_id, const char *destination)
       : destination_(destination),
         working_(pkg_id, destination),
-        root_(safe_open(destination, O_PATH | O_DIRECTORY)) {}
+        table_(working_.table().substr(destination_.size() + 1)),
+        root_(safe_open(destination, O_PATH | O_DIRECTORY)),
+        user_(user_of_package()),
+        acting_(user_) {}
 
   Extracted extract(ByteSource *source, const unz_file_info64 &info, const char *name) {
     const std::size_t length = std::strlen(name);
@@ -229,7 +237,7 @@ class Unpacker {
       LOGE("calloc() failed, buf is NULL");
       return Extracted::kFailed;
     }
-    UniqueFd file(parent < 0 ? -1 : create(parent, path.c_str() + slash + 1));
+    UniqueFd file = create(parent, path, slash + 1);
     if (!file) {
       LOGE("fopen() failed, file is NULL %s", (destination_ + "/" + path).c_str());
       return Extracted::kFailed;
@@ -249,10 +257,7 @@ class Unpacker {
       refuse(name, why);
       return;
     }
-    if (root_ && safe_open_below(root_.get(), path.c_str(), O_PATH | O_DIRECTORY)) return;
-    const int made = open_parent(path);
-    // the table knows nothing of a folder without files, which is the application's all the same
-    if (made < 0 || fchown(made, kAppUid, kAppGid) != 0) {
+    if (open_parent(path) < 0) {
       LOGE("fail to make folder %s : %d", (destination_ + "/" + path).c_str(), errno);
     }
   }
@@ -302,9 +307,9 @@ class Unpacker {
 
   /** The folder of an entry, made when missing; the last one is kept open. -1 with errno. */
   int open_parent(const std::string &folder) {
+    constexpr int kFlags = O_PATH | O_DIRECTORY;
     if (parent_ && folder == parent_name_) return parent_.get();
-    UniqueFd known(root_ ? safe_open_below(root_.get(), folder.c_str(), O_RDONLY | O_DIRECTORY)
-                         : UniqueFd());
+    UniqueFd known = open_below_as_package(root_.get(), folder.c_str(), kFlags, 0, user_, nullptr);
     if (known) {
       parent_ = std::move(known);
       parent_name_ = folder;
@@ -314,9 +319,10 @@ class Unpacker {
     for (std::size_t start = 0; at && start <= folder.size();) {
       const std::size_t end = std::min(folder.find('/', start), folder.size());
       const std::string name = folder.substr(start, end - start);
-      if (mkdirat(at.get(), name.c_str(), kFolderMode) != 0 && errno != EEXIST) return -1;
-      UniqueFd next(
-          openat(at.get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+      if (mkdir_as_package(at.get(), name.c_str(), kFolderMode, user_) != 0 && errno != EEXIST) {
+        return -1;
+      }
+      UniqueFd next = open_as_package(at.get(), name.c_str(), kFlags, 0, user_, nullptr);
       if (!next && errno == ENOTDIR) errno = is_link(at.get(), name) ? ELOOP : ENOTDIR;
       const int reason = errno;
       at = std::move(next);
@@ -329,21 +335,31 @@ class Unpacker {
     return parent_.get();
   }
 
-  static bool is_link(int dir, const std::string &name) {
+  bool is_link(int dir, const std::string &name) const {
     struct stat status {};
-    return fstatat(dir, name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISLNK(status.st_mode);
+    return status_as_package(dir, name.c_str(), user_, &status) == 0 && S_ISLNK(status.st_mode);
   }
 
   /** A file that nobody else has open, whatever lay under its name. */
-  int create(int parent, const char *name) {
-    constexpr int kFlags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+  UniqueFd create(int parent, const std::string &path, std::size_t name_at) {
+    if (parent < 0) return {};
+    const char *name = path.c_str() + name_at;
+    if (path == table_) {  // the daemon's own, until it has been read
+      const ActAsRoot root;
+      return create_named(parent, name, kTableMode, {0, 0});
+    }
+    return create_named(parent, name, kUnpackedMode, user_);
+  }
+
+  UniqueFd create_named(int parent, const char *name, mode_t mode, const package_user &owner) {
+    constexpr int kFlags = O_WRONLY | O_CREAT | O_EXCL;
     // where one name was taken the next one will be, and then this saves a call
-    if (expect_taken_) expect_taken_ = unlinkat(parent, name, 0) == 0;
-    const int fd = openat(parent, name, kFlags, kFileMode);
-    if (fd >= 0 || errno != EEXIST) return fd;
-    expect_taken_ = unlinkat(parent, name, 0) == 0;
-    if (!expect_taken_) return -1;  // a directory stays
-    return openat(parent, name, kFlags, kFileMode);
+    if (expect_taken_) expect_taken_ = unlink_as_package(parent, name, 0, user_) == 0;
+    UniqueFd file = open_as_package(parent, name, kFlags, mode, owner, nullptr);
+    if (file || errno != EEXIST) return file;
+    expect_taken_ = unlink_as_package(parent, name, 0, user_) == 0;
+    if (!expect_taken_) return {};  // a directory stays
+    return open_as_package(parent, name, kFlags, mode, owner, nullptr);
   }
 
   Extracted write(ByteSource *source, const unz_file_info64 &info, UniqueFd *file,
@@ -355,7 +371,7 @@ class Unpacker {
                                    : codec_->inflate(source, &sink, &totals);
     const bool closed = close(file->release()) == 0;
     if (sink.too_long()) {
-      unlinkat(parent_.get(), path.c_str() + path.rfind('/') + 1, 0);
+      unlink_as_package(parent_.get(), path.c_str() + path.rfind('/') + 1, 0, user_);
       return refuse(path.c_str(), "it holds more than it announces");
     }
     if (result == CodecResult::kSinkFailed || !closed) {
@@ -372,7 +388,10 @@ class Unpacker {
 
   std::string destination_;
   WorkingFiles working_;
+  std::string table_;
   UniqueFd root_;
+  package_user user_;
+  ActAsPackage acting_;
   UniqueFd parent_;
   std::string parent_name_;
   bool expect_taken_ = false;  // files lie where the entries go

@@ -111,13 +111,28 @@ TEST_P(ZipReader, UnpacksEveryEntryAndMakesItsDirectories) {
   EXPECT_TRUE(captured_texts().empty());
 }
 
-TEST_P(ZipReader, FilesAreTheDaemonsAloneAndDirectoriesHaveTheirMode) {
-  ASSERT_EQ(unpack({deflated_entry("data/dir/a", "x")}), QUARN_OK);
-  struct stat status = {};
-  ASSERT_EQ(lstat((root_ / "data/dir/a").c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode, S_IFREG | 0600U);
-  ASSERT_EQ(lstat((root_ / "data/dir").c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode, S_IFDIR | 0755U);
+TEST_P(ZipReader, WhatIsMadeIsThePackagesAndItsTableTheDaemons) {
+  for (const uid_t owner : {0U, kAppUid}) {
+    ASSERT_EQ(chown(root_.dir("data").c_str(), owner, owner), 0);
+    ASSERT_EQ(chmod(root_.dir("data/own").c_str(), 0555), 0);
+    ASSERT_EQ(chown(root_.dir("data/own").c_str(), kAppUid, kAppGid), 0);
+    ASSERT_EQ(unpack({deflated_entry("data/dir/a", "x"), deflated_entry("data/own/a", "x"),
+                      deflated_entry("shared/data/org.example.notes.perm", "{}")}),
+              QUARN_OK);
+    struct stat status = {};
+    for (const char *name : {"data/dir/a", "data/own/a"}) {
+      ASSERT_EQ(lstat((root_ / name).c_str(), &status), 0);
+      EXPECT_EQ(status.st_mode, S_IFREG | S_ISVTX) << "nobody opens it before it has its mode";
+      EXPECT_EQ(status.st_uid, kAppUid);
+      EXPECT_EQ(status.st_gid, kAppGid);
+    }
+    ASSERT_EQ(lstat((root_ / "data/dir").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode, S_IFDIR | 0755U);
+    EXPECT_EQ(status.st_uid, kAppUid);
+    ASSERT_EQ(lstat((root_ / "shared/data/org.example.notes.perm").c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode, S_IFREG | 0600U);
+    EXPECT_EQ(status.st_uid, 0U);
+  }
 }
 
 TEST_P(ZipReader, WithoutAReportTheResultIsTheSame) {

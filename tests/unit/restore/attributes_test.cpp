@@ -102,7 +102,7 @@ TEST_F(AttributesTest, EachMissingMemberIsAnErrorAndTheModeStays) {
 
 TEST_F(AttributesTest, AnEmptyLabelGetsModeAndOwnerAndThenFails) {
   const std::string path = file("data/a", "x", 0640);
-  ASSERT_EQ(chown(path.c_str(), 0, 0), 0);
+  ASSERT_EQ(chown(path.c_str(), kAppUid, 0), 0);
   EXPECT_EQ(restore("data/a", R"({"0": 384, "1": 0, "2": 0, "3": ""})"), 0);
   expect_error("error : there isn't smack info of " + path);
   EXPECT_EQ(mode_of(path), 0600);
@@ -113,7 +113,7 @@ TEST_F(AttributesTest, AnEmptyLabelGetsModeAndOwnerAndThenFails) {
 TEST_F(AttributesTest, AnyStoredOwnerYieldsTheApplicationUser) {
   for (const char *owner : {"0", "1000", "5001"}) {
     const std::string path = file("data/a", "x");
-    ASSERT_EQ(chown(path.c_str(), 0, 0), 0);
+    ASSERT_EQ(chown(path.c_str(), kAppUid, 0), 0);
     const std::string id = owner;
     EXPECT_EQ(
         restore("data/a", R"({"0": 420, "1": )" + id + R"(, "2": )" + id + R"(, "3": "app.data"})"),
@@ -168,7 +168,7 @@ TEST_F(AttributesTest, ALabelThatCannotBeReadIsAFailure) {
 
 TEST_F(AttributesTest, SetIdBitsSurviveTheChangeOfOwner) {
   const std::string path = file("data/tool", "x", 0700);
-  ASSERT_EQ(chown(path.c_str(), 0, 0), 0);
+  ASSERT_EQ(chown(path.c_str(), kAppUid, 0), 0);
   EXPECT_EQ(restore("data/tool", R"({"0": 3565, "1": 0, "2": 0, "3": "app.data"})"), 1);
   EXPECT_EQ(mode_of(path), 06755);
   EXPECT_EQ(status_of(path).st_uid, 5000U);
@@ -205,7 +205,7 @@ TEST_F(AttributesTest, AFileWithAnotherNameElsewhereIsLeftAsItIs) {
 
 TEST_F(AttributesTest, AnOwnerThatCannotBeSetIsAFailureAfterTheMode) {
   const std::string path = file("data/a", "x", 0640);
-  ASSERT_EQ(chown(path.c_str(), 0, 0), 0);
+  ASSERT_EQ(chown(path.c_str(), kAppUid, 0), 0);
   const WithoutCapabilities none({CAP_CHOWN});
   EXPECT_EQ(restore("data/a", R"({"0": 384, "1": 1, "2": 1, "3": "app.data"})"), 0);
   expect_error("chown: error \n");

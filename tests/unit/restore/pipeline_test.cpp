@@ -513,7 +513,7 @@ TEST_F(PipelineTest, ProgressIsToldStepByStep) {
 TEST_F(PipelineTest, APartOfADownloadHindersNoRestore) {
   make_old_data();
   const std::string part =
-      unpacked_file("shared/data/.quarn-part-0123456789abcdef01234567", "part of an archive");
+      daemons_file("shared/data/.quarn-part-0123456789abcdef01234567", "part of an archive");
   auto ctx = waiting_context();
   ASSERT_EQ(restore(ctx.get()), 0);
   make_archive(download(), new_data);

@@ -42,6 +42,46 @@ class RaceTest : public RestoreTest {
       }
     }
   }
+  /**
+   * Take @p name away and put a link to the secret in its place, again and again: what a system
+   * call does for an application where links to others' files are not forbidden.
+   */
+  void link_forever(const std::string &name) {
+    racer = fork();
+    if (racer == 0) {
+      const std::string link_name = base + "/link";
+      for (;;) {
+        if (link(secret.c_str(), link_name.c_str()) == 0) {
+          rename(link_name.c_str(), name.c_str());
+          unlink(link_name.c_str());  // two names of one file are not renamed
+        }
+      }
+    }
+  }
+  /** What an application keeps ready to put in the place of a snapshot. */
+  void make_fake_snapshot(const std::string &path, const std::vector<std::string> &names) const {
+    for (const std::string &name : names) {
+      const std::filesystem::path file = path + "/" + name;
+      std::filesystem::create_directories(file.parent_path());
+      ASSERT_EQ(link(secret.c_str(), file.c_str()), 0);
+    }
+    ASSERT_EQ(chown(path.c_str(), kAppUid, kAppGid), 0);
+  }
+  void restore_while(const std::string &archive, const std::function<void()> &attack) {
+    pkg_restore_context ctx;
+    ctx.serial = kSerial;
+    ctx.pkgid = kPkg;
+    ctx.version = kVersion;
+    ctx.root = root;
+    ctx.wait_for_result = true;
+    ASSERT_EQ(restore_app_data("app", &ctx), 0);
+    std::filesystem::copy_file(archive, download());
+    attack();
+    answer();
+    stop();
+    clear_captured_log();
+  }
+
   void stop() {
     if (racer <= 0) return;
     kill(racer, SIGKILL);
@@ -149,6 +189,122 @@ TEST_F(RaceTest, ASwappedDataDirectoryIsNotRelabelledElsewhere) {
   }
   stop();
   expect_secret_untouched();
+}
+
+/* ---- links to files of others ---------------------------------------------- */
+
+TEST_F(RaceTest, AFileSwappedForALinkToAnothersFileIsNeverChanged) {
+  file("data/a", "x");
+  const JsonPtr entries = table({{"data/a", "", 0777, "wrt::db_origin"}});
+  link_forever(at("data/a"));
+  for (int i = 0; i < kRounds; ++i) {
+    parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get());
+    restore_file_info(at("data/a").c_str(), kPkg, root.c_str(), entries.get());
+    clear_captured_log();
+  }
+  stop();
+  expect_secret_untouched();
+}
+
+TEST_F(RaceTest, AFileOfAnothersWithNoOtherNameIsNeverChanged) {
+  // its first name has gone, so that the number of its names tells nothing
+  file("data/dir/a", "x");
+  const JsonPtr entries = table({{"data/dir/a", "", 0777, "wrt::db_origin"}});
+  ASSERT_EQ(rename(secret.c_str(), at("data/dir/a").c_str()), 0);
+  const Tree before = tree_of(at("data/dir"));
+  EXPECT_EQ(parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get()), 0);
+  EXPECT_EQ(restore_file_info(at("data/dir/a").c_str(), kPkg, root.c_str(), entries.get()), 0);
+  expect_error("refused : " + at("data/dir/a") + " is a link to a file elsewhere", 2);
+  EXPECT_EQ(tree_of(at("data/dir")), before);
+}
+
+TEST_F(RaceTest, RestoresAndRollbacksNeverChangeAnothersFile) {
+  const std::vector<Entry> entries = {{"data/a", "new", 0777, "wrt::db_origin"},
+                                      {"data/b", "new", 0777, "wrt::db_origin"}};
+  const std::string good = base + "/good.zip";
+  const std::string broken = base + "/broken.zip";
+  make_archive(good, entries);
+  make_archive(broken, entries, "not json");
+  for (int i = 0; i < kRounds / 30; ++i) {
+    for (const std::string &archive : {good, broken}) {
+      file("data/a", "x", 04755);
+      file("data/b", "x", 0666);
+      restore_while(archive, [this] { link_forever(at("data/b")); });
+      unlink(at("data/b").c_str());
+    }
+  }
+  expect_secret_untouched();
+}
+
+TEST_F(RaceTest, ASnapshotSwappedForAFolderOfLinksIsNotUsed) {
+  const std::string broken = base + "/broken.zip";
+  make_archive(broken, {{"data/a", "new", 0777, "wrt::db_origin"}}, "not json");
+  const std::string fake = at("shared/data/quarn_tmp_rst_dir.mine");
+  int rolled_back = 0;
+  for (int i = 0; i < kRounds / 30; ++i) {
+    std::filesystem::remove_all(fake);
+    std::filesystem::remove_all(snapshot());
+    file("data/a", "old", 0666);
+    make_fake_snapshot(fake, {"data/a", "data/dir/b"});
+    restore_while(broken, [&] { swap_forever(snapshot(), fake); });
+    if (read_text(at("data/a")) == "old") ++rolled_back;
+  }
+  expect_secret_untouched();
+  EXPECT_GT(rolled_back, 0);
+}
+
+TEST_F(RaceTest, ARecoveryNeverChangesAnothersFile) {
+  const std::string fake = at("shared/data/quarn_tmp_rst_dir.mine");
+  for (int i = 0; i < kRounds / 30; ++i) {
+    std::filesystem::remove_all(fake);
+    std::filesystem::remove_all(snapshot());
+    file("data/a", "old", 0666);
+    ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+    make_fake_snapshot(fake, {"data/a"});
+    swap_forever(snapshot(), fake);
+    recover_interrupted_restore(kPkg, root.c_str());
+    stop();
+    clear_captured_log();
+  }
+  expect_secret_untouched();
+}
+
+TEST_F(RaceTest, ASnapshotThatHasGoneAtTheEndIsTold) {
+  const std::string archive = base + "/archive.zip";
+  make_archive(archive, {{"data/a", "new"}});
+  file("data/a", "old");
+  const AtStep move("restored",
+                    [this] { ASSERT_EQ(rename(snapshot().c_str(), (base + "/mine").c_str()), 0); });
+  pkg_restore_context *ctx = new_context();
+  ctx->wait_for_result = true;
+  ASSERT_EQ(restore_app_data("app", ctx), 0);
+  std::filesystem::copy_file(archive, download());
+  answer();
+  expect_error("snapshot of (org.example.notes) was moved during its restore");
+  EXPECT_EQ(ctx->result, QUARN_REFUSED);
+  EXPECT_EQ(read_text(at("data/a")), "old");
+  delete ctx;
+}
+
+TEST_F(RaceTest, ASnapshotThatWasMovedEndsTheRestoreWithoutSuccess) {
+  const std::string archive = base + "/archive.zip";
+  make_archive(archive, {{"data/a", "new"}});
+  file("data/a", "old");
+  const Tree before = tree_of(root);
+  const AtStep move("unpacked", [this] {
+    ASSERT_EQ(rename(snapshot().c_str(), at("shared/data/mine").c_str()), 0);
+    ASSERT_EQ(mkdir(snapshot().c_str(), 0755), 0);
+    ASSERT_EQ(chown(snapshot().c_str(), kAppUid, kAppGid), 0);
+  });
+  pkg_restore_context *ctx = new_context();
+  ctx->wait_for_result = true;
+  ASSERT_EQ(restore_app_data("app", ctx), 0);
+  std::filesystem::copy_file(archive, download());
+  answer();
+  EXPECT_EQ(ctx->result, QUARN_REFUSED);
+  EXPECT_EQ(read_text(at("data/a")), "old") << "put back from where it is";
+  EXPECT_TRUE(std::filesystem::is_empty(at("shared/data/mine")));
+  delete ctx;
 }
 
 }  // namespace

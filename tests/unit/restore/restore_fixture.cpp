@@ -2,8 +2,10 @@
 
 #include <fcntl.h>
 #include <linux/capability.h>
+#include <linux/securebits.h>
 #include <sched.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -26,6 +28,7 @@
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/admission.h"
+#include "quarn_d_utils/unpacked_file.h"
 #include "quarn_dbus_client.h"
 
 using ::testing::_;
@@ -237,6 +240,9 @@ WithoutCapabilities::WithoutCapabilities(std::initializer_list<int> capabilities
   __user_cap_data_struct data[2] = {};
   EXPECT_EQ(syscall(SYS_capget, &header, data), 0);
   for (int i = 0; i < 2; ++i) effective_[i] = data[i].effective;
+  // else a change of the thread's identity would give them back
+  securebits_ = prctl(PR_GET_SECUREBITS);
+  EXPECT_EQ(prctl(PR_SET_SECUREBITS, securebits_ | SECBIT_NO_SETUID_FIXUP), 0);
   for (const int capability : capabilities) {
     data[capability / 32].effective &= ~(1U << (capability % 32));
   }
@@ -249,6 +255,7 @@ WithoutCapabilities::~WithoutCapabilities() {
   EXPECT_EQ(syscall(SYS_capget, &header, data), 0);
   for (int i = 0; i < 2; ++i) data[i].effective = effective_[i];
   EXPECT_EQ(syscall(SYS_capset, &header, data), 0);
+  EXPECT_EQ(prctl(PR_SET_SECUREBITS, securebits_), 0);
 }
 
 DiskFullAfter::DiskFullAfter(unsigned long bytes) {
@@ -346,6 +353,18 @@ std::string RestoreTest::file(const std::string &name, const std::string &conten
 }
 
 std::string RestoreTest::unpacked_file(const std::string &name, const std::string &content) {
+  const std::string path = at(name);
+  unlink(path.c_str());
+  write_text(path, content);
+  for (std::string folder = parent_of(name); !folder.empty(); folder = parent_of(folder)) {
+    EXPECT_EQ(chown(at(folder).c_str(), kAppUid, kAppGid), 0);
+  }
+  EXPECT_EQ(chown(path.c_str(), kAppUid, kAppGid), 0);
+  EXPECT_EQ(chmod(path.c_str(), kUnpackedMode), 0);
+  return path;
+}
+
+std::string RestoreTest::daemons_file(const std::string &name, const std::string &content) {
   const std::string path = at(name);
   unlink(path.c_str());
   write_text(path, content);

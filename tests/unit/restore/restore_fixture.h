@@ -87,7 +87,9 @@ class RestoreTest : public ::testing::Test {
   /** A file of the application: owner 5000:5000, labelled. */
   std::string file(const std::string &name, const std::string &content, int mode = 0644,
                    const std::string &label = kDataLabel);
-  /** A file as the unpacking leaves it: root's, for nobody else, with the label of its folder. */
+  /** A file of the daemon's own: root's, for nobody else. */
+  std::string daemons_file(const std::string &name, const std::string &content);
+  /** A file as the unpacking leaves it: the package's, not to be opened by anybody yet. */
   std::string unpacked_file(const std::string &name, const std::string &content);
   std::string dir(const std::string &name, int mode = 0755, const std::string &label = kDataLabel);
   /** Two files with attributes of their own, a database with its own label, in two folders. */
@@ -145,6 +147,7 @@ class WithoutCapabilities {
 
  private:
   unsigned int effective_[2];
+  int securebits_;
 };
 
 /** Lets no file grow beyond @p bytes while it lives, as a full disk does. */

@@ -28,7 +28,7 @@ class SnapshotTest : public RestoreTest {
     set_label(at("data/settings.ini"), "other");
     std::filesystem::remove(at("shared/trusted/key.bin"));
     unpacked_file("data/new/half.tmp", "half");
-    unpacked_file("shared/data/org.example.notes.perm", "{}");
+    daemons_file("shared/data/org.example.notes.perm", "{}");
   }
 };
 
@@ -140,6 +140,7 @@ TEST_F(SnapshotTest, AFileThatCannotBeReadFailsIt) {
   ASSERT_EQ(chmod(at("shared/data").c_str(), 0777), 0);
   ASSERT_EQ(chmod(at("data").c_str(), 0777), 0);
   ASSERT_EQ(chmod(at("data/db").c_str(), 0777), 0);
+  ASSERT_EQ(chmod(at("data/db/notes.db").c_str(), 0), 0);
   const Tree before = tree();
   {
     const WithoutCapabilities none({CAP_DAC_OVERRIDE, CAP_DAC_READ_SEARCH});
@@ -202,7 +203,7 @@ TEST_F(SnapshotTest, ATableThatCannotBeWrittenIsReportedAndTheSnapshotIsIncomple
 
 TEST_F(SnapshotTest, AnEntryThatVanishesIsLogged) {
   const std::string gone = file("data/a", "x");
-  const AtStep step("snapshot-entry", [&] { unlink(gone.c_str()); });
+  const AtStep step("snapshot-folder", [&] { unlink(gone.c_str()); });
   EXPECT_EQ(take(), 0);
   expect_error("error : lstat for -1 " + gone);
 }
@@ -471,7 +472,7 @@ TEST_F(SnapshotTest, NoOtherFileIsMadeAnotherUsersProgram) {
 }
 
 TEST_F(SnapshotTest, AnOwnerOrLabelThatCannotBePutBackIsLogged) {
-  const std::string path = file("data/a", "x", 0640, "wrt::db_origin");
+  const std::string path = file("data/a", "x", 0644, "wrt::db_origin");
   ASSERT_EQ(chown(path.c_str(), 5001, 5001), 0);
   ASSERT_EQ(take(), 0);
   std::unique_ptr<WithoutCapabilities> none;
