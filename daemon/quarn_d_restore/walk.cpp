@@ -24,7 +24,6 @@ using Transaction = Handle<security_server_transaction, &security_server_perm_ab
 
 constexpr mode_t kFolderMode = 0755;
 constexpr mode_t kSettledMode = 0600;
-constexpr char kLinkListKey[] = "quarn_symbolic_info";
 
 /** What stays the same in the walk over one package. */
 struct walk_context {
