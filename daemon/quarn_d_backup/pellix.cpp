@@ -132,7 +132,8 @@ char *get_app_list_for_pellix() {
   if (!saved) return nullptr;
   CString text;
   // another text is not this list: the folder is the companion's
-  if (!read_data_from_file(list_path.c_str(), out(text)) || written != text.get()) {
+  const bool read = read_data_from_file(list_path.c_str(), out(text));
+  if (!read || written != text.get()) {
     LOGE("cannot read app list file...");
     text.reset();
   }

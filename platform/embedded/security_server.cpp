@@ -144,7 +144,8 @@ bool label_one(const char *path, const std::string &label) {
   const int fd = open_without_links(AT_FDCWD, path, O_NOFOLLOW);
   if (fd < 0) return false;
   struct stat status {};
-  const bool alone = fstat(fd, &status) == 0 && (S_ISDIR(status.st_mode) || status.st_nlink == 1);
+  const bool alone = fstat(fd, &status) == 0 && !S_ISLNK(status.st_mode) &&
+                     (S_ISDIR(status.st_mode) || status.st_nlink == 1);
   const bool done = alone && embedded::write_label(name_of(fd).c_str(), Links::kFollow,
                                                    LabelKind::kAccess, label) == 0;
   close(fd);

@@ -187,12 +187,13 @@ TEST_F(Causes, APackageThatIsRemovedBeforeItIsPackedIsSaidToBeThat) {
 }
 
 TEST_F(Causes, APackageThatIsRemovedBeforeItsUploadIsSaidToBeThat) {
-  FakePackage &a = install("org.a");
-  at(Op::upload, a.object(), [&] { std::filesystem::remove_all(a.root); });
+  const std::string first = install("org.a").object();
+  const std::string root = install("org.b").root;
+  at(Op::upload, first, [&] { std::filesystem::remove_all(root); });
   const SeenStep end = end_of_run();
   EXPECT_EQ(end.result, 12);
   EXPECT_EQ(end.cause, "removed");
-  EXPECT_EQ(step_of("org.a").outcome, backup_outcome::removed);
+  EXPECT_EQ(step_of("org.b").outcome, backup_outcome::removed);
 }
 
 /** Folders nested to the depth, counted from the data directory's own. */
