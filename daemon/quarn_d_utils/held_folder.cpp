@@ -55,9 +55,13 @@ bool HeldFolder::covers(const char *path) const {
 }
 
 const HeldFolder *HeldFolder::of(const char *path) {
+  const HeldFolder *nearest = nullptr;
   const HeldFolder *at = path == nullptr ? nullptr : innermost;
-  while (at != nullptr && !at->covers(path)) at = at->outer_;
-  return at;
+  for (; at != nullptr; at = at->outer_) {
+    const bool nearer = nearest == nullptr || at->path_.size() > nearest->path_.size();
+    if (nearer && at->covers(path)) nearest = at;
+  }
+  return nearest;
 }
 
 UniqueFd HeldFolder::reopen(int flags) const {

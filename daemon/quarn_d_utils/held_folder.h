@@ -20,7 +20,7 @@
 
 /**
  * One such directory, for the thread that made it and for as long as it lives. They
- * nest: the innermost that a path is below counts, and one of the same path is the
+ * nest: the deepest that a path is below counts, and one of the same path is the
  * same directory, which the outer one keeps. Held across no fiber's wait.
  */
 class HeldFolder {
@@ -38,7 +38,7 @@ class HeldFolder {
   /** True while its path still leads to it. */
   bool is_in_place() const;
 
-  /** The thread's innermost folder that @p path is at or below; null for none. */
+  /** The thread's deepest folder that @p path is at or below; null for none. */
   static const HeldFolder *of(const char *path);
   /** What of @p path lies below this folder: "." for the folder itself. */
   const char *below(const char *path) const;
