@@ -22,6 +22,7 @@
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/kernel_settings.h"
+#include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
@@ -71,6 +72,7 @@ bool server_util_is_account_exist() {
   step("account");
   return account;
 }
+bool drop_other_groups() { return true; }
 int tell_kernel_settings(const char *settings) {
   EXPECT_STREQ(settings, "/proc/sys");
   step("kernel_settings");
