@@ -23,7 +23,7 @@ constexpr std::size_t kThreads = 4;
  * More files are brought to the disk all at once. Each by itself waits for a flush of the disk's
  * cache, of which two thousand took longer than everything else that a restore does.
  */
-constexpr std::size_t kFew = 128;
+constexpr std::size_t kFew = 64;
 
 /** Sync a few objects in threads. @return true when everything is on the disk */
 bool sync_each(const std::vector<UniqueFd> &objects) {

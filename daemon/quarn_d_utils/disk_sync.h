@@ -12,7 +12,7 @@
  * Bring every file and directory below @p dir, itself included, onto the disk:
  * their content, attributes and names. What @p skipped takes by its path need
  * not be there. A few files are synced by themselves, in threads; with more
- * than 128 the file system's own sync costs less than their flushes. Blocks.
+ * than 64 the file system's own sync costs less than their flushes. Blocks.
  * @return false when anything could not be brought there; kernels before 5.8
  * do not tell that of many files
  */

@@ -576,7 +576,8 @@ TEST_P(ZipWriter, TheDeepestTreeIsTakenByARestoreAndADeeperOneIsNot) {
   root_.file(path + "/d/beyond", "text");
   EXPECT_EQ(pack_within(kBackupBounds), QUARN_REFUSED);
   expect_excess(archive_bound::depth, kMaxDirDepth + 1, kMaxDirDepth);
-  EXPECT_EQ(errors("archive is full at " + root_ / (path + "/d")), 1);
+  constexpr std::size_t kShown = 256;
+  EXPECT_EQ(errors("archive is full at " + (root_ / path).substr(0, kShown) + "..."), 1);
 }
 
 TEST_P(ZipWriter, OtherProgramsFindEveryEntryHoweverMany) {

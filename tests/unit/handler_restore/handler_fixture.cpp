@@ -3,6 +3,7 @@
 #include <Ecore.h>
 
 #include <cstring>
+#include <filesystem>
 
 #include "quarn_d_restore/quarn_d_restore.h"
 
@@ -83,7 +84,9 @@ HandlerTest::HandlerTest() {
   ON_CALL(transport, backup_trans_upload_file_ors_async)
       .WillByDefault([this](auto, const char *local, const char *remote,
                             backup_trans_upload_cb callback, auto, auto, void *data, auto) {
-        if (upload_result == 0) uploads.push_back({local, remote, data, callback});
+        // What the descriptor that is handed over holds.
+        const std::string held = std::filesystem::read_symlink(local).string();
+        if (upload_result == 0) uploads.push_back({held, remote, data, callback});
         return upload_result;
       });
 }
