@@ -3,6 +3,8 @@ import os
 import random
 import sqlite3
 
+#: Whose files an application's are.
+APPLICATION_USER = 5000
 KIB = 1024
 MIB = 1024 * KIB
 WORDS = ("watch step heart note sleep walk morning battery charge place street river cloud light "
@@ -78,10 +80,13 @@ TREES = {"small": small, "db": db, "media": media, "mixed": mixed}
 
 
 def make(kind, root):
-    """Make one tree below `root`, with the three data directories of an application."""
+    """Make one tree below `root`, with the three data directories of an application, all its own."""
     for folder in ("data", "shared/data", "shared/trusted"):
         os.makedirs(os.path.join(root, folder), exist_ok=True)
     TREES[kind](root)
+    for folder, folders, names in os.walk(root):
+        for name in [".", *names]:
+            os.chown(os.path.join(folder, name), APPLICATION_USER, APPLICATION_USER)
 
 
 def make_package(source, package, version, fill):
