@@ -298,7 +298,8 @@ class MovingBack {
     std::vector<TreeEntry> entries;
     std::vector<std::string> folders;
     if (!list_tree_entries(from, &entries)) moved_ = false;
-    const bool closed = !is_open_to_root(to);
+    // The daemon replaces names only where the application may, or has no part in the folder.
+    const bool closed = !names_may_be_changed(to, user_);
     for (TreeEntry &entry : entries) {
       const PathStep step(&path_, entry.name.c_str());
       if (is_own()) continue;
@@ -316,13 +317,6 @@ class MovingBack {
       }
     }
     return folders;
-  }
-
-  /** The daemon replaces names only where the application may, or has no part in the folder. */
-  bool is_open_to_root(int folder) const {
-    struct stat status = {};
-    return fstat(folder, &status) == 0 &&
-           (status.st_uid == user_.uid || !application_can_fill(folder, user_));
   }
 
   bool move_file(int from, int to, const char *name, const struct stat &status) {
@@ -371,7 +365,7 @@ class MovingBack {
     if (fstatat(to, name, &present, AT_SYMLINK_NOFOLLOW) == 0) {
       if (S_ISDIR(present.st_mode) || unlink_as_package(to, name, 0, user_) != 0) return false;
     }
-    if (!is_open_to_root(to)) return false;
+    if (!names_may_be_changed(to, user_)) return false;
     // The snapshot's table stays where it is until the end.
     if (files_.snapshot_table.compare(0, path_.size() + 1, path_ + "/") == 0) return false;
     return renameat(from, name, to, name) == 0;

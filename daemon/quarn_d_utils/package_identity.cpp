@@ -87,10 +87,30 @@ bool can_fill(int dir, const struct stat &status, const package_user &user) {
   return list >= 0 || (errno != ENODATA && errno != EOPNOTSUPP);
 }
 
-/** True when root may make or remove a name there although the user may not. */
-bool is_changed_for(int dir, const package_user &user) {
-  struct stat status = {};
-  return fstat(dir, &status) == 0 && (status.st_uid == user.uid || !can_fill(dir, status, user));
+/** True when the application may move what it may write out of a folder, or into it. */
+bool can_move_in(int dir, const struct stat &status, const package_user &user) {
+  const bool sticky = (status.st_mode & S_ISVTX) != 0 && status.st_uid != user.uid;
+  return !sticky && can_fill(dir, status, user);
+}
+
+/**
+ * False when a folder of somebody else's lies in one that the application may have moved to where
+ * it is now: up to a folder of the application's own, or the root of all.
+ */
+bool is_in_its_place(int dir, struct stat status, const package_user &user) {
+  const ActAsRoot root;
+  UniqueFd held;
+  while (status.st_uid != user.uid) {
+    UniqueFd above(openat(dir, "..", kPlaceFlags | O_DIRECTORY));
+    struct stat holder = {};
+    if (!root || !above || fstat(above.get(), &holder) != 0) return false;
+    if (holder.st_ino == status.st_ino && holder.st_dev == status.st_dev) return true;
+    if (can_fill(dir, status, user) && can_move_in(above.get(), holder, user)) return false;
+    held = std::move(above);
+    dir = held.get();
+    status = holder;
+  }
+  return true;
 }
 
 /** True when the application cannot have put somebody else's object where it lies. */
@@ -98,7 +118,9 @@ bool lies_by_others_doing(int dir, int object, const struct stat &status,
                           const package_user &user) {
   struct stat holder = {};
   if (fstat(dir, &holder) != 0) return false;
-  if (!can_fill(dir, holder, user)) return S_ISDIR(status.st_mode) || status.st_nlink == 1;
+  if (!can_fill(dir, holder, user)) {
+    return (S_ISDIR(status.st_mode) || status.st_nlink == 1) && is_in_its_place(dir, holder, user);
+  }
   // A folder has one name, and goes elsewhere only with the right to write it.
   return S_ISDIR(status.st_mode) && holder.st_uid == user.uid && !can_fill(object, status, user);
 }
@@ -125,7 +147,7 @@ UniqueFd open_looked_at(int dir, const char *name, int flags, const package_user
 /** Do what the user was refused once more, without the modes, where that is right. */
 template <typename Call>
 int again_in(int dir, int other, const package_user &user, Call call) {
-  if (!is_changed_for(dir, user) || (other != dir && !is_changed_for(other, user))) {
+  if (!names_may_be_changed(dir, user) || (other != dir && !names_may_be_changed(other, user))) {
     errno = EACCES;
     return -1;
   }
@@ -169,6 +191,13 @@ FileIdentity::~FileIdentity() {
 bool application_can_fill(int dir, const package_user &user) {
   struct stat status = {};
   return fstat(dir, &status) != 0 || can_fill(dir, status, user);
+}
+
+bool names_may_be_changed(int dir, const package_user &user) {
+  struct stat status = {};
+  if (fstat(dir, &status) != 0) return false;
+  if (status.st_uid == user.uid) return true;
+  return !can_fill(dir, status, user) && is_in_its_place(dir, status, user);
 }
 
 UniqueFd open_as_package(int dir, const char *name, int flags, mode_t mode,

@@ -87,6 +87,14 @@ class ActAsRoot : public FileIdentity {
 bool application_can_fill(int dir, const package_user &user);
 
 /**
+ * True when root may make, replace and remove names in a directory although the
+ * package's user may not: it is the user's own; or one that the application
+ * cannot fill, and none of those above it, up to one of the application's own,
+ * is such that the application may have moved it there with all that it holds.
+ */
+bool names_may_be_changed(int dir, const package_user &user);
+
+/**
  * Open @p name of the directory @p dir as the package's user. A new file
  * (O_CREAT, which takes O_EXCL along) is that user's from the beginning.
  *
@@ -94,9 +102,9 @@ bool application_can_fill(int dir, const package_user &user);
  * where the directory is its own, or one that it may not write. Of what is
  * there already a regular file or a directory is opened that the user owns; a
  * file of somebody else's when it has this one name only and lies in a directory
- * that the application cannot fill; a directory of somebody else's when the
- * application can neither fill the one it lies in nor, where that is its own,
- * have moved it there. The object that was looked at is the one that is opened.
+ * that the application can neither fill nor have moved there with one above it;
+ * a directory of somebody else's in such a one, or in one of the application's
+ * own when the application cannot have moved it there. The object that was looked at is the one that is opened.
  *
  * O_PATH answers what lies there, whoever's it is: such a descriptor says
  * nothing about whether the application could have opened it.
@@ -127,8 +135,8 @@ bool may_be_changed(int dir, int object, const struct stat &status, const packag
 
 /**
  * mkdirat(), unlinkat() and renameat() as the package's user. On EACCES alone
- * they are done all the same, new folders still being that user's, where the
- * directories are the user's own or cannot be filled by the application.
+ * they are done all the same, new folders still being that user's, where
+ * names_may_be_changed() allows it.
  * @return 0, or -1 with errno
  */
 int mkdir_as_package(int dir, const char *name, mode_t mode, const package_user &user);

@@ -252,6 +252,43 @@ TEST_F(PackageIdentity, AnothersFolderIsEnteredWhereTheApplicationCannotHaveMove
   EXPECT_EQ(errno, EACCES);
 }
 
+TEST_F(PackageIdentity, WhatLiesDeepInAFolderThatTheApplicationMayHaveMovedIsRefused) {
+  struct Above {
+    mode_t mode;
+    uid_t owner;
+    bool trusted;
+  };
+  const Above folders[] = {
+      {0755, kOther, true}, {0777, kOther, false}, {01777, kOther, false}, {0700, kApp.uid, true}};
+  struct stat status = {};
+  for (const Above &above : folders) {
+    SCOPED_TRACE(above.mode);
+    give("data/above", above.mode, above.owner);
+    give("data/above/middle", 0755, kOther);
+    give("data/above/middle/theirs", 0755, kOther);
+    file("data/above/middle/theirs/file", 0600, kOther);
+    open_folder("data/above/middle/theirs");
+    EXPECT_EQ(read_as_package("file") != kRefused, above.trusted);
+    EXPECT_EQ(names_may_be_changed(folder_.get(), kApp), above.trusted);
+    const UniqueFd made =
+        open_as_package(folder_.get(), "new", O_WRONLY | O_CREAT, 0, kApp, &status);
+    EXPECT_EQ(static_cast<bool>(made), above.trusted);
+    EXPECT_EQ(unlink_as_package(folder_.get(), "file", 0, kApp) == 0, above.trusted);
+    EXPECT_EQ(exists(dir_ / "data/above/middle/theirs/file"), !above.trusted);
+    EXPECT_EQ(unlink_as_package(folder_.get(), "new", 0, kApp) == 0, above.trusted);
+  }
+}
+
+TEST_F(PackageIdentity, WhatLiesInAFolderForAllThatNobodyMovesStaysInReach) {
+  // as a package's folder in /tmp
+  give("public", 01777, 0);
+  give("public/package", 0755, kOther);
+  file("public/package/file", 0600, kOther);
+  open_folder("public/package");
+  EXPECT_EQ(read_as_package("file"), "public/package/file");
+  EXPECT_EQ(unlink_as_package(folder_.get(), "file", 0, kApp), 0);
+}
+
 TEST_F(PackageIdentity, LinksAreNotFollowedAndOtherTypesNotOpened) {
   ASSERT_EQ(symlink((dir_ / "root/secret").c_str(), (dir_ / "data/link").c_str()), 0);
   ASSERT_EQ(mkfifo((dir_ / "data/fifo").c_str(), 0), 0);
