@@ -23,7 +23,7 @@ struct Conversion {
   char kind = '\0';
 
   /** The same for snprintf(), which is given width and precision. */
-  std::string spec() const { return "%" + flags + "*.*" + size + kind; }
+  std::string text() const { return "%" + flags + "*.*" + size + kind; }
 };
 
 /** The arguments, passed on from function to function. */
@@ -66,7 +66,7 @@ std::string formatted(const Conversion &how, Value value) {
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
 #pragma GCC diagnostic ignored "-Wformat-security"
   const int length =
-      std::snprintf(text, sizeof text, how.spec().c_str(), how.width, how.precision, value);
+      std::snprintf(text, sizeof text, how.text().c_str(), how.width, how.precision, value);
 #pragma GCC diagnostic pop
   if (length < 0) return {};
   return {text, std::min(static_cast<std::size_t>(length), sizeof text - 1)};

@@ -46,6 +46,39 @@ std::uint64_t last_age = 0;
 caller_source &source = *new caller_source;
 std::optional<gid_t> given_group;
 
+/** What was refused to one caller since a moment. */
+struct refusals {
+  gint64 since = 0;
+  unsigned int count = 0;
+};
+std::mutex &refusals_mutex = *new std::mutex;
+std::map<std::string, refusals> &refused_callers = *new std::map<std::string, refusals>;
+gint64 (*refusal_clock)() = g_get_monotonic_time;
+
+/** The same for all connections of a caller, and no other's: nobody hides what others do. */
+std::string name_of_caller(const quarn_caller &caller) {
+  if (!caller.known) return "callers that are not known";
+  const std::string user = "user " + std::to_string(caller.uid);
+  return caller.label.empty() ? user : user + ", label " + caller.label;
+}
+
+void tell_left_out(const std::string &who, const refusals &of) {
+  if (of.count <= kMostRefusalLines) return;
+  LOGE("refused : %u more calls of %s", of.count - kMostRefusalLines, who.c_str());
+}
+
+/** Tell of what is over, so that no more is kept than callers that are refused now. */
+void end_refusals(gint64 before) {
+  for (auto at = refused_callers.begin(); at != refused_callers.end();) {
+    if (at->second.since > before) {
+      ++at;
+      continue;
+    }
+    tell_left_out(at->first, at->second);
+    at = refused_callers.erase(at);
+  }
+}
+
 void drop(const std::string &sender) {
   EntryPtr dropped;
   {
@@ -140,7 +173,9 @@ void on_credentials(GObject *bus, GAsyncResult *result, gpointer data) {
   GErrorPtr error;
   const GVariantPtr reply(
       g_dbus_connection_call_finish(G_DBUS_CONNECTION(bus), result, out(error)));
-  if (!reply) LOGE("cannot get user of (%s) : %s", asked->sender.c_str(), error->message);
+  if (!reply && tells_of_refusal({})) {
+    LOGE("cannot get user of (%s) : %s", asked->sender.c_str(), error->message);
+  }
   take_answer(asked->sender, asked->entry, reply ? read_credentials(reply.get()) : quarn_caller{});
 }
 
@@ -282,7 +317,7 @@ caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
                           const quarn_subject &subject, bool cloud_mode) {
   caller_verdict verdict =
       may_call(caller, caller.uid == 0 ? kNoGroup : client_group(), subject, cloud_mode);
-  if (!verdict.allowed) {
+  if (!verdict.allowed && tells_of_refusal(caller)) {
     LOGE("refused : %s of (%s) : %s", subject.member.c_str(), sender.c_str(),
          verdict.reason.c_str());
   }
@@ -295,10 +330,27 @@ std::string refusal_text(const quarn_subject &subject, const caller_verdict &ver
 
 gid_t client_group() { return given_group ? *given_group : look_up_client_group(); }
 
+bool tells_of_refusal(const quarn_caller &caller) {
+  const std::lock_guard<std::mutex> lock(refusals_mutex);
+  const gint64 now = refusal_clock();
+  end_refusals(now - kRefusalPeriod);
+  refusals &of =
+      refused_callers.try_emplace(name_of_caller(caller), refusals{now, 0}).first->second;
+  return ++of.count <= kMostRefusalLines;
+}
+
 void forget_callers() {
+  {
+    const std::lock_guard<std::mutex> lock(refusals_mutex);
+    end_refusals(G_MAXINT64);
+  }
   while (!entries.empty()) drop(std::string(entries.begin()->first));
 }
 
 void set_caller_source(caller_source asked) { source = std::move(asked); }
+
+void set_refusal_clock(gint64 (*clock)()) {
+  refusal_clock = clock == nullptr ? g_get_monotonic_time : clock;
+}
 
 void set_client_group(gid_t group) { given_group = group; }

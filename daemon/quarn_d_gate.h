@@ -47,7 +47,8 @@ quarn_subject subject_of_call(const std::string &interface_name, const std::stri
                               GVariant *arguments);
 
 /**
- * The verdict on a call. A refusal is logged with its caller and method.
+ * The verdict on a call. A refusal is logged with its caller and method, as tells_of_refusal()
+ * says.
  * @param cloud_mode as for may_call()
  */
 caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
@@ -59,6 +60,18 @@ std::string refusal_text(const quarn_subject &subject, const caller_verdict &ver
 /** Number of the clients' group, -1 when the system has none. Any thread. */
 gid_t client_group();
 
+/** Refusals of one caller that are told within kRefusalPeriod, each with its line. */
+inline constexpr unsigned int kMostRefusalLines = 60;
+/** Microseconds. */
+inline constexpr gint64 kRefusalPeriod = 60'000'000;
+
+/**
+ * Whether the line about a refusal of @p caller may be written, however many connections it has.
+ * What is left out is counted, and told when the period is over or callers are forgotten. Any
+ * thread.
+ */
+bool tells_of_refusal(const quarn_caller &caller);
+
 /** Forget everything; for a connection that is left. */
 void forget_callers();
 
@@ -66,6 +79,8 @@ void forget_callers();
 using caller_source = std::function<void(const std::string &sender, caller_work answer)>;
 /** @param source null: the bus */
 void set_caller_source(caller_source source);
+/** @param clock microseconds that only grow; null: the system's. For tests. */
+void set_refusal_clock(gint64 (*clock)());
 /** The group that counts instead of the system's; for tests. */
 void set_client_group(gid_t group);
 

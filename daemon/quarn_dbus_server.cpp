@@ -216,7 +216,9 @@ client_cb_data *make_uncounted_record(const MethodCall &call, guint32 req_id) {
 /** Refuse a request that may wait where too many do. */
 bool refuse_beyond_bounds(MethodCall &call) {
   if (may_wait(call.sender(), parties_of(call))) return false;
-  LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
+  if (tells_of_refusal(call.caller())) {
+    LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
+  }
   call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "Too many requests are waiting");
   return true;
 }
@@ -417,6 +419,11 @@ bool wait_for_turn(MethodCall &call) {
   return true;
 }
 
+void tell_excess(const MethodCall &call, const std::string &excess) {
+  if (!tells_of_refusal(call.caller())) return;
+  LOGE("refused : %s of (%s) : %s", call.method().c_str(), call.sender().c_str(), excess.c_str());
+}
+
 /**
  * Whether the caller may have what it asks for; else it is refused here, and nothing but the
  * pending end is touched.
@@ -433,7 +440,7 @@ bool admit(MethodCall &call, GVariant *parameters) {
     call.refuse(G_DBUS_ERROR_ACCESS_DENIED, refusal_text(subject, verdict));
     return false;
   }
-  LOGE("refused : %s of (%s) : %s", call.method().c_str(), call.sender().c_str(), excess.c_str());
+  tell_excess(call, excess);
   call.refuse(G_DBUS_ERROR_INVALID_ARGS, excess);
   return false;
 }
@@ -528,8 +535,7 @@ void serve_raw(RawCall &call, GDBusConnection *connection, GDBusMessage *message
   if (form == quarn_call_form::of_other_object) return forward_to_library(connection, message);
   if (form == quarn_call_form::too_large) {
     cancel_quarn_terminate();
-    LOGE("refused : %s of (%s) : %s", call.method().c_str(), call.sender().c_str(),
-         kArgumentsTooLarge);
+    tell_excess(call, kArgumentsTooLarge);
     return call.refuse(G_DBUS_ERROR_INVALID_ARGS, kArgumentsTooLarge);
   }
   if (form == quarn_call_form::other_arguments) {

@@ -3,6 +3,7 @@ import configparser
 import os
 import re
 import shutil
+import stat
 import subprocess
 import sys
 import unittest
@@ -10,6 +11,8 @@ import unittest
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
 from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+
+import system_calls  # noqa: E402
 
 UNITS = os.path.join(BIN_DIR, "../data")
 MODEL = os.path.join(HERE, "../../../docs/threat-model.md")
@@ -84,13 +87,16 @@ class Unit(unittest.TestCase):
 
 
 class WithTheUnitsCapabilities(TestCase):
-    """The whole job, by a daemon that has only what the unit leaves it."""
+    """The whole job, by a daemon that has only the rights and system calls that the unit leaves it."""
 
     PACKAGE = "org.example.notes"
     SERIAL = "350000000000001"
     #: Of the set-id bits, too, which need a capability of their own where the group is another's.
     FILES = {"data/program": (b"program", 0o6755), "data/closed": (b"closed", 0o000),
-             "data/deep/er/text": (b"text", 0o640), "shared/data/list": (b"list", 0o666)}
+             "data/deep/er/text": (b"text", 0o640), "shared/data/list": (b"list", 0o666),
+             "data/shut/text": (b"within", 0o600), "data/fixed/text": (b"fixed", 0o444)}
+    #: Folders that their own application has closed to itself.
+    FOLDERS = {"data/shut": 0o000, "data/fixed": 0o555}
 
     def setUp(self):
         wanted = section_of("quarnd.service")["CapabilityBoundingSet"].lower().replace("cap_", "+")
@@ -101,9 +107,12 @@ class WithTheUnitsCapabilities(TestCase):
         os.mkdir(programs)
         for name in ("quarn-device", "quarnctl"):
             shutil.copy(os.path.join(BIN_DIR, name), programs)
+        daemon = [os.path.realpath(os.path.join(BIN_DIR, "quarnd"))]
+        if system_calls.known_here():
+            daemon = ["/usr/bin/python3", "-B", system_calls.__file__,
+                      os.path.realpath(os.path.join(UNITS, "quarnd.service")), *daemon]
         with open(os.path.join(programs, "quarnd"), "w") as file:
-            file.write("#!/bin/sh\nexec %s %s \"$@\"\n" % (
-                " ".join(self.limited), os.path.realpath(os.path.join(BIN_DIR, "quarnd"))))
+            file.write("#!/bin/sh\nexec %s \"$@\"\n" % " ".join(self.limited + daemon))
         os.chmod(os.path.join(programs, "quarnd"), 0o755)
         self.device = self.new_device(serial=self.SERIAL)
         self.device.tool = os.path.join(programs, "quarn-device")
@@ -111,10 +120,13 @@ class WithTheUnitsCapabilities(TestCase):
         source = make_source(self.path("source"), self.PACKAGE, "1.0.0", self.FILES)
         subprocess.run([*self.limited, self.device.tool, "install", self.device.path, source],
                        check=True)
+        for path, mode in self.FOLDERS.items():
+            os.chmod(self.device.app_path(self.PACKAGE, path), mode)
         self.device.start()
 
     def present(self):
-        found = {}
+        found = {path: stat.S_IMODE(os.stat(self.device.app_path(self.PACKAGE, path)).st_mode)
+                 for path in self.FOLDERS}
         for path in self.FILES:
             name = self.device.app_path(self.PACKAGE, path)
             status = os.stat(name)
@@ -124,8 +136,9 @@ class WithTheUnitsCapabilities(TestCase):
 
     def test_backup_export_and_restore(self):
         before = self.present()
-        self.assertEqual({path: (content, mode, 5000, 5000)
-                          for path, (content, mode) in self.FILES.items()}, before)
+        self.assertEqual({**self.FOLDERS, **{path: (content, mode, 5000, 5000)
+                                             for path, (content, mode) in self.FILES.items()}},
+                         before)
         self.device.quarnctl("backup")
         pid = wait_until(self.device.daemon_pid, "the daemon runs")
         with open("/proc/%d/status" % pid) as file:
@@ -135,7 +148,8 @@ class WithTheUnitsCapabilities(TestCase):
         self.assertEqual(0x3000000db, int(effective, 16))
         self.device.quarnctl("app", "export", self.PACKAGE)
         shutil.rmtree(self.device.app_path(self.PACKAGE, "data/deep"))
-        for path in ("data/program", "data/closed", "shared/data/list"):
+        for path in ("data/program", "data/closed", "shared/data/list", "data/shut/text",
+                     "data/fixed/text"):
             os.unlink(self.device.app_path(self.PACKAGE, path))
         self.device.quarnctl("app", "restore", self.PACKAGE)
         self.assertEqual(before, self.present())

@@ -162,6 +162,72 @@ TEST(Verdict, ARefusalIsLoggedWithItsCallerAndMethod) {
   EXPECT_EQ(captured_log().size(), 1U);
 }
 
+gint64 moment = 0;
+
+/** Callers that ask again and again for what they may not have. */
+class Flood : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    forget_callers();
+    set_client_group(7001);
+    set_refusal_clock([] { return moment; });
+    clear_captured_log();
+  }
+  void TearDown() override {
+    forget_callers();
+    set_refusal_clock(nullptr);
+  }
+  static void refuse(unsigned int times, const quarn_caller &caller = {true, 1, {1}, ""}) {
+    const quarn_subject asked{kQuarnInterface, "backup_enable", "", -1, false};
+    for (unsigned int i = 0; i < times; ++i) {
+      judge_call(caller, ":1." + std::to_string(i), asked, false);
+    }
+  }
+};
+
+TEST_F(Flood, ACallersRefusalsHaveABoundedNumberOfLinesHoweverManyConnectionsItHas) {
+  refuse(100'000);
+  ASSERT_EQ(captured_log().size(), kMostRefusalLines);
+  EXPECT_EQ(count_logged(DLOG_ERROR,
+                         "refused : backup_enable of (:1.59) : it is for root and the group quarn"),
+            1)
+      << "the last one that is told";
+}
+
+TEST_F(Flood, NobodyHidesWhatOthersAreRefused) {
+  refuse(1'000);
+  clear_captured_log();
+  refuse(1, {true, 2, {2}, ""});
+  refuse(1, {true, 1, {1}, "org.example.notes"});
+  refuse(1, {});
+  EXPECT_EQ(captured_log().size(), 3U);
+}
+
+TEST_F(Flood, WhatWasLeftOutIsToldWhenThePeriodIsOver) {
+  refuse(kMostRefusalLines + 5);
+  clear_captured_log();
+  moment += kRefusalPeriod - 1;
+  refuse(1);
+  EXPECT_TRUE(captured_log().empty());
+  moment += 1;
+  refuse(1, {true, 2, {2}, ""});
+  EXPECT_EQ(count_logged(DLOG_ERROR, "refused : 6 more calls of user 1"), 1);
+  clear_captured_log();
+  refuse(1);
+  EXPECT_EQ(captured_log().size(), 1U) << "a new period has lines of its own";
+}
+
+TEST_F(Flood, WhatWasLeftOutIsToldAtTheEnd) {
+  refuse(kMostRefusalLines + 1, {true, 5000, {}, "org.example.notes"});
+  clear_captured_log();
+  forget_callers();
+  EXPECT_EQ(
+      count_logged(DLOG_ERROR, "refused : 1 more calls of user 5000, label org.example.notes"), 1);
+  clear_captured_log();
+  forget_callers();
+  EXPECT_TRUE(captured_log().empty());
+}
+
 /** On a real bus. */
 class AskedBus : public ::testing::Test {
  protected:
