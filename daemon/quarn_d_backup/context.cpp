@@ -13,6 +13,7 @@
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/own_place.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
@@ -94,6 +95,17 @@ bool wait_in_run(backup_context *ctx, lease_table &table, std::unique_lock<std::
   return !stop;
 }
 
+void on_packing_ended() {
+  lease_table &table = leases();
+  const std::lock_guard<std::mutex> lock(table.mutex);
+  wake_waiters(table);
+}
+
+/** One package is packed at a time, and an export may take as long as it has data. */
+bool must_wait_for_packing(const std::string &pkg_id) {
+  return pkg_id != kStagedListLease && any_package_is_packed();
+}
+
 }  // namespace
 
 backup_context::backup_context() : notes(std::make_shared<run_notes>()), run_id(++last_run_id) {}
@@ -133,16 +145,20 @@ int backup_context_init(backup_context *ctx) {
 
 bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id) {
   lease_table &table = leases();
+  set_packing_ended_hook(on_packing_ended);
   std::unique_lock<std::mutex> lock(table.mutex);
   for (;;) {
-    const auto holder = table.holders.emplace(pkg_id, ctx).first;
-    if (holder->second == ctx) return true;
+    const bool held = table.holders.emplace(pkg_id, ctx).first->second == ctx;
+    if (held && !must_wait_for_packing(pkg_id)) return true;
     const bool goes_on =
         on_main_thread() ? wait_in_loop(table, lock) : wait_in_run(ctx, table, lock);
-    if (!goes_on) {
-      LOGE("gave up waiting for the archive of (%s)", pkg_id.c_str());
-      return false;
+    if (goes_on) continue;
+    LOGE("gave up waiting for the archive of (%s)", pkg_id.c_str());
+    if (held) {
+      table.holders.erase(pkg_id);
+      wake_waiters(table);
     }
+    return false;
   }
 }
 

@@ -12,6 +12,7 @@ struct Uses {
   std::condition_variable ended;
   std::optional<std::string> packed;
   std::optional<std::string> changed;
+  void (*packing_ended)() = nullptr;
 };
 
 Uses &uses() {
@@ -40,9 +41,26 @@ PackageDataLock::PackageDataLock(const std::string &pkg_id, PackageUse use)
 PackageDataLock::~PackageDataLock() {
   if (!held_) return;
   Uses &all = uses();
+  void (*hook)() = nullptr;
+  {
+    const std::lock_guard<std::mutex> lock(all.mutex);
+    (packs_ ? all.packed : all.changed).reset();
+    all.ended.notify_all();
+    if (packs_) hook = all.packing_ended;
+  }
+  if (hook != nullptr) hook();
+}
+
+bool any_package_is_packed() {
+  Uses &all = uses();
   const std::lock_guard<std::mutex> lock(all.mutex);
-  (packs_ ? all.packed : all.changed).reset();
-  all.ended.notify_all();
+  return all.packed.has_value();
+}
+
+void set_packing_ended_hook(void (*hook)()) {
+  Uses &all = uses();
+  const std::lock_guard<std::mutex> lock(all.mutex);
+  all.packing_ended = hook;
 }
 
 bool package_is_packed(const std::string &pkg_id) {

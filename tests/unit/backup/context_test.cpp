@@ -1,5 +1,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
+#include <optional>
 
 #include <filesystem>
 #include <thread>
@@ -8,6 +9,7 @@
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
@@ -128,6 +130,38 @@ TEST_F(Context, RequestsOnFibersHaveTheArchiveInTheirOrder) {
     release_staged_archive(request.get(), "org.app");
   }
   EXPECT_THAT(order, ::testing::ElementsAre("first", "second", "third"));
+}
+
+TEST_F(Context, ARequestOnAFiberWaitsForAnothersPackingWhileTheLoopGoesOn) {
+  std::optional<PackageDataLock> export_of_another;
+  export_of_another.emplace("org.other", PackageUse::kPack);
+  bool taken = false;
+  run_on_fiber([&] { taken = acquire_staged_archive(other_.get(), "org.second"); });
+  bool served = false;
+  g_idle_add(
+      [](gpointer seen) -> gboolean {
+        *static_cast<bool *>(seen) = true;
+        return G_SOURCE_REMOVE;
+      },
+      &served);
+  while (!served) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_FALSE(taken);
+  std::thread([&] { export_of_another.reset(); }).join();
+  while (!taken) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_TRUE(holds_staged_archive(other_.get(), "org.second"));
+}
+
+TEST_F(Context, ARequestThatIsWithdrawnWhileAnotherIsPackedGivesItsPlaceBack) {
+  const PackageDataLock export_of_another("org.other", PackageUse::kPack);
+  std::uint64_t number = 0;
+  bool taken = true;
+  run_on_fiber([&] {
+    number = fiber_id(current_fiber());
+    taken = acquire_staged_archive(other_.get(), "org.second");
+  });
+  EXPECT_TRUE(withdraw_waits(number));
+  while (taken) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_FALSE(holds_staged_archive(other_.get(), "org.second"));
 }
 
 TEST_F(Context, AWithdrawnRequestWaitsForNoArchive) {

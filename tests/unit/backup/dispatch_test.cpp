@@ -1,9 +1,11 @@
 #include <chrono>
+#include <optional>
 #include <thread>
 
 #include "backup_device.h"
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 
 using ::testing::_;
@@ -329,15 +331,23 @@ TEST_F(Dispatch, ABackupWhoseOutcomeIsSettledIsNotWithdrawn) {
   EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{0, 4, 1}));
 }
 
+/** In a name's place: another package is packed, by an export say. */
+constexpr char kPacking[] = "packing";
+
 /** A request that holds an archive for as long as it likes. */
 class HeldArchive {
  public:
   explicit HeldArchive(const std::string &name) : holder_(new backup_context) {
-    EXPECT_TRUE(acquire_staged_archive(holder_.get(), name));
+    if (name == kPacking) {
+      packing_.emplace("org.other", PackageUse::kPack);
+    } else {
+      EXPECT_TRUE(acquire_staged_archive(holder_.get(), name));
+    }
   }
 
  private:
   BackupContextPtr holder_;
+  std::optional<PackageDataLock> packing_;
 };
 
 class LeaseWait : public Dispatch, public ::testing::WithParamInterface<const char *> {
@@ -381,7 +391,19 @@ TEST_P(LeaseWait, IsEndedByTheLossOfWifi) {
   EXPECT_GE(cloud_.cancels, 1);
 }
 
-INSTANTIATE_TEST_SUITE_P(OfArchiveAndList, LeaseWait, ::testing::Values("org.a", kStagedListLease));
+INSTANTIATE_TEST_SUITE_P(OfArchiveAndList, LeaseWait,
+                         ::testing::Values("org.a", kStagedListLease, kPacking));
+
+TEST_F(Dispatch, ARunGoesOnWhenAnothersPackingHasEnded) {
+  install("org.a");
+  std::optional<HeldArchive> held(kPacking);
+  start(1);
+  run_until([this] { return info("backup enabled for (org.a)") == 1; });
+  EXPECT_TRUE(sent_statuses().empty());
+  held.reset();
+  finish();
+  EXPECT_THAT(sent_statuses(), ElementsAre(SentStatus{0, 4, 1}));
+}
 
 TEST_F(Dispatch, RequestIsOutstandingFromItsQueuingToItsEnd) {
   ::testing::InSequence in_order;
