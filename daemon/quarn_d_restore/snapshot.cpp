@@ -67,6 +67,8 @@ bool remove_own(const std::string &path) {
   }
   if (!is_own_file(status)) return false;
   if (!S_ISDIR(status.st_mode)) return unlinkat(parent.get(), name.c_str(), 0) == 0;
+  // One of root's that others may write the application may have moved there, with what it holds.
+  if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) return false;
   return delete_tree_at(parent.get(), name.c_str(), path, OtherTypes::kRemoved, TreeAccess::kDaemon,
                         &status);
 }

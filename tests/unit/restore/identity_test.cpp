@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <regex>
 
+#include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/package_identity.h"
 #include "restore_fixture.h"
 
@@ -141,6 +142,23 @@ TEST_F(IdentityTest, WhatASnapshotKeepsByItsLastNameIsNotReadByAnotherNameOfTheS
     EXPECT_EQ(errno, EACCES) << name;
     std::filesystem::remove(at(mine + name));
   }
+}
+
+TEST_F(IdentityTest, AFolderOfRootsThatTheApplicationMayHaveMovedIsNotRemovedAsTheDaemonsOwn) {
+  const restore_files files(kPkg, root);
+  for (const std::string &place : {files.snapshot, files.aside, files.table_aside}) {
+    ASSERT_EQ(mkdir(place.c_str(), 0777), 0);
+    ASSERT_EQ(chmod(place.c_str(), 0777), 0);
+    write_text(place + "/roots", "root's");
+  }
+  EXPECT_FALSE(remove_snapshot(files));
+  forget_told_snapshot(files);
+  put_own_table_back(files);
+  for (const std::string &place : {files.snapshot, files.aside, files.table_aside}) {
+    EXPECT_EQ(read_text(place + "/roots"), "root's") << place;
+    std::filesystem::remove_all(place);
+  }
+  clear_captured_log();
 }
 
 TEST_F(IdentityTest, AnApplicationsOwnHardLinksAreNoReasonToRefuse) {
