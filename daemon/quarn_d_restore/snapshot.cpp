@@ -22,6 +22,8 @@ constexpr mode_t kSnapshotMode = 0700;
 constexpr std::size_t kSmallFile = 64 << 10;
 constexpr mode_t kCopyMode = 0600;
 constexpr mode_t kFolderMode = 0755;
+/** As far as it goes by the folder's mode, anybody may have put there what it holds. */
+constexpr mode_t kLinksFolderMode = S_IRWXU | S_IWOTH;
 constexpr char kAsideName[] = "/table";
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
 constexpr std::size_t kOpenAtOnce = 32;
@@ -65,6 +67,8 @@ bool remove_own(const std::string &path) {
   }
   if (!is_own_file(status)) return false;
   if (!S_ISDIR(status.st_mode)) return unlinkat(parent.get(), name.c_str(), 0) == 0;
+  // One of root's that others may write the application may have moved there, with what it holds.
+  if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) return false;
   return delete_tree_at(parent.get(), name.c_str(), path, OtherTypes::kRemoved, TreeAccess::kDaemon,
                         &status);
 }
@@ -269,7 +273,8 @@ class SnapshotCopy {
 
   /**
    * Keep a file by a second name: somebody else's, which the application cannot read, so that
-   * nothing of it may be copied or changed. It goes back as what it is.
+   * nothing of it may be copied or changed. It goes back as what it is. When this is its last name
+   * one day, and the application has let a walk into the snapshot by another, it is refused still.
    */
   bool keep_unreadable(const Found &found, UniqueFd *target) {
     if (!S_ISREG(found.status.st_mode) || found.readable ||
@@ -277,8 +282,9 @@ class SnapshotCopy {
       return false;
     }
     if (!*target) *target = make_folder(path_.substr(root_.size() + 1));
-    if (*target && linkat(AT_FDCWD, own_fd_path(found.object.get()).c_str(), target->get(),
-                          found.entry->name.c_str(), AT_SYMLINK_FOLLOW) == 0) {
+    if (*target && fchmod(target->get(), kLinksFolderMode) == 0 &&
+        linkat(AT_FDCWD, own_fd_path(found.object.get()).c_str(), target->get(),
+               found.entry->name.c_str(), AT_SYMLINK_FOLLOW) == 0) {
       // known to the table, which has no attributes for it
       json_object_object_add(table_->root, path_.c_str() + root_.size() + 1,
                              json_object_new_object());

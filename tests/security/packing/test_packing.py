@@ -1,12 +1,14 @@
 """An application works against the backup of its own data: nothing but what was packed is sent, and
 what it puts into /tmp stops nothing."""
 import contextlib
+import fcntl
 import io
 import os
 import signal
 import socket
 import stat
 import sys
+import threading
 import time
 import unittest
 import zipfile
@@ -109,6 +111,45 @@ class Packing(TestCase):
         self.back_up_changed()
         self.assertIn(PACKAGE + ".zip", [os.path.basename(path) for path, _ in self.sent()],
                       "it is backed up when the attack has ended")
+
+
+    def test_what_is_exchanged_while_the_store_is_slow_is_not_sent(self):
+        packages = (PACKAGE, OTHER)
+        for package in packages:
+            with open(self.device.app_path(package, "data/much"), "wb") as file:
+                file.write(os.urandom(8 << 20))
+        huge = self.path("huge")
+        with open(os.open(huge, os.O_WRONLY | os.O_CREAT, 0o600), "wb") as file:
+            file.write(MARKER)
+        # below the applications' folder, which the device's own hides from its users
+        names = ["%s/shared/data/%s_upload.zip" % (package, package) for package in packages]
+        archives = [self.device.app_path("", name) for name in names]
+        places = [os.open(path, os.O_PATH | os.O_DIRECTORY)
+                  for path in (self.directory, self.device.app_path(""))]
+        store = os.open(self.device.cloud, os.O_RDONLY | os.O_DIRECTORY)
+        for place in places:
+            self.addCleanup(os.close, place)
+        self.addCleanup(os.close, store)
+        backup = threading.Thread(target=self.device.quarnctl, args=("backup",),
+                                  kwargs={"check": False})
+        # One lies there while the other is packed, and both while the store is slow.
+        with kernel_settings({"fs.protected_hardlinks": "0"}), \
+                application(exchange, *places, names):
+            backup.start()
+            try:
+                while backup.is_alive() and not any(map(os.path.lexists, archives)):
+                    pass
+                fcntl.flock(store, fcntl.LOCK_EX)
+                wait_until(lambda: all("request upload for (%s)" % package in self.device.log()
+                                       for package in packages), "both are to be sent")
+            finally:
+                fcntl.flock(store, fcntl.LOCK_UN)
+                backup.join()
+        self.check_cloud()
+        self.assertIn("was exchanged, so it is not sent", self.device.log())
+        self.device.quarnctl("backup")
+        self.check_cloud()
+        self.assertEqual(2, sum(path.endswith(".zip") for path, _ in self.sent()))
 
 
 class Squatting(TestCase):

@@ -1,10 +1,13 @@
 // Whose files a restore makes, reads and changes.
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <regex>
 
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/package_identity.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -113,6 +116,49 @@ TEST_F(IdentityTest, ALinkToAnothersFileIsReplacedAndTheFileStaysAsItIs) {
     EXPECT_EQ(label_of(secret), "secret");
     EXPECT_EQ(read_text(secret), "secret");
   }
+}
+
+TEST_F(IdentityTest, WhatASnapshotKeepsByItsLastNameIsNotReadByAnotherNameOfTheSnapshot) {
+  const std::string secret = base + "/secret";
+  write_text(secret, "secret");
+  ASSERT_EQ(chmod(secret.c_str(), 0600), 0);
+  dir("data/folder");
+  for (const char *name : {"data/a", "data/folder/a"}) {
+    ASSERT_EQ(link(secret.c_str(), at(name).c_str()), 0);
+  }
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  chown_to("shared/data", kAppUid, kAppGid, 0755);
+  const std::string mine = "shared/data/mine";
+  ASSERT_EQ(rename(snapshot().c_str(), at(mine).c_str()), 0);
+  std::filesystem::remove(secret);
+  std::filesystem::remove(at("data/a"));
+  std::filesystem::remove(at("data/folder/a"));
+  const UniqueFd package(open(root.c_str(), O_PATH | O_DIRECTORY));
+  for (const char *name : {"/data/a", "/data/folder/a"}) {
+    EXPECT_EQ(status_of(mine + name).st_uid, 0U);
+    const UniqueFd file = open_below_as_package(package.get(), (mine + name).c_str(), O_RDONLY, 0,
+                                                user_of_package(), nullptr);
+    EXPECT_FALSE(file) << name;
+    EXPECT_EQ(errno, EACCES) << name;
+    std::filesystem::remove(at(mine + name));
+  }
+}
+
+TEST_F(IdentityTest, AFolderOfRootsThatTheApplicationMayHaveMovedIsNotRemovedAsTheDaemonsOwn) {
+  const restore_files files(kPkg, root);
+  for (const std::string &place : {files.snapshot, files.aside, files.table_aside}) {
+    ASSERT_EQ(mkdir(place.c_str(), 0777), 0);
+    ASSERT_EQ(chmod(place.c_str(), 0777), 0);
+    write_text(place + "/roots", "root's");
+  }
+  EXPECT_FALSE(remove_snapshot(files));
+  forget_told_snapshot(files);
+  put_own_table_back(files);
+  for (const std::string &place : {files.snapshot, files.aside, files.table_aside}) {
+    EXPECT_EQ(read_text(place + "/roots"), "root's") << place;
+    std::filesystem::remove_all(place);
+  }
+  clear_captured_log();
 }
 
 TEST_F(IdentityTest, AnApplicationsOwnHardLinksAreNoReasonToRefuse) {

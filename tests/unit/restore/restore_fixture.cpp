@@ -92,6 +92,8 @@ void relabel_below(UniqueFd fd, const std::string &label) {
     UniqueFd object(openat(dirfd(dir.get()), name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK));
     struct stat status = {};
     if (!object || fstat(object.get(), &status) != 0) continue;
+    // the service labels nothing by a second name
+    if (!S_ISDIR(status.st_mode) && status.st_uid != kAppUid) continue;
     put_label(("/proc/self/fd/" + std::to_string(object.get())).c_str(), label.c_str(), true);
     if (S_ISDIR(status.st_mode)) relabel_below(std::move(object), label);
   }
