@@ -2,6 +2,7 @@
 
 #include <iterator>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <utility>
 
@@ -33,6 +34,9 @@ using call_key = std::pair<std::string, guint32>;
 std::mutex &calls_mutex = *new std::mutex;
 std::map<call_key, delivered_call> &calls = *new std::map<call_key, delivered_call>;
 bool answered_all = false;
+std::mutex &held_mutex = *new std::mutex;
+std::map<std::string, unsigned int> &held_of = *new std::map<std::string, unsigned int>;
+unsigned int held_calls = 0;
 
 std::string text_or_empty(const char *text) { return text == nullptr ? "" : text; }
 
@@ -59,6 +63,14 @@ void refuse(GDBusMessage *message, const char *name, const std::string &text) {
 
 bool is(GDBusMessage *message, const char *method) {
   return g_strcmp0(g_dbus_message_get_member(message), method) == 0;
+}
+
+void release_call(gpointer data) {
+  const std::unique_ptr<std::string> sender(static_cast<std::string *>(data));
+  const std::lock_guard<std::mutex> lock(held_mutex);
+  --held_calls;
+  const auto found = held_of.find(*sender);
+  if (--found->second == 0) held_of.erase(found);
 }
 
 /** Accept a request that nobody has looked at, so that it has its last callback. */
@@ -155,6 +167,34 @@ bool refuse_unlooked(GDBusMessage *message, quarn_call_form form) {
 }
 
 }  // namespace
+
+bool count_quarn_call(GDBusMessage *message) {
+  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
+  const quarn_caller caller = known_caller(sender);
+  const bool is_root = caller.known && caller.uid == 0;
+  {
+    const std::lock_guard<std::mutex> lock(held_mutex);
+    const unsigned int most = held_calls < kManyCalls ? kMostCallsOfCaller : kFewCallsOfCaller;
+    unsigned int &held = held_of[sender];
+    if (held >= most && !is_root) return false;
+    ++held;
+    ++held_calls;
+  }
+  g_object_set_data_full(G_OBJECT(message), "quarn-held", new std::string(sender), release_call);
+  return true;
+}
+
+void refuse_quarn_call(GDBusConnection *connection, GDBusMessage *message) {
+  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
+  if (tells_of_refusal(known_caller(sender))) {
+    LOGE("refused : too many calls of (%s) wait", sender.c_str());
+  }
+  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+  const MessagePtr answer(g_dbus_message_new_method_error_literal(
+      message, "org.freedesktop.DBus.Error.LimitsExceeded", "Too many calls are waiting"));
+  g_dbus_connection_send_message(connection, answer.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
+                                 nullptr);
+}
 
 void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
   if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
