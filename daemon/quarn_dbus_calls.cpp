@@ -65,6 +65,16 @@ bool is(GDBusMessage *message, const char *method) {
   return g_strcmp0(g_dbus_message_get_member(message), method) == 0;
 }
 
+bool hold_call(const std::string &sender, bool unbounded) {
+  const std::lock_guard<std::mutex> lock(held_mutex);
+  const unsigned int most = held_calls < kManyCalls ? kMostCallsOfCaller : kFewCallsOfCaller;
+  unsigned int &held = held_of[sender];
+  if (held >= most && !unbounded) return false;
+  ++held;
+  ++held_calls;
+  return true;
+}
+
 void release_call(gpointer data) {
   const std::unique_ptr<std::string> sender(static_cast<std::string *>(data));
   const std::lock_guard<std::mutex> lock(held_mutex);
@@ -171,29 +181,12 @@ bool refuse_unlooked(GDBusMessage *message, quarn_call_form form) {
 bool count_quarn_call(GDBusMessage *message) {
   const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
   const quarn_caller caller = known_caller(sender);
-  const bool is_root = caller.known && caller.uid == 0;
-  {
-    const std::lock_guard<std::mutex> lock(held_mutex);
-    const unsigned int most = held_calls < kManyCalls ? kMostCallsOfCaller : kFewCallsOfCaller;
-    unsigned int &held = held_of[sender];
-    if (held >= most && !is_root) return false;
-    ++held;
-    ++held_calls;
+  if (!hold_call(sender, caller.known && caller.uid == 0)) {
+    if (tells_of_refusal(caller)) LOGE("refused : too many calls of (%s) wait", sender.c_str());
+    return false;
   }
   g_object_set_data_full(G_OBJECT(message), "quarn-held", new std::string(sender), release_call);
   return true;
-}
-
-void refuse_quarn_call(GDBusConnection *connection, GDBusMessage *message) {
-  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
-  if (tells_of_refusal(known_caller(sender))) {
-    LOGE("refused : too many calls of (%s) wait", sender.c_str());
-  }
-  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
-  const MessagePtr answer(g_dbus_message_new_method_error_literal(
-      message, "org.freedesktop.DBus.Error.LimitsExceeded", "Too many calls are waiting"));
-  g_dbus_connection_send_message(connection, answer.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
-                                 nullptr);
 }
 
 void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
