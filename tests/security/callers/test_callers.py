@@ -156,6 +156,44 @@ class Outsiders(Attack):
             self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
 
 
+#: Calls that want no answer, of which the bus lets any number wait.
+SHOUTER = """
+import sys
+from gi.repository import Gio, GLib
+flags = Gio.DBusConnectionFlags
+bus = Gio.DBusConnection.new_for_address_sync(
+    sys.argv[1], flags.AUTHENTICATION_CLIENT | flags.MESSAGE_BUS_CONNECTION, None, None)
+for _ in range(20000):
+    call = Gio.DBusMessage.new_method_call(
+        sys.argv[2], "/org/orvane/Quarn/GDBus", "org.orvane.Quarn", "make_app_data")
+    call.set_body(GLib.Variant("(s)", ("a" * 4000,)))
+    call.set_flags(Gio.DBusMessageFlags.NO_REPLY_EXPECTED)
+    bus.send_message(call, Gio.DBusSendMessageFlags.NONE)
+bus.flush_sync(None)
+"""
+#: Bytes of the log that the refusals of one user may fill, other calls' lines included.
+MOST_LOG = 512 << 10
+
+
+class Shouting(Attack):
+    def test_takes_neither_memory_nor_the_log(self):
+        client = self.new_client()
+        client.call("last_bu_time")
+        before = len(self.device.log())
+        shouters = [subprocess.Popen(
+            [sys.executable, "-c", SHOUTER, self.device.bus_address(), NAME],
+            user=APPLICATION, group=APPLICATION, extra_groups=[]) for _ in range(2)]
+        most = 0
+        while any(process.poll() is None for process in shouters):
+            client.call("last_bu_time")
+            most = max(most, self.memory_kb())
+        self.assertEqual([process.wait() for process in shouters], [0, 0])
+        client.call("last_bu_time")
+        self.assertLess(len(self.device.log()) - before, MOST_LOG)
+        if not self.is_sanitized():
+            self.assertLess(max(most, self.memory_kb()), MEMORY_LIMIT_KB)
+
+
 class TooMuch(Attack):
     def test_three_million_candidates_are_refused_and_the_daemon_goes_on(self):
         client = self.new_client()
