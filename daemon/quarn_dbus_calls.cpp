@@ -2,7 +2,6 @@
 
 #include <iterator>
 #include <map>
-#include <memory>
 #include <mutex>
 #include <utility>
 
@@ -34,9 +33,6 @@ using call_key = std::pair<std::string, guint32>;
 std::mutex &calls_mutex = *new std::mutex;
 std::map<call_key, delivered_call> &calls = *new std::map<call_key, delivered_call>;
 bool answered_all = false;
-std::mutex &held_mutex = *new std::mutex;
-std::map<std::string, unsigned int> &held_of = *new std::map<std::string, unsigned int>;
-unsigned int held_calls = 0;
 
 std::string text_or_empty(const char *text) { return text == nullptr ? "" : text; }
 
@@ -63,24 +59,6 @@ void refuse(GDBusMessage *message, const char *name, const std::string &text) {
 
 bool is(GDBusMessage *message, const char *method) {
   return g_strcmp0(g_dbus_message_get_member(message), method) == 0;
-}
-
-bool hold_call(const std::string &sender, bool unbounded) {
-  const std::lock_guard<std::mutex> lock(held_mutex);
-  const unsigned int most = held_calls < kManyCalls ? kMostCallsOfCaller : kFewCallsOfCaller;
-  unsigned int &held = held_of[sender];
-  if (held >= most && !unbounded) return false;
-  ++held;
-  ++held_calls;
-  return true;
-}
-
-void release_call(gpointer data) {
-  const std::unique_ptr<std::string> sender(static_cast<std::string *>(data));
-  const std::lock_guard<std::mutex> lock(held_mutex);
-  --held_calls;
-  const auto found = held_of.find(*sender);
-  if (--found->second == 0) held_of.erase(found);
 }
 
 /** Accept a request that nobody has looked at, so that it has its last callback. */
@@ -177,17 +155,6 @@ bool refuse_unlooked(GDBusMessage *message, quarn_call_form form) {
 }
 
 }  // namespace
-
-bool count_quarn_call(GDBusMessage *message) {
-  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
-  const quarn_caller caller = known_caller(sender);
-  if (!hold_call(sender, caller.known && caller.uid == 0)) {
-    if (tells_of_refusal(caller)) LOGE("refused : too many calls of (%s) wait", sender.c_str());
-    return false;
-  }
-  g_object_set_data_full(G_OBJECT(message), "quarn-held", new std::string(sender), release_call);
-  return true;
-}
 
 void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
   if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;

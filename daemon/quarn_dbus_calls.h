@@ -22,19 +22,6 @@ enum class quarn_call_form {
   too_large        /**< its arguments were thrown away */
 };
 
-/** Calls of one connection that want no answer and may be held at once. */
-inline constexpr unsigned int kMostCallsOfCaller = 128;
-/** Such calls of all that are held when each connection may have only kFewCallsOfCaller. */
-inline constexpr unsigned int kManyCalls = 1024;
-inline constexpr unsigned int kFewCallsOfCaller = 4;
-
-/**
- * Count a call that wants no answer for as long as its message is kept: the bus lets any number of
- * them through, faster than they are looked at. Bus thread.
- * @return false when its connection has too many already, which is logged; root's never has
- */
-bool count_quarn_call(GDBusMessage *message);
-
 /** A call was delivered. Bus thread. */
 void note_quarn_call(GDBusMessage *message, quarn_call_form form);
 /** A message leaves: an answer, maybe. Bus thread. */

@@ -654,8 +654,6 @@ GDBusMessage *filter_calls(GDBusConnection *connection, GDBusMessage *message, g
   const quarn_call_form form = form_of_call(static_cast<const GDBusNodeInfo *>(user_data), message);
   MessagePtr owned(message);
   if (form == quarn_call_form::too_large) owned = without_body(owned.get());
-  // The bus bounds those that want an answer.
-  if (wants_no_reply(owned.get()) && !count_quarn_call(owned.get())) return nullptr;
   note_quarn_call(owned.get(), form);
   const bool of_library = form == quarn_call_form::right ||
                           (form == quarn_call_form::of_other_object && has_own_handler(message));

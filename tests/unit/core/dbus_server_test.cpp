@@ -22,7 +22,6 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
 
@@ -301,34 +300,6 @@ TEST_F(Callers, CallsThatWaitForTheAnswerKeepTheirOrderAndHoldUpNobody) {
   EXPECT_TRUE(run_until([&] { return outcomes.back()->finished; }));
   EXPECT_EQ(steps, (Texts{"cancel", "backup_enable 0", "cancel", "cancel", "backup_enable 2"}));
   EXPECT_FALSE(quarnd_calls_unjudged());
-}
-
-void shout(GDBusConnection *connection, const char *method) {
-  GDBusMessage *message =
-      g_dbus_message_new_method_call("org.orvane.Quarn", kQuarnObjectPath, kQuarnInterface, method);
-  g_dbus_message_set_body(message, g_variant_new("(i)", 1));
-  g_dbus_message_set_flags(message, G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED);
-  g_dbus_connection_send_message(connection, message, G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
-                                 nullptr);
-  g_object_unref(message);
-}
-
-TEST_F(Callers, AConnectionHasABoundedNumberOfCallsHeldAndTheRestAreRefusedAtOnce) {
-  held_ = true;
-  for (unsigned int i = 0; i < kMostCallsOfCaller + 2; ++i) {
-    shout(client_->connection(), i % 2 == 0 ? "fly" : "backup_enable");
-  }
-  const std::string line = "refused : too many calls of (" + client_->name() + ") wait";
-  EXPECT_TRUE(run_until([&] { return count_logged(DLOG_ERROR, line) == 2; }));
-  EXPECT_TRUE(run_until([this] { return !questions_.empty(); }));
-  held_ = false;
-  told_ = {true, 0, {}, ""};
-  ScriptedClient other;
-  EXPECT_EQ(other.call("set_activation", "(1,)").reply, "(0,)") << "nobody else waits for it";
-  steps.clear();
-  questions_.front()({true, 1, {kGroup}, ""});
-  EXPECT_EQ(client_->call("set_activation", "(1,)").reply, "(0,)") << "they count no longer";
-  EXPECT_EQ(std::count(steps.begin(), steps.end(), "backup_enable 1"), kMostCallsOfCaller / 2);
 }
 
 gboolean run_work(gpointer work) {
