@@ -454,6 +454,8 @@ class Announced {
     }
     // Nothing says that what is read over and over comes to anything.
     if (read_ > kMostReadings * archive_size_) return "its entries lie over one another";
+    folders_ += new_folders(name);
+    if (folders_ > kMostFolders) return "its directories are more than a backup can hold";
     if (names_ > kMaxUnpackedSize) return "its names are longer than a backup's can be";
     if (depth_of(name) > kMaxDirDepth) return "its directories are deeper than a backup's can be";
     return nullptr;
@@ -461,12 +463,25 @@ class Announced {
 
  private:
   static constexpr std::uint64_t kMostReadings = 2;
+  /** Some are counted again where the entries do not come in the order of a walk. */
+  static constexpr std::uint64_t kMostFolders = 4 * kMaxArchiveEntries;
+
+  /** Directories on the way to an entry that were not on the way to the one before. */
+  std::uint64_t new_folders(const char *name) {
+    const std::string path = name;
+    const auto differ = std::mismatch(path.begin(), path.end(), before_.begin(), before_.end());
+    const auto count = std::count(differ.first, path.end(), '/');
+    before_ = path;
+    return static_cast<std::uint64_t>(count);
+  }
 
   const std::uint64_t archive_size_;
   std::uint64_t entries_ = 0;
   std::uint64_t size_ = 0;
   std::uint64_t read_ = 0;
   std::uint64_t names_ = 0;
+  std::uint64_t folders_ = 0;
+  std::string before_;
 };
 
 constexpr char kTableTooLarge[] = "its table is larger than a backup's can be";

@@ -545,6 +545,21 @@ TEST_P(ZipReader, EntriesThatLieOverOneAnotherAreRefusedBeforeAnythingIsWritten)
   EXPECT_THAT(files(), IsEmpty());
 }
 
+TEST_P(ZipReader, MoreDirectoriesThanABackupCanHoldAreRefusedBeforeAnythingIsMade) {
+  // Few entries, each with hundreds of directories of its own on its way.
+  constexpr std::uint64_t kDirectories = 300;
+  std::string way;
+  for (std::uint64_t i = 0; i < kDirectories; ++i) way += "/d";
+  std::vector<ZipEntry> entries;
+  for (std::uint64_t i = 0; i * kDirectories <= 4 * kMaxArchiveEntries; ++i) {
+    entries.push_back(stored_entry("data/" + std::to_string(i) + way + "/f", ""));
+  }
+  EXPECT_EQ(unpack(entries), QUARN_UNREADABLE);
+  EXPECT_THAT(captured_texts(), ElementsAre("refused archive " + archive_ +
+                                            ": its directories are more than a backup can hold"));
+  EXPECT_THAT(files(), IsEmpty());
+}
+
 TEST_P(ZipReader, MoreEntriesThanABackupCanHoldAreRefused) {
   std::vector<ZipEntry> entries(kMaxArchiveEntries + 1, stored_entry("data/a", ""));
   EXPECT_EQ(unpack(zip64_bytes(entries)), QUARN_UNREADABLE);
