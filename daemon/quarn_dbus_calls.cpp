@@ -2,6 +2,7 @@
 
 #include <iterator>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <utility>
 
@@ -33,6 +34,55 @@ using call_key = std::pair<std::string, guint32>;
 std::mutex &calls_mutex = *new std::mutex;
 std::map<call_key, delivered_call> &calls = *new std::map<call_key, delivered_call>;
 bool answered_all = false;
+
+/** What a message takes beside its arguments. */
+constexpr std::size_t kBytesOfCall = 2048;
+/** Arguments of any type are kept in pieces, which take more than what came. */
+constexpr std::size_t kBytesOfPiece = 16;
+/** A call of so many bytes is small. */
+constexpr std::size_t kSmallCall = 16384;
+
+/** The calls of a connection that stand. */
+struct standing_calls {
+  std::size_t count = 0;
+  std::size_t bytes = 0;
+  bool refused = false;
+};
+struct standing_call {
+  std::string sender;
+  std::size_t bytes;
+  bool of_root;
+};
+
+std::mutex &standing_mutex = *new std::mutex;
+std::map<std::string, standing_calls> &standing = *new std::map<std::string, standing_calls>;
+/** Of all but root. */
+std::size_t standing_bytes = 0;
+
+std::size_t bytes_of(GDBusMessage *message, quarn_call_form form) {
+  GVariant *const body = g_dbus_message_get_body(message);
+  const std::size_t size = body == nullptr ? 0 : g_variant_get_size(body);
+  return kBytesOfCall + (form == quarn_call_form::right ? size : size * kBytesOfPiece);
+}
+
+void forget_standing(gpointer data) {
+  const std::unique_ptr<standing_call> call(static_cast<standing_call *>(data));
+  const std::lock_guard<std::mutex> lock(standing_mutex);
+  const auto found = standing.find(call->sender);
+  found->second.bytes -= call->bytes;
+  if (!call->of_root) standing_bytes -= call->bytes;
+  if (--found->second.count == 0) standing.erase(found);
+}
+
+/** Under standing_mutex. */
+bool has_room(const standing_call &call) {
+  if (call.of_root) return true;
+  const auto found = standing.find(call.sender);
+  const standing_calls own = found == standing.end() ? standing_calls{} : found->second;
+  if (own.count < kCallsAlwaysTaken && call.bytes <= kSmallCall) return true;
+  return own.bytes + call.bytes <= kMostBytesOfConnection &&
+         standing_bytes + call.bytes <= kMostBytesOfConnections;
+}
 
 std::string text_or_empty(const char *text) { return text == nullptr ? "" : text; }
 
@@ -155,6 +205,42 @@ bool refuse_unlooked(GDBusMessage *message, quarn_call_form form) {
 }
 
 }  // namespace
+
+bool take_quarn_call(GDBusMessage *message, quarn_call_form form) {
+  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
+  const quarn_caller caller = known_caller(sender);
+  auto call = std::make_unique<standing_call>(
+      standing_call{sender, bytes_of(message, form), caller.known && caller.uid == 0});
+  {
+    const std::lock_guard<std::mutex> lock(standing_mutex);
+    if (!has_room(*call)) return false;
+    standing_calls &own = standing[sender];
+    ++own.count;
+    own.bytes += call->bytes;
+    if (!call->of_root) standing_bytes += call->bytes;
+  }
+  static const GQuark kStanding = g_quark_from_static_string("quarn-standing-call");
+  g_object_set_qdata_full(G_OBJECT(message), kStanding, call.release(), forget_standing);
+  return true;
+}
+
+void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message) {
+  const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
+  bool first = true;
+  {
+    const std::lock_guard<std::mutex> lock(standing_mutex);
+    const auto found = standing.find(sender);
+    if (found != standing.end()) first = !std::exchange(found->second.refused, true);
+  }
+  if (first && tells_of_refusal(known_caller(sender))) {
+    LOGE("refused : too many calls of (%s) wait", sender.c_str());
+  }
+  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+  const MessagePtr answer(g_dbus_message_new_method_error_literal(
+      message, "org.freedesktop.DBus.Error.LimitsExceeded", "Too many calls are waiting"));
+  g_dbus_connection_send_message(connection, answer.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
+                                 nullptr);
+}
 
 void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
   if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;

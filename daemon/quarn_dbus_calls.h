@@ -10,6 +10,7 @@
 
 #include <gio/gio.h>
 
+#include <cstddef>
 #include <string>
 
 /** What can be said of a call before anyone looks into it. */
@@ -21,6 +22,23 @@ enum class quarn_call_form {
   of_other_object, /**< or of another interface */
   too_large        /**< its arguments were thrown away */
 };
+
+/** What calls that nobody has looked at yet may hold of memory, told by what they bring. */
+inline constexpr std::size_t kMostBytesOfConnection = 2 * 1024 * 1024;
+/** The same of all connections but root's. */
+inline constexpr std::size_t kMostBytesOfConnections = 4 * 1024 * 1024;
+/** So many small calls of a connection are taken whatever others have sent. */
+inline constexpr std::size_t kCallsAlwaysTaken = 4;
+
+/**
+ * Count a call that was delivered, until its message goes: the bus library reads
+ * as fast as anyone writes, and nobody waits for the main thread. Bus thread.
+ * @return false when its connection, or all of them, have sent too much that
+ * waits; it is to be kept nowhere then
+ */
+bool take_quarn_call(GDBusMessage *message, quarn_call_form form);
+/** The answer to a call that was not taken; the first of a row is logged. Bus thread. */
+void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message);
 
 /** A call was delivered. Bus thread. */
 void note_quarn_call(GDBusMessage *message, quarn_call_form form);

@@ -1,6 +1,8 @@
 #include "quarn_dbus_server.h"
 
 #include <gio/gio.h>
+#include <gio/gunixfdlist.h>
+#include <malloc.h>
 
 #include <algorithm>
 #include <atomic>
@@ -613,13 +615,50 @@ bool is_own_message(GDBusConnection *connection, GDBusMessage *message) {
                    g_dbus_connection_get_unique_name(connection)) == 0;
 }
 
-/** The same call without its arguments, which nobody is to hold while it waits. */
-MessagePtr without_body(GDBusMessage *message) {
+/** Bytes of what the allocator gives back to the system as soon as it is free. */
+constexpr int kGivenBackAtOnce = 131072;
+
+/**
+ * The same message without the arguments that nobody is to hold while it waits, and without
+ * descriptors: no method of ours takes any, and who sends enough of them would leave the process
+ * without.
+ * @return null when there are too few descriptors to copy it
+ */
+MessagePtr lightened(GDBusMessage *message, bool too_large) {
   MessagePtr copy(g_dbus_message_copy(message, nullptr));
-  // What cannot be copied (it brings descriptors) is kept as it is.
-  if (!copy) return MessagePtr(G_DBUS_MESSAGE(g_object_ref(message)));
+  if (!copy) return nullptr;
+  g_dbus_message_set_unix_fd_list(copy.get(), nullptr);
+  if (!too_large) return copy;
+  // Else the allocator takes the size of what it is given back for the measure of what to keep.
+  if (g_variant_get_size(g_dbus_message_get_body(message)) > kMostListArgumentBytes) {
+    mallopt(M_MMAP_THRESHOLD, kGivenBackAtOnce);
+  }
   g_dbus_message_set_body(copy.get(), nullptr);
   return copy;
+}
+
+bool has_descriptors(GDBusMessage *message) {
+  return g_dbus_message_get_unix_fd_list(message) != nullptr;
+}
+
+/** The answer of a client to its callback. */
+bool is_answer_of_client(GDBusMessage *message) {
+  const GDBusMessageType type = g_dbus_message_get_message_type(message);
+  if (type != G_DBUS_MESSAGE_TYPE_METHOD_RETURN && type != G_DBUS_MESSAGE_TYPE_ERROR) return false;
+  const char *const sender = g_dbus_message_get_sender(message);
+  const quarn_caller caller = known_caller(sender == nullptr ? "" : sender);
+  // Root's services are asked for more than an integer.
+  return caller.known && caller.uid != 0;
+}
+
+/** What is no call, without what nobody wants of a client. Takes @p message. */
+GDBusMessage *without_burden(MessagePtr message) {
+  GVariant *const body = g_dbus_message_get_body(message.get());
+  const bool too_large = body != nullptr && g_variant_get_size(body) > kMostListArgumentBytes;
+  const bool burdened = too_large || has_descriptors(message.get());
+  if (!burdened || !is_answer_of_client(message.get())) return message.release();
+  MessagePtr light = lightened(message.get(), too_large);
+  return light ? light.release() : message.release();
 }
 
 quarn_call_form form_of_call(const GDBusNodeInfo *node, GDBusMessage *message) {
@@ -649,16 +688,24 @@ GDBusMessage *filter_calls(GDBusConnection *connection, GDBusMessage *message, g
     note_quarn_answer(message);
     return message;
   }
-  if (g_dbus_message_get_message_type(message) != G_DBUS_MESSAGE_TYPE_METHOD_CALL) return message;
   if (is_own_message(connection, message)) return message;
-  const quarn_call_form form = form_of_call(static_cast<const GDBusNodeInfo *>(user_data), message);
   MessagePtr owned(message);
-  if (form == quarn_call_form::too_large) owned = without_body(owned.get());
-  note_quarn_call(owned.get(), form);
+  if (g_dbus_message_get_message_type(message) != G_DBUS_MESSAGE_TYPE_METHOD_CALL) {
+    return without_burden(std::move(owned));
+  }
+  const quarn_call_form form = form_of_call(static_cast<const GDBusNodeInfo *>(user_data), message);
+  const bool too_large = form == quarn_call_form::too_large;
+  MessagePtr kept =
+      too_large || has_descriptors(message) ? lightened(message, too_large) : std::move(owned);
+  if (!kept || !take_quarn_call(kept.get(), form)) {
+    refuse_untaken_call(connection, message);
+    return nullptr;
+  }
+  note_quarn_call(kept.get(), form);
   const bool of_library = form == quarn_call_form::right ||
-                          (form == quarn_call_form::of_other_object && has_own_handler(message));
-  if (of_library) return owned.release();
-  pass_to_main_thread(connection, std::move(owned), form);
+                          (form == quarn_call_form::of_other_object && has_own_handler(kept.get()));
+  if (of_library) return kept.release();
+  pass_to_main_thread(connection, std::move(kept), form);
   return nullptr;
 }
 

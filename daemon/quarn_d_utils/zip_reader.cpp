@@ -43,6 +43,8 @@ class ArchiveFile {
   ArchiveFile(const ArchiveFile &) = delete;
   ArchiveFile &operator=(const ArchiveFile &) = delete;
 
+  std::uint64_t size() const { return size_; }
+
   /** The file for minizip, which never writes or closes it. */
   zlib_filefunc64_def functions() {
     zlib_filefunc64_def table = {};
@@ -187,6 +189,15 @@ class FileSink : public ByteSink {
   bool too_long_ = false;
 };
 
+/** What is wrong with an entry whatever its name is; null: nothing. */
+const char *form_refusal(const unz_file_info64 &info) {
+  if (info.compression_method != Z_DEFLATED && info.compression_method != kStored) {
+    return "its compression is not known";
+  }
+  if ((info.flag & 1U) != 0) return "it is encrypted";
+  return nullptr;
+}
+
 /** A stored entry: its bytes as they are. */
 CodecResult copy_stored(ByteSource *source, ByteSink *sink, CodecTotals *totals) {
   constexpr std::size_t kChunk = 16U << 10;
@@ -284,11 +295,7 @@ class Unpacker {
         })) {
       return kNoData;
     }
-    if (info.compression_method != Z_DEFLATED && info.compression_method != kStored) {
-      return "its compression is not known";
-    }
-    if ((info.flag & 1U) != 0) return "it is encrypted";
-    return nullptr;
+    return form_refusal(info);
   }
 
   /** What is wrong with a name wherever it lies. */
@@ -432,23 +439,49 @@ int depth_of(const char *name) {
  */
 class Announced {
  public:
+  /** @param archive_size bytes of the file itself */
+  explicit Announced(std::uint64_t archive_size) : archive_size_(archive_size) {}
+
   /** @return why the archive is refused, null when it is not */
   const char *add(const unz_file_info64 &info, const char *name) {
     ++entries_;
     names_ += info.size_filename;
     size_ += std::min<std::uint64_t>(info.uncompressed_size, kMaxUnpackedSize + 1);
+    // A size that is a lie is read to the file's end, and costs its entry.
+    read_ += std::min<std::uint64_t>(info.compressed_size, archive_size_);
     if (entries_ > kMaxArchiveEntries || size_ > kMaxUnpackedSize) {
       return "it unpacks to more than a backup can hold";
     }
+    // Nothing says that what is read over and over comes to anything.
+    if (read_ > kMostReadings * archive_size_) return "its entries lie over one another";
+    folders_ += new_folders(name);
+    if (folders_ > kMostFolders) return "its directories are more than a backup can hold";
     if (names_ > kMaxUnpackedSize) return "its names are longer than a backup's can be";
     if (depth_of(name) > kMaxDirDepth) return "its directories are deeper than a backup's can be";
     return nullptr;
   }
 
  private:
+  static constexpr std::uint64_t kMostReadings = 2;
+  /** Some are counted again where the entries do not come in the order of a walk. */
+  static constexpr std::uint64_t kMostFolders = 4 * kMaxArchiveEntries;
+
+  /** Directories on the way to an entry that were not on the way to the one before. */
+  std::uint64_t new_folders(const char *name) {
+    const std::string path = name;
+    const auto differ = std::mismatch(path.begin(), path.end(), before_.begin(), before_.end());
+    const auto count = std::count(differ.first, path.end(), '/');
+    before_ = path;
+    return static_cast<std::uint64_t>(count);
+  }
+
+  const std::uint64_t archive_size_;
   std::uint64_t entries_ = 0;
   std::uint64_t size_ = 0;
+  std::uint64_t read_ = 0;
   std::uint64_t names_ = 0;
+  std::uint64_t folders_ = 0;
+  std::string before_;
 };
 
 constexpr char kTableTooLarge[] = "its table is larger than a backup's can be";
@@ -488,6 +521,7 @@ bool read_entry(const Archive &from, const unz_file_info64 &info, ByteSink *sink
  */
 table_state look_at_table(const Archive &from, const unz_file_info64 &info, bool closely) {
   if (info.uncompressed_size > kArchiveTableBounds.text) return table_state::beyond;
+  if (form_refusal(info) != nullptr) return table_state::malformed;  // it is not unpacked either
   unzFile archive = from.handle.get();
   if (unzOpenCurrentFile2(archive, nullptr, nullptr, kRaw) != UNZ_OK) return table_state::malformed;
   TableReader reader(TableUse::check);
@@ -507,7 +541,7 @@ table_state look_at_table(const Archive &from, const unz_file_info64 &info, bool
 const char *look_at_archive(const Archive &from, const char *pkg_id, archived_table *found) {
   const std::string table_name = std::string("shared/data/") + pkg_id + ".perm";
   unzFile archive = from.handle.get();
-  Announced announced;
+  Announced announced(from.file->size());
   std::vector<std::pair<unz64_file_pos, unz_file_info64>> tables;
   std::vector<char> name(kMaxNameSize + 1);
   for (int at = unzGoToFirstFile(archive); at == UNZ_OK; at = unzGoToNextFile(archive)) {
@@ -518,7 +552,8 @@ const char *look_at_archive(const Archive &from, const char *pkg_id, archived_ta
     }
     if (const char *why = announced.add(info, name.data())) return why;
     unz64_file_pos place = {};
-    if (table_name == name.data() && unzGetFilePos64(archive, &place) == UNZ_OK) {
+    const bool is_table = table_name == name.data() && table_name.size() == info.size_filename;
+    if (is_table && unzGetFilePos64(archive, &place) == UNZ_OK) {
       tables.emplace_back(place, info);
     }
   }
@@ -592,7 +627,7 @@ int unpack_entry(Unpacker *unpacker, const Archive &from, Announced *announced, 
 int unpack_entries(const char *pkg_id, const char *destination, const Archive &archive,
                    unzip_report *report) {
   Unpacker unpacker(pkg_id, destination);
-  Announced announced;
+  Announced announced(archive.file->size());
   CString name;
   unz_global_info64 global = {};
   unzGetGlobalInfo64(archive.handle.get(), &global);

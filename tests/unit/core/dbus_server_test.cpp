@@ -1,11 +1,14 @@
 #include "quarn_dbus_server.h"
 
 #include <fcntl.h>
+#include <gio/gunixfdlist.h>
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 
@@ -22,6 +25,7 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
 
@@ -386,6 +390,106 @@ TEST_F(Callers, ArgumentsThatNobodyWouldReadAreNotKept) {
   told_ = application("");
   ScriptedClient stranger;
   EXPECT_EQ(stranger.call("auto_backup_start", "('" + large + "',)").error_name, kDenied);
+}
+
+constexpr std::size_t kManyCalls = 2000;
+
+/** So many calls that want no answer; all have left when this returns. */
+void send_calls(ScriptedClient &client, std::size_t count) {
+  for (std::size_t i = 0; i < count; ++i) {
+    GDBusMessage *message = g_dbus_message_new_method_call("org.orvane.Quarn", kQuarnObjectPath,
+                                                           kQuarnInterface, "backup_enable");
+    g_dbus_message_set_flags(message, G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED);
+    g_dbus_message_set_body(message, g_variant_new("(i)", 1));
+    g_dbus_connection_send_message(client.connection(), message, G_DBUS_SEND_MESSAGE_FLAGS_NONE,
+                                   nullptr, nullptr);
+    g_object_unref(message);
+  }
+  client.call_bus("GetId");
+}
+
+int told_of_too_many(const ScriptedClient &client) {
+  return count_logged(DLOG_ERROR, "refused : too many calls of (" + client.name() + ") wait");
+}
+
+TEST_F(Callers, CallsThatNobodyHasLookedAtAreBoundedForAConnectionAndForAll) {
+  held_ = true;
+  std::vector<std::unique_ptr<ScriptedClient>> clients;
+  for (std::size_t i = 0; i < kMostBytesOfConnections / kMostBytesOfConnection; ++i) {
+    clients.push_back(std::make_unique<ScriptedClient>());
+    send_calls(*clients.back(), kManyCalls);
+    EXPECT_TRUE(run_until([&] { return told_of_too_many(*clients.back()) == 1; }));
+  }
+  EXPECT_TRUE(run_until([&] { return questions_.size() == clients.size(); }));
+  const auto answered = [](const std::shared_ptr<CallOutcome> &outcome) {
+    return run_until([&] { return outcome->finished; });
+  };
+  const auto one_more = std::make_shared<CallOutcome>();
+  clients.front()->start_call("backup_enable", "(1,)", one_more);
+  EXPECT_TRUE(answered(one_more));
+  EXPECT_EQ(one_more->error_name, kTooMany);
+  EXPECT_EQ(one_more->error_text, "Too many calls are waiting");
+  EXPECT_EQ(told_of_too_many(*clients.front()), 1) << "told once, not for each";
+
+  std::vector<std::shared_ptr<CallOutcome>> late;
+  for (std::size_t i = 0; i <= kCallsAlwaysTaken; ++i) {
+    late.push_back(std::make_shared<CallOutcome>());
+    client_->start_call("backup_enable", "(1,)", late.back());
+  }
+  EXPECT_TRUE(answered(late.back()));
+  EXPECT_EQ(late.back()->error_name, kTooMany);
+  EXPECT_FALSE(late.front()->finished) << "a few are taken whatever others send";
+
+  steps.clear();
+  for (std::size_t i = 0; i < questions_.size(); ++i) questions_[i]({true, 5000, {kGroup}, ""});
+  EXPECT_TRUE(answered(late.front()));
+  EXPECT_EQ(late.front()->reply, "(0,)");
+  const auto served = static_cast<std::size_t>(
+      std::count(steps.begin(), steps.end(), std::string("backup_enable 1")));
+  EXPECT_GT(served, kManyCalls / 2);
+  EXPECT_LT(served * 2048, kMostBytesOfConnections + 2048 * (kCallsAlwaysTaken + 1));
+  EXPECT_EQ(clients.front()->call("backup_enable", "(1,)").reply, "(0,)") << "there is room again";
+}
+
+/** How many descriptors of this process lead to @p target. */
+int descriptors_of(const std::string &target) {
+  int count = 0;
+  for (const auto &entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+    std::error_code gone;
+    if (std::filesystem::read_symlink(entry, gone).string().find(target) != std::string::npos) {
+      ++count;
+    }
+  }
+  return count;
+}
+
+TEST_F(Callers, DescriptorsThatComeWithACallAreClosedBeforeItIsLookedAt) {
+  held_ = true;
+  const int descriptor = memfd_create("brought", MFD_CLOEXEC);
+  ASSERT_GE(descriptor, 0);
+  for (const char *method : {"make_app_data", "fly"}) {
+    GDBusMessage *message = g_dbus_message_new_method_call("org.orvane.Quarn", kQuarnObjectPath,
+                                                           kQuarnInterface, method);
+    g_dbus_message_set_body(message, g_variant_new("(s)", "org.example.notes"));
+    GUnixFDList *list = g_unix_fd_list_new();
+    g_unix_fd_list_append(list, descriptor, nullptr);
+    g_dbus_message_set_unix_fd_list(message, list);
+    g_dbus_connection_send_message(client_->connection(), message, G_DBUS_SEND_MESSAGE_FLAGS_NONE,
+                                   nullptr, nullptr);
+    g_object_unref(list);
+    g_object_unref(message);
+  }
+  // The answer to what comes last tells that all of it has come.
+  client_->call_bus("GetId");
+  EXPECT_TRUE(run_until([this] { return !questions_.empty(); }));
+  EXPECT_TRUE(run_until([] { return descriptors_of("brought") == 1; }));
+  const auto last = std::make_shared<CallOutcome>();
+  client_->start_call("last_bu_time", "()", last);
+  questions_.front()({true, 0, {}, ""});
+  EXPECT_TRUE(run_until([&] { return last->finished; }));
+  EXPECT_EQ(steps.front(), "cancel");
+  EXPECT_EQ(steps[1], "make_app_data org.example.notes 0") << "the call itself is served";
+  close(descriptor);
 }
 
 TEST(Elements, AreCountedWithoutParsingAndNeverTooFew) {

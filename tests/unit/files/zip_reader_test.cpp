@@ -528,6 +528,38 @@ TEST_P(ZipReader, AByteThatClaimsToTakeFourGigabytesIsCorrupt) {
   EXPECT_EQ(report_.extracted, 1U);
 }
 
+TEST_P(ZipReader, EntriesThatLieOverOneAnotherAreRefusedBeforeAnythingIsWritten) {
+  // Each is read to the end of the same bytes, which inflate to nothing.
+  const std::string nothing("\0\0\0\xff\xff", 5);
+  std::string padding;
+  for (int i = 0; i < 20000; ++i) padding += nothing;
+  std::vector<ZipEntry> entries;
+  for (int i = 0; i < 4; ++i) {
+    entries.push_back(deflated_entry("data/" + std::to_string(i), ""));
+    entries.back().packed_size = padding.size();
+  }
+  entries.push_back(stored_entry("data/padding", padding));
+  EXPECT_EQ(unpack(entries), QUARN_UNREADABLE);
+  EXPECT_THAT(captured_texts(),
+              ElementsAre("refused archive " + archive_ + ": its entries lie over one another"));
+  EXPECT_THAT(files(), IsEmpty());
+}
+
+TEST_P(ZipReader, MoreDirectoriesThanABackupCanHoldAreRefusedBeforeAnythingIsMade) {
+  // Few entries, each with hundreds of directories of its own on its way.
+  constexpr std::uint64_t kDirectories = 300;
+  std::string way;
+  for (std::uint64_t i = 0; i < kDirectories; ++i) way += "/d";
+  std::vector<ZipEntry> entries;
+  for (std::uint64_t i = 0; i * kDirectories <= 4 * kMaxArchiveEntries; ++i) {
+    entries.push_back(stored_entry("data/" + std::to_string(i) + way + "/f", ""));
+  }
+  EXPECT_EQ(unpack(entries), QUARN_UNREADABLE);
+  EXPECT_THAT(captured_texts(), ElementsAre("refused archive " + archive_ +
+                                            ": its directories are more than a backup can hold"));
+  EXPECT_THAT(files(), IsEmpty());
+}
+
 TEST_P(ZipReader, MoreEntriesThanABackupCanHoldAreRefused) {
   std::vector<ZipEntry> entries(kMaxArchiveEntries + 1, stored_entry("data/a", ""));
   EXPECT_EQ(unpack(zip64_bytes(entries)), QUARN_UNREADABLE);
@@ -646,6 +678,12 @@ TEST_P(ZipReader, WithoutAWholeTableNothingIsUnpackedWhereThatCannotBeUndone) {
   EXPECT_EQ(found({data, deflated_entry(kTableName, "{}"), deflated_entry(kTableName, "{")}),
             archived_table::malformed)
       << "the last one stays";
+  // What is not unpacked is no table.
+  EXPECT_EQ(found({data, stored_entry(kTableName + std::string("\0", 1), "{}")}),
+            archived_table::none);
+  ZipEntry encrypted = deflated_entry(kTableName, "{}");
+  encrypted.flags |= 1;
+  EXPECT_EQ(found({data, encrypted}), archived_table::malformed);
   EXPECT_EQ(found({data, stored_entry(kTableName, R"({"data/a": {"0": 420}})")}),
             archived_table::whole);
 }
