@@ -104,7 +104,8 @@ bool names_may_be_changed(int dir, const package_user &user);
  * file of somebody else's when it has this one name only and lies in a directory
  * that the application can neither fill nor have moved there with one above it;
  * a directory of somebody else's in such a one, or in one of the application's
- * own when the application cannot have moved it there. The object that was looked at is the one that is opened.
+ * own when the application cannot have moved it there. The object that was looked at is the one
+ * that is opened.
  *
  * O_PATH answers what lies there, whoever's it is: such a descriptor says
  * nothing about whether the application could have opened it.
