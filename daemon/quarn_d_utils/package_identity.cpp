@@ -10,6 +10,8 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdint>
+#include <ctime>
 #include <string>
 #include <utility>
 
@@ -94,22 +96,52 @@ bool can_move_in(int dir, const struct stat &status, const package_user &user) {
 }
 
 /**
+ * A folder that was found in its place, by this thread and a moment ago: whoever walks a tree of
+ * somebody else's asks of the same folder for each of its entries, and of the one above it before.
+ * What the application could not move it cannot move meanwhile.
+ */
+class KnownPlace {
+ public:
+  bool is(const struct stat &status) const {
+    return status.st_ino == place_.st_ino && status.st_dev == place_.st_dev &&
+           status.st_mode == place_.st_mode && status.st_uid == place_.st_uid && now() < until_;
+  }
+  void remember(const struct stat &status) {
+    place_ = status;
+    until_ = now() + kMoment;
+  }
+
+ private:
+  static constexpr std::int64_t kMoment = 1;
+  static std::int64_t now() {
+    timespec time = {};
+    clock_gettime(CLOCK_MONOTONIC_COARSE, &time);
+    return time.tv_sec;
+  }
+  struct stat place_ = {};
+  std::int64_t until_ = 0;
+};
+thread_local KnownPlace known_place;
+
+/**
  * False when a folder of somebody else's lies in one that the application may have moved to where
  * it is now: up to a folder of the application's own, or the root of all.
  */
 bool is_in_its_place(int dir, struct stat status, const package_user &user) {
+  const struct stat asked = status;
   const ActAsRoot root;
   UniqueFd held;
-  while (status.st_uid != user.uid) {
+  while (status.st_uid != user.uid && !known_place.is(status)) {
     UniqueFd above(openat(dir, "..", kPlaceFlags | O_DIRECTORY));
     struct stat holder = {};
     if (!root || !above || fstat(above.get(), &holder) != 0) return false;
-    if (holder.st_ino == status.st_ino && holder.st_dev == status.st_dev) return true;
+    if (holder.st_ino == status.st_ino && holder.st_dev == status.st_dev) break;
     if (can_fill(dir, status, user) && can_move_in(above.get(), holder, user)) return false;
     held = std::move(above);
     dir = held.get();
     status = holder;
   }
+  known_place.remember(asked);
   return true;
 }
 
