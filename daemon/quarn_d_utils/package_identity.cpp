@@ -10,8 +10,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdint>
-#include <ctime>
 #include <string>
 #include <utility>
 
@@ -96,32 +94,28 @@ bool can_move_in(int dir, const struct stat &status, const package_user &user) {
 }
 
 /**
- * A folder that was found in its place, by this thread and a moment ago: whoever walks a tree of
- * somebody else's asks of the same folder for each of its entries, and of the one above it before.
- * What the application could not move it cannot move meanwhile.
+ * A folder that was found in its place since this thread took on another identity: whoever walks a
+ * tree of somebody else's asks of the same folder for each of its entries, and of the one above it
+ * before. What the application cannot move it cannot move meanwhile.
  */
 class KnownPlace {
  public:
   bool is(const struct stat &status) const {
-    return status.st_ino == place_.st_ino && status.st_dev == place_.st_dev &&
-           status.st_mode == place_.st_mode && status.st_uid == place_.st_uid && now() < until_;
+    return known_ && status.st_ino == place_.st_ino && status.st_dev == place_.st_dev &&
+           status.st_mode == place_.st_mode && status.st_uid == place_.st_uid;
   }
   void remember(const struct stat &status) {
     place_ = status;
-    until_ = now() + kMoment;
+    known_ = true;
   }
+  void forget() { known_ = false; }
 
  private:
-  static constexpr std::int64_t kMoment = 1;
-  static std::int64_t now() {
-    timespec time = {};
-    clock_gettime(CLOCK_MONOTONIC_COARSE, &time);
-    return time.tv_sec;
-  }
   struct stat place_ = {};
-  std::int64_t until_ = 0;
+  bool known_ = false;
 };
 thread_local KnownPlace known_place;
+thread_local int identities = 0;
 
 /**
  * False when a folder of somebody else's lies in one that the application may have moved to where
@@ -211,11 +205,13 @@ package_user user_of_package() { return {kAppUid, kAppGid}; }
 bool drop_other_groups() { return geteuid() != 0 || setgroups(0, nullptr) == 0; }
 
 FileIdentity::FileIdentity(package_user user) : before_(identity()), granted_(true) {
+  if (identities++ == 0) known_place.forget();
   if (geteuid() == 0) granted_ = become(user);
 }
 
 FileIdentity::~FileIdentity() {
   const int error = errno;
+  --identities;
   become(before_);
   errno = error;
 }
