@@ -17,6 +17,13 @@ BIN_DIR = os.environ.get("QUARN_BIN_DIR") or os.path.join(
 DEADLINE = 60
 
 
+def is_sanitized(program):
+    """Whether what it takes of memory is the sanitizer's."""
+    with open(program, "rb") as file:
+        content = file.read()
+    return b"__asan_init" in content or b"__tsan_init" in content
+
+
 def wait_until(condition, what, deadline=DEADLINE):
     """Poll until `condition()` is true; its value is returned."""
     end = time.monotonic() + deadline

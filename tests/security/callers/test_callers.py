@@ -11,7 +11,8 @@ sys.path.insert(0, os.path.join(HERE, "../../integration"))
 sys.path.insert(0, os.path.join(HERE, "../../integration/bus"))
 from bus_client import INTERFACE, NAME, PATH, Client  # noqa: E402
 from gi.repository import GLib  # noqa: E402
-from quarn_test import BIN_DIR, TestCase, make_source, read_text, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    BIN_DIR, TestCase, is_sanitized, make_source, read_text, wait_until)
 
 APPLICATION = 5000
 STRANGER = 65534
@@ -126,8 +127,7 @@ class Attack(TestCase):
         return client
 
     def is_sanitized(self):
-        with open(os.path.join(BIN_DIR, "quarnd"), "rb") as file:
-            return b"__asan_init" in (content := file.read()) or b"__tsan_init" in content
+        return is_sanitized(os.path.join(BIN_DIR, "quarnd"))
 
     def memory_kb(self):
         for line in read_text("/proc/%d/smaps_rollup" % self.device.daemon_pid()).splitlines():

@@ -10,7 +10,8 @@ import unittest
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
-from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    BIN_DIR, TestCase, is_sanitized, make_source, wait_until)
 
 import system_calls  # noqa: E402
 
@@ -18,12 +19,6 @@ UNITS = os.path.join(BIN_DIR, "../data")
 MODEL = os.path.join(HERE, "../../../docs/threat-model.md")
 MOST_EXPOSED = 3.0
 BOTH = ("quarnd.service", "quarnd-recover.service")
-
-
-def is_sanitized(program):
-    with open(program, "rb") as file:
-        content = file.read()
-    return b"__asan_init" in content or b"__tsan_init" in content
 
 
 def table(heading):
