@@ -147,7 +147,7 @@ class CallsAtTheEnd(EndTest):
                 return method, request(left), "manual_backup_cancel_result", left
             return method, arguments, None, 0
         self.churn(CALLS, choose)
-        self.assertGreater(self.device.log().count("Quarn Daemon start"), CALLS // 500)
+        self.assertGreater(self.device.log().count("Quarn Daemon start"), CALLS // 1000)
 
     def test_requests_to_a_daemon_that_keeps_ending_each_end_once(self):
         self.install()
