@@ -49,12 +49,7 @@ class FailureTest : public RestoreTest {
   int restore(const std::function<void()> &prepare) {
     before = tree_of(root);
     pkg_restore_context ctx;
-    ctx.serial = kSerial;
-    ctx.pkgid = kPkg;
-    ctx.version = kVersion;
-    ctx.root = root;
-    ctx.wait_for_result = true;
-    EXPECT_EQ(restore_app_data("app", &ctx), 0);
+    request_restore(&ctx);
     prepare();
     answer();
     EXPECT_EQ(ctx.pending, 0);

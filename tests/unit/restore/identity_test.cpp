@@ -20,12 +20,7 @@ class IdentityTest : public RestoreTest {
   }
   int restore(const std::string &archive) {
     pkg_restore_context ctx;
-    ctx.serial = kSerial;
-    ctx.pkgid = kPkg;
-    ctx.version = kVersion;
-    ctx.root = root;
-    ctx.wait_for_result = true;
-    EXPECT_EQ(restore_app_data("app", &ctx), 0);
+    request_restore(&ctx);
     std::filesystem::copy_file(archive, download(),
                                std::filesystem::copy_options::overwrite_existing);
     answer();

@@ -69,12 +69,7 @@ class RaceTest : public RestoreTest {
   }
   void restore_while(const std::string &archive, const std::function<void()> &attack) {
     pkg_restore_context ctx;
-    ctx.serial = kSerial;
-    ctx.pkgid = kPkg;
-    ctx.version = kVersion;
-    ctx.root = root;
-    ctx.wait_for_result = true;
-    ASSERT_EQ(restore_app_data("app", &ctx), 0);
+    request_restore(&ctx);
     std::filesystem::copy_file(archive, download());
     attack();
     answer();
@@ -163,12 +158,7 @@ TEST_F(RaceTest, WholeRestoresAndRollbacksTouchNothingOutside) {
     file("data/dir/file", "x");
     std::filesystem::create_directory_symlink(secret_dir, at("data/swap"));
     pkg_restore_context ctx;
-    ctx.serial = kSerial;
-    ctx.pkgid = kPkg;
-    ctx.version = kVersion;
-    ctx.root = root;
-    ctx.wait_for_result = true;
-    ASSERT_EQ(restore_app_data("app", &ctx), 0);
+    request_restore(&ctx);
     std::filesystem::copy_file(archive, download());
     swap_forever(at("data/dir"), at("data/swap"));
     answer();

@@ -32,12 +32,7 @@ class RemovalTest : public RestoreTest {
   std::string restore_until(const std::string &archive, int nth, const std::function<void()> &act) {
     install();
     pkg_restore_context ctx;
-    ctx.serial = kSerial;
-    ctx.pkgid = kPkg;
-    ctx.version = kVersion;
-    ctx.root = root;
-    ctx.wait_for_result = true;
-    EXPECT_EQ(restore_app_data("app", &ctx), 0);
+    request_restore(&ctx);
     std::filesystem::copy_file(archive, download());
     std::string last;
     steps_left = nth;

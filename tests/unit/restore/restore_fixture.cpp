@@ -436,6 +436,15 @@ void RestoreTest::make_archive(const std::string &path, const std::vector<Entry>
   make_plain_archive(path, all);
 }
 
+void RestoreTest::request_restore(pkg_restore_context *ctx) const {
+  ctx->serial = kSerial;
+  ctx->pkgid = kPkg;
+  ctx->version = kVersion;
+  ctx->root = root;
+  ctx->wait_for_result = true;
+  EXPECT_EQ(restore_app_data("app", ctx), 0);
+}
+
 pkg_restore_context *RestoreTest::new_context() const {
   auto *ctx = new pkg_restore_context;
   ctx->serial = kSerial;

@@ -105,6 +105,8 @@ class RestoreTest : public ::testing::Test {
   void make_plain_archive(const std::string &path, const std::vector<Entry> &entries) const;
 
   pkg_restore_context *new_context() const;
+  /** Fill @p ctx for a restore whose end is waited for, and request it. */
+  void request_restore(pkg_restore_context *ctx) const;
   /** Where the engine downloads to. */
   std::string download() const { return at("shared/data/org.example.notes_download.zip"); }
   std::string snapshot() const { return at("shared/data/quarn_tmp_rst_dir"); }
