@@ -92,6 +92,8 @@ int start_wifi_monitor() {
     LOGE("connection_set_type_changed_cb failed %d", ret);
     return kFailed;
   }
+  // Nobody tells of a change between the first look and the registration.
+  if (connection_get_type(g_connection, &type) == CONNECTION_ERROR_NONE) g_connection_type = type;
   wifi_monitor_started = 1;
   return kSucceeded;
 }
@@ -163,6 +165,10 @@ int start_screen_monitor() {
   if (ret != DEVICE_ERROR_NONE) {
     LOGE("Failed to set changed cb for screen : %d", ret);
     return kFailed;
+  }
+  // Nobody tells of a change between the first look and the registration.
+  if (device_display_get_state(&state) == DEVICE_ERROR_NONE) {
+    lcd_off = state == DISPLAY_STATE_SCREEN_OFF ? 1 : 0;
   }
   screen_monitor_started = 1;
   return kSucceeded;

@@ -63,6 +63,9 @@ class CleanUp(TestCase):
         return [event for event in client.callbacks("restore_enable_cb")
                 if event[1][1] == "restore_stop"]
 
+    def status(self):
+        return json.loads(self.device.quarnctl("status", "--json").stdout)
+
     def nightly(self):
         """One automatic run, by its alarm."""
         device = self.device
@@ -71,12 +74,14 @@ class CleanUp(TestCase):
         device.quarnctl("auto", "on")
         device.set("charger", "on")
         device.set("display", "off")
-        alarm = wait_until(lambda: json.loads(device.quarnctl("status", "--json").stdout)
-                           ["condition_alarm_ms"], "the conditions hold")
+        alarm = wait_until(lambda: self.status()["condition_alarm_ms"], "the conditions hold")
         due = min(device.alarms(), key=lambda one: abs(one["due_ms"] - alarm))
         device.fire(due["id"])
         device.wait_for_log("auto backup successful!", runs + 1)
+        # What is off, on and off again within its services' grain has not changed for the daemon.
+        seen = device.log().count("Lcd_Off=>0")
         device.set("display", "on")
+        device.wait_for_log("Lcd_Off=>0", seen + 1)
 
     def assert_kept(self):
         self.assertIn(GONE, self.entries())
@@ -131,16 +136,20 @@ class CleanUp(TestCase):
         with open(self.device.app_path(package, "data/file"), "rb") as file:
             return file.read()
 
+    def set_network(self, network, wifi):
+        """Network and packages are told by different services, so that what is told of one may
+        overtake what is told of the other."""
+        self.device.set("network", network)
+        wait_until(lambda: self.status()["wifi_connected"] is wifi, "the daemon knows of it")
+
     def fail_to_restore(self):
         """The package is installed where there is no Wi-Fi, so its restore is not even begun."""
         client = self.restore_on(SERIAL, [GONE])
-        self.device.set("network", "none")
+        self.set_network("none", wifi=False)
         self.install(self.device, GONE, b"as it comes from the shop")
         client.until(lambda: self.stops(client), "the mode ends")
         self.assertEqual(self.content(GONE), b"as it comes from the shop")
-        self.device.set("network", "wifi")
-        wait_until(lambda: json.loads(self.device.quarnctl("status", "--json").stdout)
-                   ["wifi_connected"], "the daemon knows of it")
+        self.set_network("wifi", wifi=True)
 
     def test_what_a_failed_restore_did_not_bring_is_not_backed_up_over(self):
         before = self.entries()[GONE]

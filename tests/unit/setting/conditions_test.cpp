@@ -148,11 +148,21 @@ TEST_F(SettingTest, WithoutItsMonitorThereIsNoWifi) {
 TEST_F(SettingTest, TheWifiMonitorUsesTheConnection) {
   init_backup_resource();
   ASSERT_NE(g_connection, nullptr);
-  EXPECT_CALL(platform, connection_get_type(g_connection, _)).Times(1);
+  EXPECT_CALL(platform, connection_get_type(g_connection, _)).Times(2);
   EXPECT_CALL(platform, connection_set_type_changed_cb(g_connection, _, IsNull())).Times(1);
   EXPECT_EQ(start_wifi_monitor(), 1);
   EXPECT_CALL(platform, connection_unset_type_changed_cb(g_connection)).Times(1);
   EXPECT_EQ(stop_wifi_monitor(), 1);
+}
+
+TEST_F(SettingTest, WifiThatIsLostWhileItsMonitorStartsIsNoticed) {
+  network = CONNECTION_TYPE_WIFI;
+  EXPECT_CALL(platform, connection_set_type_changed_cb).WillOnce([this](auto &&...) {
+    network = CONNECTION_TYPE_CELLULAR;
+    return CONNECTION_ERROR_NONE;
+  });
+  EXPECT_EQ(start_wifi_monitor(), 1);
+  EXPECT_EQ(wifi_connected(), 0);
 }
 
 TEST_F(SettingTest, AStartedWifiMonitorIsNotStartedAgain) {
@@ -351,6 +361,18 @@ TEST_F(SettingTest, TheScreenMonitorSeesADisplayThatIsOffAlready) {
   display = DISPLAY_STATE_SCREEN_OFF;
   start_wifi_monitor();
   EXPECT_CALL(platform, device_add_callback(DEVICE_CALLBACK_DISPLAY_STATE, _, IsNull())).Times(1);
+  EXPECT_EQ(start_screen_monitor(), 1);
+  EXPECT_EQ(backup_condition_pass(), 1);
+}
+
+TEST_F(SettingTest, ADisplayThatGoesOffWhileItsMonitorStartsIsNoticed) {
+  charger = true;
+  network = CONNECTION_TYPE_WIFI;
+  start_wifi_monitor();
+  EXPECT_CALL(platform, device_add_callback).WillOnce([this](auto &&...) {
+    display = DISPLAY_STATE_SCREEN_OFF;
+    return DEVICE_ERROR_NONE;
+  });
   EXPECT_EQ(start_screen_monitor(), 1);
   EXPECT_EQ(backup_condition_pass(), 1);
 }
