@@ -648,6 +648,20 @@ TEST_P(ZipReader, ATableBeyondItsBoundsIsRefusedBeforeAnythingIsWritten) {
   }
 }
 
+TEST_P(ZipReader, OnlyTheLastOfSeveralTablesIsHeldToTheBounds) {
+  // The others are an application's own file of that name.
+  const std::string own[] = {R"({"a":[[[[[1]]]]]})", "{" + std::string(std::size_t{33} << 20, ' '),
+                             R"({"a":")" + std::string(4096, 'x') + "\"}"};
+  for (const std::string &text : own) {
+    EXPECT_EQ(unpack({deflated_entry(kTableName, text), deflated_entry(kTableName, "{}")}),
+              QUARN_OK);
+    expect_report(2, 0, 0);
+    EXPECT_EQ(content_of(root_ / kTableName), "{}");
+    EXPECT_EQ(unpack({deflated_entry(kTableName, "{}"), deflated_entry(kTableName, text)}),
+              QUARN_UNREADABLE);
+  }
+}
+
 TEST_P(ZipReader, ATableThatIsNoneCostsNothingWhereTheUnpackingCanBeUndone) {
   EXPECT_EQ(unpack({deflated_entry("data/a", "x"), deflated_entry(kTableName, "not json")}),
             QUARN_OK);
