@@ -395,6 +395,7 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
     } else {
       LOGE("cannot read json info...");
     }
+    LOGE("app data restore failed, so will be cleared");
     LOGE("fail to restore for (%s)", pkgid);
     done.unpacked = QUARN_OK;
     return done;

@@ -742,17 +742,27 @@ TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAt
 TEST_F(CompanionTest, WithoutAUsableTableNothingIsUnpacked) {
   make_old_data();
   const Tree before = tree_of(root);
-  make_archive(archive(), new_data, "not json");
-  auto ctx = context(true);
-  EXPECT_EQ(restore(ctx.get()), 0);
-  EXPECT_EQ(ctx->result, 0);
-  EXPECT_EQ(ctx->pending, -1);
-  expect_error("cannot read json info...");
-  expect_error("fail to restore for (org.example.notes)");
-  expect_info("restore_app_data for org.example.notes complete");
-  EXPECT_EQ(tree_of(root), before);
-  EXPECT_EQ(progress.back().outcome, Outcome::failed);
-  EXPECT_EQ(progress.back().result, 36);
+  for (const bool has_table : {true, false}) {
+    if (has_table) {
+      make_archive(archive(), new_data, "not json");
+    } else {
+      make_plain_archive(archive(), new_data);
+    }
+    clear_captured_log();
+    auto ctx = context(true);
+    EXPECT_EQ(restore(ctx.get()), 0);
+    EXPECT_EQ(ctx->result, 0);
+    EXPECT_EQ(ctx->pending, -1);
+    EXPECT_EQ(captured_texts(),
+              (std::vector<std::string>{
+                  has_table ? "cannot read json info..." : "there isn't file-info file...",
+                  "app data restore failed, so will be cleared",
+                  "fail to restore for (org.example.notes)",
+                  "restore_app_data for org.example.notes complete"}));
+    EXPECT_EQ(tree_of(root), before);
+    EXPECT_EQ(progress.back().outcome, Outcome::failed);
+    EXPECT_EQ(progress.back().result, 36);
+  }
 }
 
 TEST_F(CompanionTest, AnArchiveBeyondTheBoundsIsRefusedWholeAndLeavesTheDataAsItIs) {
