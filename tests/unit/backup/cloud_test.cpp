@@ -496,6 +496,7 @@ TEST_F(Cloud, StrayFileInTheDevicesFolderIsLeftAlone) {
   delete_other_backup_items_in_cloud(ctx_.get());
   cloud_.answer_all();
   EXPECT_THAT(cloud_.paths(), ElementsAre(in_device("stray.txt")));
+  EXPECT_EQ(cloud_.count_requests("delete " + in_device("stray.txt")), 0);
 }
 
 TEST_F(Cloud, FoldersAfterTheFirstHundredAreFoundBeforeAnyIsRemoved) {

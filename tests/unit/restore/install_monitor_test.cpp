@@ -189,6 +189,24 @@ TEST_F(MonitorTest, WhatARestoreOnInstallationDidNotBringIsOwed) {
   EXPECT_EQ(owed(), archive_claim::none);
 }
 
+TEST_F(MonitorTest, ARestoreOnInstallationThatSucceedsLeavesNothingOwed) {
+  serial_num_user_select = kSerial;
+  install();
+  ASSERT_TRUE(exists(root + "/shared/data/quarn_tmp_rst_dir.owed"));
+  make_archive(download(), {{"data/a", "brought back"}});
+  answer();
+  EXPECT_EQ(ends.back(), (std::pair{restore_outcome::restored, 0}));
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::none);
+  EXPECT_FALSE(exists(root + "/shared/data/quarn_tmp_rst_dir.owed"));
+}
+
+TEST_F(MonitorTest, WhereTheCloudHasNoArchiveOfTheVersionOnlyTheOthersAreOwed) {
+  serial_num_user_select = kSerial;
+  install();
+  answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT);
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::versions);
+}
+
 TEST_F(MonitorTest, AnInstallThatIsNotRestoredClaimsNothingAnyMore) {
   await_archives(kSerial, {kPkg}, {});
   serial_num_user_select = kSerial;

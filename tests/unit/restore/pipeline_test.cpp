@@ -688,6 +688,24 @@ TEST_F(PipelineTest, WhatCouldNotBePutBackIsToldAndNotSnapshotOver) {
   EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
 }
 
+TEST_F(PipelineTest, ASnapshotThatIsOnlyKeptGoesWithTheNextRestoreThatSucceeds) {
+  make_old_data();
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  file("data/mine", "written since");
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  const std::string kept = "quarn_tmp_rst_dir.kept/data/settings.ini";
+  for (const bool good : {false, true}) {
+    if (good) std::filesystem::remove(at("data/mine"));  // no archive has it
+    auto ctx = waiting_context();
+    ASSERT_EQ(restore(ctx.get()), 0);
+    make_archive(download(), new_data, good ? nullptr : "not json");
+    answer();
+    EXPECT_EQ(ctx->result, good ? 0 : 36);
+    EXPECT_EQ(exists(at("shared/data/" + kept)), !good) << "what it was kept for is still to come";
+  }
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+}
+
 /* ---- from the phone-transfer companion ---- */
 
 class CompanionTest : public PipelineTest {
