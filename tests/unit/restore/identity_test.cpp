@@ -236,6 +236,9 @@ TEST_F(IdentityTest, WhatACompanionsFailedRestoreLeavesIsTheApplicationsToUse) {
   std::vector<Entry> all = told;
   all.push_back({"data/dir/untold", "new"});
   make_archive(archive, all, table_text(told).c_str());
+  file("data/theirs", "looks like a file that is unpacked");
+  chown_to("data/theirs", 5001, 100, 01000);
+  set_label(at("data/theirs"), "theirs");
   for (const int refusal : {0, -2}) {
     begin_result = refusal;
     pkg_restore_context ctx;
@@ -253,6 +256,8 @@ TEST_F(IdentityTest, WhatACompanionsFailedRestoreLeavesIsTheApplicationsToUse) {
     }
     EXPECT_EQ(label_of(at("data/dir/told")), kDataLabel);
     EXPECT_EQ(label_of(at("data/dir/untold")), kDataLabel);
+    EXPECT_EQ(status_of("data/theirs").st_mode & 07777, 01000U);
+    EXPECT_EQ(label_of(at("data/theirs")), "theirs");
   }
   std::filesystem::remove(archive);
 }

@@ -652,6 +652,7 @@ TEST_F(OwnNamesTest, BothNamesOfADownloadTakenIsARefusal) {
 
 TEST_F(PipelineTest, WhatCouldNotBePutBackIsToldAndNotSnapshotOver) {
   make_old_data();
+  file("shared/data/org.example.notes.perm", "its own, which comes back before the rest");
   const Tree before = tree_of(root);
   const auto block = [this] {
     std::filesystem::remove_all(at("data/settings.ini"));

@@ -421,6 +421,16 @@ TEST_F(SnapshotTest, ARollbackKeepsWhatNoSnapshotHolds) {
   EXPECT_EQ(tree(), before);
 }
 
+TEST_F(SnapshotTest, WhatAnEarlierReleaseHasSetAsideComesBack) {
+  make_old_data();
+  ASSERT_EQ(take(), 0);
+  spoil();
+  write_text(snapshot() + "/kept/quarn_tmp_rst_dir2", "no snapshot holds it");
+  roll_back();
+  EXPECT_EQ(read_text(at("shared/data/quarn_tmp_rst_dir2")), "no snapshot holds it");
+  EXPECT_EQ(read_text(at("data/settings.ini")), "old settings");
+}
+
 TEST_F(SnapshotTest, WithoutASnapshotARollbackTouchesNothing) {
   make_old_data();
   const Tree before = tree();
