@@ -78,6 +78,23 @@ TEST_F(IdentityTest, WhatIsClosedOrAnothersIsPutBackAsItWas) {
   EXPECT_EQ(status_of("data/secret").st_nlink, 1U);
 }
 
+TEST_F(IdentityTest, WhatLiesInAnothersFolderThatTheApplicationMayWriteIsPutBack) {
+  make_archive(base + "/broken.zip",
+               {{"data/theirs/a", "new"}, {"data/theirs/b", "new"}, {"data/theirs/in/c", "new"}},
+               "not json");
+  for (const mode_t mode : {0777, 0775, 01777}) {
+    dir("data/theirs");
+    file("data/theirs/a", "another's");
+    file("data/theirs/own", "its own");
+    chown_to("data/theirs/a", 5001, kAppGid, 0644);
+    chown_to("data/theirs", 5001, kAppGid, mode);
+    const Tree before = tree_of(root);
+    EXPECT_NE(restore(base + "/broken.zip"), 0);
+    EXPECT_EQ(tree_of(root), before) << std::oct << mode;
+    std::filesystem::remove_all(at("data/theirs"));
+  }
+}
+
 TEST_F(IdentityTest, WhatIsClosedIsRestored) {
   make_closed_data();
   make_archive(base + "/good.zip", closed_entries());
