@@ -9,6 +9,7 @@
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/request_cause.h"
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
@@ -316,6 +317,16 @@ TEST_F(Cloud, FailedUploadFailsTheRunAndFreesTheArchive) {
   EXPECT_EQ(ctx_->upload_remain, 0);
   EXPECT_FALSE(exists(app.staged()));
   EXPECT_FALSE(holds_staged_archive(ctx_.get(), "org.app"));
+}
+
+TEST_F(Cloud, CauseOfASinglePackagesUploadIsItsRequests) {
+  const FakePackage &app = staged("org.app");
+  ctx_->single_package = true;
+  fail_all();
+  note_request_end(request_cause::none);
+  upload(app);
+  cloud_.answer_all();
+  EXPECT_EQ(last_request_cause(), request_cause::server);
 }
 
 TEST_F(Cloud, RefusedUploadFailsTheRunAndFreesTheArchive) {

@@ -702,6 +702,37 @@ TEST_P(ZipReader, WithoutAWholeTableNothingIsUnpackedWhereThatCannotBeUndone) {
             archived_table::whole);
 }
 
+std::string changing_archive;
+std::string changed_bytes;
+void change_archive() {
+  const UniqueFd file(open(changing_archive.c_str(), O_WRONLY));
+  const auto size = static_cast<ssize_t>(changed_bytes.size());
+  EXPECT_EQ(pwrite(file.get(), changed_bytes.data(), changed_bytes.size(), 0), size);
+}
+
+TEST_P(ZipReader, AnArchiveThatChangesWhileItIsReadIsHeldToItsBoundsAsWell) {
+  // So many entries that the directory is not read ahead, with names of one length.
+  std::vector<ZipEntry> entries;
+  std::vector<ZipEntry> deep;
+  for (int i = 100; i < 500; ++i) {
+    std::string name = "data";
+    std::string deep_name = "data";
+    for (int part = 0; part < 4; ++part) name += "/" + std::string(199, 'n');
+    for (int part = 0; part < 400; ++part) deep_name += "/d";
+    entries.push_back(stored_entry(name + "/" + std::to_string(i), "x"));
+    deep.push_back(stored_entry(deep_name + "/" + std::to_string(i), "x"));
+  }
+  changing_archive = place_ / "archive.zip";
+  changed_bytes = zip_bytes(deep);
+  ASSERT_EQ(changed_bytes.size(), zip_bytes(entries).size());
+  set_call_hook("unzOpenCurrentFile2", change_archive);
+  EXPECT_EQ(unpack(entries), QUARN_UNREADABLE);
+  set_call_hook(nullptr, nullptr);
+  EXPECT_EQ(errors("archive was changed while it was read"), 1);
+  EXPECT_FALSE(report_.complete());
+  EXPECT_FALSE(exists(root_ / "data/d"));
+}
+
 /* ---- failures ---------------------------------------------------------------- */
 
 TEST_P(ZipReader, AnEntryThatCannotBeOpenedIsSkipped) {
