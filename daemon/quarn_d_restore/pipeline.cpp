@@ -385,6 +385,7 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
   }
   done.size = archive_size(archive);
   report_restore_step(ctx.pkgid, restore_stage::unpacking, done.size);
+  const UnpackingNote note(files);
   unzip_report report;
   archived_table table = archived_table::none;
   done.unpacked = unzip_data_with_table(pkgid, ctx.root.c_str(), archive.c_str(), &report, &table);
@@ -395,6 +396,7 @@ companion_restore unpack_from_companion(const pkg_restore_context &ctx) {
     } else {
       LOGE("cannot read json info...");
     }
+    LOGE("app data restore failed, so will be cleared");
     LOGE("fail to restore for (%s)", pkgid);
     done.unpacked = QUARN_OK;
     return done;

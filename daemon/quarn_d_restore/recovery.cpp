@@ -2,6 +2,7 @@
 
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/settle.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_lock.h"
@@ -82,6 +83,7 @@ recovery_result recover_package_data(const char *pkgid, const char *root) {
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
   const recovery_result result = recover_snapshot(pkgid, root, files);
+  settle_interrupted_unpacking(pkgid, root);
   put_own_table_back(files);
   return result;
 }

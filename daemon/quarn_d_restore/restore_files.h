@@ -26,7 +26,8 @@ struct restore_files {
         told(snapshot + "/told"),
         aside(own.snapshot() + ".kept"),
         table_aside(own.snapshot() + ".table"),
-        hidden_icon(own.snapshot() + ".icon") {}
+        hidden_icon(own.snapshot() + ".icon"),
+        unpacking(own.snapshot() + ".unpacking") {}
 
   /** True for an archive in transit. */
   bool is_archive(const std::string &path) const { return path == upload || path == download; }
@@ -50,6 +51,7 @@ struct restore_files {
   const std::string aside;       /**< such a snapshot while a further restore runs, and after it */
   const std::string table_aside; /**< holds the application's own file of the table's name */
   const std::string hidden_icon; /**< lies there while the package's icon is hidden */
+  const std::string unpacking;   /**< lies there while what nothing would undo is unpacked */
 };
 
 #endif

@@ -312,11 +312,44 @@ class MovingBack {
         folders.push_back(std::move(entry.name));
       } else if (!S_ISREG(status.st_mode)) {
         LOGE("this is unexpected type : %s", path_.c_str());
-      } else if (closed || !move_file(from, to, entry.name.c_str(), status)) {
+      } else if (closed ? !move_as_application(from, to, entry.name.c_str(), status)
+                        : !move_file(from, to, entry.name.c_str(), status)) {
         failed();
       }
     }
     return folders;
+  }
+
+  /** What a name in a folder means to the application, as the kernel has it. */
+  enum class Reach { kNone, kReplace, kSeeOnly };
+  Reach reach_of(int folder, const char *name) const {
+    const ActAsPackage acting(user_);
+    struct stat holder = {};
+    struct stat present = {};
+    if (!acting || fstat(folder, &holder) != 0 ||
+        faccessat(folder, ".", W_OK | X_OK, AT_EACCESS) != 0) {
+      return Reach::kNone;
+    }
+    const bool others_stay = (holder.st_mode & S_ISVTX) != 0 && holder.st_uid != user_.uid;
+    if (!others_stay || fstatat(folder, name, &present, AT_SYMLINK_NOFOLLOW) != 0 ||
+        present.st_uid == user_.uid) {
+      return Reach::kReplace;
+    }
+    return Reach::kSeeOnly;
+  }
+
+  /** Into a folder of somebody else's that the application may write: no more than it could do. */
+  bool move_as_application(int from, int to, const char *name, const struct stat &status) {
+    switch (reach_of(to, name)) {
+      case Reach::kReplace:
+        return move_file(from, to, name, status);
+      case Reach::kSeeOnly:
+        // Nor could the restore, so it is as it was.
+        return unlinkat(from, name, 0) == 0;
+      case Reach::kNone:
+        break;
+    }
+    return false;
   }
 
   bool move_file(int from, int to, const char *name, const struct stat &status) {

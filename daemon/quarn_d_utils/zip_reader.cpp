@@ -6,6 +6,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <iterator>
+#include <optional>
 #include <utility>
 #include <vector>
 
@@ -535,6 +536,8 @@ table_state look_at_table(const Archive &from, const unz_file_info64 &info, bool
 
 /**
  * Look at everything that an archive announces, and at its table; the entries are held to it later.
+ * Of several entries of the table's name the last is the table, and replaces the others, which are
+ * nobody's to read: an application's own file of that name, with whatever it holds.
  * @param[in,out] found asks for a close look at the table where it is not null
  * @return why it is refused, null when it is not
  */
@@ -542,7 +545,7 @@ const char *look_at_archive(const Archive &from, const char *pkg_id, archived_ta
   const std::string table_name = std::string("shared/data/") + pkg_id + ".perm";
   unzFile archive = from.handle.get();
   Announced announced(from.file->size());
-  std::vector<std::pair<unz64_file_pos, unz_file_info64>> tables;
+  std::optional<std::pair<unz64_file_pos, unz_file_info64>> table;
   std::vector<char> name(kMaxNameSize + 1);
   for (int at = unzGoToFirstFile(archive); at == UNZ_OK; at = unzGoToNextFile(archive)) {
     unz_file_info64 info = {};
@@ -554,15 +557,14 @@ const char *look_at_archive(const Archive &from, const char *pkg_id, archived_ta
     unz64_file_pos place = {};
     const bool is_table = table_name == name.data() && table_name.size() == info.size_filename;
     if (is_table && unzGetFilePos64(archive, &place) == UNZ_OK) {
-      tables.emplace_back(place, info);
+      table.emplace(place, info);
     }
   }
   if (found != nullptr) *found = archived_table::none;
-  for (auto &[place, info] : tables) {
-    if (unzGoToFilePos64(archive, &place) != UNZ_OK) continue;
-    const table_state state = look_at_table(from, info, found != nullptr);
-    if (state == table_state::beyond) return kTableTooLarge;
-    if (found == nullptr) continue;
+  if (!table || unzGoToFilePos64(archive, &table->first) != UNZ_OK) return nullptr;
+  const table_state state = look_at_table(from, table->second, found != nullptr);
+  if (state == table_state::beyond) return kTableTooLarge;
+  if (found != nullptr) {
     *found = state == table_state::whole ? archived_table::whole : archived_table::malformed;
   }
   return nullptr;

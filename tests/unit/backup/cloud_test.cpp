@@ -9,6 +9,7 @@
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/request_cause.h"
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
@@ -318,6 +319,16 @@ TEST_F(Cloud, FailedUploadFailsTheRunAndFreesTheArchive) {
   EXPECT_FALSE(holds_staged_archive(ctx_.get(), "org.app"));
 }
 
+TEST_F(Cloud, CauseOfASinglePackagesUploadIsItsRequests) {
+  const FakePackage &app = staged("org.app");
+  ctx_->single_package = true;
+  fail_all();
+  note_request_end(request_cause::none);
+  upload(app);
+  cloud_.answer_all();
+  EXPECT_EQ(last_request_cause(), request_cause::server);
+}
+
 TEST_F(Cloud, RefusedUploadFailsTheRunAndFreesTheArchive) {
   const FakePackage &app = staged("org.app");
   refuse_all();
@@ -496,6 +507,7 @@ TEST_F(Cloud, StrayFileInTheDevicesFolderIsLeftAlone) {
   delete_other_backup_items_in_cloud(ctx_.get());
   cloud_.answer_all();
   EXPECT_THAT(cloud_.paths(), ElementsAre(in_device("stray.txt")));
+  EXPECT_EQ(cloud_.count_requests("delete " + in_device("stray.txt")), 0);
 }
 
 TEST_F(Cloud, FoldersAfterTheFirstHundredAreFoundBeforeAnyIsRemoved) {

@@ -115,7 +115,9 @@ int quarnd_backup_app_data(const char *pkg_id, void *record) {
 int quarnd_restore_app_data(const char *pkg_id, void *record) {
   return note(std::string("restore_app_data ") + pkg_id + " " + take(record));
 }
+std::size_t waiting_in_export = 0;
 int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
+  waiting_in_export = waiting_requests();
   return note(std::string("make_app_data ") + pkg_id + " " + number(client_uid));
 }
 int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
@@ -638,6 +640,7 @@ TEST_F(Server, OneCallerMayHaveSixtyFourRequestsWaiting) {
     EXPECT_EQ(steps, Texts{"cancel"}) << "the end is put off all the same";
   }
   EXPECT_EQ(records.size(), kMaxWaitingOfCaller) << "no record is made";
+  EXPECT_EQ(client_->call("make_app_data", "('org.example.notes',)").error_name, kTooMany);
   // What ends waiting, or never waits, is served.
   EXPECT_EQ(client_->call("manual_backup_cancel", "(uint32 1,)").reply, "(0,)");
   EXPECT_EQ(client_->call("restore_enable", "(0, 0, '', '', uint32 1)").reply, "(0,)");
@@ -647,6 +650,12 @@ TEST_F(Server, OneCallerMayHaveSixtyFourRequestsWaiting) {
   records.erase(records.begin());
   EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
   EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").error_name, kTooMany);
+}
+
+TEST_F(Server, AnExportCountsAsWaitingAsLongAsItLasts) {
+  EXPECT_EQ(client_->call("make_app_data", "('org.example.notes',)").reply, "(0,)");
+  EXPECT_EQ(waiting_in_export, 1U);
+  EXPECT_EQ(waiting_requests(), 0U);
 }
 
 TEST_F(Server, AllCallersTogetherMayHaveFiveHundredAndTwelveRequestsWaiting) {

@@ -648,6 +648,20 @@ TEST_P(ZipReader, ATableBeyondItsBoundsIsRefusedBeforeAnythingIsWritten) {
   }
 }
 
+TEST_P(ZipReader, OnlyTheLastOfSeveralTablesIsHeldToTheBounds) {
+  // The others are an application's own file of that name.
+  const std::string own[] = {R"({"a":[[[[[1]]]]]})", "{" + std::string(std::size_t{33} << 20, ' '),
+                             R"({"a":")" + std::string(4096, 'x') + "\"}"};
+  for (const std::string &text : own) {
+    EXPECT_EQ(unpack({deflated_entry(kTableName, text), deflated_entry(kTableName, "{}")}),
+              QUARN_OK);
+    expect_report(2, 0, 0);
+    EXPECT_EQ(content_of(root_ / kTableName), "{}");
+    EXPECT_EQ(unpack({deflated_entry(kTableName, "{}"), deflated_entry(kTableName, text)}),
+              QUARN_UNREADABLE);
+  }
+}
+
 TEST_P(ZipReader, ATableThatIsNoneCostsNothingWhereTheUnpackingCanBeUndone) {
   EXPECT_EQ(unpack({deflated_entry("data/a", "x"), deflated_entry(kTableName, "not json")}),
             QUARN_OK);
@@ -686,6 +700,37 @@ TEST_P(ZipReader, WithoutAWholeTableNothingIsUnpackedWhereThatCannotBeUndone) {
   EXPECT_EQ(found({data, encrypted}), archived_table::malformed);
   EXPECT_EQ(found({data, stored_entry(kTableName, R"({"data/a": {"0": 420}})")}),
             archived_table::whole);
+}
+
+std::string changing_archive;
+std::string changed_bytes;
+void change_archive() {
+  const UniqueFd file(open(changing_archive.c_str(), O_WRONLY));
+  const auto size = static_cast<ssize_t>(changed_bytes.size());
+  EXPECT_EQ(pwrite(file.get(), changed_bytes.data(), changed_bytes.size(), 0), size);
+}
+
+TEST_P(ZipReader, AnArchiveThatChangesWhileItIsReadIsHeldToItsBoundsAsWell) {
+  // So many entries that the directory is not read ahead, with names of one length.
+  std::vector<ZipEntry> entries;
+  std::vector<ZipEntry> deep;
+  for (int i = 100; i < 500; ++i) {
+    std::string name = "data";
+    std::string deep_name = "data";
+    for (int part = 0; part < 4; ++part) name += "/" + std::string(199, 'n');
+    for (int part = 0; part < 400; ++part) deep_name += "/d";
+    entries.push_back(stored_entry(name + "/" + std::to_string(i), "x"));
+    deep.push_back(stored_entry(deep_name + "/" + std::to_string(i), "x"));
+  }
+  changing_archive = place_ / "archive.zip";
+  changed_bytes = zip_bytes(deep);
+  ASSERT_EQ(changed_bytes.size(), zip_bytes(entries).size());
+  set_call_hook("unzOpenCurrentFile2", change_archive);
+  EXPECT_EQ(unpack(entries), QUARN_UNREADABLE);
+  set_call_hook(nullptr, nullptr);
+  EXPECT_EQ(errors("archive was changed while it was read"), 1);
+  EXPECT_FALSE(report_.complete());
+  EXPECT_FALSE(exists(root_ / "data/d"));
 }
 
 /* ---- failures ---------------------------------------------------------------- */

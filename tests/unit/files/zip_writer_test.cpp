@@ -859,6 +859,17 @@ TEST_P(ZipWriter, AFileInTheTablesPlaceIsPackedAndStays) {
   EXPECT_EQ(after.st_ino, before.st_ino);
 }
 
+TEST_P(ZipWriter, WhateverAFileInTheTablesPlaceHoldsTheArchiveIsTakenByARestore) {
+  root_.file("data/a", "x");
+  root_.file(kTableEntry, R"({"its own": [[[[["deeper than any attributes"]]]]]})");
+  ASSERT_EQ(pack_within(kBackupBounds), QUARN_OK);
+  const TempDir out;
+  unzip_report report;
+  EXPECT_EQ(unzip_data(kPackage, out.path().c_str(), archive_.c_str(), &report), QUARN_OK);
+  EXPECT_TRUE(report.complete());
+  EXPECT_EQ(content_of(out / "data/a"), "x");
+}
+
 TEST_P(ZipWriter, ALinkInTheTablesPlaceStays) {
   root_.link(kTableEntry, "elsewhere");
   EXPECT_EQ(pack(), 0);

@@ -5,6 +5,7 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
+#include <future>
 #include <thread>
 
 #include "handler_fixture.h"
@@ -14,6 +15,7 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package_lock.h"
 
 using ::testing::_;
 using ::testing::Return;
@@ -329,6 +331,26 @@ TEST_F(AppDataTest, ARestoreInTheCompanionsModeDoesNotWait) {
   EXPECT_EQ(restore(), 0);
   EXPECT_EQ(outside.answers, restored(31)) << "there is no archive of the companion's";
   EXPECT_TRUE(downloads.empty());
+}
+
+TEST_F(AppDataTest, ARestoreInTheCompanionsModeLetsOthersBeServedWhileItsPackageIsPacked) {
+  current_restore_client = 1;
+  std::promise<void> locked;
+  std::promise<void> go;
+  bool in_time = false;
+  std::thread packing([&] {
+    const PackageDataLock lock(kPkg, PackageUse::kPack);
+    locked.set_value();
+    in_time = go.get_future().wait_for(std::chrono::seconds(20)) == std::future_status::ready;
+  });
+  locked.get_future().wait();
+  run_on_fiber([this] { restore(); });
+  EXPECT_TRUE(outside.answers.empty());
+  go.set_value();
+  packing.join();
+  EXPECT_TRUE(in_time) << "the main loop stood still";
+  while (outside.answers.empty()) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(outside.answers, restored(31));
 }
 
 TEST_F(AppDataTest, TwoRestoresOfOnePackageAreAnsweredInTheirOrder) {

@@ -1,12 +1,15 @@
 // A daemon that is killed in a restore, and the next one: old or new, never a mixture.
 #include <sys/inotify.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <csignal>
+#include <cstring>
 #include <filesystem>
 #include <set>
 
+#include "quarn_d_restore/recovery.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -172,6 +175,77 @@ TEST_F(CrashTest, KilledInTheMiddleOfTheUnpacking) {
       EXPECT_EQ(now.at("data/settings.ini"), new_tree.at("data/settings.ini"));
     }
   }
+}
+
+/* ---- from the companion, without a snapshot ---- */
+
+class KilledCompanionTest : public CrashTest {
+ protected:
+  KilledCompanionTest() {
+    current_restore_client = 1;
+    std::filesystem::create_directories(kCompanionDir);
+    std::filesystem::copy_file(
+        archive, std::string(kCompanionDir) + "/" + kPkg + "_" + std::string(kVersion) + ".zip");
+    ON_CALL(platform, package_manager_foreach_package_info)
+        .WillByDefault([](package_manager_package_info_cb callback, void *data) {
+          EXPECT_TRUE(callback(nullptr, data));
+          return 0;
+        });
+    ON_CALL(platform, package_info_get_package).WillByDefault([](auto, char **id) {
+      *id = strdup(kPkg);
+      return 0;
+    });
+    ON_CALL(platform, package_info_get_root_path).WillByDefault([this](auto, char **path) {
+      *path = strdup(root.c_str());
+      return 0;
+    });
+  }
+  ~KilledCompanionTest() override {
+    std::filesystem::remove_all("/opt/usr/apps/com.velmor.pellix-efl");
+  }
+  void restore_from_companion() const {
+    pkg_restore_context ctx;
+    ctx.pkgid = kPkg;
+    ctx.version = kVersion;
+    ctx.root = root;
+    ctx.wait_for_result = true;
+    restore_app_data("app", &ctx);
+  }
+  int mode_of(const char *name) const {
+    struct stat status = {};
+    EXPECT_EQ(lstat(at(name).c_str(), &status), 0) << name;
+    return static_cast<int>(status.st_mode & 07777);
+  }
+};
+
+TEST_F(KilledCompanionTest, WhatWasUnpackedIsTheApplicationsToUse) {
+  int step = 1;
+  for (;; ++step) {
+    reset_data();
+    if (!killed_at(step, [this] { restore_from_companion(); })) break;
+    recover_device();
+    for (const auto &entry : new_data) {
+      EXPECT_EQ(read_text(at(entry.name)), entry.content) << "killed at step " << step;
+      const int mode = mode_of(entry.name.c_str());
+      EXPECT_TRUE(mode == 0600 || mode == static_cast<int>(entry.mode))
+          << entry.name << " killed at step " << step << ": " << std::oct << mode;
+    }
+    EXPECT_FALSE(exists(perm())) << "killed at step " << step;
+    EXPECT_FALSE(exists(snapshot() + ".unpacking")) << "killed at step " << step;
+  }
+  EXPECT_GT(step, 5) << "steps of the attributes";
+  EXPECT_FALSE(exists(snapshot() + ".unpacking")) << "nor after one that has ended";
+}
+
+TEST_F(KilledCompanionTest, AnApplicationsOwnFileOfTheNotesNameStaysAndHindersNothing) {
+  const std::string note = file("shared/data/quarn_tmp_rst_dir.unpacking", "its own");
+  const std::string odd = file("data/odd", "its own", 01000);
+  recover_device();
+  EXPECT_EQ(mode_of("data/odd"), 01000);
+  restore_from_companion();
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+  EXPECT_EQ(read_text(note), "its own");
+  expect_error("that data is unpacked cannot be noted : " + note);
 }
 
 }  // namespace

@@ -78,6 +78,23 @@ TEST_F(IdentityTest, WhatIsClosedOrAnothersIsPutBackAsItWas) {
   EXPECT_EQ(status_of("data/secret").st_nlink, 1U);
 }
 
+TEST_F(IdentityTest, WhatLiesInAnothersFolderThatTheApplicationMayWriteIsPutBack) {
+  make_archive(base + "/broken.zip",
+               {{"data/theirs/a", "new"}, {"data/theirs/b", "new"}, {"data/theirs/in/c", "new"}},
+               "not json");
+  for (const mode_t mode : {0777, 0775, 01777}) {
+    dir("data/theirs");
+    file("data/theirs/a", "another's");
+    file("data/theirs/own", "its own");
+    chown_to("data/theirs/a", 5001, kAppGid, 0644);
+    chown_to("data/theirs", 5001, kAppGid, mode);
+    const Tree before = tree_of(root);
+    EXPECT_NE(restore(base + "/broken.zip"), 0);
+    EXPECT_EQ(tree_of(root), before) << std::oct << mode;
+    std::filesystem::remove_all(at("data/theirs"));
+  }
+}
+
 TEST_F(IdentityTest, WhatIsClosedIsRestored) {
   make_closed_data();
   make_archive(base + "/good.zip", closed_entries());
@@ -236,6 +253,9 @@ TEST_F(IdentityTest, WhatACompanionsFailedRestoreLeavesIsTheApplicationsToUse) {
   std::vector<Entry> all = told;
   all.push_back({"data/dir/untold", "new"});
   make_archive(archive, all, table_text(told).c_str());
+  file("data/theirs", "looks like a file that is unpacked");
+  chown_to("data/theirs", 5001, 100, 01000);
+  set_label(at("data/theirs"), "theirs");
   for (const int refusal : {0, -2}) {
     begin_result = refusal;
     pkg_restore_context ctx;
@@ -253,6 +273,8 @@ TEST_F(IdentityTest, WhatACompanionsFailedRestoreLeavesIsTheApplicationsToUse) {
     }
     EXPECT_EQ(label_of(at("data/dir/told")), kDataLabel);
     EXPECT_EQ(label_of(at("data/dir/untold")), kDataLabel);
+    EXPECT_EQ(status_of("data/theirs").st_mode & 07777, 01000U);
+    EXPECT_EQ(label_of(at("data/theirs")), "theirs");
   }
   std::filesystem::remove(archive);
 }

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <filesystem>
 
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_setting/quarn_d_setting.h"
@@ -141,6 +142,7 @@ class MonitorTest : public RestoreTest {
                package_manager_error_e error = PACKAGE_MANAGER_ERROR_NONE) {
     event("tpk", package, type, state, 100, error, nullptr);
   }
+  std::string icon_note() const { return root + "/shared/data/quarn_tmp_rst_dir.icon"; }
   bool is_candidate() const {
     for (const auto &one : pkg_list_to_be_restored) {
       if (one == kPkg) return true;
@@ -189,6 +191,24 @@ TEST_F(MonitorTest, WhatARestoreOnInstallationDidNotBringIsOwed) {
   EXPECT_EQ(owed(), archive_claim::none);
 }
 
+TEST_F(MonitorTest, ARestoreOnInstallationThatSucceedsLeavesNothingOwed) {
+  serial_num_user_select = kSerial;
+  install();
+  ASSERT_TRUE(exists(root + "/shared/data/quarn_tmp_rst_dir.owed"));
+  make_archive(download(), {{"data/a", "brought back"}});
+  answer();
+  EXPECT_EQ(ends.back(), (std::pair{restore_outcome::restored, 0}));
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::none);
+  EXPECT_FALSE(exists(root + "/shared/data/quarn_tmp_rst_dir.owed"));
+}
+
+TEST_F(MonitorTest, WhereTheCloudHasNoArchiveOfTheVersionOnlyTheOthersAreOwed) {
+  serial_num_user_select = kSerial;
+  install();
+  answer(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT);
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::versions);
+}
+
 TEST_F(MonitorTest, AnInstallThatIsNotRestoredClaimsNothingAnyMore) {
   await_archives(kSerial, {kPkg}, {});
   serial_num_user_select = kSerial;
@@ -212,10 +232,20 @@ TEST_F(MonitorTest, TheIconIsHiddenUntilTheRestoreHasEnded) {
   install();
   EXPECT_EQ(timer_delays, std::vector<double>{0.5});
   EXPECT_EQ(timers_left, 1);
+  EXPECT_TRUE(exists(icon_note())) << "for the next daemon";
   ::testing::Mock::VerifyAndClearExpectations(&platform);
   EXPECT_CALL(platform, pkgmgr_client_activate(_, nullptr, ::testing::StrEq(kPkg))).Times(1);
   answer(BACKUP_TRANS_ERROR_NETWORK);
   EXPECT_EQ(timers_left, 0);
+  EXPECT_FALSE(exists(icon_note()));
+}
+
+TEST_F(MonitorTest, AnIconThatTheNextDaemonWouldNotShowIsNotHidden) {
+  std::filesystem::create_directories(icon_note() + "/in/the/way");
+  install();
+  expect_error("icon of (org.example.notes) stays: that it is hidden cannot be noted");
+  EXPECT_EQ(timers_left, 0);
+  answer(BACKUP_TRANS_ERROR_NETWORK);
 }
 
 TEST_F(MonitorTest, AnInstallOfNoCandidateLeavesTheListUnchanged) {
@@ -300,9 +330,11 @@ TEST_F(MonitorTest, APackageThatWasHandledIsNotRestoredAgain) {
 TEST_F(MonitorTest, AnUnknownPackageIsDropped) {
   ON_CALL(platform, package_manager_get_package_info).WillByDefault(Return(-71));
   EXPECT_CALL(platform, package_info_destroy).Times(0);
+  serial_num_user_select = kSerial;
   install();
   expect_error("package_manager_get_package_info() failed");
   EXPECT_EQ(ends.back(), (std::pair{restore_outcome::skipped, 1}));
+  EXPECT_EQ(claim_on_archive(kSerial, kPkg), archive_claim::whole) << "its archive is kept";
 }
 
 TEST_F(MonitorTest, WithoutARootPathThePackageIsDropped) {
@@ -406,8 +438,10 @@ TEST_F(MonitorTest, ADownloadThatWasRequestedBeforeTheVisitFailedIsFinished) {
 
 TEST_F(MonitorTest, ACompanionsRestoreHappensAtOnce) {
   current_restore_client = 1;
+  serial_num_user_select = kSerial;
   install();
   EXPECT_TRUE(downloads.empty());
+  EXPECT_TRUE(owed_packages(kSerial).empty()) << "it is not the cloud's";
   expect_info("restore_app_data for org.example.notes complete");
   EXPECT_EQ(timers_left, 1) << "its icon is hidden all the same";
   EXPECT_EQ(ends.back(), (std::pair{restore_outcome::failed, 31}));

@@ -652,6 +652,7 @@ TEST_F(OwnNamesTest, BothNamesOfADownloadTakenIsARefusal) {
 
 TEST_F(PipelineTest, WhatCouldNotBePutBackIsToldAndNotSnapshotOver) {
   make_old_data();
+  file("shared/data/org.example.notes.perm", "its own, which comes back before the rest");
   const Tree before = tree_of(root);
   const auto block = [this] {
     std::filesystem::remove_all(at("data/settings.ini"));
@@ -685,6 +686,24 @@ TEST_F(PipelineTest, WhatCouldNotBePutBackIsToldAndNotSnapshotOver) {
   make_archive(download(), new_data);
   answer();
   EXPECT_EQ(ctx->result, 0);
+  EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
+}
+
+TEST_F(PipelineTest, ASnapshotThatIsOnlyKeptGoesWithTheNextRestoreThatSucceeds) {
+  make_old_data();
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  file("data/mine", "written since");
+  EXPECT_FALSE(recover_interrupted_restore(kPkg, root.c_str()));
+  const std::string kept = "quarn_tmp_rst_dir.kept/data/settings.ini";
+  for (const bool good : {false, true}) {
+    if (good) std::filesystem::remove(at("data/mine"));  // no archive has it
+    auto ctx = waiting_context();
+    ASSERT_EQ(restore(ctx.get()), 0);
+    make_archive(download(), new_data, good ? nullptr : "not json");
+    answer();
+    EXPECT_EQ(ctx->result, good ? 0 : 36);
+    EXPECT_EQ(exists(at("shared/data/" + kept)), !good) << "what it was kept for is still to come";
+  }
   EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
 }
 
@@ -742,17 +761,27 @@ TEST_F(CompanionTest, AFailingAttributeRestoreStillReportsZeroAndLeavesPendingAt
 TEST_F(CompanionTest, WithoutAUsableTableNothingIsUnpacked) {
   make_old_data();
   const Tree before = tree_of(root);
-  make_archive(archive(), new_data, "not json");
-  auto ctx = context(true);
-  EXPECT_EQ(restore(ctx.get()), 0);
-  EXPECT_EQ(ctx->result, 0);
-  EXPECT_EQ(ctx->pending, -1);
-  expect_error("cannot read json info...");
-  expect_error("fail to restore for (org.example.notes)");
-  expect_info("restore_app_data for org.example.notes complete");
-  EXPECT_EQ(tree_of(root), before);
-  EXPECT_EQ(progress.back().outcome, Outcome::failed);
-  EXPECT_EQ(progress.back().result, 36);
+  for (const bool has_table : {true, false}) {
+    if (has_table) {
+      make_archive(archive(), new_data, "not json");
+    } else {
+      make_plain_archive(archive(), new_data);
+    }
+    clear_captured_log();
+    auto ctx = context(true);
+    EXPECT_EQ(restore(ctx.get()), 0);
+    EXPECT_EQ(ctx->result, 0);
+    EXPECT_EQ(ctx->pending, -1);
+    EXPECT_EQ(captured_texts(),
+              (std::vector<std::string>{
+                  has_table ? "cannot read json info..." : "there isn't file-info file...",
+                  "app data restore failed, so will be cleared",
+                  "fail to restore for (org.example.notes)",
+                  "restore_app_data for org.example.notes complete"}));
+    EXPECT_EQ(tree_of(root), before);
+    EXPECT_EQ(progress.back().outcome, Outcome::failed);
+    EXPECT_EQ(progress.back().result, 36);
+  }
 }
 
 TEST_F(CompanionTest, AnArchiveBeyondTheBoundsIsRefusedWholeAndLeavesTheDataAsItIs) {
