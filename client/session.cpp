@@ -12,6 +12,7 @@
 #include "backup_sets.h"
 #include "bus_client.h"
 #include "clean_up.h"
+#include "files/package_files.h"
 #include "json_read.h"
 #include "platform_clock.h"
 #include "progress.h"
@@ -36,8 +37,6 @@ constexpr char kRestoreStop[] = "restore_stop";
 constexpr char kBackupKind[] = "backup";
 constexpr char kRestoreKind[] = "restore";
 constexpr char kRestoredOutcome[] = "restored";
-constexpr char kExportDirectory[] = "/tmp/";
-constexpr char kExportSuffix[] = "_tmp.zip";
 
 /** A result code as an exit code; one that is not known counts as a failure of no special kind. */
 int exit_of(int result) {
@@ -426,7 +425,7 @@ void Session::app_export() {
   const std::string &package = command_.packages[0];
   call_for_result("make_app_data", g_variant_new("(s)", package.c_str()), [this](int result) {
     const std::string &name = command_.packages[0];
-    const std::string path = kExportDirectory + name + kExportSuffix;
+    const std::string path = exported_archive(name);
     json_add(document_.get(), "package", name);
     if (result == QUARN_OK) json_add(document_.get(), "path", path);
     finish_with(result, "export of " + name, path);
