@@ -65,6 +65,12 @@ enum quarn_backup_state : int {
   QUARN_BACKUP_CANCELLED = 6
 };
 
+/** For whom an application list is made and packages are restored, as calls name it. */
+enum quarn_client_kind : int {
+  QUARN_CLIENT_CLOUD = 0,    /**< a screen for what lies in the cloud */
+  QUARN_CLIENT_COMPANION = 1 /**< the phone-transfer companion */
+};
+
 /** Words for a result code; static, never null. */
 const char *quarn_result_text(int result);
 

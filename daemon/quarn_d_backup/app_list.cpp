@@ -5,6 +5,7 @@
 #include <cstring>
 #include <limits>
 
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/list_bound.h"
@@ -12,7 +13,6 @@
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"
 
@@ -33,12 +33,7 @@ constexpr int kSupportedFormat = 1;
 constexpr int kEntryDepth = 256;
 constexpr int kPackageDepth = kEntryDepth - 2;  // an array of an object
 
-constexpr char kCompanionListName[] = "/shared/data/app_list.txt";
 constexpr mode_t kPrivateFile = 0600;
-
-std::string companion_list_path() {
-  return std::string(kAppsDir) + kPellixPackage + kCompanionListName;
-}
 
 json_object *member(json_object *object, const char *key, json_type type) {
   json_object *value = nullptr;
@@ -339,7 +334,7 @@ void add_pkg_info_to_app_list(backup_context *ctx, const char *pkg_id, const cha
 }
 
 bool save_app_list_to_file(backup_context *ctx) {
-  const std::string path = ctx->for_pellix ? companion_list_path() : kLocalAppListPath;
+  const std::string path = ctx->for_pellix ? companion_list() : kLocalAppListPath;
   bool saved = false;
   if (!ctx->app_list_root) {
     note_cause(ctx, request_cause::list_foreign);

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstring>
 
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/owed_archive.h"
@@ -14,15 +15,13 @@
 #include "quarn_d_utils/file_crc.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/rules_state.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
+#include "rules/rules_file.h"
 
 namespace {
 
-constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
 constexpr int kMaxBackupMegabytes = kMaxBackupSize >> 20;
 constexpr char kIndexSeparator = '/';  // in no id and no version
 
@@ -430,9 +429,8 @@ int make_app_data_zip(backup_context *ctx, const char *) {
 
 std::uint64_t get_app_backup_size(backup_context *ctx) {
   std::uint64_t size = 0;
-  for (const char *dir : kDataDirs) {
-    size += get_dir_backup_size((ctx->cur_root_path + dir).c_str(), ctx->cur_pkg_id.c_str(),
-                                ctx->cur_root_path.c_str());
+  for (const std::string &dir : package_files(ctx->cur_pkg_id, ctx->cur_root_path).data_dirs()) {
+    size += get_dir_backup_size(dir.c_str(), ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str());
   }
   return size;
 }

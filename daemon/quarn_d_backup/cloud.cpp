@@ -8,6 +8,7 @@
 #include <unordered_set>
 
 #include "backup_transport.h"
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/list_bound.h"
@@ -16,14 +17,12 @@
 #include "quarn_d_backup/single_upload.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 
 namespace {
 
 constexpr char kWaitedForSuffix[] = ".waited_for.";
-constexpr char kArchiveSuffix[] = ".zip";
 /** How often an upload is begun again that was aborted for somebody else's sake. */
 constexpr int kMaxTimesAborted = 8;
 
@@ -74,20 +73,11 @@ std::set<std::string> &single_uploads() {
   return *folders;
 }
 
-std::string package_folder(const std::string &serial, const std::string &pkg_id) {
-  return "/" + serial + "/" + pkg_id;
-}
-
-std::string version_folder(const std::string &serial, const std::string &pkg_id,
-                           const std::string &version) {
-  return package_folder(serial, pkg_id) + "/" + version;
-}
-
 void note_single_upload(const std::string &serial, const std::string &pkg_id,
                         const std::string &version) {
   const std::lock_guard<std::mutex> lock(single_uploads_mutex);
-  single_uploads().insert(package_folder(serial, pkg_id));
-  single_uploads().insert(version_folder(serial, pkg_id, version));
+  single_uploads().insert(cloud_package_folder(serial, pkg_id));
+  single_uploads().insert(cloud_version_folder(serial, pkg_id, version));
 }
 
 bool uploaded_by_single_request(const std::string &folder) {
@@ -504,8 +494,7 @@ void upload_app_data(backup_context *ctx, const char *pkg_id, const char *root_p
   record->ctx = share_backup_context(ctx);
   record->pkg_id = pkg_id;
   record->local_path = staged_archive_path(root_path, pkg_id);
-  record->remote_path =
-      version_folder(ctx->serial_number, pkg_id, version) + "/" + pkg_id + kArchiveSuffix;
+  record->remote_path = cloud_archive(ctx->serial_number, pkg_id, version);
   record->size = staged_file_size(record->local_path);
   if (ctx->single_package) {
     note_single_upload(ctx->serial_number, pkg_id, version);
@@ -568,10 +557,10 @@ void delete_other_backup_items_in_cloud(backup_context *ctx) {
   record->ctx = share_backup_context(ctx);
   record->folder = "/" + ctx->serial_number + "/";
   for (const pkg_information &package : ctx->current_pkg_list) {
-    record->keep.insert(package_folder(ctx->serial_number, package.pkg_id));
+    record->keep.insert(cloud_package_folder(ctx->serial_number, package.pkg_id));
   }
   for (const std::string &pkg_id : ctx->unexamined_pkg_ids) {
-    record->keep.insert(package_folder(ctx->serial_number, pkg_id));
+    record->keep.insert(cloud_package_folder(ctx->serial_number, pkg_id));
   }
   ++ctx->serial_clean_pending;
   request_listing(std::move(record), kPackageCleanup);
@@ -588,9 +577,9 @@ void delete_other_version_in_cloud(backup_context *ctx, const std::string &seria
                                    const std::string &pkg_id, const std::string &version) {
   auto record = std::make_unique<cleanup_listing>();
   record->ctx = share_backup_context(ctx);
-  record->folder = package_folder(serial, pkg_id) + "/";
+  record->folder = cloud_package_folder(serial, pkg_id) + "/";
   record->package = pkg_id;
-  record->keep.insert(version_folder(serial, pkg_id, version));
+  record->keep.insert(cloud_version_folder(serial, pkg_id, version));
   ++ctx->version_list_pending;
   request_listing(std::move(record), kVersionCleanup);
 }

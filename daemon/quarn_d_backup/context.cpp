@@ -8,6 +8,7 @@
 #include <condition_variable>
 #include <mutex>
 
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
@@ -15,7 +16,6 @@
 #include "quarn_d_utils/own_place.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"

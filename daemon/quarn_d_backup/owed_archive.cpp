@@ -9,10 +9,10 @@
 #include <mutex>
 #include <utility>
 
+#include "files/safe_path.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 

@@ -4,13 +4,11 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include "files/safe_path.h"
 #include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 
 namespace {
-
-constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
 
 /** The worse of two findings: what is too deep stays so, whoever looks. */
 backup_outcome worse(backup_outcome one, backup_outcome other) {
@@ -42,7 +40,7 @@ backup_outcome find_package_trouble(const std::string &root) {
   if (!is_directory(root.c_str())) return backup_outcome::removed;
   backup_outcome found = backup_outcome::none;
   for (const char *name : kDataDirs) {
-    const DirPtr dir = safe_opendir((root + name).c_str());
+    const DirPtr dir = safe_opendir((root + "/" + name).c_str());
     found = worse(found, dir == nullptr ? backup_outcome::unreadable : look_below(dir.get(), 1));
   }
   // it may have gone meanwhile

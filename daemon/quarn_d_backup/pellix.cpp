@@ -6,20 +6,18 @@
 #include <cerrno>
 
 #include "backup_transport.h"
+#include "files/safe_path.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kSharedDataDir[] = "/shared/data/";
 constexpr char kListName[] = "app_list.txt";
-constexpr char kArchiveSuffix[] = ".zip";
 constexpr mode_t kPrivateFile = 0600;
 constexpr mode_t kArchiveMode = 0777;  // the companion's own rules decide who reads it
 
@@ -29,11 +27,9 @@ std::string hidden_name() {
   return std::string(BACKUP_TRANS_TEMPORARY_PREFIX) + random.get();
 }
 
-std::string companion_dir() { return std::string(kAppsDir) + kPellixPackage + kSharedDataDir; }
-
 /** Let nobody but the companion into its folder, before anything of another's lies there. */
-bool close_companion_dir() {
-  const UniqueFd dir = safe_open(companion_dir().c_str(), O_RDONLY | O_DIRECTORY);
+bool close_companion_folder() {
+  const UniqueFd dir = safe_open(companion_folder().c_str(), O_RDONLY | O_DIRECTORY);
   struct stat status = {};
   if (!dir || fstat(dir.get(), &status) != 0) return false;
   // a folder that is not the companion's own may be its group's
@@ -75,8 +71,8 @@ void hand_over_archive(int archive, const std::string &path) {
 
 /** Pack the current package. @return true when the archive lies at its name */
 bool pack_for_companion(backup_context *ctx, const std::string &name) {
-  const std::string path = companion_dir() + name;
-  const UniqueFd dir = safe_open(companion_dir().c_str(), O_RDONLY | O_DIRECTORY);
+  const std::string path = companion_folder() + name;
+  const UniqueFd dir = safe_open(companion_folder().c_str(), O_RDONLY | O_DIRECTORY);
   if (file_exist(path.c_str())) delete_file(path.c_str());
   std::string hidden;
   UniqueFd archive = dir ? make_hidden_file(dir.get(), &hidden) : UniqueFd();
@@ -97,10 +93,10 @@ bool pack_for_companion(backup_context *ctx, const std::string &name) {
 
 void make_companion_archive(backup_context *ctx) {
   if (check_current_backup_size(ctx) != QUARN_OK) return;
-  const std::string name = ctx->cur_pkg_id + "_" + ctx->cur_version + kArchiveSuffix;
+  const std::string name = companion_archive_name(ctx->cur_pkg_id, ctx->cur_version);
   if (!pack_for_companion(ctx, name)) return;
   json_object_array_add(ctx->app_data_path,
-                        json_object_new_string((companion_dir() + name).c_str()));
+                        json_object_new_string((companion_folder() + name).c_str()));
 }
 
 }  // namespace
@@ -109,15 +105,15 @@ char *get_app_list_for_pellix() {
   LOGI("make_pellix_app_list");
   const BackupContextPtr ctx(new backup_context);
   ctx->for_pellix = true;
-  const std::string list_path = companion_dir() + kListName;
+  const std::string list_path = companion_folder() + kListName;
   if (!create_app_list_info(ctx.get())) return nullptr;
   // packing would make the directory, and with it half a package that is not installed
-  if (!is_directory(companion_dir().c_str())) {
+  if (!is_directory(companion_folder().c_str())) {
     LOGE("no directory for app list file %s", list_path.c_str());
     return nullptr;
   }
-  if (!close_companion_dir()) {
-    LOGE("cannot close %s to others", companion_dir().c_str());
+  if (!close_companion_folder()) {
+    LOGE("cannot close %s to others", companion_folder().c_str());
     return nullptr;
   }
   const int ret = package_manager_foreach_package_info(foreach_package_info_callback, ctx.get());

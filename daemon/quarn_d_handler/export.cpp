@@ -19,8 +19,6 @@
 
 namespace {
 
-constexpr char kExportDir[] = "/tmp/";
-constexpr char kExportSuffix[] = "_tmp.zip";
 constexpr char kStagingTemplate[] = "/tmp/quarn/export_XXXXXX";
 constexpr char kStagedName[] = "/export.zip";
 constexpr mode_t kExportMode = 0600;
@@ -119,7 +117,7 @@ int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
     LOGE("cannot get root path info of (%s)...", pkg_id == nullptr ? "" : pkg_id);
     return QUARN_REFUSED;
   }
-  const std::string target = std::string(kExportDir) + pkg_id + kExportSuffix;
+  const std::string target = exported_archive(pkg_id);
   if (file_exist(target.c_str())) delete_file(target.c_str());
   std::string root;
   if (get_string_app_root_path(pkg_id, root) != QUARN_OK) {

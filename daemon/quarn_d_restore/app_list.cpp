@@ -2,6 +2,7 @@
 #include <memory>
 #include <vector>
 
+#include "files/safe_path.h"
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_restore/quarn_d_restore.h"
@@ -11,7 +12,6 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/request_cause.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 

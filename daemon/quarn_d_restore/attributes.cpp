@@ -5,12 +5,12 @@
 #include <cerrno>
 #include <cstring>
 
+#include "files/safe_path.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_reader.h"
 #include "quarn_log.h"
 

@@ -9,12 +9,12 @@
 #include <set>
 #include <string>
 
+#include "files/safe_path.h"
 #include "platform_package_client.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 namespace {

@@ -3,6 +3,8 @@
 #include <memory>
 #include <optional>
 
+#include "files/held_folder.h"
+#include "files/safe_path.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/hidden_icon.h"
@@ -15,10 +17,8 @@
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/cloud_transfer.h"
-#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/request_cause.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 std::vector<std::string> pkg_list_to_be_restored;
@@ -325,8 +325,7 @@ int restore_from_cloud(pkg_restore_context *ctx) {
     return QUARN_FAILED;
   }
   auto request = std::make_unique<download_request>();
-  request->cloud_path =
-      "/" + ctx->serial + "/" + ctx->pkgid + "/" + ctx->version + "/" + ctx->pkgid + ".zip";
+  request->cloud_path = cloud_archive(ctx->serial, ctx->pkgid, ctx->version);
   request->local_path = WorkingFiles(ctx->pkgid, ctx->root).download_place();
   if (request->local_path.empty()) {
     LOGE("there is no place for the archive of (%s)", ctx->pkgid.c_str());
@@ -346,8 +345,7 @@ int restore_from_cloud(pkg_restore_context *ctx) {
 }
 
 std::string companion_archive(const pkg_restore_context &ctx) {
-  return std::string(kAppsDir) + kPellixPackage + "/shared/data/" + ctx.pkgid + "_" + ctx.version +
-         ".zip";
+  return companion_folder() + companion_archive_name(ctx.pkgid, ctx.version);
 }
 
 /** What a restore from the companion came to. */

@@ -1,10 +1,10 @@
 #include "quarn_d_restore/recovery.h"
 
+#include "files/held_folder.h"
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/settle.h"
 #include "quarn_d_restore/snapshot.h"
-#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_d_utils/working_files.h"

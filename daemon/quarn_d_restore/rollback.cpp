@@ -5,13 +5,13 @@
 #include <cstring>
 #include <utility>
 
+#include "files/held_folder.h"
+#include "files/safe_path.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
-#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
@@ -290,7 +290,7 @@ class MovingBack {
     const std::string &top = files_.snapshot;
     const bool at_top = path_.rfind('/') == top.size() && path_.compare(0, top.size(), top) == 0;
     if (at_top) return path_ != top + "/data" && path_ != top + "/shared";
-    return path_ == files_.snapshot_table || files_.is_archive(path_);
+    return path_ == files_.parts.table || files_.own.is_archive(path_);
   }
 
   /** The files of one directory. @return the directories in it */
@@ -400,7 +400,7 @@ class MovingBack {
     }
     if (!names_may_be_changed(to, user_)) return false;
     // The snapshot's table stays where it is until the end.
-    if (files_.snapshot_table.compare(0, path_.size() + 1, path_ + "/") == 0) return false;
+    if (files_.parts.table.compare(0, path_.size() + 1, path_ + "/") == 0) return false;
     return renameat(from, name, to, name) == 0;
   }
 
@@ -476,7 +476,7 @@ rollback_result put_snapshot_back(const char *pkgid, const char *root) {
     return rollback_result::none;
   }
   restore_step("rollback");
-  const JsonPtr table = read_table(files.snapshot_table);
+  const JsonPtr table = read_table(files.parts.table);
   if (table == nullptr) {
     // What is in its place already and what is the restore's could not be told apart.
     LOGE("snapshot of (%s) cannot be read, so it is kept", pkgid);
@@ -509,6 +509,6 @@ int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root)
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
   const JsonPtr table =
-      file_exist(files.snapshot_table.c_str()) ? read_table(files.snapshot_table) : nullptr;
+      file_exist(files.parts.table.c_str()) ? read_table(files.parts.table) : nullptr;
   return MovingBack(files, root, table.get()).run(dir) ? 1 : 0;
 }

@@ -7,12 +7,12 @@
 #include <cstring>
 #include <utility>
 
+#include "files/held_folder.h"
+#include "files/safe_path.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/disk_sync.h"
-#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
@@ -101,16 +101,16 @@ bool make_snapshot_dir(const restore_files &files, std::optional<HeldFolder> *he
 /** Save the table under its name only when it is whole and everything it tells of is on disk. */
 int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
   // Beside the copies, not among them, where an application's file could have the name.
-  const int result = save_file_info_table(table, files.unfinished_table.c_str());
+  const int result = save_file_info_table(table, files.parts.unfinished_table.c_str());
   if (result != QUARN_OK) return result;
   restore_step("snapshot-table-written");
   // The snapshot's own name is in the folder that it lies in.
-  if (!create_directory_of_file(files.snapshot_table.c_str()) || !sync_tree(files.snapshot) ||
+  if (!create_directory_of_file(files.parts.table.c_str()) || !sync_tree(files.snapshot) ||
       !sync_directory(folder_of(files.snapshot))) {
     return QUARN_REFUSED;
   }
-  if (!rename_path(files.unfinished_table, files.snapshot_table)) return QUARN_REFUSED;
-  return sync_directory(folder_of(files.snapshot_table)) ? QUARN_OK : QUARN_REFUSED;
+  if (!rename_path(files.parts.unfinished_table, files.parts.table)) return QUARN_REFUSED;
+  return sync_directory(folder_of(files.parts.table)) ? QUARN_OK : QUARN_REFUSED;
 }
 
 /** Copy what is left of a file, which may have changed its size meanwhile. */
@@ -378,8 +378,8 @@ snapshot_state state_of_snapshot(const restore_files &files) {
   struct stat status = {};
   if (safe_lstat(files.snapshot.c_str(), &status) != 0) return snapshot_state::none;
   if (!is_own_snapshot(status)) return snapshot_state::foreign;
-  if (file_exist(files.snapshot_table.c_str())) return snapshot_state::complete;
-  return file_exist(files.told.c_str()) ? snapshot_state::told : snapshot_state::incomplete;
+  if (file_exist(files.parts.table.c_str())) return snapshot_state::complete;
+  return file_exist(files.parts.told.c_str()) ? snapshot_state::told : snapshot_state::incomplete;
 }
 
 bool remove_snapshot(const restore_files &files) {
@@ -429,7 +429,7 @@ void forget_told_snapshot(const restore_files &files) {
 }
 
 bool keep_told_snapshot(const restore_files &files) {
-  return rename_path(files.snapshot_table, files.told) && sync_directory(files.snapshot);
+  return rename_path(files.parts.table, files.parts.told) && sync_directory(files.snapshot);
 }
 
 bool discard_snapshot(const char *pkgid, const char *root) {
@@ -444,11 +444,11 @@ bool discard_snapshot(const char *pkgid, const char *root) {
       LOGE("data of (%s) is not on the disk, so its snapshot is kept", pkgid);
       return false;
     }
-    if (!unlink_path(files.snapshot_table)) {
+    if (!unlink_path(files.parts.table)) {
       LOGE("snapshot of (%s) cannot be released, so it is kept", pkgid);
       return false;
     }
-    sync_directory(folder_of(files.snapshot_table));
+    sync_directory(folder_of(files.parts.table));
   }
   restore_step("snapshot-released");
   if (state_of_snapshot(files) != snapshot_state::told) remove_snapshot(files);
@@ -469,7 +469,7 @@ int take_snapshot(const char *pkgid, const char *root, std::optional<HeldFolder>
     LOGE("fail to make snapshot directory : %s", files.snapshot.c_str());
     return QUARN_REFUSED;
   }
-  StampWriter stamps(files.stamps);
+  StampWriter stamps(files.parts.stamps);
   SnapshotCopy copy(pkgid, root, files.snapshot, table.get(), &stamps);
   for (const auto &dir : files.dirs) {
     if (!copy.copy(dir)) {

@@ -17,9 +17,9 @@
 #include <string>
 #include <vector>
 
+#include "files/held_folder.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/held_folder.h"
 
 enum class snapshot_state {
   none,

@@ -5,13 +5,13 @@
 #include <cerrno>
 #include <utility>
 
+#include "files/held_folder.h"
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/disk_sync.h"
-#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_walk.h"
 #include "quarn_d_utils/unpacked_file.h"
 #include "quarn_d_utils/working_files.h"
@@ -145,7 +145,7 @@ bool StampWriter::finish() {
 bool note_unpacked_files(const char *pkgid, const char *root) {
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
-  StampWriter stamps(files.unpacked);
+  StampWriter stamps(files.parts.unpacked);
   DataWalk(files).run([&](const std::string &, const struct stat &status) {
     stamps.add(status);
     return true;
@@ -156,8 +156,8 @@ bool note_unpacked_files(const char *pkgid, const char *root) {
 bool application_has_written(const restore_files &files, std::string *path) {
   Stamps known;
   // A snapshot of an earlier release tells nothing of it.
-  if (!read_stamps(files.stamps, &known)) return false;
-  const bool unpacked = read_stamps(files.unpacked, &known);
+  if (!read_stamps(files.parts.stamps, &known)) return false;
+  const bool unpacked = read_stamps(files.parts.unpacked, &known);
   std::sort(known.begin(), known.end());
   bool written = false;
   DataWalk(files).run([&](const std::string &file, const struct stat &status) {

@@ -3,6 +3,8 @@
 #include <cerrno>
 #include <utility>
 
+#include "files/held_folder.h"
+#include "files/safe_path.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/archive_table.h"
@@ -10,9 +12,7 @@
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/settle.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_text.h"
 #include "quarn_d_utils/tree_walk.h"
 #include "quarn_d_utils/unpacked_file.h"

@@ -11,10 +11,8 @@
 
 #include <cstdint>
 
+#include "files/tree_depth.h"
 #include "quarn_common.h"
-
-/** Directories in one another, the data directory counted: walks hold a descriptor for each. */
-inline constexpr int kMaxDirDepth = 400;
 
 /** What is counted while an archive is made. */
 struct archive_bounds {

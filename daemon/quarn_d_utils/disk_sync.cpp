@@ -12,7 +12,7 @@
 #include <utility>
 #include <vector>
 
-#include "quarn_d_utils/safe_path.h"
+#include "files/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 
 namespace {

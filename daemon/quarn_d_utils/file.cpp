@@ -8,10 +8,10 @@
 #include <climits>
 #include <cstring>
 
+#include "files/safe_path.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/file_crc.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"
@@ -221,11 +221,6 @@ bool copy_in_kernel(int from, int to, bool *copied) {
 }
 
 }  // namespace
-
-bool is_safe_path_component(const std::string &text) {
-  return !text.empty() && text != "." && text != ".." && text.find('/') == std::string::npos &&
-         text.find('\0') == std::string::npos;
-}
 
 bool file_exist(const char *path) {
   struct stat status = {};

@@ -4,10 +4,10 @@
 #include <cstring>
 #include <new>
 
+#include "files/safe_path.h"
 #include "platform_smack.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_text.h"
 #include "quarn_log.h"
 

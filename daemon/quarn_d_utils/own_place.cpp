@@ -10,8 +10,8 @@
 #include <cstdio>
 #include <vector>
 
+#include "files/safe_path.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"

@@ -13,8 +13,9 @@
 #include <string>
 #include <utility>
 
+#include "files/held_folder.h"
+#include "files/safe_path.h"
 #include "quarn_common.h"
-#include "quarn_d_utils/safe_path.h"
 
 namespace {
 
@@ -302,4 +303,15 @@ int unlink_as_package(int dir, const char *name, int flags, const package_user &
 int rename_as_package(int from, const char *old_name, int to, const char *name,
                       const package_user &user) {
   return as_package(from, to, user, [&] { return renameat(from, old_name, to, name); });
+}
+
+UniqueFd open_held_as_package(const std::string &path, int flags) {
+  const HeldFolder *folder = HeldFolder::of(path.c_str());
+  if (folder == nullptr) return safe_open(path.c_str(), flags);
+  const package_user user = user_of_package();
+  UniqueFd fd =
+      open_below_as_package(folder->fd(), folder->below(path.c_str()), flags, 0, user, nullptr);
+  // the device maker's links are followed
+  if (!fd && errno == ELOOP) fd = safe_open(path.c_str(), flags);
+  return fd;
 }

@@ -25,6 +25,8 @@
 #include <sys/stat.h>
 #include <sys/types.h>
 
+#include <string>
+
 #include "quarn_d_utils/handles.h"
 
 /** Who a package's files belong to. */
@@ -144,5 +146,11 @@ int mkdir_as_package(int dir, const char *name, mode_t mode, const package_user 
 int unlink_as_package(int dir, const char *name, int flags, const package_user &user);
 int rename_as_package(int from, const char *old_name, int to, const char *name,
                       const package_user &user);
+
+/**
+ * Open what lies at an absolute path below a held folder as the package's user,
+ * as open_below_as_package() does; outside of one as the daemon.
+ */
+UniqueFd open_held_as_package(const std::string &path, int flags);
 
 #endif

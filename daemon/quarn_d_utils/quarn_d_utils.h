@@ -24,15 +24,16 @@
 #include <vector>
 
 #include "backup_transport.h"
+#include "files/package_files.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/handles.h"
+#include "rules/path_matcher.h"
+#include "rules/rules_file.h"
 
 /* ---- file.cpp: any thread ------------------------------------------------ */
 
-/** True when an id may name a file or folder: not empty, not "." or "..", no "/", no NUL. */
-bool is_safe_path_component(const std::string &text);
 /** True for a regular file; a link is neither file nor directory. */
 bool file_exist(const char *path);
 /** True for a directory. */
@@ -116,10 +117,12 @@ extern thread_local bool xml_has_include_field;
 void reset_backup_path_info();
 /** Load a package's rules file, if it has one, in place of the thread's rules. */
 void parse_backup_path_xml(const char *pkg_id, const char *pkg_type, const char *root);
+/** What the last parse_backup_path_xml() of the calling thread found; none after a reset. */
+rules_state backup_rules_state();
+/** rules_usable() of that. */
+bool backup_rules_usable();
 /** Append @p path when something lies there. */
 void add_to_path_info_list(const char *path, std::vector<std::string> *list);
-/** True when @p parent ends with "/" and @p path begins with it. */
-bool is_child_file(const char *parent, const char *path);
 /** Whether the thread's rules take the file or link at @p path. */
 bool is_backup_file(const char *path);
 /** Bytes that an archive would take from @p dir; 26214401 for an unreadable directory. */

@@ -9,8 +9,8 @@
 #include <cerrno>
 #include <utility>
 
+#include "files/safe_path.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
 
 namespace {

@@ -9,23 +9,16 @@
 #include <map>
 #include <mutex>
 #include <optional>
-#include <string_view>
 #include <vector>
 
-#include "backup_transport.h"
+#include "files/safe_path.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
 namespace {
-
-constexpr std::string_view kPartPrefix = BACKUP_TRANS_TEMPORARY_PREFIX;
-
-/** Added to the snapshot's name when the application has that name. */
-constexpr char kBeside[] = ".snapshot";
 
 /** What tells a file from every other: none that nobody else may write keeps these and differs. */
 struct FileMark {
@@ -51,10 +44,6 @@ std::mutex claimed_mutex;
 std::map<std::string, std::optional<FileMark>> &claimed() {
   static auto *paths = new std::map<std::string, std::optional<FileMark>>;
   return *paths;
-}
-
-bool is_part_name(const char *name) {
-  return std::strncmp(name, kPartPrefix.data(), kPartPrefix.size()) == 0;
 }
 
 /** A file that nobody but the daemon has made, and that has no other name. */
@@ -104,16 +93,16 @@ bool is_own_leftover(const std::string &path) {
 }
 
 std::string WorkingFiles::download_place() const {
-  if (!is_applications(download_)) return download_;
-  return is_applications(download_aside_) ? "" : download_aside_;
+  if (!is_applications(download())) return download();
+  return is_applications(download_aside()) ? "" : download_aside();
 }
 
 std::string WorkingFiles::snapshot_place() const {
-  const std::string beside = snapshot_ + kBeside;
+  const std::string beside = snapshot_beside();
   struct stat status = {};
   // One that lies there counts, also when the application has made room meanwhile.
   const bool used = safe_lstat(beside.c_str(), &status) == 0 && is_own_file(status);
-  return used || is_applications(snapshot_) ? beside : snapshot_;
+  return used || is_applications(snapshot()) ? beside : snapshot();
 }
 
 void claim_working_file(const std::string &path) {

@@ -15,6 +15,7 @@
 
 #include <string>
 
+#include "files/package_files.h"
 #include "quarn_d_utils/handles.h"
 
 /**
@@ -32,56 +33,22 @@ bool is_own_leftover(const char *name, const struct stat &status);
 /** The same for whatever lies at @p path; costs nothing for another name. */
 bool is_own_leftover(const std::string &path);
 
-/** Their paths for one package below one root. */
-class WorkingFiles {
+/** The names of one package's files, and which of them is to be used. */
+class WorkingFiles : public package_files {
  public:
-  WorkingFiles(const std::string &pkg_id, const std::string &root)
-      : folder_(root + "/shared/data"),
-        upload_(folder_ + "/" + pkg_id + "_upload.zip"),
-        download_(folder_ + "/" + pkg_id + "_download.zip"),
-        table_(folder_ + "/" + pkg_id + ".perm"),
-        snapshot_(folder_ + "/quarn_tmp_rst_dir"),
-        upload_aside_(snapshot_ + "." + pkg_id + "_upload.zip"),
-        download_aside_(snapshot_ + "." + pkg_id + "_download.zip"),
-        owed_(snapshot_ + ".owed") {}
+  using package_files::package_files;
 
-  const std::string &folder() const { return folder_; } /**< where all of them lie */
-  const std::string &upload() const { return upload_; }
-  /** Where the archive is staged whose name an application's own file has. */
-  const std::string &upload_aside() const { return upload_aside_; }
-  const std::string &download() const { return download_; }
-  /** Where an archive is downloaded to when the application's own file has that name. */
-  const std::string &download_aside() const { return download_aside_; }
-  /** The one of both that is to be used; empty when the application has both. */
+  /** Of both places of a download the one that is to be used; empty when the application has both.
+   */
   std::string download_place() const;
-  /** Everything of ours that is not an archive begins with this, the snapshot as a rule. */
-  const std::string &snapshot() const { return snapshot_; }
   /** The snapshot's place: beside the usual one where that is the application's own. */
   std::string snapshot_place() const;
-  /** The table on its way into an archive or out of one; the application's own may have the name.
-   */
-  const std::string &table() const { return table_; }
-  /** Says that a restore has not brought the data back yet; outlives the process. */
-  const std::string &owed() const { return owed_; }
 
   /**
    * True for both archives, for every path that begins with the snapshot's,
    * and for the transport's files.
    */
-  bool contain(const std::string &path) const {
-    return path.compare(0, snapshot_.size(), snapshot_) == 0 || path == upload_ ||
-           path == download_ || is_own_leftover(path);
-  }
-
- private:
-  std::string folder_;
-  std::string upload_;
-  std::string download_;
-  std::string table_;
-  std::string snapshot_;
-  std::string upload_aside_;
-  std::string download_aside_;
-  std::string owed_;
+  bool contain(const std::string &path) const { return name(path) || is_own_leftover(path); }
 };
 
 /** From now on @p path is this process's own: its sweep leaves it alone. */

@@ -10,12 +10,12 @@
 #include <utility>
 #include <vector>
 
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_reader.h"
 #include "quarn_d_utils/unpacked_file.h"
 #include "quarn_d_utils/working_files.h"
@@ -28,7 +28,6 @@ constexpr mode_t kFolderMode = 0755;
 constexpr int kStored = 0;
 constexpr int kRaw = 1;
 // What a snapshot holds: only there can an unpacking be undone.
-constexpr const char *kDataDirs[] = {"data/", "shared/data/", "shared/trusted/"};
 
 constexpr char kNoData[] = "it does not belong to the application's data";
 
@@ -276,8 +275,10 @@ class Unpacker {
 
   /** True for what lies in a data directory, and for such a directory and those that hold one. */
   static bool is_data_place(const std::string &path) {
-    return std::any_of(std::begin(kDataDirs), std::end(kDataDirs), [&](const std::string &dir) {
-      return path.compare(0, dir.size(), dir) == 0 || dir.compare(0, path.size(), path) == 0;
+    return std::any_of(kDataDirs.begin(), kDataDirs.end(), [&](const std::string &dir) {
+      const std::string inside = dir + "/";
+      return path.compare(0, inside.size(), inside) == 0 ||
+             inside.compare(0, path.size(), path) == 0;
     });
   }
 
@@ -291,8 +292,9 @@ class Unpacker {
     if (path.size() != info.size_filename) return "its name holds a NUL";
     if (!path.empty() && path.back() == '/') return "it is a directory";
     if (const char *why = name_refusal(path)) return why;
-    if (std::none_of(std::begin(kDataDirs), std::end(kDataDirs), [&](const char *dir) {
-          return path.compare(0, std::strlen(dir), dir) == 0;
+    if (std::none_of(kDataDirs.begin(), kDataDirs.end(), [&](const char *dir) {
+          const std::size_t length = std::strlen(dir);
+          return path.compare(0, length, dir) == 0 && path.size() > length && path[length] == '/';
         })) {
       return kNoData;
     }
@@ -542,7 +544,7 @@ table_state look_at_table(const Archive &from, const unz_file_info64 &info, bool
  * @return why it is refused, null when it is not
  */
 const char *look_at_archive(const Archive &from, const char *pkg_id, archived_table *found) {
-  const std::string table_name = std::string("shared/data/") + pkg_id + ".perm";
+  const std::string table_name = archived_table_name(pkg_id);
   unzFile archive = from.handle.get();
   Announced announced(from.file->size());
   std::optional<std::pair<unz64_file_pos, unz_file_info64>> table;

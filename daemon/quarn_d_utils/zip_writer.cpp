@@ -5,23 +5,20 @@
 #include <cerrno>
 #include <cstring>
 
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/rules_state.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
+#include "rules/rules_file.h"
 
 namespace {
 
-constexpr const char *kDataDirs[] = {"/data", "/shared/data", "/shared/trusted"};
-constexpr char kTableDir[] = "/shared/data/";
-constexpr char kTableSuffix[] = ".perm";
 constexpr int kLevel = 1;
 constexpr mode_t kArchiveMode = 0600;
 constexpr mode_t kFolderMode = 0755;
@@ -549,7 +546,7 @@ UniqueFd create_archive(const char *zip_path) {
  */
 bool is_half_restored(const char *pkg_id, const char *root) {
   const std::string snapshot = WorkingFiles(pkg_id, root).snapshot_place();
-  const std::string table = snapshot + kTableDir + pkg_id + kTableSuffix;
+  const std::string table = snapshot_files(pkg_id, snapshot).table;
   struct stat status = {};
   // An application can make neither of root's.
   return safe_lstat(snapshot.c_str(), &status) == 0 && S_ISDIR(status.st_mode) &&
@@ -621,9 +618,9 @@ bool may_be_packed(const char *pkg_id, const char *root) {
 /** The data directories and the table; without it what went beyond a bound, or was stopped. */
 void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table_h *table,
               int *error) {
-  for (const char *dir : kDataDirs) {
+  for (const std::string &dir : package_files(pkg_id, root).data_dirs()) {
     if (packing->ended()) break;
-    parse_app_dir_for_zip(pkg_id, root, zip, (std::string(root) + dir).c_str(), table, error);
+    parse_app_dir_for_zip(pkg_id, root, zip, dir.c_str(), table, error);
   }
   if (packing->ended()) {
     *error = QUARN_REFUSED;
@@ -756,7 +753,7 @@ void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const 
                                    const char *root, int *error) {
   std::size_t size = 0;
   const char *text = json_object_to_json_string_length(table->root, JSON_C_TO_STRING_SPACED, &size);
-  const std::string path = std::string(root) + kTableDir + pkg_id + kTableSuffix;
+  const std::string path = package_files(pkg_id, root).table();
   // The table goes into the archive from memory: a file among the data would take the place of one
   // that the application calls the same. A directory in that place is one that no restore removes.
   if (text == nullptr || is_directory(path.c_str())) {

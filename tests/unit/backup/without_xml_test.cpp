@@ -7,7 +7,7 @@
 #include "lazy_xml.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/rules_state.h"
+#include "rules/rules_file.h"
 
 extern "C" {
 void *__real_dlopen(const char *name, int flags);

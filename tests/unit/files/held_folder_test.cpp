@@ -1,4 +1,5 @@
-#include "quarn_d_utils/held_folder.h"
+#include "files/held_folder.h"
+#include "quarn_d_utils/package_identity.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -8,9 +9,9 @@
 #include <optional>
 #include <thread>
 
+#include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "temp_dir.h"
 
 namespace {

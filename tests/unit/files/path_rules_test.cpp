@@ -11,7 +11,7 @@
 #include "fault.h"
 #include "log_capture.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/rules_state.h"
+#include "rules/rules_file.h"
 #include "temp_dir.h"
 
 namespace {

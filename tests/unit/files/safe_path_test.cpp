@@ -1,4 +1,4 @@
-#include "quarn_d_utils/safe_path.h"
+#include "files/safe_path.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>

@@ -6,8 +6,8 @@
 
 #include <filesystem>
 
+#include "files/safe_path.h"
 #include "quarn_d_restore/snapshot.h"
-#include "quarn_d_utils/safe_path.h"
 #include "restore_fixture.h"
 
 namespace {

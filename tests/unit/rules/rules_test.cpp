@@ -9,11 +9,11 @@
 #include <filesystem>
 #include <fstream>
 
+#include "files/safe_path.h"
 #include "mock_platform.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/rules_file.h"
-#include "quarn_d_utils/safe_path.h"
+#include "rules/rules_file.h"
 
 namespace {
 
@@ -185,6 +185,7 @@ TEST_F(Rules, ATreeThatIsTooDeepForTheDaemonIsUnreadable) {
 }
 
 using SchemaSource = Handle<xmlSchemaParserCtxt, &xmlSchemaFreeParserCtxt>;
+using Document = Handle<xmlDoc, &xmlFreeDoc>;
 using Schema = Handle<xmlSchema, &xmlSchemaFree>;
 using SchemaCheck = Handle<xmlSchemaValidCtxt, &xmlSchemaFreeValidCtxt>;
 
@@ -193,7 +194,7 @@ TEST(RulesSchema, TakesWhatTheCheckerHasNothingAgainst) {
   const Schema schema(xmlSchemaParse(source.get()));
   ASSERT_TRUE(schema);
   const auto is_valid = [&](const std::string &text) {
-    const RulesDoc document(
+    const Document document(
         xmlReadMemory(text.data(), static_cast<int>(text.size()), "rules", nullptr, 0));
     const SchemaCheck check(xmlSchemaNewValidCtxt(schema.get()));
     xmlSchemaSetValidStructuredErrors(
@@ -212,6 +213,33 @@ TEST(RulesSchema, TakesWhatTheCheckerHasNothingAgainst) {
 TEST_F(Rules, ElementsWithoutPathAndUnknownOnesAreNamed) {
   rules("<backup><exclude/><skip path=\"data/\"/></backup>");
   EXPECT_EQ(kinds(check()), (std::vector<std::string>{"no-path", "unknown-element"}));
+}
+
+TEST_F(Rules, EveryFileIsDecidedAsTheDaemonDecides) {
+  for (const char *path : {"data/a", "data/b/c", "data/b/d/e", "data/bc", "shared/data/f"}) {
+    write(path, "x");
+  }
+  const std::vector<std::string> paths = {
+      "data/",       "data",      "data/a",    "data/b",   "data/b/",
+      "data/b/d",    "data/b/d/", "data/none", "/data/bc", "shared/",
+      "shared/data", "data//b/",  "data/b/c/", "",         "/"};
+  for (const std::string &one : paths) {
+    for (const std::string &other : paths) {
+      for (const char *kinds : {"ii", "ie", "ei", "ee"}) {
+        const auto rule = [](char kind, const std::string &path) {
+          return (kind == 'i' ? "<include path=\"" : "<exclude path=\"") + path + "\"/>";
+        };
+        rules("<backup>" + rule(kinds[0], one) + rule(kinds[1], other) + "</backup>");
+        const rules_report report = check();
+        parse_backup_path_xml("org.example.app", "tpk", root_.c_str());
+        for (const rule_entry &entry : report.entries) {
+          EXPECT_EQ(entry.in, is_backup_file((root_ + "/" + entry.path).c_str()))
+              << kinds << " " << one << " " << other << ": " << entry.path;
+        }
+      }
+    }
+  }
+  reset_backup_path_info();
 }
 
 TEST_F(Rules, OverTheCapShowsTheLargestFiles) {

@@ -1,4 +1,4 @@
-#include "quarn_d_utils/safe_path.h"
+#include "files/safe_path.h"
 
 #include <fcntl.h>
 #include <linux/openat2.h>
@@ -10,7 +10,7 @@
 #include <cstring>
 #include <vector>
 
-#include "quarn_d_utils/held_folder.h"
+#include "files/held_folder.h"
 
 namespace {
 

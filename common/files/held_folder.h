@@ -8,15 +8,15 @@
  * its own from the directory that it opened; nothing is found or made there
  * once that directory has gone, and nothing in another that has its path.
  */
-#ifndef QUARN_D_UTILS_HELD_FOLDER_H
-#define QUARN_D_UTILS_HELD_FOLDER_H
+#ifndef QUARN_HELD_FOLDER_H
+#define QUARN_HELD_FOLDER_H
 
 #include <sys/stat.h>
 
 #include <string>
 #include <utility>
 
-#include "quarn_d_utils/handles.h"
+#include "quarn_handles.h"
 
 /**
  * One such directory, for the thread that made it and for as long as it lives. They
@@ -64,11 +64,5 @@ class HeldFile : public HeldFolder {
  public:
   explicit HeldFile(std::string path) : HeldFolder(std::move(path), 0) {}
 };
-
-/**
- * Open what lies at an absolute path below a held folder as the package's user,
- * as open_below_as_package() does; outside of one as the daemon.
- */
-UniqueFd open_held_as_package(const std::string &path, int flags);
 
 #endif

@@ -8,16 +8,16 @@
  * below a folder that the thread holds is reached from that folder, see
  * held_folder.h. All functions set errno on failure and log nothing. Any thread.
  */
-#ifndef QUARN_D_UTILS_SAFE_PATH_H
-#define QUARN_D_UTILS_SAFE_PATH_H
+#ifndef QUARN_SAFE_PATH_H
+#define QUARN_SAFE_PATH_H
 
 #include <sys/stat.h>
 #include <sys/types.h>
 
 #include <string>
 
-#include "quarn_d_utils/bounds.h"
-#include "quarn_d_utils/handles.h"
+#include "files/tree_depth.h"
+#include "quarn_handles.h"
 
 /**
  * Open an absolute path. The last component is never followed when it is a

@@ -1,4 +1,4 @@
-#include "quarn_d_utils/held_folder.h"
+#include "files/held_folder.h"
 
 #include <fcntl.h>
 
@@ -6,8 +6,7 @@
 #include <cstring>
 #include <utility>
 
-#include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/safe_path.h"
+#include "files/safe_path.h"
 
 namespace {
 
@@ -79,15 +78,4 @@ const char *HeldFolder::below(const char *path) const {
   path += path_.size();
   while (*path == '/') ++path;
   return *path == '\0' ? "." : path;
-}
-
-UniqueFd open_held_as_package(const std::string &path, int flags) {
-  const HeldFolder *folder = HeldFolder::of(path.c_str());
-  if (folder == nullptr) return safe_open(path.c_str(), flags);
-  const package_user user = user_of_package();
-  UniqueFd fd =
-      open_below_as_package(folder->fd(), folder->below(path.c_str()), flags, 0, user, nullptr);
-  // the device maker's links are followed
-  if (!fd && errno == ELOOP) fd = safe_open(path.c_str(), flags);
-  return fd;
 }
