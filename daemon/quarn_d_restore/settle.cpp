@@ -7,7 +7,7 @@
 #include <cerrno>
 
 #include "quarn_d_utils/disk_sync.h"
-#include "quarn_d_utils/safe_path.h"
+#include "files/safe_path.h"
 #include "quarn_log.h"
 
 namespace {
