@@ -9,6 +9,7 @@
 
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/held_folder.h"
 #include "quarn_d_utils/package_identity.h"
@@ -27,6 +28,8 @@ constexpr mode_t kLinksFolderMode = S_IRWXU | S_IWOTH;
 constexpr char kAsideName[] = "/table";
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
 constexpr std::size_t kOpenAtOnce = 32;
+/** What the largest archive's can be. */
+constexpr std::uint64_t kMostNames = kMaxUnpackedSize - kMaxBackupSize;
 
 struct TableRelease {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
@@ -203,6 +206,7 @@ class SnapshotCopy {
       const std::string name = std::move(pending.back().back());
       pending.back().pop_back();
       const std::size_t length = path_.size();
+      if (is_beyond_bounds(place)) return false;
       path_ += "/" + name;
       if (place.down(name.c_str())) {
         pending.push_back(copy_folder(place.fd()));
@@ -215,6 +219,14 @@ class SnapshotCopy {
   }
 
  private:
+  /** Whether to go deeper would be more than a backup can hold: its table is in memory whole. */
+  bool is_beyond_bounds(const TreePlace &place) const {
+    const bool deeper = place.depth() >= static_cast<std::size_t>(kMaxDirDepth);
+    if (!deeper && table_->names <= kMostNames) return false;
+    LOGE("data at %s is %s than a snapshot can hold", path_.c_str(), deeper ? "deeper" : "more");
+    return true;
+  }
+
   /** The files of the directory at the walk's path. @return the directories in it */
   std::vector<std::string> copy_folder(int dir) {
     std::vector<TreeEntry> entries;
