@@ -1,7 +1,5 @@
 // An application that changes its data at the very moment: between any two steps of the packing it
 // puts another's file in the place of its own, and takes it away again a step or two later.
-#include <dirent.h>
-#include <dlfcn.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -11,9 +9,7 @@
 #include <unistd.h>
 #include <unzip.h>
 
-#include <cerrno>
 #include <chrono>
-#include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -22,6 +18,7 @@
 #include <functional>
 #include <string>
 
+#include "each_moment.h"
 #include "mock_platform.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/quarn_d_utils.h"
@@ -44,76 +41,6 @@ std::chrono::milliseconds race() {
   const char *seconds = std::getenv("QUARN_RACE_SECONDS");
   return std::chrono::milliseconds(seconds == nullptr ? 10000 : 1000 * std::atoi(seconds));
 }
-
-/** Called before and after each step of the thread that packs. */
-thread_local std::function<void()> *between_steps = nullptr;
-
-/** What the application does, with its rights, on the thread that packs. */
-class AsApplication {
- public:
-  AsApplication() : group_(syscall(SYS_setfsgid, kAppGid)), user_(syscall(SYS_setfsuid, kAppUid)) {}
-  ~AsApplication() {
-    syscall(SYS_setfsuid, user_);
-    syscall(SYS_setfsgid, group_);
-  }
-  AsApplication(const AsApplication &) = delete;
-  AsApplication &operator=(const AsApplication &) = delete;
-
- private:
-  const long group_;
-  const long user_;
-};
-
-void step() {
-  if (between_steps == nullptr) return;
-  const int error = errno;
-  std::function<void()> *once = between_steps;
-  between_steps = nullptr;  // what it does is no step
-  (*once)();
-  between_steps = once;
-  errno = error;
-}
-
-/** The C library's function of that name, between two moments. */
-template <typename Function, typename... Arguments>
-auto stepped(const char *name, Arguments... arguments) {
-  auto *const real = reinterpret_cast<Function *>(dlsym(RTLD_NEXT, name));
-  step();
-  const auto result = real(arguments...);
-  step();
-  return result;
-}
-
-}  // namespace
-
-extern "C" {
-int open(const char *path, int flags, ...) {
-  va_list arguments;
-  va_start(arguments, flags);
-  const mode_t mode = va_arg(arguments, mode_t);
-  va_end(arguments);
-  return stepped<int(const char *, int, ...)>("open", path, flags, mode);
-}
-int openat(int dir, const char *path, int flags, ...) {
-  va_list arguments;
-  va_start(arguments, flags);
-  const mode_t mode = va_arg(arguments, mode_t);
-  va_end(arguments);
-  return stepped<int(int, const char *, int, ...)>("openat", dir, path, flags, mode);
-}
-int fstat(int fd, struct stat *status) noexcept {
-  return stepped<int(int, struct stat *)>("fstat", fd, status);
-}
-int fstatat(int dir, const char *path, struct stat *status, int flags) noexcept {
-  return stepped<int(int, const char *, struct stat *, int)>("fstatat", dir, path, status, flags);
-}
-dirent *readdir(DIR *dir) { return stepped<dirent *(DIR *)>("readdir", dir); }
-ssize_t read(int fd, void *data, std::size_t size) {
-  return stepped<ssize_t(int, void *, std::size_t)>("read", fd, data, size);
-}
-}
-
-namespace {
 
 class PackingRace : public ::testing::Test {
  protected:
@@ -168,10 +95,10 @@ class PackingRace : public ::testing::Test {
       if (steps == until) put(false);
       ++steps;
     };
-    between_steps = &at_step;
+    at_each_moment = &at_step;
     int error = 0;
     make_zip_data(kPackage, root_.c_str(), archive_.c_str(), &error);
-    between_steps = nullptr;
+    at_each_moment = nullptr;
     if (steps > from && steps <= until) put(false);
     met_ += error != 0;
     ++rounds_;
