@@ -86,6 +86,38 @@ bool is_packages_folder(int folder, const struct stat &status) {
 }
 
 /**
+ * A folder that goes back to somebody else is closed to the application first, and emptied of
+ * what is not its own: whatever it has linked there would count as the other's from then on.
+ * Each of those files comes back from the snapshot.
+ * @param entry the table's for the folder, null when it has none
+ * @param folder may be of the O_PATH kind
+ */
+void take_from_application(int folder, json_object *entry) {
+  const uid_t application = user_of_package().uid;
+  json_object *owner = nullptr;
+  struct stat status = {};
+  if (entry == nullptr || !json_object_object_get_ex(entry, "1", &owner) ||
+      static_cast<uid_t>(json_object_get_int64(owner)) == application ||
+      fstat(folder, &status) != 0 || status.st_uid != application) {
+    return;
+  }
+  if (change_object_owner(folder, 0, 0) < 0 || change_object_mode(folder, status, S_IRWXU) < 0) {
+    LOGE("chown: error \n");
+    return;
+  }
+  const UniqueFd opened(openat(folder, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  std::vector<TreeEntry> entries;
+  if (opened) list_tree_entries(opened.get(), &entries);
+  for (const TreeEntry &one : entries) {
+    const char *name = one.name.c_str();
+    if (fstatat(folder, name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode) &&
+        status.st_uid != application) {
+      static_cast<void>(unlinkat(folder, name, 0));
+    }
+  }
+}
+
+/**
  * The attributes of what the table has below the directory @p top. Files get
  * theirs in the snapshot, where the application cannot put another file in
  * their place; what is not there stays away.
@@ -104,6 +136,10 @@ void put_all_attributes_back(json_object *table, const std::string &top, Objects
     if (objects == Objects::kDirectories && !is_packages_folder(object.get(), status)) {
       LOGE("refused : %s was put there from elsewhere", key);
       continue;
+    }
+    if (objects == Objects::kDirectories) {
+      take_from_application(object.get(), entry);
+      if (fstat(object.get(), &status) != 0) continue;
     }
     put_attributes_back(object.get(), status, key, entry);
   }
@@ -404,40 +440,11 @@ class MovingBack {
     return renameat(from, name, to, name) == 0;
   }
 
-  /**
-   * A folder that goes back to somebody else is closed to the application first, and emptied of
-   * what is not its own: whatever it has linked there would count as the other's from then on.
-   * Each of those files comes back from the snapshot.
-   */
-  void take_from_application(int folder) const {
-    json_object *entry = entry_of(table_, path_.substr(files_.snapshot.size() + 1));
-    json_object *owner = nullptr;
-    struct stat status = {};
-    if (entry == nullptr || !json_object_object_get_ex(entry, "1", &owner) ||
-        static_cast<uid_t>(json_object_get_int64(owner)) == user_.uid ||
-        fstat(folder, &status) != 0 || status.st_uid != user_.uid) {
-      return;
-    }
-    if (change_object_owner(folder, 0, 0) < 0 || change_object_mode(folder, status, S_IRWXU) < 0) {
-      LOGE("chown: error \n");
-      return;
-    }
-    std::vector<TreeEntry> entries;
-    list_tree_entries(folder, &entries);
-    for (const TreeEntry &one : entries) {
-      const char *name = one.name.c_str();
-      if (fstatat(folder, name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode) &&
-          status.st_uid != user_.uid) {
-        static_cast<void>(unlinkat(folder, name, 0));
-      }
-    }
-  }
-
   bool enter(TreePlace *source, TreePlace *target, const char *name) {
     // as a rule it is there
     static_cast<void>(mkdir_as_package(target->fd(), name, kFolderMode, user_));
     if (!target->down(name)) return false;
-    take_from_application(target->fd());
+    take_from_application(target->fd(), entry_of(table_, path_.substr(files_.snapshot.size() + 1)));
     if (source->down(name)) return true;
     static_cast<void>(target->up());
     return false;

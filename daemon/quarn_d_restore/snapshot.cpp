@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <utility>
@@ -11,6 +12,7 @@
 #include "files/safe_path.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/tree_place.h"
@@ -27,6 +29,8 @@ constexpr mode_t kLinksFolderMode = S_IRWXU | S_IWOTH;
 constexpr char kAsideName[] = "/table";
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
 constexpr std::size_t kOpenAtOnce = 32;
+/** What the largest archive's can be. */
+constexpr std::uint64_t kMostNames = kMaxUnpackedSize - kMaxBackupSize;
 
 struct TableRelease {
   void operator()(file_info_table_h *table) const { release_file_info_table(table); }
@@ -113,30 +117,64 @@ int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
   return sync_directory(folder_of(files.parts.table)) ? QUARN_OK : QUARN_REFUSED;
 }
 
-/** Copy what is left of a file, which may have changed its size meanwhile. */
-bool copy_rest(int from, int to, char *buffer, std::size_t size) {
-  while (true) {
-    const ssize_t count = TEMP_FAILURE_RETRY(read(from, buffer, size));
-    if (count <= 0) return count == 0;
-    if (write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
+/** Copy the bytes from @p at on and before @p end. @return where the file or the copying ended */
+off_t copy_piece(int from, int to, off_t at, off_t end) {
+  while (at < end) {
+    off_t in = at;
+    off_t out = at;
+    const ssize_t count =
+        copy_file_range(from, &in, to, &out, static_cast<std::size_t>(end - at), 0);
+    if (count <= 0) break;
+    at += count;
   }
+  char buffer[kSmallFile];
+  while (at < end) {
+    const auto wanted = static_cast<std::size_t>(std::min<off_t>(end - at, sizeof(buffer)));
+    const ssize_t count = TEMP_FAILURE_RETRY(pread(from, buffer, wanted, at));
+    if (count <= 0 || pwrite(to, buffer, static_cast<std::size_t>(count), at) != count) break;
+    at += count;
+  }
+  return at;
 }
 
-/** Copy all of a file's bytes: small ones through memory, which costs less than a set-up. */
-bool copy_bytes(int from, int to, off_t size) {
-  char buffer[kSmallFile];
-  if (size <= static_cast<off_t>(sizeof(buffer))) {
-    const ssize_t count = read(from, buffer, sizeof(buffer));
-    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
-    return count == size || copy_rest(from, to, buffer, sizeof(buffer));
-  }
-  while (size > 0) {
-    const ssize_t count =
-        copy_file_range(from, nullptr, to, nullptr, static_cast<std::size_t>(size), 0);
-    if (count <= 0) return copy_rest(from, to, buffer, sizeof(buffer));
-    size -= count;
+/** Copy what is no hole: an application may have holes of any size, and a copy's take no room. */
+bool copy_data(int from, int to, off_t at, off_t end) {
+  while (at < end) {
+    off_t data = lseek(from, at, SEEK_DATA);
+    if (data < 0 && errno == ENXIO) return true;  // nothing but holes follows
+    if (data < 0) data = at;                      // the file system does not tell
+    off_t hole = lseek(from, data, SEEK_HOLE);
+    if (hole <= data) hole = end;
+    at = std::min(hole, end);
+    struct stat now = {};
+    if (data < at && copy_piece(from, to, data, at) < at &&
+        (fstat(from, &now) != 0 || now.st_size >= at)) {
+      return false;  // and the file has not become shorter
+    }
   }
   return true;
+}
+
+/**
+ * Copy a file as long as it is by now, whose size may have changed since it was @p size. What grows
+ * meanwhile grows for ever, if its application likes.
+ */
+bool copy_bytes(int from, int to, off_t size) {
+  struct stat now = {};
+  off_t copied = 0;
+  if (size <= static_cast<off_t>(kSmallFile)) {
+    // small ones through memory, which costs less than a set-up
+    char buffer[kSmallFile];
+    const ssize_t count = read(from, buffer, sizeof(buffer));
+    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
+    if (count == size) return true;
+    copied = count;
+  }
+  if (fstat(from, &now) != 0) return false;
+  const off_t end = now.st_size;
+  if (!copy_data(from, to, copied, end) || fstat(from, &now) != 0) return false;
+  // its last hole, or what it has lost meanwhile
+  return ftruncate(to, std::min(end, now.st_size)) == 0;
 }
 
 /**
@@ -203,6 +241,7 @@ class SnapshotCopy {
       const std::string name = std::move(pending.back().back());
       pending.back().pop_back();
       const std::size_t length = path_.size();
+      if (is_beyond_bounds(place)) return false;
       path_ += "/" + name;
       if (place.down(name.c_str())) {
         pending.push_back(copy_folder(place.fd()));
@@ -215,6 +254,14 @@ class SnapshotCopy {
   }
 
  private:
+  /** Whether to go deeper would be more than a backup can hold: its table is in memory whole. */
+  bool is_beyond_bounds(const TreePlace &place) const {
+    const bool deeper = place.depth() >= static_cast<std::size_t>(kMaxDirDepth);
+    if (!deeper && table_->names <= kMostNames) return false;
+    LOGE("data at %s is %s than a snapshot can hold", path_.c_str(), deeper ? "deeper" : "more");
+    return true;
+  }
+
   /** The files of the directory at the walk's path. @return the directories in it */
   std::vector<std::string> copy_folder(int dir) {
     std::vector<TreeEntry> entries;

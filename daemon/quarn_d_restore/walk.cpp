@@ -33,8 +33,19 @@ struct walk_context {
   restore_files files;
 };
 
-/** A directory of the walk, which follows: its name, and what was looked at. */
-using Found = std::vector<std::pair<std::string, struct stat>>;
+/** A directory of the walk, which follows. */
+struct FoundFolder {
+  std::string name;
+  struct stat status; /**< as it was looked at */
+  bool lacks_info;    /**< it got no attributes, which is a failure unless it holds no file */
+};
+
+/** A directory that the walk is in. */
+struct Level {
+  std::vector<FoundFolder> folders; /**< those in it that are still to be entered */
+  bool lacks_info = false;
+  bool holds_file = false; /**< here or anywhere below */
+};
 
 /** What an entry is, and a descriptor to change it by; none, with errno, when it is gone. */
 UniqueFd find_entry(int dir, const TreeEntry &entry, struct stat *status) {
@@ -57,7 +68,7 @@ bool is_empty_folder(const std::string &path) {
 }
 
 int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, const std::string &path,
-                  Found *found) {
+                  Level *level) {
   struct stat status = {};
   const UniqueFd object = find_entry(dir, entry, &status);
   if (!object) {
@@ -67,16 +78,12 @@ int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, cons
   }
   if (S_ISLNK(status.st_mode)) return 1;
   if (S_ISDIR(status.st_mode)) {
-    found->emplace_back(entry.name, status);
-    if (restore_object(ctx, dir, object.get(), status, path)) return 1;
-    if (is_empty_folder(path)) {
-      LOGI("it is empty folder : %s", path.c_str());
-      return 1;
-    }
-    LOGE("fail to restore file info : %s", path.c_str());
-    return 0;
+    const bool restored = restore_object(ctx, dir, object.get(), status, path);
+    level->folders.push_back({entry.name, status, !restored});
+    return 1;
   }
   if (S_ISREG(status.st_mode)) {
+    level->holds_file = true;
     if (restore_object(ctx, dir, object.get(), status, path)) return 1;
     LOGE("fail to restore file info : %s", path.c_str());
     return 0;
@@ -86,16 +93,27 @@ int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, cons
 }
 
 /** One directory: everything in it but what lies deeper. @return 1, or 0 when anything failed */
-int restore_folder(const walk_context &ctx, int dir, std::string *path, Found *found) {
+int restore_folder(const walk_context &ctx, int dir, std::string *path, Level *level) {
   std::vector<TreeEntry> entries;
   int result = list_tree_entries(dir, &entries) ? 1 : 0;
   for (const TreeEntry &entry : entries) {
     const PathStep step(path, entry.name.c_str());
     if (ctx.files.is_skipped(*path)) continue;
     restore_step("attributes");
-    if (!restore_entry(ctx, dir, entry, *path, found)) result = 0;
+    if (!restore_entry(ctx, dir, entry, *path, level)) result = 0;
   }
   return result;
+}
+
+/** What a directory without attributes of its own comes to. @return 1, or 0 for a failure */
+int judge_folder(const std::string &path, bool lacks_info, bool holds_file) {
+  if (!lacks_info) return 1;
+  if (!holds_file) {
+    LOGI("it is empty folder : %s", path.c_str());
+    return 1;
+  }
+  LOGE("fail to restore file info : %s", path.c_str());
+  return 0;
 }
 
 /** Go into a directory that was looked at; not into another that was put in its place. */
@@ -116,24 +134,29 @@ int walk_directory(const walk_context &ctx, const std::string &dir) {
     return 0;
   }
   std::string path = dir;
-  std::vector<Found> pending(1);
+  std::vector<Level> pending(1);
   int result = restore_folder(ctx, place.fd(), &path, &pending.back());
   while (true) {
-    if (pending.back().empty()) {
+    if (pending.back().folders.empty()) {
+      const Level left = std::move(pending.back());
       pending.pop_back();
+      // Asked of each folder on its own, this would go over all that lies below it again.
+      if (!judge_folder(path, left.lacks_info, left.holds_file)) result = 0;
       if (pending.empty()) return result;
+      if (left.holds_file) pending.back().holds_file = true;
       if (!place.up()) return 0;
       path.resize(path.rfind('/'));
       continue;
     }
-    const auto [name, status] = std::move(pending.back().back());
-    pending.back().pop_back();
+    const FoundFolder next = std::move(pending.back().folders.back());
+    pending.back().folders.pop_back();
     const std::size_t length = path.size();
-    path += "/" + name;
-    if (enter_checked(&place, name, status)) {
-      pending.emplace_back();
+    path += "/" + next.name;
+    if (enter_checked(&place, next.name, next.status)) {
+      pending.push_back({{}, next.lacks_info, false});
       if (!restore_folder(ctx, place.fd(), &path, &pending.back())) result = 0;
     } else {
+      judge_folder(path, next.lacks_info, next.lacks_info && !is_empty_folder(path));
       LOGE("error : cannot open this path %s", path.c_str());
       result = 0;
       path.resize(length);

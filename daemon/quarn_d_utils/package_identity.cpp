@@ -88,12 +88,6 @@ bool can_fill(int dir, const struct stat &status, const package_user &user) {
   return list >= 0 || (errno != ENODATA && errno != EOPNOTSUPP);
 }
 
-/** True when the application may move what it may write out of a folder, or into it. */
-bool can_move_in(int dir, const struct stat &status, const package_user &user) {
-  const bool sticky = (status.st_mode & S_ISVTX) != 0 && status.st_uid != user.uid;
-  return !sticky && can_fill(dir, status, user);
-}
-
 /**
  * A folder that was found in its place since this thread took on another identity: whoever walks a
  * tree of somebody else's asks of the same folder for each of its entries, and of the one above it
@@ -116,27 +110,63 @@ class KnownPlace {
   bool known_ = false;
 };
 thread_local KnownPlace known_place;
+/** The application's own folder above it, which folders beside it have above them as well. */
+thread_local KnownPlace known_home;
 thread_local int identities = 0;
 
+bool lies_at(int top, const char *path, const struct stat &status) {
+  struct stat found = {};
+  return fstatat(top, path, &found, AT_SYMLINK_NOFOLLOW) == 0 && found.st_ino == status.st_ino &&
+         found.st_dev == status.st_dev;
+}
+
+/** True for the root of a package: what it lies in is none of the applications' doing. */
+bool is_package_root(int top, const package_user &user) {
+  struct stat holder = {};
+  const UniqueFd above(openat(top, "..", kPlaceFlags | O_DIRECTORY));
+  return above && fstat(above.get(), &holder) == 0 && !can_fill(above.get(), holder, user);
+}
+
 /**
- * False when a folder of somebody else's lies in one that the application may have moved to where
- * it is now: up to a folder of the application's own, or the root of all.
+ * One of the folders for a package's data: where the package's root is its own the application
+ * could exchange these as well, but what others keep right there is to be backed up and restored.
+ */
+bool is_data_folder(int dir, const struct stat &status, const package_user &user) {
+  UniqueFd top(openat(dir, "..", kPlaceFlags | O_DIRECTORY));
+  if (top && lies_at(top.get(), "data", status) && is_package_root(top.get(), user)) return true;
+  top.reset(openat(dir, "../..", kPlaceFlags | O_DIRECTORY));
+  return top &&
+         (lies_at(top.get(), "shared/data", status) ||
+          lies_at(top.get(), "shared/trusted", status)) &&
+         is_package_root(top.get(), user);
+}
+
+/**
+ * False when a folder is one that the application may have moved to where it is now, or lies in
+ * such a one: up to a folder for data or the root of all, for what the application owns it can move
+ * with all that it holds. A sticky folder keeps nobody from moving something into it.
  */
 bool is_in_its_place(int dir, struct stat status, const package_user &user) {
   const struct stat asked = status;
+  struct stat home = {};
   const ActAsRoot root;
   UniqueFd held;
-  while (status.st_uid != user.uid && !known_place.is(status)) {
+  while (!known_place.is(status) && !known_home.is(status)) {
     UniqueFd above(openat(dir, "..", kPlaceFlags | O_DIRECTORY));
     struct stat holder = {};
     if (!root || !above || fstat(above.get(), &holder) != 0) return false;
     if (holder.st_ino == status.st_ino && holder.st_dev == status.st_dev) break;
-    if (can_fill(dir, status, user) && can_move_in(above.get(), holder, user)) return false;
+    if (status.st_uid == user.uid && home.st_nlink == 0) home = status;
+    if (can_fill(dir, status, user) && can_fill(above.get(), holder, user)) {
+      if (is_data_folder(dir, status, user)) break;
+      return false;
+    }
     held = std::move(above);
     dir = held.get();
     status = holder;
   }
   known_place.remember(asked);
+  if (home.st_nlink != 0) known_home.remember(home);
   return true;
 }
 
@@ -148,8 +178,9 @@ bool lies_by_others_doing(int dir, int object, const struct stat &status,
   if (!can_fill(dir, holder, user)) {
     return (S_ISDIR(status.st_mode) || status.st_nlink == 1) && is_in_its_place(dir, holder, user);
   }
-  // A folder has one name, and goes elsewhere only with the right to write it.
-  return S_ISDIR(status.st_mode) && holder.st_uid == user.uid && !can_fill(object, status, user);
+  // A folder has one name, and goes elsewhere only with the right to write it, or with its holder.
+  return S_ISDIR(status.st_mode) && holder.st_uid == user.uid && !can_fill(object, status, user) &&
+         is_in_its_place(dir, holder, user);
 }
 
 /** What is refused to the user: by root, on the object that was looked at. */
@@ -206,7 +237,10 @@ package_user user_of_package() { return {kAppUid, kAppGid}; }
 bool drop_other_groups() { return geteuid() != 0 || setgroups(0, nullptr) == 0; }
 
 FileIdentity::FileIdentity(package_user user) : before_(identity()), granted_(true) {
-  if (identities++ == 0) known_place.forget();
+  if (identities++ == 0) {
+    known_place.forget();
+    known_home.forget();
+  }
   if (geteuid() == 0) granted_ = become(user);
 }
 

@@ -34,22 +34,20 @@ constexpr char kProc[] = "/proc/";
 
 std::string name_of(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
-/** What a transaction gives its label to. */
-struct Given {
-  const std::string &label;
-  uid_t owner; /**< of the folder that was named */
-};
+bool relabel_folder(int fd, const struct stat &folder, const std::string &label);
 
-bool relabel_folder(int fd, const struct stat &folder, const Given &given);
+bool others_may_write(const struct stat &folder) {
+  return (folder.st_mode & (S_IWGRP | S_IWOTH)) != 0;
+}
 
 /**
- * True for what is no second name of somebody else's file: it belongs to the owner of what was
- * given, or that owner cannot have put it where it lies.
+ * True for what is no second name of somebody else's file. It belongs to the owner of the folder
+ * that it lies in, whoever owns what was named: an application's folder in one of root's holds what
+ * that application has put there. Else nobody but a service can have put it into its folder.
  */
-bool is_given(const struct stat &status, const struct stat &folder, const Given &given) {
-  if (status.st_uid == given.owner) return true;
-  return status.st_nlink == 1 && folder.st_uid != given.owner &&
-         (folder.st_mode & (S_IWGRP | S_IWOTH)) == 0;
+bool is_given(const struct stat &status, const struct stat &folder) {
+  if (status.st_uid == folder.st_uid) return status.st_uid != 0 || !others_may_write(folder);
+  return status.st_nlink == 1 && folder.st_uid == 0 && !others_may_write(folder);
 }
 
 /** Label what is held as @p fd: a link itself, not its target. */
@@ -66,15 +64,15 @@ bool is_roots_own(const struct stat &folder) {
 }
 
 /** One entry of the folder that is open as @p dir: what was looked at is what is labelled. */
-bool relabel_entry(int dir, const struct stat &folder, const char *name, const Given &given) {
+bool relabel_entry(int dir, const struct stat &folder, const char *name, const std::string &label) {
   const int fd = openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
   if (fd < 0) return errno == ENOENT;
   struct stat status {};
   bool done = fstat(fd, &status) == 0;
   if (done && S_ISDIR(status.st_mode)) {
-    if (!is_roots_own(status)) done = relabel_folder(fd, status, given);
-  } else if (done && is_given(status, folder, given)) {
-    done = relabel_leaf(fd, status, given.label);
+    if (!is_roots_own(status)) done = relabel_folder(fd, status, label);
+  } else if (done && is_given(status, folder)) {
+    done = relabel_leaf(fd, status, label);
   }
   close(fd);
   return done;
@@ -84,8 +82,8 @@ bool relabel_entry(int dir, const struct stat &folder, const char *name, const G
  * Label the folder @p fd (an O_PATH descriptor) and everything below it. Folders are held while
  * their entries are labelled, so a link swapped in leads nowhere.
  */
-bool relabel_folder(int fd, const struct stat &folder, const Given &given) {
-  if (!relabel_leaf(fd, folder, given.label)) return false;
+bool relabel_folder(int fd, const struct stat &folder, const std::string &label) {
+  if (!relabel_leaf(fd, folder, label)) return false;
   const int opened = openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   DIR *dir = opened < 0 ? nullptr : fdopendir(opened);
   if (dir == nullptr) {
@@ -96,7 +94,7 @@ bool relabel_folder(int fd, const struct stat &folder, const Given &given) {
   while (const dirent *entry = readdir(dir)) {
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
-    done = relabel_entry(opened, folder, entry->d_name, given) && done;
+    done = relabel_entry(opened, folder, entry->d_name, label) && done;
   }
   closedir(dir);
   return done;
@@ -131,8 +129,7 @@ bool relabel(const std::string &path, const std::string &label) {
   const int fd = open_folder(path);
   if (fd < 0) return false;
   struct stat folder {};
-  const bool done =
-      fstat(fd, &folder) == 0 && relabel_folder(fd, folder, Given{label, folder.st_uid});
+  const bool done = fstat(fd, &folder) == 0 && relabel_folder(fd, folder, label);
   close(fd);
   return done;
 }

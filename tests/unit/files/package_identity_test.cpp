@@ -259,7 +259,7 @@ TEST_F(PackageIdentity, WhatLiesDeepInAFolderThatTheApplicationMayHaveMovedIsRef
     bool trusted;
   };
   const Above folders[] = {
-      {0755, kOther, true}, {0777, kOther, false}, {01777, kOther, false}, {0700, kApp.uid, true}};
+      {0755, kOther, true}, {0777, kOther, false}, {01777, kOther, false}, {0700, kApp.uid, false}};
   struct stat status = {};
   for (const Above &above : folders) {
     SCOPED_TRACE(above.mode);
@@ -277,6 +277,61 @@ TEST_F(PackageIdentity, WhatLiesDeepInAFolderThatTheApplicationMayHaveMovedIsRef
     EXPECT_EQ(exists(dir_ / "data/above/middle/theirs/file"), !above.trusted);
     EXPECT_EQ(unlink_as_package(folder_.get(), "new", 0, kApp) == 0, above.trusted);
   }
+}
+
+TEST_F(PackageIdentity, WhatOthersKeepInAFolderThatTheApplicationCanMoveIsRefused) {
+  give("elsewhere", 0755, kApp.uid);
+  give("elsewhere/mine", 0755, kApp.uid);
+  give("elsewhere/mine/theirs", 0700, kOther);
+  file("elsewhere/mine/theirs/file", 0600, kOther);
+  {
+    const ActAsPackage acting(kApp);
+    const UniqueFd from(open((dir_ / "elsewhere").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    ASSERT_EQ(renameat(from.get(), "mine", folder_.get(), "moved"), 0) << std::strerror(errno);
+  }
+  open_folder("data/moved");
+  struct stat status = {};
+  EXPECT_FALSE(open_as_package(folder_.get(), "theirs", O_RDONLY | O_DIRECTORY, 0, kApp, &status));
+  EXPECT_EQ(errno, EACCES);
+  open_folder("data/moved/theirs");
+  EXPECT_EQ(read_as_package("file"), kRefused);
+  EXPECT_FALSE(open_as_package(folder_.get(), "new", O_WRONLY | O_CREAT, 0, kApp, &status));
+  EXPECT_EQ(unlink_as_package(folder_.get(), "file", 0, kApp), -1);
+  const UniqueFd object(openat(folder_.get(), "file", O_PATH | O_CLOEXEC));
+  ASSERT_EQ(fstat(object.get(), &status), 0);
+  EXPECT_FALSE(may_be_changed(folder_.get(), object.get(), status, kApp));
+}
+
+TEST_F(PackageIdentity, WhatOthersKeepRightInAPackagesDataStaysInReach) {
+  for (const char *data : {"package/data", "package/shared/data", "package/shared/trusted"}) {
+    const std::string theirs = std::string(data) + "/theirs";
+    file(theirs + "/deeper/file", 0600, kOther);
+    for (const std::string &name : {theirs, theirs + "/deeper"}) own(name, 0700, kOther);
+    for (const char *name : {"package/shared", "package"}) {
+      if (exists(dir_ / name)) own(name, 0755, kApp.uid);
+    }
+    own(data, 0755, kApp.uid);
+    open_folder(data);
+    struct stat status = {};
+    EXPECT_TRUE(
+        open_below_as_package(folder_.get(), "theirs/deeper/file", O_RDONLY, 0, kApp, &status))
+        << data;
+  }
+  give("package/data/other", 0755, kApp.uid);
+  give("package/data/other/data", 0755, kApp.uid);
+  give("package/data/other/data/theirs", 0700, kOther);
+  open_folder("package/data/other/data");
+  EXPECT_FALSE(open_as_package(folder_.get(), "theirs", O_RDONLY, 0, kApp, nullptr))
+      << "a name alone makes no folder for data";
+}
+
+TEST_F(PackageIdentity, WhatMayHaveBeenMovedIntoAFolderForAllIsRefused) {
+  give("public", 01777, 0);
+  give("public/open", 0777, kOther);
+  file("public/open/theirs/file", 0600, kOther);
+  own("public/open/theirs", 0755, kOther);
+  open_folder("public/open/theirs");
+  EXPECT_EQ(read_as_package("file"), kRefused);
 }
 
 TEST_F(PackageIdentity, WhatLiesInAFolderForAllThatNobodyMovesStaysInReach) {

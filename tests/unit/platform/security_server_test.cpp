@@ -81,7 +81,9 @@ TEST_F(SecurityServer, LeavesOutWhatOnlyRootMayEnter) {
   ASSERT_EQ(chmod((dir_ / "tree/data/deep/own").c_str(), 0700), 0);
   dir_.file("tree/data/deep/app/file", "");
   ASSERT_EQ(chmod((dir_ / "tree/data/deep/app").c_str(), 0700), 0);
-  ASSERT_EQ(chown((dir_ / "tree/data/deep/app").c_str(), 5000, 5000), 0);
+  for (const char *name : {"tree/data/deep/app", "tree/data/deep/app/file"}) {
+    ASSERT_EQ(chown((dir_ / name).c_str(), 5000, 5000), 0);
+  }
   ASSERT_EQ(chmod((dir_ / "tree/data").c_str(), 0700), 0);  // what was asked for is labelled
   EXPECT_EQ(relabel(dir_ / "tree/data"), SECURITY_SERVER_SUCCESS);
   EXPECT_EQ(label("tree/data"), "new");
@@ -109,6 +111,35 @@ TEST_F(SecurityServer, LeavesOutSecondNamesOfOthersFiles) {
   EXPECT_EQ(label("tree/data/mine"), "new");
   EXPECT_EQ(label("tree/data/deep/again"), "new");
   EXPECT_EQ(label("tree/data/service/file"), "new") << "the application cannot have put it there";
+}
+
+TEST_F(SecurityServer, WhoOwnsTheFolderOfAnObjectCountsNotWhoOwnsWhatWasNamed) {
+  const auto own = [this](const char *name, uid_t owner) {
+    ASSERT_EQ(lchown((dir_ / name).c_str(), owner, owner), 0);
+  };
+  // a folder of root's that holds the application's, and one that others may fill
+  for (const char *name : {"roots", "service"}) dir_.file(std::string("outside/") + name, "");
+  own("outside/service", 1234);
+  dir_.file("tree/data/app/mine", "");
+  dir_.file("tree/data/app/left", "");
+  dir_.file("tree/data/open/left", "");
+  own("tree/data/app/mine", 5000);
+  own("tree/data/app", 5000);
+  ASSERT_EQ(chmod((dir_ / "tree/data/open").c_str(), 01777), 0);
+  for (const char *name : {"roots", "service"}) {
+    const std::string there = dir_ / (std::string("outside/") + name);
+    for (const char *folder : {"tree/data/app/", "tree/data/open/"}) {
+      ASSERT_EQ(link(there.c_str(), (dir_ / (std::string(folder) + name)).c_str()), 0);
+    }
+  }
+  EXPECT_EQ(relabel(dir_ / "tree/data"), SECURITY_SERVER_SUCCESS);
+  for (const char *name :
+       {"outside/roots", "outside/service", "tree/data/app/left", "tree/data/open/left"}) {
+    EXPECT_EQ(label(name), "_") << name;
+  }
+  for (const char *name : {"tree/data/app", "tree/data/app/mine", "tree/data/file"}) {
+    EXPECT_EQ(label(name), "new") << name;
+  }
 }
 
 TEST_F(SecurityServer, LabelsNoObjectThroughALink) {

@@ -1,14 +1,27 @@
 // A tree that the writer packs is taken by the snapshot, the restore and the rollback.
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
+#include <functional>
 
 #include "files/safe_path.h"
 #include "quarn_d_restore/snapshot.h"
 #include "restore_fixture.h"
+
+namespace {
+
+std::function<void()> on_folder_read;
+
+}  // namespace
+
+extern "C" void rewinddir(DIR *dir) noexcept {
+  if (on_folder_read) on_folder_read();
+  reinterpret_cast<void (*)(DIR *)>(dlsym(RTLD_NEXT, "rewinddir"))(dir);
+}
 
 namespace {
 
@@ -113,6 +126,28 @@ TEST_F(DeepTest, ARollbackNeedsFewDescriptors) {
   ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
   EXPECT_EQ(result, rollback_result::whole);
   EXPECT_EQ(deepest(), "present");
+}
+
+TEST_F(DeepTest, DataThatIsDeeperThanABackupsIsLeftAsItIs) {
+  make_deep(kMaxDirDepth + 1, "d", "present");
+  make_archive(base + "/saved.zip", {{"data/db", "saved"}}, "{}");
+  EXPECT_EQ(restore(base + "/saved.zip"), 36);
+  EXPECT_EQ(deepest(), "present");
+  EXPECT_FALSE(exists(snapshot()));
+  EXPECT_FALSE(exists(at("data/db")));
+  EXPECT_EQ(count_logged(DLOG_ERROR, "fail to temp backup : " + at("data")), 1);
+}
+
+TEST_F(DeepTest, EachFolderOfADeepTreeIsLookedAtOnceForItsAttributes) {
+  // as an application can dig while it is restored
+  constexpr int kLevels = 3000;
+  make_deep(kLevels, "d", "dug");
+  int folders = 0;
+  on_folder_read = [&] { ++folders; };
+  EXPECT_EQ(parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), nullptr), 0);
+  on_folder_read = nullptr;
+  EXPECT_GT(folders, kLevels);
+  EXPECT_LT(folders, 2 * kLevels);
 }
 
 }  // namespace

@@ -231,6 +231,26 @@ TEST_F(IdentityTest, WhatWasPutIntoAFolderThatGoesBackToAnotherDoesNotStayInIt) 
   EXPECT_EQ(tree_of(root), before);
 }
 
+TEST_F(IdentityTest, NorWhatWasPutIntoOneOfWhichTheSnapshotHoldsNoFile) {
+  const std::string secret = base + "/secret";
+  write_text(secret, "root's");
+  ASSERT_EQ(chmod(secret.c_str(), 0600), 0);
+  dir("data/theirs");
+  chown_to("data/theirs", 0, 0, 0755);
+  make_archive(base + "/broken.zip", {{"data/new", "new", 0640}}, "not json");
+  const AtStep planted("rollback-moved", [&] {
+    ASSERT_FALSE(exists(at("data/theirs"))) << "it was empty";
+    dir("data/theirs");
+    ASSERT_EQ(link(secret.c_str(), at("data/theirs/planted").c_str()), 0);
+    ASSERT_EQ(unlink(secret.c_str()), 0);
+    chown_to("data/theirs", kAppUid, kAppGid, 0755);
+  });
+  EXPECT_EQ(restore(base + "/broken.zip"), QUARN_REFUSED);
+  EXPECT_EQ(status_of("data/theirs").st_uid, 0U);
+  EXPECT_EQ(status_of("data/theirs").st_mode & 07777U, 0755U);
+  EXPECT_FALSE(exists(at("data/theirs/planted")));
+}
+
 TEST_F(IdentityTest, AnExchangedTableIsNotRead) {
   file("data/a", "old", 0600);
   const std::vector<Entry> entries = {{"data/a", "new", 0644}};

@@ -1,18 +1,33 @@
 #include <fcntl.h>
 #include <linux/capability.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 
 #include "quarn_d_restore/snapshot.h"
 #include "restore_fixture.h"
 
 using ::testing::_;
 using ::testing::Return;
+
+namespace {
+
+/** What an application does while a file of its is copied. */
+std::function<void()> on_copy;
+
+}  // namespace
+
+extern "C" ssize_t copy_file_range(int from, off64_t *in, int to, off64_t *out, std::size_t size,
+                                   unsigned int flags) {
+  if (on_copy) on_copy();
+  return syscall(SYS_copy_file_range, from, in, to, out, size, flags);
+}
 
 namespace {
 
@@ -279,6 +294,53 @@ TEST_F(SnapshotTest, ALinkInAFolderInItsPlaceHindersNothing) {
   std::filesystem::create_symlink("/nowhere", snapshot() + "/link");
   EXPECT_EQ(take(), 0);
   EXPECT_FALSE(std::filesystem::is_symlink(snapshot() + "/link"));
+}
+
+TEST_F(SnapshotTest, HolesOfAnySizeTakeNeitherTimeNorRoom) {
+  constexpr off_t kHole = off_t{1} << 40;
+  const std::string path = file("data/huge", "begin");
+  const UniqueFd huge(open(path.c_str(), O_RDWR | O_CLOEXEC));
+  ASSERT_EQ(pwrite(huge.get(), "middle", 6, kHole), 6);
+  if (ftruncate(huge.get(), 2 * kHole) != 0) GTEST_SKIP() << "no file can be as large here";
+  struct stat status = {};
+  EXPECT_EQ(take(), 0);
+  ASSERT_EQ(stat((snapshot() + "/data/huge").c_str(), &status), 0);
+  EXPECT_EQ(status.st_size, 2 * kHole);
+  EXPECT_LT(status.st_blocks, 1024);
+  ASSERT_EQ(ftruncate(huge.get(), 0), 0);
+  EXPECT_EQ(roll_back(), 0);
+  const UniqueFd back(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  char text[7] = {};
+  EXPECT_EQ(pread(back.get(), text, 5, 0), 5);
+  EXPECT_STREQ(text, "begin");
+  EXPECT_EQ(pread(back.get(), text, 6, kHole), 6);
+  EXPECT_STREQ(text, "middle");
+  ASSERT_EQ(fstat(back.get(), &status), 0);
+  EXPECT_EQ(status.st_size, 2 * kHole);
+}
+
+TEST_F(SnapshotTest, AFileThatGrowsForEverIsCopiedAsItWas) {
+  for (const std::size_t size : {100U, 1U << 20}) {
+    const std::string path = file("data/log", std::string(size, 'x'));
+    std::size_t grown = 0;
+    on_copy = [&] {
+      std::ofstream(path, std::ios::app) << std::string(size, 'y');
+      ASSERT_LT(++grown, 10U) << "nothing ends it";
+    };
+    EXPECT_EQ(take(), 0);
+    on_copy = nullptr;
+    EXPECT_EQ(grown > 0, size > 100);
+    EXPECT_TRUE(read_text(snapshot() + "/data/log") == std::string(size, 'x'));
+    EXPECT_EQ(roll_back(), 0);
+  }
+}
+
+TEST_F(SnapshotTest, AFileThatShrinksIsCopiedAsFarAsItGoes) {
+  const std::string path = file("data/log", std::string(1U << 20, 'x'));
+  on_copy = [&] { std::filesystem::resize_file(path, 4096); };
+  EXPECT_EQ(take(), 0);
+  on_copy = nullptr;
+  EXPECT_TRUE(read_text(snapshot() + "/data/log") == std::string(4096, 'x'));
 }
 
 /* ---- rollback ---- */
