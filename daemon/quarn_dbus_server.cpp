@@ -198,12 +198,16 @@ class RawCall : public MethodCall {
   GDBusMessage *message_;
 };
 
-/** Whose bounds a call counts against, beside its connection's: one caller may have many. */
+/**
+ * Whose bounds a call counts against, beside its connection's, of which one caller may have many.
+ * Applications are one user, and callers by their labels.
+ */
 waiting_parties parties_of(const MethodCall &call) {
   const quarn_caller &caller = call.caller();
   if (!caller.known || caller.uid == 0) return {};
-  return {"user " + std::to_string(caller.uid),
-          caller.label.empty() ? "" : "label " + caller.label};
+  const std::string user = "user " + std::to_string(caller.uid);
+  if (caller.uid != kAppUid) return {user, false};
+  return {user + ", label " + caller.label, true};
 }
 
 client_cb_data *make_record(const MethodCall &call, guint32 req_id) {

@@ -324,26 +324,66 @@ TEST_F(Callers, LeavingWaitsForTheAnswerAndServesWhatHadArrived) {
   EXPECT_EQ(outcome->reply, "(0,)");
 }
 
-TEST_F(Callers, AUserAndAnApplicationAreBoundedOverAllTheirConnections) {
-  std::vector<RecordPtr> records;
-  kept_records = &records;
-  std::vector<std::unique_ptr<ScriptedClient>> clients;
-  const auto ask = [&](const std::string &label) {
-    told_ = application(label);
-    constexpr std::size_t kOfAConnection = 8;
-    if (records.size() % kOfAConnection == 0) clients.push_back(std::make_unique<ScriptedClient>());
-    return clients.back()->call("app_data_backup_start", "('" + label + "', uint32 1)").error_name;
-  };
-  for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_EQ(ask("org.example.a"), "") << i;
-  EXPECT_EQ(ask("org.example.a"), kTooMany) << "however many connections it has";
-  for (const char *label : {"org.example.b", "org.example.c", "org.example.d"}) {
-    for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_EQ(ask(label), "") << i;
+constexpr uid_t kMember = 7001;
+
+/** Callers that ask from one connection after the other, for what waits. */
+class Askers {
+ public:
+  Askers() { kept_records = &records_; }
+  ~Askers() { kept_records = nullptr; }
+  Askers(const Askers &) = delete;
+  Askers &operator=(const Askers &) = delete;
+
+  /** @return how many requests were accepted before one was refused for their number */
+  std::size_t ask(const char *method, const std::string &arguments) {
+    constexpr std::size_t kOfAConnection = 48;
+    for (std::size_t count = 0;; ++count) {
+      if (count % kOfAConnection == 0) clients_.push_back(std::make_unique<ScriptedClient>());
+      const CallOutcome outcome = clients_.back()->call(method, arguments);
+      if (outcome.error_name == kTooMany) return count;
+      EXPECT_EQ(outcome.reply, "(0,)") << outcome.error_name;
+      if (outcome.reply != "(0,)") return count;
+    }
   }
-  EXPECT_EQ(records.size(), kMaxWaitingOfUser);
-  EXPECT_EQ(ask("org.example.e"), kTooMany) << "all applications together";
+  std::size_t waiting() const { return records_.size(); }
+
+ private:
+  std::vector<RecordPtr> records_;
+  std::vector<std::unique_ptr<ScriptedClient>> clients_;
+};
+
+TEST_F(Callers, OneApplicationOrUserFillsNoMoreThanACallersPlacesWithManyConnections) {
+  Askers askers;
+  told_ = application("org.example.a");
+  EXPECT_EQ(askers.ask("app_data_backup_start", "('org.example.a', uint32 1)"),
+            kMaxWaitingOfCaller);
+  told_ = {true, kMember, {kGroup}, "User"};
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaitingOfCaller);
+  told_ = {true, kMember + 1, {kGroup}, "User"};
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaitingOfCaller)
+      << "a label that many users have bounds none of them";
+}
+
+TEST_F(Callers, RootIsServedWhoeverElseHasFilledTheirPlaces) {
+  Askers askers;
+  for (char letter = 'a'; letter <= 'd'; ++letter) {
+    const std::string package = std::string("org.example.") + letter;
+    told_ = application(package);
+    EXPECT_EQ(askers.ask("app_data_backup_start", "('" + package + "', uint32 1)"),
+              kMaxWaitingOfCaller);
+  }
+  told_ = application("org.example.e");
+  EXPECT_EQ(askers.ask("app_data_backup_start", "('org.example.e', uint32 1)"), 0U)
+      << "all applications together";
+  for (uid_t user = kMember; user < kMember + 3; ++user) {
+    told_ = {true, user, {kGroup}, ""};
+    EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaitingOfCaller);
+  }
+  told_ = {true, kMember + 3, {kGroup}, ""};
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), 0U) << "all but root together";
+  EXPECT_EQ(askers.waiting(), kMaxWaitingOfOthers);
   told_ = {true, 0, {}, ""};
-  ScriptedClient root;
-  EXPECT_EQ(root.call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaiting - kMaxWaitingOfOthers);
 }
 
 TEST_F(Callers, ListsAndNamesAreBoundedBeforeARecordIsMade) {
