@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <utility>
@@ -113,28 +114,18 @@ int save_snapshot_table(file_info_table_h *table, const restore_files &files) {
   return sync_directory(folder_of(files.snapshot_table)) ? QUARN_OK : QUARN_REFUSED;
 }
 
-/** Copy what is left of a file, which may have changed its size meanwhile. */
-bool copy_rest(int from, int to, char *buffer, std::size_t size) {
-  while (true) {
-    const ssize_t count = TEMP_FAILURE_RETRY(read(from, buffer, size));
-    if (count <= 0) return count == 0;
-    if (write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
-  }
-}
-
-/** Copy all of a file's bytes: small ones through memory, which costs less than a set-up. */
-bool copy_bytes(int from, int to, off_t size) {
+/** Copy what a file has between two places; it may have become shorter meanwhile. */
+bool copy_extent(int from, int to, off_t begin, off_t end) {
   char buffer[kSmallFile];
-  if (size <= static_cast<off_t>(sizeof(buffer))) {
-    const ssize_t count = read(from, buffer, sizeof(buffer));
-    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
-    return count == size || copy_rest(from, to, buffer, sizeof(buffer));
-  }
-  while (size > 0) {
-    const ssize_t count =
-        copy_file_range(from, nullptr, to, nullptr, static_cast<std::size_t>(size), 0);
-    if (count <= 0) return copy_rest(from, to, buffer, sizeof(buffer));
-    size -= count;
+  for (off_t at = begin; at < end;) {
+    off_t target = at;
+    if (copy_file_range(from, &at, to, &target, static_cast<std::size_t>(end - at), 0) > 0)
+      continue;
+    const auto most = std::min<std::size_t>(sizeof(buffer), static_cast<std::size_t>(end - at));
+    const ssize_t count = TEMP_FAILURE_RETRY(pread(from, buffer, most, at));
+    if (count <= 0) return count == 0;
+    if (pwrite(to, buffer, static_cast<std::size_t>(count), at) != count) return false;
+    at += count;
   }
   return true;
 }
@@ -373,6 +364,25 @@ class SnapshotCopy {
 };
 
 }  // namespace
+
+bool copy_bytes(int from, int to, off_t size) {
+  // Small ones through memory, which costs less than a set-up.
+  if (size <= static_cast<off_t>(kSmallFile)) {
+    char buffer[kSmallFile];
+    const ssize_t count = TEMP_FAILURE_RETRY(read(from, buffer, sizeof(buffer)));
+    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
+    if (count == size) return true;
+  }
+  for (off_t at = 0;;) {
+    const off_t data = lseek(from, at, SEEK_DATA);
+    const off_t hole = data < 0 ? data : lseek(from, data, SEEK_HOLE);
+    if (hole < 0 && errno == ENXIO) break;  // nothing is left but a hole
+    if (hole < 0 || !copy_extent(from, to, data, hole)) return false;
+    at = hole;
+  }
+  const off_t end = lseek(from, 0, SEEK_END);
+  return end >= 0 && ftruncate(to, end) == 0;
+}
 
 snapshot_state state_of_snapshot(const restore_files &files) {
   struct stat status = {};
