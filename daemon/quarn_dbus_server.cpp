@@ -219,13 +219,25 @@ client_cb_data *make_uncounted_record(const MethodCall &call, guint32 req_id) {
   return new client_cb_data{req_id, call.sender(), nullptr};
 }
 
-/** Refuse a request that may wait where too many do. */
-bool refuse_beyond_bounds(MethodCall &call) {
-  if (may_wait(call.sender(), parties_of(call))) return false;
+void refuse_for_number(MethodCall &call, const char *which, const std::string &text) {
   if (tells_of_refusal(call.caller())) {
-    LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
+    LOGE("refused : too many requests of (%s) %s", call.sender().c_str(), which);
   }
-  call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "Too many requests are waiting");
+  call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, text);
+}
+
+/** Refuse a request that may wait where too many do. */
+bool refuse_beyond_places(MethodCall &call) {
+  if (may_wait(call.sender(), parties_of(call))) return false;
+  refuse_for_number(call, "wait", "Too many requests are waiting");
+  return true;
+}
+
+/** Refuse a request beyond what its caller may have waiting or may ask for in a minute. */
+bool refuse_beyond_bounds(MethodCall &call) {
+  if (refuse_beyond_places(call)) return true;
+  if (count_request(call.caller())) return false;
+  refuse_for_number(call, "within a minute", "Too many requests within a minute");
   return true;
 }
 
@@ -416,7 +428,7 @@ bool must_wait(const MethodCall &call, GVariant *parameters) {
 /** @return false when the call was refused or is not wanted any more, and is answered */
 bool wait_for_turn(MethodCall &call) {
   cancel_quarn_terminate();
-  if (refuse_beyond_bounds(call)) return false;
+  if (refuse_beyond_places(call)) return false;
   const auto counted = count_waiting(call.sender(), parties_of(call));
   const LoopPtr loop(new_wait_loop());
   waits_for_turn.push_back(loop.get());

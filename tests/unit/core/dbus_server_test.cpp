@@ -386,6 +386,35 @@ TEST_F(Callers, RootIsServedWhoeverElseHasFilledTheirPlaces) {
   EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaiting - kMaxWaitingOfOthers);
 }
 
+gint64 minute_clock = 0;
+
+TEST_F(Callers, AnApplicationMayAskSoOftenInAMinuteAndOthersAsEver) {
+  minute_clock = g_get_monotonic_time();
+  set_refusal_clock([] { return minute_clock; });
+  const auto ask = [this](const quarn_caller &caller) {
+    told_ = caller;
+    ScriptedClient connection;
+    return connection.call("app_data_backup_start", "('" + caller.label + "', uint32 1)");
+  };
+  for (unsigned int i = 0; i < kMostRequestsOfPeriod; ++i) {
+    ASSERT_EQ(ask(application("org.example.a")).reply, "(0,)") << i;
+  }
+  steps.clear();
+  captured_log().clear();
+  const CallOutcome beyond = ask(application("org.example.a"));
+  EXPECT_EQ(beyond.error_name, kTooMany);
+  EXPECT_EQ(beyond.error_text, "Too many requests within a minute");
+  EXPECT_EQ(steps, Texts{"cancel"}) << "nothing is made of it";
+  EXPECT_EQ(ask(application("org.example.b")).reply, "(0,)");
+  const quarn_caller member{true, kMember, {kGroup}, "User"};
+  for (unsigned int i = 0; i <= kMostRequestsOfPeriod; ++i) {
+    ASSERT_EQ(ask(member).reply, "(0,)") << i;
+  }
+  minute_clock += kRequestPeriod;
+  EXPECT_EQ(ask(application("org.example.a")).reply, "(0,)");
+  set_refusal_clock(nullptr);
+}
+
 TEST_F(Callers, ListsAndNamesAreBoundedBeforeARecordIsMade) {
   told_ = {true, 0, {}, ""};
   const auto list = [](std::size_t packages) {
