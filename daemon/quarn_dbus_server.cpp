@@ -359,7 +359,11 @@ void on_make_app_data(MethodCall &call, GVariant *parameters) {
   }
   if (refuse_beyond_bounds(call)) return;
   const auto counted = count_waiting(call.sender(), parties_of(call));
-  call.reply_int(quarnd_make_app_data(pkg_id, call.caller().uid));
+  const quarn_caller &caller = call.caller();
+  const bool trusted =
+      caller.uid == 0 || kind_of_caller(caller, client_group()) == caller_kind::trusted;
+  // All applications have one user, and what an application asks for is for it alone.
+  call.reply_int(quarnd_make_app_data(pkg_id, caller.uid, trusted ? "" : caller.label));
 }
 
 /** The one dispatcher; @p given is null when the call has no arguments. */

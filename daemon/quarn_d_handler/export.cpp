@@ -9,6 +9,7 @@
 #include <system_error>
 #include <thread>
 
+#include "platform_smack.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/export_turn.h"
 #include "quarn_d_handler/quarn_d_handler.h"
@@ -16,6 +17,7 @@
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/own_place.h"
 #include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 
@@ -44,12 +46,30 @@ class StagingDir {
   std::string path_;
 };
 
+/** Who the archive is for. */
+struct export_client {
+  uid_t uid;
+  std::string label;
+};
+
+/** Set the client's label where it has one: those who share its user are not to read the data. */
+bool label_for(const export_client &client, int file) {
+  if (client.label.empty()) return true;
+  if (smack_setlabel(own_fd_path(file).c_str(), client.label.c_str(), SMACK_LABEL_ACCESS) == 0) {
+    return true;
+  }
+  LOGE("smack_setlabel failed for the export of (%s)", client.label.c_str());
+  return false;
+}
+
 /**
  * Give the archive to the client under its public name, whatever lies there.
  * @param file the archive, as it was made
  */
-bool hand_over(int file, const std::string &archive, const std::string &target, uid_t client_uid) {
-  return fchmod(file, kExportMode) == 0 && fchown(file, client_uid, static_cast<gid_t>(-1)) == 0 &&
+bool hand_over(int file, const std::string &archive, const std::string &target,
+               const export_client &client) {
+  return label_for(client, file) && fchmod(file, kExportMode) == 0 &&
+         fchown(file, client.uid, static_cast<gid_t>(-1)) == 0 &&
          move_to_own_place(archive, target);
 }
 
@@ -107,8 +127,8 @@ int pack(const std::string &pkg_id, const std::string &root, const std::string &
 
 /** Everything between an earlier export's removal and the answer. */
 int export_package(const std::string &pkg_id, const std::string &root, const std::string &target,
-                   unsigned int client_uid) {
-  ExportTurn turn(std::to_string(client_uid) + " " + pkg_id);
+                   const export_client &client) {
+  ExportTurn turn(std::to_string(client.uid) + " " + pkg_id);
   if (!turn.wait()) return QUARN_CANCELLED;
   const StagingDir staging;
   if (staging.path().empty()) return QUARN_UNREADABLE;
@@ -117,7 +137,7 @@ int export_package(const std::string &pkg_id, const std::string &root, const std
   const int result = pack(pkg_id, root, archive, &turn, &made);
   // one that lacks a file is told to be such, and is the client's as well
   const bool whole = result == QUARN_OK || result == QUARN_REFUSED;
-  if (made && whole && !hand_over(made.get(), archive, target, client_uid)) {
+  if (made && whole && !hand_over(made.get(), archive, target, client)) {
     LOGE("fail to hand over %s : %d", target.c_str(), errno);
     return QUARN_UNREADABLE;
   }
@@ -126,7 +146,8 @@ int export_package(const std::string &pkg_id, const std::string &root, const std
 
 }  // namespace
 
-int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid,
+                         const std::string &client_label) {
   if (pkg_id == nullptr || !is_safe_path_component(pkg_id)) {
     LOGE("cannot get root path info of (%s)...", pkg_id == nullptr ? "" : pkg_id);
     return QUARN_REFUSED;
@@ -140,7 +161,7 @@ int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
   }
   reset_backup_path_info();
   request_power_lock(true);  // the daemon is not idle before that has ended
-  const int zip_result = export_package(pkg_id, root, target, client_uid);
+  const int zip_result = export_package(pkg_id, root, target, {client_uid, client_label});
   request_power_lock(false);
   LOGI("quarnd_make_app_data zip_result = %d", zip_result);
   return zip_result;

@@ -115,8 +115,10 @@ int quarnd_backup_app_data(const char *pkg_id, void *record) {
 int quarnd_restore_app_data(const char *pkg_id, void *record) {
   return note(std::string("restore_app_data ") + pkg_id + " " + take(record));
 }
-int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
-  return note(std::string("make_app_data ") + pkg_id + " " + number(client_uid));
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid,
+                         const std::string &client_label) {
+  return note(std::string("make_app_data ") + pkg_id + " " + number(client_uid) +
+              (client_label.empty() ? "" : " " + client_label));
 }
 int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
                           void *record) {
@@ -253,7 +255,8 @@ TEST_F(Callers, AnApplicationAsksForItsOwnPackageAndNoOther) {
     EXPECT_EQ(steps, Texts{"cancel"});
   }
   EXPECT_EQ(client_->call("make_app_data", "('org.example.notes',)").reply, "(0,)");
-  EXPECT_EQ(steps.back(), "make_app_data org.example.notes 5000") << "and the archive is its own";
+  EXPECT_EQ(steps.back(), "make_app_data org.example.notes 5000 org.example.notes")
+      << "and the archive is its own";
   const CallOutcome refused = client_->call("make_app_data", "('org.example.other',)");
   EXPECT_EQ(refused.error_name, kDenied);
   EXPECT_EQ(refused.error_text,
@@ -384,6 +387,20 @@ TEST_F(Callers, RootIsServedWhoeverElseHasFilledTheirPlaces) {
   EXPECT_EQ(askers.waiting(), kMaxWaitingOfOthers);
   told_ = {true, 0, {}, ""};
   EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaiting - kMaxWaitingOfOthers);
+}
+
+TEST_F(Callers, AnApplicationsExportIsForItsLabelAlone) {
+  const auto exported_for = [this](const quarn_caller &caller) {
+    told_ = caller;
+    steps.clear();
+    ScriptedClient connection;
+    EXPECT_EQ(connection.call("make_app_data", "('org.example.a',)").reply, "(0,)");
+    return steps.back();
+  };
+  EXPECT_EQ(exported_for(application("org.example.a")),
+            "make_app_data org.example.a 5000 org.example.a");
+  EXPECT_EQ(exported_for({true, kMember, {kGroup}, "User"}), "make_app_data org.example.a 7001");
+  EXPECT_EQ(exported_for({true, 0, {}, "System"}), "make_app_data org.example.a 0");
 }
 
 gint64 minute_clock = 0;

@@ -18,6 +18,7 @@
 
 using ::testing::_;
 using ::testing::Return;
+using ::testing::StrEq;
 
 namespace {
 
@@ -572,6 +573,28 @@ TEST_F(ExportTest, PacksThePackageForTheClientAlone) {
   EXPECT_TRUE(outside.answers.empty());
   EXPECT_TRUE(uploads.empty());
   EXPECT_EQ(staging_directories(), before);
+}
+
+TEST_F(ExportTest, AnApplicationsHasItsLabelBeforeAnybodyCanReachIt) {
+  bool reachable = true;
+  EXPECT_CALL(platform, smack_setlabel(_, StrEq(kPkg), SMACK_LABEL_ACCESS))
+      .WillOnce([&](const char *path, const char *, enum smack_label_type) {
+        struct stat status = {};
+        EXPECT_EQ(stat(path, &status), 0);
+        EXPECT_EQ(status.st_uid, 0U);
+        reachable = exists(kTarget);
+        return 0;
+      });
+  EXPECT_EQ(quarnd_make_app_data(kPkg, kClient, kPkg), 0);
+  EXPECT_FALSE(reachable);
+  expect_exported();
+}
+
+TEST_F(ExportTest, OneThatCannotBeLabelledIsNotHandedOver) {
+  ON_CALL(platform, smack_setlabel).WillByDefault(Return(-1));
+  EXPECT_EQ(quarnd_make_app_data(kPkg, kClient, kPkg), 31);
+  expect_error("smack_setlabel failed for the export of (org.example.notes)");
+  EXPECT_FALSE(exists(kTarget));
 }
 
 TEST_F(ExportTest, ASecondExportReplacesTheFirst) {
