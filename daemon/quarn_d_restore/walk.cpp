@@ -1,6 +1,7 @@
 #include <fcntl.h>
 
 #include <cerrno>
+#include <cstring>
 #include <utility>
 
 #include "platform_security_server.h"
@@ -11,6 +12,7 @@
 #include "quarn_d_restore/settle.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/held_folder.h"
+#include "quarn_d_utils/log_budget.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/table_text.h"
@@ -31,6 +33,7 @@ struct walk_context {
   const char *root;
   json_object *table;
   restore_files files;
+  LogBudget *unknown; /**< lines about what the table does not know */
 };
 
 /** A directory of the walk, which follows: its name, and what was looked at. */
@@ -51,6 +54,12 @@ bool restore_object(const walk_context &ctx, int dir, int object, const struct s
   return restore_object_info(object, status, path.c_str(), ctx.pkgid, ctx.root, ctx.table) != 0;
 }
 
+/** False for what the table does not know when enough of that kind has been told. */
+bool is_worth_a_line(const walk_context &ctx, const std::string &path) {
+  const char *key = path.c_str() + std::strlen(ctx.root) + 1;
+  return json_object_object_get_ex(ctx.table, key, nullptr) != FALSE || ctx.unknown->take();
+}
+
 bool is_empty_folder(const std::string &path) {
   const ActAsRoot root;
   return is_empty_directory(path.c_str());
@@ -66,8 +75,12 @@ int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, cons
     return vanished ? 1 : 0;
   }
   if (S_ISLNK(status.st_mode)) return 1;
+  if (S_ISDIR(status.st_mode)) found->emplace_back(entry.name, status);
+  const bool restorable = S_ISDIR(status.st_mode) || S_ISREG(status.st_mode);
+  if (restorable && !is_worth_a_line(ctx, path)) {
+    return S_ISDIR(status.st_mode) && is_empty_folder(path) ? 1 : 0;
+  }
   if (S_ISDIR(status.st_mode)) {
-    found->emplace_back(entry.name, status);
     if (restore_object(ctx, dir, object.get(), status, path)) return 1;
     if (is_empty_folder(path)) {
       LOGI("it is empty folder : %s", path.c_str());
@@ -354,7 +367,8 @@ void settle_unpacked_files(const char *pkgid, const char *root) {
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table) {
   const HeldFolder package(root);
-  const walk_context ctx{pkgid, root, table, restore_files(pkgid, root)};
+  LogBudget unknown(dir);
+  const walk_context ctx{pkgid, root, table, restore_files(pkgid, root), &unknown};
   return walk_directory(ctx, dir);
 }
 
