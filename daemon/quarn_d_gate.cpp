@@ -6,6 +6,7 @@
 
 #include <cstdlib>
 #include <deque>
+#include <iterator>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -54,6 +55,14 @@ struct refusals {
 std::mutex &refusals_mutex = *new std::mutex;
 std::map<std::string, refusals> &refused_callers = *new std::map<std::string, refusals>;
 gint64 (*refusal_clock)() = g_get_monotonic_time;
+
+/** What one application has asked for since a moment. Main thread. */
+struct accepted_requests {
+  gint64 since = 0;
+  unsigned int count = 0;
+};
+std::map<std::string, accepted_requests> &asking_callers =
+    *new std::map<std::string, accepted_requests>;
 
 /** The same for all connections of a caller, and no other's: nobody hides what others do. */
 std::string name_of_caller(const quarn_caller &caller) {
@@ -339,11 +348,26 @@ bool tells_of_refusal(const quarn_caller &caller) {
   return ++of.count <= kMostRefusalLines;
 }
 
+bool count_request(const quarn_caller &caller) {
+  if (caller.uid == 0 || kind_of_caller(caller, client_group()) == caller_kind::trusted)
+    return true;
+  const gint64 now = refusal_clock();
+  for (auto at = asking_callers.begin(); at != asking_callers.end();) {
+    at = at->second.since <= now - kRequestPeriod ? asking_callers.erase(at) : std::next(at);
+  }
+  accepted_requests &of =
+      asking_callers.try_emplace(name_of_caller(caller), accepted_requests{now, 0}).first->second;
+  if (of.count >= kMostRequestsOfPeriod) return false;
+  ++of.count;
+  return true;
+}
+
 void forget_callers() {
   {
     const std::lock_guard<std::mutex> lock(refusals_mutex);
     end_refusals(G_MAXINT64);
   }
+  asking_callers.clear();
   while (!entries.empty()) drop(std::string(entries.begin()->first));
 }
 

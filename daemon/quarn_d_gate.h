@@ -72,6 +72,19 @@ inline constexpr gint64 kRefusalPeriod = 60'000'000;
  */
 bool tells_of_refusal(const quarn_caller &caller);
 
+/** Requests of one application, over all its connections, that are accepted within kRequestPeriod.
+ */
+inline constexpr unsigned int kMostRequestsOfPeriod = 120;
+/** Microseconds. */
+inline constexpr gint64 kRequestPeriod = 60'000'000;
+
+/**
+ * Count a request that is about to be accepted. Each costs lines of the log, writes and transfers,
+ * of which an application may bring about so many and no more; who is trusted is not counted.
+ * @return false when it is one too many
+ */
+bool count_request(const quarn_caller &caller);
+
 /** Forget everything; for a connection that is left. */
 void forget_callers();
 
@@ -79,7 +92,8 @@ void forget_callers();
 using caller_source = std::function<void(const std::string &sender, caller_work answer)>;
 /** @param source null: the bus */
 void set_caller_source(caller_source source);
-/** @param clock microseconds that only grow; null: the system's. For tests. */
+/** @param clock microseconds that only grow; null: the system's, of refusals and requests. For
+ * tests. */
 void set_refusal_clock(gint64 (*clock)());
 /** The group that counts instead of the system's; for tests. */
 void set_client_group(gid_t group);

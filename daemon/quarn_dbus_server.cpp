@@ -198,12 +198,16 @@ class RawCall : public MethodCall {
   GDBusMessage *message_;
 };
 
-/** Whose bounds a call counts against, beside its connection's: one caller may have many. */
+/**
+ * Whose bounds a call counts against, beside its connection's, of which one caller may have many.
+ * Applications are one user, and callers by their labels.
+ */
 waiting_parties parties_of(const MethodCall &call) {
   const quarn_caller &caller = call.caller();
   if (!caller.known || caller.uid == 0) return {};
-  return {"user " + std::to_string(caller.uid),
-          caller.label.empty() ? "" : "label " + caller.label};
+  const std::string user = "user " + std::to_string(caller.uid);
+  if (caller.uid != kAppUid) return {user, false};
+  return {user + ", label " + caller.label, true};
 }
 
 client_cb_data *make_record(const MethodCall &call, guint32 req_id) {
@@ -215,13 +219,25 @@ client_cb_data *make_uncounted_record(const MethodCall &call, guint32 req_id) {
   return new client_cb_data{req_id, call.sender(), nullptr};
 }
 
-/** Refuse a request that may wait where too many do. */
-bool refuse_beyond_bounds(MethodCall &call) {
-  if (may_wait(call.sender(), parties_of(call))) return false;
+void refuse_for_number(MethodCall &call, const char *which, const std::string &text) {
   if (tells_of_refusal(call.caller())) {
-    LOGE("refused : too many requests of (%s) wait", call.sender().c_str());
+    LOGE("refused : too many requests of (%s) %s", call.sender().c_str(), which);
   }
-  call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, "Too many requests are waiting");
+  call.refuse(G_DBUS_ERROR_LIMITS_EXCEEDED, text);
+}
+
+/** Refuse a request that may wait where too many do. */
+bool refuse_beyond_places(MethodCall &call) {
+  if (may_wait(call.sender(), parties_of(call))) return false;
+  refuse_for_number(call, "wait", "Too many requests are waiting");
+  return true;
+}
+
+/** Refuse a request beyond what its caller may have waiting or may ask for in a minute. */
+bool refuse_beyond_bounds(MethodCall &call) {
+  if (refuse_beyond_places(call)) return true;
+  if (count_request(call.caller())) return false;
+  refuse_for_number(call, "within a minute", "Too many requests within a minute");
   return true;
 }
 
@@ -343,7 +359,11 @@ void on_make_app_data(MethodCall &call, GVariant *parameters) {
   }
   if (refuse_beyond_bounds(call)) return;
   const auto counted = count_waiting(call.sender(), parties_of(call));
-  call.reply_int(quarnd_make_app_data(pkg_id, call.caller().uid));
+  const quarn_caller &caller = call.caller();
+  const bool trusted =
+      caller.uid == 0 || kind_of_caller(caller, client_group()) == caller_kind::trusted;
+  // All applications have one user, and what an application asks for is for it alone.
+  call.reply_int(quarnd_make_app_data(pkg_id, caller.uid, trusted ? "" : caller.label));
 }
 
 /** The one dispatcher; @p given is null when the call has no arguments. */
@@ -412,7 +432,7 @@ bool must_wait(const MethodCall &call, GVariant *parameters) {
 /** @return false when the call was refused or is not wanted any more, and is answered */
 bool wait_for_turn(MethodCall &call) {
   cancel_quarn_terminate();
-  if (refuse_beyond_bounds(call)) return false;
+  if (refuse_beyond_places(call)) return false;
   const auto counted = count_waiting(call.sender(), parties_of(call));
   const LoopPtr loop(new_wait_loop());
   waits_for_turn.push_back(loop.get());

@@ -31,10 +31,13 @@ int quarnd_restore_app_data(const char *pkg_id, void *record);
  * Pack one package's data as /tmp/PKGID_tmp.zip, mode 0600, in place of an earlier one; waits in
  * a nested loop for the thread that packs.
  * @param client_uid user that shall own the archive
+ * @param client_label security label that it gets, for a user that is many callers; empty: the
+ *        daemon's own
  * @return 0, 36 without a root path, 17 when the daemon ends, or what packing gave; with 36 the
  *         archive is there too, and lacks what could not be packed
  */
-int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid);
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid,
+                         const std::string &client_label = "");
 
 /** Restore mode of the phone-transfer companion is active. */
 extern char pellix_restore_running;

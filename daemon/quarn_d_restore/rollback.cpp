@@ -20,7 +20,6 @@ namespace {
 constexpr mode_t kPermissionBits = 07777;
 constexpr mode_t kCopyMode = 0600;
 constexpr mode_t kFolderMode = 0755;
-constexpr std::size_t kCopyChunk = 64 << 10;
 /** Where an earlier release set aside what no snapshot holds. */
 constexpr char kKept[] = "/kept";
 
@@ -410,14 +409,7 @@ class MovingBack {
     const UniqueFd source = safe_open_file_at(from, name, &status);
     unlink_as_package(to, name, 0, user_);
     UniqueFd copy = open_as_package(to, name, O_WRONLY | O_CREAT, kCopyMode, user_, nullptr);
-    bool copied = source && copy;
-    std::vector<char> chunk(kCopyChunk);
-    while (copied) {
-      const ssize_t count = TEMP_FAILURE_RETRY(read(source.get(), chunk.data(), chunk.size()));
-      if (count == 0) break;
-      copied =
-          count > 0 && write(copy.get(), chunk.data(), static_cast<std::size_t>(count)) == count;
-    }
+    const bool copied = source && copy && copy_bytes(source.get(), copy.get(), status.st_size);
     const std::string key = path_.substr(files_.snapshot.size() + 1);
     json_object *entry = entry_of(table_, key);
     if (copied && entry != nullptr && fstat(copy.get(), &status) == 0) {

@@ -156,28 +156,6 @@ bool copy_data(int from, int to, off_t at, off_t end) {
 }
 
 /**
- * Copy a file as long as it is by now, whose size may have changed since it was @p size. What grows
- * meanwhile grows for ever, if its application likes.
- */
-bool copy_bytes(int from, int to, off_t size) {
-  struct stat now = {};
-  off_t copied = 0;
-  if (size <= static_cast<off_t>(kSmallFile)) {
-    // small ones through memory, which costs less than a set-up
-    char buffer[kSmallFile];
-    const ssize_t count = read(from, buffer, sizeof(buffer));
-    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
-    if (count == size) return true;
-    copied = count;
-  }
-  if (fstat(from, &now) != 0) return false;
-  const off_t end = now.st_size;
-  if (!copy_data(from, to, copied, end) || fstat(from, &now) != 0) return false;
-  // its last hole, or what it has lost meanwhile
-  return ftruncate(to, std::min(end, now.st_size)) == 0;
-}
-
-/**
  * What a walk has found under one name: a file that is open for reading, where that is allowed,
  * or a descriptor that tells what else it is.
  */
@@ -420,6 +398,24 @@ class SnapshotCopy {
 };
 
 }  // namespace
+
+bool copy_bytes(int from, int to, off_t size) {
+  struct stat now = {};
+  off_t copied = 0;
+  if (size <= static_cast<off_t>(kSmallFile)) {
+    // small ones through memory, which costs less than a set-up
+    char buffer[kSmallFile];
+    const ssize_t count = read(from, buffer, sizeof(buffer));
+    if (count < 0 || write(to, buffer, static_cast<std::size_t>(count)) != count) return false;
+    if (count == size) return true;
+    copied = count;
+  }
+  if (fstat(from, &now) != 0) return false;
+  const off_t end = now.st_size;
+  if (!copy_data(from, to, copied, end) || fstat(from, &now) != 0) return false;
+  // its last hole, or what it has lost meanwhile
+  return ftruncate(to, std::min(end, now.st_size)) == 0;
+}
 
 snapshot_state state_of_snapshot(const restore_files &files) {
   struct stat status = {};

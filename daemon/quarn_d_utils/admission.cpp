@@ -13,25 +13,11 @@ struct waiting_table {
   std::size_t count = 0;
   /** By caller, the numbers of the fibers; 0 for a request that came without one. */
   std::map<std::string, std::multiset<std::uint64_t>> callers;
-  std::map<std::string, std::size_t> users;
-  std::map<std::string, std::size_t> labels;
+  /** Of all but root, over all connections of a caller. */
+  std::map<std::string, std::size_t> parties;
+  std::size_t others = 0;
+  std::size_t applications = 0;
 };
-
-using counts = std::map<std::string, std::size_t>;
-
-void count_up(counts &of, const std::string &party) {
-  if (!party.empty()) ++of[party];
-}
-
-void count_down(counts &of, const std::string &party) {
-  const auto entry = of.find(party);
-  if (entry != of.end() && --entry->second == 0) of.erase(entry);
-}
-
-bool is_below(const counts &of, const std::string &party, std::size_t bound) {
-  const auto entry = of.find(party);
-  return entry == of.end() || entry->second < bound;
-}
 
 waiting_table &table() {
   // never destroyed: the worker may outlive main()
@@ -45,18 +31,23 @@ class counted_request {
       : caller_(caller), parties_(parties), fiber_(fiber_id(current_fiber())) {
     const std::lock_guard<std::mutex> lock(table().mutex);
     table().callers[caller_].insert(fiber_);
-    count_up(table().users, parties_.user);
-    count_up(table().labels, parties_.label);
     ++table().count;
+    if (parties_.caller.empty()) return;
+    ++table().parties[parties_.caller];
+    ++table().others;
+    if (parties_.is_application) ++table().applications;
   }
   ~counted_request() {
     const std::lock_guard<std::mutex> lock(table().mutex);
     const auto entry = table().callers.find(caller_);
     entry->second.erase(entry->second.find(fiber_));
     if (entry->second.empty()) table().callers.erase(entry);
-    count_down(table().users, parties_.user);
-    count_down(table().labels, parties_.label);
     --table().count;
+    if (parties_.caller.empty()) return;
+    const auto party = table().parties.find(parties_.caller);
+    if (--party->second == 0) table().parties.erase(party);
+    --table().others;
+    if (parties_.is_application) --table().applications;
   }
   counted_request(const counted_request &) = delete;
   counted_request &operator=(const counted_request &) = delete;
@@ -73,9 +64,12 @@ bool may_wait(const std::string &caller, const waiting_parties &parties) {
   const std::lock_guard<std::mutex> lock(table().mutex);
   const auto entry = table().callers.find(caller);
   const std::size_t own = entry == table().callers.end() ? 0 : entry->second.size();
-  return own < kMaxWaitingOfCaller && table().count < kMaxWaiting &&
-         is_below(table().users, parties.user, kMaxWaitingOfUser) &&
-         is_below(table().labels, parties.label, kMaxWaitingOfLabel);
+  if (own >= kMaxWaitingOfCaller || table().count >= kMaxWaiting) return false;
+  if (parties.caller.empty()) return true;
+  const auto party = table().parties.find(parties.caller);
+  const std::size_t of_party = party == table().parties.end() ? 0 : party->second;
+  return of_party < kMaxWaitingOfCaller && table().others < kMaxWaitingOfOthers &&
+         (!parties.is_application || table().applications < kMaxWaitingOfApplications);
 }
 
 std::shared_ptr<const void> count_waiting(const std::string &caller,

@@ -13,17 +13,20 @@
 #include <string>
 #include <vector>
 
+/** Of one connection, and of one caller but root over all its connections. */
 inline constexpr std::size_t kMaxWaitingOfCaller = 64;
 inline constexpr std::size_t kMaxWaiting = 512;
-/** Of one user other than root over all its connections: half of all stays for others. */
-inline constexpr std::size_t kMaxWaitingOfUser = 256;
-/** Of one application, which a security label names, over all its connections. */
-inline constexpr std::size_t kMaxWaitingOfLabel = 64;
+/** Of all applications together, which are one user: the rest stays for the users that are trusted.
+ */
+inline constexpr std::size_t kMaxWaitingOfApplications = 256;
+/** Of all but root: what one caller may have stays for it, whoever else asks. */
+inline constexpr std::size_t kMaxWaitingOfOthers = kMaxWaiting - kMaxWaitingOfCaller;
 
-/** Whose requests a connection's are besides; empty: nobody's that is bounded. */
+/** Whose requests a connection's are besides. */
 struct waiting_parties {
-  std::string user;
-  std::string label;
+  std::string
+      caller; /**< the same for all its connections; empty: root, whose are as many callers */
+  bool is_application = false;
 };
 
 /** True when another request of @p caller, a unique bus name, may be accepted. Any thread. */

@@ -282,6 +282,55 @@ class TooMuch(Attack):
             self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
 
 
+#: Bytes that the unit leaves the daemon for its data and its threads' stacks.
+UNITS_LIMIT = 512 << 20
+
+
+class Exports(Attack):
+    """Nothing bounds an export: who asks for many at once, or for a large one, asks for much."""
+
+    def ask(self, client, count, package=NOTES):
+        return [client.start("make_app_data", GLib.Variant("(s)", (package,)))
+                for _ in range(count)]
+
+    def test_of_many_callers_at_once_do_not_end_the_daemon(self):
+        clients = [self.new_client() for _ in range(4)]
+        clients[0].call("last_bu_time")
+        daemon = self.device.daemon_pid()
+        if not self.is_sanitized():
+            subprocess.run(["prlimit", "--pid", str(daemon), "--data=%d" % UNITS_LIMIT], check=True)
+        calls = [call for client in clients for call in self.ask(client, 64)]
+        clients[0].until(lambda: all(call.done for call in calls), "the exports", deadline=300)
+        self.assertEqual({(call.reply, call.error) for call in calls}, {((0,), None)})
+        self.assertEqual(self.device.daemon_pid(), daemon)
+        if not self.is_sanitized():
+            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+
+    def test_that_are_withdrawn_hold_up_nobody_while_another_is_made(self):
+        with open(self.device.app_path(NOTES, "data/hole"), "wb") as file:
+            os.chown(file.fileno(), APPLICATION, APPLICATION)
+            file.truncate(16 << 30)
+        first, second, honest = (self.new_client() for _ in range(3))
+        large = self.ask(first, 1)
+        wait_until(lambda: self.is_packing(), "it is packed")
+        waiting = self.ask(second, 8)
+        self.assertEqual(second.call("CancelOwn", path=PACKAGES, interface=INTERFACE + ".Packages"),
+                         (8,))
+        honest.call("last_bu_time")
+        second.until(lambda: all(call.done for call in waiting), "they are withdrawn")
+        self.assertEqual({call.reply for call in waiting}, {(17,)})
+        self.assertFalse(large[0].done, "what it waited for is still being made")
+        self.assertEqual(first.call("CancelOwn", path=PACKAGES, interface=INTERFACE + ".Packages"),
+                         (1,))
+        first.until(lambda: large[0].done, "it is withdrawn as well")
+        self.assertEqual(large[0].reply, (17,))
+
+    def is_packing(self):
+        return any(os.path.exists("%s/%s/export.zip" % (folder, name))
+                   for folder in [os.path.join(self.device.path, "root/tmp/quarn")]
+                   if os.path.isdir(folder) for name in os.listdir(folder))
+
+
 class NeverAnswering(Attack):
     """A client that takes its callbacks and says nothing to them."""
 

@@ -116,9 +116,11 @@ int quarnd_restore_app_data(const char *pkg_id, void *record) {
   return note(std::string("restore_app_data ") + pkg_id + " " + take(record));
 }
 std::size_t waiting_in_export = 0;
-int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid) {
+int quarnd_make_app_data(const char *pkg_id, unsigned int client_uid,
+                         const std::string &client_label) {
   waiting_in_export = waiting_requests();
-  return note(std::string("make_app_data ") + pkg_id + " " + number(client_uid));
+  return note(std::string("make_app_data ") + pkg_id + " " + number(client_uid) +
+              (client_label.empty() ? "" : " " + client_label));
 }
 int quarnd_restore_enable(int on, int client, const char *serial_num, const char *pkg_list,
                           void *record) {
@@ -255,7 +257,8 @@ TEST_F(Callers, AnApplicationAsksForItsOwnPackageAndNoOther) {
     EXPECT_EQ(steps, Texts{"cancel"});
   }
   EXPECT_EQ(client_->call("make_app_data", "('org.example.notes',)").reply, "(0,)");
-  EXPECT_EQ(steps.back(), "make_app_data org.example.notes 5000") << "and the archive is its own";
+  EXPECT_EQ(steps.back(), "make_app_data org.example.notes 5000 org.example.notes")
+      << "and the archive is its own";
   const CallOutcome refused = client_->call("make_app_data", "('org.example.other',)");
   EXPECT_EQ(refused.error_name, kDenied);
   EXPECT_EQ(refused.error_text,
@@ -326,26 +329,109 @@ TEST_F(Callers, LeavingWaitsForTheAnswerAndServesWhatHadArrived) {
   EXPECT_EQ(outcome->reply, "(0,)");
 }
 
-TEST_F(Callers, AUserAndAnApplicationAreBoundedOverAllTheirConnections) {
-  std::vector<RecordPtr> records;
-  kept_records = &records;
-  std::vector<std::unique_ptr<ScriptedClient>> clients;
-  const auto ask = [&](const std::string &label) {
-    told_ = application(label);
-    constexpr std::size_t kOfAConnection = 8;
-    if (records.size() % kOfAConnection == 0) clients.push_back(std::make_unique<ScriptedClient>());
-    return clients.back()->call("app_data_backup_start", "('" + label + "', uint32 1)").error_name;
-  };
-  for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_EQ(ask("org.example.a"), "") << i;
-  EXPECT_EQ(ask("org.example.a"), kTooMany) << "however many connections it has";
-  for (const char *label : {"org.example.b", "org.example.c", "org.example.d"}) {
-    for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_EQ(ask(label), "") << i;
+constexpr uid_t kMember = 7001;
+
+/** Callers that ask from one connection after the other, for what waits. */
+class Askers {
+ public:
+  Askers() { kept_records = &records_; }
+  ~Askers() { kept_records = nullptr; }
+  Askers(const Askers &) = delete;
+  Askers &operator=(const Askers &) = delete;
+
+  /** @return how many requests were accepted before one was refused for their number */
+  std::size_t ask(const char *method, const std::string &arguments) {
+    constexpr std::size_t kOfAConnection = 48;
+    for (std::size_t count = 0;; ++count) {
+      if (count % kOfAConnection == 0) clients_.push_back(std::make_unique<ScriptedClient>());
+      const CallOutcome outcome = clients_.back()->call(method, arguments);
+      if (outcome.error_name == kTooMany) return count;
+      EXPECT_EQ(outcome.reply, "(0,)") << outcome.error_name;
+      if (outcome.reply != "(0,)") return count;
+    }
   }
-  EXPECT_EQ(records.size(), kMaxWaitingOfUser);
-  EXPECT_EQ(ask("org.example.e"), kTooMany) << "all applications together";
+  std::size_t waiting() const { return records_.size(); }
+
+ private:
+  std::vector<RecordPtr> records_;
+  std::vector<std::unique_ptr<ScriptedClient>> clients_;
+};
+
+TEST_F(Callers, OneApplicationOrUserFillsNoMoreThanACallersPlacesWithManyConnections) {
+  Askers askers;
+  told_ = application("org.example.a");
+  EXPECT_EQ(askers.ask("app_data_backup_start", "('org.example.a', uint32 1)"),
+            kMaxWaitingOfCaller);
+  told_ = {true, kMember, {kGroup}, "User"};
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaitingOfCaller);
+  told_ = {true, kMember + 1, {kGroup}, "User"};
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaitingOfCaller)
+      << "a label that many users have bounds none of them";
+}
+
+TEST_F(Callers, RootIsServedWhoeverElseHasFilledTheirPlaces) {
+  Askers askers;
+  for (char letter = 'a'; letter <= 'd'; ++letter) {
+    const std::string package = std::string("org.example.") + letter;
+    told_ = application(package);
+    EXPECT_EQ(askers.ask("app_data_backup_start", "('" + package + "', uint32 1)"),
+              kMaxWaitingOfCaller);
+  }
+  told_ = application("org.example.e");
+  EXPECT_EQ(askers.ask("app_data_backup_start", "('org.example.e', uint32 1)"), 0U)
+      << "all applications together";
+  for (uid_t user = kMember; user < kMember + 3; ++user) {
+    told_ = {true, user, {kGroup}, ""};
+    EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaitingOfCaller);
+  }
+  told_ = {true, kMember + 3, {kGroup}, ""};
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), 0U) << "all but root together";
+  EXPECT_EQ(askers.waiting(), kMaxWaitingOfOthers);
   told_ = {true, 0, {}, ""};
-  ScriptedClient root;
-  EXPECT_EQ(root.call("manual_backup_start", "(uint32 1,)").reply, "(0,)");
+  EXPECT_EQ(askers.ask("manual_backup_start", "(uint32 1,)"), kMaxWaiting - kMaxWaitingOfOthers);
+}
+
+TEST_F(Callers, AnApplicationsExportIsForItsLabelAlone) {
+  const auto exported_for = [this](const quarn_caller &caller) {
+    told_ = caller;
+    steps.clear();
+    ScriptedClient connection;
+    EXPECT_EQ(connection.call("make_app_data", "('org.example.a',)").reply, "(0,)");
+    return steps.back();
+  };
+  EXPECT_EQ(exported_for(application("org.example.a")),
+            "make_app_data org.example.a 5000 org.example.a");
+  EXPECT_EQ(exported_for({true, kMember, {kGroup}, "User"}), "make_app_data org.example.a 7001");
+  EXPECT_EQ(exported_for({true, 0, {}, "System"}), "make_app_data org.example.a 0");
+}
+
+gint64 minute_clock = 0;
+
+TEST_F(Callers, AnApplicationMayAskSoOftenInAMinuteAndOthersAsEver) {
+  minute_clock = g_get_monotonic_time();
+  set_refusal_clock([] { return minute_clock; });
+  const auto ask = [this](const quarn_caller &caller) {
+    told_ = caller;
+    ScriptedClient connection;
+    return connection.call("app_data_backup_start", "('" + caller.label + "', uint32 1)");
+  };
+  for (unsigned int i = 0; i < kMostRequestsOfPeriod; ++i) {
+    ASSERT_EQ(ask(application("org.example.a")).reply, "(0,)") << i;
+  }
+  steps.clear();
+  captured_log().clear();
+  const CallOutcome beyond = ask(application("org.example.a"));
+  EXPECT_EQ(beyond.error_name, kTooMany);
+  EXPECT_EQ(beyond.error_text, "Too many requests within a minute");
+  EXPECT_EQ(steps, Texts{"cancel"}) << "nothing is made of it";
+  EXPECT_EQ(ask(application("org.example.b")).reply, "(0,)");
+  const quarn_caller member{true, kMember, {kGroup}, "User"};
+  for (unsigned int i = 0; i <= kMostRequestsOfPeriod; ++i) {
+    ASSERT_EQ(ask(member).reply, "(0,)") << i;
+  }
+  minute_clock += kRequestPeriod;
+  EXPECT_EQ(ask(application("org.example.a")).reply, "(0,)");
+  set_refusal_clock(nullptr);
 }
 
 TEST_F(Callers, ListsAndNamesAreBoundedBeforeARecordIsMade) {

@@ -175,24 +175,65 @@ TEST(Admission, AllTogetherHaveFiveHundredAndTwelve) {
   EXPECT_TRUE(may_wait(":1.1000"));
 }
 
-TEST(Admission, AUserAndALabelHaveTheirsOverAllConnections) {
-  std::vector<std::shared_ptr<const void>> waiting;
-  const auto take = [&waiting](const waiting_parties &parties) {
-    const std::string caller = ":1." + std::to_string(waiting.size());
-    if (!may_wait(caller, parties)) return false;
-    waiting.push_back(count_waiting(caller, parties));
+/** Requests of parties, each from a connection of its own. */
+class Waiting {
+ public:
+  bool take(const waiting_parties &parties) {
+    const std::string connection = ":1." + std::to_string(waiting_.size());
+    if (!may_wait(connection, parties)) return false;
+    waiting_.push_back(count_waiting(connection, parties));
     return true;
-  };
-  for (std::size_t i = 0; i < kMaxWaitingOfLabel; ++i) ASSERT_TRUE(take({"user", "label"})) << i;
-  EXPECT_FALSE(take({"user", "label"}));
-  EXPECT_TRUE(take({"user", "other label"}));
-  while (waiting.size() < kMaxWaitingOfUser) ASSERT_TRUE(take({"user", ""}));
-  EXPECT_FALSE(take({"user", ""}));
-  EXPECT_TRUE(take({"other user", ""}));
-  while (waiting.size() < kMaxWaiting) ASSERT_TRUE(take({}));
-  EXPECT_FALSE(take({}));
-  waiting.clear();
-  EXPECT_TRUE(take({"user", "label"})) << "all are given back";
+  }
+  /** @return how many were accepted */
+  std::size_t take_all(const waiting_parties &parties) {
+    std::size_t count = 0;
+    while (take(parties)) ++count;
+    return count;
+  }
+  std::size_t size() const { return waiting_.size(); }
+
+ private:
+  std::vector<std::shared_ptr<const void>> waiting_;
+};
+
+TEST(Admission, ACallerHasSixtyFourOverAllItsConnections) {
+  Waiting waiting;
+  EXPECT_EQ(waiting.take_all({"user", false}), kMaxWaitingOfCaller);
+  EXPECT_EQ(waiting.take_all({"application", true}), kMaxWaitingOfCaller);
+  EXPECT_EQ(waiting.take_all({"other user", false}), kMaxWaitingOfCaller);
+}
+
+TEST(Admission, ApplicationsLeavePlacesForUsersAndUsersForRoot) {
+  Waiting waiting;
+  for (int i = 0; waiting.take_all({"application " + std::to_string(i), true}) != 0; ++i) {
+  }
+  EXPECT_EQ(waiting.size(), kMaxWaitingOfApplications);
+  for (int i = 0; waiting.take_all({"user " + std::to_string(i), false}) != 0; ++i) {
+  }
+  EXPECT_EQ(waiting.size(), kMaxWaitingOfOthers);
+  EXPECT_EQ(waiting.take_all({}), kMaxWaiting - kMaxWaitingOfOthers) << "root's";
+  EXPECT_EQ(kMaxWaiting - kMaxWaitingOfOthers, kMaxWaitingOfCaller);
+}
+
+TEST(Admission, WhatRootLetsWaitLeavesTheOthersAsManyPlacesAsThereAre) {
+  Waiting waiting;
+  for (std::size_t i = 0; i < kMaxWaitingOfOthers; ++i) ASSERT_TRUE(waiting.take({})) << i;
+  EXPECT_EQ(waiting.take_all({"user", false}), kMaxWaiting - kMaxWaitingOfOthers);
+}
+
+TEST(Admission, AllPlacesAreGivenBack) {
+  {
+    Waiting waiting;
+    for (const bool is_application : {false, true}) {
+      for (int i = 0; i < 8; ++i) waiting.take_all({std::to_string(i), is_application});
+    }
+  }
+  EXPECT_EQ(waiting_requests(), 0U);
+  Waiting waiting;
+  for (int i = 0; waiting.take_all({"application " + std::to_string(i), true}) != 0; ++i) {
+  }
+  EXPECT_EQ(waiting.size(), kMaxWaitingOfApplications);
+  EXPECT_TRUE(waiting.take({"user", false}));
 }
 
 TEST(Admission, KnowsTheFibersOfACaller) {

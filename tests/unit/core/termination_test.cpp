@@ -32,7 +32,7 @@ int quarnd_manual_backup(void *) { return 0; }
 int quarnd_manual_backup_cancel(void *) { return 0; }
 int quarnd_backup_app_data(const char *, void *) { return 0; }
 int quarnd_restore_app_data(const char *, void *) { return 0; }
-int quarnd_make_app_data(const char *, unsigned int) { return 0; }
+int quarnd_make_app_data(const char *, unsigned int, const std::string &) { return 0; }
 int quarnd_restore_enable(int, int, const char *, const char *, void *) { return 0; }
 
 namespace {

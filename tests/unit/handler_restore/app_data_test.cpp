@@ -1,3 +1,4 @@
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -19,6 +20,7 @@
 
 using ::testing::_;
 using ::testing::Return;
+using ::testing::StrEq;
 
 namespace {
 
@@ -595,6 +597,28 @@ TEST_F(ExportTest, PacksThePackageForTheClientAlone) {
   EXPECT_EQ(staging_directories(), before);
 }
 
+TEST_F(ExportTest, AnApplicationsHasItsLabelBeforeAnybodyCanReachIt) {
+  bool reachable = true;
+  EXPECT_CALL(platform, smack_setlabel(_, StrEq(kPkg), SMACK_LABEL_ACCESS))
+      .WillOnce([&](const char *path, const char *, enum smack_label_type) {
+        struct stat status = {};
+        EXPECT_EQ(stat(path, &status), 0);
+        EXPECT_EQ(status.st_uid, 0U);
+        reachable = exists(kTarget);
+        return 0;
+      });
+  EXPECT_EQ(quarnd_make_app_data(kPkg, kClient, kPkg), 0);
+  EXPECT_FALSE(reachable);
+  expect_exported();
+}
+
+TEST_F(ExportTest, OneThatCannotBeLabelledIsNotHandedOver) {
+  ON_CALL(platform, smack_setlabel).WillByDefault(Return(-1));
+  EXPECT_EQ(quarnd_make_app_data(kPkg, kClient, kPkg), 31);
+  expect_error("smack_setlabel failed for the export of (org.example.notes)");
+  EXPECT_FALSE(exists(kTarget));
+}
+
 TEST_F(ExportTest, ASecondExportReplacesTheFirst) {
   EXPECT_EQ(make(), 0);
   struct stat first = {};
@@ -735,6 +759,108 @@ TEST_F(ExportTest, ASecondRequestIsServedInsideTheFirst) {
   EXPECT_EQ(inner, 0);
   expect_exported();
 }
+
+std::ptrdiff_t threads_of_process() {
+  return std::distance(std::filesystem::directory_iterator("/proc/self/task"),
+                       std::filesystem::directory_iterator());
+}
+
+TEST_F(ExportTest, AnyNumberOfThemTakesOneThreadAndAllAreAnswered) {
+  constexpr std::size_t kMany = 64;
+  hold_packing();
+  std::vector<int> results;
+  const std::ptrdiff_t before = threads_of_process();
+  for (std::size_t i = 0; i < kMany; ++i) run_on_fiber([&] { results.push_back(make()); });
+  EXPECT_LE(threads_of_process(), before + 1);
+  EXPECT_FALSE(is_idle_status());
+  go = true;
+  while (results.size() < kMany) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(results, std::vector<int>(kMany, 0));
+  expect_exported();
+  EXPECT_TRUE(is_idle_status());
+}
+
+TEST_F(ExportTest, WhoAsksAgainAndAgainIsNotServedBeforeWhoAsksOnce) {
+  hold_packing();
+  std::vector<unsigned int> served;
+  const auto ask = [&](unsigned int client) {
+    run_on_fiber([&served, client] {
+      EXPECT_EQ(quarnd_make_app_data(kPkg, client), 0);
+      served.push_back(client);
+    });
+  };
+  for (int i = 0; i < 3; ++i) ask(kClient);
+  ask(kClient + 1);
+  ask(kClient + 2);
+  go = true;
+  while (served.size() < 5) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(served,
+            (std::vector<unsigned int>{kClient, kClient + 1, kClient + 2, kClient, kClient}));
+}
+
+TEST_F(ExportTest, OneThatWaitsForAnotherIsWithdrawnAtOnce) {
+  hold_packing();
+  std::vector<int> results(3, -1);
+  std::uint64_t second = 0;
+  run_on_fiber([&] { results[0] = make(); });
+  run_on_fiber([&] {
+    second = fiber_id(current_fiber());
+    results[1] = make();
+  });
+  run_on_fiber([&] { results[2] = make(); });
+  EXPECT_TRUE(withdraw_waits(second));
+  while (results[1] == -1) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(results, (std::vector<int>{-1, 17, -1})) << "nothing of the others' is waited for";
+  go = true;
+  while (results[2] == -1) g_main_context_iteration(nullptr, TRUE);
+  EXPECT_EQ(results, (std::vector<int>{0, 17, 0}));
+}
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)  // they map more themselves
+/** Takes what room for threads there is, until it goes. */
+class NoThreads {
+ public:
+  NoThreads() {
+    threads_.reserve(kMost);
+    EXPECT_EQ(getrlimit(RLIMIT_DATA, &before_), 0);
+    const rlimit none{4096, before_.rlim_max};  // for the kernel 0 is no bound
+    EXPECT_EQ(setrlimit(RLIMIT_DATA, &none), 0);
+    hold_.lock();
+    try {
+      // The library keeps the room of threads that have ended.
+      while (threads_.size() < kMost) {
+        threads_.emplace_back([this] { const std::lock_guard<std::mutex> held(hold_); });
+      }
+    } catch (const std::system_error &) {
+    }
+    EXPECT_LT(threads_.size(), kMost);
+  }
+  ~NoThreads() {
+    setrlimit(RLIMIT_DATA, &before_);
+    hold_.unlock();
+    for (std::thread &thread : threads_) thread.join();
+  }
+  NoThreads(const NoThreads &) = delete;
+  NoThreads &operator=(const NoThreads &) = delete;
+
+ private:
+  static constexpr std::size_t kMost = 64;
+  rlimit before_{};
+  std::mutex hold_;
+  std::vector<std::thread> threads_;
+};
+
+TEST_F(ExportTest, WithoutAThreadToPackInItFailsAndTheNextIsMade) {
+  {
+    const NoThreads taken;
+    EXPECT_EQ(make(), 42);
+  }
+  expect_error("no thread to pack (org.example.notes) in : Resource temporarily unavailable");
+  EXPECT_TRUE(is_idle_status());
+  EXPECT_EQ(make(), 0);
+  expect_exported();
+}
+#endif
 
 TEST_F(ExportTest, TheDaemonIsNotIdleWhileAPackageIsPacked) {
   bool idle = true;

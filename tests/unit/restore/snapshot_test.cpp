@@ -406,6 +406,61 @@ TEST_F(SnapshotTest, AFileThatCannotBeCopiedBackIsTakenOutOfTheSnapshot) {
   EXPECT_EQ(tree(), before);
 }
 
+/** A file with something at its begin and at its end, and a hole between them. */
+void make_hole(const std::string &path, off_t size) {
+  const UniqueFd file(open(path.c_str(), O_RDWR | O_CLOEXEC));
+  ASSERT_TRUE(file);
+  ASSERT_EQ(ftruncate(file.get(), size), 0);
+  ASSERT_EQ(pwrite(file.get(), "end", 3, size), 3);
+}
+
+void expect_hole(const std::string &path, off_t size) {
+  const UniqueFd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  ASSERT_TRUE(file) << path;
+  struct stat status = {};
+  ASSERT_EQ(fstat(file.get(), &status), 0);
+  EXPECT_EQ(status.st_size, size + 3) << path;
+  EXPECT_LT(status.st_blocks * 512, 1 << 20) << path;
+  std::string text(9, '-');
+  EXPECT_EQ(pread(file.get(), text.data(), 5, 0), 5);
+  EXPECT_EQ(pread(file.get(), text.data() + 5, 4, size - 1), 4);
+  EXPECT_EQ(text, std::string("begin\0end", 9)) << path;
+}
+
+TEST_F(SnapshotTest, AHoleOfAnySizeIsNeitherCopiedNorFilled) {
+  constexpr off_t kSize = off_t{2} << 30;
+  file("data/holes", "begin");
+  make_hole(at("data/holes"), kSize);
+  file("data/nothing else", "");
+  ASSERT_EQ(truncate(at("data/nothing else").c_str(), kSize), 0);
+  ASSERT_EQ(take(), 0);
+  expect_hole(snapshot() + "/data/holes", kSize);
+  EXPECT_EQ(std::filesystem::file_size(snapshot() + "/data/nothing else"), kSize);
+  std::filesystem::remove(at("data/holes"));
+  EXPECT_EQ(put_snapshot_back(kPkg, root.c_str()), rollback_result::whole);
+  expect_hole(at("data/holes"), kSize);
+  EXPECT_EQ(std::filesystem::file_size(at("data/nothing else")), kSize);
+}
+
+TEST_F(SnapshotTest, BytesAreCopiedWhateverAFilesSizeWasAndIs) {
+  const auto copied = [this](const std::string &bytes, off_t looked_at) {
+    write_text(base + "/from", bytes);
+    write_text(base + "/to", "");
+    const UniqueFd from(open((base + "/from").c_str(), O_RDONLY | O_CLOEXEC));
+    const UniqueFd to(open((base + "/to").c_str(), O_WRONLY | O_CLOEXEC));
+    EXPECT_TRUE(copy_bytes(from.get(), to.get(), looked_at));
+    return read_text(base + "/to") == bytes;
+  };
+  const std::string large(1000000, 'l');
+  EXPECT_TRUE(copied("", 0));
+  EXPECT_TRUE(copied("small", 5));
+  EXPECT_TRUE(copied(large, 1000000));
+  EXPECT_TRUE(copied(large, 5)) << "it has grown";
+  EXPECT_TRUE(copied("small", 1000000)) << "it has become shorter";
+  EXPECT_TRUE(copied("", 1000000));
+  EXPECT_TRUE(copied("small", 70));
+}
+
 TEST_F(SnapshotTest, AFileThatCannotBePutBackIsLoggedAndKeptAndTheRestIsRestored) {
   file("data/a", "x");
   file("data/b", "y");

@@ -5,6 +5,7 @@
 #include <filesystem>
 
 #include "platform_security_server.h"
+#include "quarn_d_utils/log_budget.h"
 #include "restore_fixture.h"
 
 using ::testing::_;
@@ -193,6 +194,25 @@ TEST_F(WalkTest, AFailureDoesNotStopTheWalk) {
   for (const char *name : {"data/a", "data/b", "data/c"}) {
     expect_error("fail to restore file info : " + at(name));
   }
+}
+
+TEST_F(WalkTest, WhatTheTableDoesNotKnowIsToldAHundredTimesAndCounted) {
+  constexpr unsigned int kMany = 250;
+  for (unsigned int i = 0; i < kMany; ++i) unpacked("data/own" + std::to_string(i));
+  unpacked("data/known");
+  EXPECT_EQ(walk("data", table({{"data/known", "", 0640}}).get()), 0);
+  unsigned int told = 0;
+  for (unsigned int i = 0; i < kMany; ++i) {
+    told += count_logged(DLOG_ERROR,
+                         "fail to restore file info : " + at("data/own" + std::to_string(i)));
+  }
+  EXPECT_EQ(told, kMaxFileLines);
+  EXPECT_EQ(count_logged(DLOG_WARN, std::to_string(kMany - kMaxFileLines) + " more such lines on " +
+                                        at("data") + " are left out"),
+            1);
+  struct stat status = {};
+  ASSERT_EQ(lstat(at("data/known").c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0640U) << "the rest is restored all the same";
 }
 
 TEST_F(WalkTest, ASymbolicLinkIsLeftAsItIs) {
