@@ -13,6 +13,8 @@ namespace {
 
 constexpr char kDav[] = "DAV:";
 constexpr guint kDecimal = 10;
+// No folder of a device holds as many; what a server says beyond it is no listing.
+constexpr std::size_t kMaxEntries = 50000;
 
 bool is_element(const xmlNode *node, const char *name) {
   return node->type == XML_ELEMENT_NODE && node->ns != nullptr &&
@@ -149,14 +151,17 @@ std::string href_in(const xmlNode *parent, const char *name) {
 bool parse_multistatus(const std::string &xml, const std::string &host,
                        std::vector<DavEntry> *entries, bool *left_out) {
   const std::size_t before = entries->size();
+  bool is_too_long = false;
   *left_out = false;
   const bool whole = read_xml(
       xml, [](const xmlNode *root) { return is_element(root, "multistatus"); },
       [&](const xmlNode *node) {
-        if (is_element(node, "response") && !read_response(node, host, entries)) *left_out = true;
+        is_too_long = entries->size() - before >= kMaxEntries;
+        if (is_too_long || !is_element(node, "response")) return;
+        if (!read_response(node, host, entries)) *left_out = true;
       });
-  if (!whole) entries->resize(before);
-  return whole;
+  if (!whole || is_too_long) entries->resize(before);
+  return whole && !is_too_long;
 }
 
 std::string parse_lock_token(const std::string &xml, const std::string &owner) {
