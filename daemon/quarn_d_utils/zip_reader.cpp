@@ -9,6 +9,7 @@
 #include <utility>
 #include <vector>
 
+#include "log_scope.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/codec.h"
@@ -626,6 +627,7 @@ int unpack_entry(Unpacker *unpacker, const Archive &from, Announced *announced, 
 /** Everything of an archive that was looked at; its first entry is the current one. */
 int unpack_entries(const char *pkg_id, const char *destination, const Archive &archive,
                    unzip_report *report) {
+  const LogScope scope(std::string("the archive of ") + pkg_id);
   Unpacker unpacker(pkg_id, destination);
   Announced announced(archive.file->size());
   CString name;
