@@ -31,6 +31,7 @@ constexpr int kRaw = 1;
 constexpr const char *kDataDirs[] = {"data/", "shared/data/", "shared/trusted/"};
 
 constexpr char kNoData[] = "it does not belong to the application's data";
+constexpr char kWorkingFile[] = "it is a working file of a restore";
 
 enum class Extracted { kDone, kFolder, kRefused, kFailed };
 
@@ -263,8 +264,10 @@ class Unpacker {
     std::string path = name;
     path.pop_back();
     const char *why = path.size() + 1 != info.size_filename ? "its name holds a NUL"
-                      : is_data_place(path + "/")           ? name_refusal(path)
-                                                            : kNoData;
+                      // a folder there would keep the table out for good
+                      : path == table_            ? kWorkingFile
+                      : is_data_place(path + "/") ? name_refusal(path)
+                                                  : kNoData;
     if (why != nullptr) {
       refuse(name, why);
       return;
@@ -309,7 +312,8 @@ class Unpacker {
       }
       start = end + 1;
     }
-    if (working_.contain(destination_ + "/" + path)) return "it is a working file of a restore";
+    if (path.compare(0, table_.size() + 1, table_ + "/") == 0) return kWorkingFile;
+    if (working_.contain(destination_ + "/" + path)) return kWorkingFile;
     return nullptr;
   }
 
