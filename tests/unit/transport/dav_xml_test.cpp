@@ -370,6 +370,18 @@ TEST(DavXml, WhatIsNoLock) {
     EXPECT_FALSE(parse_lock(xml, kHost, &lock)) << xml;
 }
 
+// It is sent back in a header.
+TEST(DavXml, ATokenThatWouldEndAHeaderIsNone) {
+  for (const char *token : {"t&#13;&#10;X-Other: 1", "t&#10;x", "a b", "a&gt; &lt;b", "\xc3\xa4"}) {
+    const std::string xml =
+        lock_document("<D:activelock><D:owner>me</D:owner><D:locktoken><D:href>" +
+                      std::string(token) + "</D:href></D:locktoken></D:activelock>");
+    DavLock lock;
+    EXPECT_FALSE(parse_lock(xml, kHost, &lock)) << token;
+    EXPECT_EQ(transport::parse_lock_token(xml, "me"), "") << token;
+  }
+}
+
 std::string many(const std::string &element, std::size_t count) {
   std::string text;
   for (std::size_t i = 0; i < count; ++i) text += element;
