@@ -2,6 +2,8 @@
 #include <glib.h>
 
 #include "dav_test.h"
+#include "http.h"
+#include "ticket.h"
 
 using namespace harness;
 using front::Response;
@@ -256,6 +258,34 @@ TEST_F(Leftovers, WaitForTheNextListingWhereTheServerIsLost) {
   have(5000);
   list();
   EXPECT_LE(requests("DELETE", "/f/"), 2) << "the HTTP library itself repeats one";
+}
+
+// Each worker may ask for one, and together they would not fit the daemon.
+TEST_F(DavTest, OnlySoManyLongAnswersAreInMemoryAtATime) {
+  model.put("/f/long", std::string(3U << 20, 'x'));
+  model.put("/f/short", std::string(1U << 20, 'x'));
+  transport::HttpRequest request;
+  request.method = "GET";
+  request.user = DavModel::kUser;
+  request.password = "right";
+  const std::string base = "http://127.0.0.1:" + std::to_string(server.port()) + DavModel::kRoot;
+  const auto ask = [&](const char *path) {
+    transport::Ticket ticket;
+    request.url = base + path;
+    return transport::http_perform(ticket, request);
+  };
+  std::vector<transport::HttpAnswer> answers;
+  for (int i = 0; i < transport::kMaxLongAnswers; ++i) {
+    answers.push_back(ask("/f/long"));
+    EXPECT_TRUE(answers.back().good()) << answers.back().problem.message;
+  }
+  const transport::HttpAnswer refused = ask("/f/long");
+  EXPECT_EQ(refused.problem.message, "the server's answers are too long together");
+  EXPECT_TRUE(refused.problem.transient);
+  EXPECT_TRUE(ask("/f/short").good());
+  answers.pop_back();
+  EXPECT_TRUE(ask("/f/long").good());
+  EXPECT_TRUE(ask("/f/long").good()) << "one that nobody has any more takes no room";
 }
 
 INSTANTIATE_TEST_SUITE_P(Answers, PrunedFolder, ::testing::Values(404, 409, 201));
