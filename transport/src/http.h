@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <functional>
 #include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -25,6 +26,10 @@ constexpr std::chrono::seconds kStallTime{30};
 
 /** Answers that are kept in memory are cut off with an error beyond this. */
 constexpr std::size_t kMaxAnswerBytes = 16 * 1024 * 1024;
+/** Of longer ones so many are in memory at a time; one that comes beside them is a transient error.
+ */
+constexpr std::size_t kShortAnswerBytes = 2 * 1024 * 1024;
+constexpr int kMaxLongAnswers = 2;
 /** Of one that is no success so much is kept: it says why, and no more. */
 constexpr std::size_t kMaxErrorBytes = 64 * 1024;
 /** The same for the headers of all answers to one request. */
@@ -59,6 +64,8 @@ struct HttpAnswer {
   std::string reason;                         /**< the status in the server's words; may be empty */
   std::map<std::string, std::string> headers; /**< names in lower case */
   std::string body;
+  /** Counts a long body among those in memory, until the last copy has gone. */
+  std::shared_ptr<void> room;
   /** Why there was no complete answer; its code is set then. */
   Outcome problem;
 
