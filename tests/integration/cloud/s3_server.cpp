@@ -9,7 +9,7 @@
 
 #include <sstream>
 
-#include "http.h"
+#include "http/http.h"
 
 using namespace harness;
 

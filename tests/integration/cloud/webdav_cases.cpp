@@ -9,9 +9,9 @@
 #include <filesystem>
 #include <sstream>
 
-#include "dav_client.h"
+#include "webdav/dav_client.h"
 #include "forwarder.h"
-#include "session.h"
+#include "session/session.h"
 #include "webdav_store.h"
 
 using namespace harness;

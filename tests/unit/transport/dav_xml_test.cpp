@@ -1,7 +1,7 @@
 #include <glib.h>
 
-#include "backend_webdav.h"
 #include "harness.h"
+#include "webdav/backend_webdav.h"
 
 using namespace harness;
 using transport::DavEntry;

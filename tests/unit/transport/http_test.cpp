@@ -1,4 +1,4 @@
-#include "http.h"
+#include "http/http.h"
 
 #include <glib.h>
 

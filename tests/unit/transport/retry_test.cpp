@@ -1,4 +1,4 @@
-#include "retry.h"
+#include "core/retry.h"
 
 #include "harness.h"
 

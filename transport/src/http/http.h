@@ -1,0 +1,120 @@
+/**
+ * @file http.h
+ * @brief HTTP for the network stores: one transport thread that all requests share.
+ *
+ * libcurl is loaded with the first request. The thread ends when nothing was
+ * asked of it for a while, and takes its connections along.
+ */
+#ifndef BACKUP_TRANSPORT_HTTP_H
+#define BACKUP_TRANSPORT_HTTP_H
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "core/outcome.h"
+#include "core/retry.h"
+#include "core/ticket.h"
+
+namespace transport {
+
+/** An exchange in which nothing moves for so long is given up. */
+constexpr std::chrono::seconds kStallTime{30};
+
+/** Answers that are kept in memory are cut off with an error beyond this. */
+constexpr std::size_t kMaxAnswerBytes = 16 * 1024 * 1024;
+/** Of one that is no success so much is kept: it says why, and no more. */
+constexpr std::size_t kMaxErrorBytes = 64 * 1024;
+/** The same for the headers of all answers to one request. */
+constexpr std::size_t kMaxHeaderBytes = 256 * 1024;
+/** The same for what is only read through, where the request has no limit of its own. */
+constexpr uint64_t kMaxReadBytes = uint64_t{256} * 1024 * 1024;
+
+struct HttpRequest {
+  std::string method;
+  std::string url;
+  std::vector<std::string> headers; /**< "Name: value" */
+  std::string user;                 /**< empty: no credentials */
+  std::string password;
+  /** "provider:provider:region:service": sign with the password instead of sending it. */
+  std::string signature;
+  std::string ca_file; /**< empty: the system's authorities */
+
+  long seconds = 0; /**< for the whole exchange; 0: as long as something moves, see kStallTime */
+
+  bool has_body = false;
+  std::string body; /**< sent when body_fd is none */
+  int body_fd = -1; /**< sent from its start, body_size bytes */
+  uint64_t body_size = 0;
+
+  /** Receives the body of a 2xx answer instead of HttpAnswer::body; false: local failure. */
+  std::function<bool(const char *data, std::size_t size)> sink;
+  uint64_t sink_limit = kMaxReadBytes; /**< bytes; a longer body is an error of the server */
+};
+
+struct HttpAnswer {
+  int status = 0;                             /**< 0: there was no answer; problem tells why */
+  std::string reason;                         /**< the status in the server's words; may be empty */
+  std::map<std::string, std::string> headers; /**< names in lower case */
+  std::string body;
+  /** Why there was no complete answer; its code is set then. */
+  Outcome problem;
+
+  bool complete() const { return problem.ok(); }
+  bool good() const { return complete() && status >= 200 && status <= 299; }
+  /** "" when absent */
+  std::string header(const std::string &name) const;
+};
+
+/** Blocks until the answer is there or @p ticket is cancelled. Any thread. */
+HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request);
+
+/** Load the HTTP library ahead of the first exchange, whose error it is when that fails. */
+void prepare_http();
+
+/** Wait between two exchanges. @return false when @p ticket was cancelled before the end */
+bool http_pause(Ticket &ticket, std::chrono::milliseconds duration);
+
+/** The time by which stalls, limits and pauses are measured. */
+RetryClock::Point http_now();
+
+/** Have another clock for stalls, limits and pauses; null: the real one. */
+void set_http_clock(RetryClock *clock);
+
+/** Have the transport thread take everything that came and look at its clock before this returns.
+ */
+void wake_http();
+
+/**
+ * The outcome that an answer means for any store: transient where it is worth
+ * another attempt, with the store's Retry-After.
+ * @param what what was being done, for people
+ */
+Outcome outcome_of(const HttpAnswer &answer, const char *what);
+
+/** A path of the store, percent-encoded, slashes kept. */
+std::string encode_path(const std::string &path);
+
+/** Is @p host this machine itself? Only there may a store be reached without TLS. */
+bool is_loopback(const std::string &host);
+
+/** The parts of a network store's URL. */
+struct StoreUrl {
+  std::string base;   /**< "https://host:port/path", without a trailing slash */
+  std::string origin; /**< "https://host:port" */
+  std::string host;
+  std::string path; /**< decoded, without a trailing slash; "" at the top */
+};
+
+/**
+ * @param scheme "webdav" or "s3"
+ * @return false with @p problem; the problem is empty when the URL has another scheme
+ */
+bool parse_store_url(const std::string &url, const std::string &scheme, StoreUrl *parsed,
+                     std::string *problem);
+
+}  // namespace transport
+
+#endif
