@@ -14,7 +14,7 @@
 
 namespace transport {
 
-struct Outcome {
+struct [[nodiscard]] Outcome {
   backup_trans_error_code code = BACKUP_TRANS_ERROR_NONE;
   /** For people; holds no credentials. */
   std::string message;

@@ -8,7 +8,8 @@
 #include <chrono>
 #include <condition_variable>
 #include <functional>
-#include <mutex>
+
+#include "thread_annotations.h"
 
 namespace transport {
 
@@ -20,7 +21,7 @@ class Ticket {
  public:
   /** The request was cancelled; its worker leaves no trace and returns. */
   bool cancelled() const {
-    const std::lock_guard<std::mutex> lock(mutex_);
+    const MutexLock lock(mutex_);
     return state_ == State::cancelled;
   }
 
@@ -29,8 +30,8 @@ class Ticket {
    * after this is too late.
    * @return false when the request was cancelled before
    */
-  bool begin_commit() {
-    const std::lock_guard<std::mutex> lock(mutex_);
+  [[nodiscard]] bool begin_commit() {
+    const MutexLock lock(mutex_);
     if (state_ == State::cancelled) return false;
     state_ = State::committing;
     return true;
@@ -40,7 +41,7 @@ class Ticket {
   bool cancel() {
     std::function<void()> waker;
     {
-      const std::lock_guard<std::mutex> lock(mutex_);
+      const MutexLock lock(mutex_);
       if (state_ == State::committing) return false;
       state_ = State::cancelled;
       waker = waker_;
@@ -52,8 +53,10 @@ class Ticket {
 
   /** Wait. @return false when the request was cancelled before the end */
   bool pause(std::chrono::milliseconds duration) {
-    std::unique_lock<std::mutex> lock(mutex_);
-    return !changed_.wait_for(lock, duration, [this] { return state_ == State::cancelled; });
+    MutexLock lock(mutex_);
+    return !changed_.wait_for(lock.waiting(), duration, [this]() QUARN_REQUIRES(mutex_) {
+      return state_ == State::cancelled;
+    });
   }
 
   /**
@@ -63,17 +66,17 @@ class Ticket {
    * own what it uses.
    */
   void set_waker(std::function<void()> waker) {
-    const std::lock_guard<std::mutex> lock(mutex_);
+    const MutexLock lock(mutex_);
     waker_ = std::move(waker);
   }
 
  private:
   enum class State { running, committing, cancelled };
 
-  mutable std::mutex mutex_;
+  mutable Mutex mutex_;
   std::condition_variable changed_;
-  State state_ = State::running;
-  std::function<void()> waker_;
+  State state_ QUARN_GUARDED_BY(mutex_) = State::running;
+  std::function<void()> waker_ QUARN_GUARDED_BY(mutex_);
 };
 
 }  // namespace transport

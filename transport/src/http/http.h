@@ -17,6 +17,7 @@
 #include "core/outcome.h"
 #include "core/retry.h"
 #include "core/ticket.h"
+#include "http/answer.h"
 
 namespace transport {
 
@@ -54,20 +55,6 @@ struct HttpRequest {
   uint64_t sink_limit = kMaxReadBytes; /**< bytes; a longer body is an error of the server */
 };
 
-struct HttpAnswer {
-  int status = 0;                             /**< 0: there was no answer; problem tells why */
-  std::string reason;                         /**< the status in the server's words; may be empty */
-  std::map<std::string, std::string> headers; /**< names in lower case */
-  std::string body;
-  /** Why there was no complete answer; its code is set then. */
-  Outcome problem;
-
-  bool complete() const { return problem.ok(); }
-  bool good() const { return complete() && status >= 200 && status <= 299; }
-  /** "" when absent */
-  std::string header(const std::string &name) const;
-};
-
 /** Blocks until the answer is there or @p ticket is cancelled. Any thread. */
 HttpAnswer http_perform(Ticket &ticket, const HttpRequest &request);
 
@@ -86,34 +73,6 @@ void set_http_clock(RetryClock *clock);
 /** Have the transport thread take everything that came and look at its clock before this returns.
  */
 void wake_http();
-
-/**
- * The outcome that an answer means for any store: transient where it is worth
- * another attempt, with the store's Retry-After.
- * @param what what was being done, for people
- */
-Outcome outcome_of(const HttpAnswer &answer, const char *what);
-
-/** A path of the store, percent-encoded, slashes kept. */
-std::string encode_path(const std::string &path);
-
-/** Is @p host this machine itself? Only there may a store be reached without TLS. */
-bool is_loopback(const std::string &host);
-
-/** The parts of a network store's URL. */
-struct StoreUrl {
-  std::string base;   /**< "https://host:port/path", without a trailing slash */
-  std::string origin; /**< "https://host:port" */
-  std::string host;
-  std::string path; /**< decoded, without a trailing slash; "" at the top */
-};
-
-/**
- * @param scheme "webdav" or "s3"
- * @return false with @p problem; the problem is empty when the URL has another scheme
- */
-bool parse_store_url(const std::string &url, const std::string &scheme, StoreUrl *parsed,
-                     std::string *problem);
 
 }  // namespace transport
 

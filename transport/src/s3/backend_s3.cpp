@@ -11,6 +11,7 @@
 
 #include "core/remote_path.h"
 #include "http/http_store.h"
+#include "http/url.h"
 #include "http/xml_answer.h"
 
 namespace transport {

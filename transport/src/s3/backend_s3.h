@@ -16,7 +16,7 @@
 
 #include "core/backend.h"
 #include "core/config.h"
-#include "http/http.h"
+#include "http/url.h"
 
 namespace transport {
 

@@ -9,19 +9,19 @@ Outcome ListingPages::get(const PageWanted &wanted, RetryClock::Point now, const
                           ListPage *page) {
   unsigned changes = 0;
   {
-    const std::lock_guard<std::mutex> lock(mutex_);
+    const MutexLock lock(mutex_);
     if (take(wanted, now, page)) return success();
     changes = changes_;
   }
   const Outcome outcome = fetch(wanted.start, std::max(wanted.count, kAhead), page);
   if (!outcome.ok()) return outcome;
-  const std::lock_guard<std::mutex> lock(mutex_);
+  const MutexLock lock(mutex_);
   keep(wanted, now, changes, page);
   return outcome;
 }
 
 void ListingPages::forget() {
-  const std::lock_guard<std::mutex> lock(mutex_);
+  const MutexLock lock(mutex_);
   ++changes_;
   kept_ = {};
 }

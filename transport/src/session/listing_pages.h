@@ -13,12 +13,12 @@
 #include <chrono>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "core/backend.h"
 #include "core/retry.h"
+#include "thread_annotations.h"
 
 namespace transport {
 
@@ -45,17 +45,19 @@ class ListingPages {
   void forget();
 
  private:
-  bool take(const PageWanted &wanted, RetryClock::Point now, ListPage *page);
-  void keep(const PageWanted &wanted, RetryClock::Point now, unsigned changes, ListPage *page);
+  bool take(const PageWanted &wanted, RetryClock::Point now, ListPage *page) QUARN_REQUIRES(mutex_);
+  void keep(const PageWanted &wanted, RetryClock::Point now, unsigned changes, ListPage *page)
+      QUARN_REQUIRES(mutex_);
 
-  std::mutex mutex_;
-  unsigned changes_ = 0;  // of stores, so far
-  std::weak_ptr<Backend> store_;
-  std::string folder_;
-  int next_ = 0;                  // where kept_ begins
-  std::vector<ObjectInfo> kept_;  // in reverse, so that a page is taken from its end
-  bool more_ = false;             // the store has more than what is kept
-  RetryClock::Point read_at_;
+  Mutex mutex_;
+  unsigned changes_ QUARN_GUARDED_BY(mutex_) = 0;  // of stores, so far
+  std::weak_ptr<Backend> store_ QUARN_GUARDED_BY(mutex_);
+  std::string folder_ QUARN_GUARDED_BY(mutex_);
+  int next_ QUARN_GUARDED_BY(mutex_) = 0;  // where kept_ begins
+  /** In reverse, so that a page is taken from its end. */
+  std::vector<ObjectInfo> kept_ QUARN_GUARDED_BY(mutex_);
+  bool more_ QUARN_GUARDED_BY(mutex_) = false;  // the store has more than what is kept
+  RetryClock::Point read_at_ QUARN_GUARDED_BY(mutex_);
 };
 
 }  // namespace transport

@@ -1,7 +1,7 @@
 #include "stores/make_backend.h"
 
 #include "file/backend_file.h"
-#include "http/http.h"
+#include "http/url.h"
 #include "s3/backend_s3.h"
 #include "webdav/backend_webdav.h"
 

@@ -535,8 +535,9 @@ class WebdavBackend : public Backend {
     if (result.ok()) return result;
     if (result.code == BACKUP_TRANS_ERROR_CONFLICT)
       return explain_refusal(ticket, upload, uploaded, result);
-    // Nobody shall see a part of it once the lock is gone.
-    uploaded->place->mend(destination.lock, Next::another_attempt);
+    // Nobody shall see a part of it once the lock is gone. What cannot be mended now is looked at by
+    // the next attempt; this one ends with what was in its way.
+    static_cast<void>(uploaded->place->mend(destination.lock, Next::another_attempt));
     return result;
   }
 

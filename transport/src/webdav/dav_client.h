@@ -15,6 +15,7 @@
 #include "core/outcome.h"
 #include "core/ticket.h"
 #include "http/http_store.h"
+#include "http/url.h"
 #include "webdav/backend_webdav.h"
 
 namespace transport {
