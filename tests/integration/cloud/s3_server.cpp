@@ -10,6 +10,7 @@
 #include <sstream>
 
 #include "http/http.h"
+#include "http/url.h"
 
 using namespace harness;
 
