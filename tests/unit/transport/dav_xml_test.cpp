@@ -1,7 +1,7 @@
 #include <glib.h>
 
 #include "harness.h"
-#include "webdav/backend_webdav.h"
+#include "webdav/dav_xml.h"
 
 using namespace harness;
 using transport::DavEntry;

@@ -95,6 +95,11 @@ Outcome dav_outcome(const HttpAnswer &answer, const char *what) {
   return result;
 }
 
+Outcome of_upload(Outcome outcome) {
+  if (outcome.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) outcome.code = BACKUP_TRANS_ERROR_SERVER;
+  return outcome;
+}
+
 std::string DavClient::url_of(const std::string &path) const {
   return url_.base + encode_path(stored_path(path));
 }

@@ -16,7 +16,7 @@
 #include "core/ticket.h"
 #include "http/http_store.h"
 #include "http/url.h"
-#include "webdav/backend_webdav.h"
+#include "webdav/dav_xml.h"
 
 namespace transport {
 
@@ -56,6 +56,9 @@ std::string strong_tag(const HttpAnswer &answer);
 
 /** outcome_of(); somebody else's lock goes away by itself. */
 Outcome dav_outcome(const HttpAnswer &answer, const char *what);
+
+/** An upload cannot end with what is said of objects that are asked for. */
+Outcome of_upload(Outcome outcome);
 
 /** What lies in a folder. */
 struct DavListing {

@@ -1,12 +1,12 @@
+#include "webdav/dav_xml.h"
+
 #include <glib.h>
 
 #include <algorithm>
 #include <cstring>
-#include <optional>
 
 #include "http/http_date.h"
 #include "http/xml_answer.h"
-#include "webdav/backend_webdav.h"
 
 namespace transport {
 namespace {
