@@ -1,6 +1,5 @@
 #include "file/backend_file.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <glib.h>
 #include <sys/file.h>
@@ -9,18 +8,17 @@
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
-#include <cstring>
 #include <vector>
 
+#include "core/checksum.h"
 #include "core/remote_path.h"
+#include "file/store_folder.h"
 
 namespace transport {
 namespace {
 
 using std::chrono::milliseconds;
 
-constexpr mode_t kFolderMode = 0700;
-constexpr int kFolderFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr int kObjectFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
 constexpr std::size_t kBufferBytes = 256 * 1024;
 constexpr milliseconds kFirstLockPause{1};
@@ -28,18 +26,6 @@ constexpr milliseconds kLongestLockPause{20};
 constexpr milliseconds kLockPatience{60000};
 constexpr int64_t kMillisecondsPerSecond = 1000;
 constexpr int64_t kNanosecondsPerMillisecond = 1000000;
-
-struct DirCloser {
-  void operator()(DIR *directory) const { closedir(directory); }
-};
-using Directory = std::unique_ptr<DIR, DirCloser>;
-
-struct ChecksumFree {
-  void operator()(GChecksum *checksum) const { g_checksum_free(checksum); }
-};
-using Checksum = std::unique_ptr<GChecksum, ChecksumFree>;
-
-Checksum new_checksum() { return Checksum(g_checksum_new(G_CHECKSUM_SHA256)); }
 
 Outcome store_failure(const char *what, int error) {
   backup_trans_error_code code = BACKUP_TRANS_ERROR_SERVER;
@@ -83,127 +69,6 @@ bool set_timestamp(int fd, int64_t timestamp_ms) {
   return futimens(fd, times) == 0;
 }
 
-Directory open_directory(int fd) {
-  UniqueFd own(openat(fd, ".", kFolderFlags));
-  if (!own) return nullptr;
-  Directory directory(fdopendir(own.get()));
-  if (directory) own.release();
-  return directory;
-}
-
-enum class EntryKind { object, folder, other };
-
-EntryKind kind_of(int folder, const struct dirent &entry) {
-  if (entry.d_type == DT_REG) return EntryKind::object;
-  if (entry.d_type == DT_DIR) return EntryKind::folder;
-  if (entry.d_type != DT_UNKNOWN) return EntryKind::other;
-  struct stat status {};
-  if (fstatat(folder, entry.d_name, &status, AT_SYMLINK_NOFOLLOW) != 0) return EntryKind::other;
-  if (S_ISREG(status.st_mode)) return EntryKind::object;
-  return S_ISDIR(status.st_mode) ? EntryKind::folder : EntryKind::other;
-}
-
-bool is_dots(const char *name) {
-  return std::strcmp(name, ".") == 0 || std::strcmp(name, "..") == 0;
-}
-
-// Calls @p visit(name, kind) for what may be shown until it answers false; errno 0 at the end.
-template <typename Visit>
-bool for_each_entry(int folder, Visit visit) {
-  const Directory directory = open_directory(folder);
-  if (!directory) return false;
-  for (;;) {
-    errno = 0;
-    const struct dirent *entry = readdir(directory.get());
-    if (entry == nullptr) return errno == 0;
-    if (is_dots(entry->d_name) || is_temporary_name(entry->d_name)) continue;
-    const EntryKind kind = kind_of(folder, *entry);
-    if (kind == EntryKind::other) continue;
-    if (!visit(static_cast<const char *>(entry->d_name), kind)) return true;
-  }
-}
-
-// A folder is one only through the objects in it, as in a store that knows objects alone.
-bool holds_object(int parent, const char *name) {
-  const UniqueFd folder(openat(parent, name, kFolderFlags));
-  if (!folder) return false;
-  bool found = false;
-  for_each_entry(folder.get(), [&](const char *child, EntryKind kind) {
-    found = kind == EntryKind::object || holds_object(folder.get(), child);
-    return !found;
-  });
-  return found;
-}
-
-void remove_tree(int parent, const char *name) {
-  if (unlinkat(parent, name, 0) == 0) return;
-  {
-    const UniqueFd folder(openat(parent, name, kFolderFlags));
-    if (!folder) return;
-    const Directory directory = open_directory(folder.get());
-    if (!directory) return;
-    while (const struct dirent *entry = readdir(directory.get())) {
-      if (!is_dots(entry->d_name)) remove_tree(folder.get(), entry->d_name);
-    }
-  }
-  unlinkat(parent, name, AT_REMOVEDIR);
-}
-
-// The folders from the root to the one that holds an object.
-class FolderChain {
- public:
-  explicit FolderChain(int root) { folders_.push_back({"", UniqueFd(dup(root))}); }
-
-  // errno on failure
-  bool enter(const std::vector<std::string> &components, std::size_t count, bool create) {
-    for (std::size_t i = 0; i < count; ++i) {
-      const std::string &name = components[i];
-      UniqueFd next(openat(innermost(), name.c_str(), kFolderFlags));
-      if (!next && errno == ENOENT && create) {
-        if (mkdirat(innermost(), name.c_str(), kFolderMode) != 0 && errno != EEXIST) return false;
-        next.reset(openat(innermost(), name.c_str(), kFolderFlags));
-        if (first_new_ == 0) first_new_ = folders_.size();
-      }
-      if (!next) return false;
-      folders_.push_back({name, std::move(next)});
-    }
-    return true;
-  }
-
-  int innermost() const { return folders_.back().fd.get(); }
-
-  // Folders that hold nothing vanish, from the innermost outwards.
-  void prune() {
-    while (folders_.size() > 1) {
-      const std::string name = std::move(folders_.back().name);
-      folders_.pop_back();
-      if (unlinkat(innermost(), name.c_str(), AT_REMOVEDIR) != 0) return;
-    }
-  }
-
-  void sync() {
-    const std::size_t oldest = first_new_ == 0 ? folders_.size() : first_new_;
-    for (std::size_t i = folders_.size(); i >= oldest && i > 0; --i)
-      fsync(folders_[i - 1].fd.get());
-  }
-
- private:
-  struct Folder {
-    std::string name;
-    UniqueFd fd;
-  };
-  std::vector<Folder> folders_;
-  std::size_t first_new_ = 0;  // 0: none; the root is never new here
-};
-
-// Makes missing parents with the mode of the store's own folders.
-UniqueFd open_root(const std::string &root, bool create) {
-  UniqueFd fd(open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (fd || errno != ENOENT || !create) return fd;
-  if (g_mkdir_with_parents(root.c_str(), kFolderMode) != 0) return {};
-  return UniqueFd(open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-}
-
 class FileBackend : public Backend {
  public:
   explicit FileBackend(std::string root) : root_path_(std::move(root)) {}
@@ -217,9 +82,9 @@ class FileBackend : public Backend {
     if (!outcome.ok()) return outcome;
     if (size > target.limit()) return too_large();
     if (!target.begin()) return local_failure("cannot make a local file", errno);
-    const Checksum checksum = new_checksum();
+    Checksum checksum(G_CHECKSUM_SHA256);
     uint64_t copied = 0;
-    outcome = copy(attempt.ticket, object.get(), target.fd(), checksum.get(), &copied,
+    outcome = copy(attempt.ticket, object.get(), target.fd(), &checksum, &copied,
                    Direction::from_store, size);
     if (!outcome.ok()) return outcome;
     if (copied != size)
@@ -227,7 +92,7 @@ class FileBackend : public Backend {
     if (!target.sync()) return local_failure("cannot write the local file", errno);
     if (!attempt.ticket.begin_commit()) return cancelled();
     if (!target.publish()) return local_failure("cannot replace the local file", errno);
-    if (version != nullptr) *version = g_checksum_get_string(checksum.get());
+    if (version != nullptr) *version = checksum.hex();
     return success();
   }
 
@@ -373,7 +238,7 @@ class FileBackend : public Backend {
 
   // An object that somebody writes may become longer for as long as it is read: no more than
   // @p most bytes of it are, and one.
-  static Outcome copy(Ticket &ticket, int from, int to, GChecksum *checksum, uint64_t *copied,
+  static Outcome copy(Ticket &ticket, int from, int to, Checksum *checksum, uint64_t *copied,
                       Direction direction, uint64_t most = UINT64_MAX) {
     const std::unique_ptr<char[]> buffer(new char[kBufferBytes]);
     const bool upload = direction == Direction::to_store;
@@ -396,8 +261,7 @@ class FileBackend : public Backend {
         }
         done += written;
       }
-      if (checksum != nullptr)
-        g_checksum_update(checksum, reinterpret_cast<const guchar *>(buffer.get()), count);
+      if (checksum != nullptr) checksum->add(buffer.get(), static_cast<std::size_t>(count));
       offset += count;
       *copied += static_cast<uint64_t>(count);
     }
@@ -454,16 +318,16 @@ class FileBackend : public Backend {
     Version present;
     struct stat status {};
     if (object && fstat(object.get(), &status) == 0 && S_ISREG(status.st_mode)) {
-      const Checksum checksum = new_checksum();
-      const Outcome outcome = checksum_of(ticket, object.get(), checksum.get());
+      Checksum checksum(G_CHECKSUM_SHA256);
+      const Outcome outcome = checksum_of(ticket, object.get(), &checksum);
       if (!outcome.ok()) return outcome;
-      present = g_checksum_get_string(checksum.get());
+      present = checksum.hex();
     }
     if (present == basis) return success();
     return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
   }
 
-  static Outcome checksum_of(Ticket &ticket, int object, GChecksum *checksum) {
+  static Outcome checksum_of(Ticket &ticket, int object, Checksum *checksum) {
     const std::unique_ptr<char[]> buffer(new char[kBufferBytes]);
     for (;;) {
       if (ticket.cancelled()) return cancelled();
@@ -471,7 +335,7 @@ class FileBackend : public Backend {
       if (count < 0 && errno == EINTR) continue;
       if (count < 0) return store_failure("cannot read the object", errno);
       if (count == 0) return success();
-      g_checksum_update(checksum, reinterpret_cast<const guchar *>(buffer.get()), count);
+      checksum->add(buffer.get(), static_cast<std::size_t>(count));
     }
   }
 
