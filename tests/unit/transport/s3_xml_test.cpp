@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 
 #include "s3/backend_s3.h"
+#include "s3/s3_xml.h"
 
 using namespace transport;
 

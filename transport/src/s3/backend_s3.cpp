@@ -4,138 +4,25 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <atomic>
 #include <cerrno>
-#include <mutex>
+#include <map>
+#include <memory>
 
 #include "core/remote_path.h"
 #include "http/http_store.h"
-#include "http/url.h"
-#include "http/xml_answer.h"
+#include "s3/s3_answer.h"
+#include "s3/s3_client.h"
+#include "s3/s3_xml.h"
 
 namespace transport {
 namespace {
 
-constexpr int kMovedPermanently = 301;
 constexpr std::size_t kMaxKeysPerPage = 1000;
-constexpr std::size_t kMaxPages = 1000;                        // of one listing
-constexpr std::size_t kMaxPrefixBytes = 1024 - kMaxPathBytes;  // a key has 1024 bytes at the most
+constexpr std::size_t kMaxPages = 1000;  // of one listing
 constexpr std::size_t kHashBufferBytes = 64 * 1024;
-constexpr std::size_t kMd5Bytes = 16;
 constexpr int64_t kMillisecondsPerSecond = 1000;
-constexpr char kUsualRegion[] = "us-east-1";
 constexpr char kUnsigned[] = "UNSIGNED-PAYLOAD";
-constexpr char kChecksumHeader[] = "x-amz-meta-md5";
-constexpr char kHexDigits[] = "0123456789abcdef";
-
-// What codes mean where the status does not tell, or not enough.
-struct Meaning {
-  const char *code;
-  backup_trans_error_code result;
-  bool transient;
-  const char *text;  // for people; null: the code says it
-};
-constexpr Meaning kMeanings[] = {
-    {"AccessDenied", BACKUP_TRANS_ERROR_AUTHENTICATION, false, nullptr},
-    {"AuthorizationHeaderMalformed", BACKUP_TRANS_ERROR_AUTHENTICATION, false,
-     "is the region the right one?"},
-    {"BadDigest", BACKUP_TRANS_ERROR_SERVER, true, "it did not arrive as it was sent"},
-    // Swift's, to a writer who was overtaken.
-    {"BrokenMPU", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"ConditionalRequestConflict", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"EntityTooLarge", BACKUP_TRANS_ERROR_QUOTA, false, nullptr},
-    {"ExpiredToken", BACKUP_TRANS_ERROR_AUTHENTICATION, false, nullptr},
-    {"IncompleteBody", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"InternalError", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"InvalidAccessKeyId", BACKUP_TRANS_ERROR_AUTHENTICATION, false,
-     "the access key is not known there"},
-    {"NoSuchBucket", BACKUP_TRANS_ERROR_SERVER, false, "there is no such bucket"},
-    {"OperationAborted", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"PermanentRedirect", BACKUP_TRANS_ERROR_SERVER, false, "the bucket is at another endpoint"},
-    {"QuotaExceeded", BACKUP_TRANS_ERROR_QUOTA, false, nullptr},
-    {"RequestTimeTooSkewed", BACKUP_TRANS_ERROR_AUTHENTICATION, false,
-     "the device's clock differs too much from the server's"},
-    {"RequestTimeout", BACKUP_TRANS_ERROR_NETWORK, true, nullptr},
-    {"ServiceUnavailable", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"SignatureDoesNotMatch", BACKUP_TRANS_ERROR_AUTHENTICATION, false,
-     "is the secret the right one?"},
-    {"SlowDown", BACKUP_TRANS_ERROR_SERVER, true, nullptr},
-    {"XAmzContentSHA256Mismatch", BACKUP_TRANS_ERROR_SERVER, true,
-     "it did not arrive as it was sent"},
-};
-
-void explain(const S3Error &error, Outcome *outcome) {
-  if (error.code.empty()) return;
-  const char *text = nullptr;
-  for (const Meaning &meaning : kMeanings) {
-    if (error.code != meaning.code) continue;
-    outcome->code = meaning.result;
-    outcome->transient = meaning.transient;
-    text = meaning.text;
-  }
-  outcome->message += " (" + error.code + (text == nullptr ? "" : std::string(": ") + text) + ")";
-}
-
-// The object itself being absent is looked at before this is asked.
-Outcome outcome(const HttpAnswer &answer, const char *what) {
-  Outcome result = outcome_of(answer, what);
-  if (!answer.complete() || answer.good()) return result;
-  explain(parse_s3_error(answer.body), &result);
-  if (const char *missing = xml_missing_for_answers()) {
-    result.message += std::string(" (") + missing + " cannot be loaded)";
-  }
-  if (result.code == BACKUP_TRANS_ERROR_NO_SUCH_OBJECT) result.code = BACKUP_TRANS_ERROR_SERVER;
-  return result;
-}
-
-bool is_absent_object(const HttpAnswer &answer) {
-  // An answer without a body, to a HEAD, does not tell a missing bucket from a missing object.
-  return is_absent(answer) && parse_s3_error(answer.body).code != "NoSuchBucket" &&
-         xml_missing_for_answers() == nullptr;
-}
-
-bool is_ip_address(const std::string &host) { return g_hostname_is_ip_address(host.c_str()) != 0; }
-
-std::string to_base64(const std::string &hex) {
-  std::array<guchar, kMd5Bytes> bytes{};
-  for (std::size_t i = 0; i < bytes.size(); ++i)
-    bytes[i] = static_cast<guchar>(g_ascii_xdigit_value(hex[2 * i]) * 16 +
-                                   g_ascii_xdigit_value(hex[2 * i + 1]));
-  char *text = g_base64_encode(bytes.data(), bytes.size());
-  std::string base64 = text;
-  g_free(text);
-  return base64;
-}
-
-std::string checksum_of(GChecksumType type, const std::string &text) {
-  Checksum checksum(type);
-  checksum.add(text.data(), text.size());
-  return checksum.hex();
-}
-
-std::string etag_of(const HttpAnswer &answer) {
-  std::string etag = answer.header("etag");
-  if (etag.size() >= 2 && etag.front() == '"' && etag.back() == '"')
-    etag = etag.substr(1, etag.size() - 2);
-  return etag;
-}
-
-bool is_md5(const std::string &text) {
-  return text.size() == 2 * kMd5Bytes && text.find_first_not_of(kHexDigits) == std::string::npos;
-}
-
-// What an object's content must have as its MD5; "" when that is not known.
-std::string expected_md5(const HttpAnswer &answer) {
-  const std::string own = answer.header(kChecksumHeader);
-  if (is_md5(own)) return own;
-  // With keys that the service does not hold itself the tag is something else.
-  const std::string encryption = answer.header("x-amz-server-side-encryption");
-  const bool plain_tag = (encryption.empty() || encryption == "AES256") &&
-                         answer.header("x-amz-server-side-encryption-customer-algorithm").empty();
-  const std::string etag = etag_of(answer);
-  return plain_tag && is_md5(etag) ? etag : "";
-}
 
 // The content that is being sent, and what became of it so far.
 struct Sending {
@@ -169,35 +56,24 @@ class ListingRoute {
   std::size_t next_mark_ = 1;
 };
 
-struct Place {
-  std::string bucket_url;  // what the query of a listing follows
-  std::string object_url;  // what a key follows; ends in a slash
-  std::string prefix;      // of every key; "" or ends in a slash
-  bool is_tls = true;
-};
-
 class S3Backend : public Backend {
  public:
-  S3Backend(Place place, const Config &config)
-      : place_(std::move(place)),
-        user_(config.user),
-        password_(config.password),
-        ca_file_(config.ca_file),
-        region_(config.region.empty() ? kUsualRegion : config.region) {}
+  S3Backend(S3Place place, const Config &config) : client_(std::move(place), config) {}
 
   Outcome download(Attempt &attempt, const std::string &path, LocalTarget &target,
                    Version *version) override {
     if (!target.begin()) return local_failure("cannot make a local file");
-    const std::string key = key_of(path);
-    const HttpRequest request = signed_request("GET", key);
+    const std::string key = client_.key_of(path);
+    const HttpRequest request = client_.signed_request("GET", key);
     Received received = receive(attempt.ticket, request, G_CHECKSUM_MD5, target);
-    if (takes_region_from(received.answer, request))
-      received = receive(attempt.ticket, signed_request("GET", key), G_CHECKSUM_MD5, target);
+    if (client_.takes_region_from(received.answer, request))
+      received =
+          receive(attempt.ticket, client_.signed_request("GET", key), G_CHECKSUM_MD5, target);
     if (is_absent_object(received.answer)) {
       if (version != nullptr) version->reset();
       return no_such_object();
     }
-    if (!received.answer.good()) return outcome(received.answer, "download");
+    if (!received.answer.good()) return s3_outcome(received.answer, "download");
     const std::string expected = expected_md5(received.answer);
     if (!expected.empty() && expected != received.checksum)
       return again("download: the object came damaged");
@@ -249,7 +125,8 @@ class S3Backend : public Backend {
       // One more than asked for tells that there is more.
       if (children.size() > last + 1) children.erase(std::prev(children.end()));
     };
-    const std::string prefix = folder.empty() ? place_.prefix : key_of(folder) + "/";
+    const std::string prefix =
+        folder.empty() ? client_.place().prefix : client_.key_of(folder) + "/";
     const Outcome result =
         for_each_page(attempt.ticket, prefix, "/", [&](const S3Listing &listing) {
           for (const S3Object &object : listing.objects)
@@ -271,12 +148,12 @@ class S3Backend : public Backend {
   Outcome remove_folder(Attempt &attempt, const std::string &folder) override {
     // An earlier attempt that failed may have had its effect all the same.
     bool held_object = attempt.memory.has_value();
-    const Outcome result =
-        for_each_page(attempt.ticket, key_of(folder) + "/", "", [&](const S3Listing &listing) {
+    const Outcome result = for_each_page(
+        attempt.ticket, client_.key_of(folder) + "/", "", [&](const S3Listing &listing) {
           std::vector<std::string> keys;
           for (const S3Object &object : listing.objects) {
             keys.push_back(object.key);
-            const std::string path = "/" + object.key.substr(place_.prefix.size());
+            const std::string path = "/" + object.key.substr(client_.place().prefix.size());
             held_object = held_object || is_object_path(path.c_str());
           }
           if (held_object) attempt.memory = true;
@@ -289,67 +166,8 @@ class S3Backend : public Backend {
  private:
   using Parameters = std::map<std::string, std::string>;
 
-  std::string key_of(const std::string &path) const { return place_.prefix + path.substr(1); }
-
   static Outcome conflict() {
     return failure(BACKUP_TRANS_ERROR_CONFLICT, "the object changed since it was read");
-  }
-
-  HttpRequest request_to(const char *method, std::string url) {
-    HttpRequest request;
-    request.method = method;
-    request.url = std::move(url);
-    request.user = user_;
-    request.password = password_;
-    request.ca_file = ca_file_;
-    return request;
-  }
-
-  static std::string signature_in(const std::string &region) { return "aws:amz:" + region + ":s3"; }
-
-  void sign(const std::string &payload, HttpRequest *request) {
-    const std::lock_guard<std::mutex> guard(mutex_);
-    request->headers.push_back("x-amz-content-sha256: " + payload);
-    request->signature = signature_in(region_);
-  }
-
-  HttpRequest signed_request(const char *method, const std::string &key) {
-    HttpRequest request = request_to(method, place_.object_url + encode_path(key));
-    sign(checksum_of(G_CHECKSUM_SHA256, ""), &request);
-    return request;
-  }
-
-  // Whether the answer named another region than the request, which is the one from now on.
-  bool takes_region_from(const HttpAnswer &answer, const HttpRequest &request) {
-    if (!answer.complete() ||
-        (answer.status != kMovedPermanently && answer.status != kHttpBadRequest))
-      return false;
-    std::string named = answer.header("x-amz-bucket-region");
-    if (!is_s3_name(named)) named = parse_s3_error(answer.body).region;
-    const std::lock_guard<std::mutex> guard(mutex_);
-    if (named.empty() || signature_in(named) == request.signature) return false;
-    region_ = named;
-    return true;
-  }
-
-  // @p payload is the hexadecimal SHA-256 of the body, or kUnsigned.
-  HttpAnswer perform(Ticket &ticket, HttpRequest request, const std::string &payload) {
-    const std::vector<std::string> headers = request.headers;
-    sign(payload, &request);
-    HttpAnswer answer = http_perform(ticket, request);
-    if (!takes_region_from(answer, request)) return answer;
-    request.headers = headers;
-    sign(payload, &request);
-    return http_perform(ticket, request);
-  }
-
-  HttpAnswer perform(Ticket &ticket, HttpRequest request) {
-    const std::string payload = checksum_of(G_CHECKSUM_SHA256, request.body);
-    return perform(ticket, std::move(request), payload);
-  }
-
-  HttpAnswer head(Ticket &ticket, const std::string &path) {
-    return perform(ticket, request_to("HEAD", place_.object_url + encode_path(key_of(path))));
   }
 
   Outcome hash(Ticket &ticket, const LocalSource &source, Sending *sending) const {
@@ -366,12 +184,12 @@ class S3Backend : public Backend {
       if (count < 0) return local_failure("cannot read the local file");
       if (count == 0) break;
       md5.add(buffer.get(), static_cast<std::size_t>(count));
-      if (!place_.is_tls) sha256.add(buffer.get(), static_cast<std::size_t>(count));
+      if (!client_.place().is_tls) sha256.add(buffer.get(), static_cast<std::size_t>(count));
       done += static_cast<uint64_t>(count);
     }
     if (done != source.size()) return local_change();
     sending->md5 = md5.hex();
-    if (!place_.is_tls) sending->sha256 = sha256.hex();
+    if (!client_.place().is_tls) sending->sha256 = sha256.hex();
     return success();
   }
 
@@ -380,9 +198,9 @@ class S3Backend : public Backend {
   }
 
   Outcome look(Ticket &ticket, const Upload &upload, const Sending &sending, Present *present) {
-    const HttpAnswer answer = head(ticket, upload.path);
+    const HttpAnswer answer = client_.head(ticket, upload.path);
     if (is_absent(answer)) return success();
-    if (!answer.good()) return outcome(answer, "upload");
+    if (!answer.good()) return s3_outcome(answer, "upload");
     present->version = etag_of(answer);
     present->is_ours =
         expected_md5(answer) == sending.md5 && has_size(answer, upload.source.size());
@@ -391,7 +209,8 @@ class S3Backend : public Backend {
 
   HttpAnswer put(Ticket &ticket, const Upload &upload, const Sending &sending,
                  const std::string &condition) {
-    HttpRequest request = request_to("PUT", place_.object_url + encode_path(key_of(upload.path)));
+    HttpRequest request = client_.request_to(
+        "PUT", client_.place().object_url + encode_path(client_.key_of(upload.path)));
     request.has_body = true;
     request.body_fd = upload.source.fd();
     request.body_size = upload.source.size();
@@ -403,7 +222,8 @@ class S3Backend : public Backend {
                        "Content-MD5: " + to_base64(sending.md5),
                        kChecksumHeader + (": " + sending.md5), time};
     if (!condition.empty()) request.headers.push_back(condition);
-    return perform(ticket, std::move(request), place_.is_tls ? kUnsigned : sending.sha256);
+    return client_.perform(ticket, std::move(request),
+                           client_.place().is_tls ? kUnsigned : sending.sha256);
   }
 
   std::string condition_for(const Upload &upload, bool bare_tags) const {
@@ -439,16 +259,16 @@ class S3Backend : public Backend {
     }
     if (answer.good()) return verify(ticket, upload, *sending, answer);
     if (answer.complete() && !upload.source.unchanged()) return local_change();
-    return outcome(answer, "upload");
+    return s3_outcome(answer, "upload");
   }
 
   // A service that keeps checksums has said so with its tag; the others must at least have it all.
   Outcome verify(Ticket &ticket, const Upload &upload, const Sending &sending,
                  const HttpAnswer &answer) {
     if (etag_of(answer) == sending.md5) return success();
-    const HttpAnswer kept = head(ticket, upload.path);
+    const HttpAnswer kept = client_.head(ticket, upload.path);
     if (is_absent(kept)) return again("upload: it did not last");
-    if (!kept.good()) return outcome(kept, "upload");
+    if (!kept.good()) return s3_outcome(kept, "upload");
     const std::string found = expected_md5(kept);
     if (!found.empty() && found != sending.md5) return again("upload: something else is there");
     return has_size(kept, upload.source.size()) ? success()
@@ -468,9 +288,10 @@ class S3Backend : public Backend {
                                {"prefix", prefix}};
       if (*delimiter != '\0') parameters["delimiter"] = delimiter;
       if (!token.empty()) parameters["continuation-token"] = token;
-      const HttpAnswer answer =
-          perform(ticket, request_to("GET", place_.bucket_url + make_s3_query(parameters)));
-      if (!answer.good()) return outcome(answer, "list");
+      const HttpAnswer answer = client_.perform(
+          ticket,
+          client_.request_to("GET", client_.place().bucket_url + make_s3_query(parameters)));
+      if (!answer.good()) return s3_outcome(answer, "list");
       S3Listing listing;
       if (!parse_s3_listing(answer.body, &listing))
         return no_store("list: the server's answer is not a listing");
@@ -513,27 +334,28 @@ class S3Backend : public Backend {
       if (refused) alone.insert(alone.end(), together.begin(), together.end());
     }
     for (const std::string &key : alone) {
-      const HttpAnswer answer =
-          perform(ticket, request_to("DELETE", place_.object_url + encode_path(key)));
-      if (!answer.good() && !is_absent_object(answer)) return outcome(answer, "delete");
+      const HttpAnswer answer = client_.perform(
+          ticket, client_.request_to("DELETE", client_.place().object_url + encode_path(key)));
+      if (!answer.good() && !is_absent_object(answer)) return s3_outcome(answer, "delete");
     }
     return success();
   }
 
   Outcome remove_together(Ticket &ticket, const std::vector<std::string> &keys, bool *refused) {
-    HttpRequest request = request_to("POST", place_.bucket_url + make_s3_query({{"delete", ""}}));
+    HttpRequest request =
+        client_.request_to("POST", client_.place().bucket_url + make_s3_query({{"delete", ""}}));
     request.has_body = true;
     request.body = make_s3_deletion(keys);
     request.headers = {"Content-Type: application/xml",
                        "Content-MD5: " + to_base64(checksum_of(G_CHECKSUM_MD5, request.body))};
-    const HttpAnswer answer = perform(ticket, std::move(request));
+    const HttpAnswer answer = client_.perform(ticket, std::move(request));
     if (answer.complete() &&
         (answer.status == kHttpNotImplemented || answer.status == kHttpMethodNotAllowed)) {
       many_at_once_ = false;
       *refused = true;
       return success();
     }
-    if (!answer.good()) return outcome(answer, "delete");
+    if (!answer.good()) return s3_outcome(answer, "delete");
     std::vector<S3Error> errors;
     if (!parse_s3_deletion(answer.body, &errors))
       return failure(BACKUP_TRANS_ERROR_SERVER, "delete: the server's answer tells no result");
@@ -543,54 +365,19 @@ class S3Backend : public Backend {
     return kept;
   }
 
-  const Place place_;
-  const std::string user_;
-  const std::string password_;
-  const std::string ca_file_;
-  std::mutex mutex_;
-  std::string region_;
+  S3Client client_;
   // What the service turned out not to have.
   std::atomic<bool> conditions_{true};
   std::atomic<bool> bare_tags_{false};  // it compares tags without their quotes
   std::atomic<bool> many_at_once_{true};
 };
 
-// "" when everything can be meant.
-std::string find_place(const StoreUrl &url, const Config &config, Place *place) {
-  const std::string path = url.path.empty() ? "" : url.path.substr(1);
-  const std::string bucket = path.substr(0, path.find('/'));
-  const std::string prefix = bucket.size() == path.size() ? "" : path.substr(bucket.size());
-  if (!is_s3_name(bucket) || bucket.front() == '.') return "the url names no bucket";
-  if (!prefix.empty() && !is_object_path(prefix.c_str()))
-    return "the url's path behind the bucket is no folder";
-  if (prefix.size() > kMaxPrefixBytes) return "the url's path behind the bucket is too long";
-  if (config.user.empty() || config.password.empty())
-    return "the store needs an access key as user and a secret as password";
-  if (!config.region.empty() && !is_s3_name(config.region)) return "the region is no name";
-  const bool is_virtual = config.addressing == "virtual";
-  if (!is_virtual && !config.addressing.empty() && config.addressing != "path")
-    return "the addressing is neither path nor virtual";
-  if (is_virtual && is_ip_address(url.host)) return "virtual addressing needs a host with a name";
-  place->is_tls = url.origin.compare(0, 6, "https:") == 0;
-  place->prefix = prefix.empty() ? "" : prefix.substr(1) + "/";
-  if (is_virtual) {
-    std::string origin = url.origin;
-    origin.insert(origin.find("//") + 2, bucket + ".");
-    place->object_url = origin + "/";
-    place->bucket_url = origin + "/";
-  } else {
-    place->bucket_url = url.origin + "/" + bucket;
-    place->object_url = place->bucket_url + "/";
-  }
-  return "";
-}
-
 }  // namespace
 
 std::shared_ptr<Backend> make_s3_backend(const StoreUrl &url, const Config &config,
                                          std::string *problem) {
-  Place place;
-  *problem = find_place(url, config, &place);
+  S3Place place;
+  *problem = find_s3_place(url, config, &place);
   if (!problem->empty()) return nullptr;
   return std::make_shared<S3Backend>(std::move(place), config);
 }

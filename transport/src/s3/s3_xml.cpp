@@ -1,9 +1,10 @@
+#include "s3/s3_xml.h"
+
 #include <glib.h>
 
 #include <cstring>
 
 #include "http/xml_answer.h"
-#include "s3/backend_s3.h"
 
 namespace transport {
 namespace {
