@@ -37,13 +37,13 @@ class ConfigFile {
    * Look at the file, and read it when it is another one than the last time.
    * @return whether config() can be used; else problem() tells why
    */
-  bool refresh();
+  [[nodiscard]] bool refresh();
 
   const Config &config() const { return config_; }
   const std::string &problem() const { return problem_; }
 
  private:
-  bool read();
+  [[nodiscard]] bool read();
 
   std::string path_;
   struct stat seen_ = {};

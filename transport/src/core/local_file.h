@@ -23,19 +23,19 @@
 namespace transport {
 
 /** The parent directory of @p path, reached safely; @p name receives the last component. */
-UniqueFd open_local_parent(const std::string &path, std::string *name);
+[[nodiscard]] UniqueFd open_local_parent(const std::string &path, std::string *name);
 
 /** An open regular file that is being sent. One thread at a time. */
 class LocalSource {
  public:
   /** @return false with errno; ELOOP for a link, EINVAL for what is not a regular file */
-  bool open(const std::string &path);
+  [[nodiscard]] bool open(const std::string &path);
 
   int fd() const { return fd_.get(); }
   uint64_t size() const { return static_cast<uint64_t>(size_); }
 
   /** Is the content the one that was there when it was opened? */
-  bool unchanged() const;
+  [[nodiscard]] bool unchanged() const;
 
  private:
   UniqueFd fd_;
@@ -47,23 +47,23 @@ class LocalSource {
 class LocalTarget {
  public:
   /** Find its directory, which must exist. @return false with errno */
-  bool open(const std::string &path);
+  [[nodiscard]] bool open(const std::string &path);
 
   /** Most bytes that it may have; 0: any number. */
   void set_limit(uint64_t limit) { limit_ = limit; }
   uint64_t limit() const { return limit_ == 0 ? UINT64_MAX : limit_; }
 
   /** Start, or start over, with an empty file that nobody sees. @return false with errno */
-  bool begin();
+  [[nodiscard]] bool begin();
 
   /** The file since begin(). */
   int fd() const { return staged_->fd(); }
 
   /** Have the content on the disk. @return false with errno */
-  bool sync() const;
+  [[nodiscard]] bool sync() const;
 
   /** Make it the file at the path. @return false with errno */
-  bool publish();
+  [[nodiscard]] bool publish();
 
   /** Give up what begin() started. */
   void discard() { staged_.reset(); }

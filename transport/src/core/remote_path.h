@@ -18,10 +18,10 @@ constexpr std::size_t kMaxComponentBytes = 255;
 constexpr std::size_t kMaxPathBytes = 768;
 
 /** Is @p path a proper absolute path of an object? */
-bool is_object_path(const char *path);
+[[nodiscard]] bool is_object_path(const char *path);
 
 /** The same for a folder; @p folder receives it without a trailing slash, the root as "". */
-bool parse_folder_path(const char *path, std::string *folder);
+[[nodiscard]] bool parse_folder_path(const char *path, std::string *folder);
 
 /** The components of a checked path. */
 std::vector<std::string> split_path(std::string_view path);
@@ -39,7 +39,7 @@ std::string make_temporary_name();
  * Could make_temporary_name() have made it? No object has such a name. Servers put
  * something behind a dot to it while they receive it.
  */
-bool is_temporary_name(std::string_view name);
+[[nodiscard]] bool is_temporary_name(std::string_view name);
 
 }  // namespace transport
 

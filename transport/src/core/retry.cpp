@@ -3,6 +3,7 @@
 #include <glib.h>
 
 #include <algorithm>
+#include <optional>
 
 namespace transport {
 namespace {

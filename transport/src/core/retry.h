@@ -7,7 +7,6 @@
 
 #include <chrono>
 #include <functional>
-#include <optional>
 
 #include "core/outcome.h"
 #include "core/ticket.h"

@@ -25,18 +25,18 @@ class StagedFile {
   ~StagedFile();
 
   /** Mode 0600, in @p folder, which must stay open as long as this object. */
-  bool create(int folder);
+  [[nodiscard]] bool create(int folder);
 
   int fd() const { return fd_.get(); }
 
   /** Give it the name @p name in @p target_folder of the same file system, over what has it. */
-  bool publish(int target_folder, const std::string &name);
+  [[nodiscard]] bool publish(int target_folder, const std::string &name);
 
   /** For tests: behave as on a file system without nameless files. */
   static void set_nameless_allowed(bool allowed);
 
  private:
-  bool link_as(int target_folder, const std::string &name) const;
+  [[nodiscard]] bool link_as(int target_folder, const std::string &name) const;
 
   int folder_ = -1;
   std::string temporary_name_;  // empty while the file has no name

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "core/checksum.h"
+#include "core/file_bytes.h"
 #include "core/remote_path.h"
 #include "file/store_folder.h"
 
@@ -244,22 +245,15 @@ class FileBackend : public Backend {
     const bool upload = direction == Direction::to_store;
     for (off_t offset = 0;;) {
       if (ticket.cancelled()) return cancelled();
-      const ssize_t count = pread(from, buffer.get(), kBufferBytes, offset);
-      if (count < 0 && errno == EINTR) continue;
+      const ssize_t count = read_at(from, buffer.get(), kBufferBytes, offset);
       if (count < 0) {
         return upload ? local_failure("cannot read the local file", errno)
                       : store_failure("cannot read the object", errno);
       }
       if (count == 0 || *copied > most) return success();
-      for (ssize_t done = 0; done < count;) {
-        const ssize_t written =
-            write(to, buffer.get() + done, static_cast<std::size_t>(count - done));
-        if (written < 0 && errno == EINTR) continue;
-        if (written < 0) {
-          return upload ? store_failure("cannot write the object", errno)
-                        : local_failure("cannot write the local file", errno);
-        }
-        done += written;
+      if (!write_all(to, buffer.get(), static_cast<std::size_t>(count))) {
+        return upload ? store_failure("cannot write the object", errno)
+                      : local_failure("cannot write the local file", errno);
       }
       if (checksum != nullptr) checksum->add(buffer.get(), static_cast<std::size_t>(count));
       offset += count;

@@ -19,7 +19,7 @@ namespace transport {
 std::string path_of_file_url(const std::string &url);
 
 /** @param root absolute; made when something is first stored */
-std::shared_ptr<Backend> make_file_backend(std::string root);
+[[nodiscard]] std::shared_ptr<Backend> make_file_backend(std::string root);
 
 }  // namespace transport
 

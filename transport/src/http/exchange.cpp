@@ -8,10 +8,11 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <limits>
+
+#include "core/file_bytes.h"
 
 namespace transport {
 namespace {
@@ -50,10 +51,7 @@ std::size_t read_body(char *buffer, std::size_t size, std::size_t count, void *d
     exchange.sent += wanted;
     return wanted;
   }
-  ssize_t got = 0;
-  do {
-    got = pread(request.body_fd, buffer, wanted, static_cast<off_t>(exchange.sent));
-  } while (got < 0 && errno == EINTR);
+  const ssize_t got = read_at(request.body_fd, buffer, wanted, static_cast<off_t>(exchange.sent));
   if (got < 0 || (got == 0 && wanted > 0)) {
     exchange.local_failure = true;
     return CURL_READFUNC_ABORT;

@@ -7,7 +7,6 @@
 #ifndef BACKUP_TRANSPORT_EXCHANGE_H
 #define BACKUP_TRANSPORT_EXCHANGE_H
 
-#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <set>

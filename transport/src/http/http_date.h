@@ -15,7 +15,7 @@ namespace transport {
  * @param text any of the three forms that a server may send
  * @return seconds since the Unix epoch; none when it is no date. Whatever the locale is.
  */
-std::optional<int64_t> parse_http_date(const std::string &text);
+[[nodiscard]] std::optional<int64_t> parse_http_date(const std::string &text);
 
 }  // namespace transport
 

@@ -1,25 +1,12 @@
 #include "http/http_store.h"
 
 #include <glib.h>
-#include <unistd.h>
 
 #include <cerrno>
 
+#include "core/file_bytes.h"
+
 namespace transport {
-namespace {
-
-bool write_all(int fd, const char *data, std::size_t size) {
-  while (size > 0) {
-    const ssize_t written = write(fd, data, size);
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) return false;
-    data += written;
-    size -= static_cast<std::size_t>(written);
-  }
-  return true;
-}
-
-}  // namespace
 
 Outcome no_such_object() {
   return failure(BACKUP_TRANS_ERROR_NO_SUCH_OBJECT, "no such object in the store");

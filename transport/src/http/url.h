@@ -13,7 +13,7 @@ namespace transport {
 std::string encode_path(const std::string &path);
 
 /** Is @p host this machine itself? Only there may a store be reached without TLS. */
-bool is_loopback(const std::string &host);
+[[nodiscard]] bool is_loopback(const std::string &host);
 
 /** The parts of a network store's URL. */
 struct StoreUrl {
@@ -27,8 +27,8 @@ struct StoreUrl {
  * @param scheme "webdav" or "s3"
  * @return false with @p problem; the problem is empty when the URL has another scheme
  */
-bool parse_store_url(const std::string &url, const std::string &scheme, StoreUrl *parsed,
-                     std::string *problem);
+[[nodiscard]] bool parse_store_url(const std::string &url, const std::string &scheme,
+                                   StoreUrl *parsed, std::string *problem);
 
 }  // namespace transport
 

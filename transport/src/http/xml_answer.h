@@ -19,7 +19,7 @@ struct XmlFree {
 using XmlAnswer = std::unique_ptr<xmlDoc, XmlFree>;
 
 /** Null when it is no well-formed document, or has a document type. */
-XmlAnswer parse_xml(const std::string &text);
+[[nodiscard]] XmlAnswer parse_xml(const std::string &text);
 
 /**
  * Read a document element by element, so that a long one takes no more memory than its text.
@@ -27,8 +27,9 @@ XmlAnswer parse_xml(const std::string &text);
  * @param child called with each element right below it, with all that is in that one
  * @return false when it is no well-formed document, has a document type, or @p root is false
  */
-bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)> &root,
-              const std::function<void(const xmlNode *)> &child);
+[[nodiscard]] bool read_xml(const std::string &text,
+                            const std::function<bool(const xmlNode *)> &root,
+                            const std::function<void(const xmlNode *)> &child);
 
 /**
  * The library's name once an answer had to be read and it could not be loaded; null before. Then

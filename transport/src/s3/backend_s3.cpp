@@ -9,6 +9,7 @@
 #include <map>
 #include <memory>
 
+#include "core/file_bytes.h"
 #include "core/remote_path.h"
 #include "http/http_store.h"
 #include "s3/s3_answer.h"
@@ -179,8 +180,7 @@ class S3Backend : public Backend {
     for (;;) {
       if (ticket.cancelled()) return cancelled();
       const ssize_t count =
-          pread(source.fd(), buffer.get(), kHashBufferBytes, static_cast<off_t>(done));
-      if (count < 0 && errno == EINTR) continue;
+          read_at(source.fd(), buffer.get(), kHashBufferBytes, static_cast<off_t>(done));
       if (count < 0) return local_failure("cannot read the local file");
       if (count == 0) break;
       md5.add(buffer.get(), static_cast<std::size_t>(count));

@@ -15,8 +15,8 @@
 namespace transport {
 
 /** @return null with @p problem when the configuration cannot be meant */
-std::shared_ptr<Backend> make_s3_backend(const StoreUrl &url, const Config &config,
-                                         std::string *problem);
+[[nodiscard]] std::shared_ptr<Backend> make_s3_backend(const StoreUrl &url, const Config &config,
+                                                       std::string *problem);
 
 }  // namespace transport
 

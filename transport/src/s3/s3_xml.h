@@ -29,7 +29,7 @@ struct S3Listing {
 };
 
 /** @return false when @p xml is no listing */
-bool parse_s3_listing(const std::string &xml, S3Listing *listing);
+[[nodiscard]] bool parse_s3_listing(const std::string &xml, S3Listing *listing);
 
 /** What an answer that is none says; texts that are no plain names are left out. */
 struct S3Error {
@@ -45,10 +45,10 @@ S3Error parse_s3_error(const std::string &xml);
  * object that was not there it is none.
  * @return false when @p xml is no such answer
  */
-bool parse_s3_deletion(const std::string &xml, std::vector<S3Error> *errors);
+[[nodiscard]] bool parse_s3_deletion(const std::string &xml, std::vector<S3Error> *errors);
 
 /** Can XML 1.0 carry this key? */
-bool fits_xml(const std::string &key);
+[[nodiscard]] bool fits_xml(const std::string &key);
 
 /** The request to delete these objects; each key must fit. */
 std::string make_s3_deletion(const std::vector<std::string> &keys);
@@ -57,7 +57,7 @@ std::string make_s3_deletion(const std::vector<std::string> &keys);
 std::string make_s3_query(const std::map<std::string, std::string> &parameters);
 
 /** A plain name of letters, digits, "-", "." and "_", of at most 64 bytes? */
-bool is_s3_name(const std::string &text);
+[[nodiscard]] bool is_s3_name(const std::string &text);
 
 }  // namespace transport
 

@@ -7,8 +7,6 @@
 #ifndef BACKUP_TRANSPORT_CHECK_H
 #define BACKUP_TRANSPORT_CHECK_H
 
-#include <memory>
-
 #include "core/backend.h"
 
 namespace transport {

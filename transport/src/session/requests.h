@@ -8,6 +8,7 @@
 #define BACKUP_TRANSPORT_REQUESTS_H
 
 #include <cstdint>
+#include <optional>
 #include <string>
 
 #include "session/request.h"

@@ -17,7 +17,7 @@ namespace transport {
  * The store that a configuration names.
  * @return null, with @p problem, when it names none that can be
  */
-std::shared_ptr<Backend> make_backend(const Config &config, std::string *problem);
+[[nodiscard]] std::shared_ptr<Backend> make_backend(const Config &config, std::string *problem);
 
 }  // namespace transport
 

@@ -15,8 +15,9 @@
 namespace transport {
 
 /** Null with @p problem when nothing can be meant by the configuration. */
-std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url, const Config &config,
-                                             std::string *problem);
+[[nodiscard]] std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url,
+                                                           const Config &config,
+                                                           std::string *problem);
 
 }  // namespace transport
 

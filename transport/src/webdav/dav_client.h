@@ -106,7 +106,8 @@ class DavClient {
    * The lock of one of our devices that keeps others out of a folder.
    * @return false when there is none, or the server does not tell
    */
-  bool find_foreign_lock(Ticket &ticket, const std::string &folder, DavLock *lock) const;
+  [[nodiscard]] bool find_foreign_lock(Ticket &ticket, const std::string &folder,
+                                       DavLock *lock) const;
   /** Take it from its holder. */
   void break_lock(Ticket &ticket, const std::string &folder, const DavLock &lock) const;
   /** The header that proves a lock. */
@@ -118,7 +119,7 @@ class DavClient {
   void delete_pieces(Ticket &ticket, const std::string &folder, const std::string &temporary) const;
 
   /** Does the answer send whoever asked for a folder as for an object to its name with a slash? */
-  bool means_folder(const HttpAnswer &answer, const std::string &path) const;
+  [[nodiscard]] bool means_folder(const HttpAnswer &answer, const std::string &path) const;
 
  private:
   HttpRequest question(const char *body, const std::string &folder, const char *depth) const;

@@ -1,8 +1,8 @@
 #include "webdav/dav_place.h"
 
-#include <unistd.h>
-
 #include <algorithm>
+
+#include "core/file_bytes.h"
 
 namespace transport {
 namespace {
@@ -58,8 +58,8 @@ DavPlace::Found DavPlace::compare_source(uint64_t size, const std::string &end) 
   if (size > source_.size()) return Found::foreign;
   if (spoilt_) return Found::part;
   std::string expected(std::min(size, kComparedBytes), '\0');
-  const ssize_t got = pread(source_.fd(), expected.data(), expected.size(),
-                            static_cast<off_t>(size - expected.size()));
+  const ssize_t got = read_at(source_.fd(), expected.data(), expected.size(),
+                              static_cast<off_t>(size - expected.size()));
   if (got != static_cast<ssize_t>(expected.size()) || end != expected) return Found::foreign;
   return size == source_.size() ? Found::whole : Found::part;
 }

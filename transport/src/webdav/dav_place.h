@@ -47,7 +47,7 @@ class DavPlace {
 
   Outcome look(Ticket &ticket, Found *found) const;
   /** After a good answer to what was sent, with a good one to a HEAD: is it there? */
-  bool arrived(Ticket &ticket, const HttpAnswer &head) const;
+  [[nodiscard]] bool arrived(Ticket &ticket, const HttpAnswer &head) const;
 
   /**
    * Take a part away: what was there before comes back where it was kept, else the object goes;
@@ -67,7 +67,7 @@ class DavPlace {
   HttpRequest short_request(const char *method) const;
   Outcome look(Ticket &ticket, Seen *seen) const;
   Outcome look_for_late(Ticket &ticket, Seen *seen) const;
-  bool read_end(Ticket &ticket, uint64_t size, std::string *end) const;
+  [[nodiscard]] bool read_end(Ticket &ticket, uint64_t size, std::string *end) const;
   Found compare(uint64_t size, const std::string &end) const;
   Found compare_source(uint64_t size, const std::string &end) const;
 

@@ -1,13 +1,11 @@
 #include "webdav/dav_upload.h"
 
-#include <unistd.h>
-
 #include <any>
 #include <array>
-#include <cerrno>
 #include <memory>
 #include <set>
 
+#include "core/file_bytes.h"
 #include "core/remote_path.h"
 
 namespace transport {
@@ -196,8 +194,7 @@ Version DavUploads::version_of(const LocalSource &source) {
   Checksum checksum(G_CHECKSUM_SHA256);
   std::array<char, 64 * 1024> buffer{};
   for (off_t at = 0;;) {
-    const ssize_t got = pread(source.fd(), buffer.data(), buffer.size(), at);
-    if (got < 0 && errno == EINTR) continue;
+    const ssize_t got = read_at(source.fd(), buffer.data(), buffer.size(), at);
     if (got <= 0) return checksum.hex();
     checksum.add(buffer.data(), static_cast<std::size_t>(got));
     at += got;

@@ -28,11 +28,11 @@ struct DavEntry {
  * @param left_out receives whether the document tells of more than @p entries
  * @return false when it is none, or holds a document type
  */
-bool parse_multistatus(const std::string &xml, const std::string &host,
-                       std::vector<DavEntry> *entries, bool *left_out);
+[[nodiscard]] bool parse_multistatus(const std::string &xml, const std::string &host,
+                                     std::vector<DavEntry> *entries, bool *left_out);
 
 /** The token of the lock that has that owner, in angle brackets; "" when there is none. */
-std::string parse_lock_token(const std::string &xml, const std::string &owner);
+[[nodiscard]] std::string parse_lock_token(const std::string &xml, const std::string &owner);
 
 /** A lock that somebody holds. */
 struct DavLock {
@@ -43,7 +43,7 @@ struct DavLock {
 };
 
 /** The first lock that a multi-status document tells of; false when there is none. */
-bool parse_lock(const std::string &xml, const std::string &host, DavLock *lock);
+[[nodiscard]] bool parse_lock(const std::string &xml, const std::string &host, DavLock *lock);
 
 }  // namespace transport
 
