@@ -31,7 +31,7 @@ constexpr const char *kFunctions[] = {"xmlFree",
                                       "xmlDocGetRootElement",
                                       "xmlGetProp",
                                       "xmlNodeGetContent",
-                                      "xmlReaderForMemory",
+                                      "xmlReaderForIO",
                                       "xmlTextReaderRead",
                                       "xmlTextReaderNext",
                                       "xmlTextReaderNodeType",
@@ -82,9 +82,9 @@ xmlChar *xmlGetProp(const xmlNode *node, const xmlChar *name) { FORWARD(xmlGetPr
 
 xmlChar *xmlNodeGetContent(const xmlNode *node) { FORWARD(xmlNodeGetContent, node); }
 
-xmlTextReaderPtr xmlReaderForMemory(const char *buffer, int size, const char *url,
-                                    const char *encoding, int options) {
-  FORWARD(xmlReaderForMemory, buffer, size, url, encoding, options);
+xmlTextReaderPtr xmlReaderForIO(xmlInputReadCallback take, xmlInputCloseCallback close,
+                                void *source, const char *url, const char *encoding, int options) {
+  FORWARD(xmlReaderForIO, take, close, source, url, encoding, options);
 }
 
 xmlNodePtr xmlTextReaderCurrentNode(xmlTextReaderPtr reader) {

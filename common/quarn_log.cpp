@@ -8,11 +8,14 @@
 #include <cstring>
 #include <string>
 
+#include "log_scope.h"
 #include "quarn_printable.h"
 
 namespace {
 
 constexpr char kTag[] = "QUARND";
+
+thread_local LogScope *scope = nullptr;
 
 /** One conversion of a format: "%-5.3ld" has the flags "-", width 5, precision 3, size "l". */
 struct Conversion {
@@ -124,9 +127,36 @@ std::string shown_value(const Conversion &how, Arguments *arguments) {
 
 }  // namespace
 
+LogScope::LogScope(std::string subject) : subject_(std::move(subject)) {
+  if (scope == nullptr) scope = this;
+}
+
+LogScope::~LogScope() {
+  if (scope != this) return;
+  scope = nullptr;
+  if (left_out_ > 0) LOGW("%u more such lines on %s are left out", left_out_, subject_.c_str());
+}
+
+bool LogScope::admits(const quarn_log_place &place) {
+  return scope == nullptr || scope->take(place);
+}
+
+bool LogScope::take(const quarn_log_place &place) {
+  auto known = std::find_if(written_.begin(), written_.end(), [&](const Written &written) {
+    return written.line == place.line && written.file == place.file;
+  });
+  if (known == written_.end()) {
+    known = written_.insert(known, {place.file, place.line, 0});
+  }
+  const bool admitted = known->count < kMaxLinesOfAPlace;
+  ++(admitted ? known->count : left_out_);
+  return admitted;
+}
+
 void quarn_log(log_id_t buffer, log_priority level, const quarn_log_place &place, const char *fmt,
                ...) {
   const int saved_errno = errno;
+  if (!LogScope::admits(place)) return;
   Arguments arguments;
   va_start(arguments.list, fmt);
   std::string message;

@@ -11,6 +11,7 @@
 #include "quarn_d_backup/model_entries.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/log_budget.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/write_text.h"
@@ -32,6 +33,8 @@ constexpr int kSupportedFormat = 1;
 // Entries that are only carried over may be deeper than what is read.
 constexpr int kEntryDepth = 256;
 constexpr int kPackageDepth = kEntryDepth - 2;  // an array of an object
+// Each takes more memory than its text.
+constexpr std::size_t kMaxDevices = 4096;
 
 constexpr char kCompanionListName[] = "/shared/data/app_list.txt";
 constexpr mode_t kPrivateFile = 0600;
@@ -104,13 +107,13 @@ struct own_entry {
 };
 
 /** Parse a device's entry, its packages one by one. @return false when it is not JSON */
-bool parse_entry(std::string_view text, own_entry *parsed, bool *too_deep) {
+bool parse_entry(std::string_view text, own_entry *parsed, bool *beyond) {
   list_text parts = take_list_apart(text, kPkgList);
-  parsed->entry.reset(parse_whole_json(parts.frame, kEntryDepth, too_deep));
+  parsed->entry.reset(parse_whole_json(parts.frame, kEntryDepth, beyond));
   // null is a value like any other, but has no object
   if (!parsed->entry && text != "null") return false;
   for (const std::string_view &package : parts.entries) {
-    const JsonPtr value(parse_whole_json(package, kPackageDepth, too_deep));
+    const JsonPtr value(parse_whole_json(package, kPackageDepth, beyond));
     if (!value && package != "null") return false;
   }
   parsed->packages = std::move(parts.entries);
@@ -119,12 +122,14 @@ bool parse_entry(std::string_view text, own_entry *parsed, bool *too_deep) {
 
 /**
  * Read every entry and keep the first of this device.
- * @return false when one of them is not JSON
+ * @return false when one of them is not JSON, or there is more than can be read
  */
-bool find_own_entry(const list_text &list, const char *serial, own_entry *own, bool *too_deep) {
+bool find_own_entry(const list_text &list, const char *serial, own_entry *own, bool *beyond) {
+  *beyond = list.entries.size() > kMaxDevices;
+  if (*beyond) return false;
   for (std::size_t i = 0; i < list.entries.size(); ++i) {
     own_entry read;
-    if (!parse_entry(list.entries[i], &read, too_deep)) return false;
+    if (!parse_entry(list.entries[i], &read, beyond)) return false;
     if (own->entry) continue;
     const char *entry_serial =
         text_member(member(read.entry.get(), kBackupInfo, json_type_object), kSerialNumber);
@@ -252,16 +257,16 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
 
   ctx->app_list_root.reset(generate_new_json_tokener_parser(ctx, list.frame.c_str()));
   own_entry own;
-  bool too_deep = false;
+  bool beyond = false;
   notes_of(ctx).list_understood = false;
   if (!ctx->app_list_root) {
-    parse_whole_json(list.frame, JSON_TOKENER_DEFAULT_DEPTH, &too_deep);
-  } else if (!find_own_entry(list, serial, &own, &too_deep)) {
+    parse_whole_json(list.frame, JSON_TOKENER_DEFAULT_DEPTH, &beyond);
+  } else if (!find_own_entry(list, serial, &own, &beyond)) {
     release_json_resource_of_app_list(ctx);
   }
   if (!ctx->app_list_root) {
     LOGI("json token error");
-    ctx->keep_cloud_list = too_deep;
+    ctx->keep_cloud_list = beyond;
     return QUARN_OK;
   }
 
@@ -302,6 +307,7 @@ void get_previous_package_list_info(backup_context *ctx,
     LOGI("no previous package list in old app list");
     return;
   }
+  LogBudget refused("the previous package list");
   for (std::size_t i = 0; i < packages.size(); ++i) {
     const JsonPtr owned(parse_whole_json(packages[i], kPackageDepth, nullptr));
     json_object *element = owned.get();
@@ -309,7 +315,7 @@ void get_previous_package_list_info(backup_context *ctx,
     const char *version = text_member(element, kVersion);
     if (pkg_id == nullptr || version == nullptr || !is_safe_path_component(pkg_id) ||
         !is_safe_path_component(version)) {
-      LOGE("refused entry %zu of previous package list", i);
+      if (refused.take()) LOGE("refused entry %zu of previous package list", i);
       continue;
     }
     pkg_information info;

@@ -26,6 +26,12 @@ constexpr char kWaitedForSuffix[] = ".waited_for.";
 constexpr char kArchiveSuffix[] = ".zip";
 /** How often an upload is begun again that was aborted for somebody else's sake. */
 constexpr int kMaxTimesAborted = 8;
+/**
+ * Folders that one run deletes, and children that it takes from one listing: no device leaves more
+ * behind between two runs, but a server may say so, and each request has its memory and time.
+ */
+constexpr unsigned int kMaxDeletions = 500;
+constexpr std::size_t kMaxChildren = 10000;
 
 /** A transfer of the application list. */
 struct app_list_transfer {
@@ -353,11 +359,15 @@ void delete_listed_folders(const cleanup_listing &record, const cleanup_kind &ki
     if (!is_child_of(record.folder, child.path) || uploaded_by_single_request(child.path)) continue;
     const std::string name = child.path.substr(record.folder.size());
     if (!may_remove(record, record.package.empty() ? name : record.package)) continue;
+    if (notes_of(record.ctx.get()).deletions++ >= kMaxDeletions) {
+      LOGW("clean up of cloud folder [%s] goes on with the next backup", record.folder.c_str());
+      return;
+    }
     request_folder_deletion(record.ctx.get(), kind, child.path);
   }
 }
 
-/** Keep one page. @return true when there are more */
+/** Keep one page. @return true when there are more to be had */
 bool collect_page(cleanup_listing *record, const backup_trans_child_list_s *list) {
   if (list == nullptr) return false;
   for (int i = 0; i < list->count; ++i) {
@@ -367,7 +377,7 @@ bool collect_page(cleanup_listing *record, const backup_trans_child_list_s *list
     while (path.size() > 1 && path.back() == '/') path.pop_back();
     record->children.push_back({std::move(path), child.is_file});
   }
-  return list->more && list->count > 0;
+  return list->more && list->count > 0 && record->children.size() < kMaxChildren;
 }
 
 void __backup_trans_serial_child_list_resp_cb(backup_trans_error_code error, void *user_data,

@@ -8,6 +8,13 @@
 namespace {
 
 constexpr char kEntryPlaceholder[] = "null";
+// No list that a device wrote comes near these; one that does would not fit the daemon's memory.
+constexpr std::size_t kMaxEntries = 200000;
+constexpr std::size_t kMaxParsedSize = std::size_t{8} << 20;
+// What json-c takes for a value, about: a table of members, a member with its key, a place.
+constexpr std::size_t kContainerSize = 1024;
+constexpr std::size_t kValueSize = 256;
+constexpr std::size_t kNullSize = 48;
 
 using TokenerPtr = Handle<json_tokener, &json_tokener_free>;
 
@@ -97,7 +104,7 @@ bool split_array(std::string_view array, std::vector<std::string_view> *elements
   if (!scanner.take('[') || scanner.at(']')) return false;
   do {
     std::string_view element;
-    if (!scanner.take_value(&element)) return false;
+    if (elements->size() == kMaxEntries || !scanner.take_value(&element)) return false;
     elements->push_back(element);
   } while (scanner.take(','));
   return scanner.take(']');
@@ -120,6 +127,27 @@ std::string_view find_value(std::string_view text, const char *wanted) {
   return found;
 }
 
+/** Whether a text's values fit into memory; the bytes of its strings are those of the text. */
+bool fits_memory(std::string_view text) {
+  std::size_t size = 0;
+  bool in_string = false;
+  for (std::size_t i = 0; i < text.size() && size <= kMaxParsedSize; ++i) {
+    const char c = text[i];
+    if (in_string && c == '\\') {
+      ++i;
+    } else if (c == '"') {
+      in_string = !in_string;
+    } else if (!in_string && (c == '{' || c == '[')) {
+      size += kContainerSize;
+    } else if (!in_string && c == ',') {
+      const std::size_t next = text.find_first_not_of(" \t\r\n", i + 1);
+      const bool is_null = next != std::string_view::npos && text[next] == 'n';
+      size += is_null ? kNullSize : kValueSize;
+    }
+  }
+  return size <= kMaxParsedSize;
+}
+
 }  // namespace
 
 list_text take_list_apart(std::string_view text, const char *key) {
@@ -140,7 +168,10 @@ list_text take_list_apart(std::string_view text, const char *key) {
   return result;
 }
 
-json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep) {
+json_object *parse_whole_json(std::string_view text, int depth, bool *beyond) {
+  const bool fits = fits_memory(text);
+  if (beyond != nullptr) *beyond = !fits;
+  if (!fits) return nullptr;
   const TokenerPtr tokener(json_tokener_new_ex(depth));
   if (!tokener) return nullptr;
   json_tokener_set_flags(tokener.get(), JSON_TOKENER_STRICT);
@@ -149,7 +180,7 @@ json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep) 
   JsonPtr value(
       json_tokener_parse_ex(tokener.get(), whole.c_str(), static_cast<int>(whole.size() + 1)));
   const json_tokener_error error = json_tokener_get_error(tokener.get());
-  if (too_deep != nullptr) *too_deep = error == json_tokener_error_depth;
+  if (beyond != nullptr) *beyond = error == json_tokener_error_depth;
   if (error != json_tokener_success) return nullptr;
   return value.release();
 }

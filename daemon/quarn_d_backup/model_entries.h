@@ -30,16 +30,18 @@ struct list_text {
 /**
  * Take the text of an object apart, at the array under @p key. Nothing is
  * checked beyond what tells one value from the next: parse the frame and the
- * entries afterwards. A text without entries is all frame.
+ * entries afterwards. A text without entries, or with more than any device
+ * could have written, is all frame.
  */
 list_text take_list_apart(std::string_view text, const char *key);
 
 /**
  * Parse exactly one JSON value.
- * @param[out] too_deep the value is nested deeper than @p depth; may be null
+ * @param[out] beyond the value is nested deeper than @p depth, or has more values than the daemon's
+ *   memory is for; may be null
  * @return null when the text is anything else
  */
-json_object *parse_whole_json(std::string_view text, int depth, bool *too_deep);
+json_object *parse_whole_json(std::string_view text, int depth, bool *beyond);
 
 /** A value that is written as @p text, which must be JSON; null when memory is out. */
 json_object *new_json_from_text(std::string_view text);

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <utility>
 
+#include "log_scope.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
@@ -120,6 +121,7 @@ class Clearing {
   /** @return true when no file is left that there was not */
   bool run() {
     LOGI("clearing app data backup directory");
+    const LogScope scope("what a restore has left");
     const ActAsPackage acting(user_);
     for (const auto &dir : files_.dirs) clear(dir);
     return cleared_;
@@ -234,6 +236,7 @@ class MovingBack {
 
   /** @return true when everything below @p dir, in the snapshot, is in its place */
   bool run(const std::string &dir) {
+    const LogScope scope(dir);
     TreePlace source(safe_open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
     if (!source) {
       LOGE("error : cannot open this path %s", dir.c_str());

@@ -7,6 +7,7 @@
 #include <cstring>
 #include <utility>
 
+#include "log_scope.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/disk_sync.h"
@@ -182,6 +183,7 @@ class SnapshotCopy {
 
   /** @return true when everything below @p dir was recorded and copied */
   bool copy(const std::string &dir) {
+    const LogScope scope(dir);
     TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
                     TreeAccess::kPackage);
     if (!place) {

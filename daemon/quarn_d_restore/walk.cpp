@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "log_scope.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/archive_table.h"
@@ -334,6 +335,7 @@ int restore_app_info(const char *pkgid, const char *root) {
 }
 
 void settle_unpacked_files(const char *pkgid, const char *root) {
+  const LogScope scope(root);
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
   for (const auto &dir : files.dirs) {
@@ -353,12 +355,14 @@ void settle_unpacked_files(const char *pkgid, const char *root) {
 
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table) {
+  const LogScope scope(dir);
   const HeldFolder package(root);
   const walk_context ctx{pkgid, root, table, restore_files(pkgid, root)};
   return walk_directory(ctx, dir);
 }
 
 int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table) {
+  const LogScope scope(root);
   const HeldFolder package(root);
   json_object *list = nullptr;
   if (!json_object_object_get_ex(table, kLinkListKey, &list) ||
@@ -379,6 +383,7 @@ int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table)
 }
 
 void clear_app_dir(const char *pkgid, const char *root) {
+  const LogScope scope(root);
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
   LOGI("clearing app data backup directory");

@@ -8,6 +8,7 @@
 #include <climits>
 #include <cstring>
 
+#include "log_scope.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/file_crc.h"
 #include "quarn_d_utils/quarn_d_utils.h"
@@ -82,6 +83,7 @@ bool search_folder(int dir, const std::string &path, std::vector<std::string> *f
 
 /** True when a regular file lies anywhere below the open directory, whose path is @p path. */
 bool search_for_files(UniqueFd dir, std::string path) {
+  const LogScope scope(path);
   TreePlace place(std::move(dir));
   std::vector<std::vector<std::string>> pending(1);
   bool found = search_folder(place.fd(), path, &pending.back());
@@ -128,6 +130,7 @@ bool delete_file_at(int dir, const char *name) {
 
 /** Empty a directory but for the entry whose full path is @p keep (null: nothing is kept). */
 bool empty_directory(const char *path_text, const char *keep) {
+  const LogScope scope(path_text);
   const DirPtr dir = safe_opendir(path_text);
   if (dir == nullptr) {
     LOGE("error : cannot open this path %s", path_text);

@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "log_scope.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/safe_path.h"
 #include "quarn_log.h"
@@ -197,6 +198,7 @@ bool list_tree_entries(int dir, std::vector<TreeEntry> *entries) {
 
 bool delete_tree_at(int parent, const char *name, const std::string &path, OtherTypes others,
                     TreeAccess access, const struct stat *looked_at) {
+  const LogScope scope(path);
   Removal removal(parent, path, others, access);
   if (access == TreeAccess::kDaemon) return removal.run(name, looked_at);
   const ActAsPackage acting;

@@ -9,6 +9,7 @@
 #include <utility>
 #include <vector>
 
+#include "log_scope.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/codec.h"
@@ -30,6 +31,7 @@ constexpr int kRaw = 1;
 constexpr const char *kDataDirs[] = {"data/", "shared/data/", "shared/trusted/"};
 
 constexpr char kNoData[] = "it does not belong to the application's data";
+constexpr char kWorkingFile[] = "it is a working file of a restore";
 
 enum class Extracted { kDone, kFolder, kRefused, kFailed };
 
@@ -262,8 +264,10 @@ class Unpacker {
     std::string path = name;
     path.pop_back();
     const char *why = path.size() + 1 != info.size_filename ? "its name holds a NUL"
-                      : is_data_place(path + "/")           ? name_refusal(path)
-                                                            : kNoData;
+                      // a folder there would keep the table out for good
+                      : path == table_            ? kWorkingFile
+                      : is_data_place(path + "/") ? name_refusal(path)
+                                                  : kNoData;
     if (why != nullptr) {
       refuse(name, why);
       return;
@@ -308,7 +312,8 @@ class Unpacker {
       }
       start = end + 1;
     }
-    if (working_.contain(destination_ + "/" + path)) return "it is a working file of a restore";
+    if (path.compare(0, table_.size() + 1, table_ + "/") == 0) return kWorkingFile;
+    if (working_.contain(destination_ + "/" + path)) return kWorkingFile;
     return nullptr;
   }
 
@@ -626,6 +631,7 @@ int unpack_entry(Unpacker *unpacker, const Archive &from, Announced *announced, 
 /** Everything of an archive that was looked at; its first entry is the current one. */
 int unpack_entries(const char *pkg_id, const char *destination, const Archive &archive,
                    unzip_report *report) {
+  const LogScope scope(std::string("the archive of ") + pkg_id);
   Unpacker unpacker(pkg_id, destination);
   Announced announced(archive.file->size());
   CString name;

@@ -5,6 +5,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "log_scope.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/package_directory.h"
@@ -646,6 +647,7 @@ struct PackRequest {
 /** Pack into the open archive, whose library handle is @p zip. */
 void pack_into(const PackRequest &request, const PackageRoot &package, file_info_table_h *table,
                ArchiveFile *file, zipFile zip) {
+  const LogScope scope(std::string("the data of ") + request.pkg_id);
   Packing current(file, request.zip_path, request.bounds, request.stop);
   packing = &current;
   pack_all(request.pkg_id, request.root, zip, table, request.error);

@@ -25,6 +25,8 @@ TRANSFER_FAILED = 12
 CANCELLED = 17
 #: Bytes that an attack may take beside what the daemon has at rest.
 MOST_MEMORY = 8 << 20
+#: The same where the largest list there may be is taken apart and written anew.
+MOST_LIST_MEMORY = 40 << 20
 #: Bytes of the log that one attack may fill.
 MOST_LOG = 256 << 10
 
@@ -125,10 +127,10 @@ class ServerTest(TestCase):
                 found[path[len(top):]] = (status.st_mode, status.st_uid, status.st_gid, content)
         return found
 
-    def assert_unharmed(self):
+    def assert_unharmed(self, memory=MOST_MEMORY):
         self.assertEqual(self.device.daemon_pid(), self.pid, "the daemon is another one")
         if not is_sanitized(os.path.join(BIN_DIR, "quarnd")):
-            self.assertLess(number(self.pid, "VmHWM") - self.memory, MOST_MEMORY)
+            self.assertLess(number(self.pid, "VmHWM") - self.memory, memory)
         self.assertLess(len(self.device.log()) - self.log, MOST_LOG)
         self.assertEqual(self.tree(), self.before)
 
@@ -161,13 +163,27 @@ class Lists(ServerTest):
         self.assertLess(line.count("y"), 256)
         self.assert_unharmed()
 
+    def backup(self):
+        self.ask("manual_backup_start", None, "(u)")
+        self.client.until(lambda: [one for _, one in self.client.callbacks("manual_backup_status")
+                                   if one[1] != 2 and one[2] == self.count],
+                          "the end of the backup")
+        return self.client.callbacks("manual_backup_status")[-1][1][:2]
+
     def test_the_run_of_a_backup_is_as_careful(self):
         self.cloud.put(LIST, self.cloud.endless())
-        call, _ = self.ask("manual_backup_start", None, "(u)")
-        self.client.until(lambda: [one for one in self.client.callbacks("manual_backup_status")
-                                   if one[1][1] != 2], "the end of the backup")
-        self.assertEqual(self.client.callbacks("manual_backup_status")[-1][1][:2], (13, 5))
+        self.assertEqual(self.backup(), (13, 5))
         self.assert_unharmed()
+
+    def test_a_run_takes_no_memory_for_a_million_values(self):
+        objects = b"[" + b"{}," * 1300000 + b"{}]"
+        own = b'{"backup_info":{"serial_number":"%s"},%%s}' % SERIAL.encode()
+        for entries in (b"0," * 2000000 + b"0", b'{"a":%s}' % objects, own % (b'"a":' + objects),
+                        own % (b'"pkg_list":' + objects), own % (b'"pkg_list":[%s]' % objects)):
+            self.cloud.put(LIST, b'{"format_ver":1,"model_list":[%s]}' % entries)
+            self.assertEqual(self.backup(), (12, 5))
+            self.device.wait_for_log("json token error")
+            self.assert_unharmed(MOST_LIST_MEMORY)
 
 
 class Downloads(ServerTest):

@@ -224,6 +224,42 @@ TEST_F(AppListDocument, TextThatIsNestedTooDeeplyIsNeverReplaced) {
   }
 }
 
+TEST_F(AppListDocument, TextOfMoreValuesThanMemoryIsForIsNeverReplacedNorTakenIn) {
+  const auto many = [](const std::string &value) {
+    std::string text = "[" + value;
+    for (int i = 0; i < 300000; ++i) text += "," + value;
+    return text + "]";
+  };
+  const std::string other = R"({"backup_info":{"serial_number":"A"},"x":)";
+  const std::string own = own_entry("[]");
+  const std::string member = own.substr(0, own.size() - 1) + R"(,"x":)";
+  for (const std::string &text :
+       {many("{}"), R"({"format_ver":1,"x":)" + many("[]") + "}", list_of(many("0")),
+        R"({"format_ver":1,"model_list":)" + many("0") + "}",
+        R"({"format_ver":1,"model_list":)" + many("null") + "}", list_of(other + many("{}") + "}"),
+        list_of(member + many("{}") + "}"), list_of(own_entry(many("{}"))),
+        list_of(own_entry("[" + many("{}") + "]"))}) {
+    clear_captured_log();
+    ctx_.reset(new backup_context);
+    ctx_->serial_number = kSerial;
+    ASSERT_TRUE(create(text));
+    EXPECT_EQ(count_logged(DLOG_INFO, "json token error"), 1) << text.substr(0, 100);
+    EXPECT_EQ(ctx_->app_list_root, nullptr);
+    EXPECT_TRUE(ctx_->keep_cloud_list);
+  }
+}
+
+TEST_F(AppListDocument, AsManyPackagesAsAListHoldsAreTakenIn) {
+  std::string packages;
+  for (int i = 0; i < 50000; ++i) {
+    packages += (i == 0 ? "" : ",") +
+                (R"({"pkg_id":"org.)" + std::to_string(i) + R"(","version":"1.0","crc":7})");
+  }
+  ASSERT_TRUE(create(list_of(kEntryA + "," + own_entry("[" + packages + "]"))));
+  EXPECT_EQ(ctx_->previous_pkg_list.size(), 50000U);
+  EXPECT_NE(saved().find(kEntryA), std::string::npos);
+}
+
 TEST_F(AppListDocument, OtherFormatVersionIsNeverReplacedAndGivesNoPreviousCrc) {
   const std::string own = own_entry(R"([{"pkg_id":"p","version":"1","crc":5}])");
   for (const char *version :
@@ -296,6 +332,17 @@ TEST_F(AppListDocument, PreviousEntriesThatAreNotUnderstoodAreLeftOut) {
                                       "under 1 0", "max 1 2147483647", "null 1 0"));
   EXPECT_EQ(count_logged(DLOG_ERROR, "refused entry 0 of previous package list"), 1);
   EXPECT_EQ(count_logged(DLOG_ERROR, "refused entry 13 of previous package list"), 1);
+}
+
+TEST_F(AppListDocument, AnyNumberOfEntriesThatAreNotUnderstoodIsAHundredLinesAndOne) {
+  std::string packages = "0";
+  for (int i = 0; i < 100000; ++i) packages += ",0";
+  ASSERT_TRUE(create(list_of(own_entry("[" + packages + "]"))));
+  EXPECT_EQ(count_logged(DLOG_ERROR, "refused entry 99 of previous package list"), 1);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "refused entry 100 of previous package list"), 0);
+  EXPECT_EQ(
+      count_logged(DLOG_WARN, "99901 more such lines on the previous package list are left out"),
+      1);
 }
 
 // Damaged texts of every kind: what is written afterwards is JSON, and whoever

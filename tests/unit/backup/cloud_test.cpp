@@ -522,6 +522,38 @@ TEST_F(Cloud, FoldersAfterTheFirstHundredAreFoundBeforeAnyIsRemoved) {
   EXPECT_EQ(info("clean up cloud items end"), 1);
 }
 
+TEST_F(Cloud, WhateverAListingNamesOneRunDeletesFiveHundredFoldersAndTheNextGoesOn) {
+  for (int i = 0; i < 700; ++i) {
+    cloud_.objects[in_device("org.gone" + std::to_string(1000 + i) + "/1/a.zip")] = "x";
+  }
+  delete_other_backup_items_in_cloud(ctx_.get());
+  delete_other_version_in_cloud(ctx_.get(), kSerial, "org.gone1699", "2");
+  cloud_.answer_all();
+  EXPECT_EQ(cloud_.objects.size(), 200U) << "both kinds count together";
+  EXPECT_EQ(ctx_->pkg_delete_pending, 0);
+  EXPECT_EQ(count_logged(DLOG_WARN,
+                         "clean up of cloud folder [/350000000000001/] goes on with the next "
+                         "backup"),
+            1);
+  ctx_.reset(new backup_context);
+  ctx_->serial_number = kSerial;
+  ctx_->package_walk_complete = true;
+  delete_other_backup_items_in_cloud(ctx_.get());
+  cloud_.answer_all();
+  EXPECT_THAT(cloud_.paths(), IsEmpty());
+}
+
+TEST_F(Cloud, AListingWithoutAnEndIsFollowedForTenThousandChildren) {
+  for (int i = 0; i < 10200; ++i) {
+    cloud_.objects[in_device("stray" + std::to_string(10000 + i))] = "x";
+  }
+  delete_other_backup_items_in_cloud(ctx_.get());
+  cloud_.answer_all();
+  EXPECT_EQ(cloud_.count_requests("list /350000000000001/ 9900"), 1);
+  EXPECT_EQ(cloud_.count_requests("list /350000000000001/ 10000"), 0);
+  EXPECT_EQ(ctx_->serial_clean_pending, 0);
+}
+
 TEST_F(Cloud, RefusedLaterPageRemovesNothing) {
   for (int i = 0; i < 150; ++i) {
     cloud_.objects[in_device("org.gone" + std::to_string(1000 + i) + "/1/a.zip")] = "x";

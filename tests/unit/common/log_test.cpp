@@ -5,8 +5,10 @@
 
 #include <cerrno>
 #include <limits>
+#include <thread>
 
 #include "log_capture.h"
+#include "log_scope.h"
 #include "quarn_printable.h"
 
 namespace {
@@ -113,6 +115,45 @@ TEST_F(LogLines, TheErrorOfTheCallerStays) {
   errno = ENOSPC;
   LOGE("%s", std::string(1000, '\n').c_str());
   EXPECT_EQ(errno, ENOSPC);
+}
+
+void write_lines(int count) {
+  for (int i = 0; i < count; ++i) {
+    LOGE("here %d", i);
+    LOGI("there %d", i);
+  }
+}
+
+TEST(LogScopes, EachPlaceWritesAHundredLinesAndTheRestIsCounted) {
+  clear_captured_log();
+  {
+    const LogScope scope("a tree");
+    write_lines(1000);
+    LOGE("something else");
+  }
+  EXPECT_EQ(captured_log().size(), 202U);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "here 99"), 1);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "here 100"), 0);
+  EXPECT_EQ(count_logged(DLOG_INFO, "there 99"), 1);
+  EXPECT_EQ(count_logged(DLOG_ERROR, "something else"), 1);
+  EXPECT_EQ(captured_log().back().text, "1800 more such lines on a tree are left out");
+  clear_captured_log();
+  write_lines(1000);
+  EXPECT_EQ(captured_log().size(), 2000U) << "afterwards everything is told";
+}
+
+TEST(LogScopes, AnInnerOneIsPartOfTheOuterOneAndOfNoOtherThread) {
+  clear_captured_log();
+  const LogScope other("another thread's");
+  std::thread([] {
+    const LogScope outer("outer");
+    for (int i = 0; i < 3; ++i) {
+      const LogScope inner("inner");
+      write_lines(100);
+    }
+  }).join();
+  EXPECT_EQ(captured_log().size(), 201U);
+  EXPECT_EQ(captured_log().back().text, "400 more such lines on outer are left out");
 }
 
 }  // namespace

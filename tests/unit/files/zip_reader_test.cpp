@@ -293,6 +293,30 @@ TEST_P(ZipReader, ADirectoryThatBreaksOffIsNotComplete) {
 
 /* ---- hostile names ----------------------------------------------------------- */
 
+TEST_P(ZipReader, NothingKeepsTheTableOutOfItsPlace) {
+  const std::string table = "shared/data/org.example.notes.perm";
+  EXPECT_EQ(unpack({stored_entry(table + "/", ""), deflated_entry(table + "/x", "1"),
+                    stored_entry(table + "/y/", ""), deflated_entry(table, "{}")}),
+            QUARN_OK);
+  expect_report(1, 1, 0);
+  EXPECT_EQ(content_of(root_ / table), "{}");
+  EXPECT_EQ(errors("refused archive entry " + table + "/: it is a working file of a restore"), 1);
+  EXPECT_EQ(errors("refused archive entry " + table + "/x: it is a working file of a restore"), 1);
+  EXPECT_EQ(errors("refused archive entry " + table + "/y/: it is a working file of a restore"), 1);
+}
+
+TEST_P(ZipReader, AnyNumberOfRefusedEntriesIsTwoHundredLinesAndOne) {
+  std::vector<ZipEntry> entries;
+  for (int i = 0; i < 5000; ++i) entries.push_back(deflated_entry("../" + std::to_string(i), "x"));
+  EXPECT_EQ(unpack(entries), QUARN_OK);
+  expect_report(0, 5000, 0);
+  EXPECT_EQ(captured_log().size(), 201U);
+  EXPECT_EQ(errors("refused archive entry ../99: its name leaves its place"), 1);
+  EXPECT_EQ(errors("extract_file_from_zip() failed ../99"), 1);
+  EXPECT_EQ(captured_texts().back(),
+            "9800 more such lines on the archive of org.example.notes are left out");
+}
+
 TEST_P(ZipReader, RefusesNamesThatLeaveTheirPlace) {
   for (const char *name :
        {"data/../../outside", "data/..", "../data/a", "data/./a", "data//a", "data/sub/../a"}) {

@@ -259,6 +259,17 @@ TEST_P(ZipWriter, AnotherTypeIsAnErrorAndTheRestIsPacked) {
   EXPECT_THAT(captured_texts(), ElementsAre("this is unexpected type : " + root_ / "data/pipe"));
 }
 
+TEST_P(ZipWriter, AnyNumberOfWhatCannotBePackedAndOfLinksIsAHundredLinesOfEachAndOne) {
+  for (int i = 0; i < 1000; ++i) {
+    ASSERT_EQ(mkfifo((root_ / ("data/pipe" + std::to_string(i))).c_str(), 0600), 0);
+    root_.link("data/link" + std::to_string(i), "x");
+  }
+  EXPECT_EQ(pack(), QUARN_REFUSED);
+  EXPECT_EQ(captured_log().size(), 201U);
+  EXPECT_EQ(captured_texts().back(),
+            "1800 more such lines on the data of " + std::string(kPackage) + " are left out");
+}
+
 TEST_P(ZipWriter, NamesMayHoldAnyByte) {
   const std::vector<std::string> all = {"data/two words",
                                         "data/back\\slash",

@@ -208,6 +208,15 @@ TEST_F(WalkTest, ASymbolicLinkIsLeftAsItIs) {
   EXPECT_EQ(owner_of(target), 0U);
 }
 
+TEST_F(WalkTest, AnyNumberOfWhatIsUnexpectedIsAHundredLinesAndOne) {
+  for (int i = 0; i < 1000; ++i) {
+    ASSERT_EQ(mkfifo(at("data/pipe" + std::to_string(i)).c_str(), 0600), 0);
+  }
+  EXPECT_EQ(walk("data", table({}).get()), 0);
+  EXPECT_EQ(captured_texts().size(), 101U);
+  EXPECT_EQ(captured_texts().back(), "900 more such lines on " + at("data") + " are left out");
+}
+
 TEST_F(WalkTest, AnythingElseIsUnexpected) {
   ASSERT_EQ(mkfifo(at("data/pipe").c_str(), 0600), 0);
   unpacked("data/a");

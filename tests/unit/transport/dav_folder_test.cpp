@@ -1,5 +1,9 @@
 // What a WebDAV server says of folders, and when it does not say it.
+#include <glib.h>
+
+#include "core/ticket.h"
 #include "dav_test.h"
+#include "http/http.h"
 
 using namespace harness;
 using front::Response;
@@ -205,6 +209,83 @@ TEST_F(Parent, StaysForWhatCannotBeLookedAt) {
   add_to_listings(
       "<response><href>/dav/f/a</href><status>HTTP/1.1 403 Forbidden</status></response>");
   expect_kept("/f/", {{"/f/", ""}});
+}
+
+// What lies about for a day is deleted by whoever lists it, but not for as long as a server likes.
+class Leftovers : public Parent {
+ protected:
+  void have(int count) {
+    std::string responses;
+    for (int i = 0; i < count; ++i) {
+      char digits[25];
+      g_snprintf(digits, sizeof digits, "%024x", static_cast<unsigned>(i));
+      responses += std::string("<response><href>/dav/f/.quarn-part-") + digits +
+                   "</href><propstat><prop><getlastmodified>Mon, 01 Jan 2001 00:00:00 GMT"
+                   "</getlastmodified></prop></propstat></response>";
+    }
+    Rule more{"PROPFIND", "/f/"};
+    more.fault.spoil = front::Spoil::edit;
+    more.fault.edit = [responses](Response *answer) {
+      answer->headers["Date"] = "Sun, 22 Nov 2026 12:00:00 GMT";
+      answer->body.insert(answer->body.rfind("</multistatus>"), responses);
+    };
+    server.set_rules({more, deletion_});
+    model.put("/f/o", "x");
+  }
+  void list() {
+    const AnswerPtr answer = cloud.list("/f");
+    ASSERT_TRUE(cloud.settle());
+    EXPECT_EQ(answer->code, 0);
+  }
+
+  Rule deletion_{"DELETE", "/f/"};
+};
+
+TEST_F(Leftovers, GoWithAListing) {
+  have(3);
+  list();
+  EXPECT_EQ(requests("DELETE", "/f/"), 3);
+}
+
+TEST_F(Leftovers, OfAnyNumberAreSixtyFourRequestsAListing) {
+  have(5000);
+  list();
+  EXPECT_EQ(requests("DELETE", "/f/"), 64);
+}
+
+TEST_F(Leftovers, WaitForTheNextListingWhereTheServerIsLost) {
+  deletion_.fault.spoil = front::Spoil::reset_response;
+  have(5000);
+  list();
+  EXPECT_LE(requests("DELETE", "/f/"), 2) << "the HTTP library itself repeats one";
+}
+
+// Each worker may ask for one, and together they would not fit the daemon.
+TEST_F(DavTest, OnlySoManyLongAnswersAreInMemoryAtATime) {
+  model.put("/f/long", std::string(3U << 20, 'x'));
+  model.put("/f/short", std::string(1U << 20, 'x'));
+  transport::HttpRequest request;
+  request.method = "GET";
+  request.user = DavModel::kUser;
+  request.password = "right";
+  const std::string base = "http://127.0.0.1:" + std::to_string(server.port()) + DavModel::kRoot;
+  const auto ask = [&](const char *path) {
+    transport::Ticket ticket;
+    request.url = base + path;
+    return transport::http_perform(ticket, request);
+  };
+  std::vector<transport::HttpAnswer> answers;
+  for (int i = 0; i < transport::kMaxLongAnswers; ++i) {
+    answers.push_back(ask("/f/long"));
+    EXPECT_TRUE(answers.back().good()) << answers.back().problem.message;
+  }
+  const transport::HttpAnswer refused = ask("/f/long");
+  EXPECT_EQ(refused.problem.message, "the server's answers are too long together");
+  EXPECT_TRUE(refused.problem.transient);
+  EXPECT_TRUE(ask("/f/short").good());
+  answers.pop_back();
+  EXPECT_TRUE(ask("/f/long").good());
+  EXPECT_TRUE(ask("/f/long").good()) << "one that nobody has any more takes no room";
 }
 
 INSTANTIATE_TEST_SUITE_P(Answers, PrunedFolder, ::testing::Values(404, 409, 201));

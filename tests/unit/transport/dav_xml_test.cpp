@@ -1,4 +1,5 @@
 #include <glib.h>
+#include <sys/resource.h>
 
 #include "harness.h"
 #include "webdav/dav_xml.h"
@@ -26,6 +27,13 @@ std::vector<std::string> parsed(const std::string &xml, const std::string &host 
   std::vector<std::string> texts;
   for (const DavEntry &entry : entries) texts.push_back(text_of(entry));
   return texts;
+}
+
+/** Bytes that this process has had at the most. */
+std::size_t most_memory() {
+  rusage usage{};
+  getrusage(RUSAGE_SELF, &usage);
+  return static_cast<std::size_t>(usage.ru_maxrss) << 10;
 }
 
 using Texts = std::vector<std::string>;
@@ -360,6 +368,44 @@ TEST(DavXml, WhatIsNoLock) {
         lock_document("<D:activelock><D:locktoken/></D:activelock>"), std::string("garbage"),
         std::string(R"(<D:activelock xmlns:D="DAV:"/>)"), std::string("<!DOCTYPE m>") + "<m/>"})
     EXPECT_FALSE(parse_lock(xml, kHost, &lock)) << xml;
+}
+
+// It is sent back in a header.
+TEST(DavXml, ATokenThatWouldEndAHeaderIsNone) {
+  for (const char *token : {"t&#13;&#10;X-Other: 1", "t&#10;x", "a b", "a&gt; &lt;b", "\xc3\xa4"}) {
+    const std::string xml =
+        lock_document("<D:activelock><D:owner>me</D:owner><D:locktoken><D:href>" +
+                      std::string(token) + "</D:href></D:locktoken></D:activelock>");
+    DavLock lock;
+    EXPECT_FALSE(parse_lock(xml, kHost, &lock)) << token;
+    EXPECT_EQ(transport::parse_lock_token(xml, "me"), "") << token;
+  }
+}
+
+std::string many(const std::string &element, std::size_t count) {
+  std::string text;
+  for (std::size_t i = 0; i < count; ++i) text += element;
+  return text;
+}
+
+// Each node is a hundred times its bytes.
+TEST(DavXml, OneResponseOfAMillionElementsIsRefusedAndTakesNoMemory) {
+  const std::size_t before = most_memory();
+  for (const std::string &content : {many("<a/>", 4000000), many("<a b='' c=''/>", 1000000),
+                                     many("<a>x", 200) + many("<b/>", 4000000)}) {
+    EXPECT_EQ(parsed(document("<D:response>" + content + "</D:response>")), Texts{"refused"});
+    const std::string lock = document("<D:activelock>" + content + "</D:activelock>");
+    transport::DavLock found;
+    EXPECT_FALSE(transport::parse_lock(lock, kHost, &found));
+    EXPECT_EQ(transport::parse_lock_token(lock, "owner"), "");
+  }
+  EXPECT_LT(most_memory() - before, std::size_t{96} << 20);
+}
+
+TEST(DavXml, AListingOfAsManyResponsesAsThereMayBeIsReadAndALongerOneIsNone) {
+  const std::string response = "<D:response><D:href>/f/o</D:href></D:response>";
+  EXPECT_EQ(parsed(document(many(response, 50000))).size(), 50000U);
+  EXPECT_EQ(parsed(document(many(response, 50001))), Texts{"refused"});
 }
 
 }  // namespace

@@ -37,6 +37,28 @@ TEST(S3Listing, HoldsObjectsAndPrefixes) {
   EXPECT_EQ(listing.next, "");
 }
 
+TEST(S3Listing, OfMoreThanAnyPageHoldsIsNone) {
+  std::string text = "<ListBucketResult><IsTruncated>false</IsTruncated>";
+  for (int i = 0; i < 100000; ++i) text += "<a/>";
+  S3Listing listing;
+  EXPECT_FALSE(parse_s3_listing(text + "</ListBucketResult>", &listing));
+}
+
+TEST(S3Listing, APageOfTheLongestNamesWithAllThatServicesTellIsRead) {
+  std::string text = "<ListBucketResult><EncodingType>url</EncodingType>";
+  for (int i = 0; i < 1000; ++i) {
+    text += "<Contents><Key>" + std::string(3000, 'k') +
+            "</Key><LastModified>t</LastModified><ETag>&quot;e==&quot;</ETag><Size>1</Size>"
+            "<ChecksumAlgorithm>c</ChecksumAlgorithm><ChecksumType>f</ChecksumType>"
+            "<Owner><ID>i</ID><DisplayName>d</DisplayName></Owner>"
+            "<RestoreStatus><IsRestoreInProgress>f</IsRestoreInProgress></RestoreStatus>"
+            "<StorageClass>s</StorageClass></Contents>";
+  }
+  S3Listing listing;
+  ASSERT_TRUE(parse_s3_listing(text + "</ListBucketResult>", &listing));
+  EXPECT_EQ(listing.objects.size(), 1000U);
+}
+
 TEST(S3Listing, TellsWhereToGoOn) {
   S3Listing listing;
   ASSERT_TRUE(

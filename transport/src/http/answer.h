@@ -6,6 +6,7 @@
 #define BACKUP_TRANSPORT_ANSWER_H
 
 #include <map>
+#include <memory>
 #include <string>
 
 #include "core/outcome.h"
@@ -17,6 +18,8 @@ struct HttpAnswer {
   std::string reason;                         /**< the status in the server's words; may be empty */
   std::map<std::string, std::string> headers; /**< names in lower case */
   std::string body;
+  /** Counts a long body among those in memory, until the last copy has gone. */
+  std::shared_ptr<void> room;
   /** Why there was no complete answer; its code is set then. */
   Outcome problem;
 

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cstdlib>
 #include <cstring>
 #include <limits>
@@ -100,6 +101,24 @@ bool is_too_large(const Exchange &exchange, std::size_t more) {
              limit;
 }
 
+std::atomic<int> long_answers{0};
+
+// Null when there are as many as there may be.
+std::shared_ptr<void> take_room() {
+  if (++long_answers <= kMaxLongAnswers) {
+    return {nullptr, [](void *) { --long_answers; }};
+  }
+  --long_answers;
+  return nullptr;
+}
+
+bool fits_memory(Exchange *exchange) {
+  if (exchange->sunk <= kShortAnswerBytes) return true;
+  if (exchange->answer.room.use_count() == 0) exchange->answer.room = take_room();
+  exchange->too_many = exchange->answer.room.use_count() == 0;
+  return !exchange->too_many;
+}
+
 std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *data) {
   Exchange &exchange = *static_cast<Exchange *>(data);
   const std::size_t length = size * count;
@@ -115,7 +134,7 @@ std::size_t take_body(char *buffer, std::size_t size, std::size_t count, void *d
   }
   exchange.sunk += length;
   exchange.too_long = exchange.sunk > kMaxAnswerBytes;
-  if (exchange.too_long) return 0;
+  if (exchange.too_long || (success && !fits_memory(&exchange))) return 0;
   const std::size_t room = success ? length : kMaxErrorBytes - exchange.answer.body.size();
   exchange.answer.body.append(buffer, std::min(length, room));
   return length;
@@ -319,6 +338,12 @@ Outcome problem_of(const Curl &curl, const Exchange &exchange, CURLcode code) {
     return failure(BACKUP_TRANS_ERROR_TOO_LARGE, "the object is larger than it may be");
   if (exchange.too_long)
     return failure(BACKUP_TRANS_ERROR_SERVER, "the server's answer is too long");
+  if (exchange.too_many) {
+    Outcome later =
+        failure(BACKUP_TRANS_ERROR_SERVER, "the server's answers are too long together");
+    later.transient = true;
+    return later;
+  }
   std::string text = exchange.error[0] != '\0' ? exchange.error : curl.easy_strerror(code);
   switch (code) {
     case CURLE_PEER_FAILED_VERIFICATION:

@@ -53,6 +53,7 @@ struct Exchange {
   bool local_failure = false;
   bool too_long = false;
   bool too_large = false;        // for the request's sink
+  bool too_many = false;         // long answers at a time
   std::size_t header_bytes = 0;  // of every answer so far
   uint64_t sunk = 0;
   char error[CURL_ERROR_SIZE] = "";

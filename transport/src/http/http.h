@@ -25,6 +25,10 @@ constexpr std::chrono::seconds kStallTime{30};
 
 /** Answers that are kept in memory are cut off with an error beyond this. */
 constexpr std::size_t kMaxAnswerBytes = 16 * 1024 * 1024;
+/** Of longer ones so many are in memory at a time; one that comes beside them is a transient error.
+ */
+constexpr std::size_t kShortAnswerBytes = 2 * 1024 * 1024;
+constexpr int kMaxLongAnswers = 2;
 /** Of one that is no success so much is kept: it says why, and no more. */
 constexpr std::size_t kMaxErrorBytes = 64 * 1024;
 /** The same for the headers of all answers to one request. */

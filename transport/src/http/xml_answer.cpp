@@ -4,13 +4,18 @@
 #include <libxml/parser.h>
 #include <libxml/xmlreader.h>
 
+#include <algorithm>
 #include <atomic>
+#include <string_view>
 
 #include "lazy_xml.h"
 
 namespace transport {
 namespace {
 
+// Signs of tags and attributes in what is in memory at one time: a page of a listing has a third.
+// Each can be a node, of a hundred times its bytes.
+constexpr std::ptrdiff_t kMaxSigns = 65536;
 constexpr int kOptions = XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING;
 
 struct ReaderFree {
@@ -32,13 +37,36 @@ bool has_document_type(const std::string &text) {
   return text.find("<!DOCTYPE") != std::string::npos;
 }
 
+std::ptrdiff_t signs_in(std::string_view text) {
+  return std::count_if(text.begin(), text.end(), [](char c) { return c == '<' || c == '='; });
+}
+
+/** A document on its way to a reader, which is told of no more of it than it may keep. */
+struct Source {
+  std::string_view left;
+  std::ptrdiff_t signs = 0;  // since the last element that was done with
+  bool is_too_much = false;
+};
+
+int take_piece(void *data, char *buffer, int size) {
+  auto *const source = static_cast<Source *>(data);
+  const std::string_view piece = source->left.substr(0, static_cast<std::size_t>(size));
+  source->signs += signs_in(piece);
+  source->is_too_much = source->signs > kMaxSigns;
+  if (source->is_too_much) return -1;
+  piece.copy(buffer, piece.size());
+  source->left.remove_prefix(piece.size());
+  return static_cast<int>(piece.size());
+}
+
 }  // namespace
 
 bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)> &root,
               const std::function<void(const xmlNode *)> &child) {
   if (!library_serves() || has_document_type(text)) return false;
+  Source source{text};
   const std::unique_ptr<xmlTextReader, ReaderFree> reader(
-      xmlReaderForMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr, kOptions));
+      xmlReaderForIO(&take_piece, nullptr, &source, nullptr, nullptr, kOptions));
   if (reader == nullptr) return false;
   int read = xmlTextReaderRead(reader.get());
   while (read == 1) {
@@ -51,13 +79,15 @@ bool read_xml(const std::string &text, const std::function<bool(const xmlNode *)
       if (node == nullptr) return false;
       child(node);
     }
+    source.signs = 0;
     read = depth == 1 ? xmlTextReaderNext(reader.get()) : xmlTextReaderRead(reader.get());
   }
-  return read == 0;
+  return read == 0 && !source.is_too_much;
 }
 
 XmlAnswer parse_xml(const std::string &text) {
   if (text.empty() || !library_serves() || has_document_type(text)) return nullptr;
+  if (signs_in(text) > kMaxSigns) return nullptr;
   XmlAnswer document(
       xmlReadMemory(text.data(), static_cast<int>(text.size()), nullptr, nullptr, kOptions));
   if (document && document->intSubset != nullptr) document.reset();

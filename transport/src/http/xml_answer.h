@@ -18,14 +18,18 @@ struct XmlFree {
 };
 using XmlAnswer = std::unique_ptr<xmlDoc, XmlFree>;
 
-/** Null when it is no well-formed document, or has a document type. */
+/**
+ * Null when it is no well-formed document, has a document type, or more elements and attributes
+ * than an answer that is read as a whole can have.
+ */
 [[nodiscard]] XmlAnswer parse_xml(const std::string &text);
 
 /**
  * Read a document element by element, so that a long one takes no more memory than its text.
  * @param root called with the outermost element, without what is in it
  * @param child called with each element right below it, with all that is in that one
- * @return false when it is no well-formed document, has a document type, or @p root is false
+ * @return false when it is no well-formed document, has a document type, @p root is false, or a
+ *   single child has more elements and attributes than an answer can have
  */
 [[nodiscard]] bool read_xml(const std::string &text,
                             const std::function<bool(const xmlNode *)> &root,

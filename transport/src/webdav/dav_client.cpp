@@ -10,6 +10,8 @@ namespace transport {
 namespace {
 
 constexpr int64_t kLeftoverSeconds = 24L * 60 * 60;
+// So many of them go with one listing: whoever names more than uploads leave is not believed.
+constexpr int kMaxSwept = 64;
 constexpr int kRedirection = 3;
 constexpr int kUnlockAttempts = 2;
 constexpr int kStatusClass = 100;
@@ -175,8 +177,14 @@ Outcome DavClient::list(Ticket &ticket, const std::string &folder, DavListing *l
   if (!read_listing(answer, folder, listing, &temporary, &is_folder)) return no_listing("list");
   if (!is_folder) return no_such_object();
   const std::optional<int64_t> now = parse_http_date(answer.header("date"));
+  int left = kMaxSwept;
   for (const DavEntry &entry : temporary) {
-    const bool swept = is_leftover(entry, now) && send(ticket, "DELETE", entry.path).good();
+    bool swept = false;
+    if (left > 0 && is_leftover(entry, now)) {
+      const HttpAnswer deleted = send(ticket, "DELETE", entry.path);
+      swept = deleted.good();
+      left = deleted.complete() ? left - 1 : 0;
+    }
     listing->has_others = listing->has_others || !swept;
   }
   return success();

@@ -13,6 +13,8 @@ namespace {
 
 constexpr char kDav[] = "DAV:";
 constexpr guint kDecimal = 10;
+// No folder of a device holds as many; what a server says beyond it is no listing.
+constexpr std::size_t kMaxEntries = 50000;
 
 bool is_element(const xmlNode *node, const char *name) {
   return node->type == XML_ELEMENT_NODE && node->ns != nullptr &&
@@ -103,12 +105,19 @@ bool read_response(const xmlNode *node, const std::string &host, std::vector<Dav
   return true;
 }
 
+// A lock's token goes into headers as it is: what could end one is no part of an address.
+std::string as_token(const std::string &text) {
+  const bool plain = std::all_of(
+      text.begin(), text.end(), [](char c) { return c > ' ' && c <= '~' && c != '<' && c != '>'; });
+  return text.empty() || !plain ? "" : "<" + text + ">";
+}
+
 std::string find_token(const xmlNode *node, const std::string &owner) {
   const xmlNode *named = child_named(node, "owner");
   const xmlNode *token = child_named(node, "locktoken");
   const xmlNode *href = token == nullptr ? nullptr : child_named(token, "href");
   if (named != nullptr && href != nullptr && text_of(named) == owner)
-    return "<" + text_of(href) + ">";
+    return as_token(text_of(href));
   for (const xmlNode *child = node->children; child != nullptr; child = child->next) {
     const std::string found = find_token(child, owner);
     if (!found.empty()) return found;
@@ -149,14 +158,17 @@ std::string href_in(const xmlNode *parent, const char *name) {
 bool parse_multistatus(const std::string &xml, const std::string &host,
                        std::vector<DavEntry> *entries, bool *left_out) {
   const std::size_t before = entries->size();
+  bool is_too_long = false;
   *left_out = false;
   const bool whole = read_xml(
       xml, [](const xmlNode *root) { return is_element(root, "multistatus"); },
       [&](const xmlNode *node) {
-        if (is_element(node, "response") && !read_response(node, host, entries)) *left_out = true;
+        is_too_long = entries->size() - before >= kMaxEntries;
+        if (is_too_long || !is_element(node, "response")) return;
+        if (!read_response(node, host, entries)) *left_out = true;
       });
-  if (!whole) entries->resize(before);
-  return whole;
+  if (!whole || is_too_long) entries->resize(before);
+  return whole && !is_too_long;
 }
 
 std::string parse_lock_token(const std::string &xml, const std::string &owner) {
@@ -170,12 +182,11 @@ bool parse_lock(const std::string &xml, const std::string &host, DavLock *lock) 
   const xmlNode *active = root == nullptr ? nullptr : find_below(root, "activelock");
   if (active == nullptr) return false;
   const xmlNode *owner = child_named(active, "owner");
-  const std::string token = href_in(active, "locktoken");
   lock->owner = owner == nullptr ? "" : text_of(owner);
-  lock->token = "<" + token + ">";
+  lock->token = as_token(href_in(active, "locktoken"));
   lock->seconds = seconds_in(active);
   lock->root = path_of_href(href_in(active, "lockroot"), host);
-  return !token.empty();
+  return !lock->token.empty();
 }
 
 }  // namespace transport
