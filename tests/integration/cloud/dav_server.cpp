@@ -16,7 +16,7 @@
 
 #include <vector>
 
-#include "http.h"
+#include "http/http.h"
 
 using namespace harness;
 

@@ -2,7 +2,7 @@
 
 #include <set>
 
-#include "http.h"
+#include "http/http.h"
 
 namespace {
 

@@ -9,7 +9,8 @@
 
 #include <sstream>
 
-#include "http.h"
+#include "http/http.h"
+#include "http/url.h"
 
 using namespace harness;
 

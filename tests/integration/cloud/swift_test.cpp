@@ -3,7 +3,7 @@
 #include <mutex>
 
 #include "s3_service.h"
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 

@@ -7,7 +7,7 @@
 
 #include "dav_server.h"
 #include "harness.h"
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 using std::chrono::milliseconds;

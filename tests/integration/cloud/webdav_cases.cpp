@@ -9,9 +9,10 @@
 #include <filesystem>
 #include <sstream>
 
-#include "dav_client.h"
 #include "forwarder.h"
-#include "session.h"
+#include "http/url.h"
+#include "session/session.h"
+#include "webdav/dav_client.h"
 #include "webdav_store.h"
 
 using namespace harness;

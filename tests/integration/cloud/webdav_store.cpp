@@ -9,7 +9,7 @@
 
 #include <algorithm>
 
-#include "dav_client.h"
+#include "webdav/dav_client.h"
 
 using namespace harness;
 

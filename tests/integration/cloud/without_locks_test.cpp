@@ -3,7 +3,7 @@
 
 #include "dav_server.h"
 #include "forwarder.h"
-#include "http.h"
+#include "http/http.h"
 
 using namespace harness;
 

@@ -5,9 +5,9 @@
 
 #include <filesystem>
 
+#include "core/remote_path.h"
+#include "core/staged_file.h"
 #include "disk_store.h"
-#include "remote_path.h"
-#include "staged_file.h"
 
 using namespace harness;
 namespace fs = std::filesystem;

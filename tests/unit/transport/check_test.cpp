@@ -1,4 +1,4 @@
-#include "check.h"
+#include "session/check.h"
 
 #include <glib.h>
 #include <gmock/gmock.h>
@@ -11,7 +11,7 @@
 #include <utility>
 
 #include "harness.h"
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 using namespace transport;

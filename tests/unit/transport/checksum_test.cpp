@@ -1,4 +1,4 @@
-#include "checksum.h"
+#include "core/checksum.h"
 
 #include <dlfcn.h>
 #include <gtest/gtest.h>

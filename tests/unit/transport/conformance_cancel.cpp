@@ -3,7 +3,7 @@
 #include <atomic>
 
 #include "conformance.h"
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 

@@ -1,4 +1,4 @@
-#include "dav_client.h"
+#include "webdav/dav_client.h"
 
 #include <gtest/gtest.h>
 

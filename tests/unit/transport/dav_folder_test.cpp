@@ -1,9 +1,9 @@
 // What a WebDAV server says of folders, and when it does not say it.
 #include <glib.h>
 
+#include "core/ticket.h"
 #include "dav_test.h"
-#include "http.h"
-#include "ticket.h"
+#include "http/http.h"
 
 using namespace harness;
 using front::Response;

@@ -8,9 +8,9 @@
 #include <algorithm>
 
 #include "conformance.h"
-#include "dav_client.h"
 #include "dav_model.h"
 #include "http_front.h"
+#include "webdav/dav_client.h"
 
 class DavFrontStore : public TestStore {
  public:

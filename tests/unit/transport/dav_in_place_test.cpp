@@ -1,7 +1,7 @@
 // Uploads to a WebDAV server that cannot move, where other devices and odd servers come in between.
 #include "dav_test.h"
 
-#include "dav_client.h"
+#include "webdav/dav_client.h"
 
 using namespace harness;
 using front::Fault;

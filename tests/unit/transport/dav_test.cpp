@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 using front::Fault;

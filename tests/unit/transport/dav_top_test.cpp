@@ -1,10 +1,10 @@
 // The collection that a WebDAV store is, and those that it lies in.
 #include <gtest/gtest.h>
 
-#include "check.h"
 #include "dav_model.h"
 #include "harness.h"
-#include "session.h"
+#include "session/check.h"
+#include "session/session.h"
 
 using namespace harness;
 using front::Rule;

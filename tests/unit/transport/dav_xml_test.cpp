@@ -1,8 +1,8 @@
 #include <glib.h>
 #include <sys/resource.h>
 
-#include "backend_webdav.h"
 #include "harness.h"
+#include "webdav/dav_xml.h"
 
 using namespace harness;
 using transport::DavEntry;

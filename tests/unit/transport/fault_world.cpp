@@ -1,7 +1,8 @@
 #include "fault_world.h"
 
-#include "remote_path.h"
-#include "session.h"
+#include "core/remote_path.h"
+#include "session/session.h"
+#include "stores/make_backend.h"
 
 using namespace harness;
 using front::Spoil;

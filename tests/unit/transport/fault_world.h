@@ -10,7 +10,7 @@
 #include <string>
 #include <vector>
 
-#include "backend.h"
+#include "core/backend.h"
 #include "fault_table.h"
 #include "harness.h"
 #include "virtual_clock.h"

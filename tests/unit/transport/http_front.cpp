@@ -18,7 +18,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "http.h"
+#include "http/http.h"
 
 namespace front {
 namespace {

@@ -1,4 +1,5 @@
-#include "http.h"
+#include "http/http.h"
+#include "http/url.h"
 
 #include <glib.h>
 

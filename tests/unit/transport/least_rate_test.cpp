@@ -1,4 +1,4 @@
-#include "least_rate.h"
+#include "http/least_rate.h"
 
 #include <gtest/gtest.h>
 

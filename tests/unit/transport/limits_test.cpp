@@ -5,7 +5,7 @@
 
 #include "fault_world.h"
 #include "network_kinds.h"
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 using front::Fault;

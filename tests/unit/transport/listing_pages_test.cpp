@@ -1,4 +1,4 @@
-#include "listing_pages.h"
+#include "session/listing_pages.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "local_file.h"
+#include "core/local_file.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>

@@ -5,8 +5,8 @@
 #include <fstream>
 
 #include "dav_front_store.h"
-#include "http.h"
-#include "session.h"
+#include "http/http.h"
+#include "session/session.h"
 
 using namespace harness;
 namespace fs = std::filesystem;

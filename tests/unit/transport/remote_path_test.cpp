@@ -1,4 +1,4 @@
-#include "remote_path.h"
+#include "core/remote_path.h"
 
 #include "harness.h"
 

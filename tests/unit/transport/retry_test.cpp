@@ -1,4 +1,4 @@
-#include "retry.h"
+#include "core/retry.h"
 
 #include "harness.h"
 
@@ -68,7 +68,7 @@ TEST(Retry, JitterStaysInTheUpperHalf) {
   FakeClock clock;
   Ticket ticket;
   clock.share = 0.999;
-  run_with_retries(ticket, clock, {}, [](int) { return lost(); });
+  EXPECT_FALSE(run_with_retries(ticket, clock, {}, [](int) { return lost(); }).ok());
   EXPECT_EQ(clock.pauses[0], milliseconds(499));
   EXPECT_EQ(clock.pauses[1], milliseconds(999));
 }
@@ -77,15 +77,16 @@ TEST(Retry, TotalBoundCountsFromTheFirstFailure) {
   FakeClock clock;
   Ticket ticket;
   int attempts = 0;
-  run_with_retries(ticket, clock, {}, [&](int) {
+  const Outcome outcome = run_with_retries(ticket, clock, {}, [&](int) {
     ++attempts;
     clock.pass(seconds(100));  // a long transfer that is lost near its end
     return lost();
   });
+  EXPECT_FALSE(outcome.ok());
   EXPECT_EQ(attempts, 3);
   milliseconds total{0};
   FakeClock quick;
-  run_with_retries(ticket, quick, {}, [](int) { return lost(); });
+  EXPECT_FALSE(run_with_retries(ticket, quick, {}, [](int) { return lost(); }).ok());
   for (const milliseconds pause : quick.pauses) total += pause;
   EXPECT_LT(total, seconds(BACKUP_TRANS_RETRY_TOTAL_SECONDS));
   EXPECT_GT(total, seconds(BACKUP_TRANS_RETRY_TOTAL_SECONDS) - milliseconds(20000));
@@ -95,12 +96,13 @@ TEST(Retry, StoreThatAsksForAPauseGetsIt) {
   FakeClock clock;
   Ticket ticket;
   clock.share = 0.5;
-  run_with_retries(ticket, clock, {}, [](int number) {
+  const Outcome ended = run_with_retries(ticket, clock, {}, [](int number) {
     if (number == 2) return success();
     Outcome outcome = lost();
     outcome.retry_after = seconds(30);
     return outcome;
   });
+  EXPECT_TRUE(ended.ok());
   ASSERT_EQ(clock.pauses.size(), 1U);
   EXPECT_EQ(clock.pauses[0], milliseconds(31500));
 }

@@ -10,7 +10,7 @@
 #include "harness.h"
 #include "http_front.h"
 #include "s3_model.h"
-#include "session.h"
+#include "session/session.h"
 
 using namespace harness;
 using front::Fault;

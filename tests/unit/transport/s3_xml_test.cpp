@@ -1,7 +1,8 @@
 // What the S3 store reads from and writes for its service.
 #include <gtest/gtest.h>
 
-#include "backend_s3.h"
+#include "s3/backend_s3.h"
+#include "s3/s3_xml.h"
 
 using namespace transport;
 

@@ -1,4 +1,4 @@
-#include "upload_queue.h"
+#include "http/upload_queue.h"
 
 #include <gtest/gtest.h>
 

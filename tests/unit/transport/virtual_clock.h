@@ -10,8 +10,8 @@
 #include <mutex>
 #include <vector>
 
-#include "http.h"
-#include "retry.h"
+#include "core/retry.h"
+#include "http/http.h"
 
 /** The clock of retries and exchanges. Any thread. */
 class VirtualClock : public transport::RetryClock {

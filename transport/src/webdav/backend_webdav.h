@@ -1,0 +1,24 @@
+/**
+ * @file backend_webdav.h
+ * @brief A store that is a collection of a WebDAV server.
+ */
+#ifndef BACKUP_TRANSPORT_BACKEND_WEBDAV_H
+#define BACKUP_TRANSPORT_BACKEND_WEBDAV_H
+
+#include <memory>
+#include <string>
+
+#include "core/backend.h"
+#include "core/config.h"
+#include "http/url.h"
+
+namespace transport {
+
+/** Null with @p problem when nothing can be meant by the configuration. */
+[[nodiscard]] std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url,
+                                                           const Config &config,
+                                                           std::string *problem);
+
+}  // namespace transport
+
+#endif
