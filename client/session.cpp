@@ -8,8 +8,8 @@
 
 #include "files/package_files.h"
 #include "json_read.h"
-#include "status.h"
 #include "session.h"
+#include "status.h"
 #include "text.h"
 
 namespace quarn_client {

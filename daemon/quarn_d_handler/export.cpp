@@ -9,6 +9,7 @@
 #include <system_error>
 #include <thread>
 
+#include "files/safe_path.h"
 #include "platform_smack.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/export_turn.h"
@@ -17,7 +18,6 @@
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/own_place.h"
 #include "quarn_d_utils/quarn_d_utils.h"
-#include "quarn_d_utils/safe_path.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 

@@ -6,8 +6,8 @@
 
 #include <cerrno>
 
-#include "quarn_d_utils/disk_sync.h"
 #include "files/safe_path.h"
+#include "quarn_d_utils/disk_sync.h"
 #include "quarn_log.h"
 
 namespace {
