@@ -4,8 +4,8 @@
 
 #include <filesystem>
 
+#include "log_scope.h"
 #include "platform_security_server.h"
-#include "quarn_d_utils/log_budget.h"
 #include "restore_fixture.h"
 
 using ::testing::_;
@@ -206,10 +206,11 @@ TEST_F(WalkTest, WhatTheTableDoesNotKnowIsToldAHundredTimesAndCounted) {
     told += count_logged(DLOG_ERROR,
                          "fail to restore file info : " + at("data/own" + std::to_string(i)));
   }
-  EXPECT_EQ(told, kMaxFileLines);
-  EXPECT_EQ(count_logged(DLOG_WARN, std::to_string(kMany - kMaxFileLines) + " more such lines on " +
-                                        at("data") + " are left out"),
-            1);
+  EXPECT_LE(told, kMaxLinesOfAPlace);
+  EXPECT_GE(told, kMaxLinesOfAPlace - 1) << "one more line of that place may be about another file";
+  const std::string last = captured_texts().back();
+  EXPECT_NE(last.find(" more such lines on " + at("data") + " are left out"), std::string::npos)
+      << last;
   struct stat status = {};
   ASSERT_EQ(lstat(at("data/known").c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777, 0640U) << "the rest is restored all the same";
