@@ -14,7 +14,6 @@
 #include "text.h"
 
 using quarn_client::json_add;
-using quarn_client::json_text;
 using quarn_client::printable;
 
 namespace {
