@@ -81,6 +81,10 @@ int unlinkat(int dir, const char *path, int flags) noexcept {
 int renameat(int from, const char *old, int to, const char *name) noexcept {
   return between<int(int, const char *, int, const char *)>("renameat", from, old, to, name);
 }
+int renameat2(int from, const char *old, int to, const char *name, unsigned int flags) noexcept {
+  return between<int(int, const char *, int, const char *, unsigned int)>("renameat2", from, old,
+                                                                          to, name, flags);
+}
 int fchmod(int fd, mode_t mode) noexcept { return between<int(int, mode_t)>("fchmod", fd, mode); }
 int chmod(const char *path, mode_t mode) noexcept {
   return between<int(const char *, mode_t)>("chmod", path, mode);

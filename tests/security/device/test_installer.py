@@ -17,9 +17,10 @@ PACKAGE = "org.example.notes"
 APPLICATION = 5000
 EXCHANGE = 2
 AT_FDCWD = -100
-#: One in ten led an installer that goes by paths astray.
-UPDATES = 60
-FILES = 60
+#: Exchanges two names at one moment of a program, see exchange_at.cpp.
+EXCHANGE_AT = os.path.join(os.environ["QUARN_BUILD_DIR"], "tests/libexchange_at.so")
+#: Fewer were not the installer's.
+FEWEST_MOMENTS = 30
 LIBC = ctypes.CDLL(None, use_errno=True)
 
 
@@ -37,12 +38,6 @@ def as_application(work):
             os._exit(1)
         os._exit(0)
     return child
-
-
-def exchange_for_ever(one, other):
-    one, other = one.encode(), other.encode()
-    while True:
-        LIBC.renameat2(AT_FDCWD, one, AT_FDCWD, other, EXCHANGE)
 
 
 class Installer(TestCase):
@@ -64,18 +59,42 @@ class Installer(TestCase):
     def attack(self, work):
         self.children.append(as_application(work))
 
+    def update_with_exchange(self, at, folder):
+        """An update to which the application exchanges a folder for a link at one moment of it.
+        @return how many moments it had"""
+        count = self.path("moments")
+        environment = {**os.environ, "LD_PRELOAD": EXCHANGE_AT, "EXCHANGE_AT": str(at),
+                       "EXCHANGE_ONE": self.app_path(folder),
+                       "EXCHANGE_OTHER": self.app_path("link"), "EXCHANGE_COUNT": count,
+                       "ASAN_OPTIONS": "verify_asan_link_order=0"}
+        self.device.call("install", self.path("next"), check=False, env=environment)
+        with open(count) as file:
+            return int(file.read())
+
     def updates_against(self, folder):
-        """Updates that add files to a folder which the application exchanges for a link."""
+        """Updates that add a file to a folder which the application exchanges for a link, each at
+        another moment: an installer that goes by paths is led astray at one of them."""
         self.device.install(make_source(self.path("first"), PACKAGE, "1.0.0",
                                         {folder + "/there": b"there"}))
-        os.symlink(self.vault, self.app_path("link"))
-        self.attack(lambda: exchange_for_ever(self.app_path(folder), self.app_path("link")))
-        for index in range(UPDATES):
-            source = make_source(self.path("next"), PACKAGE, "1.0.0", {
-                "%s/%d-%d" % (folder, index, number): b"x" for number in range(FILES)})
-            self.device.call("install", source, check=False)
-            shutil.rmtree(source)
-            self.assertEqual([], os.listdir(self.vault), "the installer was led astray")
+        make_source(self.path("next"), PACKAGE, "1.0.0", {folder + "/new": b"new"})
+        link, added = self.app_path("link"), self.app_path(folder + "/new")
+        os.symlink(self.vault, link)
+        moments = self.update_with_exchange(0, folder)
+        self.assertTrue(os.path.exists(added))
+        self.assertGreater(moments, FEWEST_MOMENTS)
+        exchanges = 0
+        for at in range(1, moments + 1):
+            os.unlink(added)
+            self.update_with_exchange(at, folder)
+            self.assertEqual([], os.listdir(self.vault),
+                             "the installer was led astray at moment %d of %d" % (at, moments))
+            if not os.path.islink(link):
+                exchanges += 1
+                LIBC.renameat2(AT_FDCWD, link.encode(), AT_FDCWD,
+                               self.app_path(folder).encode(), EXCHANGE)
+            if not os.path.exists(added):
+                shutil.copy(self.path("next/" + folder + "/new"), added)
+        self.assertGreater(exchanges, moments // 2)
         self.assertEqual((0, 0o755), (os.stat(self.vault).st_uid,
                                       os.stat(self.vault).st_mode & 0o7777))
 
