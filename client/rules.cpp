@@ -177,7 +177,7 @@ void walk(Check *check, const DirPtr &dir, std::string *path, int depth) {
   for (const std::string &name : names) {
     const PathStep step(path, name.c_str());
     struct stat status {};
-    if (check->files.name(*path) ||
+    if (check->files.names(*path) ||
         fstatat(dirfd(dir.get()), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 ||
         is_transports(name, status)) {
       continue;

@@ -20,6 +20,8 @@
 #include <type_traits>
 #include <utility>
 
+#include "unique_fd.h"
+
 /** Calls @p Release on the pointer. */
 template <auto Release>
 struct Releaser {
@@ -41,32 +43,6 @@ using GMainLoopPtr = Handle<GMainLoop, &g_main_loop_unref>;
 using JsonPtr = Handle<json_object, &json_object_put>;
 using FilePtr = Handle<std::FILE, &std::fclose>;
 using DirPtr = Handle<DIR, &closedir>;
-
-/** Owner of a file descriptor; -1 is none. */
-class UniqueFd {
- public:
-  UniqueFd() = default;
-  explicit UniqueFd(int fd) : fd_(fd) {}
-  UniqueFd(UniqueFd &&other) noexcept : fd_(other.release()) {}
-  UniqueFd &operator=(UniqueFd &&other) noexcept {
-    reset(other.release());
-    return *this;
-  }
-  UniqueFd(const UniqueFd &) = delete;
-  UniqueFd &operator=(const UniqueFd &) = delete;
-  ~UniqueFd() { reset(); }
-
-  int get() const { return fd_; }
-  explicit operator bool() const { return fd_ >= 0; }
-  int release() { return std::exchange(fd_, -1); }
-  void reset(int fd = -1) {
-    if (fd_ >= 0) close(fd_);
-    fd_ = fd;
-  }
-
- private:
-  int fd_ = -1;
-};
 
 /** Receives a malloc'd text through an out pointer: `get(handle, out(text))`. */
 class CStringOut {

@@ -4,7 +4,6 @@
 #include <fcntl.h>
 #include <glib.h>
 #include <poll.h>
-#include <pthread.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -16,6 +15,7 @@
 #include <limits>
 #include <vector>
 
+#include "detached_thread.h"
 #include "quarn_log.h"
 
 namespace {
@@ -267,18 +267,7 @@ bool quarn_loop_watch_signals(const quarn_signal_watch &hooks) {
   watch.hooks = hooks;
   watch.read_fd = ends[0];
 
-  pthread_attr_t attributes;
-  pthread_attr_init(&attributes);
-  pthread_attr_setstacksize(&attributes, kWatcherStackSize);
-  pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
-  sigset_t all;
-  sigset_t before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);
-  pthread_t thread;
-  const int error = pthread_create(&thread, &attributes, watch_signals, &watch);
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
-  pthread_attr_destroy(&attributes);
+  const int error = start_detached_thread(kWatcherStackSize, watch_signals, &watch);
   if (error != 0) {
     LOGE("pthread_create() failed : %d", error);
     close(ends[0]);

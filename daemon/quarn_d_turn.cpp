@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <glib.h>
-#include <pthread.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -17,6 +16,7 @@
 #include <mutex>
 #include <string>
 
+#include "detached_thread.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 
@@ -135,18 +135,7 @@ void *wait_for_lock(void *) {
 }
 
 bool start_waiter() {
-  pthread_attr_t attributes;
-  pthread_attr_init(&attributes);
-  pthread_attr_setstacksize(&attributes, kWaiterStackSize);
-  pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
-  sigset_t all;
-  sigset_t before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);
-  pthread_t thread;
-  const int error = pthread_create(&thread, &attributes, wait_for_lock, nullptr);
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
-  pthread_attr_destroy(&attributes);
+  const int error = start_detached_thread(kWaiterStackSize, wait_for_lock, nullptr);
   if (error != 0) LOGE("pthread_create() failed : %d", error);
   return error == 0;
 }

@@ -12,6 +12,7 @@
 #include <memory>
 #include <vector>
 
+#include "files/package_files.h"
 #include "state/labels.h"
 
 namespace {
@@ -24,7 +25,6 @@ constexpr mode_t kModeBits = 07777;
 constexpr mode_t kFolderMode = 0755;
 constexpr mode_t kOwnFolderMode = 0700;
 constexpr int kFolderFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-constexpr const char *kDataFolders[] = {"data", "shared/data", "shared/trusted"};
 /** Beside the applications' folder, on its file system. */
 constexpr char kParent[] = "root/opt/usr";
 constexpr char kApps[] = "apps";
@@ -146,7 +146,7 @@ void PackageFiles::install(const std::string &source, const std::string &id) {
   };
   make_folder(root);
   make_folder(root / "shared");
-  for (const char *folder : kDataFolders) {
+  for (const char *folder : kDataDirs) {
     const fs::path from = fs::path(source) / folder;
     if (fs::is_directory(from)) {
       // A folder of the source that is a link stands for where it leads.
@@ -175,7 +175,7 @@ void PackageFiles::update(const std::string &source, const std::string &id) {
   const Fd root(open_applications_folder(apps_.fd, id.c_str(), shown));
   make_missing_folder(root.fd, "shared", id, shown + "/shared");
   const Fd shared(open_applications_folder(root.fd, "shared", shown + "/shared"));
-  for (const std::string folder : kDataFolders) {
+  for (const std::string folder : kDataDirs) {
     const bool below_shared = folder.find('/') != std::string::npos;
     const int at = below_shared ? shared.fd : root.fd;
     const std::string name = folder.substr(below_shared ? folder.find('/') + 1 : 0);

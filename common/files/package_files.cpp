@@ -82,10 +82,6 @@ std::array<std::string, kDataDirs.size()> package_files::data_dirs() const {
   return dirs;
 }
 
-std::string package_files::rules(const std::string &type) const {
-  return root_ + "/" + rules_file_of(type);
-}
-
 std::string package_files::table() const { return root_ + "/" + archived_table_name(id_); }
 
 snapshot_files::snapshot_files(const std::string &pkg_id, const std::string &snapshot)

@@ -12,8 +12,7 @@
 
 /** The folders of a package's data below its root, in the order in which they are visited. */
 inline constexpr std::array<const char *, 3> kDataDirs = {"data", "shared/data", "shared/trusted"};
-/** The one of them, and its parent, that the daemon's own files for the package lie in. */
-inline constexpr char kSharedDir[] = "shared";
+/** The one of them that the daemon's own files for the package lie in. */
 inline constexpr char kSharedDataDir[] = "shared/data";
 
 /** True when an id may name a file or folder: not empty, not "." or "..", no "/", no NUL. */
@@ -57,13 +56,8 @@ class package_files {
   /** @param root absolute, no slash at its end */
   package_files(const std::string &pkg_id, const std::string &root);
 
-  const std::string &id() const { return id_; }
-  const std::string &root() const { return root_; }
-
   /** The folders of its data, as kDataDirs. */
   std::array<std::string, kDataDirs.size()> data_dirs() const;
-  /** Its rules file. @param type the package's, "tpk" or another */
-  std::string rules(const std::string &type) const;
 
   /** Where all of the daemon's files for it lie. */
   const std::string &folder() const { return folder_; }
@@ -93,7 +87,7 @@ class package_files {
   /** True for an archive in transit. */
   bool is_archive(const std::string &path) const { return path == upload_ || path == download_; }
   /** True for both archives and for every path that begins with the snapshot's. */
-  bool name(const std::string &path) const {
+  bool names(const std::string &path) const {
     return path.compare(0, snapshot_.size(), snapshot_) == 0 || is_archive(path);
   }
 

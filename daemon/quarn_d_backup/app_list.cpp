@@ -6,13 +6,13 @@
 #include <limits>
 
 #include "files/safe_path.h"
+#include "log_scope.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/model_entries.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
-#include "quarn_d_utils/log_budget.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"
@@ -302,7 +302,7 @@ void get_previous_package_list_info(backup_context *ctx,
     LOGI("no previous package list in old app list");
     return;
   }
-  LogBudget refused("the previous package list");
+  const LogScope lines("the previous package list");
   for (std::size_t i = 0; i < packages.size(); ++i) {
     const JsonPtr owned(parse_whole_json(packages[i], kPackageDepth, nullptr));
     json_object *element = owned.get();
@@ -310,7 +310,7 @@ void get_previous_package_list_info(backup_context *ctx,
     const char *version = text_member(element, kVersion);
     if (pkg_id == nullptr || version == nullptr || !is_safe_path_component(pkg_id) ||
         !is_safe_path_component(version)) {
-      if (refused.take()) LOGE("refused entry %zu of previous package list", i);
+      LOGE("refused entry %zu of previous package list", i);
       continue;
     }
     pkg_information info;

@@ -4,7 +4,7 @@
 #include <cstring>
 
 #include "files/safe_path.h"
-#include "quarn_d_utils/log_budget.h"
+#include "log_scope.h"
 #include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/working_files.h"
@@ -31,13 +31,6 @@ void take_rule(const rules_element &element) {
                         element.include ? &backup_include_list : &backup_exclude_list);
 }
 
-/** One walk: an application may have any number of links, and of what cannot be packed. */
-struct Walk {
-  WorkingFiles working;
-  LogBudget links;
-  LogBudget failures;
-};
-
 /** What lies there, whoever may enter the directory. */
 int look_at(int dir, const char *name, struct stat *status) {
   const int found = fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
@@ -46,36 +39,34 @@ int look_at(int dir, const char *name, struct stat *status) {
   return fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
 }
 
-std::uint64_t measure(DirPtr dir, Walk *walk, std::string *path, int depth) {
+std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path, int depth) {
   std::uint64_t sum = 0;
   while (const dirent *entry = readdir(dir.get())) {
     if (is_dot_entry(entry->d_name)) continue;
     const PathStep step(path, entry->d_name);
-    if (walk->working.contain(*path)) continue;
+    if (working.contain(*path)) continue;
     struct stat status = {};
     const int result = look_at(dirfd(dir.get()), entry->d_name, &status);
     if (result != 0) {
-      if (walk->failures.take()) LOGE("error : lstat for %d %s", result, path->c_str());
+      LOGE("error : lstat for %d %s", result, path->c_str());
     } else if (S_ISDIR(status.st_mode)) {
       DirPtr child;
       if (depth < kMaxDirDepth) {
         child = open_directory_as_package(dirfd(dir.get()), entry->d_name, user_of_package());
       }
       if (child == nullptr) {
-        if (walk->failures.take()) LOGE("error : cannot open this path %s", path->c_str());
+        LOGE("error : cannot open this path %s", path->c_str());
         sum += kUnmeasurableSize;
       } else {
-        sum += measure(std::move(child), walk, path, depth + 1);
+        sum += measure(std::move(child), working, path, depth + 1);
       }
     } else if (S_ISREG(status.st_mode)) {
       if (is_backup_file(path->c_str())) sum += static_cast<std::uint64_t>(status.st_size);
     } else if (S_ISLNK(status.st_mode)) {
       if (!is_backup_file(path->c_str())) continue;
       sum += static_cast<std::uint64_t>(status.st_size);
-      if (walk->links.take()) {
-        LOGI("size of lnk file %s : %d", path->c_str(), static_cast<int>(status.st_size));
-      }
-    } else if (walk->failures.take()) {
+      LOGI("size of lnk file %s : %d", path->c_str(), static_cast<int>(status.st_size));
+    } else {
       LOGE("this is unexpected type : %s", path->c_str());
     }
   }
@@ -135,8 +126,9 @@ std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, cons
     LOGE("error : cannot open this path %s", dir_path);
     return kUnmeasurableSize;
   }
-  Walk walk{WorkingFiles(pkg_id, root), LogBudget(dir_path), LogBudget(dir_path)};
+  const LogScope lines(dir_path);
+  const WorkingFiles working(pkg_id, root);
   std::string path = dir_path;
   const ActAsPackage acting;
-  return acting ? measure(std::move(dir), &walk, &path, 1) : kUnmeasurableSize;
+  return acting ? measure(std::move(dir), working, &path, 1) : kUnmeasurableSize;
 }

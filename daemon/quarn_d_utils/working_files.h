@@ -48,7 +48,7 @@ class WorkingFiles : public package_files {
    * True for both archives, for every path that begins with the snapshot's,
    * and for the transport's files.
    */
-  bool contain(const std::string &path) const { return name(path) || is_own_leftover(path); }
+  bool contain(const std::string &path) const { return names(path) || is_own_leftover(path); }
 };
 
 /** From now on @p path is this process's own: its sweep leaves it alone. */

@@ -28,8 +28,7 @@ constexpr mode_t kTableMode = 0600;
 constexpr mode_t kFolderMode = 0755;
 constexpr int kStored = 0;
 constexpr int kRaw = 1;
-// What a snapshot holds: only there can an unpacking be undone.
-
+// A snapshot holds the data directories: only there can an unpacking be undone.
 constexpr char kNoData[] = "it does not belong to the application's data";
 constexpr char kWorkingFile[] = "it is a working file of a restore";
 

@@ -86,7 +86,7 @@ TEST_F(FileBackendTest, TemporaryFileOfALivingWriterIsNotSwept) {
   ASSERT_EQ(mkdir(store.root().c_str(), 0700), 0);
   const std::string name = transport::make_temporary_name();
   write_file(store.root() + "/" + name, "being written");
-  const transport::UniqueFd writer(open((store.root() + "/" + name).c_str(), O_RDWR));
+  const UniqueFd writer(open((store.root() + "/" + name).c_str(), O_RDWR));
   ASSERT_EQ(flock(writer.get(), LOCK_EX | LOCK_NB), 0);
   ASSERT_EQ(cloud->put("/a", "x"), 0);
   EXPECT_EQ(store.content(), (Content{{"/a", "x"}, {"/" + name, "being written"}}));

@@ -60,6 +60,16 @@ struct Upload {
   const Version *basis;
 };
 
+/** What is known of the object that an upload has made. */
+inline ObjectInfo info_of(const Upload &upload) {
+  ObjectInfo info;
+  info.path = upload.path;
+  info.is_file = true;
+  info.size = upload.source.size();
+  info.timestamp_ms = upload.timestamp_ms;
+  return info;
+}
+
 class Backend {
  public:
   Backend() = default;

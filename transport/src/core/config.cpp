@@ -10,7 +10,7 @@
 #include <memory>
 #include <utility>
 
-#include "core/unique_fd.h"
+#include "unique_fd.h"
 
 namespace transport {
 namespace {

@@ -18,7 +18,7 @@
 #include <string>
 
 #include "core/staged_file.h"
-#include "core/unique_fd.h"
+#include "unique_fd.h"
 
 namespace transport {
 

@@ -7,7 +7,7 @@
 
 #include <string>
 
-#include "core/unique_fd.h"
+#include "unique_fd.h"
 
 namespace transport {
 

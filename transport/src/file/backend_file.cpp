@@ -107,10 +107,7 @@ class FileBackend : public Backend {
     if (!outcome.ok()) return outcome;
     outcome = commit(attempt.ticket, root.get(), upload, &staged);
     if (!outcome.ok()) return outcome;
-    info->path = upload.path;
-    info->is_file = true;
-    info->size = upload.source.size();
-    info->timestamp_ms = upload.timestamp_ms;
+    *info = info_of(upload);
     return outcome;
   }
 

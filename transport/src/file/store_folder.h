@@ -16,7 +16,7 @@
 #include <string>
 #include <vector>
 
-#include "core/unique_fd.h"
+#include "unique_fd.h"
 
 namespace transport {
 

@@ -102,10 +102,7 @@ class S3Backend : public Backend {
       result = store(attempt.ticket, upload, sending.get());
     }
     if (!result.ok()) return result;
-    info->path = upload.path;
-    info->is_file = true;
-    info->size = upload.source.size();
-    info->timestamp_ms = upload.timestamp_ms;
+    *info = info_of(upload);
     return result;
   }
 

@@ -36,10 +36,7 @@ class WebdavBackend : public Backend {
   Outcome upload(Attempt &attempt, const Upload &upload, ObjectInfo *info) override {
     Outcome result = uploads_.attempt(attempt, upload);
     if (!result.ok()) return result;
-    info->path = upload.path;
-    info->is_file = true;
-    info->size = upload.source.size();
-    info->timestamp_ms = upload.timestamp_ms;
+    *info = info_of(upload);
     return result;
   }
 

@@ -2,14 +2,12 @@
  * @file unique_fd.h
  * @brief Owner of a file descriptor.
  */
-#ifndef BACKUP_TRANSPORT_UNIQUE_FD_H
-#define BACKUP_TRANSPORT_UNIQUE_FD_H
+#ifndef QUARN_UNIQUE_FD_H
+#define QUARN_UNIQUE_FD_H
 
 #include <unistd.h>
 
 #include <utility>
-
-namespace transport {
 
 /** Owner of a file descriptor; -1 is none. */
 class UniqueFd {
@@ -36,7 +34,5 @@ class UniqueFd {
  private:
   int fd_ = -1;
 };
-
-}  // namespace transport
 
 #endif
