@@ -1,6 +1,7 @@
 // Packs, unpacks or restores one application tree with the daemon's own functions, for
 // measurements of whole processes; or runs the codec alone over the tree's files.
 #include <algorithm>
+#include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
@@ -11,8 +12,8 @@
 #ifdef QUARN_BENCH_RESTORE
 #include "quarn_d_restore/quarn_d_restore.h"
 #endif
+#include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/codec.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

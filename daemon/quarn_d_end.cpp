@@ -8,7 +8,7 @@
 #include <cstdlib>
 
 #include "quarn_d_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_log.h"
 
 namespace {

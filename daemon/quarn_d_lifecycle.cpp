@@ -2,7 +2,7 @@
 
 #include "quarn_d_end.h"
 #include "quarn_d_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_log.h"
 
 int quarn_exit_code = 0;

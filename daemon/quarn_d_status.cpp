@@ -1,11 +1,14 @@
 #include "quarn_d_status.h"
 
+#include <glib.h>
+
 #include <atomic>
 #include <cstdint>
 #include <map>
 #include <set>
 #include <string>
 
+#include "backup_transport.h"
 #include "platform_device.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/quarn_d_backup.h"
@@ -13,7 +16,8 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_log.h"
 

@@ -2,6 +2,7 @@
 
 #include <gio/gio.h>
 #include <gio/gunixfdlist.h>
+#include <glib.h>
 #include <malloc.h>
 
 #include <algorithm>
@@ -22,7 +23,6 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"

@@ -1,10 +1,15 @@
 #include <fcntl.h>
+#include <json-c/json.h>
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <cstdint>
 #include <cstring>
 #include <limits>
+#include <string>
+#include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "log_scope.h"
 #include "quarn_common.h"
@@ -13,7 +18,8 @@
 #include "quarn_d_backup/model_entries.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"
 

@@ -3,11 +3,14 @@
 #include <algorithm>
 #include <map>
 #include <mutex>
+#include <string>
 #include <utility>
+#include <vector>
 
 #include "platform_package_manager.h"
 #include "quarn_d_backup/owed_archive.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 
 namespace {

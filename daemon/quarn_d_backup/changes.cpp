@@ -1,9 +1,14 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <cstdint>
 #include <cstring>
+#include <string>
+#include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
+#include "platform_package_manager.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/owed_archive.h"
@@ -11,10 +16,14 @@
 #include "quarn_d_backup/package_trouble.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/file_crc.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/package.h"
+#include "quarn_d_utils/path_rules.h"
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"

@@ -1,13 +1,19 @@
+#include <glib.h>
 #include <sys/stat.h>
 
+#include <atomic>
 #include <cassert>
 #include <cerrno>
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <set>
+#include <string>
 #include <unordered_set>
+#include <vector>
 
 #include "backup_transport.h"
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
@@ -15,8 +21,11 @@
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_backup/single_upload.h"
+#include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/cloud_transfer.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 

@@ -1,21 +1,29 @@
 #include <fcntl.h>
+#include <glib.h>
 #include <sys/stat.h>
 #include <sys/types.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <cstdint>
 #include <mutex>
+#include <string>
+#include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/own_place.h"
 #include "quarn_d_utils/package_lock.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"

@@ -1,19 +1,24 @@
+#include <glib.h>
 #include <malloc.h>
 #include <pthread.h>
 
 #include <algorithm>
+#include <atomic>
 #include <condition_variable>
 #include <cstdint>
 #include <mutex>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "backup_transport.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_turn.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/boot_cleanup.h"
+#include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 

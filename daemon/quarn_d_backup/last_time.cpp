@@ -1,8 +1,10 @@
+#include <cstdint>
+
 #include "platform_settings.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_backup/quarn_d_backup.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
 #include "quarn_log.h"
 
 namespace {

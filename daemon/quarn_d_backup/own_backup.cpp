@@ -3,10 +3,13 @@
 #include <zlib.h>
 
 #include <atomic>
+#include <cstdint>
+#include <string>
 
 #include "platform_settings.h"
 #include "quarn_d_backup/quarn_d_backup.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 
 namespace {

@@ -4,9 +4,13 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <string>
+
+#include "files/package_files.h"
 #include "files/safe_path.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_directory.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

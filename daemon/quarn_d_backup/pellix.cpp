@@ -1,17 +1,23 @@
 #include <fcntl.h>
 #include <glib.h>
+#include <json-c/json.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <string>
 
 #include "backup_transport.h"
+#include "files/package_files.h"
 #include "files/safe_path.h"
+#include "platform_package_manager.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 

@@ -1,12 +1,16 @@
+#include <cstdint>
 #include <ctime>
 
 #include "backup_transport.h"
+#include "files/package_files.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 

@@ -1,17 +1,22 @@
 #include <memory>
 #include <utility>
 
+#include "files/package_files.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_backup/single_upload.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/withdrawal.h"
+#include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/device_info.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/platform_handles.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 

@@ -1,4 +1,5 @@
 #include <fcntl.h>
+#include <glib.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -9,15 +10,21 @@
 #include <system_error>
 #include <thread>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "platform_smack.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/export_turn.h"
 #include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/own_place.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/package.h"
+#include "quarn_d_utils/path_rules.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
 

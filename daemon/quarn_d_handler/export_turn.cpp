@@ -1,13 +1,15 @@
 #include "quarn_d_handler/export_turn.h"
 
+#include <glib.h>
+
 #include <algorithm>
 #include <cstdint>
 #include <map>
+#include <string>
 #include <utility>
 #include <vector>
 
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

@@ -1,4 +1,5 @@
 #include <algorithm>
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -8,9 +9,11 @@
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/device_info.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 

@@ -2,14 +2,18 @@
 #include <set>
 #include <utility>
 
+#include "files/package_files.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_record.h"
+#include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
 

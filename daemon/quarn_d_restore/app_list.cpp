@@ -3,14 +3,17 @@
 #include <vector>
 
 #include "files/safe_path.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/cloud_transfer.h"
+#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"

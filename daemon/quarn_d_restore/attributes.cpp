@@ -8,6 +8,7 @@
 #include "files/safe_path.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
+#include "quarn_common.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"

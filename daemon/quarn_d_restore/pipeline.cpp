@@ -4,6 +4,7 @@
 #include <optional>
 
 #include "files/held_folder.h"
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_lifecycle.h"
@@ -15,9 +16,13 @@
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/archive_check.h"
 #include "quarn_d_utils/cloud_transfer.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/package_lock.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_d_utils/request_cause.h"
 #include "quarn_log.h"
 

@@ -9,13 +9,15 @@
 #include <json-c/json.h>
 #include <sys/stat.h>
 
+#include <cstdint>
 #include <string>
 #include <vector>
 
 #include "platform_package_manager.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_utils/file_info_table.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 /** The state of one package's restore; freed by the engine or by the waiting request. */
 struct pkg_restore_context {

@@ -1,8 +1,9 @@
+#include <cstdint>
 #include <map>
 
 #include "platform_alarm.h"
 #include "quarn_d_setting/quarn_d_setting.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
 #include "quarn_log.h"
 
 alarm_id_t _alarm_id = kNoAlarm;

@@ -1,10 +1,15 @@
+#include <glib.h>
+
+#include <cstdint>
+
 #include "backup_transport.h"
 #include "platform_settings.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_setting/quarn_d_setting.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_log.h"
 
 char auto_backup_enabled = 0;

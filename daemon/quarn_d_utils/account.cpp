@@ -1,6 +1,7 @@
 #include "platform_account.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
 namespace {

@@ -15,7 +15,7 @@ enum class archived_table {
 };
 
 /**
- * unzip_data() of quarn_d_utils.h, for an archive whose table is whole; of any
+ * unzip_data() of archive.h, for an archive whose table is whole; of any
  * other nothing is unpacked.
  * @param[out] table what was found, where the archive is within its bounds
  * @return the same, and 19 when the table is not whole

@@ -1,7 +1,10 @@
 #include "quarn_d_utils/boot_cleanup.h"
 
+#include <atomic>
+
+#include "platform_package_manager.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 

@@ -1,14 +1,18 @@
 #include "quarn_d_utils/cloud_session.h"
 
+#include <glib.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <mutex>
+#include <vector>
 
+#include "backup_transport.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
 std::atomic<bool> cloud_init_done{false};

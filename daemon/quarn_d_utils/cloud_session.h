@@ -1,6 +1,6 @@
 /**
  * @file cloud_session.h
- * @brief The state of the cloud session, apart from its two public functions.
+ * @brief The session with the cloud: whether it can be had, and its handle.
  */
 #ifndef QUARN_D_UTILS_CLOUD_SESSION_H
 #define QUARN_D_UTILS_CLOUD_SESSION_H
@@ -15,5 +15,16 @@ extern std::atomic<bool> cloud_init_done;
 extern std::atomic<backup_trans_handle_h> _g_handle;
 /** How long one caller waits for the transport's answer. */
 extern unsigned int cloud_init_timeout_seconds;
+
+/**
+ * True when the transport is ready; starts it when needed and waits up to 60
+ * seconds: the main thread in a nested loop, other threads on a condition.
+ */
+bool cloud_initialized();
+/** The transport handle; null before cloud_initialized() was true. Any thread. */
+backup_trans_handle_h cloud_handler();
+
+/** True when a user is signed in. Main thread. */
+bool server_util_is_account_exist();
 
 #endif

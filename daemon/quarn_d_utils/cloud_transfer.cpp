@@ -1,6 +1,9 @@
 #include "quarn_d_utils/cloud_transfer.h"
 
-#include "quarn_d_utils/quarn_d_utils.h"
+#include <cstdint>
+
+#include "backup_transport.h"
+#include "quarn_d_utils/cloud_session.h"
 
 extern "C" {
 #define QUARN_MAY_BE_MISSING __attribute__((weak))

@@ -1,9 +1,12 @@
 #include <sys/time.h>
 
+#include <cstdint>
+
 #include "platform_clock.h"
 #include "platform_system_info.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
 namespace {

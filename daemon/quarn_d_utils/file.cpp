@@ -1,18 +1,25 @@
 #include <fcntl.h>
+#include <glib.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
+#include <sys/stat.h>
 #include <sys/statfs.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <climits>
+#include <cstdint>
 #include <cstring>
+#include <string>
+#include <vector>
 
 #include "files/safe_path.h"
 #include "log_scope.h"
+#include "quarn_common.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/file_crc.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_d_utils/write_text.h"
 #include "quarn_log.h"

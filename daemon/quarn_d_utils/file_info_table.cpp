@@ -1,13 +1,19 @@
 #include <fcntl.h>
+#include <json-c/json.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <cstring>
 #include <new>
+#include <string>
 
 #include "files/safe_path.h"
 #include "platform_smack.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/file_info_table.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/table_text.h"
 #include "quarn_log.h"
 

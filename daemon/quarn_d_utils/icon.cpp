@@ -2,9 +2,14 @@
 
 #include <algorithm>
 #include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
 
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/icon.h"
+#include "quarn_d_utils/package.h"
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
 namespace {

@@ -1,11 +1,13 @@
 #include "quarn_d_utils/nested_loop.h"
 
+#include <glib.h>
+
 #include <algorithm>
 #include <atomic>
+#include <cstdint>
 #include <vector>
 
 #include "quarn_d_utils/fiber.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

@@ -5,8 +5,7 @@
  * The loop that a request waits for is a mark, not a loop that runs: the
  * request leaves its fiber, the one main loop goes on, and the request goes on
  * when its own mark is quit, whatever waits beside it. Main thread, where not
- * told otherwise. run_nested_loop() and quit_nested_loops() are declared with
- * the other helpers.
+ * told otherwise.
  */
 #ifndef QUARN_D_UTILS_NESTED_LOOP_H
 #define QUARN_D_UTILS_NESTED_LOOP_H
@@ -40,4 +39,14 @@ void wait_for_answer(GMainLoop *loop);
  * @return false when it does not wait, or what it waits for has come
  */
 bool withdraw_waits(std::uint64_t fiber);
+
+/**
+ * Wait until @p loop, one of new_wait_loop(), is quit; quit_nested_loops() and
+ * withdraw_waits() end the wait as well. On a fiber everything else goes on
+ * meanwhile; off it, GLib's sources do, and later waits end first.
+ */
+void run_nested_loop(GMainLoop *loop);
+/** End every wait, the longest first, and refuse further ones. Returns when nobody waits. */
+void quit_nested_loops();
+
 #endif

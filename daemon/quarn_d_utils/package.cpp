@@ -1,9 +1,14 @@
 #include <cstring>
+#include <mutex>
+#include <string>
+#include <vector>
 
 #include "platform_package_info.h"
+#include "platform_package_manager.h"
+#include "quarn_common.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/package.h"
 #include "quarn_d_utils/platform_handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_log.h"
 
 std::vector<std::string> install_complete_pkgs;

@@ -1,12 +1,20 @@
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <cerrno>
+#include <cstdint>
 #include <cstring>
+#include <string>
+#include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "log_scope.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_directory.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/path_rules.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
 #include "rules/path_matcher.h"

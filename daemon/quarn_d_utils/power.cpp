@@ -1,7 +1,8 @@
 #include <atomic>
+#include <mutex>
 
 #include "platform_device.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_log.h"
 
 namespace {

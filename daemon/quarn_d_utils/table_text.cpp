@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include "quarn_d_utils/bounds.h"
 
 namespace {
 

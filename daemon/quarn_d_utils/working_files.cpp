@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -9,12 +10,15 @@
 #include <map>
 #include <mutex>
 #include <optional>
+#include <string>
 #include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 

@@ -1,22 +1,30 @@
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
+#include <unzip.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <iterator>
 #include <optional>
+#include <string>
 #include <utility>
 #include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "log_scope.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/archive_check.h"
+#include "quarn_d_utils/archive_entry.h"
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/table_reader.h"
 #include "quarn_d_utils/unpacked_file.h"
 #include "quarn_d_utils/working_files.h"

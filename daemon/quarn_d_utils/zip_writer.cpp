@@ -1,18 +1,33 @@
+#include <dirent.h>
 #include <fcntl.h>
+#include <json-c/json.h>
+#include <sys/stat.h>
 #include <unistd.h>
+#include <zip.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
+#include <cstdint>
 #include <cstring>
+#include <string>
+#include <vector>
 
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "log_scope.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/archive_entry.h"
+#include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/codec.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/file_info_table.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_directory.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/package_lock.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/path_rules.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"

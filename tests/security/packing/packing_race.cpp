@@ -21,7 +21,7 @@
 #include "each_moment.h"
 #include "mock_platform.h"
 #include "quarn_common.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/archive.h"
 
 namespace {
 

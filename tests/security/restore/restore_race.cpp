@@ -13,6 +13,7 @@
 #include <string>
 
 #include "each_moment.h"
+#include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 
 // Nothing is to outlive this, and most of a restore's time is the disk's.

@@ -5,7 +5,7 @@
 
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/cloud_session.h"
 
 namespace {
 

@@ -1,4 +1,5 @@
 #include "quarn_d_utils/boot_cleanup.h"
+#include "quarn_common.h"
 
 #include <fcntl.h>
 #include <gmock/gmock.h>
@@ -12,11 +13,12 @@
 #include <filesystem>
 #include <fstream>
 #include <string>
+#include <vector>
 
 #include "log_capture.h"
 #include "mock_platform.h"
+#include "platform_package_manager.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/working_files.h"
 
 namespace {

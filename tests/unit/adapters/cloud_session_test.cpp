@@ -5,20 +5,22 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
 #include <future>
 #include <mutex>
+#include <string>
 #include <thread>
 #include <vector>
 
+#include "backup_transport.h"
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "mock_transport.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

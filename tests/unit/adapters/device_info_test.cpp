@@ -2,12 +2,13 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <cstdint>
 #include <cstring>
 
 #include "log_capture.h"
 #include "mock_platform.h"
+#include "quarn_d_utils/device_info.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

@@ -7,7 +7,8 @@
 
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/icon.h"
+#include "quarn_d_utils/package.h"
 
 namespace {
 

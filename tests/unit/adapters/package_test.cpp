@@ -4,11 +4,14 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "log_capture.h"
 #include "mock_platform.h"
+#include "platform_package_manager.h"
+#include "quarn_common.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/package.h"
 
 namespace {
 

@@ -1,3 +1,4 @@
+#include <json-c/json.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -8,11 +9,15 @@
 #include <csignal>
 #include <filesystem>
 #include <random>
+#include <string>
 #include <thread>
+#include <vector>
 
 #include "backup_device.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/model_entries.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 
+#include "quarn_common.h"
 #include "quarn_d_backup/package_trouble.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_utils/request_cause.h"

@@ -1,8 +1,16 @@
+#include <cstdint>
 #include <filesystem>
+#include <string>
+#include <vector>
 
 #include "backup_device.h"
+#include "platform_package_manager.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/path_rules.h"
 
 using ::testing::AllOf;
 using ::testing::Contains;

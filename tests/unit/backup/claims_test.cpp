@@ -2,6 +2,7 @@
 #include <filesystem>
 #include <memory>
 
+#include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/own_backup.h"

@@ -1,14 +1,20 @@
+#include <glib.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdint>
 #include <cstdio>
 #include <filesystem>
+#include <string>
+#include <vector>
 
 #include "backup_device.h"
+#include "backup_transport.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_d_utils/request_cause.h"
 
 using ::testing::ElementsAre;

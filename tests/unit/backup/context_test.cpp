@@ -1,16 +1,21 @@
+#include <glib.h>
 #include <sys/stat.h>
 #include <unistd.h>
-#include <optional>
 
+#include <atomic>
+#include <cstdint>
 #include <filesystem>
+#include <optional>
+#include <string>
 #include <thread>
+#include <vector>
 
 #include "backup_device.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/fiber.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 namespace {
 

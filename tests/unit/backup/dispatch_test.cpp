@@ -1,12 +1,20 @@
+#include <glib.h>
+
+#include <atomic>
 #include <chrono>
+#include <cstdint>
 #include <optional>
+#include <string>
 #include <thread>
+#include <vector>
 
 #include "backup_device.h"
+#include "backup_transport.h"
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_lock.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 
 using ::testing::_;
 using ::testing::ElementsAre;

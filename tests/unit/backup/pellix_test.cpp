@@ -1,4 +1,5 @@
 #include <fcntl.h>
+#include <json-c/json.h>
 #include <sched.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
@@ -6,10 +7,13 @@
 
 #include <filesystem>
 #include <random>
+#include <string>
+#include <vector>
 
 #include "backup_device.h"
+#include "platform_package_manager.h"
+#include "quarn_common.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 
 using ::testing::_;
 using ::testing::ElementsAre;

@@ -6,6 +6,7 @@
 
 #include "backup_device.h"
 #include "poll_hook.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/bounds.h"
 

@@ -1,4 +1,5 @@
 #include <dlfcn.h>
+#include <json-c/json.h>
 
 #include <cstring>
 #include <filesystem>
@@ -6,7 +7,8 @@
 #include "backup_device.h"
 #include "lazy_xml.h"
 #include "quarn_d_backup/run_private.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/path_rules.h"
 #include "rules/rules_file.h"
 
 extern "C" {

@@ -1,9 +1,14 @@
 // Clients that do not answer their callbacks, on the main thread and off it.
+#include <glib.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <cstdint>
 #include <cstdlib>
 #include <memory>
+#include <string>
 #include <thread>
+#include <vector>
 
 #include "log_capture.h"
 #include "private_bus.h"
@@ -11,7 +16,6 @@
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
 #include "quarn_dbus_client.h"
 
 namespace {

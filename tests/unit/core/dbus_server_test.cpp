@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <gio/gunixfdlist.h>
+#include <glib.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
 #include <sys/wait.h>
@@ -11,6 +12,8 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
+#include <string>
+#include <vector>
 
 #include "log_capture.h"
 #include "private_bus.h"
@@ -24,7 +27,7 @@
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"

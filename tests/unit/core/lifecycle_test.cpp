@@ -7,7 +7,7 @@
 #include "lifecycle_world.h"
 #include "log_capture.h"
 #include "quarn_d_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 
 bool lifecycle_idle = true;
 int lifecycle_quits = 0;

@@ -1,9 +1,12 @@
 #include "quarn_d_main.h"
 
+#include <glib.h>
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <atomic>
 #include <csignal>
+#include <cstdint>
 #include <string>
 #include <utility>
 #include <vector>
@@ -21,9 +24,12 @@
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
+#include "quarn_d_utils/boot_cleanup.h"
+#include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/kernel_settings.h"
+#include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"

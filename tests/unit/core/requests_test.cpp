@@ -1,7 +1,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <cstdint>
 #include <functional>
+#include <string>
 #include <utility>
 #include <vector>
 
@@ -12,7 +15,9 @@
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 
 using ::testing::NiceMock;

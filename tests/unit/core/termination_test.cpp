@@ -1,5 +1,8 @@
 // The loop, the terminate timer and the dispatcher together, on a real bus.
+#include <glib.h>
 #include <gtest/gtest.h>
+
+#include <string>
 
 #include "log_capture.h"
 #include "private_bus.h"
@@ -7,7 +10,7 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_dbus_server.h"
 
 namespace {

@@ -2,10 +2,16 @@
 // what was in one of them (folders, descriptors): what could be restored then can be restored now.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <json-c/json.h>
 #include <sys/stat.h>
 
+#include <string>
+
 #include "log_capture.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

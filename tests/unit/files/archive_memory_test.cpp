@@ -7,9 +7,12 @@
 #include <cstring>
 #include <fstream>
 #include <functional>
+#include <string>
 
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/bounds.h"
 #include "temp_dir.h"
 
 // A sanitizer's own memory is many times what it watches.

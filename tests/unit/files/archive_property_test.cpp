@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <json-c/json.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -10,10 +11,16 @@
 #include <map>
 #include <random>
 #include <set>
+#include <string>
+#include <vector>
 
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

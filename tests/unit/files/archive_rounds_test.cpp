@@ -2,12 +2,16 @@
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 
+#include <cstdint>
 #include <cstring>
+#include <string>
+#include <vector>
 
 #include "codec_choice.h"
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
 #include "temp_dir.h"
 #include "zip_bytes.h"
 

@@ -1,13 +1,18 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <json-c/json.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <cstring>
+#include <string>
 
 #include "fault.h"
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/file_info_table.h"
+#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

@@ -1,16 +1,22 @@
 #include <fcntl.h>
+#include <glib.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <sys/statfs.h>
 #include <zlib.h>
 
 #include <cerrno>
 #include <climits>
+#include <cstdint>
+#include <string>
 
 #include "fault.h"
+#include "files/package_files.h"
 #include "log_capture.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/file.h"
 #include "temp_dir.h"
 
 namespace {

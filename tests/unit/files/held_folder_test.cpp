@@ -3,15 +3,18 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <filesystem>
 #include <optional>
+#include <string>
 #include <thread>
 
 #include "files/safe_path.h"
 #include "quarn_common.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

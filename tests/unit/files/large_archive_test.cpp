@@ -3,10 +3,12 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <string>
 
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
 #include "temp_dir.h"
 
 namespace {

@@ -2,15 +2,20 @@
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <chrono>
+#include <cstdint>
 #include <ctime>
+#include <string>
 #include <thread>
 
 #include "fault.h"
 #include "log_capture.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/path_rules.h"
+#include "rules/path_matcher.h"
 #include "rules/rules_file.h"
 #include "temp_dir.h"
 

@@ -2,14 +2,24 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unzip.h>
 
 #include <cerrno>
+#include <cstdint>
+#include <string>
+#include <vector>
 
 #include "codec_choice.h"
 #include "fault.h"
+#include "files/package_files.h"
 #include "log_capture.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/archive_check.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/archive_entry.h"
+#include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 #include "quarn_printable.h"
 #include "temp_dir.h"

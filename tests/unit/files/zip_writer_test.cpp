@@ -1,17 +1,30 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <json-c/json.h>
 #include <sys/fsuid.h>
 #include <sys/stat.h>
+#include <zip.h>
 
+#include <atomic>
 #include <cerrno>
+#include <cstdint>
 #include <cstring>
+#include <string>
+#include <vector>
 
 #include "codec_choice.h"
 #include "fault.h"
+#include "files/package_files.h"
 #include "log_capture.h"
 #include "mock_platform.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_common.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/archive_entry.h"
+#include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/file_info_table.h"
+#include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/path_rules.h"
 #include "temp_dir.h"
 #include "zip_bytes.h"
 

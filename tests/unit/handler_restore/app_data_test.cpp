@@ -17,6 +17,8 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
+#include "quarn_d_utils/path_rules.h"
+#include "quarn_d_utils/power.h"
 
 using ::testing::_;
 using ::testing::Return;

@@ -1,4 +1,5 @@
 #include "handler_fixture.h"
+#include "quarn_d_utils/cloud_session.h"
 
 #include <Ecore.h>
 

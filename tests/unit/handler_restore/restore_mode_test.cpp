@@ -7,6 +7,8 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/package.h"
+#include "quarn_d_utils/power.h"
 
 using ::testing::_;
 using ::testing::Return;

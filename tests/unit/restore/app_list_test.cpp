@@ -3,12 +3,18 @@
 #include <unistd.h>
 
 #include <csignal>
+#include <cstdint>
 #include <filesystem>
+#include <string>
+#include <vector>
 
+#include "backup_transport.h"
+#include "platform_package_manager.h"
+#include "quarn_common.h"
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/power.h"
 #include "quarn_d_utils/request_cause.h"
 #include "restore_fixture.h"
 

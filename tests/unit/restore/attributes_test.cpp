@@ -4,6 +4,7 @@
 
 #include <filesystem>
 
+#include "quarn_common.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

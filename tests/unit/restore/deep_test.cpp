@@ -9,7 +9,10 @@
 #include <functional>
 
 #include "files/safe_path.h"
+#include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 
 namespace {

@@ -12,6 +12,7 @@
 
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 
 namespace {

@@ -6,7 +6,9 @@
 #include <filesystem>
 #include <regex>
 
+#include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/package_identity.h"
 #include "restore_fixture.h"
 

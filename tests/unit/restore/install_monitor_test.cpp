@@ -1,14 +1,22 @@
 #include <Ecore.h>
+#include <glib.h>
+#include <sys/stat.h>
 #include <sys/statfs.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <cstdint>
 #include <cstring>
 #include <filesystem>
+#include <string>
+#include <vector>
 
+#include "backup_transport.h"
+#include "platform_package_manager.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_setting/quarn_d_setting.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/icon.h"
+#include "quarn_d_utils/package.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

@@ -12,10 +12,13 @@
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/cloud_transfer.h"
+#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
+#include "quarn_d_utils/power.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

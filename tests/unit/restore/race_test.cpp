@@ -11,6 +11,8 @@
 #include <cstdio>
 #include <filesystem>
 
+#include "quarn_common.h"
+#include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 
 namespace {

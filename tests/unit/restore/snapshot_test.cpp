@@ -10,7 +10,11 @@
 #include <fstream>
 #include <functional>
 
+#include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/archive.h"
+#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/file_info_table.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

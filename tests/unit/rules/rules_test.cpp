@@ -8,11 +8,14 @@
 
 #include <filesystem>
 #include <fstream>
+#include <string>
+#include <vector>
 
 #include "files/safe_path.h"
 #include "mock_platform.h"
+#include "platform_package_manager.h"
 #include "quarn_common.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/path_rules.h"
 #include "rules/rules_file.h"
 
 namespace {

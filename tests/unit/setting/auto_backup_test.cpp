@@ -1,13 +1,18 @@
+#include <glib.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstdint>
+#include <map>
 #include <string>
 #include <vector>
 
+#include "backup_transport.h"
 #include "log_capture.h"
 #include "platform_settings.h"
 #include "quarn_d_backup/quarn_d_backup.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/power.h"
 #include "setting_fixture.h"
 
 namespace {

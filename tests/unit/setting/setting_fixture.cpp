@@ -1,12 +1,17 @@
 #include "setting_fixture.h"
 
+#include <glib.h>
+
+#include <atomic>
+#include <cstdint>
 #include <cstring>
 
 #include "log_capture.h"
 #include "platform_settings.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_lifecycle.h"
-#include "quarn_d_utils/quarn_d_utils.h"
+#include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/power.h"
 
 using ::testing::_;
 
