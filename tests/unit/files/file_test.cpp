@@ -167,7 +167,7 @@ TEST_F(Files, TellsAFilesSize) {
   EXPECT_EQ(get_file_size(dir_.file("file", "12345").c_str()), 5);
   EXPECT_EQ(get_file_size((dir_ / "none").c_str()), -1);
   EXPECT_EQ(errors("[" + dir_ / "none" + "] is not exist"), 1);
-  const Fault fault("safe_lstat", EIO, 1);
+  const Fault fault("fstat", EIO, 1);
   EXPECT_EQ(get_file_size((dir_ / "file").c_str()), -1);
   EXPECT_EQ(errors("lstat() was failed err : -1"), 1);
 }
@@ -194,7 +194,7 @@ TEST_F(Files, ReadingTellsEveryFailure) {
   EXPECT_FALSE(read_data_from_file((dir_ / "none").c_str(), &data));
   EXPECT_EQ(errors("[" + dir_ / "none" + "] is not exist"), 1);
   {
-    const Fault fault("safe_lstat", EIO, 1);
+    const Fault fault("fstat", EIO, 1);
     EXPECT_FALSE(read_data_from_file(file.c_str(), &data));
     EXPECT_EQ(errors("lstat() was failed"), 1);
   }
@@ -435,7 +435,7 @@ TEST_F(Files, MakingDirectoriesTellsEveryFailure) {
     EXPECT_FALSE(create_directory_of_file((dir_ / "a/x").c_str()));
     EXPECT_EQ(errors("g_path_get_dirname is fail"), 1);
   }
-  const Fault fault("safe_lstat", EIO, 0, 2);
+  const Fault fault("fstat", EIO, 0, 2);
   EXPECT_FALSE(create_directory_of_file((dir_ / "a/x").c_str()));
   EXPECT_EQ(errors("directory create was failed, directory is not exist."), 1);
 }
