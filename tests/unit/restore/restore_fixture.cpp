@@ -3,8 +3,6 @@
 #include <fcntl.h>
 #include <linux/capability.h>
 #include <linux/securebits.h>
-#include <sched.h>
-#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -106,19 +104,6 @@ void on_step(const char *step) {
   for (AtStep *one : awaited) one->reached(step);
 }
 
-/** /opt of its own for the companion, where that is permitted. */
-class PrivateOpt : public ::testing::Environment {
- public:
-  void SetUp() override {
-    std::filesystem::create_directories("/opt");
-    if (unshare(CLONE_NEWNS) != 0) return;
-    if (mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return;
-    static_cast<void>(mount("quarn", "/opt", "tmpfs", 0, nullptr));
-  }
-};
-[[maybe_unused]] ::testing::Environment *const private_opt =
-    ::testing::AddGlobalTestEnvironment(new PrivateOpt);
-
 char a_transaction[1];
 
 std::string parent_of(const std::string &name) {
@@ -182,21 +167,6 @@ std::string label_of(const std::string &path) {
 
 void set_label(const std::string &path, const std::string &label) {
   ASSERT_EQ(put_label(path.c_str(), label.c_str(), false), 0) << path << strerror(errno);
-}
-
-std::string read_text(const std::string &path) {
-  std::ifstream in(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-}
-
-void write_text(const std::string &path, const std::string &text) {
-  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-  std::ofstream(path, std::ios::binary) << text;
-}
-
-bool exists(const std::string &path) {
-  struct stat status = {};
-  return lstat(path.c_str(), &status) == 0;
 }
 
 Tree tree_of(const std::string &root) {
@@ -272,9 +242,6 @@ DiskFullAfter::~DiskFullAfter() {
 }
 
 RestoreTest::RestoreTest() {
-  // Memory, where it is to be had: bringing data onto a disk is not what is tested.
-  base = exists("/dev/shm") ? "/dev/shm/quarn_restore_XXXXXX" : "/tmp/quarn_restore_XXXXXX";
-  if (mkdtemp(base.data()) == nullptr) std::abort();
   label_attribute(base);
   root = base + "/opt/usr/apps/" + kPkg;
   dir("data");
@@ -341,7 +308,6 @@ RestoreTest::~RestoreTest() {
   end_restore_report();
   run_main_context();
   EXPECT_EQ(transactions, 0) << "a transaction was left open";
-  std::filesystem::remove_all(base);
 }
 
 std::string RestoreTest::file(const std::string &name, const std::string &content, int mode,
