@@ -7,6 +7,7 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 #include <zip.h>
@@ -98,10 +99,12 @@ void relabel_below(UniqueFd fd, const std::string &label) {
 }
 
 std::vector<AtStep *> awaited_steps;
+AtNthStep *awaited_number = nullptr;
 
 void on_step(const char *step) {
   const auto awaited = awaited_steps;
   for (AtStep *one : awaited) one->reached(step);
+  if (awaited_number != nullptr) awaited_number->reached(step);
 }
 
 char a_transaction[1];
@@ -200,11 +203,49 @@ AtStep::AtStep(std::string step, std::function<void()> action, int nth)
 
 AtStep::~AtStep() {
   awaited_steps.erase(std::find(awaited_steps.begin(), awaited_steps.end(), this));
-  if (awaited_steps.empty()) restore_step_hook = nullptr;
+  if (awaited_steps.empty() && awaited_number == nullptr) restore_step_hook = nullptr;
 }
 
 void AtStep::reached(const std::string &step) {
   if (step == step_ && --countdown_ == 0) action_();
+}
+
+AtNthStep::AtNthStep(int nth, std::function<void(const std::string &step)> action)
+    : countdown_(nth), action_(std::move(action)) {
+  EXPECT_EQ(awaited_number, nullptr);
+  awaited_number = this;
+  restore_step_hook = on_step;
+}
+
+AtNthStep::~AtNthStep() {
+  awaited_number = nullptr;
+  if (awaited_steps.empty()) restore_step_hook = nullptr;
+}
+
+void AtNthStep::reached(const std::string &step) {
+  if (--countdown_ == 0) action_(step);
+}
+
+bool is_killed_in(const std::function<void()> &work) {
+  const pid_t child = fork();
+  if (child == 0) {
+    work();
+    _exit(0);
+  }
+  int status = 0;
+  EXPECT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_FALSE(WIFEXITED(status) && WEXITSTATUS(status) != 0);
+  return WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL;
+}
+
+const std::vector<Entry> &new_app_data() {
+  static const std::vector<Entry> entries = {
+      {"data/settings.ini", "new settings", 0600},
+      {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
+      {"data/added/deep/file", "added"},
+      {"shared/data/pictures/one.jpg", "n", 0644},
+      {"shared/trusted/key.bin", "new key", 0444}};
+  return entries;
 }
 
 WithoutCapabilities::WithoutCapabilities(std::initializer_list<int> capabilities) {

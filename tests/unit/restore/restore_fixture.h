@@ -180,4 +180,26 @@ class AtStep {
   int countdown_;
 };
 
+/** Calls @p action at the @p nth step that the engine comes to, whichever it is. One at a time. */
+class AtNthStep {
+ public:
+  AtNthStep(int nth, std::function<void(const std::string &step)> action);
+  ~AtNthStep();
+  AtNthStep(const AtNthStep &) = delete;
+  AtNthStep &operator=(const AtNthStep &) = delete;
+
+  void reached(const std::string &step);
+
+ private:
+  int countdown_;
+  std::function<void(const std::string &step)> action_;
+};
+
+/** Run @p work in a process of its own. @return whether it was killed; the test fails when it
+ * failed */
+bool is_killed_in(const std::function<void()> &work);
+
+/** What replaces make_old_data(): changed, added and, by what it leaves out, removed. */
+const std::vector<Entry> &new_app_data();
+
 #endif
