@@ -31,18 +31,3 @@ function(quarn_program name)
   target_link_libraries(${name} PRIVATE quarn_options ${ARG_LIBS})
   set_target_properties(${name} PROPERTIES RUNTIME_OUTPUT_DIRECTORY "${QUARN_BIN_DIR}")
 endfunction()
-
-# A GoogleTest program that runs on the scripted platform; every case is a test of its own.
-# TIMEOUT is that of one case, in seconds.
-function(quarn_unit_test name)
-  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;LIBS" ${ARGN})
-  add_executable(${name} ${ARG_SOURCES})
-  target_link_libraries(${name} PRIVATE quarn_options ${ARG_LIBS} quarn_test_support)
-  target_precompile_headers(${name} REUSE_FROM quarn_test_support)
-  if(NOT ARG_TIMEOUT)
-    set(ARG_TIMEOUT 60)
-  endif()
-  # One CTest entry a program: a process start per case would cost more than the cases.
-  add_test(NAME ${name} COMMAND ${name})
-  set_tests_properties(${name} PROPERTIES TIMEOUT ${ARG_TIMEOUT} LABELS unit)
-endfunction()

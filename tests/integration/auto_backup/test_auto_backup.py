@@ -78,7 +78,7 @@ class AutoBackup(TestCase):
         wait_until(lambda: not self.alarms_in(HOUR), "the condition alarm is disarmed")
 
     def archive(self):
-        return os.path.join(self.device.cloud, SERIAL, PACKAGE, "1.0.0", PACKAGE + ".zip")
+        return self.device.archive(PACKAGE)
 
     def app_list(self):
         return os.path.join(self.device.cloud, "app_list/app_list.txt")

@@ -22,6 +22,15 @@ CALLBACKS = """
                         ("app_data_restore_complete", "isu")))
 
 
+def request(number):
+    """Arguments of what takes the request's number alone."""
+    return GLib.Variant("(u)", (number,))
+
+
+def integer(number):
+    return GLib.Variant("(i)", (number,))
+
+
 class Call:
     """A call under way: `reply` or `error` is set when it is `done`."""
 

@@ -8,7 +8,7 @@ import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
 sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
-from bus_client import INTERFACE, NAME, Client  # noqa: E402
+from bus_client import INTERFACE, NAME, Client, integer, request  # noqa: E402
 from gi.repository import GLib  # noqa: E402
 from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
 
@@ -21,14 +21,6 @@ WAITS = {"x86_64": {"7": ("0xffffffff", "0xffffffffffffffff"), "271": ("0x0",)},
 
 TEAR_DOWN = ["connection destroy ~", "backup-transport deinit ~", "remove alarm ~",
              "quarnd_dbus_deinit ~", "ecore_shutdown ~", "Good-Bye from Quarn"]
-
-
-def request(number):
-    return GLib.Variant("(u)", (number,))
-
-
-def integer(number):
-    return GLib.Variant("(i)", (number,))
 
 
 def texts(log):
@@ -72,8 +64,7 @@ class BusTest(TestCase):
 
     def run_daemon(self):
         """The daemon as a child, so that its exit status can be had."""
-        daemon = subprocess.Popen([self.device.tool, "exec", self.device.path, "--",
-                                   os.path.join(BIN_DIR, "quarnd")], stderr=subprocess.DEVNULL)
+        daemon = self.device.begin(os.path.join(BIN_DIR, "quarnd"), stderr=subprocess.DEVNULL)
         self.daemons.append(daemon)
         return daemon
 

@@ -187,9 +187,8 @@ class QuarnctlTest(TestCase):
                                  cloud="file://" + self.device.cloud)
         second.start()
         self.quarnctl("restore", "on", "--from", "nobody", device=second, status=1)
-        watcher = subprocess.Popen(
-            [second.tool, "exec", second.path, "--", "quarnctl", "restore", "on", "--from", SERIAL,
-             "--watch"], stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        watcher = second.begin("quarnctl", "restore", "on", "--from", SERIAL, "--watch",
+                               stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
         try:
             self.assertIn("restore mode is on for 2 packages", watcher.stdout.readline())
             self.install(second, BANK, data=False, metadata={"backup": "disable"})
@@ -209,10 +208,8 @@ class QuarnctlTest(TestCase):
     def test_watching_ends_when_another_client_ends_the_mode(self):
         self.install(self.device, NOTES)
         self.quarnctl("backup")
-        watcher = subprocess.Popen(
-            [self.device.tool, "exec", self.device.path, "--", "quarnctl", "restore", "on",
-             "--from", SERIAL, "--watch"], stdout=subprocess.PIPE, stderr=subprocess.PIPE,
-            text=True)
+        watcher = self.device.begin("quarnctl", "restore", "on", "--from", SERIAL, "--watch",
+                                    stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
         try:
             self.assertIn("restore mode is on", watcher.stdout.readline())
             self.quarnctl("restore", "off")
@@ -228,9 +225,8 @@ class QuarnctlTest(TestCase):
         source = make_source(self.path("large"), "org.example.large", "1.0",
                              {"data/%d" % i: os.urandom(4000000) for i in range(6)})
         self.device.install(source)
-        backup = subprocess.Popen(
-            [self.device.tool, "exec", self.device.path, "--", "quarnctl", "backup"],
-            stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True, start_new_session=True)
+        backup = self.device.begin("quarnctl", "backup", stdout=subprocess.PIPE,
+                                   stderr=subprocess.PIPE, text=True, start_new_session=True)
         try:
             self.assertEqual(backup.stdout.readline(), "backup started\n")
             os.killpg(backup.pid, signal.SIGINT)

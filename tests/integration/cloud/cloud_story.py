@@ -220,9 +220,8 @@ class CloudStory(TestCase):
         self.assertEqual(set(self.store.objects()), {"app_list/app_list.txt", notes, newer})
 
         second = self.device_on_store(SECOND)
-        watcher = subprocess.Popen(
-            [second.tool, "exec", second.path, "--", "quarnctl", "restore", "on", "--from", FIRST,
-             "--watch"], stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        watcher = second.begin("quarnctl", "restore", "on", "--from", FIRST, "--watch",
+                               stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
         try:
             self.assertIn("restore mode is on for 2 packages", watcher.stdout.readline())
             self.install(second, NOTES)

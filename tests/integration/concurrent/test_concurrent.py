@@ -91,8 +91,8 @@ class ConcurrentRequests(TestCase):
         other.start()
         self.install(other, ["org.example.q0"])
         for _ in range(3):
-            both = [subprocess.Popen([device.tool, "exec", device.path, "--", "quarnctl", "backup"],
-                                     stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+            both = [device.begin("quarnctl", "backup", stdout=subprocess.DEVNULL,
+                                 stderr=subprocess.DEVNULL)
                     for device in (self.device, other)]
             for run in both:
                 self.assertIn(run.wait(), (0, 12))

@@ -11,7 +11,7 @@ import unittest
 import zipfile
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import DEADLINE, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import DEADLINE, TestCase, make_source, tree, wait_until  # noqa: E402
 
 SERIAL = "350000000000001"
 PACKAGE = "org.example.notes"
@@ -20,23 +20,9 @@ FILES = 300
 LABELS = ("security.SMACK64", "user.quarn.SMACK64")
 
 
-def tree(root):
-    """Everything below `root`: type, content, mode, owner and labels by path."""
-    found = {}
-    for top in ("data", "shared/data", "shared/trusted"):
-        for folder, folders, names in os.walk(os.path.join(root, top)):
-            for name in folders + names:
-                path = os.path.join(folder, name)
-                status = os.lstat(path)
-                labels = {key: os.getxattr(path, key, follow_symlinks=False)
-                          for key in os.listxattr(path, follow_symlinks=False) if key in LABELS}
-                content = None
-                if name in names:
-                    with open(path, "rb") as file:
-                        content = file.read()
-                found[os.path.relpath(path, root)] = (content, status.st_mode, status.st_uid,
-                                                      status.st_gid, labels)
-    return found
+def saved_tree(root):
+    """Everything of the package that is backed up, with owners and labels, by path."""
+    return tree(root, ("data", "shared/data", "shared/trusted"), LABELS)
 
 
 class CrashTest(TestCase):
@@ -49,9 +35,8 @@ class CrashTest(TestCase):
 
     def ask(self, *arguments):
         """A client that waits for its answer."""
-        client = subprocess.Popen([self.device.tool, "exec", self.device.path, "--", "quarnctl",
-                                   *arguments], stdout=subprocess.PIPE, stderr=subprocess.STDOUT,
-                                  text=True)
+        client = self.device.begin("quarnctl", *arguments, stdout=subprocess.PIPE,
+                                   stderr=subprocess.STDOUT, text=True)
         self.addCleanup(client.communicate)
         self.addCleanup(client.kill)
         return client
@@ -80,15 +65,7 @@ class CrashTest(TestCase):
 
     def end_daemons(self):
         """None is left: a call on its way to the killed one has started another."""
-        def ended():
-            pid = self.device.daemon_pid()
-            if pid is not None:
-                try:
-                    os.kill(pid, signal.SIGTERM)
-                except ProcessLookupError:
-                    pass
-            return pid is None
-        wait_until(ended, "the daemons end")
+        wait_until(lambda: not self.device.signal_daemon(signal.SIGTERM), "the daemons end")
 
     def log_size(self):
         return os.path.getsize(os.path.join(self.device.path, "log/quarnd.log"))
@@ -96,9 +73,6 @@ class CrashTest(TestCase):
 
 class KilledBackup(CrashTest):
     PACKAGES = ["org.example.p%d" % index for index in range(6)]
-
-    def archive(self, package):
-        return os.path.join(self.device.cloud, SERIAL, package, "1.0.0", package + ".zip")
 
     def objects(self):
         """What the cloud shows: its objects, without the store's own unfinished files."""
@@ -148,10 +122,11 @@ class KilledBackup(CrashTest):
         found = sorted(os.path.relpath(os.path.join(folder, name), self.device.cloud)
                        for folder, _, names in os.walk(self.device.cloud) for name in names
                        if not name.startswith("."))
-        self.assertEqual(found, sorted([os.path.relpath(self.archive(package), self.device.cloud)
-                                        for package in self.PACKAGES] + ["app_list/app_list.txt"]))
+        archives = [os.path.relpath(self.device.archive(package), self.device.cloud)
+                    for package in self.PACKAGES]
+        self.assertEqual(found, sorted(archives + ["app_list/app_list.txt"]))
         for package in self.PACKAGES:
-            with zipfile.ZipFile(self.archive(package)) as archive:
+            with zipfile.ZipFile(self.device.archive(package)) as archive:
                 self.assertEqual(archive.read("data/content"), contents[package][-1], self.hint)
         left = [os.path.join(folder, name)
                 for folder, _, names in os.walk(os.path.join(self.device.path, "root"))
@@ -175,7 +150,7 @@ class KilledRestore(CrashTest):
         self.snapshot_table = os.path.join(self.snapshot, "shared/data", PACKAGE + ".perm")
         self.device.quarnctl("backup")
         self.device.remove("org.example.other")
-        self.saved = tree(self.root)
+        self.saved = saved_tree(self.root)
         # Afterwards the application went on: other contents and modes, files that went.
         for index in range(FILES):
             top = ("data", "shared/data", "shared/trusted")[index % 3]
@@ -186,11 +161,11 @@ class KilledRestore(CrashTest):
             with open(path, "wb") as file:
                 file.write(b"present %d\n" % index * 70)
             os.chmod(path, 0o640 + index % 4)
-        self.present = tree(self.root)
+        self.present = saved_tree(self.root)
         self.kept = self.path("kept")
         shutil.copytree(self.root, self.kept, symlinks=True)
         self.device.quarnctl("app", "restore", PACKAGE)
-        self.restored = tree(self.root)
+        self.restored = saved_tree(self.root)
         self.assertNotEqual(self.restored, self.present)
         for path, entry in self.saved.items():
             self.assertEqual(self.restored[path], entry, path)
@@ -208,7 +183,7 @@ class KilledRestore(CrashTest):
                 os.setxattr(target, key, value)
         for top in ("data", "shared/data", "shared/trusted"):
             os.chown(os.path.join(self.root, top), 5000, 5000)
-        self.assertEqual(tree(self.root), self.present)
+        self.assertEqual(saved_tree(self.root), self.present)
 
     def count(self, *path, content=None):
         """Files below a folder of the package; those that begin with `content`, when given."""
@@ -247,7 +222,7 @@ class KilledRestore(CrashTest):
         yield lambda: self.log_size() > start + number
 
     def leftovers(self):
-        return [path for path in tree(self.root)
+        return [path for path in saved_tree(self.root)
                 if "quarn_tmp_rst_dir" in path or path.endswith((".zip", ".perm"))]
 
     def test_the_tree_is_old_or_new_once_restore_mode_is_asked_for(self):
@@ -258,7 +233,7 @@ class KilledRestore(CrashTest):
             killed += self.kill_daemon_when(moment, client)
             # of another package
             self.device.quarnctl("restore", "on", "--from", SERIAL, "org.example.other")
-            now = tree(self.root)
+            now = saved_tree(self.root)
             self.assertTrue(now in (self.present, self.restored),
                             self.hint + "\n" + self.difference(now))
             self.assertEqual(self.leftovers(), [], self.hint)
@@ -272,7 +247,7 @@ class KilledRestore(CrashTest):
             client = self.ask("app", "restore", PACKAGE)
             killed += self.kill_daemon_when(moment, client)
             self.device.quarnctl("app", "restore", PACKAGE)
-            now = tree(self.root)
+            now = saved_tree(self.root)
             self.assertTrue(now == self.restored, self.hint + "\n" + self.difference(now))
             self.assertEqual(self.leftovers(), [], self.hint)
         self.assertGreater(killed, 0, self.hint)
@@ -284,14 +259,14 @@ class KilledRestore(CrashTest):
         self.assertTrue(self.kill_daemon_when(
             lambda: (os.path.exists(self.snapshot_table)
                      and self.count("data", content=b"saved") > 5), client))
-        self.assertNotIn(tree(self.root), (self.present, self.restored))
+        self.assertNotIn(saved_tree(self.root), (self.present, self.restored))
 
     def test_whatever_starts_the_next_daemon_the_tree_is_the_old_one_again(self):
         self.kill_half_way()
         self.device.quarnctl("status")
         wait_until(lambda: not os.path.lexists(self.snapshot), "the snapshot is gone")
         self.assertEqual(self.leftovers(), [])
-        now = tree(self.root)
+        now = saved_tree(self.root)
         self.assertTrue(now == self.present, self.difference(now))
 
     def test_the_device_recovers_without_an_account(self):
@@ -300,7 +275,7 @@ class KilledRestore(CrashTest):
         self.device.set("account", "none")
         self.device.start()
         self.assertEqual(self.leftovers(), [])
-        now = tree(self.root)
+        now = saved_tree(self.root)
         self.assertTrue(now == self.present, self.difference(now))
 
     def test_what_the_application_wrote_since_stays(self):
@@ -311,11 +286,11 @@ class KilledRestore(CrashTest):
         with open(note, "w") as file:
             file.write("newer than the restore")
         os.chown(note, 5000, 5000)
-        before = {path: entry for path, entry in tree(self.root).items()
+        before = {path: entry for path, entry in saved_tree(self.root).items()
                   if "quarn_tmp_rst_dir" not in path}
         self.device.stop()
         self.device.start()
-        now = {path: entry for path, entry in tree(self.root).items()
+        now = {path: entry for path, entry in saved_tree(self.root).items()
                if "quarn_tmp_rst_dir" not in path and not path.endswith((".zip", ".perm"))}
         before = {path: entry for path, entry in before.items()
                   if not path.endswith((".zip", ".perm"))}
@@ -327,7 +302,7 @@ class KilledRestore(CrashTest):
     def test_a_backup_packs_a_half_restored_package_as_it_was_before_the_restore(self):
         self.kill_half_way()
         self.device.quarnctl("backup", "--yes")
-        self.assertEqual(tree(self.root), self.present)
+        self.assertEqual(saved_tree(self.root), self.present)
         archive = os.path.join(self.device.cloud, SERIAL, PACKAGE, "1.0.0", PACKAGE + ".zip")
         with zipfile.ZipFile(archive) as packed:
             for path, (content, *_) in self.present.items():

@@ -8,7 +8,7 @@ import unittest
 import zipfile
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import TestCase, make_source  # noqa: E402
+from quarn_test import TestCase, make_source, tree  # noqa: E402
 
 PACKAGE = "org.example.notes"
 FOLDERS = ("data", "shared/data", "shared/trusted")
@@ -41,25 +41,6 @@ printf 'c' > shared/trusted/closed/content
 """
 
 
-def tree(root):
-    """All files and folders below the data folders: content, mode and owners by path."""
-    found = {}
-    for top in FOLDERS:
-        for folder, folders, names in os.walk(os.path.join(root, top)):
-            for name in folders + names:
-                path = os.path.join(folder, name)
-                status = os.lstat(path)
-                if stat.S_ISLNK(status.st_mode):
-                    continue
-                content = None
-                if stat.S_ISREG(status.st_mode):
-                    with open(path, "rb") as file:
-                        content = file.read()
-                found[os.path.relpath(path, root)] = (content, oct(status.st_mode), status.st_uid,
-                                                      status.st_gid)
-    return found
-
-
 class MadeByTheApplication(TestCase):
     def setUp(self):
         self.source = make_source(self.path("source"), PACKAGE, "1.0.0",
@@ -75,7 +56,9 @@ class MadeByTheApplication(TestCase):
         self.device.exec(*AS_APPLICATION, "sh", "-c", script, cwd="/")
 
     def tree(self):
-        return tree(self.device.app_path(PACKAGE))
+        """All files and folders below the data folders, without the links."""
+        return {path: entry for path, entry in tree(self.device.app_path(PACKAGE), FOLDERS).items()
+                if not stat.S_ISLNK(entry[1])}
 
     def assert_restored(self, written, before):
         """All that was backed up is there again, and of what is beside it nothing has changed."""
@@ -192,9 +175,8 @@ class MadeByTheApplication(TestCase):
         self.device.quarnctl("backup")
         self.device.remove(PACKAGE)
         bare = make_source(self.path("bare"), PACKAGE, "1.0.0", {})
-        watcher = subprocess.Popen(
-            [self.device.tool, "exec", self.device.path, "--", "quarnctl", "restore", "on",
-             "--from", "350000000000001", PACKAGE, "--watch"], stdout=subprocess.PIPE, text=True)
+        watcher = self.device.begin("quarnctl", "restore", "on", "--from", "350000000000001",
+                                    PACKAGE, "--watch", stdout=subprocess.PIPE, text=True)
         try:
             for line in watcher.stdout:
                 if "restore mode" in line.lower():

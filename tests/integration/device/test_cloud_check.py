@@ -1,65 +1,18 @@
 """quarn-device cloud-check: one line that tells what to look at, and quarnctl's words for it."""
-import http.server
 import json
 import os
 import secrets
 import ssl
 import subprocess
 import sys
-import threading
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import TestCase, make_source  # noqa: E402
+from quarn_test import AnsweringServer, TestCase, make_source  # noqa: E402
 
 # Words of chance: what other processes of the machine show may hold any word that means something.
 PASSWORD = secrets.token_hex(8) + " " + secrets.token_hex(8)
 OK_LINE = "ok: objects can be put there, read and removed\n"
-
-
-class Server:
-    """An HTTP server on loopback that gives every request one answer.
-
-    `seen` is called with the headers of each request before it is answered; what it returns, if
-    anything, is said instead of `reason` and `body`.
-    """
-
-    def __init__(self, status, reason, context=None, body="", seen=None):
-        class Handler(http.server.BaseHTTPRequestHandler):
-            protocol_version = "HTTP/1.1"
-
-            def answer(self):
-                self.rfile.read(int(self.headers.get("Content-Length", 0)))
-                said = seen(self.headers) if seen else None
-                text = (said or body).encode()
-                self.send_response(status, said or reason)
-                self.send_header("Content-Length", str(len(text)))
-                self.end_headers()
-                if self.command != "HEAD":
-                    self.wfile.write(text)
-
-            def __getattr__(self, name):
-                if name.startswith("do_"):
-                    return self.answer
-                raise AttributeError(name)
-
-            def log_message(self, *arguments):
-                pass
-
-        self.server = http.server.ThreadingHTTPServer(("127.0.0.1", 0), Handler)
-        self.port = self.server.server_address[1]
-        if context:
-            self.server.socket = context.wrap_socket(self.server.socket, server_side=True)
-        self.thread = threading.Thread(target=self.server.serve_forever, args=(0.02,))
-        self.thread.start()
-
-    def __enter__(self):
-        return self
-
-    def __exit__(self, *_exception):
-        self.server.shutdown()
-        self.thread.join()
-        self.server.server_close()
 
 
 class CloudCheck(TestCase):
@@ -75,7 +28,7 @@ class CloudCheck(TestCase):
         return result.returncode, result.stdout, result.stderr
 
     def answer_of(self, status, reason):
-        with Server(status, reason) as server:
+        with AnsweringServer(status, reason) as server:
             self.set_cloud("webdav+http://127.0.0.1:%d/dav" % server.port)
             return self.check()
 
@@ -84,7 +37,7 @@ class CloudCheck(TestCase):
         self.assertEqual(os.listdir(self.device.cloud), [])
 
     def test_a_refused_connection_is_the_network(self):
-        with Server(200, "OK") as server:
+        with AnsweringServer(200, "OK") as server:
             port = server.port
         self.set_cloud("webdav+http://127.0.0.1:%d/" % port)
         code, out, error = self.check()
@@ -101,7 +54,7 @@ class CloudCheck(TestCase):
             11, "", "address: list: the server answered 501 (Not Implemented)\n"))
 
     def test_a_page_for_people_is_the_address(self):
-        with Server(200, "OK") as server:
+        with AnsweringServer(200, "OK") as server:
             for kind in ("webdav", "s3"):
                 self.set_cloud("%s+http://127.0.0.1:%d/dav" % (kind, server.port))
                 self.assertEqual(self.check(), (
@@ -136,7 +89,7 @@ class CloudCheck(TestCase):
 
     def test_a_certificate_that_nobody_vouches_for_is_the_certificate(self):
         context, _certificate = self.tls()
-        with Server(507, "Insufficient Storage", context) as server:
+        with AnsweringServer(507, "Insufficient Storage", context) as server:
             self.set_cloud("webdav+https://127.0.0.1:%d/dav" % server.port)
             code, out, error = self.check()
         self.assertEqual((code, out), (12, ""))
@@ -144,7 +97,7 @@ class CloudCheck(TestCase):
 
     def test_a_ca_file_vouches_for_it(self):
         context, certificate = self.tls()
-        with Server(507, "Insufficient Storage", context) as server:
+        with AnsweringServer(507, "Insufficient Storage", context) as server:
             self.set_cloud("webdav+https://127.0.0.1:%d/dav" % server.port, "--ca-file",
                            certificate)
             self.assertEqual(self.check()[0], 14)
@@ -162,7 +115,7 @@ class CloudCheck(TestCase):
         self.assertEqual(json.loads(out), {
             "verb": "cloud-check", "cause": "ok", "error": 0,
             "message": "objects can be put there, read and removed"})
-        with Server(401, "Unauthorized") as server:
+        with AnsweringServer(401, "Unauthorized") as server:
             self.set_cloud("webdav+http://127.0.0.1:%d/dav" % server.port)
             code, out, error = self.check("--json")
         self.assertEqual((code, error), (13, ""))
@@ -176,7 +129,7 @@ class CloudCheck(TestCase):
 
     def test_quarnctl_has_words_for_it(self):
         self.device.set("network", "wifi")
-        with Server(401, "Unauthorized") as server:
+        with AnsweringServer(401, "Unauthorized") as server:
             self.set_cloud("webdav+http://127.0.0.1:%d/dav" % server.port)
             self.device.start()
             self.device.install(make_source(self.path("source"), "org.example.notes", "1.0",
@@ -197,12 +150,12 @@ class CloudCheck(TestCase):
 
     def answer_of_service(self, status, reason, code):
         body = "<Error><Code>%s</Code><Message>nothing of this is shown</Message></Error>" % code
-        with Server(status, reason, body=body) as server:
+        with AnsweringServer(status, reason, body=body) as server:
             self.set_bucket(server.port)
             return self.check()
 
     def test_a_service_that_refuses_the_connection_is_the_network(self):
-        with Server(200, "OK") as server:
+        with AnsweringServer(200, "OK") as server:
             port = server.port
         self.set_bucket(port)
         code, out, error = self.check()
@@ -239,7 +192,7 @@ class CloudCheck(TestCase):
 
     def test_a_services_certificate_that_nobody_vouches_for_is_the_certificate(self):
         context, certificate = self.tls()
-        with Server(403, "Forbidden", context) as server:
+        with AnsweringServer(403, "Forbidden", context) as server:
             self.set_bucket(server.port, "s3+https")
             code, out, error = self.check()
             self.assertEqual((code, out), (12, ""))
@@ -269,7 +222,7 @@ class Secrets(TestCase):
         self.seen += result.stdout + result.stderr
 
     def everything_said(self, url, status):
-        with Server(status, "No", seen=self.look_at_processes) as server:
+        with AnsweringServer(status, "No", seen=self.look_at_processes) as server:
             self.note(self.device.call("set", "cloud", url % server.port, "--user", "ada",
                                        input=PASSWORD + "\n"))
             self.device.call("start", env={**os.environ, "G_MESSAGES_DEBUG": "all"})

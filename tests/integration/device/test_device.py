@@ -121,7 +121,7 @@ class Life(TestCase):
     def test_stop_ends_what_exec_started(self):
         device = self.new_device()
         device.start()
-        child = subprocess.Popen([TOOL, "exec", device.path, "--", "sleep", "1000"])
+        child = device.begin("sleep", "1000")
         wait_until(lambda: os.readlink("/proc/%d/exe" % child.pid).endswith("sleep")
                    or os.path.basename(os.readlink("/proc/%d/exe" % child.pid)) == "coreutils",
                    "sleep runs")

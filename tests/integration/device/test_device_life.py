@@ -10,16 +10,11 @@ import time
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import BIN_DIR, DEADLINE, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import BIN_DIR, DEADLINE, TestCase, make_source, read_file, wait_until  # noqa: E402
 
 BUS = ("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus", "--object-path", "/",
        "--method")
 START = BUS + ("org.freedesktop.DBus.StartServiceByName", "org.orvane.Quarn", "0")
-
-
-def read(path):
-    with open(path) as file:
-        return file.read()
 
 
 def processes_naming(path):
@@ -39,7 +34,7 @@ def processes_naming(path):
 
 
 def kill_supervisor(device):
-    pid = int(read(os.path.join(device.path, "run/supervisor")).split()[0])
+    pid = int(read_file(os.path.join(device.path, "run/supervisor")).split()[0])
     process = os.pidfd_open(pid)
     os.kill(pid, signal.SIGKILL)
     ready, _, _ = select.select([process], [], [], DEADLINE)
@@ -71,7 +66,7 @@ exec "$(dirname "$0")/script"
 
     def starts(self, device):
         try:
-            return len(read(os.path.join(device.path, "starts")).split())
+            return len(read_file(os.path.join(device.path, "starts")).split())
         except FileNotFoundError:
             return 0
 
@@ -147,7 +142,7 @@ loop.run()
         device = self.device_with('#!/bin/sh\nprintf "[cpu]\\npid=%d\\n" $$ > '
                                   '"$QUARN_DEVICE_DIR/state/power.ini"\nkill -9 $$\n')
         device.exec(*START, check=False)
-        self.assertNotIn("pid", read(os.path.join(device.path, "state/power.ini")))
+        self.assertNotIn("pid", read_file(os.path.join(device.path, "state/power.ini")))
 
     def test_the_daemon_runs_in_the_device(self):
         device = self.device_with('#!/bin/sh\n{ env; ls -d /tmp/inside /opt/usr/apps/org.example.a; } > '
@@ -155,7 +150,7 @@ loop.run()
         device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {}))
         device.exec("touch", "/tmp/inside")
         device.exec(*START, check=False)
-        seen = read(os.path.join(device.path, "seen"))
+        seen = read_file(os.path.join(device.path, "seen"))
         for line in ("QUARN_DEVICE_DIR=" + device.path,
                      "QUARN_CLOUD_CONFIG=%s/state/cloud.conf" % device.path,
                      "DBUS_SYSTEM_BUS_ADDRESS=unix:path=%s/run/bus" % device.path,
@@ -310,7 +305,7 @@ class Inside(TestCase):
         self.addCleanup(os.unlink, name)
         self.assertEqual(device.exec("cat", name, cwd="/").stdout, "whole\n")
         device.stop()
-        self.assertEqual(read(name), "whole\n")
+        self.assertEqual(read_file(name), "whole\n")
         self.assertEqual(os.listdir(os.path.join(device.path, "root/tmp")), [])
 
     def test_a_directory_with_blanks_and_letters_of_the_world_is_a_device(self):
@@ -345,18 +340,17 @@ class Ends(TestCase):
     def test_stop_ends_what_forgot_its_environment(self):
         device = self.new_device()
         device.start()
-        child = subprocess.Popen([device.tool, "exec", device.path, "--", "env", "-i", "sleep",
-                                  "1000"])
-        wait_until(lambda: read("/proc/%d/cmdline" % child.pid).startswith("sleep\0"), "sleep runs")
+        child = device.begin("env", "-i", "sleep", "1000")
+        wait_until(lambda: read_file("/proc/%d/cmdline" % child.pid).startswith("sleep\0"),
+                   "sleep runs")
         device.stop()
         self.assertEqual(child.wait(timeout=DEADLINE), -signal.SIGTERM)
 
     def test_stop_ends_what_does_not_want_to_end(self):
         device = self.new_device()
         device.start()
-        child = subprocess.Popen([device.tool, "exec", device.path, "--", "sh", "-c",
-                                  "trap '' TERM; echo ready; while :; do sleep 1000; done"],
-                                 stdout=subprocess.PIPE)
+        child = device.begin("sh", "-c", "trap '' TERM; echo ready; while :; do sleep 1000; done",
+                             stdout=subprocess.PIPE)
         self.assertEqual(child.stdout.readline(), b"ready\n")
         device.stop()
         self.assertEqual(child.wait(timeout=DEADLINE), -signal.SIGKILL)
@@ -385,12 +379,12 @@ class Ends(TestCase):
 
     def test_stop_leaves_no_mount_and_no_socket(self):
         device = self.new_device()
-        before = read("/proc/self/mounts")
+        before = read_file("/proc/self/mounts")
         device.start()
         device.exec(*START)
-        self.assertEqual(read("/proc/self/mounts"), before)
+        self.assertEqual(read_file("/proc/self/mounts"), before)
         device.stop()
-        self.assertEqual(read("/proc/self/mounts"), before)
+        self.assertEqual(read_file("/proc/self/mounts"), before)
         self.assertFalse(os.path.exists(os.path.join(device.path, "run/bus")))
 
     def test_start_says_when_the_path_is_too_long_for_a_socket(self):
@@ -500,7 +494,7 @@ class Installing(TestCase):
         self.assertEqual(result.stderr.count("\n"), 1)
         self.assertEqual(device.packages(), [])
         self.assertFalse(os.path.lexists(device.app_path("org.example.a")))
-        events = read(os.path.join(device.path, "state/events.ini"))
+        events = read_file(os.path.join(device.path, "state/events.ini"))
         self.assertIn("install;failed;tpk;org.example.a;", events)
 
     def test_events_tell_of_each_step(self):
@@ -508,7 +502,7 @@ class Installing(TestCase):
         device.install(make_source(self.path("v1"), "org.example.a", "1.0.0", {}))
         device.install(make_source(self.path("v2"), "org.example.a", "2.0.0", {}))
         device.remove("org.example.a")
-        events = read(os.path.join(device.path, "state/events.ini"))
+        events = read_file(os.path.join(device.path, "state/events.ini"))
         self.assertEqual([line.split("=")[1].split(";")[:2] for line in events.splitlines()
                           if ";" in line],
                          [[action, state] for action in ("install", "update", "uninstall")
@@ -537,7 +531,7 @@ class Installing(TestCase):
 
 class Facts(TestCase):
     def fact(self, device, key):
-        lines = read(os.path.join(device.path, "state/device.ini")).splitlines()
+        lines = read_file(os.path.join(device.path, "state/device.ini")).splitlines()
         for line in lines[lines.index("[device]") + 1:]:
             if line.startswith(key + "="):
                 return line[len(key) + 1:]
@@ -549,7 +543,7 @@ class Facts(TestCase):
         self.assertEqual([self.fact(device, key) for key in ("model", "serial", "account")],
                          ["Orvane Two", "350000000000017", "ada"])
         self.assertIn("url=webdav+https://cloud.example.org/dav",
-                      read(os.path.join(device.path, "state/cloud.conf")))
+                      read_file(os.path.join(device.path, "state/cloud.conf")))
 
     def test_create_gives_each_device_a_serial_number_of_its_own(self):
         serials = set()

@@ -181,12 +181,7 @@ class Life(Races):
             self.device.stop()
 
     def kill_daemon(self):
-        pid = self.device.daemon_pid()
-        if pid is not None:
-            try:
-                os.kill(pid, signal.SIGKILL)
-            except ProcessLookupError:
-                pass
+        self.device.signal_daemon(signal.SIGKILL)
 
     @staticmethod
     def gone(pid):

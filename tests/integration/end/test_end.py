@@ -4,7 +4,6 @@ import fcntl
 import os
 import random
 import signal
-import socket
 import subprocess
 import sys
 import time
@@ -12,9 +11,9 @@ import unittest
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path[:0] = [os.path.join(HERE, ".."), os.path.join(HERE, "../bus")]
-from bus_client import INTERFACE, NAME, PATH, Client  # noqa: E402
+from bus_client import INTERFACE, NAME, PATH, Client, integer, request  # noqa: E402
 from gi.repository import GLib  # noqa: E402
-from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import BIN_DIR, TestCase, make_source, silent_server, wait_until  # noqa: E402
 
 #: Calls of all four clients together. Sanitizers make every start of the daemon slow.
 CALLS = int(os.environ.get("QUARN_END_CALLS", "10000" if "release" in BIN_DIR or
@@ -23,14 +22,6 @@ PACKAGES = ["org.example.app%d" % index for index in range(2)]
 CANCELLED = 17
 SECONDS_OF_A_SIGNAL = 1.0
 SECONDS_OF_A_SLOW_MACHINE = 2.0
-
-
-def request(number):
-    return GLib.Variant("(u)", (number,))
-
-
-def integer(number):
-    return GLib.Variant("(i)", (number,))
 
 
 def package(name, number):
@@ -64,7 +55,7 @@ class EndTest(TestCase):
 
     def slow_cloud(self):
         """Whatever asks the cloud waits: nobody answers at its address."""
-        server = socket.create_server(("127.0.0.1", 0))
+        server = silent_server()
         self.addCleanup(server.close)
         self.device.call("set", "cloud", "s3+http://127.0.0.1:%d/bucket/prefix" %
                          server.getsockname()[1], "--user", "somebody", input="secret\n")
@@ -362,8 +353,7 @@ class Successor(EndTest):
         self.slow_cloud()
         self.client.call("last_bu_time")
         self.first = self.pid()
-        second = subprocess.Popen([self.device.tool, "exec", self.device.path, "--",
-                                   os.path.join(BIN_DIR, "quarnd")], stderr=subprocess.DEVNULL)
+        second = self.device.begin(os.path.join(BIN_DIR, "quarnd"), stderr=subprocess.DEVNULL)
         self.addCleanup(second.wait)
         self.addCleanup(second.kill)
         self.device.wait_for_log("Lost the name org.orvane.Quarn")

@@ -1,15 +1,13 @@
 """The main job on real input: what stands in the cloud after each kind of run."""
-import http.server
 import json
 import os
 import subprocess
 import sys
-import threading
 import unittest
 import zipfile
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import Device, TestCase, make_source  # noqa: E402
+from quarn_test import AnsweringServer, TestCase, make_source  # noqa: E402
 
 
 def objects(device):
@@ -303,37 +301,17 @@ class BackupStory(TestCase):
         self.assertIn("libcurl.so.4 cannot be loaded", device.logs())
 
     def test_without_the_library_that_reads_answers_a_missing_bucket_is_no_missing_list(self):
-        asked = []
-
-        class Store(http.server.BaseHTTPRequestHandler):
-            def answer(self):
-                asked.append(self.command)
-                self.rfile.read(int(self.headers.get("Content-Length") or 0))
-                body = b"<Error><Code>NoSuchBucket</Code></Error>"
-                self.send_response(404)
-                self.send_header("Content-Type", "application/xml")
-                self.send_header("Content-Length", str(len(body)))
-                self.end_headers()
-                if self.command != "HEAD":
-                    self.wfile.write(body)
-
-            do_GET = do_PUT = do_POST = do_HEAD = do_DELETE = answer
-
-            def log_message(self, *_):
-                pass
-
-        server = http.server.ThreadingHTTPServer(("127.0.0.1", 0), Store)
-        self.addCleanup(server.server_close)
-        self.addCleanup(server.shutdown)
-        threading.Thread(target=server.serve_forever, daemon=True).start()
+        server = AnsweringServer(404, "Not Found", content_type="application/xml",
+                                 body="<Error><Code>NoSuchBucket</Code></Error>")
+        self.enterContext(server)
         device = self.device_without("libxml2.so.2")
         device.install(make_source(self.path("plain"), "org.example.plain", "1.0.0",
                                    {"data/a": b"a"}))
-        device.call("set", "cloud", "s3+http://127.0.0.1:%d/bucket" % server.server_port,
+        device.call("set", "cloud", "s3+http://127.0.0.1:%d/bucket" % server.port,
                     "--user", "key", input="secret\n")
         self.assertNotEqual(device.quarnctl("backup", check=False).returncode, 0)
-        self.assertIn("GET", asked)
-        self.assertNotIn("PUT", asked)
+        self.assertIn("GET", server.asked)
+        self.assertNotIn("PUT", server.asked)
         self.assertIn("libxml2.so.2 cannot be loaded", device.logs())
 
     def test_the_applications_files_with_names_of_ours_survive_a_backup_and_a_start(self):

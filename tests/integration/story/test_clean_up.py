@@ -43,7 +43,7 @@ class CleanUp(TestCase):
         return {}
 
     def archive(self, package, version="1.0"):
-        return os.path.join(self.device.cloud, SERIAL, package, version, package + ".zip")
+        return self.device.archive(package, version)
 
     def backup(self, *options, status=0):
         result = self.device.quarnctl("backup", *options, check=False)
@@ -230,9 +230,9 @@ class CleanUp(TestCase):
         backups = []
         try:
             for index, package in enumerate(packages):
-                backups.append(subprocess.Popen(
-                    [self.device.tool, "exec", self.device.path, "--", "quarnctl", "backup",
-                     "--yes"], stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True))
+                backups.append(self.device.begin(
+                    "quarnctl", "backup", "--yes", stdout=subprocess.PIPE,
+                    stderr=subprocess.STDOUT, text=True))
                 self.install(self.device, package, b"new data")
             client.until(lambda: self.stops(client), "the mode ends")
         finally:

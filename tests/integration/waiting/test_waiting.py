@@ -2,7 +2,6 @@
 import collections
 import os
 import random
-import socket
 import sys
 import time
 import unittest
@@ -10,7 +9,7 @@ import unittest
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path[:0] = [os.path.join(HERE, ".."), os.path.join(HERE, "../bus")]
 from bus_client import Client, GLib  # noqa: E402
-from quarn_test import BIN_DIR, TestCase, make_source, read_text  # noqa: E402
+from quarn_test import TestCase, is_sanitized, make_source, silent_server  # noqa: E402
 
 PACKAGES = ["org.example.p%d" % index for index in range(8)]
 OF_A_CALLER = 64
@@ -59,10 +58,8 @@ class SilentCloud(WaitingTest):
     """A store that takes connections and never answers: what is asked of it waits."""
 
     def setUp(self):
-        self.server = socket.socket()
+        self.server = silent_server()
         self.addCleanup(self.server.close)
-        self.server.bind(("127.0.0.1", 0))
-        self.server.listen(128)
         self.set_up_device()
         self.device.quarnctl("backup")
         self.device.set("cloud", "webdav+http://127.0.0.1:%d/dav" % self.server.getsockname()[1])
@@ -88,8 +85,8 @@ class SilentCloud(WaitingTest):
         other = self.new_clients(1)[0]
         self.assertEqual(other.error_of("manual_backup_start", GLib.Variant("(u)", (1,)))[0],
                          TOO_MANY)
-        if not self.is_sanitized():
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB)
         # Who waits keeps nobody from being served, and from withdrawing.
         self.assertEqual(other.call("set_activation", GLib.Variant("(i)", (1,))), (0,))
         for client in clients:
@@ -136,15 +133,6 @@ class SilentCloud(WaitingTest):
             self.assertEqual(client.callbacks("manual_backup_status")[-1][1], (CANCELLED, 6, 1))
         self.device.quarnctl("backup")
 
-    def is_sanitized(self):
-        with open(os.path.join(BIN_DIR, "quarnd"), "rb") as file:
-            return b"__asan_init" in (content := file.read()) or b"__tsan_init" in content
-
-    def memory_kb(self):
-        for line in read_text("/proc/%d/smaps_rollup" % self.device.daemon_pid()).splitlines():
-            if line.startswith("Pss:"):
-                return int(line.split()[1])
-        raise AssertionError("no memory use of the daemon")
 
 
 class EverythingAtOnce(WaitingTest):

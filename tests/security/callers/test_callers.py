@@ -9,12 +9,11 @@ import unittest
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
 sys.path.insert(0, os.path.join(HERE, "../../integration/bus"))
-from bus_client import INTERFACE, NAME, PATH, Client  # noqa: E402
+from bus_client import INTERFACE, NAME, PATH, Client, request  # noqa: E402
 from gi.repository import GLib  # noqa: E402
 from quarn_test import (  # noqa: E402
-    BIN_DIR, TestCase, is_sanitized, make_source, read_text, wait_until)
+    APPLICATION, TestCase, is_sanitized, make_source, wait_until)
 
-APPLICATION = 5000
 STRANGER = 65534
 NOTES = "org.example.notes"
 COMPANION = "com.velmor.pellix-efl"
@@ -102,10 +101,6 @@ WISHES = [
     (PATH, "org.freedesktop.DBus.Peer", "Ping", "()")]
 
 
-def request(number):
-    return GLib.Variant("(u)", (number,))
-
-
 class Attack(TestCase):
     def setUp(self):
         self.device = self.new_device(serial="350000000000001")
@@ -125,15 +120,6 @@ class Attack(TestCase):
         client.hold = lambda method, arguments: mute
         self.clients.append(client)
         return client
-
-    def is_sanitized(self):
-        return is_sanitized(os.path.join(BIN_DIR, "quarnd"))
-
-    def memory_kb(self):
-        for line in read_text("/proc/%d/smaps_rollup" % self.device.daemon_pid()).splitlines():
-            if line.startswith("Pss:"):
-                return int(line.split()[1])
-        raise AssertionError("no memory use of the daemon")
 
     def refused(self, user, wishes=None, destination=NAME):
         """What each wish of that user ends with."""
@@ -180,8 +166,8 @@ class Outsiders(Attack):
             served += 1
         self.assertGreater(served, 10)
         self.assertEqual([process.wait() for process in flood], [0, 0])
-        if not self.is_sanitized():
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB)
 
 
 #: Calls that want no answer, of which the bus lets any number wait.
@@ -214,12 +200,12 @@ class Shouting(Attack):
         most = 0
         while any(process.poll() is None for process in shouters):
             client.call("last_bu_time")
-            most = max(most, self.memory_kb())
+            most = max(most, self.device.daemon_memory_kb())
         self.assertEqual([process.wait() for process in shouters], [0, 0])
         client.call("last_bu_time")
         self.assertLess(len(self.device.log()) - before, MOST_LOG)
-        if not self.is_sanitized():
-            self.assertLess(max(most, self.memory_kb()), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(max(most, self.device.daemon_memory_kb()), MEMORY_LIMIT_KB)
 
 
 class Floods(Attack):
@@ -244,8 +230,8 @@ class Floods(Attack):
 
     def test_of_calls_do_not_fill_the_daemons_memory(self):
         self.flood(connections=3, calls=25000, size=4000, descriptors=0)
-        if not self.is_sanitized():
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB)
 
     def test_of_descriptors_leave_it_its_own(self):
         self.assertLess(self.flood(connections=2, calls=2000, size=10, descriptors=16), 200)
@@ -267,10 +253,10 @@ class TooMuch(Attack):
                          INVALID)
         self.assertEqual(client.callbacks(), [])
         self.assertEqual(self.device.daemon_pid(), daemon)
-        if not self.is_sanitized():
+        if not is_sanitized():
             # The room into which the bus library has read the largest message stays; that of its
             # copy goes, and the hundreds of megabytes that its packages would take are never made.
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB + LARGEST // 1024)
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB + LARGEST // 1024)
 
     def test_what_an_honest_client_sends_is_taken(self):
         client = self.new_client()
@@ -278,8 +264,8 @@ class TooMuch(Attack):
                               for i in range(4096)) + "]"
         arguments = GLib.Variant("(iissu)", (1, 0, "35", text, 1))
         self.assertEqual(client.call("restore_enable", arguments), (0,))
-        if not self.is_sanitized():
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB)
 
 
 #: Bytes that the unit leaves the daemon for its data and its threads' stacks.
@@ -297,14 +283,14 @@ class Exports(Attack):
         clients = [self.new_client() for _ in range(4)]
         clients[0].call("last_bu_time")
         daemon = self.device.daemon_pid()
-        if not self.is_sanitized():
+        if not is_sanitized():
             subprocess.run(["prlimit", "--pid", str(daemon), "--data=%d" % UNITS_LIMIT], check=True)
         calls = [call for client in clients for call in self.ask(client, 64)]
         clients[0].until(lambda: all(call.done for call in calls), "the exports", deadline=300)
         self.assertEqual({(call.reply, call.error) for call in calls}, {((0,), None)})
         self.assertEqual(self.device.daemon_pid(), daemon)
-        if not self.is_sanitized():
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB)
 
     def test_that_are_withdrawn_hold_up_nobody_while_another_is_made(self):
         with open(self.device.app_path(NOTES, "data/hole"), "wb") as file:
@@ -361,8 +347,8 @@ class NeverAnswering(Attack):
         self.assertLess(time.monotonic() - begin, SLOWNESS)
         self.device.quarnctl("status")
         self.device.quarnctl("backup")
-        if not self.is_sanitized():
-            self.assertLess(self.memory_kb(), MEMORY_LIMIT_KB)
+        if not is_sanitized():
+            self.assertLess(self.device.daemon_memory_kb(), MEMORY_LIMIT_KB)
         # And it is served itself, as soon as it answers.
         for client in mute:
             client.release()

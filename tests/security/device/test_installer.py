@@ -1,5 +1,4 @@
 """An application against the installer, and against what the device keeps for root."""
-import ctypes
 import fcntl
 import os
 import re
@@ -11,33 +10,16 @@ import unittest
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
-from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    APPLICATION, TestCase, as_application, exchange_names, make_source, wait_until)
 
 PACKAGE = "org.example.notes"
-APPLICATION = 5000
 EXCHANGE = 2
 AT_FDCWD = -100
 #: Exchanges two names at one moment of a program, see exchange_at.cpp.
 EXCHANGE_AT = os.path.join(os.environ["QUARN_BUILD_DIR"], "tests/libexchange_at.so")
 #: Fewer were not the installer's.
 FEWEST_MOMENTS = 30
-LIBC = ctypes.CDLL(None, use_errno=True)
-
-
-def as_application(work):
-    """A child process of the applications' user that does `work` until it is killed."""
-    child = os.fork()
-    if child == 0:
-        try:
-            os.setgroups([])
-            os.setresgid(APPLICATION, APPLICATION, APPLICATION)
-            os.setresuid(APPLICATION, APPLICATION, APPLICATION)
-            work()
-        except BaseException as error:  # whatever it is, the parent goes on
-            print("application:", repr(error), file=sys.stderr)
-            os._exit(1)
-        os._exit(0)
-    return child
 
 
 class Installer(TestCase):
@@ -90,8 +72,7 @@ class Installer(TestCase):
                              "the installer was led astray at moment %d of %d" % (at, moments))
             if not os.path.islink(link):
                 exchanges += 1
-                LIBC.renameat2(AT_FDCWD, link.encode(), AT_FDCWD,
-                               self.app_path(folder).encode(), EXCHANGE)
+                exchange_names(link, self.app_path(folder))
             if not os.path.exists(added):
                 shutil.copy(self.path("next/" + folder + "/new"), added)
         self.assertGreater(exchanges, moments // 2)

@@ -2,22 +2,21 @@
 import glob
 import os
 import re
+import sys
 import unittest
 
 HERE = os.path.dirname(os.path.abspath(__file__))
+sys.path.insert(0, os.path.join(HERE, "../../integration"))
+from quarn_test import read_file  # noqa: E402
+
 TESTS = os.path.join(HERE, "../..")
 MODEL = os.path.join(TESTS, "../docs/threat-model.md")
 SECTIONS = 4
 
 
-def read(path):
-    with open(path) as file:
-        return file.read()
-
-
 def boundaries():
     """Cells of each row, by section."""
-    text = read(MODEL)
+    text = read_file(MODEL)
     for section in text[text.index("\n## Boundaries"):].split("\n### ")[1:]:
         table = section.split("\n#")[0].split("\n|---|---|---|---|\n")[1]
         yield section.splitlines()[0], [
@@ -31,15 +30,15 @@ def programs():
     for kind in ("integration", "security"):
         for path in glob.glob(os.path.join(TESTS, kind, "*/test_*.py")):
             name = "%s_%s" % (kind, os.path.basename(path)[:-len(".py")])
-            found[name] = set(re.findall(r"^class (\w+)\(", read(path), re.MULTILINE))
+            found[name] = set(re.findall(r"^class (\w+)\(", read_file(path), re.MULTILINE))
     for path in glob.glob(os.path.join(TESTS, "*/*/CMakeLists.txt")):
         cases = set()
         for source in glob.glob(os.path.join(os.path.dirname(path), "*.cpp")):
             cases |= {".".join(case) for case in re.findall(
-                r"^(?:TEST|TEST_F|TEST_P|TYPED_TEST)\((\w+), (\w+)\)", read(source), re.MULTILINE)}
-        for name in re.findall(r"_test\(\s*(\w+)|add_executable\((test_\w+)", read(path)):
+                r"^(?:TEST|TEST_F|TEST_P|TYPED_TEST)\((\w+), (\w+)\)", read_file(source), re.MULTILINE)}
+        for name in re.findall(r"_test\(\s*(\w+)|add_executable\((test_\w+)", read_file(path)):
             program = name[0] or name[1]
-            found[program if program.startswith("test_") else "security_" + program] = cases
+            found[program] = cases
     return found
 
 

@@ -22,6 +22,7 @@
 #include "mock_platform.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive.h"
+#include "temp_dir.h"
 
 namespace {
 
@@ -50,7 +51,6 @@ class PackingRace : public ::testing::Test {
           *label = strdup("_");
           return 0;
         });
-    EXPECT_EQ(chmod(base_.c_str(), 0755), 0);
     for (const char *name :
          {"", "/data", "/data/dir", "/shared", "/shared/data", "/shared/trusted"}) {
       const std::string path = root_ + name;
@@ -66,7 +66,6 @@ class PackingRace : public ::testing::Test {
     std::ofstream(root_ + "/data/dir/file") << "its own";
     unlink((root_ + "/shared/other").c_str());
   }
-  ~PackingRace() override { std::filesystem::remove_all(base_); }
 
   /** The application's file is another's, or its folder a link to another's; or its own again. */
   void put(bool others) const {
@@ -150,10 +149,10 @@ class PackingRace : public ::testing::Test {
   }
 
   NiceMock<MockPlatform> platform_;
-  std::string base_ = "/tmp/quarn-packing-race-XXXXXX";
-  const std::string root_ = std::string(mkdtemp(base_.data())) + "/package";
-  const std::string vault_ = base_ + "/vault";
-  const std::string archive_ = base_ + "/archive.zip";
+  const TempDir base_;
+  const std::string root_ = base_ / "package";
+  const std::string vault_ = base_ / "vault";
+  const std::string archive_ = base_ / "archive.zip";
   const std::chrono::steady_clock::time_point begin_ = std::chrono::steady_clock::now();
   bool folder_ = false;
   int met_ = 0;

@@ -16,38 +16,13 @@ import zipfile
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path[:0] = [os.path.join(HERE, ".."), os.path.join(HERE, "../../integration")]
 from kernel_settings import kernel_settings  # noqa: E402
-from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import APPLICATION, TestCase, application, make_source, wait_until  # noqa: E402
 
 PACKAGE = "org.example.hostile"
 OTHER = "org.example.notes"
-APPLICATION = 5000
 MARKER = b"the secret of root: 6f1d0c52-9d7e-4b57-8ad5-0c9f3b3f2a11"
 #: Seconds that a race runs.
 RACE = float(os.environ.get("QUARN_RACE_SECONDS", "30"))
-
-
-@contextlib.contextmanager
-def application(attack, *arguments):
-    """`attack(*arguments)` again and again as the application's user, until the end of the block."""
-    child = os.fork()
-    if child == 0:
-        try:
-            os.setgroups([])
-            os.setgid(APPLICATION)
-            os.setuid(APPLICATION)
-            while True:
-                attack(*arguments)
-        finally:
-            os._exit(1)
-    try:
-        yield
-        if os.waitpid(child, os.WNOHANG) != (0, 0):
-            raise AssertionError("the attack has ended")
-    finally:
-        with contextlib.suppress(ProcessLookupError):
-            os.kill(child, signal.SIGKILL)
-        with contextlib.suppress(ChildProcessError):
-            os.waitpid(child, 0)
 
 
 def exchange(place, folder, archives):
@@ -104,7 +79,7 @@ class Packing(TestCase):
         archives = [PACKAGE + "_upload.zip", "quarn_tmp_rst_dir." + PACKAGE + "_upload.zip"]
         end = time.monotonic() + RACE
         with kernel_settings({"fs.protected_hardlinks": "0"}):
-            with application(exchange, place, folder, archives):
+            with application(lambda: exchange(place, folder, archives)):
                 while time.monotonic() < end:
                     self.back_up_changed()
                     self.check_cloud()
@@ -134,7 +109,7 @@ class Packing(TestCase):
                                   kwargs={"check": False})
         # One lies there while the other is packed, and both while the store is slow.
         with kernel_settings({"fs.protected_hardlinks": "0"}), \
-                application(exchange, *places, names):
+                application(lambda: exchange(*places, names)):
             backup.start()
             try:
                 while backup.is_alive() and not any(map(os.path.lexists, archives)):

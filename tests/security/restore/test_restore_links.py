@@ -1,9 +1,7 @@
 """An application that links root's files into its data while it is restored and rolled back."""
 import contextlib
-import ctypes
 import os
 import shutil
-import signal
 import sys
 import unittest
 import zipfile
@@ -12,22 +10,15 @@ HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
 sys.path.insert(0, os.path.join(HERE, ".."))
 from kernel_settings import kernel_settings  # noqa: E402
-from quarn_test import TestCase, make_source  # noqa: E402
+from quarn_test import (  # noqa: E402
+    APPLICATION, TestCase, application, as_application, exchange_names, make_source)
 
 SERIAL = "350000000000001"
 PACKAGE = "org.example.notes"
-APPLICATION = 5000
-EXCHANGE = 2
-AT_FDCWD = -100
 SECRET = b"root's alone"
 FILES = 60
 ROUNDS = 12
 SNAPSHOT = "shared/data/quarn_tmp_rst_dir"
-LIBC = ctypes.CDLL(None, use_errno=True)
-
-
-def exchange(one, other):
-    return LIBC.renameat2(AT_FDCWD, one.encode(), AT_FDCWD, other.encode(), EXCHANGE)
 
 
 def attributes(path):
@@ -52,7 +43,7 @@ class RestoreLinks(TestCase):
         self.device.install(make_source(self.path("source"), PACKAGE, "1.0.0", {
             name: b"kept" for name in self.names}))
         self.device.quarnctl("backup")
-        archive = os.path.join(self.device.cloud, SERIAL, PACKAGE, "1.0.0", PACKAGE + ".zip")
+        archive = self.device.archive(PACKAGE)
         self.archive = archive
         self.good = shutil.copy(archive, self.path("good.zip"))
         self.broken = self.path("broken.zip")
@@ -64,28 +55,9 @@ class RestoreLinks(TestCase):
                     whole = whole.replace(b'"data/%d"' % (FILES - 1), b'"data/none"')
                 broken.writestr(entry.filename, whole)
 
-    @contextlib.contextmanager
-    def application(self, work):
-        """A process of the applications' user that does `work` again and again."""
-        child = os.fork()
-        if child == 0:
-            try:
-                os.setgroups([])
-                os.setresgid(APPLICATION, APPLICATION, APPLICATION)
-                os.setresuid(APPLICATION, APPLICATION, APPLICATION)
-                os.link(self.secret, self.app("data/can"))
-                os.unlink(self.app("data/can"))
-                while True:
-                    work()
-            finally:
-                os._exit(1)
-        try:
-            yield
-            self.assertEqual((0, 0), os.waitpid(child, os.WNOHANG), "the application has ended")
-        finally:
-            with contextlib.suppress(ProcessLookupError, ChildProcessError):
-                os.kill(child, signal.SIGKILL)
-                os.waitpid(child, 0)
+    def make_one_link(self):
+        os.link(self.secret, self.app("data/can"))
+        os.unlink(self.app("data/can"))
 
     def app(self, name):
         return self.device.app_path(PACKAGE, name)
@@ -111,7 +83,7 @@ class RestoreLinks(TestCase):
     def put_snapshots(self):
         self.make_snapshot_of_links()
         for _ in range(100):
-            exchange(self.app(SNAPSHOT), self.app("shared/data/mine"))
+            exchange_names(self.app(SNAPSHOT), self.app("shared/data/mine"))
 
     def assert_nothing_was_reached(self):
         self.assertEqual(self.before, attributes(self.secret))
@@ -128,7 +100,8 @@ class RestoreLinks(TestCase):
         with kernel_settings({"fs.protected_hardlinks": "0"}):
             for number in range(ROUNDS):
                 shutil.copy(self.broken if number % 2 else self.good, self.archive)
-                with self.application(work):
+                self.assertEqual(0, os.waitpid(as_application(self.make_one_link), 0)[1])
+                with application(work):
                     self.device.quarnctl("app", "restore", PACKAGE, check=False)
                 self.assert_nothing_was_reached()
         # and afterwards it goes on as if nothing had been

@@ -10,7 +10,7 @@ HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path[:0] = [HERE, os.path.join(HERE, "../../integration"), os.path.join(HERE, "../../integration/bus")]
 from bus_client import Client, GLib  # noqa: E402
 from hostile_cloud import HostileCloud  # noqa: E402
-from quarn_test import BIN_DIR, TestCase, is_sanitized, make_source, wait_until  # noqa: E402
+from quarn_test import TestCase, is_sanitized, make_source, tree, wait_until  # noqa: E402
 
 PACKAGE = "org.example.notes"
 COMPANION = "com.velmor.pellix-efl"
@@ -114,22 +114,11 @@ class ServerTest(TestCase):
 
     def tree(self):
         """Everything of the application: its name, kind, owner, mode and content."""
-        top = self.device.app_path(PACKAGE)
-        found = {}
-        for folder, folders, files in os.walk(top):
-            for name in folders + files:
-                path = os.path.join(folder, name)
-                status = os.lstat(path)
-                content = None
-                if name in files:
-                    with open(path, "rb") as file:
-                        content = file.read()
-                found[path[len(top):]] = (status.st_mode, status.st_uid, status.st_gid, content)
-        return found
+        return tree(self.device.app_path(PACKAGE))
 
     def assert_unharmed(self, memory=MOST_MEMORY):
         self.assertEqual(self.device.daemon_pid(), self.pid, "the daemon is another one")
-        if not is_sanitized(os.path.join(BIN_DIR, "quarnd")):
+        if not is_sanitized():
             self.assertLess(number(self.pid, "VmHWM") - self.memory, memory)
         self.assertLess(len(self.device.log()) - self.log, MOST_LOG)
         self.assertEqual(self.tree(), self.before)

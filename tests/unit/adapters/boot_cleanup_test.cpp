@@ -20,6 +20,7 @@
 #include "platform_package_manager.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/working_files.h"
+#include "temp_dir.h"
 
 namespace {
 
@@ -38,8 +39,6 @@ const auto info = reinterpret_cast<package_info_h>(info_object);
 class BootCleanupTest : public ::testing::Test {
  protected:
   BootCleanupTest() {
-    char folder[] = "/tmp/boot-cleanup-XXXXXX";
-    root = mkdtemp(folder);
     shared = root / "shared/data";
     fs::create_directories(shared);
     boot_cleanup_done = false;
@@ -59,7 +58,6 @@ class BootCleanupTest : public ::testing::Test {
           return PACKAGE_MANAGER_ERROR_NONE;
         });
   }
-  ~BootCleanupTest() override { fs::remove_all(root); }
 
   fs::path make_file(const fs::path &path) {
     std::ofstream(path) << "left behind";
@@ -79,7 +77,8 @@ class BootCleanupTest : public ::testing::Test {
   }
 
   NiceMock<MockPlatform> platform;
-  fs::path root;
+  const TempDir dir;
+  const fs::path root = dir.path();
   fs::path shared;
 };
 

@@ -18,20 +18,9 @@ using ::testing::_;
 
 namespace {
 
-// One run at a time uses the fixed staging directory, also among processes.
-constexpr char kLockPath[] = "/tmp/quarn_backup_test.lock";
-
 std::mutex status_mutex;
 std::vector<SentStatus> statuses;
 std::function<void(int, int)> status_hook;
-
-// Hundreds of packages are quicker made in memory, where there is enough.
-std::string packages_directory() {
-  constexpr std::uintmax_t kEnough = 256U << 20;
-  std::error_code none;
-  const auto space = std::filesystem::space("/dev/shm", none);
-  return !none && space.available >= kEnough ? "/dev/shm" : "/tmp";
-}
 
 FakePackage *as_package(package_info_h info) { return reinterpret_cast<FakePackage *>(info); }
 
@@ -271,12 +260,7 @@ std::vector<backup_trans_file_info_s> FakeCloud::children(const std::string &fol
 /* ---- device ---- */
 
 BackupDevice::BackupDevice() {
-  lock_ = open(kLockPath, O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-  EXPECT_GE(lock_, 0);
-  EXPECT_EQ(flock(lock_, LOCK_EX), 0);
   std::filesystem::remove_all("/tmp/quarn");
-  std::string name = packages_directory() + "/quarn_backup_test_XXXXXX";
-  directory_ = mkdtemp(name.data());
   fake_wifi = 1;
   set_backup_wifi_probe([] { return fake_wifi.load(); });
   manual_backup_canceled = false;
@@ -289,9 +273,7 @@ BackupDevice::BackupDevice() {
 BackupDevice::~BackupDevice() {
   set_backup_progress_sink(nullptr);
   await_no_archives();
-  std::filesystem::remove_all(directory_);
   std::filesystem::remove_all("/tmp/quarn");
-  close(lock_);
 }
 
 FakePackage &BackupDevice::install(const std::string &id, const std::string &version,
@@ -429,24 +411,6 @@ void BackupDevice::script_packages() {
     *value = settings_[key];
     return VCONF_OK;
   });
-}
-
-void write_text(const std::string &path, const std::string &content) {
-  std::ofstream file(path, std::ios::trunc | std::ios::binary);
-  file << content;
-  EXPECT_TRUE(file.flush().good()) << path;
-}
-
-std::string read_text(const std::string &path) {
-  std::ifstream file(path, std::ios::binary);
-  std::stringstream content;
-  content << file.rdbuf();
-  return content.str();
-}
-
-bool exists(const std::string &path) {
-  struct stat status = {};
-  return lstat(path.c_str(), &status) == 0;
 }
 
 void write_sparse(const std::string &path, std::uint64_t size) {

@@ -23,6 +23,7 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_dbus_client.h"
+#include "temp_dir.h"
 
 inline constexpr char kSerial[] = "350000000000001";
 inline constexpr char kAppListInCloud[] = "/app_list/app_list.txt";
@@ -147,7 +148,7 @@ class BackupDevice : public ::testing::Test {
                        const std::string &content = "private");
   FakePackage &package(const std::string &id);
   void remove(const std::string &id);
-  std::string path(const std::string &name) const { return directory_ + "/" + name; }
+  std::string path(const std::string &name) const { return directory_ / name; }
 
   ::testing::NiceMock<MockPlatform> platform_;
   FakeCloud cloud_;
@@ -160,13 +161,9 @@ class BackupDevice : public ::testing::Test {
 
  private:
   void script_packages();
-  std::string directory_;
-  int lock_ = -1;
+  const TempDir directory_{quick_directory()};
 };
 
-void write_text(const std::string &path, const std::string &content);
-std::string read_text(const std::string &path);
-bool exists(const std::string &path);
 /** A file of exactly @p size bytes that takes no space. */
 void write_sparse(const std::string &path, std::uint64_t size);
 

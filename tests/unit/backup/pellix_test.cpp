@@ -1,7 +1,5 @@
 #include <fcntl.h>
 #include <json-c/json.h>
-#include <sched.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -25,19 +23,6 @@ namespace {
 
 const std::string kCompanionRoot = "/opt/usr/apps/com.velmor.pellix-efl";
 const std::string kCompanionDir = kCompanionRoot + "/shared/data";
-
-/** /opt of its own, where that is permitted; the real one is left as it was otherwise. */
-class PrivateOpt : public ::testing::Environment {
- public:
-  void SetUp() override {
-    std::filesystem::create_directories("/opt");
-    if (unshare(CLONE_NEWNS) != 0) return;
-    if (mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return;
-    static_cast<void>(mount("quarn", "/opt", "tmpfs", 0, nullptr));
-  }
-};
-[[maybe_unused]] ::testing::Environment *const private_opt =
-    ::testing::AddGlobalTestEnvironment(new PrivateOpt);
 
 class Pellix : public BackupDevice {
  protected:

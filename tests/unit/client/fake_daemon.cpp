@@ -13,7 +13,6 @@
 
 namespace {
 
-constexpr std::int64_t kDeadlineUs = 20000000;
 constexpr unsigned short kRows = 25;
 
 constexpr char kDaemonXml[] =
@@ -236,18 +235,6 @@ void FakeDaemon::on_call(GDBusConnection *connection, const char *, const char *
   // A copy: the script may replace itself.
   const Script script = found->second;
   script(IncomingCall(connection, invocation));
-}
-
-bool run_until(const std::function<bool()> &condition) {
-  const std::int64_t deadline = g_get_monotonic_time() + kDeadlineUs;
-  // Something always wakes the loop in time to look at the deadline.
-  const guint tick = g_timeout_add(
-      100, [](gpointer) -> gboolean { return TRUE; }, nullptr);
-  while (!condition() && g_get_monotonic_time() < deadline) {
-    g_main_context_iteration(nullptr, TRUE);
-  }
-  g_source_remove(tick);
-  return condition();
 }
 
 QuarnctlRun::QuarnctlRun(const PrivateBus &bus, const std::vector<std::string> &arguments,

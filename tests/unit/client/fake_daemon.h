@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "quarn_handles.h"
+#include "run_until.h"
 
 /** A dbus-daemon of the test's own. */
 class PrivateBus {
@@ -138,9 +139,6 @@ class QuarnctlRun {
   UniqueFd terminal_;
   guint terminal_source_ = 0;
 };
-
-/** Runs the main context until @p condition holds; false after the deadline. */
-bool run_until(const std::function<bool()> &condition);
 
 /** One run from start to end. */
 Outcome quarnctl(const PrivateBus &bus, const std::vector<std::string> &arguments);

@@ -11,7 +11,6 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -31,6 +30,7 @@
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
+#include "temp_dir.h"
 
 namespace {
 
@@ -853,8 +853,6 @@ TEST_F(Server, AnswersAreOnTheirWayWhenTheNameIsGivenUp) {
 class EarlierProcess {
  public:
   EarlierProcess() {
-    EXPECT_NE(mkdtemp(folder_.data()), nullptr);
-    lock_ = folder_ + "/lock";
     int ready[2];
     EXPECT_EQ(pipe2(ready, O_CLOEXEC), 0);
     EXPECT_EQ(pipe2(hold_, O_CLOEXEC), 0);
@@ -874,11 +872,7 @@ class EarlierProcess {
     begin_quarn_turn(lock_.c_str(), nullptr, quarnd_dispatch_deferred);
     EXPECT_FALSE(is_quarn_turn());
   }
-  ~EarlierProcess() {
-    end();
-    unlink(lock().c_str());
-    rmdir(folder_.c_str());
-  }
+  ~EarlierProcess() { end(); }
   EarlierProcess(const EarlierProcess &) = delete;
   EarlierProcess &operator=(const EarlierProcess &) = delete;
   void end() {
@@ -891,8 +885,8 @@ class EarlierProcess {
 
  private:
   const std::string &lock() const { return lock_; }
-  std::string lock_;
-  std::string folder_ = "/tmp/quarn-server-XXXXXX";
+  const TempDir folder_;
+  const std::string lock_ = folder_ / "lock";
   int hold_[2] = {-1, -1};
   pid_t pid_ = 0;
 };
@@ -1109,11 +1103,9 @@ std::string bare(const std::string &xml) {
 }
 
 TEST(Introspection, InstalledDocumentSaysTheSame) {
-  std::ifstream file(QUARN_INTROSPECTION_FILE);
-  ASSERT_TRUE(file) << QUARN_INTROSPECTION_FILE;
-  std::stringstream content;
-  content << file.rdbuf();
-  EXPECT_EQ(bare(content.str()), bare(quarn_introspection_xml));
+  const std::string content = read_text(QUARN_INTROSPECTION_FILE);
+  ASSERT_NE(content, "") << QUARN_INTROSPECTION_FILE;
+  EXPECT_EQ(bare(content), bare(quarn_introspection_xml));
 }
 
 std::string arguments(GDBusArgInfo **args) {

@@ -23,6 +23,7 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "resident_memory.h"
 
 namespace {
 
@@ -79,14 +80,6 @@ constexpr std::size_t kBytesOfWaiting = 12288;
 #endif
 
 /** Memory of this process that is in use. */
-std::size_t resident_bytes() {
-  std::ifstream statm("/proc/self/statm");
-  std::size_t total = 0;
-  std::size_t resident = 0;
-  statm >> total >> resident;
-  return resident * static_cast<std::size_t>(sysconf(_SC_PAGESIZE));
-}
-
 /** Write to that much of the stack. */
 void use_stack(std::size_t bytes) {
   auto *const used = static_cast<volatile char *>(alloca(bytes));

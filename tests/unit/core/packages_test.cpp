@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -14,6 +12,7 @@
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
 #include "quarn_dbus_server.h"
+#include "test_files.h"
 
 namespace {
 
@@ -147,10 +146,8 @@ std::string interface_text(const char *xml) {
 }
 
 TEST(PackagesDocument, IsTheOneThatIsInstalled) {
-  std::ifstream file(QUARN_PACKAGES_FILE);
-  std::stringstream installed;
-  installed << file.rdbuf();
-  EXPECT_EQ(interface_text(installed.str().c_str()), interface_text(kPackagesIntrospection));
+  const std::string installed = read_text(QUARN_PACKAGES_FILE);
+  EXPECT_EQ(interface_text(installed.c_str()), interface_text(kPackagesIntrospection));
 }
 
 }  // namespace

@@ -75,8 +75,6 @@ BusOwner *const bus_owner = [] {
   return owner;
 }();
 
-gboolean wake(gpointer) { return G_SOURCE_CONTINUE; }
-
 }  // namespace
 
 const std::string &private_bus_address() { return bus_owner->address(); }
@@ -90,18 +88,6 @@ ConnectionHandle connect_to_private_bus() {
       nullptr, nullptr, out(error)));
   EXPECT_TRUE(connection) << error->message;
   return connection;
-}
-
-bool run_until(const std::function<bool()> &done) {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(kDeadlineSeconds);
-  const guint tick = g_timeout_add(20, wake, nullptr);
-  bool result = done();
-  while (!result && std::chrono::steady_clock::now() < deadline) {
-    g_main_context_iteration(nullptr, TRUE);
-    result = done();
-  }
-  g_source_remove(tick);
-  return result;
 }
 
 ScriptedClient::ScriptedClient(bool with_object)

@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "quarn_d_utils/handles.h"
+#include "run_until.h"
 
 using ConnectionHandle = Handle<GDBusConnection, &g_object_unref>;
 
@@ -25,9 +26,6 @@ const std::string &private_bus_address();
 
 /** A connection of one's own to that bus. */
 ConnectionHandle connect_to_private_bus();
-
-/** Run the default context until @p done or a deadline. @return what @p done said last */
-bool run_until(const std::function<bool()> &done);
 
 /** What came of a call: the printed reply, or an error's D-Bus name and text. */
 struct CallOutcome {

@@ -17,25 +17,11 @@
 #include <string>
 #include <thread>
 
+#include "temp_dir.h"
+
 namespace {
 
 constexpr int kDeadlineMs = 20000;
-
-/** A folder with the lock in it. */
-class Folder {
- public:
-  Folder() { EXPECT_NE(mkdtemp(path_.data()), nullptr); }
-  ~Folder() {
-    unlink(lock().c_str());
-    rmdir(path_.c_str());
-  }
-  Folder(const Folder &) = delete;
-  Folder &operator=(const Folder &) = delete;
-  std::string lock() const { return path_ + "/lock"; }
-
- private:
-  std::string path_ = "/tmp/quarn-turn-XXXXXX";
-};
 
 /** A process that holds the lock until it is let go; it tells of SIGUSR1 and of lines. */
 class Holder {
@@ -122,14 +108,14 @@ void check(bool holds, const char *what) {
 }
 
 void take_a_free_turn() {
-  const Folder folder;
-  const std::string lock = folder.lock();
+  const TempDir folder;
+  const std::string lock = folder / "lock";
   begin_quarn_turn(lock.c_str(), nullptr, on_turn);
   check(is_quarn_turn(), "the turn is there");
   check(wait_for_quarn_turn(0), "nothing to wait for");
   check(!signal_quarn_predecessor(SIGUSR1), "nobody is before it");
   struct stat status {};
-  check(stat(folder.lock().c_str(), &status) == 0 && (status.st_mode & 07777) == 0600,
+  check(stat((folder / "lock").c_str(), &status) == 0 && (status.st_mode & 07777) == 0600,
         "the lock is the owner's alone");
   while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
   }
@@ -158,8 +144,8 @@ bool is_waited_for() {
 /** The earlier process takes its lock away while others wait for it, and a later one makes another.
  */
 void wait_for_a_lock_that_is_removed() {
-  const Folder folder;
-  const std::string lock = folder.lock();
+  const TempDir folder;
+  const std::string lock = folder / "lock";
   Holder first(lock);
   Holder later(lock, Holder::Begin::kWhenTold);
   begin_quarn_turn(lock.c_str(), nullptr, on_turn);
@@ -175,9 +161,9 @@ void wait_for_a_lock_that_is_removed() {
 }
 
 void wait_for_the_turn() {
-  const Folder folder;
-  Holder holder(folder.lock());
-  const std::string lock = folder.lock();
+  const TempDir folder;
+  Holder holder(folder / "lock");
+  const std::string lock = folder / "lock";
   begin_quarn_turn(lock.c_str(), nullptr, on_turn);
   check(!is_quarn_turn(), "another has it");
   check(!wait_for_quarn_turn(10), "it keeps it");
@@ -189,13 +175,13 @@ void wait_for_the_turn() {
   check(is_quarn_turn(), "the turn has come");
   while (!turn_told) g_main_context_iteration(nullptr, TRUE);
   check(!signal_quarn_predecessor(SIGUSR1), "nobody is before it any more");
-  unlink(folder.lock().c_str());
+  unlink((folder / "lock").c_str());
   _exit(::testing::Test::HasFailure() ? 1 : 0);
 }
 
 void leave_lines() {
-  const Folder folder;
-  const std::string lock = folder.lock();
+  const TempDir folder;
+  const std::string lock = folder / "lock";
   Holder holder(lock);
   begin_quarn_turn(lock.c_str(), nullptr, on_turn);
   check(tell_quarn_predecessor("a", SIGUSR2), "it can be told");
@@ -222,8 +208,8 @@ enum class Squat { kFile, kLink, kHardLink, kPipe, kDirectory };
 
 /** Somebody else lies where the lock is to be, and keeps what can be kept of it. */
 void take_the_turn_in_spite_of(Squat squat) {
-  const Folder folder;
-  const std::string lock = folder.lock();
+  const TempDir folder;
+  const std::string lock = folder / "lock";
   const std::string other = lock + ".other";
   const int file = open(other.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
   check(file >= 0, "another's file is made");

@@ -5,6 +5,7 @@
 #include <json-c/json.h>
 #include <sys/stat.h>
 
+#include <filesystem>
 #include <string>
 
 #include "log_capture.h"
@@ -31,7 +32,7 @@ class ArchiveFixtures : public ::testing::Test {
     EXPECT_EQ(report.extracted, files);
     EXPECT_TRUE(captured_texts().empty()) << captured_texts()[0];
   }
-  std::string text(const std::string &name) const { return content_of(root_ / name); }
+  std::string text(const std::string &name) const { return read_text(root_ / name); }
   /** Whether the unpacked table has such a member. */
   bool recorded(const std::string &name) const {
     const JsonPtr table(json_tokener_parse(text(kTable).c_str()));

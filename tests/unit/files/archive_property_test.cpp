@@ -8,6 +8,8 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <map>
 #include <random>
 #include <set>
@@ -170,12 +172,12 @@ class OddTrees : public ::testing::TestWithParam<unsigned int> {
     unzip_report report;
     ASSERT_EQ(unzip_data(kPackage, out_.path().c_str(), archive.c_str(), &report), QUARN_OK);
     ASSERT_TRUE(report.complete());
-    table_.reset(json_tokener_parse(content_of(out_ / kTable).c_str()));
+    table_.reset(json_tokener_parse(read_text(out_ / kTable).c_str()));
     ASSERT_NE(table_, nullptr);
   }
   void expect_files(const OddTree &tree) const {
     for (const auto &[path, content] : tree.files) {
-      EXPECT_TRUE(content_of(out_ / path) == content) << path;
+      EXPECT_TRUE(read_text(out_ / path) == content) << path;
       expect_attributes(path);
     }
     std::size_t found = 0;
@@ -240,7 +242,7 @@ TEST_P(OddTrees, MakeTheSameArchiveEachTime) {
     const std::string archive = place_ / std::to_string(i);
     make_zip_data(kPackage, root_.path().c_str(), archive.c_str(), &error, kBackupBounds);
     EXPECT_EQ(error, QUARN_OK);
-    archives.insert(content_of(archive));
+    archives.insert(read_text(archive));
   }
   EXPECT_EQ(archives.size(), 1U);
 }

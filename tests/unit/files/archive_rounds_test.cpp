@@ -4,12 +4,14 @@
 
 #include <cstdint>
 #include <cstring>
+#include <filesystem>
 #include <string>
 #include <vector>
 
 #include "codec_choice.h"
 #include "log_capture.h"
 #include "mock_platform.h"
+#include "noise.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive.h"
 #include "temp_dir.h"
@@ -20,13 +22,6 @@ namespace {
 using ::testing::NiceMock;
 
 constexpr char kPackage[] = "org.example.notes";
-
-std::string noise(std::size_t size) {
-  std::string text(size, '\0');
-  std::uint32_t state = 1;
-  for (char &c : text) c = static_cast<char>((state = state * 1664525 + 1013904223) >> 24);
-  return text;
-}
 
 /** Run a shell command, which gets the archive as $1 and a directory as $2. @return its status */
 int shell(const std::string &command, const std::string &archive, const std::string &dir) {
@@ -71,7 +66,7 @@ class ArchiveRounds : public ::testing::TestWithParam<ArchiveCodec> {
   }
   void expect_unpacked(const std::string &below) const {
     for (const auto &[name, content] : files_) {
-      EXPECT_TRUE(content_of(below + "/" + name) == content) << name;
+      EXPECT_TRUE(read_text(below + "/" + name) == content) << name;
     }
   }
 
@@ -99,7 +94,7 @@ TEST_P(ArchiveRounds, EitherCodecReadsTheArchive) {
     EXPECT_TRUE(report.complete());
     EXPECT_EQ(report.extracted, files_.size() + 1);
     expect_unpacked(out.path());
-    EXPECT_NE(content_of(out / "shared/data/org.example.notes.perm").find("data\\/deep\\/er"),
+    EXPECT_NE(read_text(out / "shared/data/org.example.notes.perm").find("data\\/deep\\/er"),
               std::string::npos);
   }
 }
@@ -155,7 +150,7 @@ TEST_P(ArchiveRounds, AnApplicationWithoutDataYieldsItsTableAlone) {
   for (const char *dir : {"data", "shared/data", "shared/trusted"}) root_.dir(dir);
   pack(GetParam());
   EXPECT_EQ(unzip_data(kPackage, out_.path().c_str(), archive_.c_str()), QUARN_OK);
-  EXPECT_EQ(content_of(out_ / "shared/data/org.example.notes.perm"),
+  EXPECT_EQ(read_text(out_ / "shared/data/org.example.notes.perm"),
             R"({ "quarn_symbolic_info": [ ] })");
   EXPECT_FALSE(exists(out_ / "data"));
 }

@@ -12,6 +12,7 @@
 
 #include "fault.h"
 #include "log_capture.h"
+#include "noise.h"
 
 namespace {
 
@@ -61,13 +62,6 @@ std::string words(std::size_t size) {
     text += "line " + std::to_string(i * 2654435761U) + " of a note\n";
   }
   text.resize(size);
-  return text;
-}
-
-std::string noise(std::size_t size) {
-  std::mt19937 random(7);
-  std::string text(size, '\0');
-  for (char &c : text) c = static_cast<char>(random());
   return text;
 }
 

@@ -92,6 +92,7 @@ WRAP(int, linkat, -1, (int from, const char *old_name, int to, const char *name,
 WRAP(int, mkdirat, -1, (int dir, const char *name, mode_t mode), (dir, name, mode))
 WRAP(int, fstatat, -1, (int dir, const char *name, struct stat *status, int flags),
      (dir, name, status, flags))
+WRAP(int, fstat, -1, (int fd, struct stat *status), (fd, status))
 WRAP(ssize_t, copy_file_range, -1,
      (int from, off_t *from_at, int to, off_t *to_at, size_t size, unsigned int flags),
      (from, from_at, to, to_at, size, flags))
@@ -156,17 +157,12 @@ int __wrap_ioctl(int fd, unsigned long request, ...) {
 
 }  // extern "C"
 
-// functions of C++ have their mangled names here
-extern "C" {
-int real_safe_lstat(const char *path, struct stat *status) asm("__real__Z10safe_lstatPKcP4stat");
-int wrap_safe_lstat(const char *path, struct stat *status) asm("__wrap__Z10safe_lstatPKcP4stat");
-int wrap_safe_lstat(const char *path, struct stat *status) {
-  return is_faulty("safe_lstat") ? -1 : real_safe_lstat(path, status);
-}
-
-void *real_new(std::size_t size, const std::nothrow_t &tag) asm("__real__ZnwmRKSt9nothrow_t");
-void *wrap_new(std::size_t size, const std::nothrow_t &tag) asm("__wrap__ZnwmRKSt9nothrow_t");
-void *wrap_new(std::size_t size, const std::nothrow_t &tag) {
-  return is_faulty("new") ? nullptr : real_new(size, tag);
-}
+// A program may bring its own of these; what it gives is deleted as any other memory.
+void *operator new(std::size_t size, const std::nothrow_t &) noexcept {
+  if (is_faulty("new")) return nullptr;
+  try {
+    return ::operator new(size);
+  } catch (const std::bad_alloc &) {
+    return nullptr;
+  }
 }

@@ -175,7 +175,7 @@ TEST_F(FileInfoTable, IsSavedAndReleased) {
   EXPECT_EQ(add(dir_.file("data/a", "x")), 0);
   const auto expected = text();
   EXPECT_EQ(save_file_info_table(table_.get(), (dir_ / "out/table.perm").c_str()), QUARN_OK);
-  EXPECT_EQ(content_of(dir_ / "out/table.perm"), expected);
+  EXPECT_EQ(read_text(dir_ / "out/table.perm"), expected);
   EXPECT_EQ(table_->root, nullptr);
   // nothing left to save
   EXPECT_EQ(save_file_info_table(table_.get(), (dir_ / "out/x").c_str()), QUARN_BAD_ARGUMENT);

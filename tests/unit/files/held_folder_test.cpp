@@ -50,7 +50,7 @@ TEST_F(HeldFolderTest, PathsLeadToTheFolderThatWasOpened) {
   }
   EXPECT_EQ(read_by_path(path), "second");
   EXPECT_FALSE(exists(dir_ / "root/data/new"));
-  EXPECT_EQ(content_of(dir_ / "aside/data/new/file"), "new");
+  EXPECT_EQ(read_text(dir_ / "aside/data/new/file"), "new");
 }
 
 TEST_F(HeldFolderTest, NothingIsFoundOrMadeWhenItHasGone) {

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <linux/capability.h>
 #include <sys/fsuid.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/xattr.h>
 
@@ -416,7 +417,7 @@ TEST_F(PackageIdentity, WhatRootKeepsIsMovedToTheApplicationAndNoFurther) {
   file("root/kept", 0600, kApp.uid);
   const UniqueFd root(open((dir_ / "root").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   EXPECT_EQ(rename_as_package(root.get(), "kept", folder_.get(), "back", kApp), 0);
-  EXPECT_EQ(content_of(dir_ / "data/back"), "root/kept");
+  EXPECT_EQ(read_text(dir_ / "data/back"), "root/kept");
   give("data/open", 0772, kOther);
   open_folder("data/open");
   file("root/kept", 0600, kApp.uid);

@@ -6,6 +6,7 @@
 #include <linux/seccomp.h>
 #include <stddef.h>
 #include <sys/prctl.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 
@@ -81,7 +82,7 @@ TEST_P(SafePath, NeverFollowsTheLastComponent) {
     EXPECT_FALSE(safe_open(link.c_str(), O_RDONLY));
     EXPECT_EQ(errno, ELOOP);
     EXPECT_FALSE(safe_open(link.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600));
-    EXPECT_EQ(content_of(dir / "target"), "x");
+    EXPECT_EQ(read_text(dir / "target"), "x");
     struct stat status = {};
     ASSERT_EQ(safe_lstat(link.c_str(), &status), 0);
     EXPECT_TRUE(S_ISLNK(status.st_mode));
@@ -263,7 +264,7 @@ TEST_P(SafePath, NamesADescriptor) {
     const UniqueFd fd = safe_open(path.c_str(), O_RDONLY);
     EXPECT_EQ(fd_path(fd.get()),
               "/proc/" + std::to_string(getpid()) + "/fd/" + std::to_string(fd.get()));
-    EXPECT_EQ(content_of(fd_path(fd.get())), "x");
+    EXPECT_EQ(read_text(fd_path(fd.get())), "x");
   });
 }
 

@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <cstdint>
+#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -60,8 +61,8 @@ class ZipReader : public ::testing::TestWithParam<ArchiveCodec> {
     const std::string name = entry.name.c_str();  // logs end at a NUL
     EXPECT_THAT(captured_texts(), ElementsAre("refused archive entry " + name + ": " + why,
                                               "extract_file_from_zip() failed " + name));
-    EXPECT_EQ(content_of(root_ / "data/first"), "1");
-    EXPECT_EQ(content_of(root_ / "data/last"), "2");
+    EXPECT_EQ(read_text(root_ / "data/first"), "1");
+    EXPECT_EQ(read_text(root_ / "data/last"), "2");
   }
   /** An archive with one entry that cannot be unpacked, between two good ones. */
   void expect_failed(const ZipEntry &entry, const std::string &message) {
@@ -71,8 +72,8 @@ class ZipReader : public ::testing::TestWithParam<ArchiveCodec> {
     expect_report(2, 0, 1);
     EXPECT_THAT(captured_texts(),
                 ElementsAre(message, "extract_file_from_zip() failed " + logged(entry.name)));
-    EXPECT_EQ(content_of(root_ / "data/first"), "1");
-    EXPECT_EQ(content_of(root_ / "data/last"), "2");
+    EXPECT_EQ(read_text(root_ / "data/first"), "1");
+    EXPECT_EQ(read_text(root_ / "data/last"), "2");
   }
   static std::string logged(const std::string &name) {
     return quarn_shortened(name, kMaxLoggedArgument);
@@ -114,10 +115,10 @@ TEST_P(ZipReader, UnpacksEveryEntryAndMakesItsDirectories) {
                     deflated_entry("shared/data/org.example.notes.perm", "{}")}),
             QUARN_OK);
   expect_report(4, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/deep/er/a"), "text");
-  EXPECT_TRUE(content_of(root_ / "data/deep/b") == large);
+  EXPECT_EQ(read_text(root_ / "data/deep/er/a"), "text");
+  EXPECT_TRUE(read_text(root_ / "data/deep/b") == large);
   EXPECT_TRUE(exists(root_ / "shared/trusted/empty"));
-  EXPECT_EQ(content_of(root_ / "shared/data/org.example.notes.perm"), "{}");
+  EXPECT_EQ(read_text(root_ / "shared/data/org.example.notes.perm"), "{}");
   EXPECT_TRUE(captured_texts().empty());
 }
 
@@ -156,8 +157,8 @@ TEST_P(ZipReader, ReplacesAFileAndLeavesWhoHoldsItOpenTheOldOne) {
   const std::string path = root_.file("data/a", "old and longer");
   const UniqueFd held(open(path.c_str(), O_RDONLY));
   ASSERT_EQ(unpack({deflated_entry("data/a", "new")}), QUARN_OK);
-  EXPECT_EQ(content_of(path), "new");
-  EXPECT_EQ(content_of("/proc/self/fd/" + std::to_string(held.get())), "old and longer");
+  EXPECT_EQ(read_text(path), "new");
+  EXPECT_EQ(read_text("/proc/self/fd/" + std::to_string(held.get())), "old and longer");
 }
 
 TEST_P(ZipReader, ReplacesALinkAndDoesNotFollowIt) {
@@ -166,7 +167,7 @@ TEST_P(ZipReader, ReplacesALinkAndDoesNotFollowIt) {
   root_.link("data/a", other);
   ASSERT_EQ(unpack({deflated_entry("data/a", "new")}), QUARN_OK);
   expect_report(1, 0, 0);
-  EXPECT_EQ(content_of(other), "untouched");
+  EXPECT_EQ(read_text(other), "untouched");
   EXPECT_TRUE(std::filesystem::is_regular_file(std::filesystem::symlink_status(root_ / "data/a")));
 }
 
@@ -181,9 +182,9 @@ TEST_P(ZipReader, ReplacesWhatIsThereAndMakesWhatIsNotInAnyOrder) {
                     deflated_entry("data/e", "5"), deflated_entry("data/f", "6")}),
             QUARN_OK);
   expect_report(5, 0, 1);
-  EXPECT_EQ(content_of(root_ / "data/a") + content_of(root_ / "data/b") +
-                content_of(root_ / "data/c") + content_of(root_ / "data/d") +
-                content_of(root_ / "data/f"),
+  EXPECT_EQ(read_text(root_ / "data/a") + read_text(root_ / "data/b") +
+                read_text(root_ / "data/c") + read_text(root_ / "data/d") +
+                read_text(root_ / "data/f"),
             "12346");
   EXPECT_EQ(errors("fopen() failed, file is NULL " + root_ / "data/e"), 1);
 }
@@ -193,7 +194,7 @@ TEST_P(ZipReader, OfTwoEntriesOfOneNameTheLastStays) {
       unpack({deflated_entry("data/a", "the first and longer"), deflated_entry("data/a", "2")}),
       QUARN_OK);
   expect_report(2, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/a"), "2");
+  EXPECT_EQ(read_text(root_ / "data/a"), "2");
 }
 
 TEST_P(ZipReader, TakesStoredEntries) {
@@ -202,8 +203,8 @@ TEST_P(ZipReader, TakesStoredEntries) {
                     stored_entry("data/empty", "")}),
             QUARN_OK);
   expect_report(3, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/a"), "text");
-  EXPECT_TRUE(content_of(root_ / "data/b") == large);
+  EXPECT_EQ(read_text(root_ / "data/a"), "text");
+  EXPECT_TRUE(read_text(root_ / "data/b") == large);
 }
 
 TEST_P(ZipReader, AnEntryWithZip64SizesIsUnpackedWholeOrRefused) {
@@ -212,7 +213,7 @@ TEST_P(ZipReader, AnEntryWithZip64SizesIsUnpackedWholeOrRefused) {
   entry.zip64 = true;
   if (unpack({entry, deflated_entry("data/b", "x")}) == QUARN_OK) {
     expect_report(2, 0, 0);
-    EXPECT_EQ(content_of(root_ / "data/a"), "text");
+    EXPECT_EQ(read_text(root_ / "data/a"), "text");
   } else {
     EXPECT_THAT(files(), IsEmpty());
   }
@@ -221,7 +222,7 @@ TEST_P(ZipReader, AnEntryWithZip64SizesIsUnpackedWholeOrRefused) {
 TEST_P(ZipReader, TakesAnArchiveWithAZip64EndRecord) {
   EXPECT_EQ(unpack(zip64_bytes({deflated_entry("data/a", "text")})), QUARN_OK);
   expect_report(1, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/a"), "text");
+  EXPECT_EQ(read_text(root_ / "data/a"), "text");
 }
 
 TEST_P(ZipReader, TakesMoreEntriesThanTheEndRecordCanTell) {
@@ -236,7 +237,7 @@ TEST_P(ZipReader, TakesAnArchiveBehindOtherBytes) {
   EXPECT_EQ(unpack(std::string(1000, '#') + zip_bytes({deflated_entry("data/a", "text")})),
             QUARN_OK);
   expect_report(1, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/a"), "text");
+  EXPECT_EQ(read_text(root_ / "data/a"), "text");
 }
 
 TEST_P(ZipReader, TakesTenThousandEntries) {
@@ -247,7 +248,7 @@ TEST_P(ZipReader, TakesTenThousandEntries) {
   }
   EXPECT_EQ(unpack(entries), QUARN_OK);
   expect_report(10000, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/99/9999"), "9999");
+  EXPECT_EQ(read_text(root_ / "data/99/9999"), "9999");
 }
 
 /* ---- archives that are none -------------------------------------------------- */
@@ -309,7 +310,7 @@ TEST_P(ZipReader, NothingKeepsTheTableOutOfItsPlace) {
                     stored_entry(table + "/y/", ""), deflated_entry(table, "{}")}),
             QUARN_OK);
   expect_report(1, 1, 0);
-  EXPECT_EQ(content_of(root_ / table), "{}");
+  EXPECT_EQ(read_text(root_ / table), "{}");
   EXPECT_EQ(errors("refused archive entry " + table + "/: it is a working file of a restore"), 1);
   EXPECT_EQ(errors("refused archive entry " + table + "/x: it is a working file of a restore"), 1);
   EXPECT_EQ(errors("refused archive entry " + table + "/y/: it is a working file of a restore"), 1);
@@ -355,7 +356,7 @@ TEST_P(ZipReader, AFolderEntryMakesTheFolderForTheApplication) {
             QUARN_OK);
   expect_report(1, 0, 0);
   EXPECT_TRUE(captured_texts().empty());
-  EXPECT_EQ(content_of(root_ / "data/new/a"), "x");
+  EXPECT_EQ(read_text(root_ / "data/new/a"), "x");
   for (const char *name : {"data/new", "data/new/er", "data/packed"}) {
     struct stat status = {};
     ASSERT_EQ(lstat((root_ / name).c_str(), &status), 0) << name;
@@ -423,13 +424,13 @@ TEST_P(ZipReader, RefusesANameBelowALink) {
 TEST_P(ZipReader, RefusesANameBelowAFile) {
   root_.file("data/file", "x");
   expect_refused(deflated_entry("data/file/a", "x"), "its way leads through a file");
-  EXPECT_EQ(content_of(root_ / "data/file"), "x");
+  EXPECT_EQ(read_text(root_ / "data/file"), "x");
 }
 
 TEST_P(ZipReader, OfAFileAndADirectoryOfOneNameTheFirstStays) {
   EXPECT_EQ(unpack({deflated_entry("data/a", "file"), deflated_entry("data/a/b", "x")}), QUARN_OK);
   expect_report(1, 1, 0);
-  EXPECT_EQ(content_of(root_ / "data/a"), "file");
+  EXPECT_EQ(read_text(root_ / "data/a"), "file");
   EXPECT_THAT(captured_texts(),
               ElementsAre("refused archive entry data/a/b: its way leads through a file",
                           "extract_file_from_zip() failed data/a/b"));
@@ -439,7 +440,7 @@ TEST_P(ZipReader, ADirectoryInTheFilesPlaceStays) {
   root_.file("data/a/b", "x");
   expect_failed(deflated_entry("data/a", "file"),
                 "fopen() failed, file is NULL " + root_ / "data/a");
-  EXPECT_EQ(content_of(root_ / "data/a/b"), "x");
+  EXPECT_EQ(read_text(root_ / "data/a/b"), "x");
 }
 
 TEST_P(ZipReader, ANameThatIsTooLongFails) {
@@ -517,7 +518,7 @@ TEST_P(ZipReader, BytesAfterAStreamAreLeftAlone) {
   entry.packed_size = entry.data.size();
   EXPECT_EQ(unpack({entry, deflated_entry("data/b", "x")}), QUARN_OK);
   expect_report(2, 0, 0);
-  EXPECT_EQ(content_of(root_ / "data/a"), "text");
+  EXPECT_EQ(read_text(root_ / "data/a"), "text");
 }
 
 TEST_P(ZipReader, MoreThanAnnouncedIsRefusedAndLeavesNothing) {
@@ -690,7 +691,7 @@ TEST_P(ZipReader, OnlyTheLastOfSeveralTablesIsHeldToTheBounds) {
     EXPECT_EQ(unpack({deflated_entry(kTableName, text), deflated_entry(kTableName, "{}")}),
               QUARN_OK);
     expect_report(2, 0, 0);
-    EXPECT_EQ(content_of(root_ / kTableName), "{}");
+    EXPECT_EQ(read_text(root_ / kTableName), "{}");
     EXPECT_EQ(unpack({deflated_entry(kTableName, "{}"), deflated_entry(kTableName, text)}),
               QUARN_UNREADABLE);
   }
@@ -836,7 +837,7 @@ TEST_P(ZipReader, EntriesOfManyDirectoriesComeInAnyOrder) {
   }
   EXPECT_EQ(unpack(entries), QUARN_OK);
   expect_report(60, 0, 0);
-  for (int i = 0; i < 60; ++i) EXPECT_EQ(content_of(root_ / entries[i].name), std::to_string(i));
+  for (int i = 0; i < 60; ++i) EXPECT_EQ(read_text(root_ / entries[i].name), std::to_string(i));
 }
 
 TEST_P(ZipReader, AFileThatCannotBeWrittenIsLeftInPart) {
@@ -845,7 +846,7 @@ TEST_P(ZipReader, AFileThatCannotBeWrittenIsLeftInPart) {
   expect_report(1, 0, 1);
   EXPECT_THAT(captured_texts(),
               ElementsAre("fwrite() failed", "extract_file_from_zip() failed data/a"));
-  EXPECT_EQ(content_of(root_ / "data/b"), "x");
+  EXPECT_EQ(read_text(root_ / "data/b"), "x");
 }
 
 TEST_P(ZipReader, ADirectoryThatCannotBeMadeFails) {
@@ -878,7 +879,7 @@ TEST_P(ZipReader, OneEntryCanBeUnpackedByItself) {
   ASSERT_EQ(unzOpenCurrentFile2(archive, nullptr, nullptr, 1), UNZ_OK);
   EXPECT_FALSE(extract_file_from_zip(kPackage, root_.path().c_str(), archive, "data/../b"));
   unzClose(archive);
-  EXPECT_EQ(content_of(root_ / "data/a"), "text");
+  EXPECT_EQ(read_text(root_ / "data/a"), "text");
   EXPECT_THAT(captured_texts(),
               Contains("refused archive entry data/../b: its name leaves its place"));
 }

@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -76,7 +78,7 @@ class ZipWriter : public ::testing::TestWithParam<ArchiveCodec> {
     EXPECT_EQ(excess_.size, size);
     EXPECT_EQ(excess_.limit, limit);
   }
-  std::vector<ZipEntry> entries() const { return parse_zip(content_of(archive_)); }
+  std::vector<ZipEntry> entries() const { return parse_zip(read_text(archive_)); }
   std::vector<std::string> names() const {
     std::vector<std::string> all;
     for (const ZipEntry &entry : entries()) all.push_back(entry.name);
@@ -171,7 +173,7 @@ TEST_P(ZipWriter, PacksFilesOfEverySize) {
   ASSERT_EQ(pack(), 0);
   for (const std::size_t size : {0, 1, 4095, 4096, 4097, 65536, 262144, 262145, 1000000}) {
     const std::string name = "data/" + std::to_string(size);
-    EXPECT_TRUE(text(name) == content_of(root_ / name)) << size;
+    EXPECT_TRUE(text(name) == read_text(root_ / name)) << size;
   }
 }
 
@@ -317,9 +319,9 @@ TEST_P(ZipWriter, TheSameDataMakesTheSameArchive) {
     root_.file("data/" + std::to_string(i), std::string(static_cast<std::size_t>(i) * 997, 'a'));
   }
   ASSERT_EQ(pack(), 0);
-  const std::string first = content_of(archive_);
+  const std::string first = read_text(archive_);
   ASSERT_EQ(pack(), 0);
-  EXPECT_TRUE(content_of(archive_) == first);
+  EXPECT_TRUE(read_text(archive_) == first);
 }
 
 TEST_P(ZipWriter, TheArchiveIsTheDaemonsAloneAndItsDirectoryIsMade) {
@@ -355,7 +357,7 @@ TEST_P(ZipWriter, ALinkInTheArchivesPlaceIsNotFollowed) {
   const std::string other = place_.file("other", "x");
   place_.link("archive.zip", other);
   EXPECT_EQ(pack(), QUARN_UNREADABLE);
-  EXPECT_EQ(content_of(other), "x");
+  EXPECT_EQ(read_text(other), "x");
   EXPECT_EQ(errors("zipOpen() failed, zf is NULL"), 1);
 }
 
@@ -596,7 +598,7 @@ TEST_P(ZipWriter, TheDeepestTreeIsTakenByARestoreAndADeeperOneIsNot) {
   unzip_report report;
   EXPECT_EQ(unzip_data(kPackage, out.path().c_str(), archive_.c_str(), &report), QUARN_OK);
   EXPECT_TRUE(report.complete());
-  EXPECT_EQ(content_of(out / (path + "/deepest")), "text");
+  EXPECT_EQ(read_text(out / (path + "/deepest")), "text");
   root_.file(path + "/d/beyond", "text");
   EXPECT_EQ(pack_within(kBackupBounds), QUARN_REFUSED);
   expect_excess(archive_bound::depth, kMaxDirDepth + 1, kMaxDirDepth);
@@ -877,7 +879,7 @@ TEST_P(ZipWriter, AFileInTheTablesPlaceIsPackedAndStays) {
   EXPECT_EQ(pack(), 0);
   EXPECT_THAT(names(), ElementsAre(kTableEntry, kTableEntry));
   EXPECT_EQ(inflate_text(entries()[1].data).find(R"({ "quarn_symbolic_info")"), 0U);
-  EXPECT_EQ(content_of(own), "the application's own");
+  EXPECT_EQ(read_text(own), "the application's own");
   struct stat after = {};
   ASSERT_EQ(lstat(own.c_str(), &after), 0);
   EXPECT_EQ(after.st_ino, before.st_ino);
@@ -891,7 +893,7 @@ TEST_P(ZipWriter, WhateverAFileInTheTablesPlaceHoldsTheArchiveIsTakenByARestore)
   unzip_report report;
   EXPECT_EQ(unzip_data(kPackage, out.path().c_str(), archive_.c_str(), &report), QUARN_OK);
   EXPECT_TRUE(report.complete());
-  EXPECT_EQ(content_of(out / "data/a"), "x");
+  EXPECT_EQ(read_text(out / "data/a"), "x");
 }
 
 TEST_P(ZipWriter, ALinkInTheTablesPlaceStays) {

@@ -9,29 +9,14 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <functional>
+#include <filesystem>
 #include <string>
 
+#include "run_until.h"
 #include "state/facts.h"
 #include "state/state_file.h"
 #include "state/watch.h"
 #include "temp_dir.h"
-
-/** Run the main loop until @p done; false when it is not within ten seconds. */
-inline bool run_until(const std::function<bool()> &done) {
-  constexpr guint kDeadlineSeconds = 10;
-  bool late = false;
-  const guint timer = g_timeout_add_seconds(
-      kDeadlineSeconds,
-      [](gpointer flag) -> gboolean {
-        *static_cast<bool *>(flag) = true;
-        return G_SOURCE_CONTINUE;
-      },
-      &late);
-  while (!done() && !late) g_main_context_iteration(nullptr, TRUE);
-  g_source_remove(timer);
-  return done();
-}
 
 /** A device directory that is the process's device while the test runs. */
 class DeviceTest : public ::testing::Test {

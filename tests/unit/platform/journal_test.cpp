@@ -2,6 +2,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <fstream>
+
 #include "device_fixture.h"
 #include "platform_log.h"
 
@@ -17,10 +19,7 @@ class Journal : public DeviceTest {
     setenv("FAKE_JOURNAL", (dir_ / "journal").c_str(), 1);
   }
   void TearDown() override { unsetenv("FAKE_JOURNAL"); }
-  std::string journal() const {
-    std::ifstream file(dir_ / "journal");
-    return {std::istreambuf_iterator<char>(file), {}};
-  }
+  std::string journal() const { return read_text(dir_ / "journal"); }
 };
 
 TEST_F(Journal, HasTheMessageAndItsPlaceInFieldsOfTheirOwn) {

@@ -4,6 +4,8 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <filesystem>
+#include <fstream>
 #include <thread>
 #include <vector>
 

@@ -1,6 +1,7 @@
 #include "state/packages.h"
 
 #include <cstdlib>
+#include <filesystem>
 #include <memory>
 
 #include "device_fixture.h"

@@ -2,6 +2,9 @@
 
 #include <sys/stat.h>
 
+#include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <set>
 #include <thread>
 #include <vector>
@@ -14,11 +17,6 @@ namespace {
 
 using StateFile = DeviceTest;
 
-std::string read_file(const std::string &path) {
-  std::ifstream file(path);
-  return {std::istreambuf_iterator<char>(file), {}};
-}
-
 TEST_F(StateFile, IsEmptyWhenItIsMissing) {
   const embedded::KeyFilePtr file = embedded::read_state(device(), "none.ini");
   ASSERT_NE(file, nullptr);
@@ -30,7 +28,7 @@ TEST_F(StateFile, CannotBeReadWhenItIsSpoilt) {
   spoil("some.ini");
   EXPECT_EQ(embedded::read_state(device(), "some.ini"), nullptr);
   EXPECT_FALSE(embedded::edit_state(device(), "some.ini", [](GKeyFile *) { return true; }));
-  EXPECT_EQ(read_file(dir_ / "state/some.ini"), "no key file\n");
+  EXPECT_EQ(read_text(dir_ / "state/some.ini"), "no key file\n");
 }
 
 TEST_F(StateFile, IsReplacedWholeAndLeavesNothingBeside) {
@@ -42,7 +40,7 @@ TEST_F(StateFile, IsReplacedWholeAndLeavesNothingBeside) {
   ASSERT_TRUE(embedded::write_state_text(device(), "some.ini", "[a]\nb=2\n", 0640));
   // Whoever had it open still reads the old one to its end.
   EXPECT_EQ(std::string(std::istreambuf_iterator<char>(reader), {}), "[a]\nb=1\n");
-  EXPECT_EQ(read_file(dir_ / "state/some.ini"), "[a]\nb=2\n");
+  EXPECT_EQ(read_text(dir_ / "state/some.ini"), "[a]\nb=2\n");
   EXPECT_TRUE(std::filesystem::is_empty(dir_ / "state/.tmp"));
 }
 
@@ -52,7 +50,7 @@ TEST_F(StateFile, IsLeftAsItIsByAChangeThatDeclines) {
     g_key_file_set_integer(file, "a", "b", 2);
     return false;
   }));
-  EXPECT_EQ(read_file(dir_ / "state/some.ini"), "[a]\nb=1\n");
+  EXPECT_EQ(read_text(dir_ / "state/some.ini"), "[a]\nb=1\n");
 }
 
 TEST_F(StateFile, CannotBeWrittenOverADirectory) {

@@ -15,8 +15,6 @@
 
 namespace {
 
-int steps_left = 0;
-
 class CrashTest : public RestoreTest {
  protected:
   CrashTest() {
@@ -60,19 +58,10 @@ class CrashTest : public RestoreTest {
 
   /** Run @p work in a process that is killed at its @p step th step. @return false: it ended */
   bool killed_at(int step, const std::function<void()> &work) {
-    const pid_t child = fork();
-    if (child == 0) {
-      steps_left = step;
-      restore_step_hook = [](const char *) {
-        if (--steps_left == 0) raise(SIGKILL);
-      };
+    return is_killed_in([&] {
+      const AtNthStep kill(step, [](const std::string &) { raise(SIGKILL); });
       work();
-      _exit(0);
-    }
-    int status = 0;
-    EXPECT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_FALSE(WIFEXITED(status) && WEXITSTATUS(status) != 0);
-    return WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL;
+    });
   }
 
   /** What the next daemon does. */
@@ -85,11 +74,7 @@ class CrashTest : public RestoreTest {
     return tree;
   }
 
-  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
-                                       {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
-                                       {"data/added/deep/file", "added"},
-                                       {"shared/data/pictures/one.jpg", "n", 0644},
-                                       {"shared/trusted/key.bin", "new key", 0444}};
+  const std::vector<Entry> &new_data = new_app_data();
   std::string archive = base + "/archive.zip";
   Tree old_tree;
   Tree new_tree;
@@ -127,17 +112,10 @@ TEST_F(CrashTest, KilledAtEveryStepOfTheRecovery) {
   int step = 1;
   for (;; ++step) {
     reset_data();
-    const auto interrupted = [this] {
-      restore_step_hook = [](const char *name) {
-        if (std::string(name) == "unpacked") raise(SIGKILL);
-      };
+    ASSERT_TRUE(is_killed_in([this] {
+      const AtStep unpacked("unpacked", [] { raise(SIGKILL); });
       restore_here();
-    };
-    const pid_t child = fork();
-    if (child == 0) interrupted();
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    ASSERT_TRUE(WIFSIGNALED(status));
+    }));
     if (!killed_at(step, [this] { recover_here(); })) break;
     recover_here();
     EXPECT_EQ(tree(), old_tree) << "killed at step " << step;

@@ -60,11 +60,7 @@ class FailureTest : public RestoreTest {
   }
   void expect_untouched() const { EXPECT_EQ(tree_of(root), before); }
 
-  std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
-                                 {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
-                                 {"data/added/deep/file", "added"},
-                                 {"shared/data/pictures/one.jpg", "n", 0644},
-                                 {"shared/trusted/key.bin", "new key", 0444}};
+  std::vector<Entry> new_data = new_app_data();
   Tree before;
 };
 

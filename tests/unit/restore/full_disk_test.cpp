@@ -2,7 +2,6 @@
 #include <fcntl.h>
 #include <sys/mount.h>
 #include <sys/statfs.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <csignal>
@@ -156,8 +155,7 @@ class FullDiskTest : public RestoreTest, public ::testing::WithParamInterface<Ki
   }
   /** Run @p work in a process that ends at its @p nth step, there once the disk is full. */
   bool killed_at(int nth, const std::string &full_from, const std::function<void()> &work) {
-    const pid_t child = fork();
-    if (child == 0) {
+    return is_killed_in([&] {
       static int left;
       static bool full;
       static const SmallDisk *small;
@@ -173,12 +171,7 @@ class FullDiskTest : public RestoreTest, public ::testing::WithParamInterface<Ki
         if (--left == 0) raise(SIGKILL);
       };
       work();
-      _exit(0);
-    }
-    int status = 0;
-    EXPECT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_FALSE(WIFEXITED(status) && WEXITSTATUS(status) != 0);
-    return WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL;
+    });
   }
 
   SmallDisk disk;

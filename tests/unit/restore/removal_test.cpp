@@ -10,16 +10,12 @@
 
 namespace {
 
-int steps_left = 0;
-std::function<void(const std::string &step)> at_last_step;
-
 class RemovalTest : public RestoreTest {
  protected:
   RemovalTest() {
     make_archive(good, new_data);
     make_archive(broken, new_data, "not json");
   }
-  ~RemovalTest() override { restore_step_hook = nullptr; }
 
   void install() {
     std::filesystem::remove_all(root);
@@ -36,27 +32,20 @@ class RemovalTest : public RestoreTest {
     request_restore(&ctx);
     std::filesystem::copy_file(archive, download());
     std::string last;
-    steps_left = nth;
-    at_last_step = [&](const std::string &step) {
-      last = step;
-      act();
-    };
-    restore_step_hook = [](const char *step) {
-      if (--steps_left == 0) at_last_step(step);
-    };
-    answer();
-    restore_step_hook = nullptr;
+    {
+      const AtNthStep nth_step(nth, [&](const std::string &step) {
+        last = step;
+        act();
+      });
+      answer();
+    }
     const bool was_over = last.empty() || last == "snapshot-released";
     EXPECT_TRUE(was_over || ctx.result != 0) << "removed at " << last;
     clear_captured_log();
     return last;
   }
 
-  const std::vector<Entry> new_data = {{"data/settings.ini", "new settings", 0600},
-                                       {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
-                                       {"data/added/deep/file", "added"},
-                                       {"shared/data/pictures/one.jpg", "n", 0644},
-                                       {"shared/trusted/key.bin", "new key", 0444}};
+  const std::vector<Entry> &new_data = new_app_data();
   std::string good = base + "/good.zip";
   std::string broken = base + "/broken.zip";
 };

@@ -3,12 +3,11 @@
 #include <fcntl.h>
 #include <linux/capability.h>
 #include <linux/securebits.h>
-#include <sched.h>
-#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 #include <zip.h>
@@ -100,24 +99,13 @@ void relabel_below(UniqueFd fd, const std::string &label) {
 }
 
 std::vector<AtStep *> awaited_steps;
+AtNthStep *awaited_number = nullptr;
 
 void on_step(const char *step) {
   const auto awaited = awaited_steps;
   for (AtStep *one : awaited) one->reached(step);
+  if (awaited_number != nullptr) awaited_number->reached(step);
 }
-
-/** /opt of its own for the companion, where that is permitted. */
-class PrivateOpt : public ::testing::Environment {
- public:
-  void SetUp() override {
-    std::filesystem::create_directories("/opt");
-    if (unshare(CLONE_NEWNS) != 0) return;
-    if (mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return;
-    static_cast<void>(mount("quarn", "/opt", "tmpfs", 0, nullptr));
-  }
-};
-[[maybe_unused]] ::testing::Environment *const private_opt =
-    ::testing::AddGlobalTestEnvironment(new PrivateOpt);
 
 char a_transaction[1];
 
@@ -184,21 +172,6 @@ void set_label(const std::string &path, const std::string &label) {
   ASSERT_EQ(put_label(path.c_str(), label.c_str(), false), 0) << path << strerror(errno);
 }
 
-std::string read_text(const std::string &path) {
-  std::ifstream in(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-}
-
-void write_text(const std::string &path, const std::string &text) {
-  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-  std::ofstream(path, std::ios::binary) << text;
-}
-
-bool exists(const std::string &path) {
-  struct stat status = {};
-  return lstat(path.c_str(), &status) == 0;
-}
-
 Tree tree_of(const std::string &root) {
   Tree tree;
   for (const auto &item : std::filesystem::recursive_directory_iterator(root)) {
@@ -230,11 +203,49 @@ AtStep::AtStep(std::string step, std::function<void()> action, int nth)
 
 AtStep::~AtStep() {
   awaited_steps.erase(std::find(awaited_steps.begin(), awaited_steps.end(), this));
-  if (awaited_steps.empty()) restore_step_hook = nullptr;
+  if (awaited_steps.empty() && awaited_number == nullptr) restore_step_hook = nullptr;
 }
 
 void AtStep::reached(const std::string &step) {
   if (step == step_ && --countdown_ == 0) action_();
+}
+
+AtNthStep::AtNthStep(int nth, std::function<void(const std::string &step)> action)
+    : countdown_(nth), action_(std::move(action)) {
+  EXPECT_EQ(awaited_number, nullptr);
+  awaited_number = this;
+  restore_step_hook = on_step;
+}
+
+AtNthStep::~AtNthStep() {
+  awaited_number = nullptr;
+  if (awaited_steps.empty()) restore_step_hook = nullptr;
+}
+
+void AtNthStep::reached(const std::string &step) {
+  if (--countdown_ == 0) action_(step);
+}
+
+bool is_killed_in(const std::function<void()> &work) {
+  const pid_t child = fork();
+  if (child == 0) {
+    work();
+    _exit(0);
+  }
+  int status = 0;
+  EXPECT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_FALSE(WIFEXITED(status) && WEXITSTATUS(status) != 0);
+  return WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL;
+}
+
+const std::vector<Entry> &new_app_data() {
+  static const std::vector<Entry> entries = {
+      {"data/settings.ini", "new settings", 0600},
+      {"data/db/notes.db", "new notes", 0640, "wrt::db_origin"},
+      {"data/added/deep/file", "added"},
+      {"shared/data/pictures/one.jpg", "n", 0644},
+      {"shared/trusted/key.bin", "new key", 0444}};
+  return entries;
 }
 
 WithoutCapabilities::WithoutCapabilities(std::initializer_list<int> capabilities) {
@@ -272,9 +283,6 @@ DiskFullAfter::~DiskFullAfter() {
 }
 
 RestoreTest::RestoreTest() {
-  // Memory, where it is to be had: bringing data onto a disk is not what is tested.
-  base = exists("/dev/shm") ? "/dev/shm/quarn_restore_XXXXXX" : "/tmp/quarn_restore_XXXXXX";
-  if (mkdtemp(base.data()) == nullptr) std::abort();
   label_attribute(base);
   root = base + "/opt/usr/apps/" + kPkg;
   dir("data");
@@ -341,7 +349,6 @@ RestoreTest::~RestoreTest() {
   end_restore_report();
   run_main_context();
   EXPECT_EQ(transactions, 0) << "a transaction was left open";
-  std::filesystem::remove_all(base);
 }
 
 std::string RestoreTest::file(const std::string &name, const std::string &content, int mode,

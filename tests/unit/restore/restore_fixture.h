@@ -23,6 +23,7 @@
 #include "mock_transport.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
+#include "temp_dir.h"
 
 /** The label of what nobody labelled. */
 inline constexpr char kFloorLabel[] = "_";
@@ -31,9 +32,6 @@ inline constexpr char kDataLabel[] = "app.data";
 
 std::string label_of(const std::string &path);
 void set_label(const std::string &path, const std::string &label);
-std::string read_text(const std::string &path);
-void write_text(const std::string &path, const std::string &text);
-bool exists(const std::string &path);
 
 /** Everything of one object that a restore must keep: type, mode, owner, label, content. */
 using Tree = std::map<std::string, std::string>;
@@ -114,7 +112,8 @@ class RestoreTest : public ::testing::Test {
 
   ::testing::NiceMock<MockPlatform> platform;
   ::testing::NiceMock<MockTransport> transport;
-  std::string base; /**< holds the root, and what lies outside of it */
+  const TempDir place{quick_directory()};
+  const std::string base = place.path(); /**< holds the root, and what lies outside of it */
   std::string root;
 
   /** Downloads that were accepted and not answered yet. */
@@ -180,5 +179,27 @@ class AtStep {
   std::function<void()> action_;
   int countdown_;
 };
+
+/** Calls @p action at the @p nth step that the engine comes to, whichever it is. One at a time. */
+class AtNthStep {
+ public:
+  AtNthStep(int nth, std::function<void(const std::string &step)> action);
+  ~AtNthStep();
+  AtNthStep(const AtNthStep &) = delete;
+  AtNthStep &operator=(const AtNthStep &) = delete;
+
+  void reached(const std::string &step);
+
+ private:
+  int countdown_;
+  std::function<void(const std::string &step)> action_;
+};
+
+/** Run @p work in a process of its own. @return whether it was killed; the test fails when it
+ * failed */
+bool is_killed_in(const std::function<void()> &work);
+
+/** What replaces make_old_data(): changed, added and, by what it leaves out, removed. */
+const std::vector<Entry> &new_app_data();
 
 #endif

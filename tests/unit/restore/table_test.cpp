@@ -103,7 +103,8 @@ TEST(TableTest, MoreKindsOfAttributesThanAreRememberedAreKeptApart) {
 }
 
 TEST(TableTest, FromAFileEveryMemberIsFoundHoweverManyDiffer) {
-  const std::string path = "/tmp/quarn_table_test." + std::to_string(getpid());
+  const TempDir dir;
+  const std::string path = dir / "table";
   constexpr int kMembers = 5000;
   std::string text = "{\"quarn_symbolic_info\": [{\"real_name\": \"data/l\"}]";
   for (int i = 0; i < kMembers; ++i) {
@@ -143,7 +144,8 @@ TEST(TableTest, FromAFileEveryMemberIsFoundHoweverManyDiffer) {
 }
 
 TEST(TableTest, WhatIsBeyondItsBoundsCostsNoMemory) {
-  const std::string path = "/tmp/quarn_table_test." + std::to_string(getpid());
+  const TempDir dir;
+  const std::string path = dir / "table";
   std::string members = "{";
   for (int i = 0; i < 300000; ++i) members += "\"" + std::to_string(i) + "\":[],";
   for (const std::string &text :
@@ -157,7 +159,6 @@ TEST(TableTest, WhatIsBeyondItsBoundsCostsNoMemory) {
     EXPECT_EQ(read.table, nullptr);
     EXPECT_LT(mallinfo2().uordblks, before + (1U << 20));
   }
-  std::filesystem::remove(path);
 }
 
 TEST(TableTest, AWholeOneMayBeReadInPiecesOfAnySize) {

@@ -17,6 +17,7 @@
 #include "quarn_common.h"
 #include "quarn_d_utils/path_rules.h"
 #include "rules/rules_file.h"
+#include "temp_dir.h"
 
 namespace {
 
@@ -25,20 +26,15 @@ namespace fs = std::filesystem;
 class Rules : public ::testing::Test {
  protected:
   void SetUp() override {
-    char name[] = "/tmp/quarn-rules-XXXXXX";
-    ASSERT_NE(mkdtemp(name), nullptr);
-    root_ = name;
     for (const char *folder : {"data/cache", "shared/data", "shared/trusted", "res"}) {
       fs::create_directories(root_ + "/" + folder);
     }
     write("data/keep.db", "12345");
     write("data/cache/tile", "123");
   }
-  void TearDown() override { fs::remove_all(root_); }
 
   void write(const std::string &path, const std::string &text) {
-    fs::create_directories(fs::path(root_ + "/" + path).parent_path());
-    std::ofstream(root_ + "/" + path) << text;
+    write_text(root_ + "/" + path, text);
   }
   void rules(const std::string &xml) { write("res/backup.path.xml", xml); }
   rules_report check(const std::string &type = "tpk") {
@@ -59,7 +55,8 @@ class Rules : public ::testing::Test {
   }
 
   ::testing::NiceMock<MockPlatform> platform_;
-  std::string root_;
+  const TempDir dir_;
+  const std::string root_ = dir_.path();
 };
 
 TEST_F(Rules, WithoutAFileEverythingIsIn) {

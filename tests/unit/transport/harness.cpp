@@ -10,32 +10,19 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
+
+#include "noise.h"
 
 namespace harness {
 namespace fs = std::filesystem;
 
-TempDir::TempDir() {
-  char name[] = "/tmp/transport-test-XXXXXX";
-  path_ = mkdtemp(name);
-}
-
-TempDir::~TempDir() {
-  std::error_code ignored;
-  fs::remove_all(path_, ignored);
-}
-
 void write_file(const std::string &path, const std::string &content, mode_t mode) {
-  std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
+  write_text(path, content);
   chmod(path.c_str(), mode);
 }
 
 std::string read_file(const std::string &path) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return "<absent>";
-  std::ostringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return std::ifstream(path) ? read_text(path) : "<absent>";
 }
 
 std::map<std::string, std::string> tree(const std::string &root) {
@@ -55,32 +42,10 @@ std::map<std::string, std::string> tree(const std::string &root) {
   return found;
 }
 
-std::string bytes(std::size_t size, unsigned seed) {
-  std::string text(size, '\0');
-  uint32_t state = seed * 2654435761U + 1;
-  for (char &c : text) {
-    state = state * 1664525U + 1013904223U;
-    c = static_cast<char>(state >> 24);
-  }
-  return text;
-}
+std::string bytes(std::size_t size, unsigned seed) { return noise(size, seed); }
 
 std::ostream &operator<<(std::ostream &out, const Child &child) {
   return out << child.path << (child.is_file ? " file " : " folder ") << child.size;
-}
-
-bool run_until(const std::function<bool()> &done, milliseconds patience) {
-  const auto end = std::chrono::steady_clock::now() + patience;
-  // Wakes the context regularly, for conditions that no source of it brings about.
-  const guint ticker = g_timeout_add(
-      5, [](gpointer) -> gboolean { return G_SOURCE_CONTINUE; }, nullptr);
-  bool met = done();
-  while (!met && std::chrono::steady_clock::now() < end) {
-    g_main_context_iteration(nullptr, TRUE);
-    met = done();
-  }
-  g_source_remove(ticker);
-  return met;
 }
 
 int threads_named(const std::string &name) {

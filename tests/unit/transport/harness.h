@@ -17,24 +17,15 @@
 #include <vector>
 
 #include "backup_transport.h"
+#include "run_until.h"
+#include "temp_dir.h"
 
 namespace harness {
 
 using std::chrono::milliseconds;
 
-/** A folder of its own that goes with the object. */
-class TempDir {
- public:
-  TempDir();
-  TempDir(const TempDir &) = delete;
-  TempDir &operator=(const TempDir &) = delete;
-  ~TempDir();
-  std::string operator/(const std::string &name) const { return path_ + "/" + name; }
-  const std::string &path() const { return path_; }
-
- private:
-  std::string path_;
-};
+using ::run_until;
+using ::TempDir;
 
 void write_file(const std::string &path, const std::string &content, mode_t mode = 0600);
 /** "<absent>" when there is none. */
@@ -68,9 +59,6 @@ struct Answer {
   std::chrono::steady_clock::time_point when;
 };
 using AnswerPtr = std::shared_ptr<Answer>;
-
-/** Run the main context until @p done, at most @p patience. @return done */
-bool run_until(const std::function<bool()> &done, milliseconds patience = milliseconds(30000));
 
 /** Threads of this process with that name. */
 int threads_named(const std::string &name);

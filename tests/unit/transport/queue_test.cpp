@@ -6,6 +6,7 @@
 
 #include "dav_front_store.h"
 #include "http/http.h"
+#include "resident_memory.h"
 #include "session/session.h"
 
 using namespace harness;
@@ -22,14 +23,6 @@ constexpr std::ptrdiff_t kSpareDescriptors = 32;
 
 std::ptrdiff_t entries_of(const std::string &folder) {
   return std::distance(fs::directory_iterator(folder), fs::directory_iterator());
-}
-
-std::size_t resident_bytes() {
-  std::ifstream file("/proc/self/statm");
-  std::size_t all = 0;
-  std::size_t resident = 0;
-  file >> all >> resident;
-  return resident * static_cast<std::size_t>(sysconf(_SC_PAGESIZE));
 }
 
 TEST(Queue, WaitingUploadsHoldADescriptorEachAndNothingElse) {

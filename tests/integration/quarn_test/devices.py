@@ -1,78 +1,11 @@
-"""What the integration tests share: embedded devices, package sources, clients on the bus.
-
-The programs are those in $QUARN_BIN_DIR. Every device lies in a directory of its own test, is
-stopped when the test ends, and its log is shown when the test failed.
-"""
+"""Embedded devices."""
 import json
 import os
-import shutil
 import subprocess
-import tempfile
-import time
-import unittest
 
-BIN_DIR = os.environ.get("QUARN_BIN_DIR") or os.path.join(
-    os.path.dirname(os.path.abspath(__file__)), "../../build/bin")
-#: How long a test waits for what must happen, in seconds; sanitizers are slow.
-DEADLINE = 60
-
-
-def is_sanitized(program):
-    """Whether what it takes of memory is the sanitizer's."""
-    with open(program, "rb") as file:
-        content = file.read()
-    return b"__asan_init" in content or b"__tsan_init" in content
-
-
-def wait_until(condition, what, deadline=DEADLINE):
-    """Poll until `condition()` is true; its value is returned."""
-    end = time.monotonic() + deadline
-    while True:
-        value = condition()
-        if value:
-            return value
-        if time.monotonic() > end:
-            raise AssertionError("did not happen in %d s: %s" % (deadline, what))
-        time.sleep(0.02)
-
-
-def make_source(path, package, version, files, metadata=None, apps=None, **keys):
-    """A package source: `files` maps relative paths to bytes, (bytes, mode), or ("->", target)."""
-    os.makedirs(path, exist_ok=True)
-    for name, content in files.items():
-        target = os.path.join(path, name)
-        os.makedirs(os.path.dirname(target), exist_ok=True)
-        mode = None
-        if isinstance(content, tuple) and content[0] == "->":
-            os.symlink(content[1], target)
-            continue
-        if isinstance(content, tuple):
-            content, mode = content
-        with open(target, "wb") as file:
-            file.write(content)
-        if mode is not None:
-            os.chmod(target, mode)
-    lines = ["[package]", "id=" + package, "version=" + version,
-             "type=" + keys.get("type", "tpk")]
-    for key in ("preload", "storage"):
-        if key in keys:
-            value = keys[key]
-            lines.append("%s=%s" % (key, str(value).lower() if isinstance(value, bool) else value))
-    for app in apps or [package]:
-        lines += ["", "[app %s]" % app, "api-version=4.0"]
-        lines += ["metadata.%s=%s" % item for item in (metadata or {}).items()]
-    with open(os.path.join(path, "package.ini"), "w") as file:
-        file.write("\n".join(lines) + "\n")
-    return path
-
-
-def read_text(path):
-    """"" when there is none."""
-    try:
-        with open(path, errors="replace") as file:
-            return file.read()
-    except OSError:
-        return ""
+from .files import read_text
+from .programs import BIN_DIR
+from .waiting import wait_until
 
 
 class Device:
@@ -130,6 +63,10 @@ class Device:
     def exec(self, *command, check=True, **keywords):
         return self.call("exec", "--", *command, check=check, **keywords)
 
+    def begin(self, *command, **keywords):
+        """A command on the device that runs beside the test; its process."""
+        return subprocess.Popen([self.tool, "exec", self.path, "--", *command], **keywords)
+
     def quarnctl(self, *arguments, check=True, **keywords):
         return self.exec("quarnctl", *arguments, check=check, **keywords)
 
@@ -156,6 +93,10 @@ class Device:
         """Where a file of a package lies for those outside the device."""
         return os.path.join(self.path, "root/opt/usr/apps", package, path)
 
+    def archive(self, package, version="1.0.0"):
+        """Where a package's archive lies in the cloud that is a folder of the device."""
+        return os.path.join(self.cloud, self.serial, package, version, package + ".zip")
+
     def bus_address(self):
         return "unix:path=" + os.path.join(self.path, "run/bus")
 
@@ -176,36 +117,26 @@ class Device:
                 continue
         return None
 
+    def daemon_memory_kb(self):
+        """Memory that the daemon alone takes, and its share of what others use as well."""
+        for line in read_text("/proc/%d/smaps_rollup" % self.daemon_pid()).splitlines():
+            if line.startswith("Pss:"):
+                return int(line.split()[1])
+        raise AssertionError("no memory use of the daemon")
+
+    def signal_daemon(self, number):
+        """Send the daemon a signal, when there is one; whether there was."""
+        pid = self.daemon_pid()
+        if pid is None:
+            return False
+        try:
+            os.kill(pid, number)
+        except ProcessLookupError:
+            pass  # it has ended on its own meanwhile
+        return True
+
     def wait_for_log(self, text, count=1):
         wait_until(lambda: self.log().count(text) >= count, "log line: " + text)
 
     def wait_for_daemon_end(self):
         wait_until(lambda: self.daemon_pid() is None, "the daemon ends")
-
-
-class TestCase(unittest.TestCase):
-    """A test with a directory of its own and devices that are stopped after it."""
-
-    maxDiff = None
-
-    def run(self, result=None):
-        self.directory = tempfile.mkdtemp(prefix="quarn-it-")
-        self.devices = []
-        failures = 0 if result is None else len(result.failures) + len(result.errors)
-        try:
-            super().run(result)
-        finally:
-            failed = result is not None and len(result.failures) + len(result.errors) > failures
-            for device in self.devices:
-                device.call("stop", check=False)
-                if failed:
-                    print("---- log of %s\n%s" % (device.path, device.log()[-20000:]))
-            shutil.rmtree(self.directory, ignore_errors=True)
-
-    def path(self, *names):
-        return os.path.join(self.directory, *names)
-
-    def new_device(self, name=None, **options):
-        device = Device(self.path(name or "device%d" % len(self.devices)), **options)
-        self.devices.append(device)
-        return device

@@ -1,0 +1,17 @@
+"""What the tests of the real programs share.
+
+Every device lies in a directory of its own test, is stopped when the test ends, and its log is
+shown when the test failed. One module a subject; tests take what they need from here.
+"""
+from .applications import APPLICATION, application, as_application, exchange_names
+from .case import TestCase
+from .devices import Device
+from .files import read_file, read_text, tree
+from .programs import BIN_DIR, is_sanitized
+from .servers import AnsweringServer, silent_server
+from .sources import make_source
+from .waiting import DEADLINE, wait_until
+
+__all__ = ["APPLICATION", "BIN_DIR", "DEADLINE", "AnsweringServer", "Device", "TestCase",
+           "application", "as_application", "exchange_names", "is_sanitized", "make_source",
+           "read_file", "read_text", "silent_server", "tree", "wait_until"]
