@@ -114,9 +114,11 @@ int verb_install(const Arguments &arguments);
 int verb_remove(const Arguments &arguments);
 int verb_list(const Arguments &arguments);
 
-/* state.cpp */
+/* facts.cpp */
 int verb_create(const Arguments &arguments);
 int verb_set(const Arguments &arguments);
+
+/* state.cpp */
 int verb_setting(const Arguments &arguments);
 int verb_alarms(const Arguments &arguments);
 int verb_fire(const Arguments &arguments);
