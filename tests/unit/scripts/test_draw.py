@@ -85,6 +85,15 @@ class Drawings(unittest.TestCase):
         self.write("scripts/floors.toml", FLOORS.replace('sees = ["lower"]', "sees = []"))
         self.assert_told('ways: an arrow from "upper" to "lower", which it does not see')
 
+    def test_of_the_transport_that_lack_one_of_its_floors_are_told(self):
+        for path, text in (("scripts/floors.toml", FLOORS),
+                           ("docs/drawings/drawings.toml", DRAWINGS)):
+            self.write(path, text.replace('"upper"', '"transport upper"').replace(
+                '"lower"] }', '"lower", "transport other"] }'))
+        self.assertEqual(draw(self.root).stdout,
+                         'ways: no arrow from "transport upper" to "transport other", '
+                         "which it sees\n")
+
 
 if __name__ == "__main__":
     unittest.main()
