@@ -21,11 +21,7 @@ DRAWINGS = """
 [house]
 columns = 2
 stack = "house"
-boxes = [
-  { row = 0, column = 0, span = 2, name = "roof", note = "dry" },
-  { row = 1, column = 0, span = 2, name = "cellar", note = "cool" },
-]
-arrows = []
+notes = [["roof", "dry"], ["cellar", "cool"]]
 [ways]
 columns = 2
 boxes = [
@@ -77,9 +73,11 @@ class Drawings(unittest.TestCase):
         self.write("docs/drawings/drawings.toml", DRAWINGS.replace("cool", "warm"))
         self.assert_told("docs/drawings/house.svg: not what scripts/draw makes of its source")
 
-    def test_that_lack_a_floor_are_told(self):
+    def test_without_a_word_on_a_floor_are_told(self):
         self.write("scripts/floors.toml", FLOORS.replace('"cellar"', '"vault"'))
-        self.assert_told("house: the floors are roof, vault, drawn are roof, cellar")
+        self.assert_told('house: the floor "vault" has no note',
+                         'house: a note on "cellar", which is no floor',
+                         "docs/drawings/house.svg: not what scripts/draw makes of its source")
 
     def test_with_an_arrow_to_what_is_not_seen_are_told(self):
         self.write("scripts/floors.toml", FLOORS.replace('sees = ["lower"]', "sees = []"))
