@@ -1,7 +1,6 @@
 #include <json-c/json.h>
 #include <unistd.h>
 
-#include <climits>
 #include <cstdio>
 #include <cstdlib>
 

@@ -1,6 +1,5 @@
 #include "session_run.h"
 
-#include <cmath>
 #include <utility>
 
 #include "json_read.h"
