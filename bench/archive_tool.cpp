@@ -6,7 +6,6 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
-#include <string>
 #include <vector>
 
 #ifdef QUARN_BENCH_RESTORE

@@ -216,12 +216,55 @@ bool is_option(const std::string &argument, const std::string &name) {
   return argument == name || argument.compare(0, name.size() + 1, name + "=") == 0;
 }
 
+/** The place of the switch that an argument is; null: it is none. */
+bool *switch_of(const std::string &argument, Options &options) {
+  struct Switch {
+    const char *name;
+    bool Options::*place;
+  };
+  constexpr Switch kSwitches[] = {
+      {"--json", &Options::json},   {"--help", &Options::help},
+      {"-h", &Options::help},       {"--version", &Options::version},
+      {"--watch", &Options::watch}, {"--transfer", &Options::transfer},
+      {"--yes", &Options::yes},
+  };
+  for (const Switch &known : kSwitches) {
+    if (argument == known.name) return &(options.*known.place);
+  }
+  return nullptr;
+}
+
+/** The option at @p i with its value, which may be the argument behind it. */
+bool take_option(const std::vector<std::string> &arguments, std::size_t &i, Options &options,
+                 std::string &error) {
+  const std::string &argument = arguments[i];
+  if (bool *given = switch_of(argument, options)) {
+    *given = true;
+    return true;
+  }
+  if (is_option(argument, "--from")) {
+    options.from_given = true;
+    return take_value(arguments, i, "--from", options.serial, error);
+  }
+  if (is_option(argument, "--timeout")) {
+    std::string value;
+    if (!take_value(arguments, i, "--timeout", value, error)) return false;
+    if (!parse_timeout(value, options.timeout)) {
+      error = "--timeout takes a number of seconds";
+      return false;
+    }
+    options.timeout_given = true;
+    return true;
+  }
+  error = "unknown option " + argument;
+  return false;
+}
+
 bool split_options(const std::vector<std::string> &arguments, Options &options,
                    std::string &error) {
   bool only_words = false;
   for (std::size_t i = 0; i < arguments.size(); ++i) {
     const std::string &argument = arguments[i];
-    std::string value;
     if (g_utf8_validate(argument.data(), static_cast<gssize>(argument.size()), nullptr) == FALSE) {
       error = "an argument is not UTF-8 text";
       return false;
@@ -230,30 +273,7 @@ bool split_options(const std::vector<std::string> &arguments, Options &options,
       options.words.push_back(argument);
     } else if (argument == "--") {
       only_words = true;
-    } else if (argument == "--json") {
-      options.json = true;
-    } else if (argument == "--help" || argument == "-h") {
-      options.help = true;
-    } else if (argument == "--version") {
-      options.version = true;
-    } else if (argument == "--watch") {
-      options.watch = true;
-    } else if (argument == "--transfer") {
-      options.transfer = true;
-    } else if (argument == "--yes") {
-      options.yes = true;
-    } else if (is_option(argument, "--from")) {
-      if (!take_value(arguments, i, "--from", options.serial, error)) return false;
-      options.from_given = true;
-    } else if (is_option(argument, "--timeout")) {
-      if (!take_value(arguments, i, "--timeout", value, error)) return false;
-      if (!parse_timeout(value, options.timeout)) {
-        error = "--timeout takes a number of seconds";
-        return false;
-      }
-      options.timeout_given = true;
-    } else {
-      error = "unknown option " + argument;
+    } else if (!take_option(arguments, i, options, error)) {
       return false;
     }
   }

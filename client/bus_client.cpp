@@ -108,7 +108,7 @@ bool is_cancelled(const GError *error) {
 }
 
 BusFailure failure_of(GError *error) {
-  const GString_ name(g_dbus_error_is_remote_error(error) != FALSE
+  const GText name(g_dbus_error_is_remote_error(error) != FALSE
                           ? g_dbus_error_get_remote_error(error)
                           : nullptr);
   g_dbus_error_strip_remote_error(error);

@@ -1,7 +1,6 @@
 #include <json-c/json.h>
 #include <unistd.h>
 
-#include <climits>
 #include <cstdio>
 #include <cstdlib>
 
@@ -47,8 +46,8 @@ bool find_package(const std::string &name, package_place *place, std::string *pr
       *problem = ini + ": " + error->message;
       return false;
     }
-    const GString_ id(g_key_file_get_string(file.get(), "package", "id", nullptr));
-    const GString_ type(g_key_file_get_string(file.get(), "package", "type", nullptr));
+    const GText id(g_key_file_get_string(file.get(), "package", "id", nullptr));
+    const GText type(g_key_file_get_string(file.get(), "package", "type", nullptr));
     const CString root(realpath(name.c_str(), nullptr));
     if (!id || !root) {
       *problem = ini + ": no package id";

@@ -1,7 +1,6 @@
 #include <json-c/json.h>
 
 #include <algorithm>
-#include <cstdio>
 #include <filesystem>
 
 #include "json_read.h"

@@ -1,9 +1,5 @@
 #include "session_run.h"
 
-#include <algorithm>
-#include <utility>
-
-#include "json_read.h"
 #include "status.h"
 #include "text.h"
 

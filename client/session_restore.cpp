@@ -1,7 +1,6 @@
 #include "session_run.h"
 
 #include <algorithm>
-#include <utility>
 
 #include "json_read.h"
 #include "text.h"

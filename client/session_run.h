@@ -56,6 +56,8 @@ class Session {
  private:
   /** What an answer of the daemon leads to. */
   using Then = std::function<void(int result)>;
+  /** What a list that cannot be had leads to, where that is not the end. */
+  using NoList = std::function<void(const std::string &error)>;
 
   void begin();
   void call_for_result(const char *method, GVariant *arguments, Then then);
@@ -70,9 +72,10 @@ class Session {
   void cancel();
   void app_request(const char *method, const char *what, const char *done);
   void app_export();
-  /** @param otherwise what a list that cannot be had leads to; by default the end */
-  void fetch_list(std::function<void(const BackupSets &)> then,
-                  std::function<void(const std::string &error)> otherwise = nullptr);
+  void fetch_list(std::function<void(const BackupSets &)> then, NoList otherwise = nullptr);
+  void fail_list(int result, const NoList &otherwise);
+  /** Of the entries of a list. */
+  void tell_left_out(std::uint64_t entries);
   void show_status();
   void show_status_packages(const std::string &serial);
   void show_list(const BackupSets &sets);

@@ -1,6 +1,5 @@
 #include "session_run.h"
 
-#include <cmath>
 #include <utility>
 
 #include "json_read.h"
@@ -39,36 +38,38 @@ void Session::last_time() {
       [this](const BusFailure &failure) { fail(failure); });
 }
 
-void Session::fetch_list(std::function<void(const BackupSets &)> then,
-                         std::function<void(const std::string &error)> otherwise) {
+void Session::fail_list(int result, const NoList &otherwise) {
+  const char *const what = "getting the application list failed";
+  if (list_client_ == QUARN_CLIENT_COMPANION) {
+    return finish(exit_of(result), "making the archives failed: " + result_words(result) + "; is " +
+                                       kPellixPackage + " installed?");
+  }
+  std::string error = std::string(what) + ": " + result_words(result);
+  if (callback_ && result == QUARN_BAD_ARGUMENT) {
+    error = "the cloud holds no application list yet, or it could not be fetched (" +
+            std::to_string(result) + ")";
+  }
+  if (otherwise) return otherwise(error);
+  finish_explained(exit_of(result), what, error);
+}
+
+void Session::tell_left_out(std::uint64_t entries) {
+  json_object_object_add(document_.get(), "left_out",
+                         json_object_new_int64(static_cast<std::int64_t>(entries)));
+  screen_.error(std::to_string(entries) + " unreadable entries are left out");
+}
+
+void Session::fetch_list(std::function<void(const BackupSets &)> then, NoList otherwise) {
   on_answer_ = [this, then = std::move(then), otherwise = std::move(otherwise)] {
     if (!reply_ && !callback_) return;
     const int result = callback_ ? callback_->result : *reply_;
-    if (result != QUARN_OK) {
-      std::string error = "getting the application list failed: " + result_words(result);
-      if (callback_ && result == QUARN_BAD_ARGUMENT) {
-        error = "the cloud holds no application list yet, or it could not be fetched (" +
-                std::to_string(result) + ")";
-      }
-      if (list_client_ == QUARN_CLIENT_COMPANION) {
-        error = "making the archives failed: " + result_words(result) + "; is " + kPellixPackage +
-                " installed?";
-        return finish(exit_of(result), error);
-      }
-      return otherwise
-                 ? otherwise(error)
-                 : finish_explained(exit_of(result), "getting the application list failed", error);
-    }
+    if (result != QUARN_OK) return fail_list(result, otherwise);
     if (!reply_ || !callback_) return;
     std::string error;
     const auto sets = parse_backup_sets(callback_->text, error);
     if (!sets) return otherwise ? otherwise(error) : finish(EXIT_PROTOCOL, error);
     // The companion's list is of this device alone and does not name it.
-    if (sets->left_out > 0 && list_client_ == QUARN_CLIENT_CLOUD) {
-      json_object_object_add(document_.get(), "left_out",
-                             json_object_new_int64(static_cast<std::int64_t>(sets->left_out)));
-      screen_.error(std::to_string(sets->left_out) + " unreadable entries are left out");
-    }
+    if (sets->left_out > 0 && list_client_ == QUARN_CLIENT_CLOUD) tell_left_out(sets->left_out);
     then(*sets);
   };
   call_for_result("get_app_list", g_variant_new("(iu)", list_client_, req_id_), [this](int result) {

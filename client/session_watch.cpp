@@ -1,10 +1,8 @@
 #include "session_run.h"
 
 #include <algorithm>
-#include <utility>
 
 #include "json_read.h"
-#include "text.h"
 
 namespace quarn_client {
 

@@ -97,7 +97,7 @@ std::string local_time(std::int64_t ms) {
   using DateTime = Handle<GDateTime, &g_date_time_unref>;
   const DateTime time(g_date_time_new_from_unix_local(ms / kMsPerSecond));
   if (!time) return "-";
-  const GString_ text(g_date_time_format(time.get(), "%Y-%m-%dT%H:%M:%S%:z"));
+  const GText text(g_date_time_format(time.get(), "%Y-%m-%dT%H:%M:%S%:z"));
   return text ? text.get() : "-";
 }
 

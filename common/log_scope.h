@@ -6,7 +6,6 @@
 #define LOG_SCOPE_H
 
 #include <string>
-#include <utility>
 #include <vector>
 
 struct quarn_log_place;

@@ -14,7 +14,6 @@
 #include <json-c/json.h>
 #include <unistd.h>
 
-#include <cstdio>
 #include <cstdlib>
 #include <memory>
 #include <type_traits>
@@ -34,14 +33,16 @@ struct Releaser {
 template <typename T, auto Release>
 using Handle = std::unique_ptr<T, Releaser<Release>>;
 
+/** A text from malloc(), as the platform gives them. */
 using CString = Handle<char, &std::free>;
-using GString_ = Handle<char, &g_free>;
+/** A text that GLib has made. */
+using GText = Handle<char, &g_free>;
+using GString_ = GText;
 using GErrorPtr = Handle<GError, &g_error_free>;
 using GDirPtr = Handle<GDir, &g_dir_close>;
 using GVariantPtr = Handle<GVariant, &g_variant_unref>;
 using GMainLoopPtr = Handle<GMainLoop, &g_main_loop_unref>;
 using JsonPtr = Handle<json_object, &json_object_put>;
-using FilePtr = Handle<std::FILE, &std::fclose>;
 using DirPtr = Handle<DIR, &closedir>;
 
 /** Receives a malloc'd text through an out pointer: `get(handle, out(text))`. */

@@ -8,7 +8,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <climits>
 #include <cstdio>
 #include <cstdlib>
 #include <iterator>
@@ -17,7 +16,6 @@
 #include "backup_transport.h"
 #include "device.h"
 #include "state/state_file.h"
-#include "state/values.h"
 
 namespace {
 

@@ -81,14 +81,17 @@ std::string reason();
 /** The verb was called the wrong way. */
 [[noreturn]] void wrong_use();
 
+/** True when the device's supervisor lives. */
+bool is_started(const std::string &device);
+
 /* lifecycle.cpp */
 int verb_start(const Arguments &arguments);
 int verb_stop(const Arguments &arguments);
 int verb_exec(const Arguments &arguments);
+
+/* daemon_run.cpp */
 /** Hidden: the activation command of the device's bus. */
 int verb_daemon(const Arguments &arguments);
-/** True when the device's supervisor lives. */
-bool is_started(const std::string &device);
 
 /* cloud.cpp */
 struct Cloud {
@@ -114,9 +117,11 @@ int verb_install(const Arguments &arguments);
 int verb_remove(const Arguments &arguments);
 int verb_list(const Arguments &arguments);
 
-/* state.cpp */
+/* facts.cpp */
 int verb_create(const Arguments &arguments);
 int verb_set(const Arguments &arguments);
+
+/* state.cpp */
 int verb_setting(const Arguments &arguments);
 int verb_alarms(const Arguments &arguments);
 int verb_fire(const Arguments &arguments);

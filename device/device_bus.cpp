@@ -5,8 +5,6 @@
 #include <sys/prctl.h>
 #include <unistd.h>
 
-#include <cerrno>
-
 #include "device.h"
 #include "state/state_file.h"
 

@@ -116,6 +116,43 @@ int verb_stop(const Arguments &arguments) {
   return DEVICE_OK;
 }
 
+namespace {
+
+/** What of the host's /tmp a command is called with, or works in, in the device's as well. */
+void show_wanted_entries(const std::string &device, int host_tmp, const std::string &here,
+                         const std::string &programs, const Arguments &arguments) {
+  std::set<std::string> wanted{tmp_entry(here + "/"), tmp_entry(programs)};
+  for (std::size_t i = 2; i < arguments.size(); ++i) {
+    const std::string &argument = arguments[i];
+    const auto value = argument[0] == '-' ? argument.find('=') : std::string::npos;
+    const std::string entry =
+        tmp_entry(value == std::string::npos ? argument : argument.substr(value + 1));
+    if (entry != kDaemonTmpEntry) wanted.insert(entry);
+  }
+  for (const std::string &name : wanted) show_tmp_entry(device, host_tmp, name);
+}
+
+/** Go on in the name space of the device's supervisor, in the same directory where it has that. */
+void enter_device(const std::string &device, const Supervisor &supervisor, const std::string &here,
+                  const std::string &programs, const Arguments &arguments) {
+  const std::string process = "/proc/" + std::to_string(supervisor.pid);
+  const Fd space(open((process + "/ns/mnt").c_str(), O_RDONLY | O_CLOEXEC));
+  // A process with threads may only move with a view of the file system of its own.
+  if (space.fd < 0 || unshare(CLONE_FS) != 0 || setns(space.fd, CLONE_NEWNS) != 0) {
+    throw Failure("cannot enter the device: " + reason());
+  }
+  const Fd mounts_lock(open((device + "/run/.mounts").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  if (mounts_lock.fd >= 0) flock(mounts_lock.fd, LOCK_EX);
+  const Fd host_tmp(open((process + "/fd/" + std::to_string(kHostTmpFd)).c_str(),
+                         O_PATH | O_DIRECTORY | O_CLOEXEC));
+  show_wanted_entries(device, host_tmp.fd, here, programs, arguments);
+  if (chdir(here.c_str()) != 0 && chdir("/") != 0) {
+    throw Failure("cannot change the directory: " + reason());
+  }
+}
+
+}  // namespace
+
 int verb_exec(const Arguments &arguments) {
   if (arguments.size() < 3 || arguments[1] != "--") wrong_use();
   const std::string device = open_device(arguments[0]);
@@ -124,31 +161,7 @@ int verb_exec(const Arguments &arguments) {
   const std::string programs = program_directory();
   std::error_code error;
   const std::string here = fs::current_path(error).string();
-  if (supervisor.own_namespace) {
-    const std::string process = "/proc/" + std::to_string(supervisor.pid);
-    const Fd space(open((process + "/ns/mnt").c_str(), O_RDONLY | O_CLOEXEC));
-    // A process with threads may only move with a view of the file system of its own.
-    if (space.fd < 0 || unshare(CLONE_FS) != 0 || setns(space.fd, CLONE_NEWNS) != 0) {
-      throw Failure("cannot enter the device: " + reason());
-    }
-    const Fd mounts_lock(
-        open((device + "/run/.mounts").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
-    if (mounts_lock.fd >= 0) flock(mounts_lock.fd, LOCK_EX);
-    const Fd host_tmp(open((process + "/fd/" + std::to_string(kHostTmpFd)).c_str(),
-                           O_PATH | O_DIRECTORY | O_CLOEXEC));
-    std::set<std::string> wanted{tmp_entry(here + "/"), tmp_entry(programs)};
-    for (std::size_t i = 2; i < arguments.size(); ++i) {
-      const std::string &argument = arguments[i];
-      const auto value = argument[0] == '-' ? argument.find('=') : std::string::npos;
-      const std::string entry =
-          tmp_entry(value == std::string::npos ? argument : argument.substr(value + 1));
-      if (entry != kDaemonTmpEntry) wanted.insert(entry);
-    }
-    for (const std::string &name : wanted) show_tmp_entry(device, host_tmp.fd, name);
-    if (chdir(here.c_str()) != 0 && chdir("/") != 0) {
-      throw Failure("cannot change the directory: " + reason());
-    }
-  }
+  if (supervisor.own_namespace) enter_device(device, supervisor, here, programs, arguments);
   set_environment(device);
   const char *path = std::getenv("PATH");
   setenv("PATH",

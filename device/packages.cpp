@@ -5,12 +5,11 @@
 #include <sys/file.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <cstdio>
 #include <memory>
 
 #include "device.h"
-#include "package_files.h"
+#include "installer.h"
 #include "state/printable.h"
 
 namespace {
@@ -42,9 +41,9 @@ class InstallerLock {
 };
 
 /** After another failure, which is the one to tell. */
-void remove_quietly(PackageFiles *files, const std::string &id) {
+void remove_quietly(Installer *installer, const std::string &id) {
   try {
-    files->remove(id);
+    installer->remove(id);
   } catch (const Failure &) {
   }
 }
@@ -104,15 +103,15 @@ int verb_install(const Arguments &arguments) {
   const char *action = update ? embedded::kActionUpdate : embedded::kActionInstall;
   send_event(device, package, action, embedded::kStateStarted);
   try {
-    PackageFiles files(device);
+    Installer installer(device);
     if (update) {
-      files.update(arguments[1], package.id);
+      installer.update(arguments[1], package.id);
     } else {
-      files.install(arguments[1], package.id);
+      installer.install(arguments[1], package.id);
     }
     if (!embedded::put_package(device, package)) {
       const std::string text = "cannot record the package: " + reason();
-      if (!update) remove_quietly(&files, package.id);
+      if (!update) remove_quietly(&installer, package.id);
       throw Failure(text);
     }
   } catch (...) {
@@ -135,7 +134,7 @@ int verb_remove(const Arguments &arguments) {
   if (!embedded::drop_package(device, package.id)) {
     throw Failure("cannot forget the package: " + reason());
   }
-  PackageFiles(device).remove(package.id);
+  Installer(device).remove(package.id);
   send_event(device, package, embedded::kActionUninstall, embedded::kStateCompleted);
   return DEVICE_OK;
 }

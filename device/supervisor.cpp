@@ -116,6 +116,62 @@ void stop_daemon(Running *self) {
     kill(static_cast<pid_t>(pid), SIGKILL);
 }
 
+/** The device's own view of its files, and its bus; the device can be found from then on. */
+void start_device(Running *self) {
+  self->own_namespace = enter_own_namespace(self->device);
+  if (!self->own_namespace) map_apps_path(self->device);
+  set_environment(self->device);
+  recover_after_boot();
+  self->bus = start_bus(self->device);
+  write_file(self->device + "/" + kSupervisorFile, std::to_string(getpid()) + " " +
+                                                       birth_of(getpid()) + " " +
+                                                       (self->own_namespace ? "1" : "0") + "\n");
+}
+
+/** Its signals, bus, timer and files as sources of a loop. GLib may have threads of its own then.
+ */
+void watch_device(Running *self) {
+  self->connection = connect_bus(self->device);
+  GVariant *hello = call_bus(self->connection.get(), "GetId", nullptr, nullptr);
+  if (hello == nullptr) throw Failure("the device's bus does not answer");
+  g_variant_unref(hello);
+  g_dbus_connection_set_exit_on_close(self->connection.get(), FALSE);
+  self->loop = g_main_loop_new(nullptr, FALSE);
+  g_unix_signal_add(SIGTERM, on_stop, self);
+  g_unix_signal_add(SIGINT, on_stop, self);
+  g_child_watch_add(self->bus, on_bus_exit, self);
+  g_dbus_connection_signal_subscribe(
+      self->connection.get(), "org.freedesktop.DBus", "org.freedesktop.DBus", "NameOwnerChanged",
+      "/org/freedesktop/DBus", kBusName, G_DBUS_SIGNAL_FLAGS_NONE, on_owner_changed, self, nullptr);
+  self->timer = timerfd_create(CLOCK_REALTIME, TFD_NONBLOCK | TFD_CLOEXEC);
+  g_unix_fd_add(self->timer, G_IO_IN, on_timer, self);
+  self->alarms = std::make_unique<embedded::StateWatch>(self->device, embedded::kAlarmsFile,
+                                                        [self] { look_at_alarms(self); });
+  self->clock = std::make_unique<embedded::StateWatch>(self->device, embedded::kClockFile,
+                                                       [self] { look_at_alarms(self); });
+}
+
+/** To whoever waits for the start. */
+void tell_ready(const Running &self, int tell) {
+  const std::string note = self.own_namespace
+                               ? std::string()
+                               : std::string("mount namespaces are not permitted here: ") +
+                                     kAppsPath + " is mapped to this device";
+  const std::string message = kReady + note;
+  if (write(tell, message.data(), message.size()) < 0) std::perror("quarn-device");
+  close(tell);
+}
+
+void stop_device(Running *self) {
+  if (self->bus != 0) {
+    stop_daemon(self);
+    kill(self->bus, SIGTERM);
+    waitpid(self->bus, nullptr, 0);
+  }
+  if (!self->own_namespace) unmap_apps_path(self->device);
+  unlink((self->device + "/run/bus").c_str());
+}
+
 /** @param lock of the start, held until the supervisor can be found: a start may be killed */
 [[noreturn]] void supervise(const std::string &device, int tell, int lock) {
   int status = DEVICE_FAILED;
@@ -124,51 +180,13 @@ void stop_daemon(Running *self) {
     signal(SIGPIPE, SIG_IGN);
     Running self;
     self.device = device;
-    self.own_namespace = enter_own_namespace(device);
-    if (!self.own_namespace) map_apps_path(device);
-    set_environment(device);
-    recover_after_boot();
-    self.bus = start_bus(device);
-    write_file(device + "/" + kSupervisorFile, std::to_string(getpid()) + " " + birth_of(getpid()) +
-                                                   " " + (self.own_namespace ? "1" : "0") + "\n");
+    start_device(&self);
     close(lock);
-    // From here on GLib may have threads of its own.
-    self.connection = connect_bus(device);
-    GVariant *hello = call_bus(self.connection.get(), "GetId", nullptr, nullptr);
-    if (hello == nullptr) throw Failure("the device's bus does not answer");
-    g_variant_unref(hello);
-    g_dbus_connection_set_exit_on_close(self.connection.get(), FALSE);
-    self.loop = g_main_loop_new(nullptr, FALSE);
-    g_unix_signal_add(SIGTERM, on_stop, &self);
-    g_unix_signal_add(SIGINT, on_stop, &self);
-    g_child_watch_add(self.bus, on_bus_exit, &self);
-    g_dbus_connection_signal_subscribe(self.connection.get(), "org.freedesktop.DBus",
-                                       "org.freedesktop.DBus", "NameOwnerChanged",
-                                       "/org/freedesktop/DBus", kBusName, G_DBUS_SIGNAL_FLAGS_NONE,
-                                       on_owner_changed, &self, nullptr);
-    self.timer = timerfd_create(CLOCK_REALTIME, TFD_NONBLOCK | TFD_CLOEXEC);
-    g_unix_fd_add(self.timer, G_IO_IN, on_timer, &self);
-    self.alarms = std::make_unique<embedded::StateWatch>(device, embedded::kAlarmsFile,
-                                                         [&self] { look_at_alarms(&self); });
-    self.clock = std::make_unique<embedded::StateWatch>(device, embedded::kClockFile,
-                                                        [&self] { look_at_alarms(&self); });
-    const std::string note = self.own_namespace
-                                 ? std::string()
-                                 : std::string("mount namespaces are not permitted here: ") +
-                                       kAppsPath + " is mapped to this device";
-    const std::string message = kReady + note;
-    if (write(tell, message.data(), message.size()) < 0) std::perror("quarn-device");
-    close(tell);
+    watch_device(&self);
+    tell_ready(self, tell);
     look_at_alarms(&self);
     g_main_loop_run(self.loop);
-
-    if (self.bus != 0) {
-      stop_daemon(&self);
-      kill(self.bus, SIGTERM);
-      waitpid(self.bus, nullptr, 0);
-    }
-    if (!self.own_namespace) unmap_apps_path(device);
-    unlink((device + "/run/bus").c_str());
+    stop_device(&self);
     status = DEVICE_OK;
   } catch (const std::exception &error) {
     std::fprintf(stderr, "quarn-device: %s\n", error.what());

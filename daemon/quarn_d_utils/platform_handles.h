@@ -15,7 +15,6 @@
 #include "quarn_d_utils/handles.h"
 
 using PackageInfoPtr = Handle<package_info_s, &package_info_destroy>;
-using PackageManagerPtr = Handle<package_manager_s, &package_manager_destroy>;
 using PkgRecordPtr = Handle<void, &pkgmgrinfo_pkginfo_destroy_pkginfo>;
 using AppRecordPtr = Handle<void, &pkgmgrinfo_appinfo_destroy_appinfo>;
 using PkgClientPtr = Handle<pkgmgr_client, &pkgmgr_client_free>;

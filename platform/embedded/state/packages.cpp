@@ -1,7 +1,6 @@
 #include "state/packages.h"
 
 #include <dirent.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>

@@ -12,6 +12,7 @@
 #include "forwarder.h"
 #include "http/url.h"
 #include "session/session.h"
+#include "webdav/backend_webdav.h"
 #include "webdav/dav_client.h"
 #include "webdav_store.h"
 
@@ -37,7 +38,8 @@ class WebdavCase : public ::testing::Test {
     EXPECT_TRUE(file.refresh());
     transport::StoreUrl url;
     std::string problem;
-    EXPECT_TRUE(transport::parse_store_url(file.config().url, "webdav", &url, &problem));
+    EXPECT_TRUE(
+        transport::parse_store_url(file.config().url, transport::kWebdavScheme, &url, &problem));
     return DavClient(url, file.config());
   }
   bool lies_there(const std::string &path) const {

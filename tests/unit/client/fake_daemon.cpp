@@ -298,8 +298,8 @@ void QuarnctlRun::on_end(GObject *source, GAsyncResult *result, gpointer user_da
   EXPECT_TRUE(g_subprocess_communicate_utf8_finish(G_SUBPROCESS(source), result, &stdout_text,
                                                    &stderr_text, out(error)))
       << (error ? error->message : "");
-  const GString_ stdout_owner(stdout_text);
-  const GString_ stderr_owner(stderr_text);
+  const GText stdout_owner(stdout_text);
+  const GText stderr_owner(stderr_text);
   if (stdout_text != nullptr) self->outcome_.out = stdout_text;
   if (stderr_text != nullptr) self->outcome_.err = stderr_text;
   GSubprocess *process = self->process_.get();

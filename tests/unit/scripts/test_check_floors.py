@@ -74,6 +74,44 @@ class Breaches(unittest.TestCase):
         self.assert_told('daemon/quarn_d_utils/files.cpp: includes daemon/quarn_d_backup/pipeline.h '
                          '("daemon utils" does not see "daemon backup")')
 
+    def test_by_a_name_of_the_embedded_platform(self):
+        self.write("daemon/quarn_d_utils/label.cpp",
+                   "namespace embedded {\nint write_label(const char *path);\n}\n"
+                   "int label() { return embedded::write_label(\"/\"); }\n")
+        told = '("daemon utils" does not see "platform embedded")'
+        self.assert_told(f"daemon/quarn_d_utils/label.cpp:1: names embedded {told}",
+                         f"daemon/quarn_d_utils/label.cpp:4: names embedded {told}")
+
+    def test_by_a_name_of_a_kind_of_store(self):
+        self.write("transport/src/session/session.cpp",
+                   "class S3Client;\nstd::shared_ptr<Backend> made = make_webdav_backend();\n")
+        self.assert_told('transport/src/session/session.cpp:2: names make_webdav_backend '
+                         '("transport session" does not see "transport webdav")',
+                         'transport/src/session/session.cpp:1: names S3Client '
+                         '("transport session" does not see "transport s3")')
+
+    def test_by_a_kind_of_store_in_a_text(self):
+        self.write("daemon/quarn_d_backup/cloud.cpp",
+                   '/* One\n   comment. */ const char kind[] = "s3+https://";  // "\n')
+        self.assert_told('daemon/quarn_d_backup/cloud.cpp:2: names s3 '
+                         '("daemon backup" does not see "transport s3")')
+
+    def test_by_what_the_transport_is_made_of(self):
+        self.write("daemon/quarn_d_backup/cloud.cpp", "transport::Ticket ticket;\n")
+        self.write("transport/src/core/retry.cpp", "void *made = curl_easy_init();\n")
+        self.assert_told('daemon/quarn_d_backup/cloud.cpp:1: names transport::Ticket '
+                         '("daemon backup" does not see "transport core")',
+                         'transport/src/core/retry.cpp:1: names curl_easy_init '
+                         '("transport core" does not see "transport http")')
+
+    def test_are_no_names_in_comments_nor_where_the_floor_is_seen(self):
+        self.write("daemon/quarn_d_backup/cloud.cpp",
+                   "// As embedded::write_label() does, on WebDAV and S3.\n/* s3\n webdav */\n")
+        self.write("device/cloud.cpp", 'const char kind[] = "s3+https://";\n'
+                   "int labelled = embedded::write_label();\n")
+        self.write("transport/src/stores/make_backend.cpp", "auto made = make_s3_backend();\n")
+        self.assert_told()
+
     def test_by_two_files_that_include_each_other(self):
         self.write("transport/src/core/ticket.h", '#include "outcome.h"\n')
         self.write("transport/src/core/outcome.h", '#include "core/ticket.h"\n')

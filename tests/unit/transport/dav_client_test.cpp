@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include "webdav/backend_webdav.h"
+
 using namespace transport;
 
 namespace {
@@ -63,7 +65,7 @@ TEST(DavAnswers, LocksOfOthersAreWaitedFor) {
 TEST(DavClientTest, UrlsAndConditions) {
   StoreUrl url;
   std::string problem;
-  ASSERT_TRUE(parse_store_url("webdav+https://h:1/d%20v/", "webdav", &url, &problem));
+  ASSERT_TRUE(parse_store_url("webdav+https://h:1/d%20v/", kWebdavScheme, &url, &problem));
   Config config;
   config.user = "u";
   config.password = "p";
@@ -83,7 +85,7 @@ TEST(DavClientTest, UrlsAndConditions) {
 TEST(DavClientTest, RedirectionToTheNameWithASlashMeansAFolder) {
   StoreUrl url;
   std::string problem;
-  ASSERT_TRUE(parse_store_url("webdav+https://h/d", "webdav", &url, &problem));
+  ASSERT_TRUE(parse_store_url("webdav+https://h/d", kWebdavScheme, &url, &problem));
   const DavClient client(url, {});
   EXPECT_TRUE(client.means_folder(answer(301, {{"location", "https://h/d/a/"}}), "/a"));
   EXPECT_TRUE(client.means_folder(answer(308, {{"location", "/d/a/"}}), "/a"));

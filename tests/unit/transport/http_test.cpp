@@ -4,6 +4,8 @@
 #include <glib.h>
 
 #include "harness.h"
+#include "s3/backend_s3.h"
+#include "webdav/backend_webdav.h"
 
 using namespace harness;
 using namespace transport;
@@ -179,7 +181,7 @@ struct Parsed {
   std::string base, origin, host, path, problem;
 };
 
-Parsed parse(const std::string &url, const std::string &scheme = "webdav") {
+Parsed parse(const std::string &url, const StoreScheme &scheme = kWebdavScheme) {
   StoreUrl parsed;
   std::string problem;
   const bool good = parse_store_url(url, scheme, &parsed, &problem);
@@ -219,7 +221,7 @@ TEST(HttpUrl, StoresAreTakenApart) {
     EXPECT_EQ(parsed.path, expected.path);
     EXPECT_EQ(parsed.problem, "");
   }
-  EXPECT_TRUE(parse("s3+https://h/bucket", "s3").good);
+  EXPECT_TRUE(parse("s3+https://h/bucket", kS3Scheme).good);
 }
 
 TEST(HttpUrl, RefusalsSayWhy) {

@@ -202,7 +202,7 @@ TEST(S3Name, IsPlain) {
 std::string problem_with(const Config &config) {
   StoreUrl url;
   std::string problem;
-  if (!parse_store_url(config.url, "s3", &url, &problem)) return problem;
+  if (!parse_store_url(config.url, kS3Scheme, &url, &problem)) return problem;
   return make_s3_backend(url, config, &problem) == nullptr ? problem : "none";
 }
 

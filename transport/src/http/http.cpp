@@ -3,7 +3,6 @@
 #include <glib.h>
 
 #include <condition_variable>
-#include <cstdlib>
 #include <deque>
 #include <list>
 #include <memory>

@@ -23,8 +23,6 @@ bool is_host(const std::string &host) {
                      [](char c) { return g_ascii_isalnum(c) || c == '-' || c == '.' || c == '_'; });
 }
 
-// WebDAV servers answer with single slashes whatever they are asked for; to S3 services "a//b" is
-// another name than "a/b".
 std::string with_single_slashes(const std::string &path) {
   std::string single;
   for (const char c : path) {
@@ -65,9 +63,9 @@ bool is_loopback(const std::string &host) {
           host.find_first_not_of("0123456789.") == std::string::npos);
 }
 
-bool parse_store_url(const std::string &url, const std::string &scheme, StoreUrl *parsed,
+bool parse_store_url(const std::string &url, const StoreScheme &scheme, StoreUrl *parsed,
                      std::string *problem) {
-  const std::string prefix = scheme + "+";
+  const std::string prefix = std::string(scheme.name) + "+";
   if (url.compare(0, prefix.size(), prefix) != 0) return false;
   const Uri parts(g_uri_parse(url.c_str() + prefix.size(), G_URI_FLAGS_NONE, nullptr));
   GUri *const uri = parts.get();
@@ -81,7 +79,7 @@ bool parse_store_url(const std::string &url, const std::string &scheme, StoreUrl
                    (host.find(':') == std::string::npos ? host : "[" + host + "]");
   if (g_uri_get_port(uri) > 0) parsed->origin += ":" + std::to_string(g_uri_get_port(uri));
   parsed->path = g_uri_get_path(uri);
-  if (scheme == "webdav") parsed->path = with_single_slashes(parsed->path);
+  if (scheme.slashes == Slashes::kOne) parsed->path = with_single_slashes(parsed->path);
   while (!parsed->path.empty() && parsed->path.back() == '/') parsed->path.pop_back();
   parsed->base = parsed->origin + encode_path(parsed->path);
   return true;

@@ -23,11 +23,23 @@ struct StoreUrl {
   std::string path; /**< decoded, without a trailing slash; "" at the top */
 };
 
+/** What a kind of store takes two slashes in a row for. */
+enum class Slashes {
+  kOne, /**< they mean one */
+  kKept /**< "a//b" is another name than "a/b" */
+};
+
+/** What the addresses of a kind of store begin with, and what is meant by their paths. */
+struct StoreScheme {
+  const char *name;
+  Slashes slashes;
+};
+
 /**
- * @param scheme "webdav" or "s3"
+ * The parts of @p url, where it is one of @p scheme: its name, "+", and an address.
  * @return false with @p problem; the problem is empty when the URL has another scheme
  */
-[[nodiscard]] bool parse_store_url(const std::string &url, const std::string &scheme,
+[[nodiscard]] bool parse_store_url(const std::string &url, const StoreScheme &scheme,
                                    StoreUrl *parsed, std::string *problem);
 
 }  // namespace transport

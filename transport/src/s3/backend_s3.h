@@ -14,6 +14,9 @@
 
 namespace transport {
 
+/** An object's name is any text, so that nothing of an address is taken for the same. */
+inline constexpr StoreScheme kS3Scheme{"s3", Slashes::kKept};
+
 /** @return null with @p problem when the configuration cannot be meant */
 [[nodiscard]] std::shared_ptr<Backend> make_s3_backend(const StoreUrl &url, const Config &config,
                                                        std::string *problem);

@@ -14,6 +14,9 @@
 
 namespace transport {
 
+/** The servers answer with single slashes whatever they are asked for. */
+inline constexpr StoreScheme kWebdavScheme{"webdav", Slashes::kOne};
+
 /** Null with @p problem when nothing can be meant by the configuration. */
 [[nodiscard]] std::shared_ptr<Backend> make_webdav_backend(const StoreUrl &url,
                                                            const Config &config,

@@ -1,5 +1,5 @@
 /**
- * @file package_files.h
+ * @file installer.h
  * @brief The installer's work on the files of packages, whose applications may be working there.
  *
  * Whatever is new is made in a folder of root's own, with owner, mode and label,
@@ -7,22 +7,22 @@
  * application has is entered by descriptors and only where it is the
  * application's: no name of its is ever followed to a place of somebody else's.
  */
-#ifndef QUARN_DEVICE_PACKAGE_FILES_H
-#define QUARN_DEVICE_PACKAGE_FILES_H
+#ifndef QUARN_DEVICE_INSTALLER_H
+#define QUARN_DEVICE_INSTALLER_H
 
 #include <string>
 
 #include "device.h"
 
 /** Held by whoever holds the installer's lock. Failures are thrown as Failure. */
-class PackageFiles {
+class Installer {
  public:
   /** Empties what an installer that was killed has left. */
-  explicit PackageFiles(const std::string &device);
+  explicit Installer(const std::string &device);
   /** Leaves nothing of the work behind, or it stays for the next one. */
-  ~PackageFiles();
-  PackageFiles(const PackageFiles &) = delete;
-  PackageFiles &operator=(const PackageFiles &) = delete;
+  ~Installer();
+  Installer(const Installer &) = delete;
+  Installer &operator=(const Installer &) = delete;
 
   /**
    * The files of a package that is not installed, in one step: all or none.

@@ -1,4 +1,4 @@
-#include "package_files.h"
+#include "installer.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -9,7 +9,6 @@
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
-#include <memory>
 #include <vector>
 
 #include "files/package_files.h"
@@ -115,7 +114,7 @@ int open_applications_folder(int at, const char *name, const std::string &shown)
 
 }  // namespace
 
-PackageFiles::PackageFiles(const std::string &device)
+Installer::Installer(const std::string &device)
     : path_(device + "/" + kParent + "/" + kOwnFolder),
       parent_(open((device + "/" + kParent).c_str(), kFolderFlags)),
       apps_(openat(parent_.fd, kApps, kFolderFlags)),
@@ -129,7 +128,7 @@ PackageFiles::PackageFiles(const std::string &device)
   empty();
 }
 
-PackageFiles::~PackageFiles() {
+Installer::~Installer() {
   try {
     empty();
   } catch (const Failure &) {
@@ -138,7 +137,7 @@ PackageFiles::~PackageFiles() {
   unlinkat(parent_.fd, kOwnFolder, AT_REMOVEDIR);
 }
 
-void PackageFiles::install(const std::string &source, const std::string &id) {
+void Installer::install(const std::string &source, const std::string &id) {
   const std::string staged = fresh_name();
   const fs::path root = path_ + "/" + staged;
   const auto make_folder = [&](const fs::path &path) {
@@ -169,7 +168,7 @@ void PackageFiles::install(const std::string &source, const std::string &id) {
   throw Failure(shown + " is in the way");
 }
 
-void PackageFiles::update(const std::string &source, const std::string &id) {
+void Installer::update(const std::string &source, const std::string &id) {
   const std::string shown = std::string(kApps) + "/" + id;
   make_missing_folder(apps_.fd, id.c_str(), id, shown);
   const Fd root(open_applications_folder(apps_.fd, id.c_str(), shown));
@@ -187,28 +186,28 @@ void PackageFiles::update(const std::string &source, const std::string &id) {
   replace_resources(root.fd, source, id);
 }
 
-void PackageFiles::remove(const std::string &id) {
+void Installer::remove(const std::string &id) {
   if (move_out(apps_.fd, id.c_str(), std::string(kApps) + "/" + id)) empty();
 }
 
-std::string PackageFiles::fresh_name() { return "p" + std::to_string(names_++); }
+std::string Installer::fresh_name() { return "p" + std::to_string(names_++); }
 
-std::string PackageFiles::stage(const std::string &from, const std::string &label) {
+std::string Installer::stage(const std::string &from, const std::string &label) {
   const std::string name = fresh_name();
   copy_tree(from, path_ + "/" + name, label);
   return name;
 }
 
-void PackageFiles::add_entries(int to, const std::string &from, const std::string &label,
-                               const std::string &shown) {
+void Installer::add_entries(int to, const std::string &from, const std::string &label,
+                            const std::string &shown) {
   for (const fs::directory_entry &entry : fs::directory_iterator(from)) {
     const std::string name = entry.path().filename();
     add_missing(to, name, entry.path(), label, shown + "/" + name);
   }
 }
 
-void PackageFiles::add_missing(int to, const std::string &name, const std::string &from,
-                               const std::string &label, const std::string &shown) {
+void Installer::add_missing(int to, const std::string &name, const std::string &from,
+                            const std::string &label, const std::string &shown) {
   struct stat present {};
   if (fstatat(to, name.c_str(), &present, AT_SYMLINK_NOFOLLOW) != 0) {
     if (errno != ENOENT) fail("look at", shown);
@@ -225,8 +224,8 @@ void PackageFiles::add_missing(int to, const std::string &name, const std::strin
   }
 }
 
-void PackageFiles::make_missing_folder(int to, const char *name, const std::string &label,
-                                       const std::string &shown) {
+void Installer::make_missing_folder(int to, const char *name, const std::string &label,
+                                    const std::string &shown) {
   struct stat present {};
   if (fstatat(to, name, &present, AT_SYMLINK_NOFOLLOW) == 0) return;
   const std::string staged = fresh_name();
@@ -236,8 +235,7 @@ void PackageFiles::make_missing_folder(int to, const char *name, const std::stri
   move_in(staged, to, name, shown);
 }
 
-void PackageFiles::replace_resources(int root, const std::string &source,
-                                     const std::string &label) {
+void Installer::replace_resources(int root, const std::string &source, const std::string &label) {
   const fs::path from = fs::path(source) / "res";
   const bool wanted = fs::is_directory(from);
   const std::string staged = wanted ? stage(fs::canonical(from), label) : "";
@@ -248,20 +246,20 @@ void PackageFiles::replace_resources(int root, const std::string &source,
   throw Failure("res is in the way");
 }
 
-bool PackageFiles::move_in(const std::string &staged, int to, const char *name,
-                           const std::string &shown) {
+bool Installer::move_in(const std::string &staged, int to, const char *name,
+                        const std::string &shown) {
   if (renameat2(own_.fd, staged.c_str(), to, name, RENAME_NOREPLACE) == 0) return true;
   if (errno != EEXIST) fail("make", shown);
   return false;
 }
 
-bool PackageFiles::move_out(int from, const char *name, const std::string &shown) {
+bool Installer::move_out(int from, const char *name, const std::string &shown) {
   if (renameat(from, name, own_.fd, fresh_name().c_str()) == 0) return true;
   if (errno != ENOENT) fail("remove", shown);
   return false;
 }
 
-bool PackageFiles::bring_up(const std::string &name) {
+bool Installer::bring_up(const std::string &name) {
   const Fd folder(openat(own_.fd, name.c_str(), kFolderFlags));
   bool some = false;
   for (const std::string &entry : names_in(folder.fd)) {
@@ -274,7 +272,7 @@ bool PackageFiles::bring_up(const std::string &name) {
   return some;
 }
 
-void PackageFiles::empty() {
+void Installer::empty() {
   int error = 0;
   // An application that is still running may keep making something in what is its.
   int fruitless = 0;
