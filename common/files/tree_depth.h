@@ -12,4 +12,7 @@
  */
 inline constexpr int kMaxDirDepth = 400;
 
+/** Whether a directory that is the @p directories'th of those in one another is beyond it. */
+constexpr bool is_too_deep(int directories) { return directories > kMaxDirDepth; }
+
 #endif
