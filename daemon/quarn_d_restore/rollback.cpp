@@ -12,6 +12,7 @@
 #include "platform_smack.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/tree_place.h"

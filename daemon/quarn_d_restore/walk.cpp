@@ -13,6 +13,7 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/settle.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"

@@ -12,7 +12,7 @@
 #include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/archive.h"
-#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/directory.h"
 #include "restore_fixture.h"
 
 namespace {
