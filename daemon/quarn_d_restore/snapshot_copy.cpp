@@ -107,7 +107,8 @@ class SnapshotCopy : public TreeVisitor {
  private:
   /** Whether to go deeper would be more than a backup can hold: its table is in memory whole. */
   bool is_beyond_bounds(const TreePlace &place) const {
-    const bool deeper = is_too_deep(static_cast<int>(place.depth()) + 1);
+    // the data directory counts, and so does the one that would be entered
+    const bool deeper = is_too_deep(static_cast<int>(place.depth()) + 2);
     if (!deeper && table_->names <= kMostNames) return false;
     LOGE("data at %s is %s than a snapshot can hold", folder_of(path_).c_str(),
          deeper ? "deeper" : "more");
