@@ -1,16 +1,12 @@
 #include "rules.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
-#include <cstring>
-
 #include "files/package_files.h"
 #include "files/safe_path.h"
-#include "files/tree_depth.h"
+#include "files/tree_walk.h"
 #include "quarn_common.h"
 #include "quarn_handles.h"
 #include "rules/path_matcher.h"
@@ -137,74 +133,80 @@ void note_unreadable(rules_report *report, const std::string &path) {
                               "the directory cannot be read: the application would be skipped"});
 }
 
-/** A check on its way through the data. */
-struct Check {
-  rules_report *report;
-  Decision decision;
-  package_files files;
-};
-
-void note_entry(Check *check, const std::string &path, const struct stat &status) {
-  rules_report *report = check->report;
-  rule_entry entry;
-  entry.path = relative_to(*report, path);
-  if (!S_ISREG(status.st_mode) && !S_ISLNK(status.st_mode)) {
-    report->problems.push_back({"special-file", 0, entry.path,
-                                "neither file, directory nor link: its application's backup "
-                                "fails"});
-    return;
-  }
-  entry.link = S_ISLNK(status.st_mode);
-  entry.size = static_cast<std::uint64_t>(status.st_size);
-  entry.in = !report->blocked && check->decision.takes(path);
-  entry.element = deciding_element(report, path, entry.in);
-  report->entries.push_back(entry);
-}
-
 /** True for a part of a download, which an application cannot have made. */
-bool is_transports(const std::string &name, const struct stat &status) {
-  return is_part_name(name.c_str()) && S_ISREG(status.st_mode) && status.st_uid == geteuid() &&
+bool is_transports(const char *name, const struct stat &status) {
+  return is_part_name(name) && S_ISREG(status.st_mode) && status.st_uid == geteuid() &&
          status.st_nlink == 1;
 }
 
-/** As the daemon walks, and no deeper: beyond it an application is skipped. */
-void walk(Check *check, const DirPtr &dir, std::string *path, int depth) {
-  std::vector<std::string> names;
-  while (const dirent *entry = readdir(dir.get())) {
-    if (!is_dot_entry(entry->d_name)) names.emplace_back(entry->d_name);
-  }
-  std::sort(names.begin(), names.end());
-  for (const std::string &name : names) {
-    const PathStep step(path, name.c_str());
-    struct stat status {};
-    if (check->files.names(*path) ||
-        fstatat(dirfd(dir.get()), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0 ||
-        is_transports(name, status)) {
-      continue;
-    }
-    if (!S_ISDIR(status.st_mode)) {
-      note_entry(check, *path, status);
-      continue;
-    }
-    DirPtr child;
-    if (depth < kMaxDirDepth) child = safe_opendir_at(dirfd(dir.get()), name.c_str());
-    if (child) {
-      walk(check, child, path, depth + 1);
-    } else {
-      note_unreadable(check->report, *path);
-    }
-  }
-}
+/** A check on its way through the data: as the daemon's, and no deeper. */
+class Check {
+ public:
+  using Entries = EntriesByName;
 
-void walk_data(Check *check, std::string path, bool installed) {
-  const DirPtr dir = safe_opendir(path.c_str());
-  if (dir) {
-    walk(check, dir, &path, 1);
-  } else if (installed || exists(path)) {
-    // A source need not bring all three: the installation makes them.
-    note_unreadable(check->report, path);
+  Check(rules_report *report, const std::string &package_id)
+      : report_(report), decision_(*report), files_(package_id, report->root) {}
+
+  void run(bool installed) {
+    for (const std::string &dir : files_.data_dirs()) walk_data(dir, installed);
   }
-}
+
+  static bool ended() { return false; }
+
+  EntryVisit visit(int dir, const WalkEntry &entry, const std::string &path) {
+    struct stat status {};
+    if (files_.names(path) || fstatat(dir, entry.name, &status, AT_SYMLINK_NOFOLLOW) != 0 ||
+        is_transports(entry.name, status)) {
+      return EntryVisit::passed;
+    }
+    if (S_ISDIR(status.st_mode)) return EntryVisit::folder;
+    note_entry(path, status);
+    return EntryVisit::counted;
+  }
+
+  static DirPtr open(int dir, const char *name, struct stat * /*status*/) {
+    return safe_opendir_at(dir, name);
+  }
+
+  /** Beyond its depth an application is skipped. */
+  void missed(const std::string &path, int /*depth*/) { note_unreadable(report_, path); }
+
+  static bool left(int /*dir*/, const struct stat & /*status*/, const std::string & /*path*/,
+                   bool counted) {
+    return counted;
+  }
+
+ private:
+  void walk_data(std::string path, bool installed) {
+    const DirPtr dir = safe_opendir(path.c_str());
+    if (dir) {
+      walk_in_order(dir.get(), &path, this);
+    } else if (installed || exists(path)) {
+      // A source need not bring all three: the installation makes them.
+      note_unreadable(report_, path);
+    }
+  }
+
+  void note_entry(const std::string &path, const struct stat &status) {
+    rule_entry entry;
+    entry.path = relative_to(*report_, path);
+    if (!S_ISREG(status.st_mode) && !S_ISLNK(status.st_mode)) {
+      report_->problems.push_back({"special-file", 0, entry.path,
+                                   "neither file, directory nor link: its application's backup "
+                                   "fails"});
+      return;
+    }
+    entry.link = S_ISLNK(status.st_mode);
+    entry.size = static_cast<std::uint64_t>(status.st_size);
+    entry.in = !report_->blocked && decision_.takes(path);
+    entry.element = deciding_element(report_, path, entry.in);
+    report_->entries.push_back(entry);
+  }
+
+  rules_report *report_;
+  Decision decision_;
+  const package_files files_;
+};
 
 // Mistakes that only show once it is known what the elements matched.
 void find_mistakes(rules_report *report) {
@@ -250,8 +252,7 @@ rules_report check_rules(const std::string &package_id, const std::string &type,
     report.problems.push_back(
         {"wrong-place", 0, other, "a package of type \"" + type + "\" keeps its rules in " + file});
   }
-  Check check{&report, Decision(report), package_files(package_id, root)};
-  for (const std::string &dir : check.files.data_dirs()) walk_data(&check, dir, installed);
+  Check(&report, package_id).run(installed);
   for (const rule_entry &entry : report.entries) report.total += entry.in ? entry.size : 0;
   find_mistakes(&report);
   return report;

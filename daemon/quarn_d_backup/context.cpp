@@ -19,6 +19,7 @@
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_utils/device_info.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"

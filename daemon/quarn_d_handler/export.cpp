@@ -18,6 +18,7 @@
 #include "quarn_d_handler/export_turn.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"

@@ -10,17 +10,13 @@
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_utils/file_attributes.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/table_reader.h"
 #include "quarn_log.h"
 
 namespace {
-
-constexpr char kModeKey[] = "0";
-constexpr char kUidKey[] = "1";
-constexpr char kGidKey[] = "2";
-constexpr char kLabelKey[] = "3";
 
 constexpr char kDatabaseLabel[] = "wrt::db_origin";
 constexpr char kNativeSuffix[] = ".native";
@@ -33,13 +29,6 @@ constexpr long kFchmodat2 = 452;  // newer than some headers
 
 constexpr mode_t kPermissionBits = 07777;
 constexpr mode_t kSetIdBits = S_ISUID | S_ISGID;
-
-/** A member of the entry, null when it is missing or of another type. */
-json_object *member(json_object *entry, const char *key, json_type type) {
-  json_object *value = nullptr;
-  if (!json_object_object_get_ex(entry, key, &value)) return nullptr;
-  return json_object_is_type(value, type) ? value : nullptr;
-}
 
 }  // namespace
 
@@ -57,31 +46,27 @@ int get_file_info_from_backup(json_object *table, const char * /*pkgid*/, const 
     LOGI("cannot get file info : %s", path);
     return QUARN_UNREADABLE;
   }
-  entry = attributes_in_table(table, entry);
-  json_object *value = member(entry, kModeKey, json_type_int);
-  if (value == nullptr) {
+  const file_attributes found = read_attributes(attributes_in_table(table, entry));
+  if (!found.mode) {
     LOGE("cannot get permission info...");
     return QUARN_UNREADABLE;
   }
-  *mode = json_object_get_int(value);
-  value = member(entry, kUidKey, json_type_int);
-  if (value == nullptr) {
+  *mode = static_cast<int>(*found.mode);
+  if (!found.owner) {
     LOGE("cannot get uid info...");
     return QUARN_UNREADABLE;
   }
-  *uid = static_cast<unsigned int>(json_object_get_int64(value));
-  value = member(entry, kGidKey, json_type_int);
-  if (value == nullptr) {
+  *uid = *found.owner;
+  if (!found.group) {
     LOGE("cannot get gid info...");
     return QUARN_UNREADABLE;
   }
-  *gid = static_cast<unsigned int>(json_object_get_int64(value));
-  value = member(entry, kLabelKey, json_type_string);
-  if (value == nullptr) {
+  *gid = *found.group;
+  if (!found.label) {
     LOGE("cannot get smack info...");
     return QUARN_UNREADABLE;
   }
-  *label = const_cast<char *>(json_object_get_string(value));
+  *label = const_cast<char *>(*found.label);
   return QUARN_OK;
 }
 

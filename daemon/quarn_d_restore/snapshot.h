@@ -48,14 +48,6 @@ enum class rollback_result {
  */
 rollback_result put_snapshot_back(const char *pkgid, const char *root);
 
-/**
- * Copy all of a file's bytes, as long as it is by now, into an empty one: what grows meanwhile may
- * grow for ever. Its holes, which an application may make as large as it likes, stay holes and take
- * neither time nor room.
- * @param size that it had when it was looked at; it may have another by now
- */
-bool copy_bytes(int from, int to, off_t size);
-
 /** Remember what has been unpacked. @return false when it could not be written */
 bool note_unpacked_files(const char *pkgid, const char *root);
 /**

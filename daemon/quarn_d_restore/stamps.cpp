@@ -7,12 +7,13 @@
 
 #include "files/held_folder.h"
 #include "files/safe_path.h"
+#include "files/tree_walk.h"
 #include "quarn_common.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/tree_walk.h"
+#include "quarn_d_utils/tree_place.h"
 #include "quarn_d_utils/unpacked_file.h"
 #include "quarn_d_utils/working_files.h"
 
@@ -50,53 +51,49 @@ bool read_stamps(const std::string &path, Stamps *stamps) {
   return true;
 }
 
-/** Visits the regular files of a package's data. */
-class DataWalk {
+/** Shows the regular files of a package's data to @p visit, by path and status. */
+template <typename Visit>
+class DataWalk : public TreeVisitor {
  public:
-  explicit DataWalk(const restore_files &files) : files_(files) {}
+  DataWalk(const restore_files &files, Visit visit) : files_(files), visit_(std::move(visit)) {}
 
-  /** @p visit gets path and status, and goes on while it answers true. */
-  template <typename Visit>
-  void run(Visit visit) {
+  /** As long as it answers true. */
+  void run() {
     const ActAsPackage acting;
     for (const auto &dir : files_.dirs) {
-      if (!walk(dir, visit)) return;
+      TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                      TreeAccess::kPackage);
+      path_ = dir;
+      if (place) static_cast<void>(walk_tree(&place, &path_, this));
+      if (!wanted_) return;
     }
   }
 
- private:
-  template <typename Visit>
-  bool walk(const std::string &dir, Visit &visit) {
-    bool wanted = true;
-    walk_tree(TreePlace(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
-                        TreeAccess::kPackage),
-              dir, [&](int fd, const std::string &path, TreeFolders *folders) {
-                wanted = scan(fd, path, visit, folders);
-                return wanted;
-              });
-    return wanted;
-  }
-
-  template <typename Visit>
-  bool scan(int dir, const std::string &folder, Visit &visit, std::vector<std::string> *folders) {
+  bool scan(const TreePlace &place, std::vector<std::string> *folders) {
     std::vector<TreeEntry> entries;
-    list_tree_entries(dir, &entries);
+    list_tree_entries(place.fd(), &entries);
     for (TreeEntry &entry : entries) {
-      const std::string path = folder + "/" + entry.name;
+      const std::string path = path_ + "/" + entry.name;
       if (files_.is_skipped(path) || path == files_.table) continue;
       struct stat status = {};
-      if (status_as_package(dir, entry.name.c_str(), user_of_package(), &status) != 0) continue;
+      if (status_as_package(place.fd(), entry.name.c_str(), user_of_package(), &status) != 0) {
+        continue;
+      }
       if (S_ISDIR(status.st_mode)) {
         folders->push_back(std::move(entry.name));
-      } else if (S_ISREG(status.st_mode) && !is_own_leftover(entry.name.c_str(), status) &&
-                 !visit(path, status)) {
-        return false;
+      } else if (S_ISREG(status.st_mode) && !is_own_leftover(entry.name.c_str(), status)) {
+        wanted_ = visit_(path, status);
+        if (!wanted_) return false;
       }
     }
     return true;
   }
 
+ private:
   const restore_files &files_;
+  Visit visit_;
+  std::string path_;
+  bool wanted_ = true;
 };
 
 }  // namespace
@@ -146,10 +143,10 @@ bool note_unpacked_files(const char *pkgid, const char *root) {
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
   StampWriter stamps(files.parts.unpacked);
-  DataWalk(files).run([&](const std::string &, const struct stat &status) {
+  DataWalk(files, [&](const std::string &, const struct stat &status) {
     stamps.add(status);
     return true;
-  });
+  }).run();
   return stamps.finish();
 }
 
@@ -160,13 +157,13 @@ bool application_has_written(const restore_files &files, std::string *path) {
   const bool unpacked = read_stamps(files.parts.unpacked, &known);
   std::sort(known.begin(), known.end());
   bool written = false;
-  DataWalk(files).run([&](const std::string &file, const struct stat &status) {
+  DataWalk(files, [&](const std::string &file, const struct stat &status) {
     if (std::binary_search(known.begin(), known.end(), file_stamp(status))) return true;
     // What the unpacking makes nobody opens until all of it is noted.
     if (!unpacked && is_being_unpacked(status)) return true;
     *path = file;
     written = true;
     return false;
-  });
+  }).run();
   return written;
 }

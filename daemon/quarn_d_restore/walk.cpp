@@ -1,40 +1,29 @@
 #include <fcntl.h>
 
 #include <cerrno>
+#include <string>
 #include <utility>
+#include <vector>
 
 #include "files/held_folder.h"
 #include "files/safe_path.h"
+#include "files/tree_walk.h"
 #include "log_scope.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"
-#include "quarn_common.h"
 #include "quarn_d_restore/archive_table.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/restore_files.h"
-#include "quarn_d_restore/settle.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/table_text.h"
-#include "quarn_d_utils/tree_walk.h"
-#include "quarn_d_utils/unpacked_file.h"
+#include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
 
 namespace {
 
 using Transaction = Handle<security_server_transaction, &security_server_perm_abort>;
-
-constexpr mode_t kFolderMode = 0755;
-constexpr mode_t kSettledMode = 0600;
-
-/** What stays the same in the walk over one package. */
-struct walk_context {
-  const char *pkgid;
-  const char *root;
-  json_object *table;
-  restore_files files;
-};
 
 /** A directory of the walk, which follows. */
 struct FoundFolder {
@@ -45,7 +34,6 @@ struct FoundFolder {
 
 /** A directory that the walk is in. */
 struct Level {
-  std::vector<FoundFolder> folders; /**< those in it that are still to be entered */
   bool lacks_info = false;
   bool holds_file = false; /**< here or anywhere below */
 };
@@ -55,68 +43,9 @@ UniqueFd find_entry(int dir, const TreeEntry &entry, struct stat *status) {
   return open_as_package(dir, entry.name.c_str(), O_PATH, 0, user_of_package(), status);
 }
 
-/** Give an object its attributes when it is the application's, not put there from elsewhere. */
-bool restore_object(const walk_context &ctx, int dir, int object, const struct stat &status,
-                    const std::string &path) {
-  if (!may_be_changed(dir, object, status, user_of_package())) {
-    LOGE("refused : %s is a link to a file elsewhere", path.c_str());
-    return false;
-  }
-  return restore_object_info(object, status, path.c_str(), ctx.pkgid, ctx.root, ctx.table) != 0;
-}
-
 bool is_empty_folder(const std::string &path) {
   const ActAsRoot root;
   return is_empty_directory(path.c_str());
-}
-
-int restore_entry(const walk_context &ctx, int dir, const TreeEntry &entry, const std::string &path,
-                  Level *level) {
-  struct stat status = {};
-  const UniqueFd object = find_entry(dir, entry, &status);
-  if (!object) {
-    const bool vanished = errno == ENOENT;
-    LOGE("error : lstat for %d %s", -1, path.c_str());
-    return vanished ? 1 : 0;
-  }
-  if (S_ISLNK(status.st_mode)) return 1;
-  if (S_ISDIR(status.st_mode)) {
-    const bool restored = restore_object(ctx, dir, object.get(), status, path);
-    level->folders.push_back({entry.name, status, !restored});
-    return 1;
-  }
-  if (S_ISREG(status.st_mode)) {
-    level->holds_file = true;
-    if (restore_object(ctx, dir, object.get(), status, path)) return 1;
-    LOGE("fail to restore file info : %s", path.c_str());
-    return 0;
-  }
-  LOGE("this is unexpected type : %s", path.c_str());
-  return 0;
-}
-
-/** One directory: everything in it but what lies deeper. @return 1, or 0 when anything failed */
-int restore_folder(const walk_context &ctx, int dir, std::string *path, Level *level) {
-  std::vector<TreeEntry> entries;
-  int result = list_tree_entries(dir, &entries) ? 1 : 0;
-  for (const TreeEntry &entry : entries) {
-    const PathStep step(path, entry.name.c_str());
-    if (ctx.files.is_skipped(*path)) continue;
-    restore_step("attributes");
-    if (!restore_entry(ctx, dir, entry, *path, level)) result = 0;
-  }
-  return result;
-}
-
-/** What a directory without attributes of its own comes to. @return 1, or 0 for a failure */
-int judge_folder(const std::string &path, bool lacks_info, bool holds_file) {
-  if (!lacks_info) return 1;
-  if (!holds_file) {
-    LOGI("it is empty folder : %s", path.c_str());
-    return 1;
-  }
-  LOGE("fail to restore file info : %s", path.c_str());
-  return 0;
 }
 
 /** Go into a directory that was looked at; not into another that was put in its place. */
@@ -128,44 +57,114 @@ bool enter_checked(TreePlace *place, const std::string &name, const struct stat 
   return false;
 }
 
-int walk_directory(const walk_context &ctx, const std::string &dir) {
-  const ActAsPackage acting;
-  TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
-                  TreeAccess::kPackage);
-  if (!place) {
-    LOGE("error : cannot open this path %s", dir.c_str());
-    return 0;
-  }
-  std::string path = dir;
-  std::vector<Level> pending(1);
-  int result = restore_folder(ctx, place.fd(), &path, &pending.back());
-  while (true) {
-    if (pending.back().folders.empty()) {
-      const Level left = std::move(pending.back());
-      pending.pop_back();
-      // Asked of each folder on its own, this would go over all that lies below it again.
-      if (!judge_folder(path, left.lacks_info, left.holds_file)) result = 0;
-      if (pending.empty()) return result;
-      if (left.holds_file) pending.back().holds_file = true;
-      if (!place.up()) return 0;
-      path.resize(path.rfind('/'));
-      continue;
+/** Gives everything below one directory of a package its attributes. */
+class AttributesWalk : public TreeVisitor {
+ public:
+  using Folder = FoundFolder;
+  static const std::string &name_of(const FoundFolder &folder) { return folder.name; }
+
+  AttributesWalk(const char *pkgid, const char *root, json_object *table)
+      : pkgid_(pkgid), root_(root), table_(table), files_(pkgid, root) {}
+
+  /** @return true when every entry was restored */
+  bool run(const std::string &dir) {
+    const ActAsPackage acting;
+    TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
+                    TreeAccess::kPackage);
+    if (!place) {
+      LOGE("error : cannot open this path %s", dir.c_str());
+      return false;
     }
-    const FoundFolder next = std::move(pending.back().folders.back());
-    pending.back().folders.pop_back();
-    const std::size_t length = path.size();
-    path += "/" + next.name;
-    if (enter_checked(&place, next.name, next.status)) {
-      pending.push_back({{}, next.lacks_info, false});
-      if (!restore_folder(ctx, place.fd(), &path, &pending.back())) result = 0;
-    } else {
-      judge_folder(path, next.lacks_info, next.lacks_info && !is_empty_folder(path));
-      LOGE("error : cannot open this path %s", path.c_str());
-      result = 0;
-      path.resize(length);
-    }
+    path_ = dir;
+    levels_.emplace_back();
+    return walk_tree(&place, &path_, this) && restored_;
   }
-}
+
+  /** One directory: everything in it but what lies deeper. */
+  bool scan(const TreePlace &place, std::vector<FoundFolder> *folders) {
+    std::vector<TreeEntry> entries;
+    if (!list_tree_entries(place.fd(), &entries)) restored_ = false;
+    for (const TreeEntry &entry : entries) {
+      const PathStep step(&path_, entry.name.c_str());
+      if (files_.is_skipped(path_)) continue;
+      restore_step("attributes");
+      if (!restore_entry(place.fd(), entry, folders)) restored_ = false;
+    }
+    return true;
+  }
+
+  TreeStep enter(TreePlace *place, const FoundFolder &folder) {
+    if (enter_checked(place, folder.name, folder.status)) {
+      levels_.push_back({folder.lacks_info, false});
+      return TreeStep::entered;
+    }
+    judge_folder(folder.lacks_info, folder.lacks_info && !is_empty_folder(path_));
+    LOGE("error : cannot open this path %s", path_.c_str());
+    restored_ = false;
+    return TreeStep::passed;
+  }
+
+  /** Asked of each folder on its own, this would go over all that lies below it again. */
+  void finish() {
+    const Level done = levels_.back();
+    levels_.pop_back();
+    if (!judge_folder(done.lacks_info, done.holds_file)) restored_ = false;
+    if (!levels_.empty() && done.holds_file) levels_.back().holds_file = true;
+  }
+
+ private:
+  /** Give an object its attributes when it is the application's, not put there from elsewhere. */
+  bool restore_object(int dir, int object, const struct stat &status) const {
+    if (!may_be_changed(dir, object, status, user_of_package())) {
+      LOGE("refused : %s is a link to a file elsewhere", path_.c_str());
+      return false;
+    }
+    return restore_object_info(object, status, path_.c_str(), pkgid_, root_, table_) != 0;
+  }
+
+  bool restore_entry(int dir, const TreeEntry &entry, std::vector<FoundFolder> *folders) {
+    struct stat status = {};
+    const UniqueFd object = find_entry(dir, entry, &status);
+    if (!object) {
+      const bool vanished = errno == ENOENT;
+      LOGE("error : lstat for %d %s", -1, path_.c_str());
+      return vanished;
+    }
+    if (S_ISLNK(status.st_mode)) return true;
+    if (S_ISDIR(status.st_mode)) {
+      const bool restored = restore_object(dir, object.get(), status);
+      folders->push_back({entry.name, status, !restored});
+      return true;
+    }
+    if (S_ISREG(status.st_mode)) {
+      levels_.back().holds_file = true;
+      if (restore_object(dir, object.get(), status)) return true;
+      LOGE("fail to restore file info : %s", path_.c_str());
+      return false;
+    }
+    LOGE("this is unexpected type : %s", path_.c_str());
+    return false;
+  }
+
+  /** Whether a directory may be without attributes of its own, if it is. */
+  bool judge_folder(bool lacks_info, bool holds_file) const {
+    if (!lacks_info) return true;
+    if (!holds_file) {
+      LOGI("it is empty folder : %s", path_.c_str());
+      return true;
+    }
+    LOGE("fail to restore file info : %s", path_.c_str());
+    return false;
+  }
+
+  const char *pkgid_;
+  const char *root_;
+  json_object *table_;
+  const restore_files files_;
+  std::string path_;
+  std::vector<Level> levels_;
+  bool restored_ = true;
+};
 
 /** Read the table and remove its file; null with the reason logged. */
 JsonPtr take_table(const std::string &path) {
@@ -227,26 +226,6 @@ bool relabel_directories(const char *pkgid, const restore_files &files) {
   return true;
 }
 
-/** Give the unpacked files of one folder that have no attributes those of any new file. */
-bool settle_folder(int dir, const std::string &path, const restore_files &files, const char *label,
-                   TreeFolders *folders) {
-  const package_user user = user_of_package();
-  std::vector<TreeEntry> entries;
-  list_tree_entries(dir, &entries);
-  for (TreeEntry &entry : entries) {
-    if (files.is_skipped(path + "/" + entry.name)) continue;
-    struct stat status = {};
-    const UniqueFd object = open_as_package(dir, entry.name.c_str(), O_PATH, 0, user, &status);
-    if (object && S_ISDIR(status.st_mode)) folders->push_back(std::move(entry.name));
-    if (!object || !is_being_unpacked(status) || status.st_uid != user.uid) continue;
-    if (change_object_mode(object.get(), status, kSettledMode) < 0) LOGE("chmod failed");
-    if (label == nullptr) continue;
-    const ActAsRoot root;
-    static_cast<void>(smack_setlabel(own_fd_path(object.get()).c_str(), label, SMACK_LABEL_ACCESS));
-  }
-  return true;
-}
-
 bool restore_tree(const char *pkgid, const char *root) {
   const HeldFolder package(root);
   const restore_files files(pkgid, root);
@@ -264,91 +243,6 @@ bool restore_tree(const char *pkgid, const char *root) {
   return true;
 }
 
-/** One element of the link list. */
-struct stored_link {
-  const char *name;
-  const char *target;
-  mode_t mode;
-  const char *label;
-};
-
-bool read_link(json_object *element, stored_link *link) {
-  json_object *name = nullptr;
-  json_object *target = nullptr;
-  json_object *perm = nullptr;
-  json_object *values[4] = {};
-  const char *const keys[4] = {"0", "1", "2", "3"};
-  const json_type types[4] = {json_type_int, json_type_int, json_type_int, json_type_string};
-  if (!json_object_object_get_ex(element, "real_name", &name) ||
-      !json_object_is_type(name, json_type_string) ||
-      !json_object_object_get_ex(element, "lnk", &target) ||
-      !json_object_is_type(target, json_type_string) ||
-      !json_object_object_get_ex(element, "perm", &perm)) {
-    return false;
-  }
-  for (int i = 0; i < 4; ++i) {
-    if (!json_object_object_get_ex(perm, keys[i], &values[i]) ||
-        !json_object_is_type(values[i], types[i])) {
-      return false;
-    }
-  }
-  link->name = json_object_get_string(name);
-  link->target = json_object_get_string(target);
-  link->mode = static_cast<mode_t>(json_object_get_int(values[0]));
-  link->label = json_object_get_string(values[3]);
-  return true;
-}
-
-/** True for a name that stays below the root: no leading slash, no "..". */
-bool stays_below(const std::string &name) {
-  if (name.empty() || name.front() == '/') return false;
-  const std::string framed = "/" + name + "/";
-  return framed.find("/../") == std::string::npos;
-}
-
-/** Make the folders that a link lies in, as the package's. */
-bool make_parents(const std::string &path) {
-  const HeldFolder *package = HeldFolder::of(path.c_str());
-  if (package == nullptr || !*package) return false;
-  const package_user user = user_of_package();
-  std::string below = package->below(path.c_str());
-  UniqueFd at = package->reopen(O_PATH | O_DIRECTORY);
-  for (std::size_t end = below.find('/'); at && end != std::string::npos; end = below.find('/')) {
-    const std::string name = below.substr(0, end);
-    below.erase(0, end + 1);
-    if (name.empty() || name == ".") continue;
-    static_cast<void>(mkdir_as_package(at.get(), name.c_str(), kFolderMode, user));
-    at = open_as_package(at.get(), name.c_str(), O_PATH | O_DIRECTORY, 0, user, nullptr);
-  }
-  return static_cast<bool>(at);
-}
-
-void make_link(const std::string &path, const stored_link &link) {
-  std::string name;
-  UniqueFd parent;
-  UniqueFd object;
-  struct stat status = {};
-  const ActAsPackage acting;
-  if (make_parents(path)) parent = safe_open_parent(path.c_str(), &name);
-  if (parent && symlinkat(link.target, parent.get(), name.c_str()) == 0) {
-    object.reset(openat(parent.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-  }
-  if (!object || fstat(object.get(), &status) != 0 || !S_ISLNK(status.st_mode)) {
-    LOGE("error : fail to make lnk for %s -> %s", path.c_str(), link.target);
-    return;
-  }
-  if (change_object_mode(object.get(), status, link.mode) < 0) LOGE("chmod failed");
-  if (change_object_owner(object.get(), kAppUid, kAppGid) < 0) LOGE("chown: error \n");
-  if (link.label[0] == '\0') {
-    LOGE("error : there isn't smack info of %s", path.c_str());
-    return;
-  }
-  const ActAsRoot root;
-  const std::string labelled = fd_path(parent.get()) + "/" + name;
-  const int result = smack_lsetlabel(labelled.c_str(), link.label, SMACK_LABEL_ACCESS);
-  if (result != 0) LOGE("fail : smack_lsetlabel for %s (err=%d)", path.c_str(), result);
-}
-
 }  // namespace
 
 void (*restore_step_hook)(const char *step) = nullptr;
@@ -359,52 +253,11 @@ int restore_app_info(const char *pkgid, const char *root) {
   return 0;
 }
 
-void settle_unpacked_files(const char *pkgid, const char *root) {
-  const LogScope scope(root);
-  const HeldFolder package(root);
-  const restore_files files(pkgid, root);
-  for (const auto &dir : files.dirs) {
-    TreePlace place(open_held_as_package(dir, O_RDONLY | O_DIRECTORY | O_NONBLOCK),
-                    TreeAccess::kPackage);
-    CString label;
-    if (place &&
-        smack_getlabel(own_fd_path(place.fd()).c_str(), out(label), SMACK_LABEL_ACCESS) != 0) {
-      label.reset();
-    }
-    const ActAsPackage acting;
-    walk_tree(std::move(place), dir, [&](int fd, const std::string &path, TreeFolders *folders) {
-      return settle_folder(fd, path, files, label.get(), folders);
-    });
-  }
-}
-
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table) {
   const LogScope scope(dir);
   const HeldFolder package(root);
-  const walk_context ctx{pkgid, root, table, restore_files(pkgid, root)};
-  return walk_directory(ctx, dir);
-}
-
-int restore_symlnk(const char * /*pkgid*/, const char *root, json_object *table) {
-  const LogScope scope(root);
-  const HeldFolder package(root);
-  json_object *list = nullptr;
-  if (!json_object_object_get_ex(table, kLinkListKey, &list) ||
-      !json_object_is_type(list, json_type_array)) {
-    return 1;
-  }
-  const std::size_t count = json_object_array_length(list);
-  for (std::size_t i = 0; i < count; ++i) {
-    stored_link link = {};
-    if (!read_link(json_object_array_get_idx(list, i), &link)) return 1;
-    if (!stays_below(link.name)) {
-      LOGE("refused : link outside of the application (%s)", link.name);
-      continue;
-    }
-    make_link(std::string(root) + "/" + link.name, link);
-  }
-  return 1;
+  return AttributesWalk(pkgid, root, table).run(dir) ? 1 : 0;
 }
 
 void clear_app_dir(const char *pkgid, const char *root) {

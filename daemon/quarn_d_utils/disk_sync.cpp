@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "files/safe_path.h"
+#include "files/tree_walk.h"
 #include "quarn_d_utils/tree_place.h"
 
 namespace {
@@ -49,93 +50,68 @@ bool sync_file_system(const std::string &dir) {
   return handle && syncfs(handle.get()) == 0;
 }
 
-/** What is done with each file and directory of a walk. */
-class SyncWalk {
+/** Shows each file, and then each directory that holds some, to @p visit, which takes it. */
+template <typename Visit>
+class SyncWalk : public TreeVisitor {
  public:
-  SyncWalk(std::string path, std::function<bool(const std::string &)> skipped)
-      : path_(std::move(path)), skipped_(std::move(skipped)) {}
+  using Skipped = std::function<bool(const std::string &)>;
+  SyncWalk(std::string path, const Skipped &skipped, Visit visit)
+      : path_(std::move(path)), skipped_(skipped), visit_(std::move(visit)) {}
 
-  /**
-   * Visit everything; @p visit takes each descriptor, and ends the walk when it answers false.
-   * @return true when every place was reached
-   */
-  bool run(const std::function<bool(UniqueFd)> &visit) {
+  /** Until it answers false. @return true when every place was reached */
+  bool run() {
     TreePlace place(safe_open(path_.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK));
-    if (!place) return false;
-    std::string path = path_;
-    bool whole = true;
-    std::vector<std::vector<std::string>> pending;
-    pending.push_back(scan(place.fd(), path, visit, &whole));
-    while (!stopped_) {
-      if (pending.back().empty()) {
-        pending.pop_back();
-        if (pending.empty()) return whole;
-        if (!place.up()) return false;
-        path.resize(path.rfind('/'));
-        continue;
-      }
-      const std::string name = std::move(pending.back().back());
-      pending.back().pop_back();
-      if (!place.down(name.c_str())) {
-        whole = false;
-        continue;
-      }
-      path += "/" + name;
-      pending.push_back(scan(place.fd(), path, visit, &whole));
-    }
-    return false;
+    return place && walk_tree(&place, &path_, this) && whole_;
   }
 
- private:
-  std::vector<std::string> stopped() {
-    stopped_ = true;
-    return {};
-  }
-
-  /** One directory: its files and then itself. @return the directories in it */
-  std::vector<std::string> scan(int dir, const std::string &path,
-                                const std::function<bool(UniqueFd)> &visit, bool *whole) {
+  /** One directory: its files and then itself. */
+  bool scan(const TreePlace &place, std::vector<std::string> *folders) {
+    const int dir = place.fd();
     std::vector<TreeEntry> entries;
-    std::vector<std::string> folders;
-    if (!list_tree_entries(dir, &entries)) *whole = false;
+    if (!list_tree_entries(dir, &entries)) whole_ = false;
     for (TreeEntry &entry : entries) {
-      if (skipped_ && skipped_(path + "/" + entry.name)) continue;
+      if (skipped_ && skipped_(path_ + "/" + entry.name)) continue;
       struct stat status = {};
       if (entry.type != DT_DIR) {
         UniqueFd file = safe_open_file_at(dir, entry.name.c_str(), &status);
         if (file) {
-          if (!visit(std::move(file))) return stopped();
+          if (!visit_(std::move(file))) return false;
           continue;
         }
         if (fstatat(dir, entry.name.c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) continue;
-        if (S_ISREG(status.st_mode)) *whole = false;
+        if (S_ISREG(status.st_mode)) whole_ = false;
         if (!S_ISDIR(status.st_mode)) continue;
       }
-      folders.push_back(std::move(entry.name));
+      folders->push_back(std::move(entry.name));
     }
     UniqueFd itself(openat(dir, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (itself) {
-      if (!visit(std::move(itself))) return stopped();
-    } else {
-      *whole = false;
-    }
-    return folders;
+    if (itself) return visit_(std::move(itself));
+    whole_ = false;
+    return true;
   }
 
-  const std::string path_;
-  const std::function<bool(const std::string &)> skipped_;
-  bool stopped_ = false;
+  TreeStep enter(TreePlace *place, const std::string &name) {
+    if (place->down(name.c_str())) return TreeStep::entered;
+    whole_ = false;
+    return TreeStep::passed;
+  }
+
+ private:
+  std::string path_;
+  const Skipped &skipped_;
+  Visit visit_;
+  bool whole_ = true;
 };
 
 }  // namespace
 
 bool sync_tree(const std::string &dir, const std::function<bool(const std::string &)> &skipped) {
-  SyncWalk walk(dir, skipped);
   std::vector<UniqueFd> few;
-  const bool reached = walk.run([&](UniqueFd object) {
+  SyncWalk walk(dir, skipped, [&](UniqueFd object) {
     few.push_back(std::move(object));
     return few.size() <= kFew;
   });
+  const bool reached = walk.run();
   if (few.size() > kFew) return sync_file_system(dir);
   // Everything is on its way before the first wait: one commit then serves many files.
   for (const UniqueFd &object : few) {

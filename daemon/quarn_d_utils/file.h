@@ -1,6 +1,6 @@
 /**
  * @file file.h
- * @brief Files and directories by their paths.
+ * @brief Files by their paths.
  *
  * Every function logs its failures and reports them by its result only.
  * Paths are absolute. Whatever lies below a package root is reached without following a
@@ -16,10 +16,6 @@
 bool file_exist(const char *path);
 /** True for a directory. */
 bool is_directory(const char *path);
-/** True when a regular file lies anywhere below @p dir. */
-bool file_exist_in_directory(const char *dir);
-/** The negation of file_exist_in_directory(). */
-bool is_empty_directory(const char *dir);
 /** Size in bytes, -1 on failure. */
 int get_file_size(const char *path);
 /** Read a whole file; @p buffer is malloc'd, NUL-terminated and the caller's. */
@@ -28,12 +24,6 @@ bool read_data_from_file(const char *path, char **buffer);
 std::uint32_t get_file_crc(const char *path);
 /** Remove a regular file. */
 bool delete_file(const char *path);
-/** Remove a directory with everything in it; links are refused and stay. */
-bool delete_directory_util(const char *dir);
-/** Empty a directory, and remove it too when @p remove_directory is set. */
-bool clear_directory(const char *dir, bool remove_directory);
-/** Empty a directory but for the entry whose full path is @p keep. */
-bool clear_shared_data_dir_except_temp_backup(const char *dir, const char *keep);
 /** Free bytes of the file system, those reserved for the super-user included; 0 on failure. */
 std::uint64_t get_dir_available_size(const char *path);
 /** Make the parent directory of a file, with its ancestors. */

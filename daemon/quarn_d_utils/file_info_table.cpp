@@ -6,57 +6,43 @@
 #include <cstring>
 #include <new>
 #include <string>
+#include <utility>
 
 #include "files/safe_path.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/file.h"
+#include "quarn_d_utils/file_attributes.h"
 #include "quarn_d_utils/file_info_table.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/table_text.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kRealNameKey[] = "real_name";
-constexpr char kLinkKey[] = "lnk";
-constexpr char kPermKey[] = "perm";
-constexpr char kPermissionKey[] = "0";
-constexpr char kUidKey[] = "1";
-constexpr char kGidKey[] = "2";
-constexpr char kLabelKey[] = "3";
-
 constexpr mode_t kPermissionBits = 07777;
 constexpr std::size_t kTargetBuffer = 1024;
-
-void add_constant(json_object *object, const char *key, json_object *value) {
-  json_object_object_add_ex(object, key, value,
-                            JSON_C_OBJECT_ADD_KEY_IS_NEW | JSON_C_OBJECT_KEY_IS_CONSTANT);
-}
 
 /**
  * An attribute object of the caller's. Most files of an application have the
  * same attributes: they share one object, so that the table of many files
  * stays small.
  */
-json_object *attribute_object(file_info_table_h *table, int permission, unsigned int uid,
-                              unsigned int gid, const char *label) {
+JsonPtr attribute_object(file_info_table_h *table, const file_attributes &attributes) {
   auto &used = table->used;
-  const auto values = std::tie(permission, uid, gid);
-  if (used != table->attributes.end() && label == std::get<std::string>(used->first) &&
+  const auto values = std::tie(*attributes.mode, *attributes.owner, *attributes.group);
+  if (used != table->attributes.end() && *attributes.label == std::get<std::string>(used->first) &&
       values ==
           std::tie(std::get<0>(used->first), std::get<1>(used->first), std::get<2>(used->first))) {
-    return json_object_get(used->second.get());
+    return JsonPtr(json_object_get(used->second.get()));
   }
-  used = table->attributes.try_emplace({permission, uid, gid, label}).first;
+  used =
+      table->attributes
+          .try_emplace({*attributes.mode, *attributes.owner, *attributes.group, *attributes.label})
+          .first;
   JsonPtr &shared = used->second;
   if (shared == nullptr) {
-    shared.reset(json_object_new_object());
-    add_constant(shared.get(), kPermissionKey, json_object_new_int(permission));
-    add_constant(shared.get(), kUidKey, json_object_new_int64(uid));
-    add_constant(shared.get(), kGidKey, json_object_new_int64(gid));
-    add_constant(shared.get(), kLabelKey, json_object_new_string(label));
+    shared = write_attributes(attributes);
     // Its text is made once for all that share it.
     char *text = strdup(json_object_get_string(shared.get()));
     if (text != nullptr) {
@@ -64,11 +50,11 @@ json_object *attribute_object(file_info_table_h *table, int permission, unsigned
                                  json_object_free_userdata);
     }
   }
-  return json_object_get(shared.get());
+  return JsonPtr(json_object_get(shared.get()));
 }
 
 /** The label of an object, which may be one that only root may read. */
-int read_label(const char *object, bool is_link, char **label) {
+int label_of(const char *object, bool is_link, char **label) {
   const auto read = is_link ? smack_lgetlabel : smack_getlabel;
   errno = 0;
   const int result = read(object, label, SMACK_LABEL_ACCESS);
@@ -78,20 +64,22 @@ int read_label(const char *object, bool is_link, char **label) {
 }
 
 /** The same for one entry, whatever of it can be read. @param object what its label is read of */
-json_object *attributes_of(file_info_table_h *table, const char *path, const struct stat &stat,
-                           const char *object, int *error, bool *complete) {
+JsonPtr attributes_of(file_info_table_h *table, const char *path, const struct stat &stat,
+                      const char *object, int *error, bool *complete) {
   CString label;
-  const int permission = static_cast<int>(stat.st_mode & kPermissionBits);
-  const unsigned int uid = stat.st_uid;
-  const unsigned int gid = stat.st_gid;
-  const int result = read_label(object, S_ISLNK(stat.st_mode), out(label));
+  const int result = label_of(object, S_ISLNK(stat.st_mode), out(label));
   *complete = result == 0;
   if (result != 0) LOGE("error : cannot get smack label of %s (err=%d)", path, result);
   if (label == nullptr) {
     LOGE("error : cannot get smack label of %s", path);
     *error = QUARN_REFUSED;
   }
-  return attribute_object(table, permission, uid, gid, label == nullptr ? "" : label.get());
+  file_attributes attributes;
+  attributes.mode = stat.st_mode & kPermissionBits;
+  attributes.owner = stat.st_uid;
+  attributes.group = stat.st_gid;
+  attributes.label = label == nullptr ? "" : label.get();
+  return attribute_object(table, attributes);
 }
 
 UniqueFd open_link(int dir, const char *name) {
@@ -142,7 +130,8 @@ void ready_file_info_table(file_info_table_h **table) {
   auto *made = new (std::nothrow) file_info_table_h;
   if (made == nullptr) return;
   made->symbolic_list = list.get();
-  add_constant(root.get(), kLinkListKey, list.release());
+  json_object_object_add_ex(root.get(), kLinkListKey, list.release(),
+                            JSON_C_OBJECT_ADD_KEY_IS_NEW | JSON_C_OBJECT_KEY_IS_CONSTANT);
   made->root = root.release();
   *table = made;
 }
@@ -161,7 +150,7 @@ bool get_file_info_from_file(const char *path, const struct stat &stat, int *per
   *label = nullptr;
   const std::string opened = fd < 0 ? std::string() : own_fd_path(fd);
   const char *object = fd < 0 ? path : opened.c_str();
-  const int result = read_label(object, S_ISLNK(stat.st_mode), label);
+  const int result = label_of(object, S_ISLNK(stat.st_mode), label);
   if (result != 0) {
     LOGE("error : cannot get smack label of %s (err=%d)", path, result);
     return false;
@@ -173,11 +162,11 @@ void add_to_file_info_table(file_info_table_h *table, const char *root, const ch
                             const struct stat &stat, int *error, int fd) {
   bool complete = false;
   const std::string opened = fd < 0 ? std::string() : own_fd_path(fd);
-  json_object *attributes =
+  JsonPtr attributes =
       attributes_of(table, path, stat, fd < 0 ? path : opened.c_str(), error, &complete);
   if (!complete) *error = QUARN_REFUSED;
   const char *name = relative_name(root, path);
-  json_object_object_add(table->root, name, attributes);
+  json_object_object_add(table->root, name, attributes.release());
   count_member(table, name, quoted_size(name));
 }
 
@@ -200,15 +189,11 @@ void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root,
   LOGI("%s -> %s", path, target);
   bool complete = false;
   const std::string object = dir < 0 ? path : own_fd_path(dir) + "/" + last;
-  json_object *attributes = attributes_of(table, path, stat, object.c_str(), error, &complete);
-  json_object *entry = json_object_new_object();
+  JsonPtr attributes = attributes_of(table, path, stat, object.c_str(), error, &complete);
   const char *name = relative_name(root, path);
-  add_constant(entry, kRealNameKey, json_object_new_string(name));
-  add_constant(entry, kLinkKey, json_object_new_string(target));
-  add_constant(entry, kPermKey, attributes);
-  json_object_array_add(table->symbolic_list, entry);
-  constexpr char kFrame[] = R"({ "real_name": , "lnk": , "perm":  })";
-  count_member(table, name, quoted_size(name) + quoted_size(target) + sizeof kFrame);
+  json_object_array_add(table->symbolic_list,
+                        write_link(name, target, std::move(attributes)).release());
+  count_member(table, name, quoted_size(name) + quoted_size(target) + kLinkFrame);
 }
 
 int save_file_info_table(file_info_table_h *table, const char *path) {

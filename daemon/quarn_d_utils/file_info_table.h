@@ -21,8 +21,8 @@
 /** Table of the modes, owners, labels and links of one archive. */
 struct file_info_table_h {
   json_object *root = nullptr;          /**< the document; owns everything below */
-  json_object *symbolic_list = nullptr; /**< "quarn_symbolic_info", borrowed */
-  using Attributes = std::map<std::tuple<int, unsigned int, unsigned int, std::string>, JsonPtr>;
+  json_object *symbolic_list = nullptr; /**< the links, borrowed */
+  using Attributes = std::map<std::tuple<mode_t, uid_t, gid_t, std::string>, JsonPtr>;
   /** Attribute objects by permission, owner, group and label: entries with the same share one. */
   Attributes attributes;
   Attributes::iterator used = attributes.end(); /**< the last one: the next entry's as a rule */

@@ -9,6 +9,7 @@
 
 #include "files/package_files.h"
 #include "files/safe_path.h"
+#include "files/tree_walk.h"
 #include "log_scope.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/file.h"
@@ -47,39 +48,54 @@ int look_at(int dir, const char *name, struct stat *status) {
   return fstatat(dir, name, status, AT_SYMLINK_NOFOLLOW);
 }
 
-std::uint64_t measure(DirPtr dir, const WorkingFiles &working, std::string *path, int depth) {
-  std::uint64_t sum = 0;
-  while (const dirent *entry = readdir(dir.get())) {
-    if (is_dot_entry(entry->d_name)) continue;
-    const PathStep step(path, entry->d_name);
-    if (working.contain(*path)) continue;
+/** Adds up what an archive would take of one directory. */
+class Measuring {
+ public:
+  using Entries = EntriesAsTheyCome;
+
+  Measuring(const char *pkg_id, const char *root) : working_(pkg_id, root) {}
+  std::uint64_t sum() const { return sum_; }
+
+  static bool ended() { return false; }
+
+  EntryVisit visit(int dir, const WalkEntry &entry, const std::string &path) {
+    if (working_.contain(path)) return EntryVisit::passed;
     struct stat status = {};
-    const int result = look_at(dirfd(dir.get()), entry->d_name, &status);
+    const int result = look_at(dir, entry.name, &status);
     if (result != 0) {
-      LOGE("error : lstat for %d %s", result, path->c_str());
+      LOGE("error : lstat for %d %s", result, path.c_str());
     } else if (S_ISDIR(status.st_mode)) {
-      DirPtr child;
-      if (depth < kMaxDirDepth) {
-        child = open_directory_as_package(dirfd(dir.get()), entry->d_name, user_of_package());
-      }
-      if (child == nullptr) {
-        LOGE("error : cannot open this path %s", path->c_str());
-        sum += kUnmeasurableSize;
-      } else {
-        sum += measure(std::move(child), working, path, depth + 1);
-      }
+      return EntryVisit::folder;
     } else if (S_ISREG(status.st_mode)) {
-      if (is_backup_file(path->c_str())) sum += static_cast<std::uint64_t>(status.st_size);
+      if (is_backup_file(path.c_str())) sum_ += static_cast<std::uint64_t>(status.st_size);
     } else if (S_ISLNK(status.st_mode)) {
-      if (!is_backup_file(path->c_str())) continue;
-      sum += static_cast<std::uint64_t>(status.st_size);
-      LOGI("size of lnk file %s : %d", path->c_str(), static_cast<int>(status.st_size));
+      if (!is_backup_file(path.c_str())) return EntryVisit::passed;
+      sum_ += static_cast<std::uint64_t>(status.st_size);
+      LOGI("size of lnk file %s : %d", path.c_str(), static_cast<int>(status.st_size));
     } else {
-      LOGE("this is unexpected type : %s", path->c_str());
+      LOGE("this is unexpected type : %s", path.c_str());
     }
+    return EntryVisit::passed;
   }
-  return sum;
-}
+
+  static DirPtr open(int dir, const char *name, struct stat * /*status*/) {
+    return open_directory_as_package(dir, name, user_of_package());
+  }
+
+  void missed(const std::string &path, int /*depth*/) {
+    LOGE("error : cannot open this path %s", path.c_str());
+    sum_ += kUnmeasurableSize;
+  }
+
+  static bool left(int /*dir*/, const struct stat & /*status*/, const std::string & /*path*/,
+                   bool counted) {
+    return counted;
+  }
+
+ private:
+  const WorkingFiles working_;
+  std::uint64_t sum_ = 0;
+};
 
 }  // namespace
 
@@ -129,14 +145,16 @@ bool is_backup_file(const char *path) {
 }
 
 std::uint64_t get_dir_backup_size(const char *dir_path, const char *pkg_id, const char *root) {
-  DirPtr dir = safe_opendir(dir_path);
+  const DirPtr dir = safe_opendir(dir_path);
   if (dir == nullptr) {
     LOGE("error : cannot open this path %s", dir_path);
     return kUnmeasurableSize;
   }
   const LogScope lines(dir_path);
-  const WorkingFiles working(pkg_id, root);
+  Measuring measuring(pkg_id, root);
   std::string path = dir_path;
   const ActAsPackage acting;
-  return acting ? measure(std::move(dir), working, &path, 1) : kUnmeasurableSize;
+  if (!acting) return kUnmeasurableSize;
+  walk_in_order(dir.get(), &path, &measuring);
+  return measuring.sum();
 }

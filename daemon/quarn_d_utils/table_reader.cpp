@@ -2,6 +2,8 @@
 
 #include <cstring>
 
+#include "quarn_d_utils/file_attributes.h"
+
 json_object *attributes_in_table(json_object *table, json_object *member) {
   if (json_object_is_type(member, json_type_string) == 0) return member;
   json_object *made = json_tokener_parse(json_object_get_string(member));

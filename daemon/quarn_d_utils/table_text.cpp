@@ -2,7 +2,9 @@
 
 #include <algorithm>
 #include <cstring>
+
 #include "quarn_d_utils/bounds.h"
+#include "quarn_d_utils/file_attributes.h"
 
 namespace {
 

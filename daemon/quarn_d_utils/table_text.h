@@ -15,9 +15,6 @@
 
 #include "quarn_d_utils/bounds.h"
 
-/** The table's member that lists the links: each element of it is a member of its own. */
-inline constexpr char kLinkListKey[] = "quarn_symbolic_info";
-
 /** How much of a table is taken. */
 struct table_bounds {
   std::uint64_t text;    /**< bytes */

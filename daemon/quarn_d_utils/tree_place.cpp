@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "files/safe_path.h"
+#include "files/tree_walk.h"
 #include "log_scope.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_log.h"
@@ -46,7 +47,7 @@ bool delete_entry(int dir, const char *name, OtherTypes others, TreeAccess acces
 }
 
 /** Removes one tree bottom up; a directory's folders are remembered while it is open. */
-class Removal {
+class Removal : public TreeVisitor {
  public:
   Removal(int parent, std::string path, OtherTypes others, TreeAccess access)
       : place_(open_folder(parent, ".", access), access),
@@ -56,36 +57,51 @@ class Removal {
 
   bool run(const char *name, const struct stat *looked_at) {
     if (looked_at != nullptr && !is_at(name, *looked_at)) return false;
-    if (!enter(name)) return false;
-    while (true) {
-      Level &level = levels_.back();
-      if (level.folders.empty()) {
-        const bool deleted = leave();
-        if (levels_.empty()) return deleted;
-        if (!deleted) failed_below();
-        path_.resize(path_.rfind('/'));
-        if (lost_) return false;
-        continue;
-      }
-      const std::string folder = std::move(level.folders.back());
-      level.folders.pop_back();
-      path_ += "/" + folder;
-      if (enter(folder.c_str())) continue;
-      failed_below();
-      path_.resize(path_.rfind('/'));
+    if (!go_into(&place_, name)) return false;
+    if (!walk_tree(&place_, &path_, this)) {
+      LOGE("Directory delete was failed");
+      LOGE("fail to delete dir : %s", path_.c_str());
+      return false;
     }
+    if (place_.up()) return remove_folder(place_.fd(), name);
+    LOGE("Directory delete was failed");
+    return false;
+  }
+
+  /** Delete what is no folder. */
+  bool scan(const TreePlace &place, std::vector<std::string> *folders) {
+    bool deleted = true;
+    for (TreeEntry &entry : entries_) {
+      struct stat status = {};
+      const bool folder = entry.type == DT_DIR ||
+                          (entry.type == DT_UNKNOWN &&
+                           status_of(place.fd(), entry.name.c_str(), access_, &status) == 0 &&
+                           S_ISDIR(status.st_mode));
+      if (folder) {
+        folders->push_back(std::move(entry.name));
+      } else if (!delete_entry(place.fd(), entry.name.c_str(), others_, access_)) {
+        LOGE("fail to delete file : %s", (path_ + "/" + entry.name).c_str());
+        deleted = false;
+      }
+    }
+    deleted_.push_back(deleted);
+    return true;
+  }
+
+  TreeStep enter(TreePlace *place, const std::string &name) {
+    if (go_into(place, name.c_str())) return TreeStep::entered;
+    failed_below();
+    return TreeStep::passed;
+  }
+
+  void left(const TreePlace &place, const char *name) {
+    if (!remove_folder(place.fd(), name)) failed_below();
   }
 
  private:
-  struct Level {
-    std::string name;
-    std::vector<std::string> folders;
-    bool deleted = true;
-  };
-
   void failed_below() {
     LOGE("fail to delete dir : %s", path_.c_str());
-    levels_.back().deleted = false;
+    deleted_.back() = false;
   }
 
   /** Go into the folder that was looked at, and no other. */
@@ -96,44 +112,26 @@ class Removal {
     return fstat(place_.fd(), &opened) == 0 && is_same_object(opened, looked_at);
   }
 
-  /** Go into a folder and delete what is no folder in it. */
-  bool enter(const char *name) {
-    std::vector<TreeEntry> entries;
-    if (!place_ || !(std::exchange(entered_, false) || place_.down(name)) ||
-        !list_tree_entries(place_.fd(), &entries)) {
-      const GErrorPtr error(g_error_new(G_FILE_ERROR, g_file_error_from_errno(errno),
-                                        "Error opening directory “%s”: %s", path_.c_str(),
-                                        g_strerror(errno)));
-      LOGE("directory open failed, err = [%s]", error->message);
-      return false;
+  /** Go into a folder, and see what it holds. */
+  bool go_into(TreePlace *place, const char *name) {
+    if (*place && (std::exchange(entered_, false) || place->down(name))) {
+      if (list_tree_entries(place->fd(), &entries_)) return true;
+      const int reason = errno;
+      static_cast<void>(place->up());
+      errno = reason;
     }
-    Level level;
-    level.name = name;
-    for (TreeEntry &entry : entries) {
-      struct stat status = {};
-      const bool folder = entry.type == DT_DIR ||
-                          (entry.type == DT_UNKNOWN &&
-                           status_of(place_.fd(), entry.name.c_str(), access_, &status) == 0 &&
-                           S_ISDIR(status.st_mode));
-      if (folder) {
-        level.folders.push_back(std::move(entry.name));
-      } else if (!delete_entry(place_.fd(), entry.name.c_str(), others_, access_)) {
-        LOGE("fail to delete file : %s", (path_ + "/" + entry.name).c_str());
-        level.deleted = false;
-      }
-    }
-    levels_.push_back(std::move(level));
-    return true;
+    const GErrorPtr error(g_error_new(G_FILE_ERROR, g_file_error_from_errno(errno),
+                                      "Error opening directory “%s”: %s", path_.c_str(),
+                                      g_strerror(errno)));
+    LOGE("directory open failed, err = [%s]", error->message);
+    return false;
   }
 
-  /** Go back out of the last folder and remove it. */
-  bool leave() {
-    const Level level = std::move(levels_.back());
-    levels_.pop_back();
-    lost_ = !place_.up();
-    if (!lost_ && remove_name(place_.fd(), level.name.c_str(), AT_REMOVEDIR, access_) == 0) {
-      return level.deleted;
-    }
+  /** Remove the folder that was left. @return true when all of it is gone */
+  bool remove_folder(int parent, const char *name) {
+    const bool emptied = deleted_.back();
+    deleted_.pop_back();
+    if (remove_name(parent, name, AT_REMOVEDIR, access_) == 0) return emptied;
     LOGE("Directory delete was failed");
     return false;
   }
@@ -142,9 +140,9 @@ class Removal {
   std::string path_;
   const OtherTypes others_;
   const TreeAccess access_;
-  std::vector<Level> levels_;
+  std::vector<TreeEntry> entries_;  // of the folder that was entered last
+  std::vector<bool> deleted_;       // for each folder on the way whether all in it is gone
   bool entered_ = false;
-  bool lost_ = false;
 };
 
 }  // namespace

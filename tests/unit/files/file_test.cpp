@@ -19,6 +19,7 @@
 #include "files/package_files.h"
 #include "log_capture.h"
 #include "quarn_common.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "temp_dir.h"
 

@@ -12,7 +12,7 @@
 #include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/archive.h"
-#include "quarn_d_utils/file.h"
+#include "quarn_d_utils/directory.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -139,6 +139,17 @@ TEST_F(DeepTest, DataThatIsDeeperThanABackupsIsLeftAsItIs) {
   EXPECT_FALSE(exists(snapshot()));
   EXPECT_FALSE(exists(at("data/db")));
   EXPECT_EQ(count_logged(DLOG_ERROR, "fail to temp backup : " + at("data")), 1);
+}
+
+TEST_F(DeepTest, OneFolderBeyondWhatIsPackedIsNotCopiedAsideEither) {
+  make_deep(kMaxDirDepth, "d", "present");
+  int error = 0;
+  make_zip_data(kPkg, root.c_str(), (base + "/deep.zip").c_str(), &error);
+  EXPECT_EQ(error, 36);
+  EXPECT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 36);
+  EXPECT_FALSE(exists(snapshot()));
+  EXPECT_EQ(deepest(), "present");
+  EXPECT_TRUE(delete_directory_util(at("data/d").c_str())) << "there is no bound to a removal";
 }
 
 TEST_F(DeepTest, EachFolderOfADeepTreeIsLookedAtOnceForItsAttributes) {
