@@ -76,12 +76,12 @@ int change_object_mode(int fd, const struct stat &status, mode_t mode) {
     return -1;
   }
   mode &= kPermissionBits;
-  int result = fchmod(fd, mode);
-  if (result == 0 || errno != EBADF) return result;
-  // A descriptor of the O_PATH kind. Kernels before 6.6, and filters that do not know the call,
-  // leave the way through /proc.
-  result = static_cast<int>(syscall(kFchmodat2, fd, "", mode, AT_EMPTY_PATH));
+  // The only one for descriptors of either kind. Kernels before 6.6, and filters that do not know
+  // the call, leave fchmod(), and the way through /proc for the O_PATH kind.
+  int result = static_cast<int>(syscall(kFchmodat2, fd, "", mode, AT_EMPTY_PATH));
   if (result == 0 || (errno != ENOSYS && errno != EPERM)) return result;
+  result = fchmod(fd, mode);
+  if (result == 0 || errno != EBADF) return result;
   return chmod(own_fd_path(fd).c_str(), mode);
 }
 

@@ -241,7 +241,8 @@ FileIdentity::FileIdentity(package_user user) : before_(identity()), granted_(tr
     known_place.forget();
     known_home.forget();
   }
-  if (geteuid() == 0) granted_ = become(user);
+  // Only root can become another; who is it already needs not ask.
+  if (!same_user(before_, user) && geteuid() == 0) granted_ = become(user);
 }
 
 FileIdentity::~FileIdentity() {

@@ -63,9 +63,23 @@ bool is_roots_own(const struct stat &folder) {
   return folder.st_uid == 0 && (folder.st_mode & (S_IRWXG | S_IRWXO)) == 0;
 }
 
+/**
+ * Hold what @p entry names. An open file is labelled at once, what is only held by a walk along its
+ * name in /proc; but no more than a file is opened for that.
+ */
+int hold_entry(int dir, const dirent &entry) {
+  if (entry.d_type == DT_REG) {
+    constexpr int kFlags = O_RDONLY | O_NONBLOCK | O_NOCTTY | O_NOFOLLOW | O_NOATIME | O_CLOEXEC;
+    const int fd = openat(dir, entry.d_name, kFlags);
+    if (fd >= 0) return fd;
+  }
+  return openat(dir, entry.d_name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+}
+
 /** One entry of the folder that is open as @p dir: what was looked at is what is labelled. */
-bool relabel_entry(int dir, const struct stat &folder, const char *name, const std::string &label) {
-  const int fd = openat(dir, name, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+bool relabel_entry(int dir, const struct stat &folder, const dirent &entry,
+                   const std::string &label) {
+  const int fd = hold_entry(dir, entry);
   if (fd < 0) return errno == ENOENT;
   struct stat status {};
   bool done = fstat(fd, &status) == 0;
@@ -94,7 +108,7 @@ bool relabel_folder(int fd, const struct stat &folder, const std::string &label)
   while (const dirent *entry = readdir(dir)) {
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
-    done = relabel_entry(opened, folder, entry->d_name, label) && done;
+    done = relabel_entry(opened, folder, *entry, label) && done;
   }
   closedir(dir);
   return done;

@@ -69,8 +69,10 @@ int read_attribute(const char *path, Links links, const char *name, std::string 
 }
 
 int write_attribute(const char *path, Links links, const char *name, const std::string &label) {
-  return links == Links::kFollow ? setxattr(path, name, label.data(), label.size(), 0)
-                                 : lsetxattr(path, name, label.data(), label.size(), 0);
+  if (links == Links::kKeep) return lsetxattr(path, name, label.data(), label.size(), 0);
+  return static_cast<int>(by_descriptor(
+      path, [&](int fd) { return fsetxattr(fd, name, label.data(), label.size(), 0); },
+      [&] { return setxattr(path, name, label.data(), label.size(), 0); }));
 }
 
 /** Which of the two an object may have. */
