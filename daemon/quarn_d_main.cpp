@@ -11,6 +11,7 @@
 #include <string>
 
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_end.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
@@ -158,7 +159,6 @@ void export_objects(GDBusConnection *connection) {
 
 /** Lower floors learn how to ask the upper ones. */
 void wire_floors() {
-  set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(work_pending);
   set_restore_disable(disable_restore);
   set_boot_recovery(recover_device);

@@ -1,4 +1,5 @@
 #include "quarn_d_progress.h"
+#include "quarn_d_conditions/setting_observer.h"
 
 #include <glib.h>
 #include <json-c/json.h>
@@ -6,7 +7,6 @@
 #include <deque>
 #include <mutex>
 
-#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"

@@ -21,6 +21,7 @@
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
 #include "quarn_d_backup/single_upload.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/device_info.h"
@@ -190,7 +191,7 @@ int request_upload(std::unique_ptr<app_data_upload> &record) {
  */
 bool begin_upload_again(std::unique_ptr<app_data_upload> &record) {
   const backup_context *ctx = record->ctx.get();
-  if (!ctx->single_package || ctx->abandoned || backup_wifi_connected() == 0) return false;
+  if (!ctx->single_package || ctx->abandoned || wifi_connected() == 0) return false;
   if (++record->times_aborted > kMaxTimesAborted) return false;
   const std::string pkg_id = record->pkg_id;
   if (request_upload(record) != BACKUP_TRANS_ERROR_NONE) return false;

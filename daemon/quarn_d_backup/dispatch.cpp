@@ -15,6 +15,7 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/boot_cleanup.h"
 #include "quarn_d_utils/cloud_session.h"
@@ -63,8 +64,6 @@ std::atomic<int> outstanding_requests{0};
 
 /** An automatic backup is queued or runs; with the list's mutex. */
 bool automatic_outstanding = false;
-
-std::atomic<int (*)()> wifi_probe{nullptr};
 
 std::atomic<backup_end_observer> end_observer{nullptr};
 
@@ -124,8 +123,8 @@ void answer_cancelled_clients() {
 }
 
 bool can_reach_cloud() {
-  if (backup_wifi_connected() != 0 && cloud_initialized()) return true;
-  LOGE("cloud couldn't be initialized.(wifi:%d)", backup_wifi_connected());
+  if (wifi_connected() != 0 && cloud_initialized()) return true;
+  LOGE("cloud couldn't be initialized.(wifi:%d)", wifi_connected());
   return false;
 }
 
@@ -272,10 +271,3 @@ bool settle_running_backup() {
 }
 
 bool backup_request_outstanding() { return outstanding_requests != 0; }
-
-void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
-
-int backup_wifi_connected() {
-  const auto probe = wifi_probe.load();
-  return probe != nullptr ? probe() : 0;
-}

@@ -8,6 +8,7 @@
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_backup/run_private.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
@@ -52,7 +53,7 @@ bool stop_when_cancelled(backup_context *ctx) {
 enum class Transfers { kLeave, kCancel };
 
 bool stop_without_wifi(backup_context *ctx, Transfers transfers) {
-  if (backup_wifi_connected() != 0) return false;
+  if (wifi_connected() != 0) return false;
   LOGE("WIFI disconnected");
   note_cause(ctx, request_cause::wifi);
   if (transfers == Transfers::kCancel) backup_trans_cancel_request(cloud_handler());
@@ -220,7 +221,7 @@ void clean_up_cloud(backup_context *ctx) {
 /** The stages in order, to the first that fails. */
 void run_stages(backup_context *ctx) {
   if (backup_context_init(ctx) != QUARN_OK) return;
-  if (backup_wifi_connected() == 0) {
+  if (wifi_connected() == 0) {
     LOGE("WIFI disconnected");
     note_cause(ctx, request_cause::wifi);
     ctx->result = QUARN_TRANSFER_FAILED;

@@ -198,10 +198,6 @@ void request_backup(void *client);
 void cancel_backup(void *client);
 /** True from request_backup() until the worker has finished everything queued. */
 bool backup_request_outstanding();
-/** How the engine asks for Wi-Fi; set once at start. */
-void set_backup_wifi_probe(int (*probe)());
-/** Whether the device is on Wi-Fi, by the probe. */
-int backup_wifi_connected();
 
 /* ---- context.cpp ------------------------------------------------------------ */
 

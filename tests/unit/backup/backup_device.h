@@ -135,6 +135,8 @@ client_cb_data *new_client(std::uint32_t req_id, const std::string &sender = ":1
 
 /** Whether the device is on Wi-Fi. */
 extern std::atomic<int> fake_wifi;
+/** Asked in its place until the next test; on the asking thread. */
+void set_wifi_hook(int (*hook)());
 
 /** Fixture: packages, cloud, Wi-Fi, no log and no clients. */
 class BackupDevice : public ::testing::Test {

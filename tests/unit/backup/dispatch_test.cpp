@@ -142,11 +142,6 @@ TEST_F(Dispatch, TheEndOfARequestIsToldWhenNothingOfItIsLeft) {
   EXPECT_EQ(sent_statuses().size(), 2U);
 }
 
-TEST_F(Dispatch, UnknownWifiIsNone) {
-  set_backup_wifi_probe(nullptr);
-  EXPECT_EQ(backup_wifi_connected(), 0);
-}
-
 TEST_F(Dispatch, TwoManualRequestsRunOneAfterTheOther) {
   install("org.a");
   run_one(1);
@@ -288,7 +283,7 @@ TEST_F(Dispatch, CancelAndStartAtAnyMomentLeaveOneOfEach) {
 TEST_F(Dispatch, ACancelledRequestThatFindsNoWifiIsReportedAsCancelled) {
   static std::atomic<bool> cancelled;
   cancelled = false;
-  set_backup_wifi_probe([] {
+  set_wifi_hook([] {
     if (!cancelled.exchange(true)) cancel();
     return 0;
   });

@@ -13,6 +13,7 @@
 
 #include "log_capture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_end.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
@@ -52,7 +53,6 @@ bool waiting_stopped = false;
 bool answer_to_given_up_name = false;
 void (*on_turn)() = nullptr;
 std::vector<int> woken;
-int (*wifi_probe)() = nullptr;
 bool (*pending_probe)() = nullptr;
 int (*restore_disable)() = nullptr;
 void (*boot_recovery)() = nullptr;
@@ -176,12 +176,10 @@ int start_wifi_monitor() {
   step("start_wifi_monitor");
   return 1;
 }
-int wifi_connected() { return 1; }
 void monitor_auto_backup_status() { step("monitor_auto_backup_status"); }
 void init_backup_req_dispatch_thread() { step("init_backup_req_dispatch_thread"); }
 bool backups_outstanding = true;
 bool backup_request_outstanding() { return backups_outstanding; }
-void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
@@ -223,7 +221,6 @@ class Main : public ::testing::Test {
     calls_deferred = false;
     backups_outstanding = true;
     manual_backup_canceled = false;
-    wifi_probe = nullptr;
     pending_probe = nullptr;
     restore_disable = nullptr;
     boot_recovery = nullptr;
@@ -498,12 +495,10 @@ TEST_F(Main, OnlyTheRecoveryIsMadeWhenItIsAskedFor) {
 
 TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {
   init_quarn();
-  ASSERT_NE(wifi_probe, nullptr);
   ASSERT_NE(pending_probe, nullptr);
   ASSERT_NE(restore_disable, nullptr);
   ASSERT_NE(boot_recovery, nullptr);
   ASSERT_NE(bus_acquired_hook, nullptr);
-  EXPECT_EQ(wifi_probe(), 1);
   EXPECT_TRUE(pending_probe());
   restart();
   EXPECT_EQ(restore_disable(), 0);
