@@ -19,6 +19,7 @@
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/boot_cleanup.h"
 #include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -68,6 +69,7 @@ bool automatic_outstanding = false;
 std::atomic<backup_end_observer> end_observer{nullptr};
 
 void end_request() {
+  PendingWork::end();
   --outstanding_requests;
   if (const backup_end_observer observer = end_observer) observer();
 }
@@ -223,6 +225,7 @@ void request_backup(void *client) {
       return;
     }
     ++outstanding_requests;
+    PendingWork::begin();
     backup_req_list.push_back({client, quarn_dbus_time_waited()});
     ++waiting_entries;
   }

@@ -425,8 +425,10 @@ TEST_F(Dispatch, RequestIsOutstandingFromItsQueuingToItsEnd) {
     EXPECT_TRUE(g_is_backing_up);
   });
   EXPECT_FALSE(backup_request_outstanding());
+  EXPECT_TRUE(is_idle_status());
   request_backup(new_client(1));
   EXPECT_TRUE(backup_request_outstanding());
+  EXPECT_FALSE(is_idle_status());
   finish();
   EXPECT_FALSE(g_is_backing_up);
   EXPECT_TRUE(is_idle_status());
