@@ -12,7 +12,7 @@
 
 #include <string>
 
-#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_backup/backup_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 
 /** The JSON text of a step. */

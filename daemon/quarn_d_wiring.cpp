@@ -1,5 +1,6 @@
 #include "quarn_d_wiring.h"
 
+#include "quarn_d_backup/backup_progress.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_conditions/setting_observer.h"
 #include "quarn_d_handler/quarn_d_handler.h"

@@ -10,7 +10,7 @@
 #include <utility>
 
 #include "files/safe_path.h"
-#include "quarn_d_backup/run_notes.h"
+#include "quarn_d_backup/kept_packages.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/working_files.h"

@@ -21,6 +21,7 @@
 #include "mock_platform.h"
 #include "mock_transport.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/backup_progress.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_dbus_client.h"
 

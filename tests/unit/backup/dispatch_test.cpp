@@ -10,8 +10,11 @@
 
 #include "backup_device.h"
 #include "backup_transport.h"
+#include "quarn_d_backup/archive_upload.h"
+#include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/cancel.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/power.h"
