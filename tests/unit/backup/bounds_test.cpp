@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <string>
+#include <thread>
 
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/single_folders.h"
@@ -53,7 +54,8 @@ TEST_F(Runs, RunsThatAreNotAnsweredLeaveOneRequestBehind) {
   set_poll_hook(nullptr);
   set_wifi_hook(flaky_wifi);
   for (int run = 0; run < 4; ++run) {
-    automatic();
+    std::thread worker([this] { automatic(); });
+    worker.join();
     EXPECT_EQ(cloud_.waiting(), 1U) << "later runs wait for it, and keep nothing";
   }
   set_wifi_hook(nullptr);
