@@ -16,6 +16,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
 
 namespace {
@@ -28,12 +29,19 @@ constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
 constexpr std::size_t kLookUpRoom = 4096;
 constexpr int kGroupsAtFirst = 32;
 
+/** A call that waits to know who makes it. */
+struct waiting_call {
+  explicit waiting_call(caller_work waiting) : work(std::move(waiting)) {}
+  caller_work work;
+  PendingWork pending;
+};
+
 /** What is known of one connection, and what waits to know it. */
 struct connection_entry {
   quarn_caller caller;
   bool asked = false;
   bool told = false;
-  std::deque<caller_work> waiting;
+  std::deque<waiting_call> waiting;
   GDBusConnection *connection = nullptr;
   guint subscription = 0;
   std::uint64_t age = 0;
@@ -143,7 +151,7 @@ EntryPtr entry_of(GDBusConnection *connection, const std::string &sender) {
 
 void drain(const EntryPtr &entry) {
   while (!entry->waiting.empty()) {
-    const caller_work work = std::move(entry->waiting.front());
+    const caller_work work = std::move(entry->waiting.front().work);
     entry->waiting.pop_front();
     work(entry->caller);
   }
@@ -245,7 +253,7 @@ gid_t look_up_client_group() {
 
 void with_caller(GDBusConnection *connection, const std::string &sender, caller_work work) {
   const EntryPtr entry = entry_of(connection, sender);
-  entry->waiting.push_back(std::move(work));
+  entry->waiting.emplace_back(std::move(work));
   if (entry->told) {
     drain(entry);
   } else if (!entry->asked) {

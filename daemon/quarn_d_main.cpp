@@ -11,24 +11,23 @@
 #include <string>
 
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_end.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
 #include "quarn_d_packages.h"
-#include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_turn.h"
-#include "quarn_d_utils/boot_cleanup.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/kernel_settings.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/power.h"
+#include "quarn_d_wiring.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
@@ -137,33 +136,11 @@ void install_signal_handlers() {
 
 bool request_pending() { return backup_request_outstanding() || quarnd_calls_deferred(); }
 
-/** Whether a call or a request stands, or its client's answer is waited for. */
-bool work_pending() {
-  return request_pending() || quarnd_calls_unjudged() || quarn_dbus_answers_awaited();
-}
-
 /** An idle process keeps its turn for as long as it has the bus name. */
 gboolean ask_for_turn(gpointer) {
   if (is_quarn_turn()) return G_SOURCE_REMOVE;
   if (request_pending()) tell_quarn_predecessor(kLeaveLine, kWithdrawSignal);
   return G_SOURCE_CONTINUE;
-}
-
-int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
-
-void export_objects(GDBusConnection *connection) {
-  quarnd_status_export(connection);
-  quarnd_packages_export(connection);
-}
-
-/** Lower floors learn how to ask the upper ones. */
-void wire_floors() {
-  set_backup_wifi_probe(wifi_connected);
-  set_pending_request_probe(work_pending);
-  set_restore_disable(disable_restore);
-  set_boot_recovery(recover_device);
-  set_bus_acquired_hook(export_objects);
-  quarnd_progress_init();
 }
 
 /** Whoever still waits hears that it is over: only a signal ends what is not idle. */

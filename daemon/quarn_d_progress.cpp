@@ -6,7 +6,6 @@
 #include <deque>
 #include <mutex>
 
-#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
@@ -240,12 +239,4 @@ void note_restore_progress(const restore_progress &progress) {
   leave({restore_progress_text(progress), std::string("restore ") + progress.package,
          progress.stage == restore_stage::finished});
   if (progress.stage == restore_stage::finished) quarnd_status_refresh();
-}
-
-void quarnd_progress_init() {
-  set_backup_progress_sink(note_backup_progress);
-  set_backup_end_observer(quarnd_status_refresh);
-  set_restore_progress_sink(note_restore_progress);
-  set_restore_mode_observer(quarnd_status_refresh);
-  set_setting_observer(quarnd_status_refresh);
 }

@@ -12,11 +12,8 @@
 
 #include <string>
 
-#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_backup/backup_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
-
-/** Follow both engines from now on. Main thread, once. */
-void quarnd_progress_init();
 
 /** The JSON text of a step. */
 std::string backup_progress_text(const backup_progress &progress);

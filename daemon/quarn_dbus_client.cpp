@@ -5,6 +5,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <thread>
 #include <utility>
@@ -14,6 +15,7 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
 
 GDBusConnection *quarn_dbus_connection = nullptr;
@@ -60,8 +62,6 @@ std::thread::id main_thread;
 /** By client, the fibers of the main thread that wait for its answer; of all in the other. */
 std::map<std::string, std::size_t> &answers_of_client = *new std::map<std::string, std::size_t>;
 std::size_t answers_of_all = 0;
-/** Of these, what a request's own fiber waits for. */
-std::size_t requests_awaiting = 0;
 
 using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
 using ContextPtr = Handle<GMainContext, &g_main_context_unref>;
@@ -171,17 +171,15 @@ void wait_in_place(SentCall *call, GMainContext *context, const std::string &sen
 /** Counts a fiber that waits for a client's answer. Main thread. */
 class AwaitedAnswer {
  public:
-  AwaitedAnswer(std::string client, bool of_request)
-      : client_(std::move(client)), of_request_(of_request) {
+  AwaitedAnswer(std::string client, bool of_request) : client_(std::move(client)) {
     ++answers_of_client[client_];
     ++answers_of_all;
-    if (of_request_) ++requests_awaiting;
+    if (of_request) pending_.emplace();
   }
   ~AwaitedAnswer() {
     const auto entry = answers_of_client.find(client_);
     if (--entry->second == 0) answers_of_client.erase(entry);
     --answers_of_all;
-    if (of_request_) --requests_awaiting;
   }
   AwaitedAnswer(const AwaitedAnswer &) = delete;
   AwaitedAnswer &operator=(const AwaitedAnswer &) = delete;
@@ -194,7 +192,7 @@ class AwaitedAnswer {
 
  private:
   const std::string client_;
-  const bool of_request_;
+  std::optional<PendingWork> pending_;  // where a request's own fiber waits
 };
 
 MessagePtr make_message(const client_cb_data &client, const char *method, GVariant *arguments) {
@@ -398,8 +396,6 @@ void quarn_dbus_stop_waiting() {
 }
 
 void quarn_dbus_note_main_thread() { main_thread = std::this_thread::get_id(); }
-
-bool quarn_dbus_answers_awaited() { return requests_awaiting != 0; }
 
 void quarn_dbus_set_patience(callback_patience exhausted) { patience = exhausted; }
 

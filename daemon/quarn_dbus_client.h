@@ -55,8 +55,6 @@ bool quarn_dbus_waiting_stopped();
 
 /** The calling thread is the one whose loop must never stand still. */
 void quarn_dbus_note_main_thread();
-/** True while requests wait on the main thread for their clients' answers to callbacks. */
-bool quarn_dbus_answers_awaited();
 /** Answers that are awaited on the main thread at the most; beyond it a callback is only sent. */
 inline constexpr std::size_t kMostAnswersAwaited = 512;
 /** Of these, one client's. */

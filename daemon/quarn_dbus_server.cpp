@@ -23,6 +23,7 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
@@ -435,6 +436,7 @@ bool wait_for_turn(MethodCall &call) {
   if (refuse_beyond_places(call)) return false;
   const auto counted = count_waiting(call.sender(), parties_of(call));
   const LoopPtr loop(new_wait_loop());
+  const PendingWork pending;
   waits_for_turn.push_back(loop.get());
   run_nested_loop(loop.get());
   waits_for_turn.erase(std::find(waits_for_turn.begin(), waits_for_turn.end(), loop.get()));
@@ -510,6 +512,7 @@ bool wants_no_reply(GDBusMessage *call) {
 
 struct Forwarded {
   MessagePtr call;
+  PendingWork pending = {};
 };
 
 void on_library_answer(GObject *bus, GAsyncResult *result, gpointer data) {

@@ -54,9 +54,9 @@ void stop_awaiting_archive(const std::string &package);
 void note_awaited_package_removed(const std::string &package);
 
 /** What is claimed of a package of the device @p serial. */
-archive_claim claim_on_archive(const std::string &serial, const std::string &package);
+[[nodiscard]] archive_claim claim_on_archive(const std::string &serial, const std::string &package);
 /** Every package of that device that something is claimed of. */
-std::vector<std::string> claimed_packages(const std::string &serial);
+[[nodiscard]] std::vector<std::string> claimed_packages(const std::string &serial);
 
 /** Ids of the packages that are installed, preloaded ones too. @return false when not all are known
  */
@@ -67,6 +67,6 @@ bool list_installed_packages(std::set<std::string> *installed);
  * are installed and not preloaded, and those that a restore is to have.
  * @return false when they are not known
  */
-bool packages_kept_by_backup(std::set<std::string> *kept);
+[[nodiscard]] bool packages_kept_by_backup(std::set<std::string> *kept);
 
 #endif

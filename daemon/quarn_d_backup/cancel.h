@@ -18,7 +18,7 @@
 std::uint32_t cancel_backups_of(const std::string &sender);
 
 /** The manual backup that the worker runs was cancelled. Any thread. */
-bool running_backup_cancelled();
+[[nodiscard]] bool running_backup_cancelled();
 
 /**
  * The worker's run has its outcome: no later cancel meets it.

@@ -1,119 +1,22 @@
-#include <fcntl.h>
 #include <glib.h>
-#include <sys/stat.h>
-#include <sys/types.h>
-#include <unistd.h>
 
-#include <algorithm>
 #include <atomic>
-#include <chrono>
-#include <condition_variable>
 #include <cstdint>
-#include <mutex>
-#include <string>
-#include <vector>
+#include <memory>
 
 #include "files/package_files.h"
-#include "files/safe_path.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/run_notes.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/device_info.h"
-#include "quarn_d_utils/directory.h"
-#include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/own_place.h"
-#include "quarn_d_utils/package_lock.h"
-#include "quarn_d_utils/tree_place.h"
-#include "quarn_d_utils/working_files.h"
+#include "quarn_dbus_client.h"
 #include "quarn_log.h"
 
 namespace {
 
-constexpr char kStagingDirectory[] = "/tmp/quarn";
-
-/** How long a run that waits for a lease does not look at cancel and Wi-Fi. */
-constexpr std::chrono::milliseconds kLookInterval{100};
-
 std::atomic<std::uint32_t> last_run_id{0};
-
-/** A request on the main thread that waits. */
-struct loop_waiter {
-  GMainLoop *loop;
-  bool woken;
-};
-
-/** Who holds which staged file. */
-struct lease_table {
-  std::mutex mutex;
-  std::condition_variable released;
-  std::unordered_map<std::string, backup_context *> holders;
-  std::vector<loop_waiter *> waiters;
-};
-
-lease_table &leases() {
-  // never destroyed: the worker and late callbacks may outlive main()
-  static auto *table = new lease_table;
-  return *table;
-}
-
-bool on_main_thread() { return getpid() == gettid(); }
-
-void wake_waiters(lease_table &table) {
-  table.released.notify_all();
-  for (loop_waiter *waiter : table.waiters) {
-    waiter->woken = true;
-    g_main_loop_quit(waiter->loop);
-  }
-}
-
-void release_all_staged_archives(backup_context *ctx) {
-  lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
-  bool any = false;
-  for (auto it = table.holders.begin(); it != table.holders.end();) {
-    if (it->second == ctx) {
-      it = table.holders.erase(it);
-      any = true;
-    } else {
-      ++it;
-    }
-  }
-  if (any) wake_waiters(table);
-}
-
-/** @return false when nobody wants the lease any more */
-bool wait_in_loop(lease_table &table, std::unique_lock<std::mutex> &lock) {
-  const GMainLoopPtr loop(new_wait_loop());
-  loop_waiter waiter{loop.get(), false};
-  table.waiters.push_back(&waiter);
-  lock.unlock();
-  run_nested_loop(loop.get());
-  lock.lock();
-  table.waiters.erase(std::find(table.waiters.begin(), table.waiters.end(), &waiter));
-  return waiter.woken;
-}
-
-/** The same for the worker's run. */
-bool wait_in_run(backup_context *ctx, lease_table &table, std::unique_lock<std::mutex> &lock) {
-  table.released.wait_for(lock, kLookInterval);
-  lock.unlock();
-  const bool stop = backup_must_stop(ctx);
-  lock.lock();
-  return !stop;
-}
-
-void on_packing_ended() {
-  lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
-  wake_waiters(table);
-}
-
-/** One package is packed at a time, and an export may take as long as it has data. */
-bool must_wait_for_packing(const std::string &pkg_id) {
-  return pkg_id != kStagedListLease && any_package_is_packed();
-}
 
 }  // namespace
 
@@ -124,6 +27,8 @@ backup_context::~backup_context() {
   GMainLoop *loop = wait_loop.exchange(nullptr);
   if (loop != nullptr) g_main_loop_unref(loop);
 }
+
+void backup_context_unref::operator()(backup_context *ctx) const { ctx->unref(); }
 
 run_notes &notes_of(const backup_context *ctx) { return *ctx->notes; }
 
@@ -152,83 +57,7 @@ int backup_context_init(backup_context *ctx) {
   return QUARN_OK;
 }
 
-bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id) {
-  lease_table &table = leases();
-  set_packing_ended_hook(on_packing_ended);
-  std::unique_lock<std::mutex> lock(table.mutex);
-  for (;;) {
-    const bool held = table.holders.emplace(pkg_id, ctx).first->second == ctx;
-    if (held && !must_wait_for_packing(pkg_id)) return true;
-    const bool goes_on =
-        on_main_thread() ? wait_in_loop(table, lock) : wait_in_run(ctx, table, lock);
-    if (goes_on) continue;
-    LOGE("gave up waiting for the archive of (%s)", pkg_id.c_str());
-    if (held) {
-      table.holders.erase(pkg_id);
-      wake_waiters(table);
-    }
-    return false;
-  }
-}
-
-void release_staged_archive(backup_context *ctx, const std::string &pkg_id) {
-  lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
-  const auto holder = table.holders.find(pkg_id);
-  if (holder == table.holders.end() || holder->second != ctx) return;
-  table.holders.erase(holder);
-  wake_waiters(table);
-}
-
-bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id) {
-  lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
-  const auto holder = table.holders.find(pkg_id);
-  return holder != table.holders.end() && holder->second == ctx;
-}
-
-std::string staged_archive_path(const std::string &root_path, const std::string &pkg_id) {
-  const WorkingFiles files(pkg_id, root_path);
-  struct stat status = {};
-  if (safe_lstat(files.upload_aside().c_str(), &status) == 0 && is_own_file(status)) {
-    return files.upload_aside();
-  }
-  const bool taken = safe_lstat(files.upload().c_str(), &status) == 0 && !is_own_file(status);
-  return taken ? files.upload_aside() : files.upload();
-}
-
-void delete_staged_file(const std::string &path) {
-  static std::mutex deletion_mutex;
-  const std::lock_guard<std::mutex> lock(deletion_mutex);
-  struct stat status = {};
-  if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
-  if (file_exist(path.c_str())) delete_file(path.c_str());
-}
-
-std::uint64_t staged_file_size(const std::string &path) {
-  struct stat status = {};
-  return safe_lstat(path.c_str(), &status) == 0 ? static_cast<std::uint64_t>(status.st_size) : 0;
-}
-
-bool prepare_staging_directory() {
-  if (make_own_directory(kStagingDirectory)) return true;
-  LOGE("cannot use staging directory %s", kStagingDirectory);
-  return false;
-}
-
-void sweep_staging_directory(const char *keep) {
-  struct stat status = {};
-  if (safe_lstat(kStagingDirectory, &status) != 0 || !is_own_file(status)) return;
-  const UniqueFd dir = safe_open(kStagingDirectory, O_RDONLY | O_DIRECTORY);
-  std::vector<TreeEntry> entries;
-  if (!dir || !list_tree_entries(dir.get(), &entries)) return;
-  for (const TreeEntry &entry : entries) {
-    const std::string path = std::string(kStagingDirectory) + "/" + entry.name;
-    if (path == keep) continue;
-    if (is_directory(path.c_str())) {
-      clear_directory(path.c_str(), true);
-    } else {
-      unlinkat(dir.get(), entry.name.c_str(), 0);
-    }
-  }
+void set_result_once(backup_context *ctx, std::int32_t code) {
+  std::int32_t expected = QUARN_OK;
+  ctx->result.compare_exchange_strong(expected, code);
 }

@@ -6,7 +6,9 @@
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
+#include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -14,10 +16,13 @@
 #include "backup_transport.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/cancel.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/pipeline.h"
+#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/boot_cleanup.h"
 #include "quarn_d_utils/cloud_session.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
@@ -34,8 +39,11 @@ constexpr int kTurnCheckMs = 100;
 // waits on and reads is never destroyed.
 std::mutex &backup_req_list_mutex = *new std::mutex;
 
+/** The client of a manual backup, which its final status deletes; null: an automatic one. */
+using ClientPtr = std::unique_ptr<client_cb_data>;
+
 struct queued_request {
-  void *client;               /**< null: an automatic backup */
+  ClientPtr client;
   std::int64_t waited_before; /**< what the worker had waited for clients when it was made */
 };
 std::vector<queued_request> &backup_req_list = *new std::vector<queued_request>;
@@ -64,26 +72,30 @@ std::atomic<int> outstanding_requests{0};
 /** An automatic backup is queued or runs; with the list's mutex. */
 bool automatic_outstanding = false;
 
-std::atomic<int (*)()> wifi_probe{nullptr};
-
 std::atomic<backup_end_observer> end_observer{nullptr};
 
 void end_request() {
+  PendingWork::end();
   --outstanding_requests;
   if (const backup_end_observer observer = end_observer) observer();
 }
 
-enum class Taken { kNothing, kRequest };
-
-Taken take_request(void **client) {
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
-  if (backup_req_list.empty()) return Taken::kNothing;
-  *client = backup_req_list.front().client;
-  backup_req_list.erase(backup_req_list.begin());
+/** Under the list's mutex: the client of the oldest request of @p list, none when it is empty. */
+std::optional<ClientPtr> take_oldest(std::vector<queued_request> *list) {
+  if (list->empty()) return std::nullopt;
+  ClientPtr client = std::move(list->front().client);
+  list->erase(list->begin());
   --waiting_entries;
-  const auto *record = static_cast<const client_cb_data *>(*client);
+  return client;
+}
+
+std::optional<ClientPtr> take_request() {
+  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  std::optional<ClientPtr> taken = take_oldest(&backup_req_list);
+  if (!taken) return taken;
+  const client_cb_data *const record = taken->get();
   running = {record != nullptr, false, record != nullptr ? record->sender : ""};
-  return Taken::kRequest;
+  return taken;
 }
 
 void forget_automatic() {
@@ -95,8 +107,7 @@ void forget_automatic() {
 bool others_held_up(const std::string &sender) {
   const std::int64_t waited = quarn_dbus_time_waited();
   const auto held_up = [&](const queued_request &request) {
-    const auto *record = static_cast<const client_cb_data *>(request.client);
-    const bool others = record == nullptr || record->sender != sender;
+    const bool others = request.client == nullptr || request.client->sender != sender;
     return others && waited - request.waited_before >= kLongestHoldUp;
   };
   const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
@@ -104,32 +115,27 @@ bool others_held_up(const std::string &sender) {
          std::any_of(cancelled_clients.begin(), cancelled_clients.end(), held_up);
 }
 
-bool take_cancelled_client(void **client) {
+std::optional<ClientPtr> take_cancelled_client() {
   const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
-  if (cancelled_clients.empty()) return false;
-  *client = cancelled_clients.front().client;
-  cancelled_clients.erase(cancelled_clients.begin());
-  --waiting_entries;
-  return true;
+  return take_oldest(&cancelled_clients);
 }
 
 /** Clients whose reservation was cancelled learn it here, not on the main thread. */
 void answer_cancelled_clients() {
-  void *client = nullptr;
   // One by one: whoever is still to be told counts among those that are held up.
-  while (take_cancelled_client(&client)) {
-    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
+  while (std::optional<ClientPtr> client = take_cancelled_client()) {
+    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client->release());
     end_request();
   }
 }
 
 bool can_reach_cloud() {
-  if (backup_wifi_connected() != 0 && cloud_initialized()) return true;
-  LOGE("cloud couldn't be initialized.(wifi:%d)", backup_wifi_connected());
+  if (wifi_connected() != 0 && cloud_initialized()) return true;
+  LOGE("cloud couldn't be initialized.(wifi:%d)", wifi_connected());
   return false;
 }
 
-void run_request(void *client) {
+void run_request(ClientPtr client) {
   if (client == nullptr) {
     if (!can_reach_cloud()) return;
     LOGI("now auto backup start!");
@@ -140,11 +146,11 @@ void run_request(void *client) {
     const bool cancelled = settle_running_backup();
     quarn_dbus_manual_backup_status(cancelled ? QUARN_CANCELLED : QUARN_NO_SESSION,
                                     cancelled ? QUARN_BACKUP_CANCELLED : QUARN_BACKUP_FAILED,
-                                    client);
+                                    client.release());
     return;
   }
   LOGI("now manual backup start!");
-  do_backup(true, client);
+  do_backup(true, std::move(client));
 }
 
 void *backup_req_dispatch_thread(void *) {
@@ -154,13 +160,13 @@ void *backup_req_dispatch_thread(void *) {
     while (!wait_for_quarn_turn(kTurnCheckMs)) answer_cancelled_clients();
     boot_cleanup_backup_items();
     answer_cancelled_clients();
-    void *client = nullptr;
-    if (take_request(&client) == Taken::kRequest) {
+    if (std::optional<ClientPtr> client = take_request()) {
+      const bool is_automatic = *client == nullptr;
       request_power_lock(true);
       g_is_backing_up = true;
-      run_request(client);
+      run_request(*std::move(client));
       settle_running_backup();
-      if (client == nullptr) forget_automatic();
+      if (is_automatic) forget_automatic();
       g_is_backing_up = false;
       request_power_lock(false);
       end_request();
@@ -176,13 +182,12 @@ template <typename Meant>
 std::uint32_t drop_reservations(Meant meant) {
   const auto dropped = std::stable_partition(
       backup_req_list.begin(), backup_req_list.end(), [&meant](const queued_request &request) {
-        return request.client == nullptr ||
-               !meant(*static_cast<const client_cb_data *>(request.client));
+        return request.client == nullptr || !meant(*request.client);
       });
   std::uint32_t count = 0;
   for (auto request = dropped; request != backup_req_list.end(); ++request, ++count) {
     LOGI("reservation for manual backup is canceled");
-    cancelled_clients.push_back(*request);
+    cancelled_clients.push_back(std::move(*request));
   }
   backup_req_list.erase(dropped, backup_req_list.end());
   return count;
@@ -217,14 +222,16 @@ void init_backup_req_dispatch_thread() {
 }
 
 void request_backup(void *client) {
+  ClientPtr record(static_cast<client_cb_data *>(client));
   {
     const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
-    if (client == nullptr && std::exchange(automatic_outstanding, true)) {
+    if (record == nullptr && std::exchange(automatic_outstanding, true)) {
       LOGI("auto backup is requested already");
       return;
     }
     ++outstanding_requests;
-    backup_req_list.push_back({client, quarn_dbus_time_waited()});
+    PendingWork::begin();
+    backup_req_list.push_back({std::move(record), quarn_dbus_time_waited()});
     ++waiting_entries;
   }
   wake_worker();
@@ -272,10 +279,3 @@ bool settle_running_backup() {
 }
 
 bool backup_request_outstanding() { return outstanding_requests != 0; }
-
-void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
-
-int backup_wifi_connected() {
-  const auto probe = wifi_probe.load();
-  return probe != nullptr ? probe() : 0;
-}

@@ -33,7 +33,7 @@ struct list_text {
  * entries afterwards. A text without entries, or with more than any device
  * could have written, is all frame.
  */
-list_text take_list_apart(std::string_view text, const char *key);
+[[nodiscard]] list_text take_list_apart(std::string_view text, const char *key);
 
 /**
  * Parse exactly one JSON value.
@@ -44,6 +44,6 @@ list_text take_list_apart(std::string_view text, const char *key);
 json_object *parse_whole_json(std::string_view text, int depth, bool *beyond);
 
 /** A value that is written as @p text, which must be JSON; null when memory is out. */
-json_object *new_json_from_text(std::string_view text);
+[[nodiscard]] json_object *new_json_from_text(std::string_view text);
 
 #endif

@@ -5,12 +5,13 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstddef>
 #include <map>
 #include <mutex>
 #include <utility>
 
 #include "files/safe_path.h"
-#include "quarn_d_backup/run_notes.h"
+#include "quarn_d_backup/kept_packages.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/working_files.h"
@@ -23,7 +24,12 @@ constexpr char kWhole = 'w';
 constexpr char kVersions = 'v';
 constexpr std::size_t kLongestNote = 256;
 
+/** So many may come to be owed before a look is taken at which of their packages are there. */
+constexpr std::size_t kOwedBetweenLooks = 256;
+
 std::mutex owed_mutex;
+/** How many the last look left; with the mutex. */
+std::size_t owed_when_looked = 0;
 /** By serial and package. */
 std::map<std::pair<std::string, std::string>, archive_claim> &owed() {
   static auto *all = new std::map<std::pair<std::string, std::string>, archive_claim>;
@@ -77,6 +83,13 @@ void owe(const std::string &serial, const std::string &package, const std::strin
 
 void note_owed_archive(const std::string &serial, const std::string &package,
                        const std::string &root) {
+  bool many = false;
+  {
+    const std::lock_guard<std::mutex> lock(owed_mutex);
+    many = owed().size() >= owed_when_looked + kOwedBetweenLooks;
+  }
+  // before, for a package that is being installed may not be known yet
+  if (many) forget_owed_of_removed_packages();
   const std::lock_guard<std::mutex> lock(owed_mutex);
   owe(serial, package, root, archive_claim::whole);
 }
@@ -136,4 +149,6 @@ void forget_owed_of_removed_packages() {
     const std::lock_guard<std::mutex> lock(owed_mutex);
     owed().erase(one);
   }
+  const std::lock_guard<std::mutex> lock(owed_mutex);
+  owed_when_looked = owed().size();
 }

@@ -30,12 +30,13 @@ void owe_other_versions(const std::string &serial, const std::string &package,
 void forget_owed_archive(const std::string &serial, const std::string &package,
                          const std::string &root);
 /** What is owed, after a look for an earlier daemon's note. */
-archive_claim look_for_owed_archive(const std::string &serial, const std::string &package,
-                                    const std::string &root);
+[[nodiscard]] archive_claim look_for_owed_archive(const std::string &serial,
+                                                  const std::string &package,
+                                                  const std::string &root);
 /** What is known to be owed. */
-archive_claim owed_claim(const std::string &serial, const std::string &package);
+[[nodiscard]] archive_claim owed_claim(const std::string &serial, const std::string &package);
 /** Every package of that device that something is known to be owed to. */
-std::vector<std::string> owed_packages(const std::string &serial);
+[[nodiscard]] std::vector<std::string> owed_packages(const std::string &serial);
 /** Nothing is owed to a package that was removed. */
 void forget_owed_of_removed_packages();
 

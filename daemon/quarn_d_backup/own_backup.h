@@ -21,7 +21,7 @@ inline constexpr char kOwnBackupKey[] = "db/private/quarn/own_backup";
  * True when the device knows of an earlier run of its own, or its user has
  * decided on the backup that it found: by a manual run, or by restore mode.
  */
-bool knows_own_backup(const std::string &serial);
+[[nodiscard]] bool knows_own_backup(const std::string &serial);
 /** Remember it. */
 void note_own_backup(const std::string &serial);
 /** A run keeps a backup that it found: the time of that run, too, tells of no decision. */

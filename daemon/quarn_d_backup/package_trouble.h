@@ -7,12 +7,12 @@
 
 #include <string>
 
-#include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_backup/backup_progress.h"
 
 /**
  * Looks through the package's data directories, as the calling thread may.
  * @return removed, too_deep or unreadable; none when every folder can be read
  */
-backup_outcome find_package_trouble(const std::string &root);
+[[nodiscard]] backup_outcome find_package_trouble(const std::string &root);
 
 #endif

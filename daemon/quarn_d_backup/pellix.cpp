@@ -1,3 +1,5 @@
+#include "quarn_d_backup/pellix.h"
+
 #include <fcntl.h>
 #include <glib.h>
 #include <json-c/json.h>
@@ -13,8 +15,13 @@
 #include "platform_package_manager.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/app_list.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/changes.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_backup/run_notes.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"

@@ -1,13 +1,26 @@
+#include "quarn_d_backup/pipeline.h"
+
 #include <cstdint>
 #include <ctime>
+#include <memory>
+#include <utility>
 
 #include "backup_transport.h"
 #include "files/package_files.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/app_list.h"
+#include "quarn_d_backup/archive_upload.h"
+#include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/cancel.h"
+#include "quarn_d_backup/changes.h"
+#include "quarn_d_backup/cloud_cleanup.h"
+#include "quarn_d_backup/list_transfer.h"
 #include "quarn_d_backup/own_backup.h"
+#include "quarn_d_backup/progress_report.h"
+#include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_backup/run_notes.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/staged_archive.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
@@ -52,7 +65,7 @@ bool stop_when_cancelled(backup_context *ctx) {
 enum class Transfers { kLeave, kCancel };
 
 bool stop_without_wifi(backup_context *ctx, Transfers transfers) {
-  if (backup_wifi_connected() != 0) return false;
+  if (wifi_connected() != 0) return false;
   LOGE("WIFI disconnected");
   note_cause(ctx, request_cause::wifi);
   if (transfers == Transfers::kCancel) backup_trans_cancel_request(cloud_handler());
@@ -220,7 +233,7 @@ void clean_up_cloud(backup_context *ctx) {
 /** The stages in order, to the first that fails. */
 void run_stages(backup_context *ctx) {
   if (backup_context_init(ctx) != QUARN_OK) return;
-  if (backup_wifi_connected() == 0) {
+  if (wifi_connected() == 0) {
     LOGE("WIFI disconnected");
     note_cause(ctx, request_cause::wifi);
     ctx->result = QUARN_TRANSFER_FAILED;
@@ -245,8 +258,8 @@ void drop_unsent_archives(backup_context *ctx) {
 void report_to_client(backup_context *ctx, int status) {
   // before the status: with that a client stops listening
   report_progress(ctx, backup_stage::finished);
-  quarn_dbus_manual_backup_status(ctx->result, status, ctx->client);
-  ctx->client = nullptr;  // the final status deletes the record
+  // the final status deletes the record
+  quarn_dbus_manual_backup_status(ctx->result, status, ctx->client.release());
 }
 
 void finish_manual_backup(backup_context *ctx) {
@@ -281,15 +294,15 @@ void finish_auto_backup(backup_context *ctx) {
 
 bool backup_must_stop(backup_context *ctx) { return must_stop(ctx, Transfers::kCancel); }
 
-void do_backup(bool is_manual, void *client) {
+void do_backup(bool is_manual, std::unique_ptr<client_cb_data> client) {
   const BackupContextPtr ctx(new backup_context);
   if (is_manual && (manual_backup_canceled || running_backup_cancelled())) {
     LOGE("manual backup was cancelled");
-    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client);
+    quarn_dbus_manual_backup_status(QUARN_CANCELLED, QUARN_BACKUP_CANCELLED, client.release());
     return;
   }
   ctx->is_manual = is_manual;
-  ctx->client = client;
+  ctx->client = std::move(client);
   run_stages(ctx.get());
   finish_backup(ctx.get());
 }

@@ -1,6 +1,10 @@
+#include <atomic>
+#include <cstdint>
+
 #include "quarn_common.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/progress_report.h"
 #include "quarn_d_backup/run_notes.h"
-#include "quarn_d_backup/run_private.h"
 
 namespace {
 

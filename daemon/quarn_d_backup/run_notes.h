@@ -11,8 +11,9 @@
 #include <set>
 #include <string>
 
-#include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_utils/request_cause.h"
+
+struct backup_context;
 
 /** Members that callbacks write are atomic; the others belong to the thread that runs the backup.
  */
@@ -43,29 +44,5 @@ struct run_notes {
 run_notes &notes_of(const backup_context *ctx);
 /** Note what the run fails of, if nothing was noted before. */
 void note_cause(backup_context *ctx, request_cause cause);
-
-/* ---- progress.cpp ---- */
-
-/** Tell the sink of something about the list that is to be seen to. */
-void report_notice(const backup_context *ctx, const char *notice, std::uint64_t size,
-                   std::uint64_t limit);
-
-/* ---- app_list.cpp ---- */
-
-/** The same id and version as one text, which no other pair has. */
-std::string listed_key(const std::string &pkg_id, const std::string &version);
-/**
- * Stage the list @p text once more, with the packages that a restore is to have
- * and that it does not name.
- * @return false when there is no such list
- */
-bool add_claimed_packages_to_list(backup_context *ctx, CString text);
-/** True when one of the cloud's packages is claimed and not in the list that was made. */
-bool claimed_package_is_missing(backup_context *ctx);
-
-/* ---- changes.cpp ---- */
-
-/** True unless the package manager says that there is no such package, or a preloaded one. */
-bool may_be_installed(const std::string &pkg_id);
 
 #endif

@@ -3,8 +3,7 @@
 
 #include "files/package_files.h"
 #include "quarn_d_backup/owed_archive.h"
-#include "quarn_d_backup/quarn_d_backup.h"
-#include "quarn_d_backup/single_upload.h"
+#include "quarn_d_backup/single_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/withdrawal.h"
@@ -120,8 +119,7 @@ int refuse_disabled(const std::string &pkg_id, bool enabled) {
 
 bool _check_backup_enabled(package_info_app_component_type_e /*type*/, const char *app_id,
                            void *data) {
-  auto *ctx = static_cast<backup_context *>(data);
-  if (!backup_enabled_app(app_id)) ctx->cur_backup_enabled = false;
+  if (!backup_enabled_app(app_id)) static_cast<single_backup *>(data)->disable();
   return true;
 }
 
@@ -134,17 +132,13 @@ bool _check_restore_enabled(package_info_app_component_type_e /*type*/, const ch
 
 bool _package_cb_for_backup(package_info_app_component_type_e /*type*/, const char *app_id,
                             void *data) {
-  auto *ctx = static_cast<backup_context *>(data);
-  if (!ctx->cur_backup_enabled || ctx->first_app_taken) return true;
-  ctx->first_app_taken = true;
-  const int result = make_app_data_zip(ctx, app_id);
-  if (result != QUARN_OK) {
+  auto *backup = static_cast<single_backup *>(data);
+  if (!backup->take_first_application()) return true;
+  if (backup->make_archive(app_id) != QUARN_OK) {
     LOGE("cannot make app data zip...");
-    ctx->result = result;
     return true;
   }
-  upload_app_data(ctx, ctx->cur_pkg_id.c_str(), ctx->cur_root_path.c_str(),
-                  ctx->cur_version.c_str());
+  backup->upload();
   return true;
 }
 
@@ -157,22 +151,7 @@ bool _package_cb_for_restore(package_info_app_component_type_e /*type*/, const c
   return true;
 }
 
-/** Wait for the answer to the upload. @return the run's result */
-int wait_for_upload(backup_context *ctx) {
-  const GMainLoopPtr loop(new_wait_loop());
-  // Before the look at what remains: the last answer may come on any thread.
-  ctx->wait_loop = g_main_loop_ref(loop.get());
-  if (ctx->upload_remain > 0) run_nested_loop(loop.get());
-  const GMainLoopPtr left(ctx->wait_loop.exchange(nullptr));
-  if (ctx->upload_remain > 0) {
-    // Withdrawn, or the daemon ends. The run lives on until its answer comes, if it comes.
-    abandon_single_upload(ctx);
-    return QUARN_CANCELLED;
-  }
-  return ctx->result;
-}
-
-int back_up(const std::string &pkg_id, package_info_h info, void *record) {
+int back_up(const std::string &pkg_id, package_info_h info, void * /*record*/) {
   package_facts facts;
   int result = refuse_preloaded(info);
   if (result == QUARN_OK) result = read_version(info, &facts);
@@ -181,22 +160,13 @@ int back_up(const std::string &pkg_id, package_info_h info, void *record) {
   if (result == QUARN_OK && !read_device(&facts)) result = QUARN_FAILED;
   if (result != QUARN_OK) return result;
 
-  const BackupContextPtr ctx(new backup_context);
-  ctx->single_package = true;
-  ctx->client = record;
-  ctx->cur_pkg_id = pkg_id;
-  ctx->cur_version = facts.version;
-  ctx->cur_pkg_type = facts.type;
-  ctx->cur_root_path = facts.root;
-  ctx->model_name = facts.model;
-  ctx->serial_number = facts.serial;
-  ctx->cur_backup_enabled = true;
-  result = visit_applications(info, _check_backup_enabled, ctx.get());
-  if (result == QUARN_OK) result = refuse_disabled(pkg_id, ctx->cur_backup_enabled);
+  single_backup backup({facts.serial, facts.model, pkg_id, facts.version, facts.type, facts.root});
+  result = visit_applications(info, _check_backup_enabled, &backup);
+  if (result == QUARN_OK) result = refuse_disabled(pkg_id, backup.enabled());
   if (result != QUARN_OK) return result;
-  result = visit_applications(info, _package_cb_for_backup, ctx.get());
-  if (ctx->upload_remain == 0 && waits_are_ended()) return QUARN_CANCELLED;
-  const int uploaded = wait_for_upload(ctx.get());
+  result = visit_applications(info, _package_cb_for_backup, &backup);
+  if (!backup.upload_under_way() && waits_are_ended()) return QUARN_CANCELLED;
+  const int uploaded = backup.wait();
   if (result == QUARN_OK && uploaded == QUARN_OK) {
     // somebody has decided that the data as it is now is to be in the cloud
     forget_owed_archive(facts.serial, pkg_id, facts.root);

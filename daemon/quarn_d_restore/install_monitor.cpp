@@ -3,9 +3,9 @@
 
 #include "quarn_common.h"
 #include "quarn_d_backup/owed_archive.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"
-#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/icon.h"

@@ -6,13 +6,14 @@
 #include "platform_settings.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_conditions/alarm.h"
+#include "quarn_d_conditions/conditions.h"
+#include "quarn_d_conditions/setting_observer.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/device_info.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_log.h"
-
-char auto_backup_enabled = 0;
 
 namespace {
 

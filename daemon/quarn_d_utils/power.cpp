@@ -1,8 +1,9 @@
-#include <atomic>
+#include "quarn_d_utils/power.h"
+
 #include <mutex>
 
 #include "platform_device.h"
-#include "quarn_d_utils/power.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
 
 namespace {
@@ -14,8 +15,6 @@ constexpr int kNoTimeout = 0;
 std::mutex power_mutex;
 unsigned int power_lock_takers = 0;
 bool power_lock_held = false;
-
-std::atomic<bool (*)()> pending_request_probe{nullptr};
 
 }  // namespace
 
@@ -35,10 +34,7 @@ void request_power_lock(bool lock) {
 }
 
 bool is_idle_status() {
-  const auto requests_pending = pending_request_probe.load();
-  if (requests_pending != nullptr && requests_pending()) return false;
+  if (PendingWork::any()) return false;
   const std::lock_guard<std::mutex> guard(power_mutex);
   return !power_lock_held;
 }
-
-void set_pending_request_probe(bool (*probe)()) { pending_request_probe = probe; }

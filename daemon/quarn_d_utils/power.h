@@ -13,9 +13,7 @@
  * lock is released with the last of them.
  */
 void request_power_lock(bool lock);
-/** True when nobody holds the CPU lock and no request is about to. */
-bool is_idle_status();
-/** Tells of requests that are queued and have not taken the lock yet. Set once at start. */
-void set_pending_request_probe(bool (*probe)());
+/** True when nobody holds the CPU lock and nothing is about to: see pending_work.h. */
+[[nodiscard]] bool is_idle_status();
 
 #endif

@@ -6,6 +6,7 @@
 
 #include "log_capture.h"
 #include "mock_platform.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_d_utils/power.h"
 
 namespace {
@@ -15,15 +16,9 @@ using ::testing::InSequence;
 using ::testing::NiceMock;
 using ::testing::Return;
 
-bool requests_pending = false;
-
 class PowerTest : public ::testing::Test {
  protected:
-  PowerTest() {
-    clear_captured_log();
-    requests_pending = false;
-  }
-  ~PowerTest() override { set_pending_request_probe(nullptr); }
+  PowerTest() { clear_captured_log(); }
 
   NiceMock<MockPlatform> platform;
 };
@@ -76,11 +71,14 @@ TEST_F(PowerTest, AReleaseWithoutATakeDoesNotUnbalanceTheNext) {
 }
 
 TEST_F(PowerTest, APendingRequestKeepsTheDaemonFromBeingIdle) {
-  set_pending_request_probe([] { return requests_pending; });
   EXPECT_TRUE(is_idle_status());
-  requests_pending = true;
+  {
+    const PendingWork call;
+    EXPECT_FALSE(is_idle_status());
+    PendingWork::begin();
+  }
   EXPECT_FALSE(is_idle_status());
-  requests_pending = false;
+  PendingWork::end();
   EXPECT_TRUE(is_idle_status());
 }
 

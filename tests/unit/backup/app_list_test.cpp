@@ -15,6 +15,9 @@
 
 #include "backup_device.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/app_list.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/list_rebase.h"
 #include "quarn_d_backup/model_entries.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"

@@ -47,6 +47,17 @@ int give_text(int result, bool null, const std::string &text, char **out) {
 
 std::atomic<int> fake_wifi{1};
 
+namespace {
+std::atomic<int (*)()> wifi_hook{nullptr};
+}
+
+void set_wifi_hook(int (*hook)()) { wifi_hook = hook; }
+
+int wifi_connected() {
+  const auto hook = wifi_hook.load();
+  return hook != nullptr ? hook() : fake_wifi.load();
+}
+
 std::ostream &operator<<(std::ostream &stream, const SentStatus &status) {
   return stream << "(" << status.err << ", " << status.status << ", " << status.req_id << ")";
 }
@@ -262,7 +273,7 @@ std::vector<backup_trans_file_info_s> FakeCloud::children(const std::string &fol
 BackupDevice::BackupDevice() {
   std::filesystem::remove_all("/tmp/quarn");
   fake_wifi = 1;
-  set_backup_wifi_probe([] { return fake_wifi.load(); });
+  set_wifi_hook(nullptr);
   manual_backup_canceled = false;
   set_status_hook(nullptr);
   clear_sent_statuses();

@@ -21,6 +21,7 @@
 #include "mock_platform.h"
 #include "mock_transport.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/backup_progress.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_dbus_client.h"
 #include "temp_dir.h"
@@ -136,6 +137,8 @@ client_cb_data *new_client(std::uint32_t req_id, const std::string &sender = ":1
 
 /** Whether the device is on Wi-Fi. */
 extern std::atomic<int> fake_wifi;
+/** Asked in its place until the next test; on the asking thread. */
+void set_wifi_hook(int (*hook)());
 
 /** Fixture: packages, cloud, Wi-Fi, no log and no clients. */
 class BackupDevice : public ::testing::Test {

@@ -6,7 +6,12 @@
 #include "backup_device.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/app_list.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/changes.h"
+#include "quarn_d_backup/kept_packages.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
@@ -415,7 +420,7 @@ TEST_F(Changes, ApplicationCallbackDoesNothingForADisabledOrFinishedPackage) {
 
 TEST_F(Changes, SizesAreLoggedWithTheFreeSpace) {
   make_current(install("org.app", "1", "12345678"));
-  check_current_backup_size(ctx_.get());
+  EXPECT_EQ(check_current_backup_size(ctx_.get()), QUARN_OK);
   EXPECT_THAT(captured_texts(),
               Contains(StartsWith("app backup size : 8, available space size : ")));
 }

@@ -12,7 +12,13 @@
 #include "backup_device.h"
 #include "backup_transport.h"
 #include "quarn_common.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/archive_upload.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/cloud_cleanup.h"
+#include "quarn_d_backup/list_transfer.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/single_folders.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/request_cause.h"
@@ -869,7 +875,7 @@ class MissingRecord : public Cloud {
 };
 
 TEST_F(MissingRecord, OfAListDownload) {
-  get_app_list_from_cloud(ctx_.get());
+  ASSERT_EQ(get_app_list_from_cloud(ctx_.get()), QUARN_OK);
   EXPECT_DEBUG_DEATH(call_without_record(downloaded_), "user_data");
   expect_logged("cb user_data is NULL...");
   downloaded_(BACKUP_TRANS_ERROR_CANCELLED, record_, nullptr);

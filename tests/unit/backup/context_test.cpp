@@ -11,7 +11,9 @@
 #include <vector>
 
 #include "backup_device.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"

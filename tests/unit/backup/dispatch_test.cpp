@@ -10,8 +10,11 @@
 
 #include "backup_device.h"
 #include "backup_transport.h"
+#include "quarn_d_backup/archive_upload.h"
+#include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/cancel.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/power.h"
@@ -140,11 +143,6 @@ TEST_F(Dispatch, TheEndOfARequestIsToldWhenNothingOfItIsLeft) {
   run_until([] { return ends_seen == 2; });
   set_backup_end_observer(nullptr);
   EXPECT_EQ(sent_statuses().size(), 2U);
-}
-
-TEST_F(Dispatch, UnknownWifiIsNone) {
-  set_backup_wifi_probe(nullptr);
-  EXPECT_EQ(backup_wifi_connected(), 0);
 }
 
 TEST_F(Dispatch, TwoManualRequestsRunOneAfterTheOther) {
@@ -288,7 +286,7 @@ TEST_F(Dispatch, CancelAndStartAtAnyMomentLeaveOneOfEach) {
 TEST_F(Dispatch, ACancelledRequestThatFindsNoWifiIsReportedAsCancelled) {
   static std::atomic<bool> cancelled;
   cancelled = false;
-  set_backup_wifi_probe([] {
+  set_wifi_hook([] {
     if (!cancelled.exchange(true)) cancel();
     return 0;
   });
@@ -430,8 +428,10 @@ TEST_F(Dispatch, RequestIsOutstandingFromItsQueuingToItsEnd) {
     EXPECT_TRUE(g_is_backing_up);
   });
   EXPECT_FALSE(backup_request_outstanding());
+  EXPECT_TRUE(is_idle_status());
   request_backup(new_client(1));
   EXPECT_TRUE(backup_request_outstanding());
+  EXPECT_FALSE(is_idle_status());
   finish();
   EXPECT_FALSE(g_is_backing_up);
   EXPECT_TRUE(is_idle_status());

@@ -1,6 +1,8 @@
 // A list that is written can be read again.
 #include "quarn_d_backup/list_bound.h"
 
+#include "quarn_d_backup/app_list.h"
+#include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/run_notes.h"
 #include "run_fixture.h"
 

@@ -7,7 +7,9 @@
 #include "backup_device.h"
 #include "poll_hook.h"
 #include "quarn_common.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/pipeline.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/bounds.h"
 
 using ::testing::Contains;
@@ -68,7 +70,7 @@ class Pipeline : public BackupDevice {
     set_backup_progress_sink(record_progress);
   }
 
-  void manual() { do_backup(true, new_client(kRequest)); }
+  void manual() { do_backup(true, std::unique_ptr<client_cb_data>(new_client(kRequest))); }
   void automatic() { do_backup(false, nullptr); }
 
   static SentStatus sent(int err, int status) { return {err, status, kRequest}; }

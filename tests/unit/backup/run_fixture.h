@@ -6,11 +6,13 @@
 #define RUN_FIXTURE_H
 
 #include <functional>
+#include <memory>
 #include <string>
 #include <vector>
 
 #include "backup_device.h"
 #include "poll_hook.h"
+#include "quarn_d_backup/pipeline.h"
 
 inline constexpr std::uint32_t kRunRequest = 43;
 
@@ -66,7 +68,7 @@ class Runs : public BackupDevice {
     };
   }
 
-  void manual() { do_backup(true, new_client(kRunRequest)); }
+  void manual() { do_backup(true, std::unique_ptr<client_cb_data>(new_client(kRunRequest))); }
   void automatic() { do_backup(false, nullptr); }
   AppList cloud_list() { return AppList(cloud_.objects[kAppListInCloud]); }
   bool in_cloud(const std::string &path) { return cloud_.objects.count(path) != 0; }

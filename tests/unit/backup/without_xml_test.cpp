@@ -6,7 +6,12 @@
 
 #include "backup_device.h"
 #include "lazy_xml.h"
-#include "quarn_d_backup/run_private.h"
+#include "quarn_d_backup/app_list.h"
+#include "quarn_d_backup/backup_context.h"
+#include "quarn_d_backup/changes.h"
+#include "quarn_d_backup/package_archive.h"
+#include "quarn_d_backup/pellix.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/path_rules.h"
 #include "rules/rules_file.h"

@@ -16,6 +16,7 @@
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_dbus_client.h"
 
 namespace {
@@ -57,7 +58,7 @@ void only_the_handler_waits() {
   int silent = 0;
   int served = 0;
   for (std::uint32_t request = 0; request < 3; ++request) start_handler(mute, request, &silent);
-  HOLDS(quarn_dbus_answers_awaited());
+  HOLDS(PendingWork::any());
   HOLDS(mute.wait_for_callbacks(3));
   for (std::uint32_t request = 0; request < 3; ++request) start_handler(other, request, &served);
   HOLDS(run_until([&served] { return served == 3; }));
@@ -69,7 +70,7 @@ void only_the_handler_waits() {
   for (const std::uint64_t fiber : fibers_of_caller(mute.name())) HOLDS(!withdraw_waits(fiber));
   quit_nested_loops();
   HOLDS(silent == 3 * 43);
-  HOLDS(!quarn_dbus_answers_awaited());
+  HOLDS(!PendingWork::any());
   HOLDS(waiting_requests() == 0);
   std::_Exit(0);
 }
@@ -82,7 +83,7 @@ void nobody_else_waits() {
   auto *record = new client_cb_data{1, mute.name(), count_waiting(mute.name())};
   HOLDS(quarn_dbus_restore_enable_cb(0, "org.example.notes", record) == 42);
   HOLDS(quarn_dbus_restore_enable_cb(0, "restore_stop", record) == 42);
-  HOLDS(!quarn_dbus_answers_awaited());
+  HOLDS(!PendingWork::any());
   HOLDS(waiting_requests() == 1);
   HOLDS(mute.wait_for_callbacks(2));
   HOLDS(mute.callbacks() == (Texts{"restore_enable_cb(0, 'org.example.notes', 1)",

@@ -26,6 +26,7 @@
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "quarn_d_utils/pending_work.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
@@ -302,6 +303,7 @@ TEST_F(Callers, CallsThatWaitForTheAnswerKeepTheirOrderAndHoldUpNobody) {
   }
   EXPECT_TRUE(run_until([this] { return !questions_.empty(); }));
   EXPECT_TRUE(quarnd_calls_unjudged());
+  EXPECT_TRUE(PendingWork::any());
   held_ = false;
   told_ = {true, 0, {}, ""};
   ScriptedClient other;
@@ -312,6 +314,7 @@ TEST_F(Callers, CallsThatWaitForTheAnswerKeepTheirOrderAndHoldUpNobody) {
   EXPECT_TRUE(run_until([&] { return outcomes.back()->finished; }));
   EXPECT_EQ(steps, (Texts{"cancel", "backup_enable 0", "cancel", "cancel", "backup_enable 2"}));
   EXPECT_FALSE(quarnd_calls_unjudged());
+  EXPECT_FALSE(PendingWork::any());
 }
 
 gboolean run_work(gpointer work) {
@@ -913,6 +916,7 @@ TEST_F(Server, CallsThatTouchDataWaitForAnEarlierProcessAndTheOthersDoNot) {
             (Texts{"cancel", "cancel", "cancel", "cancel", "cancel", "cancel", "cancel",
                    "restore_enable 0 0   " + id(5), "cancel", "manual_backup " + id(6), "cancel"}));
   EXPECT_TRUE(quarnd_calls_deferred());
+  EXPECT_TRUE(PendingWork::any());
   for (const auto &outcome : outcomes) EXPECT_FALSE(outcome->finished);
   steps.clear();
   earlier.end();
@@ -921,6 +925,7 @@ TEST_F(Server, CallsThatTouchDataWaitForAnEarlierProcessAndTheOthersDoNot) {
                        [](const auto &outcome) { return outcome->finished; });
   }));
   EXPECT_FALSE(quarnd_calls_deferred());
+  EXPECT_FALSE(PendingWork::any());
   EXPECT_EQ(steps,
             (Texts{"cancel", "restore_enable 1 0 s [] " + id(1), "cancel",
                    "get_app_list 0 " + id(2), "cancel", "backup_app_data " + id(3),

@@ -13,6 +13,8 @@
 
 #include "log_capture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_conditions/conditions.h"
+#include "quarn_d_conditions/setting_observer.h"
 #include "quarn_d_end.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
@@ -29,7 +31,6 @@
 #include "quarn_d_utils/kernel_settings.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_identity.h"
-#include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
@@ -52,8 +53,7 @@ bool waiting_stopped = false;
 bool answer_to_given_up_name = false;
 void (*on_turn)() = nullptr;
 std::vector<int> woken;
-int (*wifi_probe)() = nullptr;
-bool (*pending_probe)() = nullptr;
+std::vector<void (*)()> observers;
 int (*restore_disable)() = nullptr;
 void (*boot_recovery)() = nullptr;
 void (*bus_acquired_hook)(GDBusConnection *) = nullptr;
@@ -108,10 +108,6 @@ void quarnd_dbus_leave() {
 bool calls_deferred = false;
 bool turn_is_there = true;
 bool quarnd_calls_deferred() { return calls_deferred; }
-bool calls_unjudged = false;
-bool quarnd_calls_unjudged() { return calls_unjudged; }
-bool answers_awaited = false;
-bool quarn_dbus_answers_awaited() { return answers_awaited; }
 char pellix_restore_running = 0;
 char cloud_restore_running = 0;
 std::vector<std::string> turn_lines;
@@ -169,20 +165,29 @@ void quarnd_status_export(GDBusConnection *) { step("status_export"); }
 void quarnd_status_unexport() { step("status_unexport"); }
 void quarnd_packages_export(GDBusConnection *) { step("packages_export"); }
 void quarnd_packages_unexport() { step("packages_unexport"); }
-void quarnd_progress_init() { step("progress_init"); }
+void quarnd_status_refresh() {}
+void note_backup_progress(const backup_progress &) {}
+void note_restore_progress(const restore_progress &) {}
+void set_backup_progress_sink(backup_progress_sink sink) {
+  EXPECT_EQ(sink, note_backup_progress);
+  step("progress_init");
+}
+void set_restore_progress_sink(restore_progress_sink sink) {
+  EXPECT_EQ(sink, note_restore_progress);
+}
+void set_backup_end_observer(backup_end_observer observer) { observers.push_back(observer); }
+void set_restore_mode_observer(void (*observer)()) { observers.push_back(observer); }
+void set_setting_observer(void (*observer)()) { observers.push_back(observer); }
 void init_backup_resource() { step("init_backup_resource"); }
 void deinit_backup_resource() { step("deinit_backup_resource"); }
 int start_wifi_monitor() {
   step("start_wifi_monitor");
   return 1;
 }
-int wifi_connected() { return 1; }
 void monitor_auto_backup_status() { step("monitor_auto_backup_status"); }
 void init_backup_req_dispatch_thread() { step("init_backup_req_dispatch_thread"); }
 bool backups_outstanding = true;
 bool backup_request_outstanding() { return backups_outstanding; }
-void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
-void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
 void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
 void (*in_recovery)() = nullptr;
@@ -223,8 +228,7 @@ class Main : public ::testing::Test {
     calls_deferred = false;
     backups_outstanding = true;
     manual_backup_canceled = false;
-    wifi_probe = nullptr;
-    pending_probe = nullptr;
+    observers.clear();
     restore_disable = nullptr;
     boot_recovery = nullptr;
     for (const int signo : signals_) signal(signo, SIG_DFL);
@@ -418,24 +422,9 @@ TEST_F(Main, ProcessWhoseRequestsWaitAsksTheEarlierOneToLeaveUntilItsTurnComes) 
   backups_outstanding = false;
 }
 
-TEST_F(Main, CallsThatWaitForTheEarlierProcessKeepTheDaemonAndFollowIt) {
+TEST_F(Main, CallsThatWaitForTheEarlierProcessFollowIt) {
   quarn_run();
-  backups_outstanding = false;
-  EXPECT_FALSE(pending_probe());
-  calls_deferred = true;
-  EXPECT_TRUE(pending_probe());
   EXPECT_EQ(on_turn, quarnd_dispatch_deferred);
-}
-
-TEST_F(Main, CallsThatAreNotJudgedYetAndAnswersThatAreAwaitedKeepTheDaemon) {
-  quarn_run();
-  backups_outstanding = false;
-  for (bool *const work : {&calls_unjudged, &answers_awaited}) {
-    EXPECT_FALSE(pending_probe());
-    *work = true;
-    EXPECT_TRUE(pending_probe());
-    *work = false;
-  }
 }
 
 TEST_F(Main, InitTwiceLogsAndAsksForTheBusOnce) {
@@ -496,15 +485,13 @@ TEST_F(Main, OnlyTheRecoveryIsMadeWhenItIsAskedFor) {
   EXPECT_EXIT(run_program({"quarnd"}), ::testing::ExitedWithCode(255), "");
 }
 
-TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {
+TEST_F(Main, LowerFloorsAreGivenTheirHooksFirst) {
   init_quarn();
-  ASSERT_NE(wifi_probe, nullptr);
-  ASSERT_NE(pending_probe, nullptr);
   ASSERT_NE(restore_disable, nullptr);
   ASSERT_NE(boot_recovery, nullptr);
   ASSERT_NE(bus_acquired_hook, nullptr);
-  EXPECT_EQ(wifi_probe(), 1);
-  EXPECT_TRUE(pending_probe());
+  EXPECT_EQ(observers.size(), 3U);
+  for (void (*const observer)() : observers) EXPECT_EQ(observer, quarnd_status_refresh);
   restart();
   EXPECT_EQ(restore_disable(), 0);
   boot_recovery();

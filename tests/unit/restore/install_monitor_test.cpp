@@ -14,7 +14,7 @@
 #include "backup_transport.h"
 #include "platform_package_manager.h"
 #include "quarn_d_backup/owed_archive.h"
-#include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/package.h"
 #include "restore_fixture.h"

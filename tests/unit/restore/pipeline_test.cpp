@@ -9,9 +9,9 @@
 #include <future>
 #include <thread>
 
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/withdrawal.h"
-#include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/file.h"

@@ -201,7 +201,7 @@ TEST_F(ExpiryTest, AnIdleProcessWithAnAlarmPendingAddsNone) {
   set_auto_backup(1);
   last_backup_was(kHourMs);
   alarm_id_t pending = 0;
-  add_backup_alarm(kTwelveHours, &pending);
+  EXPECT_EQ(add_backup_alarm(kTwelveHours, &pending), ALARMMGR_RESULT_SUCCESS);
   EXPECT_CALL(platform, alarmmgr_add_alarm).Times(0);
   expire();
   expect_terminated_once();
@@ -218,10 +218,10 @@ TEST_F(SettingTest, KnowsWhenItsAlarmsAreDue) {
   EXPECT_EQ(next_alarm_due(), 0);
   const std::int64_t before = _get_current_timestamp();
   alarm_id_t id = 0;
-  add_backup_alarm(kTwelveHours, &id);
+  EXPECT_EQ(add_backup_alarm(kTwelveHours, &id), ALARMMGR_RESULT_SUCCESS);
   EXPECT_GE(next_alarm_due(), before + kTwelveHours * 1000LL);
   EXPECT_EQ(condition_alarm_due(), 0);
-  add_backup_alarm(60, &_alarm_id);
+  EXPECT_EQ(add_backup_alarm(60, &_alarm_id), ALARMMGR_RESULT_SUCCESS);
   EXPECT_GE(condition_alarm_due(), before + 60000);
   EXPECT_EQ(next_alarm_due(), condition_alarm_due());
   remove_condition_alarm();

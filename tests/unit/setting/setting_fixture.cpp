@@ -11,14 +11,17 @@
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_utils/device_info.h"
-#include "quarn_d_utils/power.h"
+#include "quarn_d_utils/pending_work.h"
 
 using ::testing::_;
 
 FakeDaemon fake_daemon;
 
 std::atomic<bool> g_is_backing_up{false};
-void request_backup(void *client) { fake_daemon.backup_requests.push_back(client); }
+void request_backup(void *client) {
+  PendingWork::begin();
+  fake_daemon.backup_requests.push_back(client);
+}
 std::uint64_t get_last_backup_time() { return fake_daemon.last_backup; }
 void request_quarn_terminate(double delay, bool restart) {
   fake_daemon.terminations.push_back({delay, restart});
@@ -32,7 +35,6 @@ char connection_object[1];
 SettingTest::SettingTest() {
   fake_daemon = FakeDaemon{};
   g_is_backing_up = false;
-  set_pending_request_probe([] { return !fake_daemon.backup_requests.empty(); });
 
   ON_CALL(platform, connection_create).WillByDefault([](connection_h *connection) {
     *connection = reinterpret_cast<connection_h>(connection_object);
@@ -115,7 +117,8 @@ SettingTest::~SettingTest() {
   stop_charger_monitor();
   stop_screen_monitor();
   deinit_backup_resource();
-  set_pending_request_probe(nullptr);
+  for (std::size_t i = 0; i < fake_daemon.backup_requests.size(); ++i) PendingWork::end();
+  fake_daemon.backup_requests.clear();
 }
 
 void SettingTest::set_charger(bool connected) {

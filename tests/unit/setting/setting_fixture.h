@@ -14,6 +14,8 @@
 
 #include "mock_platform.h"
 #include "mock_transport.h"
+#include "quarn_d_conditions/alarm.h"
+#include "quarn_d_conditions/conditions.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 
 /** What the units above and below would have done. */

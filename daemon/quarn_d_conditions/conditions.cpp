@@ -1,11 +1,15 @@
+#include "quarn_d_conditions/conditions.h"
+
 #include <atomic>
 
 #include "platform_device.h"
 #include "platform_runtime_info.h"
-#include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_conditions/alarm.h"
+#include "quarn_d_conditions/setting_observer.h"
 #include "quarn_log.h"
 
 connection_h g_connection = nullptr;
+char auto_backup_enabled = 0;
 
 namespace {
 

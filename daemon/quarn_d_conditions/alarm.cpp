@@ -1,8 +1,10 @@
+#include "quarn_d_conditions/alarm.h"
+
 #include <cstdint>
 #include <map>
 
 #include "platform_alarm.h"
-#include "quarn_d_setting/quarn_d_setting.h"
+#include "quarn_d_conditions/setting_observer.h"
 #include "quarn_d_utils/device_info.h"
 #include "quarn_log.h"
 
@@ -13,8 +15,6 @@ namespace {
 constexpr time_t kOnce = 0;
 constexpr std::int64_t kMillisecondsPerSecond = 1000;
 
-void (*setting_observer)() = nullptr;
-
 /** When the alarms that this process added fall due; the service cannot be asked. */
 std::map<alarm_id_t, std::int64_t> &alarms_due() {
   static auto *due = new std::map<alarm_id_t, std::int64_t>;
@@ -22,12 +22,6 @@ std::map<alarm_id_t, std::int64_t> &alarms_due() {
 }
 
 }  // namespace
-
-void set_setting_observer(void (*observer)()) { setting_observer = observer; }
-
-void tell_setting_observer() {
-  if (setting_observer != nullptr) setting_observer();
-}
 
 void remove_condition_alarm() {
   if (_alarm_id == kNoAlarm) return;
