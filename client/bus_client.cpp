@@ -109,8 +109,8 @@ bool is_cancelled(const GError *error) {
 
 BusFailure failure_of(GError *error) {
   const GText name(g_dbus_error_is_remote_error(error) != FALSE
-                          ? g_dbus_error_get_remote_error(error)
-                          : nullptr);
+                       ? g_dbus_error_get_remote_error(error)
+                       : nullptr);
   g_dbus_error_strip_remote_error(error);
   const std::string text = error->message;
   const auto is = [error](GDBusError code) {
