@@ -5,7 +5,6 @@
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/handles.h"
-#include "quarn_dbus_server.h"
 #include "quarn_log.h"
 
 const char kPackagesIntrospection[] =

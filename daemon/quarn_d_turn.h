@@ -9,8 +9,16 @@
 #ifndef QUARN_D_TURN_H
 #define QUARN_D_TURN_H
 
+#include <csignal>
 #include <string>
 #include <vector>
+
+/** What a process sends its predecessor to cancel the backups that run there. */
+inline constexpr int kCancelSignal = SIGUSR1;
+/** And to withdraw what the callers have asked for whose names it has left. */
+inline constexpr int kWithdrawSignal = SIGUSR2;
+/** What it leaves in place of a caller's name when requests wait for its predecessor's end. */
+inline constexpr char kLeaveLine[] = "leave";
 
 /**
  * Ask for the turn without waiting for it. Once, on the main thread.

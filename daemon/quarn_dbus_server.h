@@ -9,15 +9,6 @@
 
 #include <gio/gio.h>
 
-#include <csignal>
-
-/** What a process sends its predecessor to cancel the backups that run there. */
-inline constexpr int kCancelSignal = SIGUSR1;
-/** And to withdraw what the callers have asked for whose names it has left. */
-inline constexpr int kWithdrawSignal = SIGUSR2;
-/** What it leaves in place of a caller's name when requests wait for its predecessor's end. */
-inline constexpr char kLeaveLine[] = "leave";
-
 /** The introspection document: tabs between its elements. */
 extern const char quarn_introspection_xml[];
 

@@ -13,7 +13,6 @@
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
-#include "quarn_dbus_server.h"
 
 namespace {
 
