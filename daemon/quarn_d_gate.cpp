@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "quarn_common.h"
+#include "quarn_d_methods.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 
@@ -303,22 +304,12 @@ quarn_caller read_credentials(GVariant *reply) {
 quarn_subject subject_of_call(const std::string &interface_name, const std::string &member,
                               GVariant *arguments) {
   quarn_subject subject{interface_name, member, "", -1, false};
-  if (arguments == nullptr || interface_name != kQuarnInterface) return subject;
-  const auto has_form = [arguments](const char *form) {
-    return g_variant_is_of_type(arguments, G_VARIANT_TYPE(form)) != FALSE;
-  };
-  if (member == "restore_enable" && has_form("(iissu)")) {
-    gint32 on = 0;
-    g_variant_get_child(arguments, 0, "i", &on);
-    g_variant_get_child(arguments, 1, "i", &subject.client);
-    subject.switches_on = on != 0;
-  } else if (member == "get_app_list" && has_form("(iu)")) {
-    g_variant_get_child(arguments, 0, "i", &subject.client);
-  } else if (has_form("(s)") || has_form("(su)")) {
-    const char *text = nullptr;
-    g_variant_get_child(arguments, 0, "&s", &text);
-    subject.package = text;
-  }
+  if (interface_name != kQuarnInterface) return subject;
+  const std::optional<quarn_arguments> given = read_quarn_arguments(member, arguments);
+  if (!given) return subject;
+  subject.client = given->client;
+  subject.switches_on = given->on != 0;
+  if (given->pkg_id != nullptr) subject.package = given->pkg_id;
   return subject;
 }
 
