@@ -5,6 +5,7 @@
 #include <memory>
 #include <mutex>
 #include <utility>
+#include <variant>
 
 #include "quarn_common.h"
 #include "quarn_d_gate.h"
@@ -12,19 +13,17 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
+#include "quarn_dbus_method_call.h"
+#include "quarn_dbus_methods.h"
 #include "quarn_log.h"
 
 namespace {
-
-/** The reply to a call whose arguments are missing. */
-constexpr int kArgumentsMissing = -1;
-
-using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
 
 struct delivered_call {
   MessagePtr message;
   quarn_call_form form;
   bool begun = false;
+  RecordPtr record = nullptr; /**< where it was accepted without being looked at */
 };
 
 /** Who called, and the number of the call among that connection's. */
@@ -112,56 +111,32 @@ bool is(GDBusMessage *message, const char *method) {
 }
 
 /** Accept a request that nobody has looked at, so that it has its last callback. */
-void accept(GDBusMessage *message, quarn_request kind) {
-  GVariant *const arguments = g_dbus_message_get_body(message);
-  const gsize count = g_variant_n_children(arguments);
-  auto *record = new client_cb_data{0, text_or_empty(g_dbus_message_get_sender(message))};
-  // The number is the last argument, and a package comes before it.
-  g_variant_get_child(arguments, count - 1, "u", &record->req_id);
-  const char *package = "";
-  if (kind == quarn_request::app_backup || kind == quarn_request::app_restore) {
-    g_variant_get_child(arguments, 0, "&s", &package);
-  }
-  quarn_dbus_accept_request(kind, package, record);
-}
-
-void accept_unlooked(GDBusMessage *message) {
-  static constexpr std::pair<const char *, quarn_request> kRequests[] = {
-      {"get_app_list", quarn_request::app_list},
-      {"manual_backup_start", quarn_request::manual_backup},
-      {"manual_backup_cancel", quarn_request::cancel},
-      {"app_data_backup_start", quarn_request::app_backup},
-      {"app_data_restore_start", quarn_request::app_restore}};
-  for (const auto &[method, kind] : kRequests) {
-    if (is(message, method)) accept(message, kind);
-  }
+void accept_unlooked(delivered_call *call) {
+  GDBusMessage *const message = call->message.get();
+  const std::string member = text_or_empty(g_dbus_message_get_member(message));
+  const served_method *const method = find_served_method(member);
+  const auto arguments = read_quarn_arguments(member, g_dbus_message_get_body(message));
+  if (method == nullptr || !arguments) return;
+  const auto *const request = std::get_if<method_of_request>(&method->handler);
+  if (request == nullptr) return;
+  call->record.reset(
+      new client_cb_data{arguments->req_id, text_or_empty(g_dbus_message_get_sender(message))});
+  quarn_dbus_accept_request(request->kind, text_or_empty(arguments->pkg_id), call->record.get());
 }
 
 /** The reply to a call of the right form whose work does not end, or does not begin. */
-void answer_cancelled(GDBusMessage *message) {
-  gint32 first = 0;
-  if (is(message, "last_bu_time")) {
-    unsigned long long timestamp = 0;
-    quarnd_get_last_backed_up_time(&timestamp);
-    reply(message, g_variant_new("(t)", static_cast<guint64>(timestamp)));
-  } else if (is(message, "auto_backup_start")) {
-    reply(message, nullptr);
-  } else if (is(message, "restore_enable")) {
-    g_variant_get_child(g_dbus_message_get_body(message), 0, "i", &first);
-    // Without this process there is no restore mode.
-    reply_int(message, first != 0 ? QUARN_REFUSED : QUARN_OK);
-  } else if (is(message, "manual_backup_start") || is(message, "manual_backup_cancel") ||
-             is(message, "app_data_backup_start") || is(message, "app_data_restore_start")) {
-    reply_int(message, QUARN_OK);  // the callback tells
-  } else {
-    reply_int(message, QUARN_CANCELLED);
-  }
+void answer_unlooked(GDBusMessage *message) {
+  const std::string member = text_or_empty(g_dbus_message_get_member(message));
+  const served_method *const method = find_served_method(member);
+  const auto arguments = read_quarn_arguments(member, g_dbus_message_get_body(message));
+  if (method == nullptr) return;
+  reply(message, method->reply_unlooked(arguments.value_or(quarn_arguments{})));
 }
 
 void answer(GDBusMessage *message, quarn_call_form form) {
   switch (form) {
     case quarn_call_form::right:
-      return answer_cancelled(message);
+      return answer_unlooked(message);
     case quarn_call_form::without_arguments:
       return reply_int(message, kArgumentsMissing);
     case quarn_call_form::other_arguments:
@@ -235,7 +210,7 @@ void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message) {
   if (first && tells_of_refusal(known_caller(sender))) {
     LOGE("refused : too many calls of (%s) wait", sender.c_str());
   }
-  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+  if (wants_no_reply(message)) return;
   const MessagePtr answer(g_dbus_message_new_method_error_literal(
       message, "org.freedesktop.DBus.Error.LimitsExceeded", "Too many calls are waiting"));
   g_dbus_connection_send_message(connection, answer.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
@@ -243,7 +218,7 @@ void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message) {
 }
 
 void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
-  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+  if (wants_no_reply(message)) return;
   const call_key key(text_or_empty(g_dbus_message_get_sender(message)),
                      g_dbus_message_get_serial(message));
   MessagePtr held(G_DBUS_MESSAGE(g_object_ref(message)));
@@ -281,8 +256,8 @@ void answer_quarn_calls() {
         !call->second.begun && refuse_unlooked(call->second.message.get(), call->second.form);
     call = refused ? left.erase(call) : std::next(call);
   }
-  for (const auto &[key, call] : left) {
-    if (!call.begun && call.form == quarn_call_form::right) accept_unlooked(call.message.get());
+  for (auto &[key, call] : left) {
+    if (!call.begun && call.form == quarn_call_form::right) accept_unlooked(&call);
   }
   quarn_dbus_end_requests();
   for (const auto &[key, call] : left) answer(call.message.get(), call.form);
