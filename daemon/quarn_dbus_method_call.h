@@ -12,10 +12,6 @@
 #include "quarn_d_callers.h"
 #include "quarn_d_utils/handles.h"
 
-using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
-/** A call that nobody has answered yet: answering it takes it. */
-using InvocationPtr = Handle<GDBusMethodInvocation, &g_object_unref>;
-
 class MethodCall {
  public:
   MethodCall(const char *sender, const char *interface_name, const char *method_name,

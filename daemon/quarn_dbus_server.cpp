@@ -27,8 +27,6 @@ constexpr unsigned int kFlushLimit = 500;
 /** Milliseconds that the bus may take to answer when the process is about to be left. */
 constexpr int kLastRelease = 50;
 
-using NodeInfoPtr = Handle<GDBusNodeInfo, &g_dbus_node_info_unref>;
-
 guint registration_id = 0;
 guint filter_id = 0;
 guint name_owner_id = 0;
