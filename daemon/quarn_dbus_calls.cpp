@@ -3,7 +3,6 @@
 #include <iterator>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <utility>
 #include <variant>
 
@@ -16,6 +15,7 @@
 #include "quarn_dbus_method_call.h"
 #include "quarn_dbus_methods.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -29,10 +29,13 @@ struct delivered_call {
 /** Who called, and the number of the call among that connection's. */
 using call_key = std::pair<std::string, guint32>;
 
+struct call_table {
+  Mutex mutex;
+  std::map<call_key, delivered_call> calls QUARN_GUARDED_BY(mutex);
+  bool answered_all QUARN_GUARDED_BY(mutex) = false;
+};
 // Never destroyed: the bus thread lives as long as the process.
-std::mutex &calls_mutex = *new std::mutex;
-std::map<call_key, delivered_call> &calls = *new std::map<call_key, delivered_call>;
-bool answered_all = false;
+call_table &delivered = *new call_table;
 
 /** What a message takes beside its arguments. */
 constexpr std::size_t kBytesOfCall = 2048;
@@ -53,10 +56,13 @@ struct standing_call {
   bool of_root;
 };
 
-std::mutex &standing_mutex = *new std::mutex;
-std::map<std::string, standing_calls> &standing = *new std::map<std::string, standing_calls>;
-/** Of all but root. */
-std::size_t standing_bytes = 0;
+struct standing_table {
+  Mutex mutex;
+  std::map<std::string, standing_calls> senders QUARN_GUARDED_BY(mutex);
+  /** Of all but root. */
+  std::size_t bytes QUARN_GUARDED_BY(mutex) = 0;
+};
+standing_table &standing = *new standing_table;
 
 std::size_t bytes_of(GDBusMessage *message, quarn_call_form form) {
   GVariant *const body = g_dbus_message_get_body(message);
@@ -66,21 +72,20 @@ std::size_t bytes_of(GDBusMessage *message, quarn_call_form form) {
 
 void forget_standing(gpointer data) {
   const std::unique_ptr<standing_call> call(static_cast<standing_call *>(data));
-  const std::lock_guard<std::mutex> lock(standing_mutex);
-  const auto found = standing.find(call->sender);
+  const MutexLock lock(standing.mutex);
+  const auto found = standing.senders.find(call->sender);
   found->second.bytes -= call->bytes;
-  if (!call->of_root) standing_bytes -= call->bytes;
-  if (--found->second.count == 0) standing.erase(found);
+  if (!call->of_root) standing.bytes -= call->bytes;
+  if (--found->second.count == 0) standing.senders.erase(found);
 }
 
-/** Under standing_mutex. */
-bool has_room(const standing_call &call) {
+bool has_room(const standing_call &call) QUARN_REQUIRES(standing.mutex) {
   if (call.of_root) return true;
-  const auto found = standing.find(call.sender);
-  const standing_calls own = found == standing.end() ? standing_calls{} : found->second;
+  const auto found = standing.senders.find(call.sender);
+  const standing_calls own = found == standing.senders.end() ? standing_calls{} : found->second;
   if (own.count < kCallsAlwaysTaken && call.bytes <= kSmallCall) return true;
   return own.bytes + call.bytes <= kMostBytesOfConnection &&
-         standing_bytes + call.bytes <= kMostBytesOfConnections;
+         standing.bytes + call.bytes <= kMostBytesOfConnections;
 }
 
 std::string text_or_empty(const char *text) { return text == nullptr ? "" : text; }
@@ -187,12 +192,12 @@ bool take_quarn_call(GDBusMessage *message, quarn_call_form form) {
   auto call = std::make_unique<standing_call>(
       standing_call{sender, bytes_of(message, form), caller.known && caller.uid == 0});
   {
-    const std::lock_guard<std::mutex> lock(standing_mutex);
+    const MutexLock lock(standing.mutex);
     if (!has_room(*call)) return false;
-    standing_calls &own = standing[sender];
+    standing_calls &own = standing.senders[sender];
     ++own.count;
     own.bytes += call->bytes;
-    if (!call->of_root) standing_bytes += call->bytes;
+    if (!call->of_root) standing.bytes += call->bytes;
   }
   static const GQuark kStanding = g_quark_from_static_string("quarn-standing-call");
   g_object_set_qdata_full(G_OBJECT(message), kStanding, call.release(), forget_standing);
@@ -203,9 +208,9 @@ void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message) {
   const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
   bool first = true;
   {
-    const std::lock_guard<std::mutex> lock(standing_mutex);
-    const auto found = standing.find(sender);
-    if (found != standing.end()) first = !std::exchange(found->second.refused, true);
+    const MutexLock lock(standing.mutex);
+    const auto found = standing.senders.find(sender);
+    if (found != standing.senders.end()) first = !std::exchange(found->second.refused, true);
   }
   if (first && tells_of_refusal(known_caller(sender))) {
     LOGE("refused : too many calls of (%s) wait", sender.c_str());
@@ -222,8 +227,8 @@ void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
   const call_key key(text_or_empty(g_dbus_message_get_sender(message)),
                      g_dbus_message_get_serial(message));
   MessagePtr held(G_DBUS_MESSAGE(g_object_ref(message)));
-  const std::lock_guard<std::mutex> lock(calls_mutex);
-  calls.insert_or_assign(key, delivered_call{std::move(held), form});
+  const MutexLock lock(delivered.mutex);
+  delivered.calls.insert_or_assign(key, delivered_call{std::move(held), form});
 }
 
 void note_quarn_answer(GDBusMessage *message) {
@@ -231,24 +236,24 @@ void note_quarn_answer(GDBusMessage *message) {
   if (type != G_DBUS_MESSAGE_TYPE_METHOD_RETURN && type != G_DBUS_MESSAGE_TYPE_ERROR) return;
   const call_key key(text_or_empty(g_dbus_message_get_destination(message)),
                      g_dbus_message_get_reply_serial(message));
-  const std::lock_guard<std::mutex> lock(calls_mutex);
-  calls.erase(key);
+  const MutexLock lock(delivered.mutex);
+  delivered.calls.erase(key);
 }
 
 bool begin_quarn_call(const std::string &sender, guint32 serial) {
-  const std::lock_guard<std::mutex> lock(calls_mutex);
-  if (answered_all) return false;
-  const auto found = calls.find({sender, serial});
-  if (found != calls.end()) found->second.begun = true;
+  const MutexLock lock(delivered.mutex);
+  if (delivered.answered_all) return false;
+  const auto found = delivered.calls.find({sender, serial});
+  if (found != delivered.calls.end()) found->second.begun = true;
   return true;
 }
 
 void answer_quarn_calls() {
   std::map<call_key, delivered_call> left;
   {
-    const std::lock_guard<std::mutex> lock(calls_mutex);
-    answered_all = true;
-    left.swap(calls);
+    const MutexLock lock(delivered.mutex);
+    delivered.answered_all = true;
+    left.swap(delivered.calls);
   }
   for (auto call = left.begin(); call != left.end();) {
     // What is begun has passed.
