@@ -47,7 +47,7 @@ struct caller_verdict {
 extern const char kClientGroup[];
 
 /** @param client_group number of the clients' group; -1: the system has none */
-caller_kind kind_of_caller(const quarn_caller &caller, gid_t client_group);
+[[nodiscard]] caller_kind kind_of_caller(const quarn_caller &caller, gid_t client_group);
 
 /**
  * What kQuarnMethods says of who may call, applied to one call.
