@@ -42,6 +42,10 @@ using GErrorPtr = Handle<GError, &g_error_free>;
 using GDirPtr = Handle<GDir, &g_dir_close>;
 using GVariantPtr = Handle<GVariant, &g_variant_unref>;
 using GMainLoopPtr = Handle<GMainLoop, &g_main_loop_unref>;
+using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
+using NodeInfoPtr = Handle<GDBusNodeInfo, &g_dbus_node_info_unref>;
+/** A call that nobody has answered yet: answering it takes it. */
+using InvocationPtr = Handle<GDBusMethodInvocation, &g_object_unref>;
 using JsonPtr = Handle<json_object, &json_object_put>;
 using DirPtr = Handle<DIR, &closedir>;
 

@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "quarn_common.h"
+#include "quarn_d_methods.h"
 
 #ifndef QUARN_CLIENT_GROUP
 #define QUARN_CLIENT_GROUP "quarn"
@@ -21,9 +22,12 @@ bool is_package_label(const std::string &label) {
   return label.size() > 1 && label != ".." && label.find('/') == std::string::npos;
 }
 
-bool is_own_package_request(const quarn_subject &subject) {
-  return subject.member == "app_data_backup_start" || subject.member == "app_data_restore_start" ||
-         subject.member == "make_app_data";
+/** The method's; other interfaces, and methods that do not exist, are for who is trusted. */
+method_rights rights_to(const quarn_subject &subject) {
+  const quarn_method *const method = subject.interface_name == kQuarnInterface
+                                         ? find_quarn_method(subject.member.c_str())
+                                         : nullptr;
+  return method == nullptr ? method_rights::trusted : method->rights;
 }
 
 bool is_cancel_own(const quarn_subject &subject) {
@@ -35,7 +39,7 @@ caller_verdict refused(const std::string &reason) { return {false, reason}; }
 
 caller_verdict application_may(const std::string &label, const quarn_subject &subject) {
   if (is_cancel_own(subject)) return allowed();
-  if (subject.interface_name != kQuarnInterface || !is_own_package_request(subject)) {
+  if (rights_to(subject) != method_rights::own_package) {
     return refused(std::string("it is for root and the group ") + kClientGroup);
   }
   if (subject.package != label) return refused("an application may ask for its own package only");
@@ -44,14 +48,15 @@ caller_verdict application_may(const std::string &label, const quarn_subject &su
 
 caller_verdict companion_may(const std::string &label, const quarn_subject &subject,
                              bool cloud_mode) {
-  const bool of_companion =
-      subject.interface_name == kQuarnInterface &&
-      (subject.member == "get_app_list" || subject.member == "restore_enable");
-  if (!of_companion) return application_may(label, subject);
+  const method_rights rights = rights_to(subject);
+  const bool switches_mode = rights == method_rights::companions_mode;
+  if (rights != method_rights::as_companion && !switches_mode) {
+    return application_may(label, subject);
+  }
   if (subject.client != kCompanionClient) {
     return refused("the companion may ask as the companion only");
   }
-  if (subject.member == "restore_enable" && !subject.switches_on && cloud_mode) {
+  if (switches_mode && !subject.switches_on && cloud_mode) {
     return refused("restore mode is not the companion's");
   }
   return allowed();

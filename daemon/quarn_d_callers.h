@@ -1,6 +1,6 @@
 /**
  * @file quarn_d_callers.h
- * @brief Who may ask the daemon for what.
+ * @brief Who calls, and whether that caller may have what a method's row in quarn_d_methods.h says.
  *
  * Plain values in, a verdict out: nothing here asks the bus or keeps anything.
  * Any thread.
@@ -35,7 +35,7 @@ struct quarn_subject {
   std::string member;
   std::string package;      /**< of the arguments; empty when there is none */
   int client = -1;          /**< the kind of client that the arguments name */
-  bool switches_on = false; /**< of restore_enable */
+  bool switches_on = false; /**< of what they switch on or off */
 };
 
 struct caller_verdict {
@@ -47,13 +47,13 @@ struct caller_verdict {
 extern const char kClientGroup[];
 
 /** @param client_group number of the clients' group; -1: the system has none */
-caller_kind kind_of_caller(const quarn_caller &caller, gid_t client_group);
+[[nodiscard]] caller_kind kind_of_caller(const quarn_caller &caller, gid_t client_group);
 
 /**
- * The one table of rights.
+ * What kQuarnMethods says of who may call, applied to one call.
  * @param cloud_mode restore mode is on, and not the companion's
  */
-caller_verdict may_call(const quarn_caller &caller, gid_t client_group,
-                        const quarn_subject &subject, bool cloud_mode);
+[[nodiscard]] caller_verdict may_call(const quarn_caller &caller, gid_t client_group,
+                                      const quarn_subject &subject, bool cloud_mode);
 
 #endif

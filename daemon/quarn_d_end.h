@@ -42,6 +42,6 @@ void leave_quarn_for_good();
  * Whether a signal is what the service manager sends a service for giving its
  * bus name up: it is no wish that the process should end. True once. Any thread.
  */
-bool is_answer_to_given_up_name(int signo);
+[[nodiscard]] bool is_answer_to_given_up_name(int signo);
 
 #endif

@@ -9,15 +9,16 @@
 #include <iterator>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <utility>
 #include <vector>
 
 #include "quarn_common.h"
+#include "quarn_d_methods.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -48,8 +49,9 @@ struct connection_entry {
 };
 using EntryPtr = std::shared_ptr<connection_entry>;
 
-// The process may be left while other threads look.
-std::mutex &entries_mutex = *new std::mutex;  // the main thread writes, under it
+// The process may be left while other threads look. The main thread alone writes, under the mutex,
+// and reads without it: hence no word of it at the entries.
+Mutex &entries_mutex = *new Mutex;
 std::map<std::string, EntryPtr> &entries = *new std::map<std::string, EntryPtr>;
 std::uint64_t last_age = 0;
 caller_source &source = *new caller_source;
@@ -60,8 +62,11 @@ struct refusals {
   gint64 since = 0;
   unsigned int count = 0;
 };
-std::mutex &refusals_mutex = *new std::mutex;
-std::map<std::string, refusals> &refused_callers = *new std::map<std::string, refusals>;
+struct refusal_table {
+  Mutex mutex;
+  std::map<std::string, refusals> callers QUARN_GUARDED_BY(mutex);
+};
+refusal_table &refused = *new refusal_table;
 gint64 (*refusal_clock)() = g_get_monotonic_time;
 
 /** What one application has asked for since a moment. Main thread. */
@@ -85,21 +90,21 @@ void tell_left_out(const std::string &who, const refusals &of) {
 }
 
 /** Tell of what is over, so that no more is kept than callers that are refused now. */
-void end_refusals(gint64 before) {
-  for (auto at = refused_callers.begin(); at != refused_callers.end();) {
+void end_refusals(gint64 before) QUARN_REQUIRES(refused.mutex) {
+  for (auto at = refused.callers.begin(); at != refused.callers.end();) {
     if (at->second.since > before) {
       ++at;
       continue;
     }
     tell_left_out(at->first, at->second);
-    at = refused_callers.erase(at);
+    at = refused.callers.erase(at);
   }
 }
 
 void drop(const std::string &sender) {
   EntryPtr dropped;
   {
-    const std::lock_guard<std::mutex> lock(entries_mutex);
+    const MutexLock lock(entries_mutex);
     const auto found = entries.find(sender);
     if (found == entries.end()) return;
     dropped = std::move(found->second);
@@ -144,7 +149,7 @@ EntryPtr entry_of(GDBusConnection *connection, const std::string &sender) {
   auto entry = std::make_shared<connection_entry>();
   entry->age = ++last_age;
   entry->connection = connection;
-  const std::lock_guard<std::mutex> lock(entries_mutex);
+  const MutexLock lock(entries_mutex);
   entries[sender] = entry;
   return entry;
 }
@@ -168,7 +173,7 @@ void watch(const std::string &sender, const EntryPtr &entry) {
 
 void take_answer(const std::string &sender, const EntryPtr &entry, const quarn_caller &caller) {
   {
-    const std::lock_guard<std::mutex> lock(entries_mutex);
+    const MutexLock lock(entries_mutex);
     entry->caller = caller;
     entry->told = true;
   }
@@ -269,7 +274,7 @@ bool callers_are_asked_for() {
 }
 
 quarn_caller known_caller(const std::string &sender) {
-  const std::lock_guard<std::mutex> lock(entries_mutex);
+  const MutexLock lock(entries_mutex);
   const auto found = entries.find(sender);
   return found == entries.end() ? quarn_caller{} : found->second->caller;
 }
@@ -311,22 +316,12 @@ quarn_caller read_credentials(GVariant *reply) {
 quarn_subject subject_of_call(const std::string &interface_name, const std::string &member,
                               GVariant *arguments) {
   quarn_subject subject{interface_name, member, "", -1, false};
-  if (arguments == nullptr || interface_name != kQuarnInterface) return subject;
-  const auto has_form = [arguments](const char *form) {
-    return g_variant_is_of_type(arguments, G_VARIANT_TYPE(form)) != FALSE;
-  };
-  if (member == "restore_enable" && has_form("(iissu)")) {
-    gint32 on = 0;
-    g_variant_get_child(arguments, 0, "i", &on);
-    g_variant_get_child(arguments, 1, "i", &subject.client);
-    subject.switches_on = on != 0;
-  } else if (member == "get_app_list" && has_form("(iu)")) {
-    g_variant_get_child(arguments, 0, "i", &subject.client);
-  } else if (has_form("(s)") || has_form("(su)")) {
-    const char *text = nullptr;
-    g_variant_get_child(arguments, 0, "&s", &text);
-    subject.package = text;
-  }
+  if (interface_name != kQuarnInterface) return subject;
+  const std::optional<quarn_arguments> given = read_quarn_arguments(member, arguments);
+  if (!given) return subject;
+  subject.client = given->client;
+  subject.switches_on = given->on != 0;
+  if (given->pkg_id != nullptr) subject.package = given->pkg_id;
   return subject;
 }
 
@@ -348,11 +343,11 @@ std::string refusal_text(const quarn_subject &subject, const caller_verdict &ver
 gid_t client_group() { return given_group ? *given_group : look_up_client_group(); }
 
 bool tells_of_refusal(const quarn_caller &caller) {
-  const std::lock_guard<std::mutex> lock(refusals_mutex);
+  const MutexLock lock(refused.mutex);
   const gint64 now = refusal_clock();
   end_refusals(now - kRefusalPeriod);
   refusals &of =
-      refused_callers.try_emplace(name_of_caller(caller), refusals{now, 0}).first->second;
+      refused.callers.try_emplace(name_of_caller(caller), refusals{now, 0}).first->second;
   return ++of.count <= kMostRefusalLines;
 }
 
@@ -372,7 +367,7 @@ bool count_request(const quarn_caller &caller) {
 
 void forget_callers() {
   {
-    const std::lock_guard<std::mutex> lock(refusals_mutex);
+    const MutexLock lock(refused.mutex);
     end_refusals(G_MAXINT64);
   }
   asking_callers.clear();

@@ -28,37 +28,38 @@ using caller_work = std::function<void(const quarn_caller &caller)>;
 void with_caller(GDBusConnection *connection, const std::string &sender, caller_work work);
 
 /** True while calls wait to learn who made them: the daemon is not idle then. */
-bool callers_are_asked_for();
+[[nodiscard]] bool callers_are_asked_for();
 
 /** What is known of a connection; `known` is false when nothing is. Any thread. */
-quarn_caller known_caller(const std::string &sender);
+[[nodiscard]] quarn_caller known_caller(const std::string &sender);
 
 /**
  * The same, asking the bus in place for what is not known.
  * @param ms how long the bus may take
  */
-quarn_caller ask_caller_now(GDBusConnection *connection, const std::string &sender, int ms);
+[[nodiscard]] quarn_caller ask_caller_now(GDBusConnection *connection, const std::string &sender,
+                                          int ms);
 
 /** Read a reply of the bus' GetConnectionCredentials, "(a{sv})". Any thread. */
-quarn_caller read_credentials(GVariant *reply);
+[[nodiscard]] quarn_caller read_credentials(GVariant *reply);
 
 /** What a call asks for. @param arguments may be null. Any thread. */
-quarn_subject subject_of_call(const std::string &interface_name, const std::string &member,
-                              GVariant *arguments);
+[[nodiscard]] quarn_subject subject_of_call(const std::string &interface_name,
+                                            const std::string &member, GVariant *arguments);
 
 /**
  * The verdict on a call. A refusal is logged with its caller and method, as tells_of_refusal()
  * says.
  * @param cloud_mode as for may_call()
  */
-caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
-                          const quarn_subject &subject, bool cloud_mode);
+[[nodiscard]] caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
+                                        const quarn_subject &subject, bool cloud_mode);
 
 /** The error text of a refusal. */
-std::string refusal_text(const quarn_subject &subject, const caller_verdict &verdict);
+[[nodiscard]] std::string refusal_text(const quarn_subject &subject, const caller_verdict &verdict);
 
 /** Number of the clients' group, -1 when the system has none. Any thread. */
-gid_t client_group();
+[[nodiscard]] gid_t client_group();
 
 /** Refusals of one caller that are told within kRefusalPeriod, each with its line. */
 inline constexpr unsigned int kMostRefusalLines = 60;
@@ -70,7 +71,7 @@ inline constexpr gint64 kRefusalPeriod = 60'000'000;
  * What is left out is counted, and told when the period is over or callers are forgotten. Any
  * thread.
  */
-bool tells_of_refusal(const quarn_caller &caller);
+[[nodiscard]] bool tells_of_refusal(const quarn_caller &caller);
 
 /** Requests of one application, over all its connections, that are accepted within kRequestPeriod.
  */
@@ -83,7 +84,7 @@ inline constexpr gint64 kRequestPeriod = 60'000'000;
  * of which an application may bring about so many and no more; who is trusted is not counted.
  * @return false when it is one too many
  */
-bool count_request(const quarn_caller &caller);
+[[nodiscard]] bool count_request(const quarn_caller &caller);
 
 /** Forget everything; for a connection that is left. */
 void forget_callers();

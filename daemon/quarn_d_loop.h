@@ -54,7 +54,7 @@ struct quarn_signal_watch {
  * quarn_loop_wake_from_signal().
  * @return false when the system has no room for it; signals are then lost
  */
-bool quarn_loop_watch_signals(const quarn_signal_watch &watch);
+[[nodiscard]] bool quarn_loop_watch_signals(const quarn_signal_watch &watch);
 
 /** Hand a signal over. Async-signal-safe. */
 void quarn_loop_wake_from_signal(int signo);

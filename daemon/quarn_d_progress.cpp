@@ -4,11 +4,11 @@
 #include <json-c/json.h>
 
 #include <deque>
-#include <mutex>
 
 #include "quarn_d_status.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -22,13 +22,17 @@ struct waiting_step {
   bool settled;
 };
 
-std::mutex waiting_mutex;
+/** What the main loop is still to send. */
+struct waiting_steps {
+  Mutex mutex;
+  std::deque<waiting_step> steps QUARN_GUARDED_BY(mutex);
+};
 /** Held while steps are sent, so that two senders cannot swap their order. */
-std::mutex publish_mutex;
+Mutex publish_mutex;
 
-std::deque<waiting_step> &waiting() {
-  static auto *steps = new std::deque<waiting_step>;
-  return *steps;
+waiting_steps &waiting() {
+  static auto *all = new waiting_steps;
+  return *all;
 }
 
 const char *stage_name(backup_stage stage) {
@@ -143,11 +147,11 @@ std::string text_of(json_object *object) {
 }
 
 void publish_waiting() {
-  const std::lock_guard<std::mutex> sending(publish_mutex);
+  const MutexLock sending(publish_mutex);
   std::deque<waiting_step> steps;
   {
-    const std::lock_guard<std::mutex> lock(waiting_mutex);
-    steps.swap(waiting());
+    const MutexLock lock(waiting().mutex);
+    steps.swap(waiting().steps);
   }
   for (const waiting_step &step : steps) {
     if (quarn_dbus_connection != nullptr) quarnd_dbus_publish(kSignal, step.text.c_str());
@@ -161,9 +165,10 @@ gboolean publish_later(gpointer) {
 
 void leave(waiting_step step) {
   bool first = false;
+  waiting_steps &all = waiting();
   {
-    const std::lock_guard<std::mutex> lock(waiting_mutex);
-    std::deque<waiting_step> &steps = waiting();
+    const MutexLock lock(all.mutex);
+    std::deque<waiting_step> &steps = all.steps;
     first = steps.empty();
     if (!first && !steps.back().settled && steps.back().subject == step.subject) {
       steps.back() = std::move(step);

@@ -16,8 +16,8 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 
 /** The JSON text of a step. */
-std::string backup_progress_text(const backup_progress &progress);
-std::string restore_progress_text(const restore_progress &progress);
+[[nodiscard]] std::string backup_progress_text(const backup_progress &progress);
+[[nodiscard]] std::string restore_progress_text(const restore_progress &progress);
 
 /** The engines' sinks. Any thread. */
 void note_backup_progress(const backup_progress &progress);

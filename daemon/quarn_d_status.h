@@ -3,9 +3,9 @@
  * @brief A second, read-only object that tells what the daemon knows of itself.
  *
  * "/org/orvane/Quarn/Status" serves the interface "org.orvane.Quarn.Status":
- * properties with change signals, nothing to call. Its further interface
- * "org.orvane.Quarn.CleanUp" is read at every look and walks over the packages. It is beside the
- * daemon's own object, whose one interface stays as it is.
+ * properties with change signals (quarn_d_status_properties.h), nothing to call. Its further
+ * interface "org.orvane.Quarn.CleanUp" is read at every look and walks over the packages. It is
+ * beside the daemon's own object, whose one interface stays as it is.
  */
 #ifndef QUARN_D_STATUS_H
 #define QUARN_D_STATUS_H
@@ -19,9 +19,6 @@ inline constexpr char kStatusInterface[] = "org.orvane.Quarn.Status";
 
 /** A further interface of that object: what a backup would leave in the cloud. */
 inline constexpr char kCleanUpInterface[] = "org.orvane.Quarn.CleanUp";
-
-/** The object's introspection document; data/org.orvane.Quarn.Status.xml is the same. */
-extern const char kStatusIntrospection[];
 
 /** Serve the object on @p connection, which the caller keeps alive. Main thread. */
 void quarnd_status_export(GDBusConnection *connection);

@@ -13,12 +13,12 @@
 #include <condition_variable>
 #include <csignal>
 #include <cstring>
-#include <mutex>
 #include <string>
 
 #include "detached_thread.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -26,8 +26,9 @@ constexpr mode_t kLockMode = 0600;
 constexpr std::size_t kWaiterStackSize = 131072;
 constexpr std::size_t kReadSize = 4096;
 
-// Never destroyed: threads wait here when the process ends.
-std::mutex &turn_mutex = *new std::mutex;
+// Never destroyed: threads wait here when the process ends. `turn` is read without the mutex, and
+// comes under it, so that who waits for the change misses none.
+Mutex &turn_mutex = *new Mutex;
 std::condition_variable &turn_changed = *new std::condition_variable;
 std::atomic<bool> turn{true};
 const char *lock_path = nullptr;
@@ -59,7 +60,7 @@ gboolean tell_observer(gpointer) {
 
 void take_turn() {
   {
-    const std::lock_guard<std::mutex> lock(turn_mutex);
+    const MutexLock lock(turn_mutex);
     turn = true;
   }
   turn_changed.notify_all();
@@ -163,8 +164,9 @@ void end_quarn_turn() {
 bool is_quarn_turn() { return turn; }
 
 bool wait_for_quarn_turn(int ms) {
-  std::unique_lock<std::mutex> lock(turn_mutex);
-  return turn_changed.wait_for(lock, std::chrono::milliseconds(ms), [] { return turn.load(); });
+  MutexLock lock(turn_mutex);
+  return turn_changed.wait_for(lock.waiting(), std::chrono::milliseconds(ms),
+                               [] { return turn.load(); });
 }
 
 bool tell_quarn_predecessor(const std::string &line, int signo) {

@@ -9,8 +9,16 @@
 #ifndef QUARN_D_TURN_H
 #define QUARN_D_TURN_H
 
+#include <csignal>
 #include <string>
 #include <vector>
+
+/** What a process sends its predecessor to cancel the backups that run there. */
+inline constexpr int kCancelSignal = SIGUSR1;
+/** And to withdraw what the callers have asked for whose names it has left. */
+inline constexpr int kWithdrawSignal = SIGUSR2;
+/** What it leaves in place of a caller's name when requests wait for its predecessor's end. */
+inline constexpr char kLeaveLine[] = "leave";
 
 /**
  * Ask for the turn without waiting for it. Once, on the main thread.
@@ -24,10 +32,10 @@ void begin_quarn_turn(const char *lock_file, bool (*prepare)(), void (*on_turn)(
 void end_quarn_turn();
 
 /** Any thread. */
-bool is_quarn_turn();
+[[nodiscard]] bool is_quarn_turn();
 
 /** Wait up to @p ms. @return is_quarn_turn(). Any thread but the main one. */
-bool wait_for_quarn_turn(int ms);
+[[nodiscard]] bool wait_for_quarn_turn(int ms);
 
 /**
  * Leave a line for the process whose turn it is, and send it a signal.
@@ -37,7 +45,7 @@ bool tell_quarn_predecessor(const std::string &line, int signo);
 
 /** The lines that later processes have left since the last look, or since the start. Main thread.
  */
-std::vector<std::string> take_quarn_turn_lines();
+[[nodiscard]] std::vector<std::string> take_quarn_turn_lines();
 
 /** Send a signal to the process whose turn it is. @return false when it is one's own. Any thread.
  */

@@ -3,8 +3,8 @@
 #include <iterator>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <utility>
+#include <variant>
 
 #include "quarn_common.h"
 #include "quarn_d_gate.h"
@@ -12,28 +12,30 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
+#include "quarn_dbus_method_call.h"
+#include "quarn_dbus_methods.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
-
-/** The reply to a call whose arguments are missing. */
-constexpr int kArgumentsMissing = -1;
-
-using MessagePtr = Handle<GDBusMessage, &g_object_unref>;
 
 struct delivered_call {
   MessagePtr message;
   quarn_call_form form;
   bool begun = false;
+  RecordPtr record = nullptr; /**< where it was accepted without being looked at */
 };
 
 /** Who called, and the number of the call among that connection's. */
 using call_key = std::pair<std::string, guint32>;
 
+struct call_table {
+  Mutex mutex;
+  std::map<call_key, delivered_call> calls QUARN_GUARDED_BY(mutex);
+  bool answered_all QUARN_GUARDED_BY(mutex) = false;
+};
 // Never destroyed: the bus thread lives as long as the process.
-std::mutex &calls_mutex = *new std::mutex;
-std::map<call_key, delivered_call> &calls = *new std::map<call_key, delivered_call>;
-bool answered_all = false;
+call_table &delivered = *new call_table;
 
 /** What a message takes beside its arguments. */
 constexpr std::size_t kBytesOfCall = 2048;
@@ -54,10 +56,13 @@ struct standing_call {
   bool of_root;
 };
 
-std::mutex &standing_mutex = *new std::mutex;
-std::map<std::string, standing_calls> &standing = *new std::map<std::string, standing_calls>;
-/** Of all but root. */
-std::size_t standing_bytes = 0;
+struct standing_table {
+  Mutex mutex;
+  std::map<std::string, standing_calls> senders QUARN_GUARDED_BY(mutex);
+  /** Of all but root. */
+  std::size_t bytes QUARN_GUARDED_BY(mutex) = 0;
+};
+standing_table &standing = *new standing_table;
 
 std::size_t bytes_of(GDBusMessage *message, quarn_call_form form) {
   GVariant *const body = g_dbus_message_get_body(message);
@@ -67,21 +72,20 @@ std::size_t bytes_of(GDBusMessage *message, quarn_call_form form) {
 
 void forget_standing(gpointer data) {
   const std::unique_ptr<standing_call> call(static_cast<standing_call *>(data));
-  const std::lock_guard<std::mutex> lock(standing_mutex);
-  const auto found = standing.find(call->sender);
+  const MutexLock lock(standing.mutex);
+  const auto found = standing.senders.find(call->sender);
   found->second.bytes -= call->bytes;
-  if (!call->of_root) standing_bytes -= call->bytes;
-  if (--found->second.count == 0) standing.erase(found);
+  if (!call->of_root) standing.bytes -= call->bytes;
+  if (--found->second.count == 0) standing.senders.erase(found);
 }
 
-/** Under standing_mutex. */
-bool has_room(const standing_call &call) {
+bool has_room(const standing_call &call) QUARN_REQUIRES(standing.mutex) {
   if (call.of_root) return true;
-  const auto found = standing.find(call.sender);
-  const standing_calls own = found == standing.end() ? standing_calls{} : found->second;
+  const auto found = standing.senders.find(call.sender);
+  const standing_calls own = found == standing.senders.end() ? standing_calls{} : found->second;
   if (own.count < kCallsAlwaysTaken && call.bytes <= kSmallCall) return true;
   return own.bytes + call.bytes <= kMostBytesOfConnection &&
-         standing_bytes + call.bytes <= kMostBytesOfConnections;
+         standing.bytes + call.bytes <= kMostBytesOfConnections;
 }
 
 std::string text_or_empty(const char *text) { return text == nullptr ? "" : text; }
@@ -112,56 +116,32 @@ bool is(GDBusMessage *message, const char *method) {
 }
 
 /** Accept a request that nobody has looked at, so that it has its last callback. */
-void accept(GDBusMessage *message, quarn_request kind) {
-  GVariant *const arguments = g_dbus_message_get_body(message);
-  const gsize count = g_variant_n_children(arguments);
-  auto *record = new client_cb_data{0, text_or_empty(g_dbus_message_get_sender(message))};
-  // The number is the last argument, and a package comes before it.
-  g_variant_get_child(arguments, count - 1, "u", &record->req_id);
-  const char *package = "";
-  if (kind == quarn_request::app_backup || kind == quarn_request::app_restore) {
-    g_variant_get_child(arguments, 0, "&s", &package);
-  }
-  quarn_dbus_accept_request(kind, package, record);
-}
-
-void accept_unlooked(GDBusMessage *message) {
-  static constexpr std::pair<const char *, quarn_request> kRequests[] = {
-      {"get_app_list", quarn_request::app_list},
-      {"manual_backup_start", quarn_request::manual_backup},
-      {"manual_backup_cancel", quarn_request::cancel},
-      {"app_data_backup_start", quarn_request::app_backup},
-      {"app_data_restore_start", quarn_request::app_restore}};
-  for (const auto &[method, kind] : kRequests) {
-    if (is(message, method)) accept(message, kind);
-  }
+void accept_unlooked(delivered_call *call) {
+  GDBusMessage *const message = call->message.get();
+  const std::string member = text_or_empty(g_dbus_message_get_member(message));
+  const served_method *const method = find_served_method(member);
+  const auto arguments = read_quarn_arguments(member, g_dbus_message_get_body(message));
+  if (method == nullptr || !arguments) return;
+  const auto *const request = std::get_if<method_of_request>(&method->handler);
+  if (request == nullptr) return;
+  call->record.reset(
+      new client_cb_data{arguments->req_id, text_or_empty(g_dbus_message_get_sender(message))});
+  quarn_dbus_accept_request(request->kind, text_or_empty(arguments->pkg_id), call->record.get());
 }
 
 /** The reply to a call of the right form whose work does not end, or does not begin. */
-void answer_cancelled(GDBusMessage *message) {
-  gint32 first = 0;
-  if (is(message, "last_bu_time")) {
-    unsigned long long timestamp = 0;
-    quarnd_get_last_backed_up_time(&timestamp);
-    reply(message, g_variant_new("(t)", static_cast<guint64>(timestamp)));
-  } else if (is(message, "auto_backup_start")) {
-    reply(message, nullptr);
-  } else if (is(message, "restore_enable")) {
-    g_variant_get_child(g_dbus_message_get_body(message), 0, "i", &first);
-    // Without this process there is no restore mode.
-    reply_int(message, first != 0 ? QUARN_REFUSED : QUARN_OK);
-  } else if (is(message, "manual_backup_start") || is(message, "manual_backup_cancel") ||
-             is(message, "app_data_backup_start") || is(message, "app_data_restore_start")) {
-    reply_int(message, QUARN_OK);  // the callback tells
-  } else {
-    reply_int(message, QUARN_CANCELLED);
-  }
+void answer_unlooked(GDBusMessage *message) {
+  const std::string member = text_or_empty(g_dbus_message_get_member(message));
+  const served_method *const method = find_served_method(member);
+  const auto arguments = read_quarn_arguments(member, g_dbus_message_get_body(message));
+  if (method == nullptr) return;
+  reply(message, method->reply_unlooked(arguments.value_or(quarn_arguments{})));
 }
 
 void answer(GDBusMessage *message, quarn_call_form form) {
   switch (form) {
     case quarn_call_form::right:
-      return answer_cancelled(message);
+      return answer_unlooked(message);
     case quarn_call_form::without_arguments:
       return reply_int(message, kArgumentsMissing);
     case quarn_call_form::other_arguments:
@@ -212,12 +192,12 @@ bool take_quarn_call(GDBusMessage *message, quarn_call_form form) {
   auto call = std::make_unique<standing_call>(
       standing_call{sender, bytes_of(message, form), caller.known && caller.uid == 0});
   {
-    const std::lock_guard<std::mutex> lock(standing_mutex);
+    const MutexLock lock(standing.mutex);
     if (!has_room(*call)) return false;
-    standing_calls &own = standing[sender];
+    standing_calls &own = standing.senders[sender];
     ++own.count;
     own.bytes += call->bytes;
-    if (!call->of_root) standing_bytes += call->bytes;
+    if (!call->of_root) standing.bytes += call->bytes;
   }
   static const GQuark kStanding = g_quark_from_static_string("quarn-standing-call");
   g_object_set_qdata_full(G_OBJECT(message), kStanding, call.release(), forget_standing);
@@ -228,14 +208,14 @@ void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message) {
   const std::string sender = text_or_empty(g_dbus_message_get_sender(message));
   bool first = true;
   {
-    const std::lock_guard<std::mutex> lock(standing_mutex);
-    const auto found = standing.find(sender);
-    if (found != standing.end()) first = !std::exchange(found->second.refused, true);
+    const MutexLock lock(standing.mutex);
+    const auto found = standing.senders.find(sender);
+    if (found != standing.senders.end()) first = !std::exchange(found->second.refused, true);
   }
   if (first && tells_of_refusal(known_caller(sender))) {
     LOGE("refused : too many calls of (%s) wait", sender.c_str());
   }
-  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+  if (wants_no_reply(message)) return;
   const MessagePtr answer(g_dbus_message_new_method_error_literal(
       message, "org.freedesktop.DBus.Error.LimitsExceeded", "Too many calls are waiting"));
   g_dbus_connection_send_message(connection, answer.get(), G_DBUS_SEND_MESSAGE_FLAGS_NONE, nullptr,
@@ -243,12 +223,12 @@ void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message) {
 }
 
 void note_quarn_call(GDBusMessage *message, quarn_call_form form) {
-  if ((g_dbus_message_get_flags(message) & G_DBUS_MESSAGE_FLAGS_NO_REPLY_EXPECTED) != 0) return;
+  if (wants_no_reply(message)) return;
   const call_key key(text_or_empty(g_dbus_message_get_sender(message)),
                      g_dbus_message_get_serial(message));
   MessagePtr held(G_DBUS_MESSAGE(g_object_ref(message)));
-  const std::lock_guard<std::mutex> lock(calls_mutex);
-  calls.insert_or_assign(key, delivered_call{std::move(held), form});
+  const MutexLock lock(delivered.mutex);
+  delivered.calls.insert_or_assign(key, delivered_call{std::move(held), form});
 }
 
 void note_quarn_answer(GDBusMessage *message) {
@@ -256,24 +236,24 @@ void note_quarn_answer(GDBusMessage *message) {
   if (type != G_DBUS_MESSAGE_TYPE_METHOD_RETURN && type != G_DBUS_MESSAGE_TYPE_ERROR) return;
   const call_key key(text_or_empty(g_dbus_message_get_destination(message)),
                      g_dbus_message_get_reply_serial(message));
-  const std::lock_guard<std::mutex> lock(calls_mutex);
-  calls.erase(key);
+  const MutexLock lock(delivered.mutex);
+  delivered.calls.erase(key);
 }
 
 bool begin_quarn_call(const std::string &sender, guint32 serial) {
-  const std::lock_guard<std::mutex> lock(calls_mutex);
-  if (answered_all) return false;
-  const auto found = calls.find({sender, serial});
-  if (found != calls.end()) found->second.begun = true;
+  const MutexLock lock(delivered.mutex);
+  if (delivered.answered_all) return false;
+  const auto found = delivered.calls.find({sender, serial});
+  if (found != delivered.calls.end()) found->second.begun = true;
   return true;
 }
 
 void answer_quarn_calls() {
   std::map<call_key, delivered_call> left;
   {
-    const std::lock_guard<std::mutex> lock(calls_mutex);
-    answered_all = true;
-    left.swap(calls);
+    const MutexLock lock(delivered.mutex);
+    delivered.answered_all = true;
+    left.swap(delivered.calls);
   }
   for (auto call = left.begin(); call != left.end();) {
     // What is begun has passed.
@@ -281,8 +261,8 @@ void answer_quarn_calls() {
         !call->second.begun && refuse_unlooked(call->second.message.get(), call->second.form);
     call = refused ? left.erase(call) : std::next(call);
   }
-  for (const auto &[key, call] : left) {
-    if (!call.begun && call.form == quarn_call_form::right) accept_unlooked(call.message.get());
+  for (auto &[key, call] : left) {
+    if (!call.begun && call.form == quarn_call_form::right) accept_unlooked(&call);
   }
   quarn_dbus_end_requests();
   for (const auto &[key, call] : left) answer(call.message.get(), call.form);

@@ -36,7 +36,7 @@ inline constexpr std::size_t kCallsAlwaysTaken = 4;
  * @return false when its connection, or all of them, have sent too much that
  * waits; it is to be kept nowhere then
  */
-bool take_quarn_call(GDBusMessage *message, quarn_call_form form);
+[[nodiscard]] bool take_quarn_call(GDBusMessage *message, quarn_call_form form);
 /** The answer to a call that was not taken; the first of a row is logged. Bus thread. */
 void refuse_untaken_call(GDBusConnection *connection, GDBusMessage *message);
 
@@ -49,7 +49,7 @@ void note_quarn_answer(GDBusMessage *message);
  * A call is about to be served.
  * @return false when answer_quarn_calls() has it: it is to be left alone
  */
-bool begin_quarn_call(const std::string &sender, guint32 serial);
+[[nodiscard]] bool begin_quarn_call(const std::string &sender, guint32 serial);
 
 /**
  * Answer what has no answer, last callbacks first. Calls that would begin work
@@ -58,6 +58,7 @@ bool begin_quarn_call(const std::string &sender, guint32 serial);
 void answer_quarn_calls();
 
 /** The error text for a method that the interface does not have. */
-std::string unknown_method_text(const std::string &method, const std::string &interface_name);
+[[nodiscard]] std::string unknown_method_text(const std::string &method,
+                                              const std::string &interface_name);
 
 #endif

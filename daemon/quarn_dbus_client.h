@@ -51,7 +51,7 @@ void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void
  */
 void quarn_dbus_stop_waiting();
 /** True after quarn_dbus_stop_waiting(). */
-bool quarn_dbus_waiting_stopped();
+[[nodiscard]] bool quarn_dbus_waiting_stopped();
 
 /** The calling thread is the one whose loop must never stand still. */
 void quarn_dbus_note_main_thread();
@@ -68,7 +68,7 @@ using callback_patience = bool (*)(const std::string &sender);
 /** @param exhausted null: as long as the time-out */
 void quarn_dbus_set_patience(callback_patience exhausted);
 /** Microseconds that were spent off the main thread on waiting for answers. Any thread. */
-std::int64_t quarn_dbus_time_waited();
+[[nodiscard]] std::int64_t quarn_dbus_time_waited();
 
 /** Tell each accepted request that has not had its last callback that it is cancelled. */
 void quarn_dbus_end_requests();

@@ -1,6 +1,11 @@
 #include "quarn_dbus_limits.h"
 
+#include <algorithm>
 #include <cstring>
+#include <iterator>
+#include <optional>
+
+#include "quarn_d_methods.h"
 
 namespace {
 
@@ -8,22 +13,34 @@ std::string sentence(const char *what, std::size_t bound, const char *unit) {
   return std::string(what) + " has more than " + std::to_string(bound) + " " + unit;
 }
 
+/** @p text is null where the method has no such argument; likewise below. */
 std::string excess_of_list(const char *text) {
-  if (std::strlen(text) > kMostListBytes) return sentence("pkg_list", kMostListBytes, "bytes");
+  if (text == nullptr) return "";
+  if (std::strlen(text) > kMostListBytes) return sentence(kPkgList.name, kMostListBytes, "bytes");
   if (most_elements_of(text) > kMostCandidates) {
-    return sentence("pkg_list", kMostCandidates, "packages");
+    return sentence(kPkgList.name, kMostCandidates, "packages");
   }
   return "";
 }
 
 std::string excess_of_name(const char *what, const char *text) {
-  return std::strlen(text) > kMostNameBytes ? sentence(what, kMostNameBytes, "bytes") : "";
+  return text != nullptr && std::strlen(text) > kMostNameBytes
+             ? sentence(what, kMostNameBytes, "bytes")
+             : "";
+}
+
+bool has_list(const quarn_method &method) {
+  return std::any_of(std::begin(method.arguments), std::end(method.arguments),
+                     [](const quarn_argument &argument) {
+                       return argument.text != nullptr && argument.text == kPkgList.text;
+                     });
 }
 
 }  // namespace
 
 std::size_t most_argument_bytes(const char *member) {
-  return g_strcmp0(member, "restore_enable") == 0 ? kMostListArgumentBytes : kMostArgumentBytes;
+  const quarn_method *const method = find_quarn_method(member);
+  return method != nullptr && has_list(*method) ? kMostListArgumentBytes : kMostArgumentBytes;
 }
 
 std::size_t most_elements_of(const char *text) {
@@ -42,20 +59,9 @@ std::size_t most_elements_of(const char *text) {
 }
 
 std::string excess_of_arguments(const std::string &member, GVariant *arguments) {
-  if (arguments == nullptr) return "";
-  const auto has_form = [arguments](const char *form) {
-    return g_variant_is_of_type(arguments, G_VARIANT_TYPE(form)) != FALSE;
-  };
-  if (member == "restore_enable" && has_form("(iissu)")) {
-    const char *serial_num = nullptr;
-    const char *pkg_list = nullptr;
-    g_variant_get_child(arguments, 2, "&s", &serial_num);
-    g_variant_get_child(arguments, 3, "&s", &pkg_list);
-    const std::string excess = excess_of_name("serial_num", serial_num);
-    return excess.empty() ? excess_of_list(pkg_list) : excess;
-  }
-  if (member == "auto_backup_start" || (!has_form("(s)") && !has_form("(su)"))) return "";
-  const char *pkg_id = nullptr;
-  g_variant_get_child(arguments, 0, "&s", &pkg_id);
-  return excess_of_name("pkg_id", pkg_id);
+  const std::optional<quarn_arguments> given = read_quarn_arguments(member, arguments);
+  if (!given) return "";
+  std::string excess = excess_of_name(kSerialNum.name, given->serial_num);
+  if (excess.empty()) excess = excess_of_list(given->pkg_list);
+  return excess.empty() ? excess_of_name(kPkgId.name, given->pkg_id) : excess;
 }

@@ -24,16 +24,16 @@ inline constexpr std::size_t kMostNameBytes = 255;
 inline constexpr char kArgumentsTooLarge[] = "The arguments are too large";
 
 /** How many bytes the arguments of a method may have, before anyone looks into them. */
-std::size_t most_argument_bytes(const char *member);
+[[nodiscard]] std::size_t most_argument_bytes(const char *member);
 
 /**
  * What is too much in a call's arguments.
  * @param arguments those of the interface's method, or null
  * @return a sentence, empty when all is within the bounds
  */
-std::string excess_of_arguments(const std::string &member, GVariant *arguments);
+[[nodiscard]] std::string excess_of_arguments(const std::string &member, GVariant *arguments);
 
 /** Elements of the JSON array @p text: never less than it has, without parsing it. */
-std::size_t most_elements_of(const char *text);
+[[nodiscard]] std::size_t most_elements_of(const char *text);
 
 #endif

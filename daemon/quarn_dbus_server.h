@@ -1,6 +1,6 @@
 /**
  * @file quarn_dbus_server.h
- * @brief The bus name, the introspection data and the one method dispatcher.
+ * @brief The bus name, and the object that is served under it.
  *
  * Main thread only, where not told otherwise.
  */
@@ -9,28 +9,16 @@
 
 #include <gio/gio.h>
 
-#include <csignal>
-
-/** What a process sends its predecessor to cancel the backups that run there. */
-inline constexpr int kCancelSignal = SIGUSR1;
-/** And to withdraw what the callers have asked for whose names it has left. */
-inline constexpr int kWithdrawSignal = SIGUSR2;
-/** What it leaves in place of a caller's name when requests wait for its predecessor's end. */
-inline constexpr char kLeaveLine[] = "leave";
-
-/** The introspection document: tabs between its elements. */
-extern const char quarn_introspection_xml[];
-
 /** Who is told of the connection once the object is served; set before quarnd_dbus_init(). */
 void set_bus_acquired_hook(void (*hook)(GDBusConnection *connection));
 
 /** Own the bus name and serve the object. @return owner id, or (unsigned) -1 */
-unsigned int quarnd_dbus_init();
+[[nodiscard]] unsigned int quarnd_dbus_init();
 
 /** True while calls wait for an earlier process to end. */
-bool quarnd_calls_deferred();
+[[nodiscard]] bool quarnd_calls_deferred();
 /** True while calls wait for what the bus has to tell of them. */
-bool quarnd_calls_unjudged();
+[[nodiscard]] bool quarnd_calls_unjudged();
 /** The earlier process has ended: dispatch the calls that wait for it. */
 void quarnd_dispatch_deferred();
 

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <map>
-#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -12,16 +11,17 @@
 #include "quarn_d_utils/device_info.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
 struct claims {
-  std::mutex mutex;
-  std::string awaited_serial;
+  Mutex mutex;
+  std::string awaited_serial QUARN_GUARDED_BY(mutex);
   /** What restore mode waits for, and whether it was installed already. */
-  std::map<std::string, bool> awaited;
+  std::map<std::string, bool> awaited QUARN_GUARDED_BY(mutex);
   /** Serial and package of restores under way, with their number. */
-  std::map<std::pair<std::string, std::string>, int> held;
+  std::map<std::pair<std::string, std::string>, int> held QUARN_GUARDED_BY(mutex);
 };
 
 claims &all_claims() {
@@ -30,7 +30,8 @@ claims &all_claims() {
   return *all;
 }
 
-archive_claim claim_of(const claims &all, const std::string &serial, const std::string &package) {
+archive_claim claim_of(claims &all, const std::string &serial, const std::string &package)
+    QUARN_REQUIRES(all.mutex) {
   if (all.held.count({serial, package}) != 0) return archive_claim::whole;
   if (serial != all.awaited_serial) return archive_claim::none;
   const auto found = all.awaited.find(package);
@@ -79,7 +80,7 @@ archive_hold::archive_hold(std::string serial, std::string package)
     : serial_(std::move(serial)), package_(std::move(package)) {
   if (package_.empty()) return;
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   ++all.held[{serial_, package_}];
 }
 
@@ -99,7 +100,7 @@ archive_hold::~archive_hold() { release(); }
 void archive_hold::release() {
   if (package_.empty()) return;
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   const auto held = all.held.find({serial_, package_});
   if (--held->second == 0) all.held.erase(held);
   package_.clear();
@@ -108,7 +109,7 @@ void archive_hold::release() {
 void await_archives(const std::string &serial, const std::vector<std::string> &packages,
                     const std::set<std::string> &installed) {
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   all.awaited_serial = serial;
   all.awaited.clear();
   for (const std::string &package : packages) {
@@ -120,13 +121,13 @@ void await_no_archives() { await_archives("", {}, {}); }
 
 void stop_awaiting_archive(const std::string &package) {
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   all.awaited.erase(package);
 }
 
 void note_awaited_package_removed(const std::string &package) {
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   const auto found = all.awaited.find(package);
   if (found != all.awaited.end()) found->second = false;
 }
@@ -134,7 +135,7 @@ void note_awaited_package_removed(const std::string &package) {
 archive_claim claim_on_archive(const std::string &serial, const std::string &package) {
   const archive_claim owed = owed_claim(serial, package);
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   return std::max(owed, claim_of(all, serial, package));
 }
 
@@ -142,7 +143,7 @@ std::vector<std::string> claimed_packages(const std::string &serial) {
   const std::vector<std::string> owed = owed_packages(serial);
   std::set<std::string> packages(owed.begin(), owed.end());
   claims &all = all_claims();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   if (serial == all.awaited_serial) {
     for (const auto &awaited : all.awaited) packages.insert(awaited.first);
   }

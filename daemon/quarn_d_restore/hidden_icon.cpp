@@ -5,7 +5,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <mutex>
 #include <set>
 #include <string>
 
@@ -16,6 +15,7 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -23,9 +23,9 @@ constexpr mode_t kNoteMode = 0600;
 /** Of every type, as icons are hidden. */
 constexpr const char *kAnyPackageType = nullptr;
 
-std::mutex hidden_mutex;
+Mutex hidden_mutex;
 /** Packages whose icon this process hides, and will show itself. */
-std::set<std::string> &hidden_here() {
+std::set<std::string> &hidden_here() QUARN_REQUIRES(hidden_mutex) {
   static auto *packages = new std::set<std::string>;
   return *packages;
 }
@@ -49,7 +49,7 @@ bool is_noted(const restore_files &files) {
 
 bool note_hidden_icon(const char *pkgid, const char *root) {
   const restore_files files(pkgid, root);
-  const std::lock_guard<std::mutex> lock(hidden_mutex);
+  const MutexLock lock(hidden_mutex);
   hidden_here().insert(pkgid);
   if (is_noted(files)) return true;
   const UniqueFd note =
@@ -58,7 +58,7 @@ bool note_hidden_icon(const char *pkgid, const char *root) {
 }
 
 void forget_hidden_icon(const char *pkgid, const char *root) {
-  const std::lock_guard<std::mutex> lock(hidden_mutex);
+  const MutexLock lock(hidden_mutex);
   hidden_here().erase(pkgid);
   const restore_files files(pkgid, root);
   if (is_noted(files)) remove_note(files);
@@ -66,7 +66,7 @@ void forget_hidden_icon(const char *pkgid, const char *root) {
 
 void show_hidden_icon(const char *pkgid, const char *root) {
   const restore_files files(pkgid, root);
-  const std::lock_guard<std::mutex> lock(hidden_mutex);
+  const MutexLock lock(hidden_mutex);
   if (hidden_here().count(pkgid) != 0 || !is_noted(files)) return;
   const PkgClientPtr client(pkgmgr_client_new(PC_REQUEST));
   const int result = client == nullptr

@@ -1,22 +1,22 @@
 #include "quarn_d_utils/admission.h"
 
 #include <map>
-#include <mutex>
 #include <set>
 
 #include "quarn_d_utils/fiber.h"
+#include "thread_annotations.h"
 
 namespace {
 
 struct waiting_table {
-  std::mutex mutex;
-  std::size_t count = 0;
+  Mutex mutex;
+  std::size_t count QUARN_GUARDED_BY(mutex) = 0;
   /** By caller, the numbers of the fibers; 0 for a request that came without one. */
-  std::map<std::string, std::multiset<std::uint64_t>> callers;
+  std::map<std::string, std::multiset<std::uint64_t>> callers QUARN_GUARDED_BY(mutex);
   /** Of all but root, over all connections of a caller. */
-  std::map<std::string, std::size_t> parties;
-  std::size_t others = 0;
-  std::size_t applications = 0;
+  std::map<std::string, std::size_t> parties QUARN_GUARDED_BY(mutex);
+  std::size_t others QUARN_GUARDED_BY(mutex) = 0;
+  std::size_t applications QUARN_GUARDED_BY(mutex) = 0;
 };
 
 waiting_table &table() {
@@ -29,7 +29,7 @@ class counted_request {
  public:
   counted_request(const std::string &caller, const waiting_parties &parties)
       : caller_(caller), parties_(parties), fiber_(fiber_id(current_fiber())) {
-    const std::lock_guard<std::mutex> lock(table().mutex);
+    const MutexLock lock(table().mutex);
     table().callers[caller_].insert(fiber_);
     ++table().count;
     if (parties_.caller.empty()) return;
@@ -38,7 +38,7 @@ class counted_request {
     if (parties_.is_application) ++table().applications;
   }
   ~counted_request() {
-    const std::lock_guard<std::mutex> lock(table().mutex);
+    const MutexLock lock(table().mutex);
     const auto entry = table().callers.find(caller_);
     entry->second.erase(entry->second.find(fiber_));
     if (entry->second.empty()) table().callers.erase(entry);
@@ -61,7 +61,7 @@ class counted_request {
 }  // namespace
 
 bool may_wait(const std::string &caller, const waiting_parties &parties) {
-  const std::lock_guard<std::mutex> lock(table().mutex);
+  const MutexLock lock(table().mutex);
   const auto entry = table().callers.find(caller);
   const std::size_t own = entry == table().callers.end() ? 0 : entry->second.size();
   if (own >= kMaxWaitingOfCaller || table().count >= kMaxWaiting) return false;
@@ -78,12 +78,12 @@ std::shared_ptr<const void> count_waiting(const std::string &caller,
 }
 
 std::size_t waiting_requests() {
-  const std::lock_guard<std::mutex> lock(table().mutex);
+  const MutexLock lock(table().mutex);
   return table().count;
 }
 
 std::vector<std::uint64_t> fibers_of_caller(const std::string &caller) {
-  const std::lock_guard<std::mutex> lock(table().mutex);
+  const MutexLock lock(table().mutex);
   const auto entry = table().callers.find(caller);
   if (entry == table().callers.end()) return {};
   return {entry->second.begin(), entry->second.end()};

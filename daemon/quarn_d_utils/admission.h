@@ -30,19 +30,19 @@ struct waiting_parties {
 };
 
 /** True when another request of @p caller, a unique bus name, may be accepted. Any thread. */
-bool may_wait(const std::string &caller, const waiting_parties &parties = {});
+[[nodiscard]] bool may_wait(const std::string &caller, const waiting_parties &parties = {});
 
 /**
  * Count a request that the running fiber, if it is one, works on.
  * @return it counts until this goes, on any thread
  */
-std::shared_ptr<const void> count_waiting(const std::string &caller,
-                                          const waiting_parties &parties = {});
+[[nodiscard]] std::shared_ptr<const void> count_waiting(const std::string &caller,
+                                                        const waiting_parties &parties = {});
 
 /** Requests that count. Any thread. */
-std::size_t waiting_requests();
+[[nodiscard]] std::size_t waiting_requests();
 
 /** The fibers, by number, that @p caller's requests were accepted on; some may have ended. */
-std::vector<std::uint64_t> fibers_of_caller(const std::string &caller);
+[[nodiscard]] std::vector<std::uint64_t> fibers_of_caller(const std::string &caller);
 
 #endif

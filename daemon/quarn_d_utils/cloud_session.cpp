@@ -7,13 +7,13 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
-#include <mutex>
 #include <vector>
 
 #include "backup_transport.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 std::atomic<bool> cloud_init_done{false};
 std::atomic<backup_trans_handle_h> _g_handle{nullptr};
@@ -33,21 +33,22 @@ struct wait_record {
   bool waiting = false; /**< the nested loop runs */
 };
 
-// Guards what follows, and the flags of the records in the list. The library
+// Guards also the flags of the records in the list. The library
 // is handed the number of an attempt, not a record, so an answer that comes
 // late or never leaves nothing behind.
-std::mutex session_mutex;
+Mutex session_mutex;
 std::condition_variable session_answered;
-std::vector<wait_record *> wait_records;
-AttemptId last_attempt = kNoAttempt;
-AttemptId running_attempt = kNoAttempt; /**< started, not answered, not timed out */
+std::vector<wait_record *> wait_records QUARN_GUARDED_BY(session_mutex);
+AttemptId last_attempt QUARN_GUARDED_BY(session_mutex) = kNoAttempt;
+/** Started, not answered, not timed out. */
+AttemptId running_attempt QUARN_GUARDED_BY(session_mutex) = kNoAttempt;
 
-/** Under session_mutex: the next call starts anew. */
-void end_attempt(AttemptId attempt) {
+/** The next call starts anew. */
+void end_attempt(AttemptId attempt) QUARN_REQUIRES(session_mutex) {
   if (running_attempt == attempt) running_attempt = kNoAttempt;
 }
 
-void wake(wait_record *record) {
+void wake(wait_record *record) QUARN_REQUIRES(session_mutex) {
   record->answered = true;
   if (record->waiting) {
     g_main_loop_quit(record->loop);
@@ -57,7 +58,7 @@ void wake(wait_record *record) {
 
 /** An attempt has its answer; a transport that is ready answers every attempt. */
 void answer(AttemptId attempt) {
-  const std::lock_guard<std::mutex> lock(session_mutex);
+  const MutexLock lock(session_mutex);
   end_attempt(attempt);
   for (wait_record *record : wait_records) {
     if (record->attempt == attempt || cloud_init_done) wake(record);
@@ -93,7 +94,7 @@ void log_timeout() {
 gboolean _waiting_timeout(gpointer user_data) {
   auto *record = static_cast<wait_record *>(user_data);
   log_timeout();
-  const std::lock_guard<std::mutex> lock(session_mutex);
+  const MutexLock lock(session_mutex);
   record->timeout_source = 0;
   if (record->waiting) {
     g_main_loop_quit(record->loop);
@@ -108,7 +109,7 @@ bool on_main_thread() { return gettid() == getpid(); }
 void wait_in_nested_loop(wait_record *record) {
   const GMainLoopPtr loop(new_wait_loop());
   {
-    const std::lock_guard<std::mutex> lock(session_mutex);
+    const MutexLock lock(session_mutex);
     if (record->answered) return;
     record->loop = loop.get();
     record->waiting = true;
@@ -117,22 +118,22 @@ void wait_in_nested_loop(wait_record *record) {
   }
   run_nested_loop(loop.get());
 
-  const std::lock_guard<std::mutex> lock(session_mutex);
+  const MutexLock lock(session_mutex);
   record->waiting = false;
   if (record->timeout_source != 0) g_source_remove(record->timeout_source);
 }
 
 void wait_on_condition(wait_record *record) {
-  std::unique_lock<std::mutex> lock(session_mutex);
+  MutexLock lock(session_mutex);
   const auto timeout = std::chrono::seconds(cloud_init_timeout_seconds);
-  if (!session_answered.wait_for(lock, timeout, [record] { return record->answered; })) {
+  if (!session_answered.wait_for(lock.waiting(), timeout, [record] { return record->answered; })) {
     log_timeout();
   }
 }
 
 /** Join the attempt that is running. @return true when the caller is to make a new one */
 bool join_attempt(wait_record *record) {
-  const std::lock_guard<std::mutex> lock(session_mutex);
+  const MutexLock lock(session_mutex);
   if (cloud_init_done) {
     // Answered since the caller looked.
     record->answered = true;
@@ -146,7 +147,7 @@ bool join_attempt(wait_record *record) {
 }
 
 void leave_attempt(wait_record *record) {
-  const std::lock_guard<std::mutex> lock(session_mutex);
+  const MutexLock lock(session_mutex);
   wait_records.erase(std::remove(wait_records.begin(), wait_records.end(), record),
                      wait_records.end());
   const bool others_wait =

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
@@ -11,6 +10,7 @@
 #include "quarn_d_utils/package.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -25,13 +25,13 @@ struct icon_hide_delay_arg {
 };
 using IconHidePtr = std::unique_ptr<icon_hide_delay_arg>;
 
-std::vector<IconHidePtr> icon_hide_delay_timer_list;
-std::mutex icon_hide_delay_mutex;
+Mutex icon_hide_delay_mutex;
+std::vector<IconHidePtr> icon_hide_delay_timer_list QUARN_GUARDED_BY(icon_hide_delay_mutex);
 
 /** Take the first pending hide that @p wanted picks out of the list; null when there is none. */
 template <typename Wanted>
 IconHidePtr take_pending_hide(Wanted wanted) {
-  const std::lock_guard<std::mutex> lock(icon_hide_delay_mutex);
+  const MutexLock lock(icon_hide_delay_mutex);
   const auto found =
       std::find_if(icon_hide_delay_timer_list.begin(), icon_hide_delay_timer_list.end(), wanted);
   if (found == icon_hide_delay_timer_list.end()) return nullptr;
@@ -69,7 +69,7 @@ Eina_Bool _icon_hide_delay_cb(void *data) {
 void show_icon(const char *pkg_id) {
   delete_icon_hide_delay_timer(pkg_id);
   {
-    const std::lock_guard<std::mutex> lock(installed_check_mutex);
+    const MutexLock lock(installed_check_mutex);
     install_complete_pkgs.emplace_back(pkg_id);
   }
   const int ret = activate(pkg_id);
@@ -92,7 +92,7 @@ void hide_icon_now(const char *pkg_id) {
 void hide_icon_later(const char *pkg_id, double delay) {
   auto arg = std::make_unique<icon_hide_delay_arg>();
   arg->pkg_id = pkg_id;
-  const std::lock_guard<std::mutex> lock(icon_hide_delay_mutex);
+  const MutexLock lock(icon_hide_delay_mutex);
   arg->timer = ecore_timer_add(delay, _icon_hide_delay_cb, arg.get());
   if (arg->timer == nullptr) {
     LOGE("fail to hide icon of (%s) by delay... err:%d", pkg_id, PKGMGR_R_ERROR);
@@ -121,13 +121,13 @@ void delete_icon_hide_delay_timer(const char *pkg_id) {
 
 void init_icon_hide_delay_timer_list() {
   LOGI("init_icon_hide_delay_timer_list");
-  const std::lock_guard<std::mutex> lock(icon_hide_delay_mutex);
+  const MutexLock lock(icon_hide_delay_mutex);
   for (const IconHidePtr &arg : icon_hide_delay_timer_list) ecore_timer_del(arg->timer);
   icon_hide_delay_timer_list.clear();
 }
 
 void init_install_complete_pkgs_list() {
   LOGI("init_install_complete_pkgs_list");
-  const std::lock_guard<std::mutex> lock(installed_check_mutex);
+  const MutexLock lock(installed_check_mutex);
   install_complete_pkgs.clear();
 }

@@ -18,13 +18,13 @@
  * A loop for run_nested_loop(). g_main_loop_quit() may come at any time and
  * from any thread, also before the wait begins. The caller's.
  */
-GMainLoop *new_wait_loop();
+[[nodiscard]] GMainLoop *new_wait_loop();
 
 /**
  * True when the running request is not to wait any more: it was withdrawn, or
  * the process ends. run_nested_loop() then returns at once. Any thread.
  */
-bool waits_are_ended();
+[[nodiscard]] bool waits_are_ended();
 
 /**
  * Wait for a client's answer to a callback: as run_nested_loop(), but nobody

@@ -12,7 +12,7 @@
 #include "quarn_log.h"
 
 std::vector<std::string> install_complete_pkgs;
-std::mutex installed_check_mutex;
+Mutex installed_check_mutex;
 
 namespace {
 
@@ -75,7 +75,7 @@ bool backup_enabled_app(const char *appid) {
 }
 
 bool already_installed_package(const char *pkgid) {
-  const std::lock_guard<std::mutex> lock(installed_check_mutex);
+  const MutexLock lock(installed_check_mutex);
   for (const std::string &installed : install_complete_pkgs) {
     if (installed == pkgid) return true;
   }

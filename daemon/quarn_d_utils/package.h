@@ -8,13 +8,14 @@
 #ifndef QUARN_D_UTILS_PACKAGE_H
 #define QUARN_D_UTILS_PACKAGE_H
 
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include "thread_annotations.h"
+
+extern Mutex installed_check_mutex;
 /** Packages whose installation completed since the list was last cleared. */
-extern std::vector<std::string> install_complete_pkgs;
-extern std::mutex installed_check_mutex;
+extern std::vector<std::string> install_complete_pkgs QUARN_GUARDED_BY(installed_check_mutex);
 
 /** True when the application's API version is at least @p version, compared as bytes. */
 bool app_support_api_version(const char *appid, const char *version);

@@ -1,18 +1,19 @@
 #include "quarn_d_utils/package_lock.h"
 
 #include <condition_variable>
-#include <mutex>
 #include <optional>
+
+#include "thread_annotations.h"
 
 namespace {
 
 /** Which package is packed and which is changed. */
 struct Uses {
-  std::mutex mutex;
+  Mutex mutex;
   std::condition_variable ended;
-  std::optional<std::string> packed;
-  std::optional<std::string> changed;
-  void (*packing_ended)() = nullptr;
+  std::optional<std::string> packed QUARN_GUARDED_BY(mutex);
+  std::optional<std::string> changed QUARN_GUARDED_BY(mutex);
+  void (*packing_ended)() QUARN_GUARDED_BY(mutex) = nullptr;
 };
 
 Uses &uses() {
@@ -25,7 +26,7 @@ Uses &uses() {
 PackageDataLock::PackageDataLock(const std::string &pkg_id, PackageUse use)
     : packs_(use == PackageUse::kPack), held_(true) {
   Uses &all = uses();
-  std::unique_lock<std::mutex> lock(all.mutex);
+  MutexLock lock(all.mutex);
   std::optional<std::string> &mine = packs_ ? all.packed : all.changed;
   const std::optional<std::string> &other = packs_ ? all.changed : all.packed;
   while (mine || other == pkg_id) {
@@ -33,7 +34,7 @@ PackageDataLock::PackageDataLock(const std::string &pkg_id, PackageUse use)
       held_ = false;
       return;
     }
-    all.ended.wait(lock);
+    all.ended.wait(lock.waiting());
   }
   mine = pkg_id;
 }
@@ -43,7 +44,7 @@ PackageDataLock::~PackageDataLock() {
   Uses &all = uses();
   void (*hook)() = nullptr;
   {
-    const std::lock_guard<std::mutex> lock(all.mutex);
+    const MutexLock lock(all.mutex);
     (packs_ ? all.packed : all.changed).reset();
     all.ended.notify_all();
     if (packs_) hook = all.packing_ended;
@@ -53,18 +54,18 @@ PackageDataLock::~PackageDataLock() {
 
 bool any_package_is_packed() {
   Uses &all = uses();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   return all.packed.has_value();
 }
 
 void set_packing_ended_hook(void (*hook)()) {
   Uses &all = uses();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   all.packing_ended = hook;
 }
 
 bool package_is_packed(const std::string &pkg_id) {
   Uses &all = uses();
-  const std::lock_guard<std::mutex> lock(all.mutex);
+  const MutexLock lock(all.mutex);
   return all.packed == pkg_id;
 }

@@ -34,9 +34,9 @@ class PackageDataLock {
 };
 
 /** Whether the package is packed at the moment. */
-bool package_is_packed(const std::string &pkg_id);
+[[nodiscard]] bool package_is_packed(const std::string &pkg_id);
 /** Whether any is: the next one waits until that has ended. */
-bool any_package_is_packed();
+[[nodiscard]] bool any_package_is_packed();
 /** Called on whatever thread each time the packing of a package has ended. Set once. */
 void set_packing_ended_hook(void (*hook)());
 

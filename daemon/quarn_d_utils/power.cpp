@@ -1,10 +1,9 @@
 #include "quarn_d_utils/power.h"
 
-#include <mutex>
-
 #include "platform_device.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -12,14 +11,14 @@ constexpr int kNoTimeout = 0;
 
 // Held during the device's call too, so that the device sees the takes and
 // releases of several threads in the order in which they were counted.
-std::mutex power_mutex;
-unsigned int power_lock_takers = 0;
-bool power_lock_held = false;
+Mutex power_mutex;
+unsigned int power_lock_takers QUARN_GUARDED_BY(power_mutex) = 0;
+bool power_lock_held QUARN_GUARDED_BY(power_mutex) = false;
 
 }  // namespace
 
 void request_power_lock(bool lock) {
-  const std::lock_guard<std::mutex> guard(power_mutex);
+  const MutexLock guard(power_mutex);
   int ret = DEVICE_ERROR_NONE;
   if (lock) {
     ++power_lock_takers;
@@ -35,6 +34,6 @@ void request_power_lock(bool lock) {
 
 bool is_idle_status() {
   if (PendingWork::any()) return false;
-  const std::lock_guard<std::mutex> guard(power_mutex);
+  const MutexLock guard(power_mutex);
   return !power_lock_held;
 }

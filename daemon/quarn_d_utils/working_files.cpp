@@ -8,7 +8,6 @@
 #include <cerrno>
 #include <cstring>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -21,6 +20,7 @@
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/tree_place.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -43,9 +43,9 @@ struct FileMark {
   }
 };
 
-std::mutex claimed_mutex;
+Mutex claimed_mutex;
 /** Paths that are this process's own, and what was made there. */
-std::map<std::string, std::optional<FileMark>> &claimed() {
+std::map<std::string, std::optional<FileMark>> &claimed() QUARN_REQUIRES(claimed_mutex) {
   static auto *paths = new std::map<std::string, std::optional<FileMark>>;
   return *paths;
 }
@@ -65,7 +65,7 @@ constexpr mode_t kPrivateFile = 0600;
 
 /** Remove the file at @p path when it is the daemon's, and no longer used. */
 void sweep_file(const std::string &path, mode_t modes = ALLPERMS) {
-  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  const MutexLock lock(claimed_mutex);
   struct stat status = {};
   if (claimed().count(path) != 0 || safe_lstat(path.c_str(), &status) != 0) return;
   if (is_own_single_file(status) && (status.st_mode & ALLPERMS & ~modes) == 0)
@@ -110,14 +110,14 @@ std::string WorkingFiles::snapshot_place() const {
 }
 
 void claim_working_file(const std::string &path) {
-  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  const MutexLock lock(claimed_mutex);
   claimed()[path].reset();
 }
 
 void note_working_file(const std::string &path, int fd) {
   struct stat status = {};
   if (fstat(fd, &status) != 0) return;
-  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  const MutexLock lock(claimed_mutex);
   claimed()[path] = FileMark(status);
 }
 
@@ -125,7 +125,7 @@ UniqueFd open_working_file(const std::string &path) {
   UniqueFd file = safe_open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY);
   struct stat status = {};
   if (!file || fstat(file.get(), &status) != 0) return {};
-  const std::lock_guard<std::mutex> lock(claimed_mutex);
+  const MutexLock lock(claimed_mutex);
   const auto known = claimed().find(path);
   const bool noted = known != claimed().end() && known->second;
   if (is_own_single_file(status) && (!noted || *known->second == FileMark(status))) return file;

@@ -30,6 +30,7 @@
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
+#include "quarn_dbus_introspection.h"
 #include "quarn_dbus_limits.h"
 #include "temp_dir.h"
 
@@ -1030,8 +1031,7 @@ TEST_F(Server, BusThatIsGoneEndsTheDaemonWhenItIsIdle) {
 
 /** In a process of its own: it is not to be undone. */
 void serve_calls_at_the_end() {
-  quarnd_dbus_init();
-  if (!run_until(acquired)) _exit(1);
+  if (quarnd_dbus_init() == 0 || !run_until(acquired)) _exit(1);
   ScriptedClient client;
   quarn_dbus_stop_waiting();
   steps.clear();

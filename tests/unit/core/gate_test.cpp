@@ -180,7 +180,7 @@ class Flood : public ::testing::Test {
   static void refuse(unsigned int times, const quarn_caller &caller = {true, 1, {1}, ""}) {
     const quarn_subject asked{kQuarnInterface, "backup_enable", "", -1, false};
     for (unsigned int i = 0; i < times; ++i) {
-      judge_call(caller, ":1." + std::to_string(i), asked, false);
+      static_cast<void>(judge_call(caller, ":1." + std::to_string(i), asked, false));
     }
   }
 };

@@ -66,6 +66,38 @@ class CheckLocks(unittest.TestCase):
         self.assertNotEqual(checked.returncode, 0)
         self.assertIn("acquiring mutex 'mutex_' that is already held", checked.stderr)
 
+    def test_refuses_a_mutex_that_cannot_say_what_it_guards(self):
+        for words in ("std::mutex", "std::lock_guard<std::mutex>", "std::unique_lock<std::mutex>"):
+            checked = self.check("static %s *other = nullptr; (void)other;" % words)
+            self.assertNotEqual(checked.returncode, 0)
+            self.assertIn("Mutex and MutexLock of common/thread_annotations.h", checked.stderr)
+
+    def check_changed(self, source, old, new):
+        """A source of the daemon, checked with one thing of it changed."""
+        with open(os.path.join(ROOT, source), encoding="utf-8") as file:
+            text = file.read()
+        self.assertIn(old, text)
+        with tempfile.TemporaryDirectory() as folder:
+            path = os.path.join(folder, os.path.basename(source))
+            with open(path, "w", encoding="utf-8") as file:
+                file.write(text.replace(old, new))
+            return subprocess.run([os.path.join(ROOT, "scripts", "check-locks"), path],
+                                  capture_output=True, text=True, check=False)
+
+    def test_refuses_a_breach_in_the_daemon(self):
+        for source, lock, guarded in (
+                ("daemon/quarn_dbus_calls.cpp", "const MutexLock lock(standing.mutex);",
+                 "requires holding mutex 'standing.mutex'"),
+                ("daemon/quarn_dbus_accepted.cpp", "const MutexLock lock(requests_mutex);",
+                 "requires holding mutex 'requests_mutex'"),
+                ("daemon/quarn_d_utils/power.cpp", "const MutexLock guard(power_mutex);",
+                 "requires holding mutex 'power_mutex'")):
+            with self.subTest(source):
+                self.assertEqual(self.check_changed(source, lock, lock).returncode, 0)
+                checked = self.check_changed(source, lock, "")
+                self.assertNotEqual(checked.returncode, 0)
+                self.assertIn(guarded, checked.stderr)
+
 
 if __name__ == "__main__":
     unittest.main()
