@@ -7,6 +7,7 @@
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/restore_record.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/fiber.h"

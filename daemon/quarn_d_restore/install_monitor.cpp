@@ -1,7 +1,9 @@
 #include <algorithm>
 #include <memory>
 
+#include "platform_package_manager.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_restore/hidden_icon.h"
 #include "quarn_d_restore/quarn_d_restore.h"

@@ -6,18 +6,13 @@
 #define QUARN_D_RESTORE_H
 
 #include <glib.h>
-#include <json-c/json.h>
-#include <sys/stat.h>
 
 #include <cstdint>
 #include <string>
 #include <vector>
 
-#include "platform_package_manager.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
-#include "quarn_d_utils/file_info_table.h"
-#include "quarn_d_utils/package_identity.h"
 
 /** The state of one package's restore; freed by the engine or by the waiting request. */
 struct pkg_restore_context {
@@ -46,87 +41,6 @@ extern int current_restore_client;
 extern std::string serial_num_user_select;
 /** Record of the client that switched restore mode on. */
 extern void *g_restore_cb_data;
-
-/* ---- attributes.cpp ---- */
-
-/**
- * Look one path up in a file-info table. @p path begins with @p root and "/".
- * @param[out] label points into the table
- * @return 0, 19 without a table, 31 when the entry or a member of it is missing
- */
-int get_file_info_from_backup(json_object *table, const char *pkgid, const char *root,
-                              const char *path, int *mode, unsigned int *uid, unsigned int *gid,
-                              char **label);
-/** Give a directory or regular file its mode, the application owner and its label. @return 1, 0 */
-int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table);
-/**
- * The same for an object that is open already (O_PATH is enough), so that what
- * is changed is what was looked at; @p path names it in messages and the table.
- */
-int restore_object_info(int fd, const struct stat &status, const char *path, const char *pkgid,
-                        const char *root, json_object *table);
-/** True for the labels that a restore may write itself. @p path is for messages. */
-int is_known_exception_label(const char *path, const char *label, const char *pkgid);
-/** chmod() of an open object; a link has no mode of its own. @return 0, or -1 with errno */
-int change_object_mode(int fd, const struct stat &status, mode_t mode);
-/** chown() of an open object, a link itself included. @return 0, or -1 with errno */
-int change_object_owner(int fd, uid_t uid, gid_t gid);
-
-/* ---- table.cpp ---- */
-
-/**
- * The table of a JSON text, the caller's; null when the text is no JSON
- * object. Entries with equal attributes share them: what is read is not to be
- * changed.
- */
-json_object *parse_file_info_table(const char *text);
-
-/* ---- walk.cpp ---- */
-
-/** Modes, owners and labels of the whole package from the unpacked table. @return 1, 0 */
-int restore_app_info(const char *pkgid, const char *root);
-/** One directory of it and everything below. @return 1 when every entry was restored, else 0 */
-int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
-                              json_object *table);
-/** Make the links that the table lists. @return 1 */
-int restore_symlnk(const char *pkgid, const char *root, json_object *table);
-/** Empty the three data directories but for the snapshot. */
-void clear_app_dir(const char *pkgid, const char *root);
-
-/* ---- snapshot.cpp: the caller holds the PackageDataLock, where not told otherwise ---- */
-
-/** Copy the package's data aside. @return 0, 36, or what writing the table gave */
-int temp_backup_initial_app_data(const char *pkgid, const char *root);
-/** Copy what lies below @p dir into the snapshot @p temp_dir. @return 1, 0 when anything failed */
-int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
-                       file_info_table_h *table);
-/** put_snapshot_back() of snapshot.h. @return 0 */
-int rollback_to_initial_app_data(const char *pkgid, const char *root);
-/** Move what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
-int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
-/**
- * Remove the snapshot, its table first: from then on the present data counts.
- * @return false when that data cannot be brought onto the disk; the snapshot is kept then
- */
-bool discard_snapshot(const char *pkgid, const char *root);
-/**
- * Undo what a daemon that died in a restore of the package left: a complete
- * snapshot is put back, an incomplete one removed. Where the application has
- * written since, its data stays and the snapshot is kept. Takes the
- * PackageDataLock; a package that is packed at the moment was found whole.
- * @return true when all data was put back
- */
-bool recover_interrupted_restore(const char *pkgid, const char *root);
-/** The same for every installed package. */
-void recover_interrupted_restores();
-
-/** Told the name of each step of a restore; null but in tests. */
-extern void (*restore_step_hook)(const char *step);
-inline void restore_step(const char *step) {
-  if (restore_step_hook == nullptr) return;
-  const ActAsRoot root;
-  restore_step_hook(step);
-}
 
 /* ---- pipeline.cpp ---- */
 

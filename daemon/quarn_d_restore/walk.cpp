@@ -1,3 +1,5 @@
+#include "quarn_d_restore/walk.h"
+
 #include <fcntl.h>
 
 #include <cerrno>
@@ -10,8 +12,9 @@
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_restore/archive_table.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/attributes.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_restore/settle.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"

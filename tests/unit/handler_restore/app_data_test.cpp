@@ -12,6 +12,8 @@
 #include "handler_fixture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/cancel_own.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"

@@ -8,6 +8,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/package_identity.h"
 #include "restore_fixture.h"

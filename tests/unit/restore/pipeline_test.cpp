@@ -10,6 +10,9 @@
 #include <thread>
 
 #include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/restore_step.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/archive.h"

@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <set>
 
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 

@@ -27,6 +27,7 @@
 #include "quarn_common.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/unpacked_file.h"
 #include "quarn_dbus_client.h"

@@ -11,6 +11,7 @@
 #include <functional>
 
 #include "quarn_common.h"
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/file.h"
