@@ -10,6 +10,7 @@
 #include <vector>
 
 #ifdef QUARN_BENCH_RESTORE
+#include "quarn_d_restore/snapshot.h"
 #include "quarn_d_restore/walk.h"
 #endif
 #include "quarn_d_utils/archive.h"

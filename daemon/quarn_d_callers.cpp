@@ -14,7 +14,6 @@ const char kClientGroup[] = QUARN_CLIENT_GROUP;
 namespace {
 
 constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
-constexpr int kCompanionClient = 1;
 
 /** A label that can be a package's: its id. What the system itself runs with is none. */
 bool is_package_label(const std::string &label) {
@@ -48,7 +47,7 @@ caller_verdict companion_may(const std::string &label, const quarn_subject &subj
       subject.interface_name == kQuarnInterface &&
       (subject.member == "get_app_list" || subject.member == "restore_enable");
   if (!of_companion) return application_may(label, subject);
-  if (subject.client != kCompanionClient) {
+  if (subject.client != QUARN_CLIENT_COMPANION) {
     return refused("the companion may ask as the companion only");
   }
   if (subject.member == "restore_enable" && !subject.switches_on && cloud_mode) {

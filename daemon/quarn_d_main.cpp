@@ -72,7 +72,7 @@ gboolean cancel_backups(gpointer) {
 /** Make room for a process that has requests and waits: this one may have the bus name back. */
 void leave_for_the_next() {
   // Restore mode waits for installations, of which another process would know nothing.
-  if (pellix_restore_running != 0 || cloud_restore_running != 0) return;
+  if (current_restore_mode() != restore_mode::off) return;
   request_quarn_terminate(0.0, false);
 }
 
@@ -149,8 +149,6 @@ gboolean ask_for_turn(gpointer) {
   return G_SOURCE_CONTINUE;
 }
 
-int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
-
 void export_objects(GDBusConnection *connection) {
   quarnd_status_export(connection);
   quarnd_packages_export(connection);
@@ -160,7 +158,6 @@ void export_objects(GDBusConnection *connection) {
 void wire_floors() {
   set_backup_wifi_probe(wifi_connected);
   set_pending_request_probe(work_pending);
-  set_restore_disable(disable_restore);
   set_boot_recovery(recover_device);
   set_bus_acquired_hook(export_objects);
   quarnd_progress_init();

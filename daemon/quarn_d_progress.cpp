@@ -6,6 +6,7 @@
 #include <deque>
 #include <mutex>
 
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_status.h"
 #include "quarn_d_utils/handles.h"

@@ -13,7 +13,7 @@
 #include <string>
 
 #include "quarn_d_backup/quarn_d_backup.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_progress.h"
 
 /** Follow both engines from now on. Main thread, once. */
 void quarnd_progress_init();

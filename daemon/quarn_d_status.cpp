@@ -13,7 +13,6 @@
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_gate.h"
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_setting/quarn_d_setting.h"
 #include "quarn_d_utils/device_info.h"
@@ -81,14 +80,10 @@ GVariant *screen_off() {
   return g_variant_new_boolean(known && state == DISPLAY_STATE_SCREEN_OFF ? TRUE : FALSE);
 }
 
-bool restore_mode() { return pellix_restore_running != 0 || cloud_restore_running != 0; }
-
 GVariant *candidates() {
   GVariantBuilder builder;
   g_variant_builder_init(&builder, G_VARIANT_TYPE("as"));
-  // The list outlives a mode that was switched off; nobody waits for it then.
-  if (!restore_mode()) return g_variant_builder_end(&builder);
-  for (const std::string &package : pkg_list_to_be_restored) {
+  for (const std::string &package : restore_candidates()) {
     g_variant_builder_add(&builder, "s", package.c_str());
   }
   return g_variant_builder_end(&builder);
@@ -122,7 +117,7 @@ GVariant *value_of(const std::string &property) {
   if (property == "NextAlarm") return g_variant_new_int64(next_alarm_due());
   if (property == "LastBackup") return last_backup();
   if (property == "BackupRunning") return flag(backup_request_outstanding());
-  if (property == "RestoreMode") return flag(restore_mode());
+  if (property == "RestoreMode") return flag(current_restore_mode() != restore_mode::off);
   if (property == "RestoreCandidates") return candidates();
   if (property == "CloudProblem") return cloud_problem();
   if (property == "SerialNumber") return device_text(true);

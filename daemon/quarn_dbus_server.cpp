@@ -17,6 +17,7 @@
 #include "quarn_d_end.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/admission.h"
@@ -453,7 +454,7 @@ void tell_excess(const MethodCall &call, const std::string &excess) {
 bool admit(MethodCall &call, GVariant *parameters) {
   const quarn_subject subject = subject_of_call(call.interface_name(), call.method(), parameters);
   const caller_verdict verdict =
-      judge_call(call.caller(), call.sender(), subject, cloud_restore_running != 0);
+      judge_call(call.caller(), call.sender(), subject, cloud_restore_running());
   const std::string excess =
       verdict.allowed ? excess_of_arguments(call.method(), parameters) : std::string();
   if (verdict.allowed && excess.empty()) return true;

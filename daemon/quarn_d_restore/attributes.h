@@ -21,7 +21,10 @@ struct json_object;
 int get_file_info_from_backup(json_object *table, const char *pkgid, const char *root,
                               const char *path, int *mode, unsigned int *uid, unsigned int *gid,
                               char **label);
-/** Give a directory or regular file its mode, the application owner and its label. @return 1, 0 */
+/**
+ * Give a directory or regular file its mode, the application owner and its label. The engine itself
+ * calls restore_object_info(). @return 1, 0
+ */
 int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table);
 /**
  * The same for an object that is open already (O_PATH is enough), so that what

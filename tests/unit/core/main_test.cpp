@@ -54,7 +54,6 @@ void (*on_turn)() = nullptr;
 std::vector<int> woken;
 int (*wifi_probe)() = nullptr;
 bool (*pending_probe)() = nullptr;
-int (*restore_disable)() = nullptr;
 void (*boot_recovery)() = nullptr;
 void (*bus_acquired_hook)(GDBusConnection *) = nullptr;
 
@@ -112,8 +111,8 @@ bool calls_unjudged = false;
 bool quarnd_calls_unjudged() { return calls_unjudged; }
 bool answers_awaited = false;
 bool quarn_dbus_answers_awaited() { return answers_awaited; }
-char pellix_restore_running = 0;
-char cloud_restore_running = 0;
+restore_mode present_mode = restore_mode::off;
+restore_mode current_restore_mode() { return present_mode; }
 std::vector<std::string> turn_lines;
 bool tell_quarn_predecessor(const std::string &line, int signo) {
   step(("tell " + line + (signo == kWithdrawSignal ? "" : "?")).c_str());
@@ -183,19 +182,11 @@ bool backups_outstanding = true;
 bool backup_request_outstanding() { return backups_outstanding; }
 void set_backup_wifi_probe(int (*probe)()) { wifi_probe = probe; }
 void set_pending_request_probe(bool (*probe)()) { pending_probe = probe; }
-void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
 void (*in_recovery)() = nullptr;
 void recover_device() {
   step("recovery");
   if (in_recovery != nullptr) in_recovery();
-}
-int quarnd_restore_enable(int on, int client, const char *, const char *, void *record) {
-  EXPECT_EQ(on, 0);
-  EXPECT_EQ(client, 0);
-  EXPECT_EQ(record, nullptr);
-  step("restore_off");
-  return 0;
 }
 void quit_nested_loops() { step("quit_nested_loops"); }
 
@@ -225,7 +216,6 @@ class Main : public ::testing::Test {
     manual_backup_canceled = false;
     wifi_probe = nullptr;
     pending_probe = nullptr;
-    restore_disable = nullptr;
     boot_recovery = nullptr;
     for (const int signo : signals_) signal(signo, SIG_DFL);
     restart();
@@ -392,11 +382,11 @@ TEST_F(Main, IdleProcessLeavesForTheRequestsOfTheNext) {
     return std::exchange(steps, {});
   };
   EXPECT_EQ(leave(), Texts{"terminate"});
-  for (char *const mode : {&pellix_restore_running, &cloud_restore_running}) {
-    *mode = 1;
+  for (const restore_mode mode : {restore_mode::companion, restore_mode::cloud}) {
+    present_mode = mode;
     EXPECT_EQ(leave(), Texts{}) << "restore mode is this process's";
-    *mode = 0;
   }
+  present_mode = restore_mode::off;
 }
 
 TEST_F(Main, ProcessWhoseRequestsWaitAsksTheEarlierOneToLeaveUntilItsTurnComes) {
@@ -500,16 +490,14 @@ TEST_F(Main, LowerFloorsAreGivenTheirProbesFirst) {
   init_quarn();
   ASSERT_NE(wifi_probe, nullptr);
   ASSERT_NE(pending_probe, nullptr);
-  ASSERT_NE(restore_disable, nullptr);
   ASSERT_NE(boot_recovery, nullptr);
   ASSERT_NE(bus_acquired_hook, nullptr);
   EXPECT_EQ(wifi_probe(), 1);
   EXPECT_TRUE(pending_probe());
   restart();
-  EXPECT_EQ(restore_disable(), 0);
   boot_recovery();
   bus_acquired_hook(nullptr);
-  EXPECT_EQ(steps, (Texts{"restore_off", "recovery", "status_export", "packages_export"}));
+  EXPECT_EQ(steps, (Texts{"recovery", "status_export", "packages_export"}));
 }
 
 }  // namespace

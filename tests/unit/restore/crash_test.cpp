@@ -184,7 +184,7 @@ TEST_F(CrashTest, KilledInTheMiddleOfTheUnpacking) {
 class KilledCompanionTest : public CrashTest {
  protected:
   KilledCompanionTest() {
-    current_restore_client = 1;
+    current_restore_client = QUARN_CLIENT_COMPANION;
     std::filesystem::create_directories(kCompanionDir);
     std::filesystem::copy_file(
         archive, std::string(kCompanionDir) + "/" + kPkg + "_" + std::string(kVersion) + ".zip");

@@ -113,7 +113,7 @@ TEST_F(RemovalTest, IsTold) {
 }
 
 TEST_F(RemovalTest, ACompanionsRestoreLeavesNothingEither) {
-  current_restore_client = 1;
+  current_restore_client = QUARN_CLIENT_COMPANION;
   install();
   std::filesystem::create_directories(kCompanionDir);
   const std::string archive =
