@@ -13,7 +13,6 @@
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_end.h"
 #include "quarn_d_handler/cancel_own.h"
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
 #include "quarn_d_packages.h"

@@ -6,7 +6,7 @@
 #define QUARN_D_RESTORE_INSTALL_MONITOR_H
 
 /** Follow package events. @return 1 when the monitor runs, else 0 */
-int start_install_monitor();
+[[nodiscard]] int start_install_monitor();
 /** @return 1 */
 int stop_install_monitor();
 
