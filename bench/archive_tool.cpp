@@ -9,7 +9,8 @@
 #include <vector>
 
 #ifdef QUARN_BENCH_RESTORE
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #endif
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/codec.h"

@@ -43,7 +43,7 @@ void Session::expect(const std::string &package) {
   }
 }
 
-void Session::switch_restore_on(int client) {
+void Session::switch_restore_on(quarn_client_kind client) {
   const JsonPtr list(json_object_new_array());
   for (const std::string &package : expected_) {
     json_object_array_add(

@@ -83,7 +83,7 @@ class Session {
   void restore_on(const BackupSets &sets);
   void restore_transferred();
   void expect(const std::string &package);
-  void switch_restore_on(int client);
+  void switch_restore_on(quarn_client_kind client);
   void show_transfer();
   void restore_off();
 
@@ -130,7 +130,7 @@ class Session {
   ProgressBoard board_;
   JsonPtr document_;
   BackupSet set_; /**< restore on: the chosen set */
-  int list_client_ = QUARN_CLIENT_CLOUD;
+  quarn_client_kind list_client_ = QUARN_CLIENT_CLOUD;
   std::vector<std::string> expected_;
   std::function<void()> on_answer_; /**< called whenever reply_ or callback_ has changed */
   std::optional<int> reply_;

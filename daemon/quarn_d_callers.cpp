@@ -15,7 +15,6 @@ const char kClientGroup[] = QUARN_CLIENT_GROUP;
 namespace {
 
 constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
-constexpr int kCompanionClient = 1;
 
 /** A label that can be a package's: its id. What the system itself runs with is none. */
 bool is_package_label(const std::string &label) {
@@ -53,7 +52,7 @@ caller_verdict companion_may(const std::string &label, const quarn_subject &subj
   if (rights != method_rights::as_companion && !switches_mode) {
     return application_may(label, subject);
   }
-  if (subject.client != kCompanionClient) {
+  if (subject.client != QUARN_CLIENT_COMPANION) {
     return refused("the companion may ask as the companion only");
   }
   if (switches_mode && !subject.switches_on && cloud_mode) {

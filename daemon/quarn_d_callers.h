@@ -34,7 +34,7 @@ struct quarn_subject {
   std::string interface_name;
   std::string member;
   std::string package;      /**< of the arguments; empty when there is none */
-  int client = -1;          /**< the kind of client that the arguments name */
+  int client = -1;          /**< a #quarn_client_kind that the arguments name, where it is one */
   bool switches_on = false; /**< of what they switch on or off */
 };
 

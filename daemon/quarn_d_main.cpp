@@ -14,7 +14,6 @@
 #include "quarn_d_conditions/conditions.h"
 #include "quarn_d_end.h"
 #include "quarn_d_handler/cancel_own.h"
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
 #include "quarn_d_packages.h"
@@ -71,7 +70,7 @@ gboolean cancel_backups(gpointer) {
 /** Make room for a process that has requests and waits: this one may have the bus name back. */
 void leave_for_the_next() {
   // Restore mode waits for installations, of which another process would know nothing.
-  if (pellix_restore_running != 0 || cloud_restore_running != 0) return;
+  if (current_restore_mode() != restore_mode::off) return;
   request_quarn_terminate(0.0, false);
 }
 

@@ -5,6 +5,7 @@
 
 #include <deque>
 
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_status.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"

@@ -13,7 +13,7 @@
 #include <string>
 
 #include "quarn_d_backup/backup_progress.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_progress.h"
 
 /** The JSON text of a step. */
 [[nodiscard]] std::string backup_progress_text(const backup_progress &progress);

@@ -39,14 +39,10 @@ GVariant *screen_off() {
   return flag(known && state == DISPLAY_STATE_SCREEN_OFF);
 }
 
-bool restore_mode() { return pellix_restore_running != 0 || cloud_restore_running != 0; }
-
 GVariant *candidates() {
   GVariantBuilder builder;
   g_variant_builder_init(&builder, G_VARIANT_TYPE("as"));
-  // The list outlives a mode that was switched off; nobody waits for it then.
-  if (!restore_mode()) return g_variant_builder_end(&builder);
-  for (const std::string &package : pkg_list_to_be_restored) {
+  for (const std::string &package : restore_candidates()) {
     g_variant_builder_add(&builder, "s", package.c_str());
   }
   return g_variant_builder_end(&builder);
@@ -103,7 +99,7 @@ constexpr status_property kStatusProperties[] = {
     {"LastBackup", "t", change_signal::told, [](GError **) { return last_backup(); }},
     {"BackupRunning", "b", change_signal::told,
      [](GError **) { return flag(backup_request_outstanding()); }},
-    {"RestoreMode", "b", change_signal::told, [](GError **) { return flag(restore_mode()); }},
+    {"RestoreMode", "b", change_signal::told, [](GError **) { return flag(current_restore_mode() != restore_mode::off); }},
     {"RestoreCandidates", "as", change_signal::told, [](GError **) { return candidates(); }},
     {"CloudProblem", "s", change_signal::not_told, [](GError **) { return cloud_problem(); }},
     {"SerialNumber", "s", change_signal::constant, [](GError **) { return serial_number(); }},

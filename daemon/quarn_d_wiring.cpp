@@ -14,8 +14,6 @@
 
 namespace {
 
-int disable_restore() { return quarnd_restore_enable(0, 0, "", "", nullptr); }
-
 void export_objects(GDBusConnection *connection) {
   quarnd_status_export(connection);
   quarnd_packages_export(connection);
@@ -24,8 +22,6 @@ void export_objects(GDBusConnection *connection) {
 }  // namespace
 
 void wire_floors() {
-  // The end of the last restore switches the mode off, as the handler above does it for a client.
-  set_restore_disable(disable_restore);
   // The sweep is the backup worker's; what an interrupted restore has left only restore can mend.
   set_boot_recovery(recover_device);
   // The objects stand on a connection that the server has first, but the packages ask the server.

@@ -9,6 +9,7 @@
 #include "quarn_common.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"
@@ -173,7 +174,7 @@ bool refuse_unlooked(GDBusMessage *message, quarn_call_form form) {
                       text_or_empty(g_dbus_message_get_member(message)), arguments);
   const caller_verdict verdict =
       judge_call(ask_caller_now(quarn_dbus_connection, sender, kLastQuestion), sender, subject,
-                 cloud_restore_running != 0);
+                 cloud_restore_running());
   if (!verdict.allowed) {
     refuse(message, "org.freedesktop.DBus.Error.AccessDenied", refusal_text(subject, verdict));
     return true;

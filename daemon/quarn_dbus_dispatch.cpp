@@ -9,6 +9,7 @@
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
@@ -72,7 +73,7 @@ const GDBusInterfaceVTable kQuarnMethodTable = {_dbus_handle_method_call, nullpt
 bool admit(MethodCall &call, GVariant *parameters) {
   const quarn_subject subject = subject_of_call(call.interface_name(), call.method(), parameters);
   const caller_verdict verdict =
-      judge_call(call.caller(), call.sender(), subject, cloud_restore_running != 0);
+      judge_call(call.caller(), call.sender(), subject, cloud_restore_running());
   const std::string excess =
       verdict.allowed ? excess_of_arguments(call.method(), parameters) : std::string();
   if (verdict.allowed && excess.empty()) return true;

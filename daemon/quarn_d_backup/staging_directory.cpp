@@ -7,6 +7,7 @@
 
 #include "files/safe_path.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/own_place.h"

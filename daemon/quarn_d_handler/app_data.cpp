@@ -5,8 +5,10 @@
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/single_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
+#include "quarn_d_restore/app_restore.h"
 #include "quarn_d_restore/quarn_d_restore.h"
-#include "quarn_d_restore/withdrawal.h"
+#include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/restore_context.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/device_info.h"
 #include "quarn_d_utils/fiber.h"
@@ -39,7 +41,7 @@ struct package_facts {
   std::string serial;
 };
 
-/** One of the package's texts. @return 0 or 42 */
+/** One of the package's texts. @return #QUARN_OK or #QUARN_FAILED */
 int read_text(package_info_h info, int (*get)(package_info_h, char **), const char *call,
               const char *what, std::string *text) {
   CString value;
@@ -70,7 +72,7 @@ int read_root_path(package_info_h info, package_facts *facts) {
                    &facts->root);
 }
 
-/** 0 for a package that the user installed. */
+/** #QUARN_OK for a package that the user installed. */
 int refuse_preloaded(package_info_h info) {
   bool preload = false;
   const int result = package_info_is_preload_package(info, &preload);
@@ -98,7 +100,7 @@ bool read_device(package_facts *facts) {
   return true;
 }
 
-/** Visit the package's applications. @return 0 or 42 */
+/** Visit the package's applications. @return #QUARN_OK or #QUARN_FAILED */
 int visit_applications(package_info_h info, package_info_app_cb callback, void *data) {
   const int result =
       package_info_foreach_app_from_package(info, PACKAGE_INFO_ALLAPP, callback, data);
@@ -107,7 +109,8 @@ int visit_applications(package_info_h info, package_info_app_cb callback, void *
   return QUARN_FAILED;
 }
 
-/** 0, or 41 when one of the package's applications does not take part in backup. */
+/** #QUARN_OK, or #QUARN_DISABLED when one of the package's applications does not take part in
+ * backup. */
 int refuse_disabled(const std::string &pkg_id, bool enabled) {
   if (!enabled) {
     LOGI("backup disabled for (%s)", pkg_id.c_str());
@@ -151,7 +154,7 @@ bool _package_cb_for_restore(package_info_app_component_type_e /*type*/, const c
   return true;
 }
 
-int back_up(const std::string &pkg_id, package_info_h info, void * /*record*/) {
+int back_up(const std::string &pkg_id, package_info_h info, client_cb_data * /*record*/) {
   package_facts facts;
   int result = refuse_preloaded(info);
   if (result == QUARN_OK) result = read_version(info, &facts);
@@ -175,15 +178,15 @@ int back_up(const std::string &pkg_id, package_info_h info, void * /*record*/) {
 }
 
 /** Wait for the end of the restore, and take its context back. @return its result */
-int wait_for_restore(std::unique_ptr<pkg_restore_context> ctx) {
+int wait_for_restore(RestoreContextPtr ctx) {
   if (ctx->pending > 0) {
     const GMainLoopPtr loop(new_wait_loop());
-    ctx->main_loop = g_main_loop_ref(loop.get());
+    ctx->main_loop.reset(g_main_loop_ref(loop.get()));
     run_nested_loop(loop.get());
-    const GMainLoopPtr left(std::exchange(ctx->main_loop, nullptr));
+    const GMainLoopPtr left = std::move(ctx->main_loop);
     if (left != nullptr) {
       // Withdrawn, or the daemon ends, and the download still has its context.
-      abandon_restore(ctx.release());
+      abandon_restore(std::move(ctx));
       return QUARN_CANCELLED;
     }
   }
@@ -207,7 +210,7 @@ void wait_while_packed(const std::string &pkg_id) {
   }
 }
 
-int restore(const std::string &pkg_id, package_info_h info, void *record) {
+int restore(const std::string &pkg_id, package_info_h info, client_cb_data * /*record*/) {
   package_facts facts;
   int result = refuse_preloaded(info);
   if (result == QUARN_OK) result = read_version(info, &facts);
@@ -218,9 +221,8 @@ int restore(const std::string &pkg_id, package_info_h info, void *record) {
   }
   if (result != QUARN_OK) return result;
 
-  auto ctx = std::make_unique<pkg_restore_context>();
+  RestoreContextPtr ctx = std::make_unique<pkg_restore_context>();
   ctx->serial = facts.serial;
-  ctx->client = record;
   ctx->wait_for_result = true;
   ctx->pkgid = pkg_id;
   ctx->version = facts.version;
@@ -229,50 +231,57 @@ int restore(const std::string &pkg_id, package_info_h info, void *record) {
   if (result == QUARN_OK) result = refuse_disabled(pkg_id, ctx->backup_enabled);
   if (result != QUARN_OK) return result;
   // The companion's archive is unpacked at once, where nothing can wait any more.
-  if (current_restore_client != 0) wait_while_packed(pkg_id);
+  if (restores_from_companion()) wait_while_packed(pkg_id);
   if (waits_are_ended()) return QUARN_CANCELLED;
   result = visit_applications(info, _package_cb_for_restore, ctx.get());
   const int restored = wait_for_restore(std::move(ctx));
   return result != QUARN_OK ? result : restored;
 }
 
-using Work = int (*)(const std::string &pkg_id, package_info_h info, void *record);
+/** The record is lent. */
+using Work = int (*)(const std::string &pkg_id, package_info_h info, client_cb_data *record);
+/** Deletes the record. */
 using Answer = int (*)(int err, const char *msg, void *record);
 
 /** The frame of both requests: whatever happens, the client is told once. */
-int serve(const char *id, void *record, Work work, Answer answer) {
+int serve(const char *id, std::unique_ptr<client_cb_data> record, Work work, Answer answer) {
   const std::string pkg_id = id == nullptr ? "" : id;
   if (!is_safe_path_component(pkg_id)) {
     LOGE("refused : not a package id (%s)", pkg_id.c_str());
-    answer(QUARN_BAD_ARGUMENT, pkg_id.c_str(), record);
+    answer(QUARN_BAD_ARGUMENT, pkg_id.c_str(), record.release());
     return QUARN_BAD_ARGUMENT;
   }
   const PowerLock lock;
   if (waits_are_ended() || !cloud_initialized()) {
-    answer(waits_are_ended() ? QUARN_CANCELLED : QUARN_NO_SESSION, pkg_id.c_str(), record);
+    answer(waits_are_ended() ? QUARN_CANCELLED : QUARN_NO_SESSION, pkg_id.c_str(),
+           record.release());
     return QUARN_OK;
   }
   PackageInfoPtr info;
   const int result = package_manager_get_package_info(pkg_id.c_str(), out(info));
   if (result != PACKAGE_MANAGER_ERROR_NONE) {
     LOGE("package_manager_get_package_info() failed : %d", result);
-    answer(QUARN_BAD_ARGUMENT, pkg_id.c_str(), record);
+    answer(QUARN_BAD_ARGUMENT, pkg_id.c_str(), record.release());
     return QUARN_BAD_ARGUMENT;
   }
-  const int outcome = work(pkg_id, info.get(), record);
+  const int outcome = work(pkg_id, info.get(), record.get());
   info.reset();
-  answer(outcome, pkg_id.c_str(), record);
+  answer(outcome, pkg_id.c_str(), record.release());
   return QUARN_OK;
+}
+
+std::unique_ptr<client_cb_data> owned(void *record) {
+  return std::unique_ptr<client_cb_data>(static_cast<client_cb_data *>(record));
 }
 
 }  // namespace
 
 int quarnd_backup_app_data(const char *pkg_id, void *record) {
   LOGI("quarnd_backup_app_data");
-  return serve(pkg_id, record, back_up, quarn_dbus_app_backup_complete);
+  return serve(pkg_id, owned(record), back_up, quarn_dbus_app_backup_complete);
 }
 
 int quarnd_restore_app_data(const char *pkg_id, void *record) {
   LOGI("quarnd_restore_app_data");
-  return serve(pkg_id, record, restore, quarn_dbus_app_restore_complete);
+  return serve(pkg_id, owned(record), restore, quarn_dbus_app_restore_complete);
 }

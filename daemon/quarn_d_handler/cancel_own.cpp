@@ -1,10 +1,7 @@
 #include "quarn_d_handler/cancel_own.h"
 
-#include "quarn_common.h"
 #include "quarn_d_backup/cancel.h"
-#include "quarn_d_handler/quarn_d_handler.h"
-#include "quarn_d_restore/restore_record.h"
-#include "quarn_d_restore/withdrawal.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_log.h"
@@ -15,13 +12,7 @@ std::uint32_t quarnd_cancel_own(const std::string &sender) {
     if (withdraw_waits(fiber)) ++count;
   }
   count += withdraw_app_lists(sender);
-  const bool mode_on = pellix_restore_running != 0 || cloud_restore_running != 0;
-  if (mode_on && restore_record_is_of(sender)) {
-    set_restore_stop_result(QUARN_CANCELLED);
-    quarnd_withdraw_restore_mode();
-    abort_monitored_downloads();
-    ++count;
-  }
+  if (withdraw_restore_mode(sender)) ++count;
   LOGI("%u requests of (%s) are withdrawn", count, sender.c_str());
   return count;
 }

@@ -12,7 +12,7 @@
  * Withdraw the requests of one connection and of nobody else: manual backups,
  * queued or running, what waits for the cloud's session, another request's
  * archive or a transfer, and the restore mode that it switched on. Each ends
- * with its final callback, with result 17, and with its reply. What is settled
+ * with its final callback, with #QUARN_CANCELLED, and with its reply. What is settled
  * already, and a restore that has its archive, end as they end.
  * @param sender the connection's unique bus name
  * @return how many were withdrawn

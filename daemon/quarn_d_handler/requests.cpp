@@ -1,6 +1,8 @@
 #include <algorithm>
 #include <cstdint>
+#include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform_settings.h"
@@ -18,9 +20,6 @@
 #include "quarn_log.h"
 
 namespace {
-
-/** Who asks for an application list. */
-enum list_client : unsigned int { CLIENT_CLOUD = 0, CLIENT_COMPANION = 1 };
 
 constexpr char kFailed[] = "failed";
 
@@ -55,20 +54,22 @@ int quarnd_get_last_backed_up_time(unsigned long long *timestamp) {
 }
 
 int quarnd_get_app_list(int client, void *record) {
-  if (static_cast<unsigned int>(client) > CLIENT_COMPANION) {
-    quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kFailed, record);
+  std::unique_ptr<client_cb_data> owned(static_cast<client_cb_data *>(record));
+  if (client != QUARN_CLIENT_CLOUD && client != QUARN_CLIENT_COMPANION) {
+    quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kFailed, owned.release());
     return QUARN_BAD_ARGUMENT;
   }
   request_power_lock(true);
-  if (waits_are_ended() || (client == CLIENT_CLOUD && !cloud_initialized())) {
+  if (waits_are_ended() || (client == QUARN_CLIENT_CLOUD && !cloud_initialized())) {
     const int reason = waits_are_ended() ? QUARN_CANCELLED : QUARN_NO_SESSION;
-    quarn_dbus_get_app_list_cb(reason, kFailed, record);
+    quarn_dbus_get_app_list_cb(reason, kFailed, owned.release());
     request_power_lock(false);
     return reason;
   }
   LOGI("quarnd_get_app_list");
   int result = QUARN_FAILED;
-  run_on_thread_stack([&] { result = get_app_list(client, record); });
+  const auto kind = static_cast<quarn_client_kind>(client);
+  run_on_thread_stack([&] { result = get_app_list(kind, std::move(owned)); });
   request_power_lock(false);
   return result;
 }

@@ -18,4 +18,11 @@ struct archive_table {
  */
 archive_table read_archive_table(const char *path);
 
+/**
+ * The table of a JSON text, the caller's; null when the text is no JSON
+ * object. Entries with equal attributes share them: what is read is not to be
+ * changed.
+ */
+json_object *parse_file_info_table(const char *text);
+
 #endif

@@ -1,3 +1,5 @@
+#include "quarn_d_restore/attributes.h"
+
 #include <fcntl.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -9,7 +11,6 @@
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
-#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/file_attributes.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"

@@ -11,7 +11,7 @@
 #include "files/tree_walk.h"
 #include "log_scope.h"
 #include "quarn_d_restore/put_attributes_back.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_d_utils/tree_place.h"

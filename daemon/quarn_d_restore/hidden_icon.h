@@ -12,7 +12,7 @@
  * Note that the package's icon is about to be hidden. Main thread.
  * @return false when it could not be noted durably
  */
-bool note_hidden_icon(const char *pkgid, const char *root);
+[[nodiscard]] bool note_hidden_icon(const char *pkgid, const char *root);
 /** The icon was shown again. Main thread. */
 void forget_hidden_icon(const char *pkgid, const char *root);
 /** Show the icon of a package that an ended process has hidden. Any thread. */

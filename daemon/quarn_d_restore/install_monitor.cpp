@@ -1,11 +1,20 @@
-#include <algorithm>
-#include <memory>
+#include "quarn_d_restore/install_monitor.h"
 
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <utility>
+
+#include "platform_package_manager.h"
 #include "quarn_common.h"
+#include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_conditions/conditions.h"
+#include "quarn_d_restore/app_restore.h"
 #include "quarn_d_restore/hidden_icon.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_context.h"
+#include "quarn_d_restore/restore_mode.h"
+#include "quarn_d_restore/restore_progress.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/icon.h"
@@ -21,16 +30,6 @@ constexpr double kIconHideDelay = 0.5;
 
 package_manager_h pkgmgr_h = nullptr;
 bool monitor_running = false;
-int (*restore_disable)() = nullptr;
-void (*restore_mode_observer)() = nullptr;
-
-gboolean _restore_disable_cb(gpointer /*data*/) {
-  // The mode may have been switched on again with a new list meanwhile.
-  if (!pkg_list_to_be_restored.empty()) return G_SOURCE_REMOVE;
-  LOGI("installation of all restore candidate package was completed!");
-  if (restore_disable != nullptr) restore_disable();
-  return G_SOURCE_REMOVE;
-}
 
 bool check_restore_enabled(package_info_app_component_type_e /*type*/, const char *appid,
                            void *data) {
@@ -66,8 +65,7 @@ void skip(const char *package, int reason) {
 
 /** Until it is restored, no backup puts the new package's data in the archive's place. */
 void note_owed(const char *package, const std::string &root) {
-  constexpr int kCloudClient = 0;
-  if (current_restore_client != kCloudClient) return;
+  if (restores_from_companion()) return;
   note_owed_archive(serial_num_user_select, package, root);
 }
 
@@ -118,7 +116,7 @@ void hide_until_restored(const char *package, const std::string &root) {
 }
 
 void restore_new_package(package_info_h info, const char *package) {
-  auto ctx = std::make_unique<pkg_restore_context>();
+  RestoreContextPtr ctx = std::make_unique<pkg_restore_context>();
   if (!is_restorable(info, package, &ctx->root)) return;
   LOGI("new package install detected : %s", package);
   int result = PACKAGE_MANAGER_ERROR_NONE;
@@ -144,8 +142,8 @@ void restore_new_package(package_info_h info, const char *package) {
   } else if (ctx->pending != 0) {
     hide_until_restored(package, ctx->root);
   }
-  // With a download on its way the context is the pipeline's; otherwise nobody holds it.
-  if (ctx->pending > 0) static_cast<void>(ctx.release());
+  // Nobody waits for a download that is on its way.
+  if (ctx->pending > 0) leave_restore(std::move(ctx));
 }
 
 void package_event_cb(const char * /*type*/, const char *package,
@@ -213,29 +211,4 @@ int stop_install_monitor() {
   }
   monitor_running = false;
   return 1;
-}
-
-int package_to_be_restored(const char *pkgid) {
-  if (pkg_list_to_be_restored.empty()) {
-    g_idle_add(_restore_disable_cb, nullptr);
-    return 0;
-  }
-  const auto found =
-      std::find(pkg_list_to_be_restored.begin(), pkg_list_to_be_restored.end(), pkgid);
-  const bool candidate = found != pkg_list_to_be_restored.end();
-  if (candidate) {
-    pkg_list_to_be_restored.erase(found);
-    stop_awaiting_archive(pkgid);
-    note_restore_mode_change();
-  }
-  if (pkg_list_to_be_restored.empty()) g_idle_add(_restore_disable_cb, nullptr);
-  return candidate;
-}
-
-void set_restore_disable(int (*disable)()) { restore_disable = disable; }
-
-void set_restore_mode_observer(void (*observer)()) { restore_mode_observer = observer; }
-
-void note_restore_mode_change() {
-  if (restore_mode_observer != nullptr) restore_mode_observer();
 }

@@ -1,218 +1,65 @@
 /**
  * @file quarn_d_restore.h
- * @brief The restore engine. Main thread only.
+ * @brief What others ask the restore engine for. Main thread only.
+ *
+ * One package's restore is app_restore.h, what an ended process has left recovery.h, and what is
+ * told of restores under way restore_progress.h.
  */
 #ifndef QUARN_D_RESTORE_H
 #define QUARN_D_RESTORE_H
 
-#include <glib.h>
-#include <json-c/json.h>
-#include <sys/stat.h>
-
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
-#include "platform_package_manager.h"
 #include "quarn_common.h"
-#include "quarn_d_backup/archive_hold.h"
-#include "quarn_d_utils/file_info_table.h"
-#include "quarn_d_utils/package_identity.h"
 
-/** The state of one package's restore; freed by the engine or by the waiting request. */
-struct pkg_restore_context {
-  int result = 0;
-  std::string serial;
-  int reserved = 0;
-  bool wait_for_result = false;
-  GMainLoop *main_loop = nullptr;
-  bool reserved_flag = false;
-  bool restore_started = false;
-  int pending = 0;
-  std::string pkgid;
-  std::string version;
-  std::string root;
-  bool backup_enabled = true;
-  void *client = nullptr; /**< client_cb_data of a waiting request */
-  bool abandoned = false; /**< the waiting request is gone; the engine deletes the context */
-  archive_hold archive;   /**< no backup touches the archive before the restore has ended */
-};
+struct client_cb_data;
 
-/** Restore candidates still expected, in the order given. */
-extern std::vector<std::string> pkg_list_to_be_restored;
-/** Client of the current restore mode: 0 cloud, 1 phone-transfer companion. */
-extern int current_restore_client;
-/** Backup set chosen by the user. */
-extern std::string serial_num_user_select;
-/** Record of the client that switched restore mode on. */
-extern void *g_restore_cb_data;
-
-/* ---- attributes.cpp ---- */
+/** Whether packages are restored as they are installed, and for whom. */
+enum class restore_mode { off, cloud, companion };
+[[nodiscard]] restore_mode current_restore_mode();
+/** Restore mode of the phone-transfer companion is active. */
+[[nodiscard]] bool pellix_restore_running();
+/** Restore mode was enabled by the cloud client. */
+[[nodiscard]] bool cloud_restore_running();
+/** Packages that are waited for, in the order given; none while the mode is off. */
+[[nodiscard]] std::vector<std::string> restore_candidates();
+/** True when a restore takes the companion's archive, at once, and not the cloud's. */
+[[nodiscard]] bool restores_from_companion();
 
 /**
- * Look one path up in a file-info table. @p path begins with @p root and "/".
- * @param[out] label points into the table
- * @return 0, 19 without a table, 31 when the entry or a member of it is missing
+ * Switch restore mode on, in place of an earlier one. Waits for the cloud's session where it is
+ * @p client's.
+ * @param serial_num the device whose archives are wanted
+ * @param pkg_list JSON array of package ids; with none of them nothing is switched on
+ * @param record kept while the mode lasts, for "restore_stop"
+ * @return #QUARN_OK, #QUARN_REFUSED for the cloud while the companion's mode is on, or for a
+ *         serial number that is none, #QUARN_CANCELLED when it was withdrawn meanwhile
  */
-int get_file_info_from_backup(json_object *table, const char *pkgid, const char *root,
-                              const char *path, int *mode, unsigned int *uid, unsigned int *gid,
-                              char **label);
-/** Give a directory or regular file its mode, the application owner and its label. @return 1, 0 */
-int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table);
+[[nodiscard]] int enable_restore_mode(quarn_client_kind client, const std::string &serial_num,
+                                      const char *pkg_list, std::unique_ptr<client_cb_data> record);
+/** Restore mode off: it has served its purpose, or its client says that it has. */
+void disable_restore_mode();
 /**
- * The same for an object that is open already (O_PATH is enough), so that what
- * is changed is what was looked at; @p path names it in messages and the table.
+ * Restore mode off, with its downloads, because its client does not want it any more: it was not
+ * used.
+ * @param sender whose mode, a unique bus name
+ * @return false when there is none of that client
  */
-int restore_object_info(int fd, const struct stat &status, const char *path, const char *pkgid,
-                        const char *root, json_object *table);
-/** True for the labels that a restore may write itself. @p path is for messages. */
-int is_known_exception_label(const char *path, const char *label, const char *pkgid);
-/** chmod() of an open object; a link has no mode of its own. @return 0, or -1 with errno */
-int change_object_mode(int fd, const struct stat &status, mode_t mode);
-/** chown() of an open object, a link itself included. @return 0, or -1 with errno */
-int change_object_owner(int fd, uid_t uid, gid_t gid);
-
-/* ---- table.cpp ---- */
-
-/**
- * The table of a JSON text, the caller's; null when the text is no JSON
- * object. Entries with equal attributes share them: what is read is not to be
- * changed.
- */
-json_object *parse_file_info_table(const char *text);
-
-/* ---- walk.cpp ---- */
-
-/** Modes, owners and labels of the whole package from the unpacked table. @return 1, 0 */
-int restore_app_info(const char *pkgid, const char *root);
-/** One directory of it and everything below. @return 1 when every entry was restored, else 0 */
-int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
-                              json_object *table);
-/** Make the links that the table lists. @return 1 */
-int restore_symlnk(const char *pkgid, const char *root, json_object *table);
-/** Empty the three data directories but for the snapshot. */
-void clear_app_dir(const char *pkgid, const char *root);
-
-/* ---- snapshot.cpp: the caller holds the PackageDataLock, where not told otherwise ---- */
-
-/** Copy the package's data aside. @return 0, 36, or what writing the table gave */
-int temp_backup_initial_app_data(const char *pkgid, const char *root);
-/** Copy what lies below @p dir into the snapshot @p temp_dir. @return 1, 0 when anything failed */
-int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
-                       file_info_table_h *table);
-/** put_snapshot_back() of snapshot.h. @return 0 */
-int rollback_to_initial_app_data(const char *pkgid, const char *root);
-/** Move what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
-int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
-/**
- * Remove the snapshot, its table first: from then on the present data counts.
- * @return false when that data cannot be brought onto the disk; the snapshot is kept then
- */
-bool discard_snapshot(const char *pkgid, const char *root);
-/**
- * Undo what a daemon that died in a restore of the package left: a complete
- * snapshot is put back, an incomplete one removed. Where the application has
- * written since, its data stays and the snapshot is kept. Takes the
- * PackageDataLock; a package that is packed at the moment was found whole.
- * @return true when all data was put back
- */
-bool recover_interrupted_restore(const char *pkgid, const char *root);
-/** The same for every installed package. */
-void recover_interrupted_restores();
-
-/** Told the name of each step of a restore; null but in tests. */
-extern void (*restore_step_hook)(const char *step);
-inline void restore_step(const char *step) {
-  if (restore_step_hook == nullptr) return;
-  const ActAsRoot root;
-  restore_step_hook(step);
-}
-
-/* ---- pipeline.cpp ---- */
-
-/**
- * Restore one installed package: from the cloud later, by a download, or from
- * the phone-transfer companion at once.
- * @return 0, 42 when the download was refused, from the companion the unpacking's result
- */
-int restore_app_data(const char *appid, pkg_restore_context *ctx);
-/**
- * Count one download as done. With none left the restore ends: a waiting
- * request's loop is quit, any other context is deleted and its icon shown.
- */
-void check_package_restore_complete(pkg_restore_context *ctx);
-
-/* ---- report.cpp ---- */
-
-enum class restore_stage { downloading, snapshot, unpacking, attributes, finished };
-
-/** What became of a package; none while it is not settled. */
-enum class restore_outcome {
-  none,
-  restored,
-  rolled_back, /**< the data is as it was before */
-  incomplete,  /**< not all of the data is in its place; what is missing is kept and tried again */
-  failed,      /**< nothing was changed */
-  skipped      /**< not attempted */
-};
-
-/** One step of one package's restore; valid during the call only. */
-struct restore_progress {
-  unsigned run = 0; /**< tells the restores of one process apart: a mode, or one request */
-  int index = 0;    /**< packages that have ended in this run */
-  int count = 0;    /**< of how many */
-  const char *package = "";
-  restore_stage stage = restore_stage::downloading;
-  restore_outcome outcome = restore_outcome::none; /**< settled with restore_stage::finished */
-  int result = QUARN_OK;                           /**< result code, 0 while running */
-  std::uint64_t size = 0; /**< bytes of the archive on the device, 0 while there is none */
-};
-using restore_progress_sink = void (*)(const restore_progress &progress);
-
-/** Follow what restores do. The sink must not block; null ends it. */
-void set_restore_progress_sink(restore_progress_sink sink);
-/** Tell the sink, if there is one, of a step or of the end of a package's restore. */
-void report_restore_step(const std::string &package, restore_stage stage, std::uint64_t size = 0);
-void report_restore_end(const std::string &package, restore_outcome outcome, int result,
-                        std::uint64_t size = 0);
-/** From now on restores belong to a run of @p packages packages: restore mode was switched on. */
-void begin_restore_run(std::size_t packages);
-/** The next restore of @p package is a run of its own, until it ends. */
-void begin_requested_restore(const std::string &package);
-/** Keep the record of the client that switched restore mode on, in place of an earlier one. */
-void keep_restore_record(void *record);
-/**
- * Restore mode is over: the kept client gets "restore_stop", from the main
- * loop, as soon as no restore of an installed package is outstanding.
- */
-void end_restore_report();
-/** True while a "restore_stop" is about to be sent. */
-bool restore_report_pending();
-/** A restore of an installed package began (1) or ended (-1). */
-void count_outstanding_restore(int change);
-
-/* ---- install_monitor.cpp ---- */
-
-/** Follow package events. @return 1 when the monitor runs, else 0 */
-int start_install_monitor();
-/** @return 1 */
-int stop_install_monitor();
-/** Take a package off the candidate list. @return 1 when it was on it, else 0 */
-int package_to_be_restored(const char *pkgid);
-/** How the engine ends restore mode; set once at start. */
-void set_restore_disable(int (*disable)());
-
+[[nodiscard]] bool withdraw_restore_mode(const std::string &sender);
 /** Who is told that restore mode or its candidates may have changed; set once at start. */
 void set_restore_mode_observer(void (*observer)());
-/** Tells that observer. Main thread. */
-void note_restore_mode_change();
-
-/* ---- app_list.cpp ---- */
 
 /**
- * Answer a client's request for the application list: the cloud's, or for
- * client 1 this device's. @return 0, or 42 when it could not be had
+ * Answer a client's request for the application list: the cloud's, or the companion's of this
+ * device.
+ * @param record of the client; its answer is its last callback
+ * @return #QUARN_OK, or #QUARN_FAILED when it could not be had
  */
-int get_app_list(int client, void *invocation);
+int get_app_list(quarn_client_kind client, std::unique_ptr<client_cb_data> record);
+/** Answer @p sender's requests for the cloud's list as cancelled. @return how many */
+std::uint32_t withdraw_app_lists(const std::string &sender);
 
 #endif

@@ -2,7 +2,6 @@
 
 #include "files/held_folder.h"
 #include "quarn_d_restore/hidden_icon.h"
-#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/settle.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/package_lock.h"

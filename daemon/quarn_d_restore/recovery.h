@@ -15,6 +15,17 @@ enum class recovery_result {
 recovery_result recover_package_data(const char *pkgid, const char *root);
 
 /**
+ * Undo what a daemon that died in a restore of the package left: a complete
+ * snapshot is put back, an incomplete one removed. Where the application has
+ * written since, its data stays and the snapshot is kept. Takes the
+ * PackageDataLock; a package that is packed at the moment was found whole.
+ * @return true when all data was put back
+ */
+bool recover_interrupted_restore(const char *pkgid, const char *root);
+/** The same for every installed package. */
+void recover_interrupted_restores();
+
+/**
  * Everything for every installed package: interrupted restores, working files,
  * icons that were hidden. For a process that does nothing else, or before
  * anything else; needs neither account nor bus. Waits for each PackageDataLock.

@@ -14,7 +14,7 @@
 #include "files/tree_walk.h"
 #include "log_scope.h"
 #include "platform_smack.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/attributes.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_identity.h"

@@ -10,7 +10,7 @@
 #include "files/held_folder.h"
 #include "files/safe_path.h"
 #include "quarn_common.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_restore/snapshot_copy.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/file.h"

@@ -21,6 +21,8 @@
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_utils/handles.h"
 
+struct file_info_table_h;
+
 enum class snapshot_state {
   none,
   foreign,    /**< something of that name that is not the daemon's */
@@ -33,7 +35,8 @@ snapshot_state state_of_snapshot(const restore_files &files);
 /**
  * Copy the package's data aside. Its root is held by the caller; @p held is the
  * snapshot, in which everything that follows finds it, whatever the application
- * does with the name. @return 0, 36, or what writing the table gave
+ * does with the name.
+ * @return #QUARN_OK, #QUARN_REFUSED, or what writing the table gave
  */
 int take_snapshot(const char *pkgid, const char *root, std::optional<HeldFolder> *held);
 
@@ -73,6 +76,22 @@ bool set_own_table_aside(const restore_files &files);
 /** Put it back, in place of a table. May be repeated; nothing when there is none. */
 void put_own_table_back(const restore_files &files);
 
+/** The application's own file of the table's name is not in the way while this lives. */
+class OwnTableAside {
+ public:
+  /** @param files borrowed, and outlives this */
+  explicit OwnTableAside(const restore_files &files)
+      : files_(files), done_(set_own_table_aside(files)) {}
+  ~OwnTableAside() { put_own_table_back(files_); }
+  OwnTableAside(const OwnTableAside &) = delete;
+  OwnTableAside &operator=(const OwnTableAside &) = delete;
+  explicit operator bool() const { return done_; }
+
+ private:
+  const restore_files &files_;
+  const bool done_;
+};
+
 /** The fingerprint of a file's present content, as the stamps have it. */
 std::uint64_t file_stamp(const struct stat &status);
 
@@ -92,5 +111,23 @@ class StampWriter {
   std::vector<std::uint64_t> waiting_;
   bool failed_;
 };
+
+/**
+ * Remove the snapshot, its table first: from then on the present data counts.
+ * @return false when that data cannot be brought onto the disk; the snapshot is kept then
+ */
+bool discard_snapshot(const char *pkgid, const char *root);
+
+/* ---- single steps, which the engine itself does not call ---- */
+
+/** take_snapshot() of a package whose root nobody holds. */
+int temp_backup_initial_app_data(const char *pkgid, const char *root);
+/** Copy what lies below @p dir into the snapshot @p temp_dir. @return 1, 0 when anything failed */
+int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
+                       file_info_table_h *table);
+/** put_snapshot_back(). @return #QUARN_OK */
+int rollback_to_initial_app_data(const char *pkgid, const char *root);
+/** Move what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
+int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
 
 #endif

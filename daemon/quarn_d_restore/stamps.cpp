@@ -9,7 +9,6 @@
 #include "files/safe_path.h"
 #include "files/tree_walk.h"
 #include "quarn_common.h"
-#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/package_identity.h"

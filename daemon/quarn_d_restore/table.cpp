@@ -6,7 +6,6 @@
 #include <cstring>
 
 #include "files/safe_path.h"
-#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/table_reader.h"
 
 json_object *parse_file_info_table(const char *text) {

@@ -1,3 +1,5 @@
+#include "quarn_d_restore/walk.h"
+
 #include <fcntl.h>
 
 #include <cerrno>
@@ -12,8 +14,10 @@
 #include "platform_security_server.h"
 #include "platform_smack.h"
 #include "quarn_d_restore/archive_table.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/attributes.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/restore_step.h"
+#include "quarn_d_restore/settle.h"
 #include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"

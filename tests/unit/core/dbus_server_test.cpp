@@ -22,6 +22,7 @@
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/handles.h"
@@ -89,7 +90,8 @@ guint __wrap_g_bus_own_name(GBusType type, const gchar *name, GBusNameOwnerFlags
 }
 }
 
-char cloud_restore_running = 0;
+bool cloud_mode = false;
+bool cloud_restore_running() { return cloud_mode; }
 bool is_idle_status() { return !quarnd_calls_unjudged(); }
 void quarn_loop_quit() { steps.emplace_back("quit"); }
 void init_last_backup_time() { note("init_last_backup_time"); }
@@ -279,9 +281,9 @@ TEST_F(Callers, TheCompanionAsksForItsListAndItsRestoreMode) {
   EXPECT_EQ(client_->call("restore_enable", "(1, 1, '', '[]', uint32 1)").reply, "(0,)");
   EXPECT_EQ(client_->call("restore_enable", "(1, 0, '', '[]', uint32 1)").error_name, kDenied);
   EXPECT_EQ(client_->call("restore_enable", "(0, 1, '', '', uint32 1)").reply, "(0,)");
-  cloud_restore_running = 1;
+  cloud_mode = true;
   EXPECT_EQ(client_->call("restore_enable", "(0, 1, '', '', uint32 1)").error_name, kDenied);
-  cloud_restore_running = 0;
+  cloud_mode = false;
   EXPECT_EQ(client_->call("manual_backup_start", "(uint32 1,)").error_name, kDenied);
 }
 

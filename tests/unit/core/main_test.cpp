@@ -54,7 +54,6 @@ bool answer_to_given_up_name = false;
 void (*on_turn)() = nullptr;
 std::vector<int> woken;
 std::vector<void (*)()> observers;
-int (*restore_disable)() = nullptr;
 void (*boot_recovery)() = nullptr;
 void (*bus_acquired_hook)(GDBusConnection *) = nullptr;
 
@@ -108,8 +107,8 @@ void quarnd_dbus_leave() {
 bool calls_deferred = false;
 bool turn_is_there = true;
 bool quarnd_calls_deferred() { return calls_deferred; }
-char pellix_restore_running = 0;
-char cloud_restore_running = 0;
+restore_mode present_mode = restore_mode::off;
+restore_mode current_restore_mode() { return present_mode; }
 std::vector<std::string> turn_lines;
 bool tell_quarn_predecessor(const std::string &line, int signo) {
   step(("tell " + line + (signo == kWithdrawSignal ? "" : "?")).c_str());
@@ -188,19 +187,11 @@ void monitor_auto_backup_status() { step("monitor_auto_backup_status"); }
 void init_backup_req_dispatch_thread() { step("init_backup_req_dispatch_thread"); }
 bool backups_outstanding = true;
 bool backup_request_outstanding() { return backups_outstanding; }
-void set_restore_disable(int (*disable)()) { restore_disable = disable; }
 void set_boot_recovery(void (*recover)()) { boot_recovery = recover; }
 void (*in_recovery)() = nullptr;
 void recover_device() {
   step("recovery");
   if (in_recovery != nullptr) in_recovery();
-}
-int quarnd_restore_enable(int on, int client, const char *, const char *, void *record) {
-  EXPECT_EQ(on, 0);
-  EXPECT_EQ(client, 0);
-  EXPECT_EQ(record, nullptr);
-  step("restore_off");
-  return 0;
 }
 void quit_nested_loops() { step("quit_nested_loops"); }
 
@@ -229,7 +220,6 @@ class Main : public ::testing::Test {
     backups_outstanding = true;
     manual_backup_canceled = false;
     observers.clear();
-    restore_disable = nullptr;
     boot_recovery = nullptr;
     for (const int signo : signals_) signal(signo, SIG_DFL);
     restart();
@@ -396,11 +386,11 @@ TEST_F(Main, IdleProcessLeavesForTheRequestsOfTheNext) {
     return std::exchange(steps, {});
   };
   EXPECT_EQ(leave(), Texts{"terminate"});
-  for (char *const mode : {&pellix_restore_running, &cloud_restore_running}) {
-    *mode = 1;
+  for (const restore_mode mode : {restore_mode::companion, restore_mode::cloud}) {
+    present_mode = mode;
     EXPECT_EQ(leave(), Texts{}) << "restore mode is this process's";
-    *mode = 0;
   }
+  present_mode = restore_mode::off;
 }
 
 TEST_F(Main, ProcessWhoseRequestsWaitAsksTheEarlierOneToLeaveUntilItsTurnComes) {
@@ -487,16 +477,14 @@ TEST_F(Main, OnlyTheRecoveryIsMadeWhenItIsAskedFor) {
 
 TEST_F(Main, LowerFloorsAreGivenTheirHooksFirst) {
   init_quarn();
-  ASSERT_NE(restore_disable, nullptr);
   ASSERT_NE(boot_recovery, nullptr);
   ASSERT_NE(bus_acquired_hook, nullptr);
   EXPECT_EQ(observers.size(), 3U);
   for (void (*const observer)() : observers) EXPECT_EQ(observer, quarnd_status_refresh);
   restart();
-  EXPECT_EQ(restore_disable(), 0);
   boot_recovery();
   bus_acquired_hook(nullptr);
-  EXPECT_EQ(steps, (Texts{"restore_off", "recovery", "status_export", "packages_export"}));
+  EXPECT_EQ(steps, (Texts{"recovery", "status_export", "packages_export"}));
 }
 
 }  // namespace

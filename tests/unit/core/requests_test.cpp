@@ -4,6 +4,7 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <string>
 #include <utility>
 #include <vector>
@@ -55,8 +56,8 @@ void request_backup(void *client) {
 void cancel_backup(void *client) {
   note(std::string("cancel_backup cancelled=") + (manual_backup_canceled ? "1" : "0"), client);
 }
-int get_app_list(int client, void *data) {
-  note("get_app_list " + number(client), data);
+int get_app_list(quarn_client_kind client, std::unique_ptr<client_cb_data> data) {
+  note("get_app_list " + number(client), data.release());
   return list_result;
 }
 void request_power_lock(bool lock) { steps.emplace_back(lock ? "lock" : "unlock"); }

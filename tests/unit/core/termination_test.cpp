@@ -10,6 +10,7 @@
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_loop.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_server.h"
 
@@ -22,7 +23,7 @@ bool idle = true;
 
 }  // namespace
 
-char cloud_restore_running = 0;
+bool cloud_restore_running() { return false; }
 bool is_idle_status() { return idle; }
 void init_last_backup_time() {}
 int quarnd_backup_enable(int) { return 0; }

@@ -12,6 +12,8 @@
 #include "handler_fixture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/cancel_own.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
@@ -331,14 +333,14 @@ TEST_F(AppDataTest, ARestoreWithoutDeviceInformationIsAnsweredWithThirtySix) {
 }
 
 TEST_F(AppDataTest, ARestoreInTheCompanionsModeDoesNotWait) {
-  current_restore_client = 1;
+  current_restore_client = QUARN_CLIENT_COMPANION;
   EXPECT_EQ(restore(), 0);
   EXPECT_EQ(outside.answers, restored(31)) << "there is no archive of the companion's";
   EXPECT_TRUE(downloads.empty());
 }
 
 TEST_F(AppDataTest, ARestoreInTheCompanionsModeLetsOthersBeServedWhileItsPackageIsPacked) {
-  current_restore_client = 1;
+  current_restore_client = QUARN_CLIENT_COMPANION;
   std::promise<void> locked;
   std::promise<void> go;
   bool in_time = false;

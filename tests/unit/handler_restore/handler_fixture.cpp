@@ -31,8 +31,6 @@ extern "C" void *ecore_timer_del(Ecore_Timer *) { return nullptr; }
 
 HandlerTest::HandlerTest() {
   session = FakeSession{};
-  pellix_restore_running = 0;
-  cloud_restore_running = 0;
   ON_CALL(platform, package_manager_get_package_info).WillByDefault([](auto, auto *info) {
     *info = reinterpret_cast<package_info_h>(a_handle);
     return 0;

@@ -4,6 +4,7 @@
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/cancel_own.h"
+#include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
@@ -95,8 +96,8 @@ TEST_F(RestoreModeTest, TheCloudClientSwitchesOn) {
   EXPECT_EQ(current_restore_client, 0);
   EXPECT_EQ(serial_num_user_select, kSerial);
   EXPECT_EQ(subscriptions.size(), 1U);
-  EXPECT_EQ(cloud_restore_running, 1);
-  EXPECT_EQ(pellix_restore_running, 0);
+  EXPECT_EQ(cloud_restore_running(), 1);
+  EXPECT_EQ(pellix_restore_running(), 0);
   EXPECT_NE(g_restore_cb_data, nullptr);
   EXPECT_TRUE(is_idle_status());
   expect_info("start install event monitoring. client:0, serial_num:350000000000001");
@@ -152,8 +153,8 @@ TEST_F(RestoreModeTest, TheCompanionSwitchesOnWithoutTheCloud) {
   EXPECT_EQ(session.asked, 0);
   EXPECT_EQ(current_restore_client, 1);
   EXPECT_EQ(subscriptions.size(), 1U);
-  EXPECT_EQ(pellix_restore_running, 1);
-  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(pellix_restore_running(), 1);
+  EXPECT_EQ(cloud_restore_running(), 0);
   expect_info("start install event monitoring. client:1, serial_num:");
 }
 
@@ -182,8 +183,8 @@ TEST_F(RestoreModeTest, TheCompanionMayEnterWhileTheCloudClientsModeRuns) {
   EXPECT_EQ(on(0), 0);
   EXPECT_EQ(on(1), 0);
   EXPECT_EQ(current_restore_client, 1);
-  EXPECT_EQ(pellix_restore_running, 1);
-  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(pellix_restore_running(), 1);
+  EXPECT_EQ(cloud_restore_running(), 0);
   expect_info("start_install_monitor : already initialized");
 }
 
@@ -194,7 +195,7 @@ TEST_F(RestoreModeTest, AnEmptyArrayReturnsZeroWithoutTheMonitor) {
   expect_info("there is no package should be restored");
   EXPECT_TRUE(pkg_list_to_be_restored.empty());
   EXPECT_EQ(serial_num_user_select, "before");
-  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(cloud_restore_running(), 0);
   EXPECT_TRUE(subscriptions.empty());
   EXPECT_EQ(g_restore_cb_data, nullptr);
 }
@@ -221,7 +222,7 @@ TEST_F(RestoreModeTest, WithoutASessionNothingIsStartedAndTheRecordIsNotKept) {
   EXPECT_EQ(on(0), 0);
   EXPECT_TRUE(subscriptions.empty());
   EXPECT_EQ(g_restore_cb_data, nullptr);
-  EXPECT_EQ(cloud_restore_running, 1);
+  EXPECT_EQ(cloud_restore_running(), 1);
   EXPECT_TRUE(is_idle_status());
 }
 
@@ -252,14 +253,14 @@ TEST_F(RestoreModeTest, WhatWasAskedWhileTheSessionStartedCounts) {
   session.meanwhile = [&] { EXPECT_EQ(on(1, "", R"(["mine"])", 2), 0); };
   EXPECT_EQ(on(0), 36) << "the companion's mode runs by now";
   EXPECT_EQ(current_restore_client, 1);
-  EXPECT_EQ(pellix_restore_running, 1);
-  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(pellix_restore_running(), 1);
+  EXPECT_EQ(cloud_restore_running(), 0);
   EXPECT_EQ(pkg_list_to_be_restored, List{"mine"});
 
   EXPECT_EQ(off(), 0);
   session.meanwhile = [&] { EXPECT_EQ(off(), 0); };
   EXPECT_EQ(on(0), 0);
-  EXPECT_EQ(cloud_restore_running, 0) << "it was switched off meanwhile";
+  EXPECT_EQ(cloud_restore_running(), 0) << "it was switched off meanwhile";
   EXPECT_EQ(g_restore_cb_data, nullptr);
 }
 
@@ -293,8 +294,8 @@ TEST_F(RestoreModeTest, SwitchingOffAlwaysReturnsZeroAndClearsBothFlags) {
     EXPECT_EQ(on(client), 0);
     EXPECT_EQ(off(1 - client), 0) << "anybody may";
     EXPECT_EQ(current_restore_client, 0);
-    EXPECT_EQ(cloud_restore_running, 0);
-    EXPECT_EQ(pellix_restore_running, 0);
+    EXPECT_EQ(cloud_restore_running(), 0);
+    EXPECT_EQ(pellix_restore_running(), 0);
   }
 }
 
@@ -334,9 +335,9 @@ TEST_F(RestoreModeTest, ARequestThatIsReplacedWhileItWaitsHasItsEndAsWell) {
 TEST_F(RestoreModeTest, ItsClientMayWithdrawTheModeAndNobodyElse) {
   EXPECT_EQ(on(0, kSerial, kList, 1), 0);
   EXPECT_EQ(quarnd_cancel_own(":1.8"), 0U);
-  EXPECT_EQ(cloud_restore_running, 1);
+  EXPECT_EQ(cloud_restore_running(), 1);
   EXPECT_EQ(quarnd_cancel_own(":1.7"), 1U);
-  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(cloud_restore_running(), 0);
   EXPECT_EQ(quarnd_cancel_own(":1.7"), 0U);
   run_main_context();
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
@@ -356,7 +357,7 @@ TEST_F(RestoreModeTest, AWithdrawnRequestDoesNotSwitchTheModeOn) {
   });
   run_main_context();
   EXPECT_EQ(reply, 17);
-  EXPECT_EQ(cloud_restore_running, 0);
+  EXPECT_EQ(cloud_restore_running(), 0);
   EXPECT_TRUE(pkg_list_to_be_restored.empty());
   EXPECT_TRUE(claimed_packages(kSerial).empty()) << "what is waited for no longer is not kept";
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
@@ -400,13 +401,11 @@ TEST_F(RestoreModeTestWithMark, NorIsOneInWhosePlaceAnotherCame) {
 }
 
 TEST_F(RestoreModeTest, AListThatRunsEmptyEndsTheMode) {
-  set_restore_disable([] { return quarnd_restore_enable(0, 0, "", "", nullptr); });
   EXPECT_EQ(on(0, kSerial, R"(["org.example.notes"])"), 0);
   EXPECT_EQ(package_to_be_restored(kPkg), 1);
   run_main_context();
   EXPECT_EQ(outside.answers, Answers{stop(1)});
-  EXPECT_EQ(cloud_restore_running, 0);
-  set_restore_disable(nullptr);
+  EXPECT_EQ(cloud_restore_running(), 0);
 }
 
 }  // namespace

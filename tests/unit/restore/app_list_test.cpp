@@ -13,7 +13,7 @@
 #include "quarn_common.h"
 #include "quarn_d_backup/list_bound.h"
 #include "quarn_d_conditions/conditions.h"
-#include "quarn_d_restore/withdrawal.h"
+#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_d_utils/request_cause.h"
 #include "restore_fixture.h"
@@ -25,7 +25,9 @@ namespace {
 class AppListTest : public RestoreTest {
  protected:
   using Answers = std::vector<Outside::Answer>;
-  int ask(int client) { return get_app_list(client, make_record(9)); }
+  int ask(int client) {
+    return get_app_list(static_cast<quarn_client_kind>(client), owned_record(9));
+  }
   ~AppListTest() override { stop_wifi_monitor(); }
   void connect_to_wifi() {
     ON_CALL(platform, connection_get_type).WillByDefault([](auto, auto *type) {

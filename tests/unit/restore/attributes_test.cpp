@@ -5,6 +5,7 @@
 #include <filesystem>
 
 #include "quarn_common.h"
+#include "quarn_d_restore/attributes.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

@@ -10,6 +10,7 @@
 #include <set>
 
 #include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 
@@ -161,7 +162,7 @@ TEST_F(CrashTest, KilledInTheMiddleOfTheUnpacking) {
 class KilledCompanionTest : public CrashTest {
  protected:
   KilledCompanionTest() {
-    current_restore_client = 1;
+    current_restore_client = QUARN_CLIENT_COMPANION;
     std::filesystem::create_directories(kCompanionDir);
     std::filesystem::copy_file(
         archive, std::string(kCompanionDir) + "/" + kPkg + "_" + std::string(kVersion) + ".zip");

@@ -11,6 +11,7 @@
 #include "files/safe_path.h"
 #include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/directory.h"
 #include "restore_fixture.h"

@@ -7,6 +7,8 @@
 #include <filesystem>
 #include <fstream>
 
+#include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/snapshot.h"
 #include "restore_fixture.h"
 
 using ::testing::Return;

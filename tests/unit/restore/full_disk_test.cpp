@@ -10,6 +10,7 @@
 #include <set>
 
 #include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/file.h"
 #include "restore_fixture.h"

@@ -8,6 +8,7 @@
 #include <filesystem>
 
 #include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/snapshot.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

@@ -8,6 +8,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/package_identity.h"
 #include "restore_fixture.h"
@@ -267,7 +268,7 @@ TEST_F(IdentityTest, AnExchangedTableIsNotRead) {
 }
 
 TEST_F(IdentityTest, WhatACompanionsFailedRestoreLeavesIsTheApplicationsToUse) {
-  current_restore_client = 1;
+  current_restore_client = QUARN_CLIENT_COMPANION;
   std::filesystem::create_directories(kCompanionDir);
   const std::string archive =
       std::string(kCompanionDir) + "/" + kPkg + "_" + std::string(kVersion) + ".zip";

@@ -15,6 +15,7 @@
 #include "platform_package_manager.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_conditions/conditions.h"
+#include "quarn_d_restore/install_monitor.h"
 #include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/package.h"
 #include "restore_fixture.h"
@@ -57,23 +58,19 @@ extern "C" int fstatfs(int fd, struct statfs *status) noexcept {
 namespace {
 
 char a_handle[1];
-int disabled = 0;
+/** How often restore mode was switched off. */
+int disabled() { return count_logged(DLOG_INFO, "stop install event monitor"); }
 std::vector<std::pair<restore_outcome, int>> ends;
 
 class MonitorTest : public RestoreTest {
  protected:
   MonitorTest() {
-    disabled = 0;
     free_space = 0;
     timer_delays.clear();
     ends.clear();
     for (const std::string &package : owed_packages(kSerial)) {
       forget_owed_archive(kSerial, package, "");
     }
-    set_restore_disable([] {
-      ++disabled;
-      return 0;
-    });
     set_restore_progress_sink([](const restore_progress &step) {
       if (step.stage == restore_stage::finished) ends.emplace_back(step.outcome, step.result);
     });
@@ -140,7 +137,6 @@ class MonitorTest : public RestoreTest {
     free_space = 0;
     stop_wifi_monitor();
     stop_install_monitor();
-    set_restore_disable(nullptr);
     init_icon_hide_delay_timer_list();
   }
 
@@ -266,9 +262,9 @@ TEST_F(MonitorTest, AnInstallOfNoCandidateLeavesTheListUnchanged) {
 TEST_F(MonitorTest, AnEventOnAnEmptyListSchedulesTheEnd) {
   pkg_list_to_be_restored.clear();
   install();
-  EXPECT_EQ(disabled, 0);
+  EXPECT_EQ(disabled(), 0);
   run_main_context();
-  EXPECT_EQ(disabled, 1);
+  EXPECT_EQ(disabled(), 1);
   expect_info("installation of all restore candidate package was completed!");
 }
 
@@ -276,7 +272,7 @@ TEST_F(MonitorTest, TheLastCandidateSchedulesTheEnd) {
   pkg_list_to_be_restored = {kPkg};
   EXPECT_EQ(package_to_be_restored(kPkg), 1);
   run_main_context();
-  EXPECT_EQ(disabled, 1);
+  EXPECT_EQ(disabled(), 1);
 }
 
 TEST_F(MonitorTest, AListThatWasGivenMeanwhileIsNotEnded) {
@@ -284,11 +280,10 @@ TEST_F(MonitorTest, AListThatWasGivenMeanwhileIsNotEnded) {
   EXPECT_EQ(package_to_be_restored(kPkg), 1);
   pkg_list_to_be_restored = {"org.example.next"};
   run_main_context();
-  EXPECT_EQ(disabled, 0);
+  EXPECT_EQ(disabled(), 0);
 }
 
-TEST_F(MonitorTest, AnEndWithoutAnybodyToEndItIsHarmless) {
-  set_restore_disable(nullptr);
+TEST_F(MonitorTest, AnEndOfAModeThatIsOffIsHarmless) {
   pkg_list_to_be_restored.clear();
   EXPECT_EQ(package_to_be_restored(kPkg), 0);
   run_main_context();
@@ -445,7 +440,7 @@ TEST_F(MonitorTest, ADownloadThatWasRequestedBeforeTheVisitFailedIsFinished) {
 }
 
 TEST_F(MonitorTest, ACompanionsRestoreHappensAtOnce) {
-  current_restore_client = 1;
+  current_restore_client = QUARN_CLIENT_COMPANION;
   serial_num_user_select = kSerial;
   install();
   EXPECT_TRUE(downloads.empty());
@@ -463,12 +458,8 @@ TEST_F(MonitorTest, AVersionThatCannotBeReadIsNoPath) {
 }
 
 TEST_F(MonitorTest, RestoresOfTheModeAreFinishedBeforeItsClientIsToldOfTheEnd) {
-  keep_restore_record(make_record(5));
+  keep_restore_record(owned_record(5));
   pkg_list_to_be_restored = {kPkg};
-  set_restore_disable([] {
-    end_restore_report();
-    return 0;
-  });
   install();
   run_main_context();
   EXPECT_TRUE(outside.answers.empty());
@@ -479,12 +470,8 @@ TEST_F(MonitorTest, RestoresOfTheModeAreFinishedBeforeItsClientIsToldOfTheEnd) {
 }
 
 TEST_F(MonitorTest, TheClientIsToldOfTheEndBeforeTheDaemonEndsItself) {
-  keep_restore_record(make_record(5));
+  keep_restore_record(owned_record(5));
   pkg_list_to_be_restored = {kPkg};
-  set_restore_disable([] {
-    end_restore_report();
-    return 0;
-  });
   install();
   answer(BACKUP_TRANS_ERROR_NETWORK);  // before the main loop came to the end of the mode
   while (outside.terminations.empty()) g_main_context_iteration(nullptr, FALSE);

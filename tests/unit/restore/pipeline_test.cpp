@@ -10,8 +10,11 @@
 #include <thread>
 
 #include "quarn_d_conditions/conditions.h"
+#include "quarn_d_restore/archive_download.h"
 #include "quarn_d_restore/recovery.h"
-#include "quarn_d_restore/withdrawal.h"
+#include "quarn_d_restore/restore_step.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/file.h"
@@ -64,6 +67,13 @@ class PipelineTest : public RestoreTest {
     EXPECT_EQ(start_wifi_monitor(), 1);
   }
   int restore(pkg_restore_context *ctx) { return restore_app_data("app", ctx); }
+  /** A restore that nobody waits for, as of a package that was installed. */
+  int restore_monitored() {
+    RestoreContextPtr ctx(new_context());
+    const int result = restore(ctx.get());
+    if (ctx->pending > 0) leave_restore(std::move(ctx));
+    return result;
+  }
   /** A context that the test keeps, as a waiting request does. */
   std::unique_ptr<pkg_restore_context> waiting_context() const {
     std::unique_ptr<pkg_restore_context> ctx(new_context());
@@ -233,8 +243,7 @@ TEST_F(PipelineTest, AnEarlierTerminationFindsTheDaemonBusyWhileAnotherRestoreIs
 
 TEST_F(PipelineTest, AMonitoredRestoreShowsTheIconAndFreesItsContext) {
   make_old_data();
-  pkg_restore_context *ctx = new_context();
-  ASSERT_EQ(restore(ctx), 0);
+  ASSERT_EQ(restore_monitored(), 0);
   make_archive(download(), new_data);
   answer();
   EXPECT_EQ(shown, std::vector<std::string>{kPkg});
@@ -244,7 +253,7 @@ TEST_F(PipelineTest, AWaitingRequestGetsItsLoopQuitAndKeepsTheContext) {
   auto ctx = waiting_context();
   const GMainLoopPtr loop(new_wait_loop());
   ASSERT_EQ(restore(ctx.get()), 0);
-  ctx->main_loop = g_main_loop_ref(loop.get());
+  ctx->main_loop.reset(g_main_loop_ref(loop.get()));
   auto then = [this] { answer(BACKUP_TRANS_ERROR_NETWORK); };
   g_idle_add(
       [](gpointer call) {
@@ -261,8 +270,7 @@ TEST_F(PipelineTest, AWaitingRequestGetsItsLoopQuitAndKeepsTheContext) {
 TEST_F(PipelineTest, AnAbandonedContextIsFreedByTheEngine) {
   auto ctx = waiting_context();
   ASSERT_EQ(restore(ctx.get()), 0);
-  ctx->abandoned = true;
-  static_cast<void>(ctx.release());
+  abandon_restore(std::move(ctx));
   answer(BACKUP_TRANS_ERROR_NETWORK);
   EXPECT_TRUE(shown.empty());
 }
@@ -272,8 +280,7 @@ TEST_F(PipelineTest, AnAbandonedRestoreLeavesTheDataAsItIs) {
   const Tree before = tree_of(root);
   auto ctx = waiting_context();
   ASSERT_EQ(restore(ctx.get()), 0);
-  ctx->abandoned = true;
-  static_cast<void>(ctx.release());
+  abandon_restore(std::move(ctx));
   make_archive(download(), new_data);
   answer();
   EXPECT_EQ(tree_of(root), before);
@@ -289,7 +296,7 @@ TEST_F(PipelineTest, TheDownloadOfAnAbandonedRestoreIsEndedAndNoOther) {
   ASSERT_EQ(restore(ctx.get()), 0);
   EXPECT_EQ(transport.last_max_size, kMaxArchiveFileSize);
   EXPECT_CALL(transport, backup_trans_abort_request).Times(1);
-  abandon_restore(ctx.release());
+  abandon_restore(std::move(ctx));
   answer(BACKUP_TRANS_ERROR_CANCELLED);
   EXPECT_TRUE(downloads.empty()) << "it is not begun again";
   EXPECT_EQ(tree_of(root), before);
@@ -302,7 +309,7 @@ TEST_F(PipelineTest, AnAbandonedRestoreThatWaitsForAnotherLeavesThatAlone) {
   ASSERT_EQ(restore(first.get()), 0);
   ASSERT_EQ(restore(second.get()), 0);
   EXPECT_CALL(transport, backup_trans_abort_request).Times(0);
-  abandon_restore(second.release());
+  abandon_restore(std::move(second));
   answer(BACKUP_TRANS_ERROR_NETWORK);
   EXPECT_EQ(first->result, 12);
   EXPECT_TRUE(downloads.empty());
@@ -311,8 +318,7 @@ TEST_F(PipelineTest, AnAbandonedRestoreThatWaitsForAnotherLeavesThatAlone) {
 TEST_F(PipelineTest, WithAWithdrawnModeItsDownloadsEndAndNoRequests) {
   connect_to_wifi();
   make_old_data();
-  pkg_restore_context *monitored = new_context();
-  ASSERT_EQ(restore(monitored), 0);
+  ASSERT_EQ(restore_monitored(), 0);
   EXPECT_CALL(transport, backup_trans_abort_request).Times(1);
   abort_monitored_downloads();
   answer(BACKUP_TRANS_ERROR_CANCELLED);
@@ -328,8 +334,7 @@ TEST_F(PipelineTest, WithAWithdrawnModeItsDownloadsEndAndNoRequests) {
 TEST_F(PipelineTest, ADownloadAbortedForAnothersSakeIsBegunAgain) {
   connect_to_wifi();
   make_old_data();
-  pkg_restore_context *ctx = new_context();
-  ASSERT_EQ(restore(ctx), 0);
+  ASSERT_EQ(restore_monitored(), 0);
   for (int i = 0; i < 3; ++i) {
     answer(BACKUP_TRANS_ERROR_CANCELLED);
     ASSERT_EQ(downloads.size(), 1U) << "it goes on";
@@ -457,7 +462,7 @@ TEST_F(PipelineTest, ARestoreThatIsAbandonedWhileItsPackageIsPackedChangesNothin
   make_archive(download(), new_data);
   auto lock = std::make_unique<PackageDataLock>(kPkg, PackageUse::kPack);
   answer();
-  ctx.release()->abandoned = true;
+  abandon_restore(std::move(ctx));
   while (!is_idle_status()) g_main_context_iteration(nullptr, TRUE);
   lock.reset();
   EXPECT_EQ(tree_of(root), before);
@@ -715,7 +720,7 @@ TEST_F(PipelineTest, ASnapshotThatIsOnlyKeptGoesWithTheNextRestoreThatSucceeds) 
 class CompanionTest : public PipelineTest {
  protected:
   CompanionTest() {
-    current_restore_client = 1;
+    current_restore_client = QUARN_CLIENT_COMPANION;
     std::filesystem::create_directories(kCompanionDir);
   }
   ~CompanionTest() override { std::filesystem::remove_all("/opt/usr/apps/com.velmor.pellix-efl"); }

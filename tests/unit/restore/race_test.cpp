@@ -12,6 +12,10 @@
 #include <filesystem>
 
 #include "quarn_common.h"
+#include "quarn_d_restore/attributes.h"
+#include "quarn_d_restore/recovery.h"
+#include "quarn_d_restore/snapshot.h"
+#include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 

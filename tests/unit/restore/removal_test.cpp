@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <set>
 
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_utils/file.h"
 #include "restore_fixture.h"
 
@@ -101,7 +102,7 @@ TEST_F(RemovalTest, IsTold) {
 }
 
 TEST_F(RemovalTest, ACompanionsRestoreLeavesNothingEither) {
-  current_restore_client = 1;
+  current_restore_client = QUARN_CLIENT_COMPANION;
   install();
   std::filesystem::create_directories(kCompanionDir);
   const std::string archive =

@@ -1,4 +1,3 @@
-#include "quarn_d_restore/restore_record.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -12,7 +11,7 @@ class ReportTest : public RestoreTest {
 };
 
 TEST_F(ReportTest, TheKeptClientIsToldOfTheEndFromTheMainLoop) {
-  keep_restore_record(make_record(3));
+  keep_restore_record(owned_record(3));
   end_restore_report();
   EXPECT_TRUE(outside.answers.empty());
   run_main_context();
@@ -30,7 +29,7 @@ TEST_F(ReportTest, WithoutAKeptClientNobodyIsTold) {
 }
 
 TEST_F(ReportTest, TheEndWaitsForTheRestoresThatAreUnderWay) {
-  keep_restore_record(make_record(3));
+  keep_restore_record(owned_record(3));
   count_outstanding_restore(1);
   count_outstanding_restore(1);
   end_restore_report();
@@ -44,8 +43,8 @@ TEST_F(ReportTest, TheEndWaitsForTheRestoresThatAreUnderWay) {
 }
 
 TEST_F(ReportTest, AnEarlierRecordHasItsEndWhenALaterOneReplacesIt) {
-  keep_restore_record(make_record(3));
-  keep_restore_record(make_record(4));
+  keep_restore_record(owned_record(3));
+  keep_restore_record(owned_record(4));
   EXPECT_TRUE(outside.answers.empty()) << "not inside the call";
   EXPECT_TRUE(restore_report_pending());
   run_main_context();
@@ -57,7 +56,7 @@ TEST_F(ReportTest, AnEarlierRecordHasItsEndWhenALaterOneReplacesIt) {
 }
 
 TEST_F(ReportTest, AWithdrawnModeEndsWithItsReason) {
-  keep_restore_record(make_record(3));
+  keep_restore_record(owned_record(3));
   EXPECT_TRUE(restore_record_is_of(":1.7"));
   EXPECT_FALSE(restore_record_is_of(":1.70"));
   count_outstanding_restore(1);
@@ -65,7 +64,7 @@ TEST_F(ReportTest, AWithdrawnModeEndsWithItsReason) {
   end_restore_report();
   count_outstanding_restore(-1);
   EXPECT_FALSE(restore_record_is_of(":1.7"));
-  keep_restore_record(make_record(4));
+  keep_restore_record(owned_record(4));
   end_restore_report();
   run_main_context();
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 3}, stop(4)}))
@@ -73,10 +72,10 @@ TEST_F(ReportTest, AWithdrawnModeEndsWithItsReason) {
 }
 
 TEST_F(ReportTest, AClientWhoseModeIsOverGetsItsEndBeforeItIsReplaced) {
-  keep_restore_record(make_record(3));
+  keep_restore_record(owned_record(3));
   count_outstanding_restore(1);
   end_restore_report();
-  keep_restore_record(make_record(4));
+  keep_restore_record(owned_record(4));
   run_main_context();
   EXPECT_EQ(outside.answers, Answers{stop(3)});
   count_outstanding_restore(-1);

@@ -26,6 +26,7 @@
 #include "quarn_common.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/restore_step.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/unpacked_file.h"
 #include "quarn_dbus_client.h"
@@ -154,6 +155,9 @@ void request_quarn_terminate(double delay, bool restart) {
 
 void *make_record(unsigned int req_id, const std::string &sender) {
   return new client_cb_data{req_id, sender, count_waiting(sender)};
+}
+std::unique_ptr<client_cb_data> owned_record(unsigned int req_id) {
+  return std::unique_ptr<client_cb_data>(static_cast<client_cb_data *>(make_record(req_id)));
 }
 
 void run_main_context() {
@@ -291,7 +295,7 @@ RestoreTest::RestoreTest() {
   outside = Outside{};
   clear_captured_log();
   pkg_list_to_be_restored.clear();
-  current_restore_client = 0;
+  current_restore_client = QUARN_CLIENT_CLOUD;
   serial_num_user_select = kSerial;
 
   ON_CALL(platform, smack_getlabel).WillByDefault([](const char *path, char **label, auto) {

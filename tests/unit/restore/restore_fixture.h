@@ -14,6 +14,7 @@
 #include <functional>
 #include <initializer_list>
 #include <map>
+#include <memory>
 #include <string>
 #include <utility>
 #include <vector>
@@ -21,8 +22,12 @@
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "mock_transport.h"
-#include "quarn_d_restore/quarn_d_restore.h"
+#include "quarn_d_restore/app_restore.h"
+#include "quarn_d_restore/restore_context.h"
+#include "quarn_d_restore/restore_mode.h"
+#include "quarn_d_restore/restore_progress.h"
 #include "quarn_d_utils/handles.h"
+#include "quarn_dbus_client.h"
 #include "temp_dir.h"
 
 /** The label of what nobody labelled. */
@@ -68,6 +73,8 @@ extern Outside outside;
 
 /** A client_cb_data record, counted as the dispatcher does. */
 void *make_record(unsigned int req_id, const std::string &sender = ":1.7");
+/** The same, for what takes it as its own. */
+std::unique_ptr<client_cb_data> owned_record(unsigned int req_id);
 
 /** Run everything that is ready on the main context. */
 void run_main_context();

@@ -4,6 +4,7 @@
 #include <filesystem>
 #include <set>
 
+#include "quarn_d_restore/snapshot.h"
 #include "restore_fixture.h"
 
 namespace {

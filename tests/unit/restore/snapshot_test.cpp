@@ -12,6 +12,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_restore/copy_bytes.h"
+#include "quarn_d_restore/recovery.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/file.h"

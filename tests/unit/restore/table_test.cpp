@@ -5,6 +5,7 @@
 #include <set>
 
 #include "quarn_d_restore/archive_table.h"
+#include "quarn_d_restore/attributes.h"
 #include "quarn_d_utils/table_reader.h"
 #include "restore_fixture.h"
 

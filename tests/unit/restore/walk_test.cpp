@@ -6,6 +6,7 @@
 
 #include "log_scope.h"
 #include "platform_security_server.h"
+#include "quarn_d_restore/walk.h"
 #include "restore_fixture.h"
 
 using ::testing::_;

@@ -89,6 +89,10 @@ backup_trans_cause backup_trans_last_cause(void) {
   return MockTransport::current().backup_trans_last_cause();
 }
 
+const char *backup_trans_cause_word(backup_trans_cause cause) {
+  return MockTransport::current().backup_trans_cause_word(cause);
+}
+
 void backup_trans_cancel_request(backup_trans_handle_h handle) {
   return MockTransport::current().backup_trans_cancel_request(handle);
 }

@@ -40,6 +40,7 @@ class MockTransport {
   MOCK_METHOD(int, backup_trans_delete_folder_ors_async,
               (backup_trans_handle_h, const char *, void *, backup_trans_delete_cb));
   MOCK_METHOD(backup_trans_cause, backup_trans_last_cause, ());
+  MOCK_METHOD(const char *, backup_trans_cause_word, (backup_trans_cause));
   MOCK_METHOD(void, backup_trans_cancel_request, (backup_trans_handle_h));
   MOCK_METHOD(int, backup_trans_abort_request, (backup_trans_handle_h, void *));
 

@@ -1,5 +1,7 @@
 #include <algorithm>
 #include <memory>
+#include <string>
+#include <utility>
 #include <vector>
 
 #include "files/safe_path.h"
@@ -8,7 +10,6 @@
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_conditions/conditions.h"
 #include "quarn_d_restore/quarn_d_restore.h"
-#include "quarn_d_restore/withdrawal.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
@@ -20,7 +21,6 @@
 
 namespace {
 
-constexpr int kPellixClient = 1;
 constexpr char kFailed[] = "failed";
 constexpr char kNone[] = "none";
 /** How often a download is begun again that was aborted for somebody else's sake. */
@@ -30,7 +30,7 @@ constexpr int kMaxTimesAborted = 8;
 struct list_request {
   std::string local_path;
   std::string cloud_path;
-  void *invocation;
+  std::unique_ptr<client_cb_data> record; /**< whom the list is for */
   int times_aborted = 0;
   bool withdrawn = false; /**< its client wants it no more */
 };
@@ -123,40 +123,40 @@ void __get_app_list_resp_cb(backup_trans_error_code error, void *user_data, char
   note_request_end(cause);
   remove_list(request->local_path);
   if (text == nullptr && request->withdrawn) {
-    quarn_dbus_get_app_list_cb(QUARN_CANCELLED, kFailed, request->invocation);
+    quarn_dbus_get_app_list_cb(QUARN_CANCELLED, kFailed, request->record.release());
   } else if (text == nullptr) {
-    quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kNone, request->invocation);
+    quarn_dbus_get_app_list_cb(QUARN_BAD_ARGUMENT, kNone, request->record.release());
   } else {
-    quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), request->invocation);
+    quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), request->record.release());
   }
   request_power_lock(false);
 }
 
-int get_pellix_list(void *invocation) {
+int get_pellix_list(std::unique_ptr<client_cb_data> record) {
   const CString text(get_app_list_for_pellix());
   if (text == nullptr) {
-    quarn_dbus_get_app_list_cb(QUARN_FAILED, kFailed, invocation);
+    quarn_dbus_get_app_list_cb(QUARN_FAILED, kFailed, record.release());
     return QUARN_FAILED;
   }
-  quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), invocation);
+  quarn_dbus_get_app_list_cb(QUARN_OK, text.get(), record.release());
   return QUARN_OK;
 }
 
 }  // namespace
 
-int get_app_list(int client, void *invocation) {
-  if (client == kPellixClient) return get_pellix_list(invocation);
+int get_app_list(quarn_client_kind client, std::unique_ptr<client_cb_data> record) {
+  if (client == QUARN_CLIENT_COMPANION) return get_pellix_list(std::move(record));
   auto request = std::make_unique<list_request>();
   request->local_path = next_local_path();
   request->cloud_path = kCloudAppListPath;
-  request->invocation = invocation;
+  request->record = std::move(record);
   int result = BACKUP_TRANS_ERROR_LOCAL_FILE;
   if (prepare_staging_directory()) result = request_list(request);
   if (result != BACKUP_TRANS_ERROR_NONE) {
     LOGE("backup_trans_download_file_ors_async failed... %d", result);
     note_request_end(cause_of_transfer(result, request->local_path));
     remove_list(request->local_path);
-    quarn_dbus_get_app_list_cb(QUARN_TRANSFER_FAILED, kNone, invocation);
+    quarn_dbus_get_app_list_cb(QUARN_TRANSFER_FAILED, kNone, request->record.release());
     return QUARN_FAILED;
   }
   // Until the client has its answer the daemon is not idle.
@@ -168,7 +168,7 @@ std::uint32_t withdraw_app_lists(const std::string &sender) {
   std::uint32_t count = 0;
   const std::vector<list_request *> all = transferring;
   for (list_request *request : all) {
-    const auto *client = static_cast<const client_cb_data *>(request->invocation);
+    const client_cb_data *client = request->record.get();
     if (request->withdrawn || client == nullptr || client->sender != sender) continue;
     request->withdrawn = true;
     abort_transfer(request);
