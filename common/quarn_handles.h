@@ -37,7 +37,6 @@ using Handle = std::unique_ptr<T, Releaser<Release>>;
 using CString = Handle<char, &std::free>;
 /** A text that GLib has made. */
 using GText = Handle<char, &g_free>;
-using GString_ = GText;
 using GErrorPtr = Handle<GError, &g_error_free>;
 using GDirPtr = Handle<GDir, &g_dir_close>;
 using GVariantPtr = Handle<GVariant, &g_variant_unref>;

@@ -42,7 +42,10 @@ extern memps_source memps_facts;
 /** Lines that this kernel is known to print after the seven counters of a mapping. */
 extern int smaps_lines;
 
-/** Measure, and above the ceiling ask for a restart, which is dropped while work is going on. */
+/**
+ * Measure, and above the ceiling ask for a restart, which is dropped while work is going on.
+ * No part of the daemon calls it.
+ */
 void check_memps_status();
 /** Total PSS of a process in kilobytes; 0 when nothing could be read. */
 int get_memory_usage(int pid);

@@ -3,8 +3,8 @@
 #include "quarn_common.h"
 #include "quarn_log.h"
 
-GString_ as_bus_text(const char *text) {
-  return GString_(g_utf8_make_valid(text == nullptr ? "" : text, -1));
+GText as_bus_text(const char *text) {
+  return GText(g_utf8_make_valid(text == nullptr ? "" : text, -1));
 }
 
 bool can_be_called(const client_cb_data &client) {

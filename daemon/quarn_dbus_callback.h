@@ -14,7 +14,7 @@
 inline constexpr char kRestoreStop[] = "restore_stop";
 
 /** A text that a D-Bus message can carry; null is the empty one. */
-[[nodiscard]] GString_ as_bus_text(const char *text);
+[[nodiscard]] GText as_bus_text(const char *text);
 
 /** Whether there is a connection, and the record names a client. */
 [[nodiscard]] bool can_be_called(const client_cb_data &client);

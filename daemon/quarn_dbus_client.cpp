@@ -97,7 +97,7 @@ client_cb_data *as_record(void *record) {
 /** A callback of "(isu)" err, msg, req_id. */
 int send_message_callback(const char *method, int err, const char *msg, client_cb_data *record,
                           bool is_last) {
-  GString_ made;
+  GText made;
   const char *text = msg;
   if (text == nullptr || g_utf8_validate(text, -1, nullptr) == FALSE) {
     made = as_bus_text(msg);
@@ -207,7 +207,7 @@ int quarnd_dbus_publish(const char *signal_name, const char *value) {
   }
 
   GErrorPtr error;
-  const GString_ text = as_bus_text(value);
+  const GText text = as_bus_text(value);
   if (g_dbus_connection_emit_signal(quarn_dbus_connection, nullptr, path, kQuarnInterface,
                                     signal_name, g_variant_new("(s)", text.get()),
                                     out(error)) == FALSE) {

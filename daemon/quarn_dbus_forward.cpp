@@ -31,7 +31,7 @@ void on_library_answer(GObject *bus, GAsyncResult *result, gpointer data) {
     answer.reset(g_dbus_message_new_method_reply(forwarded->call.get()));
     g_dbus_message_set_body(answer.get(), g_dbus_message_get_body(reply.get()));
   } else {
-    GString_ name(g_dbus_error_get_remote_error(error.get()));
+    GText name(g_dbus_error_get_remote_error(error.get()));
     if (!name) name.reset(g_dbus_error_encode_gerror(error.get()));
     g_dbus_error_strip_remote_error(error.get());
     answer.reset(

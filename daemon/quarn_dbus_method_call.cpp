@@ -47,7 +47,7 @@ void RawCall::reply(GVariant *value) {
 
 void RawCall::refuse(int dbus_error, const std::string &text) {
   const GErrorPtr error(g_error_new_literal(G_DBUS_ERROR, dbus_error, text.c_str()));
-  const GString_ name(g_dbus_error_encode_gerror(error.get()));
+  const GText name(g_dbus_error_encode_gerror(error.get()));
   const MessagePtr answer(
       g_dbus_message_new_method_error_literal(message_, name.get(), text.c_str()));
   send(answer.get());

@@ -30,6 +30,9 @@ namespace {
  */
 constexpr unsigned int kMaxDeletions = 500;
 constexpr std::size_t kMaxChildren = 10000;
+/** Packages whose versions are listed at a time: each listing has its memory until it is answered.
+ */
+constexpr int kMaxListings = 64;
 
 struct folder_child {
   std::string path;
@@ -122,8 +125,8 @@ void request_folder_deletion(backup_context *ctx, const cleanup_kind &kind,
   --(ctx->*kind.deletions_pending);
 }
 
-/** Request the next page; the record ends here when that is refused. */
-void request_listing(ListingPtr record, const cleanup_kind &kind) {
+/** Request the next page; the record ends here when that is refused. @return false then */
+bool request_listing(ListingPtr record, const cleanup_kind &kind) {
   backup_context *ctx = record->ctx.get();
   const int start = static_cast<int>(record->children.size());
   const char *const folder = record->folder.c_str();
@@ -132,10 +135,11 @@ void request_listing(ListingPtr record, const cleanup_kind &kind) {
         cloud_handler(), folder, start, BACKUP_TRANS_MAX_LIST_COUNT, BACKUP_TRANS_OPTION_NONE,
         user_data, kind.list_callback);
   });
-  if (ret == BACKUP_TRANS_ERROR_NONE) return;
+  if (ret == BACKUP_TRANS_ERROR_NONE) return true;
   LOGE("backup_trans_get_folder_child_list_async failed... %d", ret);
   ctx->cleanup_result = QUARN_TRANSFER_FAILED;
   --(ctx->*kind.listings_pending);
+  return false;
 }
 
 /** False for a package that a restore is to have, or that is there after all. */
@@ -206,7 +210,7 @@ void __backup_trans_serial_child_list_resp_cb(backup_trans_error_code error, voi
   } else if (!ctx->abandoned) {
     // a later run may have uploaded by now what an abandoned one would delete
     if (collect_page(record.get(), list)) {
-      request_listing(std::move(record), kPackageCleanup);
+      static_cast<void>(request_listing(std::move(record), kPackageCleanup));
       return;
     }
     LOGI("clean up cloud items start");
@@ -214,6 +218,21 @@ void __backup_trans_serial_child_list_resp_cb(backup_trans_error_code error, voi
     LOGI("clean up cloud items end");
   }
   --ctx->serial_clean_pending;
+}
+
+/** Begin the listing of the next uploaded package's versions, if one is left. Any thread. */
+void list_next_versions(backup_context *ctx) {
+  run_notes &notes = notes_of(ctx);
+  while (true) {
+    const std::size_t next = notes.versions_listed++;
+    if (next >= notes.versions_to_list) return;
+    const pkg_information &package = ctx->upload_list[next];
+    const bool stands =
+        !ctx->abandoned &&
+        delete_other_version_in_cloud(ctx, ctx->serial_number, package.pkg_id, package.version);
+    --ctx->version_list_pending;  // it was counted with all of them
+    if (stands) return;
+  }
 }
 
 void __backup_trans_pkg_child_list_resp_cb(backup_trans_error_code error, void *user_data,
@@ -224,18 +243,19 @@ void __backup_trans_pkg_child_list_resp_cb(backup_trans_error_code error, void *
     assert(user_data != nullptr);
     return;
   }
-  backup_context *ctx = record->ctx.get();
+  const BackupContextPtr ctx = share_backup_context(record->ctx.get());
   if (error != BACKUP_TRANS_ERROR_NONE) {
     LOGE("__backup_trans_pkg_child_list_resp_cb error : %d!", error);
     ctx->cleanup_result = QUARN_LIST_CHECK_FAILED;
   } else if (!ctx->abandoned) {
     if (collect_page(record.get(), list)) {
-      request_listing(std::move(record), kVersionCleanup);
+      if (!request_listing(std::move(record), kVersionCleanup)) list_next_versions(ctx.get());
       return;
     }
     delete_listed_folders(*record, kVersionCleanup);
     LOGI("clean up cloud end");
   }
+  list_next_versions(ctx.get());
   --ctx->version_list_pending;
 }
 
@@ -260,17 +280,18 @@ void delete_other_backup_items_in_cloud(backup_context *ctx) {
     record->keep.insert(cloud_package_folder(ctx->serial_number, pkg_id));
   }
   ++ctx->serial_clean_pending;
-  request_listing(std::move(record), kPackageCleanup);
+  static_cast<void>(request_listing(std::move(record), kPackageCleanup));
 }
 
 void delete_other_pkg_version_in_cloud(backup_context *ctx) {
   if (notes_of(ctx).keep_all_listed) return;
-  for (const pkg_information &package : ctx->upload_list) {
-    delete_other_version_in_cloud(ctx, ctx->serial_number, package.pkg_id, package.version);
-  }
+  run_notes &notes = notes_of(ctx);
+  notes.versions_to_list = ctx->upload_list.size();
+  ctx->version_list_pending += static_cast<std::int32_t>(notes.versions_to_list);
+  for (int i = 0; i < kMaxListings; ++i) list_next_versions(ctx);
 }
 
-void delete_other_version_in_cloud(backup_context *ctx, const std::string &serial,
+bool delete_other_version_in_cloud(backup_context *ctx, const std::string &serial,
                                    const std::string &pkg_id, const std::string &version) {
   auto record = std::make_unique<cleanup_listing>();
   record->ctx = share_backup_context(ctx);
@@ -278,5 +299,5 @@ void delete_other_version_in_cloud(backup_context *ctx, const std::string &seria
   record->package = pkg_id;
   record->keep.insert(cloud_version_folder(serial, pkg_id, version));
   ++ctx->version_list_pending;
-  request_listing(std::move(record), kVersionCleanup);
+  return request_listing(std::move(record), kVersionCleanup);
 }

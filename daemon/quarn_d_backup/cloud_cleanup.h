@@ -15,7 +15,11 @@ struct backup_context;
 void delete_other_backup_items_in_cloud(backup_context *ctx);
 /** Delete the other versions of every package that was uploaded. */
 void delete_other_pkg_version_in_cloud(backup_context *ctx);
-void delete_other_version_in_cloud(backup_context *ctx, const std::string &serial,
+/**
+ * The same of one package; while it is under way, version_list_pending counts it. Any thread.
+ * @return whether it is under way
+ */
+bool delete_other_version_in_cloud(backup_context *ctx, const std::string &serial,
                                    const std::string &pkg_id, const std::string &version);
 
 #endif

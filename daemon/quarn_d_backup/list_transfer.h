@@ -14,6 +14,7 @@ struct backup_context;
 [[nodiscard]] int get_app_list_from_cloud(backup_context *ctx);
 /**
  * Download the list and wait for it. Any thread, also beside a run.
+ * No part of the daemon calls it.
  * @param[out] text malloc'd and the caller's; null unless QUARN_OK is returned
  * @return QUARN_OK, BACKUP_TRANS_ERROR_NO_SUCH_OBJECT when there is none, another transport error,
  *   or QUARN_LIST_CHECK_FAILED when it could not be read

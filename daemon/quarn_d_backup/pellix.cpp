@@ -36,7 +36,7 @@ constexpr mode_t kArchiveMode = 0777;  // the companion's own rules decide who r
 
 /** Known as ours wherever working files are swept and passed over. */
 std::string hidden_name() {
-  const GString_ random(g_uuid_string_random());
+  const GText random(g_uuid_string_random());
   return std::string(BACKUP_TRANS_TEMPORARY_PREFIX) + random.get();
 }
 

@@ -34,8 +34,10 @@ struct run_notes {
   bool keep_all_listed = false;
   /** The upload of a run of one package, while the transport has it. Main thread. */
   void *single_upload = nullptr;
-  unsigned int deletions = 0;    /**< of cloud folders, so far. Main thread. */
-  std::size_t packages_seen = 0; /**< by the walk, preloaded ones too */
+  unsigned int deletions = 0;       /**< of cloud folders, so far. Main thread. */
+  std::size_t packages_seen = 0;    /**< by the walk, preloaded ones too */
+  std::size_t versions_to_list = 0; /**< of upload_list; set before the first is listed */
+  std::atomic<std::size_t> versions_listed{0}; /**< of these, begun */
   /** Ids and versions in the list that was made. */
   std::set<std::string> listed;
 };

@@ -154,7 +154,7 @@ void delete_staged_file(const std::string &path) {
   const std::lock_guard<std::mutex> lock(deletion_mutex);
   struct stat status = {};
   if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
-  if (file_exist(path.c_str())) delete_file(path.c_str());
+  if (file_exist(path.c_str()) && delete_file(path.c_str())) forget_working_file(path);
 }
 
 std::uint64_t staged_file_size(const std::string &path) {

@@ -18,10 +18,13 @@ extern char auto_backup_enabled;
 /** 1 when on Wi-Fi and the monitor runs. Any thread. */
 int wifi_connected();
 int start_wifi_monitor();
+/** No part of the daemon calls it. */
 int stop_wifi_monitor();
 /** 1 when the charger is connected, read anew at every call. */
 int charger_connected();
+/** No part of the daemon calls it. */
 int start_charger_monitor();
+/** No part of the daemon calls it. */
 int stop_charger_monitor();
 int start_screen_monitor();
 int stop_screen_monitor();

@@ -24,6 +24,7 @@ int get_file_info_from_backup(json_object *table, const char *pkgid, const char 
 /**
  * Give a directory or regular file its mode, the application owner and its label. The engine itself
  * calls restore_object_info(). @return 1, 0
+ * No part of the daemon calls it.
  */
 int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table);
 /**

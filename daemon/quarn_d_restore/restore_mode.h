@@ -30,6 +30,7 @@ extern std::unique_ptr<client_cb_data> g_restore_cb_data;
  * Replace the candidate list by a JSON array of package ids. Anything else
  * than an array of texts is an empty list; impossible ids are left out. The
  * mode itself takes a list only when it is switched on.
+ * No part of the daemon calls it.
  * @return length of the list
  */
 int init_package_list_to_be_restored(const char *pkg_list_json);

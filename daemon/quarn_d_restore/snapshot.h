@@ -122,12 +122,20 @@ bool discard_snapshot(const char *pkgid, const char *root);
 
 /** take_snapshot() of a package whose root nobody holds. */
 int temp_backup_initial_app_data(const char *pkgid, const char *root);
-/** Copy what lies below @p dir into the snapshot @p temp_dir. @return 1, 0 when anything failed */
+/**
+ * Copy what lies below @p dir into the snapshot @p temp_dir.
+ * No part of the daemon calls it.
+ * @return 1, 0 when anything failed
+ */
 int parse_dir_for_copy(const char *dir, const char *temp_dir, const char *pkgid, const char *root,
                        file_info_table_h *table);
-/** put_snapshot_back(). @return #QUARN_OK */
+/** put_snapshot_back(). No part of the daemon calls it. @return #QUARN_OK */
 int rollback_to_initial_app_data(const char *pkgid, const char *root);
-/** Move what lies below @p dir, in the snapshot, back. @return 1, 0 when anything failed */
+/**
+ * Move what lies below @p dir, in the snapshot, back.
+ * No part of the daemon calls it.
+ * @return 1, 0 when anything failed
+ */
 int parse_dir_for_rollback(const char *dir, const char *pkgid, const char *root);
 
 #endif

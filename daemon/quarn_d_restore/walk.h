@@ -14,9 +14,16 @@ int restore_app_info(const char *pkgid, const char *root);
 /** One directory of it and everything below. @return 1 when every entry was restored, else 0 */
 int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
                               json_object *table);
-/** Make the links that the table lists. No restore calls it: links are only recorded. @return 1 */
+/**
+ * Make the links that the table lists. No restore calls it: links are only recorded.
+ * No part of the daemon calls it.
+ * @return 1
+ */
 int restore_symlnk(const char *pkgid, const char *root, json_object *table);
-/** Empty the three data directories but for the snapshot. The engine itself does not call it. */
+/**
+ * Empty the three data directories but for the snapshot. The engine itself does not call it.
+ * No part of the daemon calls it.
+ */
 void clear_app_dir(const char *pkgid, const char *root);
 
 #endif

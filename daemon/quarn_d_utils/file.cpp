@@ -210,7 +210,7 @@ bool create_directory_of_file(const char *file) {
     LOGE("file_name is NULL");
     return false;
   }
-  const GString_ parent(g_path_get_dirname(file));
+  const GText parent(g_path_get_dirname(file));
   if (parent == nullptr) {
     LOGE("g_path_get_dirname is fail");
     return false;

@@ -16,11 +16,11 @@
 bool file_exist(const char *path);
 /** True for a directory. */
 bool is_directory(const char *path);
-/** Size in bytes, -1 on failure. */
+/** Size in bytes, -1 on failure. No part of the daemon calls it. */
 int get_file_size(const char *path);
 /** Read a whole file; @p buffer is malloc'd, NUL-terminated and the caller's. */
 bool read_data_from_file(const char *path, char **buffer);
-/** CRC-32 (IEEE 802.3) of the content; 0 on failure. */
+/** CRC-32 (IEEE 802.3) of the content; 0 on failure. No part of the daemon calls it. */
 std::uint32_t get_file_crc(const char *path);
 /** Remove a regular file. */
 bool delete_file(const char *path);

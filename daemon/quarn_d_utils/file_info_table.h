@@ -37,6 +37,7 @@ void ready_file_info_table(file_info_table_h **table);
 void release_file_info_table(file_info_table_h *table);
 /**
  * Attributes of one entry; @p label is malloc'd, null when it could not be read.
+ * No part of the daemon calls it.
  * @param fd the entry's descriptor, borrowed, when it is open: its label is then the label of what
  *           was opened, found without another walk along the path; else negative
  */

@@ -17,7 +17,10 @@ extern Mutex installed_check_mutex;
 /** Packages whose installation completed since the list was last cleared. */
 extern std::vector<std::string> install_complete_pkgs QUARN_GUARDED_BY(installed_check_mutex);
 
-/** True when the application's API version is at least @p version, compared as bytes. */
+/**
+ * True when the application's API version is at least @p version, compared as bytes.
+ * No part of the daemon calls it.
+ */
 bool app_support_api_version(const char *appid, const char *version);
 /** True when the application takes part in backup. */
 bool backup_enabled_app(const char *appid);
@@ -25,7 +28,11 @@ bool backup_enabled_app(const char *appid);
 bool already_installed_package(const char *pkgid);
 /** True when the package lies on external storage. */
 bool app_data_storage_is_external(const char *pkgid);
-/** Package id and version of an application, malloc'd. @return 0 or 42 */
+/**
+ * Package id and version of an application, malloc'd.
+ * No part of the daemon calls it.
+ * @return 0 or 42
+ */
 int get_pkg_info(const char *appid, char **pkgid, char **version);
 /** Root path of a package, malloc'd; null on failure. */
 char *get_app_root_path(const char *pkgid);

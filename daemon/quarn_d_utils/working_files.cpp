@@ -114,6 +114,11 @@ void claim_working_file(const std::string &path) {
   claimed()[path].reset();
 }
 
+void forget_working_file(const std::string &path) {
+  const MutexLock lock(claimed_mutex);
+  claimed().erase(path);
+}
+
 void note_working_file(const std::string &path, int fd) {
   struct stat status = {};
   if (fstat(fd, &status) != 0) return;

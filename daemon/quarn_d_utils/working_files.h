@@ -51,6 +51,8 @@ class WorkingFiles : public package_files {
   bool contain(const std::string &path) const { return names(path) || is_own_leftover(path); }
 };
 
+/** What claim_working_file() has claimed is deleted, and is not to be remembered any more. */
+void forget_working_file(const std::string &path);
 /** From now on @p path is this process's own: its sweep leaves it alone. */
 void claim_working_file(const std::string &path);
 

@@ -764,6 +764,29 @@ TEST_F(Cloud, OtherVersionsOfAnUploadedPackageAreRemoved) {
   EXPECT_EQ(info("clean up cloud items start"), 0);
 }
 
+TEST_F(Cloud, VersionsOfManyPackagesAreListedAFewAtATime) {
+  constexpr int kPackages = 300;
+  for (int i = 0; i < kPackages; ++i) {
+    const std::string package = "org.app" + std::to_string(i);
+    for (const char *version : {"1", "2"}) {
+      cloud_.objects[in_device(package + "/" + version + "/" + package + ".zip")] = "x";
+    }
+    ctx_->upload_list.push_back({kSerial, package, "2", "/x", 0});
+  }
+  // org.app29 and its ten: who is refused makes room for the next as well.
+  constexpr int kRefusals = 11;
+  cloud_.refuse = [](Op op, const std::string &path) {
+    return op == Op::list && path.find("org.app29") != std::string::npos ? kRefused : 0;
+  };
+  delete_other_pkg_version_in_cloud(ctx_.get());
+  EXPECT_EQ(ctx_->version_list_pending, kPackages - 1);
+  EXPECT_EQ(cloud_.waiting(), 64U);
+  cloud_.answer_all();
+  EXPECT_EQ(ctx_->version_list_pending, 0);
+  EXPECT_EQ(ctx_->version_delete_pending, 0);
+  EXPECT_EQ(cloud_.objects.size(), static_cast<std::size_t>(kPackages + kRefusals));
+}
+
 TEST_F(Cloud, VersionsAfterTheFirstHundredAreFound) {
   for (int i = 0; i < 150; ++i) {
     cloud_.objects[in_device("org.app/" + std::to_string(1000 + i) + "/a.zip")] = "x";

@@ -387,7 +387,7 @@ class Publish : public ::testing::Test {
   }
   static void on_signal(GDBusConnection *, const gchar *, const gchar *path, const gchar *,
                         const gchar *signal, GVariant *parameters, gpointer self) {
-    const GString_ printed(g_variant_print(parameters, FALSE));
+    const GText printed(g_variant_print(parameters, FALSE));
     static_cast<Publish *>(self)->signals_.push_back(std::string(path) + " " + signal +
                                                      printed.get());
   }

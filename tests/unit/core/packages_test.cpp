@@ -68,8 +68,8 @@ class Packages : public ::testing::Test {
           GErrorPtr error;
           const GVariantPtr reply(
               g_dbus_connection_call_finish(G_DBUS_CONNECTION(source), result, out(error)));
-          const GString_ text(reply ? g_variant_print(reply.get(), FALSE)
-                                    : g_dbus_error_get_remote_error(error.get()));
+          const GText text(reply ? g_variant_print(reply.get(), FALSE)
+                                 : g_dbus_error_get_remote_error(error.get()));
           into->text = text.get();
           into->finished = true;
         },
@@ -141,7 +141,7 @@ std::string interface_text(const char *xml) {
   GString *text = g_string_new(nullptr);
   g_dbus_node_info_generate_xml(node, 0, text);
   g_dbus_node_info_unref(node);
-  const GString_ owned(g_string_free(text, FALSE));
+  const GText owned(g_string_free(text, FALSE));
   return owned.get();
 }
 

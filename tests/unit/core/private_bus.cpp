@@ -28,7 +28,7 @@ constexpr char kCallbackXml[] =
     "</interface></node>";
 
 std::string print(GVariant *value) {
-  const GString_ text(g_variant_print(value, FALSE));
+  const GText text(g_variant_print(value, FALSE));
   return text.get();
 }
 
@@ -216,7 +216,7 @@ void on_answer(GObject *connection, GAsyncResult *result, gpointer data) {
   if (reply) {
     (*outcome)->reply = print(reply.get());
   } else {
-    const GString_ name(g_dbus_error_get_remote_error(error.get()));
+    const GText name(g_dbus_error_get_remote_error(error.get()));
     if (name) (*outcome)->error_name = name.get();
     g_dbus_error_strip_remote_error(error.get());
     (*outcome)->error_text = error->message;
