@@ -3,6 +3,7 @@
 #include <atomic>
 #include <condition_variable>
 #include <deque>
+#include <filesystem>
 #include <mutex>
 
 #include "harness.h"
@@ -221,9 +222,8 @@ TEST_F(SessionTest, SignalsAreNotForTheWorkers) {
   cloud->list("/");
   ASSERT_TRUE(run_until([&] { return backend->running == 1; }));
   std::string masks;
-  for (const auto &[name, ignored] : tree("/proc/self/task")) {
-    if (name.size() < 7 || name.substr(name.size() - 7) != "/status") continue;
-    const std::string text = read_file("/proc/self/task" + name);
+  for (const auto &thread : std::filesystem::directory_iterator("/proc/self/task")) {
+    const std::string text = read_file((thread.path() / "status").string());
     if (text.find(std::string("Name:\t") + kWorkerName) != std::string::npos)
       masks += text.substr(text.find("SigBlk:"), 24);
   }
