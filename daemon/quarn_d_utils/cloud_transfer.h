@@ -21,7 +21,8 @@
 inline constexpr std::uint64_t kMaxArchiveFileSize =
     3 * kMaxUnpackedSize + 256 * kMaxArchiveEntries;
 
-/** A download on the session. Any thread. @return BACKUP_TRANS_ERROR_NONE: the callback will come */
+/** A download on the session. Any thread. @return BACKUP_TRANS_ERROR_NONE: the callback will come
+ */
 int download_bounded_async(const char *cloud_path, const char *local_path, void *user_data,
                            backup_trans_download_cb callback, int options, std::uint64_t max_size);
 /** The same, waiting for its result: not for the main thread. */
