@@ -82,6 +82,27 @@ UniqueFd open_from_start(const char *path, int flags, mode_t mode) {
   return UniqueFd(open_without_links(start.dir(), start.path(), flags, mode, below));
 }
 
+/** One name of a path; a directory where it is missing and that is made. */
+UniqueFd open_or_make(int dir, const std::string &name, int flags, Missing missing, mode_t mode) {
+  UniqueFd found(openat(dir, name.c_str(), flags));
+  if (found || errno != ENOENT || missing != Missing::kIsMade) return found;
+  if (mkdirat(dir, name.c_str(), mode) != 0 && errno != EEXIST) return {};
+  return UniqueFd(openat(dir, name.c_str(), flags));
+}
+
+/** Where the link that is open as @p fd leads. @return false with errno */
+bool read_link(int fd, std::string *target) {
+  char text[PATH_MAX];
+  const ssize_t length = readlinkat(fd, "", text, sizeof(text));
+  if (length < 0) return false;
+  if (static_cast<std::size_t>(length) == sizeof(text)) {
+    errno = ENAMETOOLONG;
+    return false;
+  }
+  target->assign(text, static_cast<std::size_t>(length));
+  return true;
+}
+
 /** Walk to the directory @p path, following trusted links only. */
 UniqueFd walk_to_directory(const std::string &path, Missing missing, mode_t mode) {
   const Start start(path.c_str());
@@ -94,25 +115,16 @@ UniqueFd walk_to_directory(const std::string &path, Missing missing, mode_t mode
     const std::string name = std::move(rest.back());
     rest.pop_back();
     if (name == ".") continue;
-    UniqueFd next(openat(current.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    if (!next && errno == ENOENT && missing == Missing::kIsMade) {
-      if (mkdirat(current.get(), name.c_str(), mode) != 0 && errno != EEXIST) return {};
-      next.reset(openat(current.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    }
-    if (!next) return {};
+    UniqueFd next =
+        open_or_make(current.get(), name, O_PATH | O_NOFOLLOW | O_CLOEXEC, missing, mode);
     struct stat status = {};
-    if (fstat(next.get(), &status) != 0) return {};
+    if (!next || fstat(next.get(), &status) != 0) return {};
     if (S_ISLNK(status.st_mode)) {
+      std::string target;
       if (++links > kMaxLinks || !is_trusted_link(status, current.get())) return fail(ELOOP);
-      char target[PATH_MAX];
-      const ssize_t length = readlinkat(next.get(), "", target, sizeof(target));
-      if (length < 0) return {};
-      if (static_cast<std::size_t>(length) == sizeof(target)) return fail(ENAMETOOLONG);
-      const std::string text(target, static_cast<std::size_t>(length));
-      push_components(&rest, text);
-      if (!text.empty() && text[0] == '/') {
-        current.reset(open("/", kPlace));
-      }
+      if (!read_link(next.get(), &target)) return {};
+      push_components(&rest, target);
+      if (target.compare(0, 1, "/") == 0) current.reset(open("/", kPlace));
       continue;
     }
     if (!S_ISDIR(status.st_mode)) return fail(ENOTDIR);
@@ -164,12 +176,7 @@ UniqueFd walk_below(int dir, const char *path, Missing missing, mode_t mode, std
       return current;
     }
     const int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-    UniqueFd next(openat(current.get(), name.c_str(), flags));
-    if (!next && errno == ENOENT && missing == Missing::kIsMade) {
-      if (mkdirat(current.get(), name.c_str(), mode) != 0 && errno != EEXIST) return {};
-      next.reset(openat(current.get(), name.c_str(), flags));
-    }
-    current = std::move(next);
+    current = open_or_make(current.get(), name, flags, missing, mode);
   }
   if (current && last != nullptr) return fail(EINVAL);
   return current;

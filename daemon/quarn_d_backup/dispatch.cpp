@@ -7,7 +7,6 @@
 #include <condition_variable>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <utility>
@@ -26,6 +25,7 @@
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_client.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 std::atomic<bool> manual_backup_canceled{false};
 std::atomic<bool> g_is_backing_up{false};
@@ -37,7 +37,7 @@ constexpr int kTurnCheckMs = 100;
 
 // The worker has no end and may be anywhere when the process exits: what it
 // waits on and reads is never destroyed.
-std::mutex &backup_req_list_mutex = *new std::mutex;
+Mutex &backup_req_list_mutex = *new Mutex;
 
 /** The client of a manual backup, which its final status deletes; null: an automatic one. */
 using ClientPtr = std::unique_ptr<client_cb_data>;
@@ -46,9 +46,10 @@ struct queued_request {
   ClientPtr client;
   std::int64_t waited_before; /**< what the worker had waited for clients when it was made */
 };
-std::vector<queued_request> &backup_req_list = *new std::vector<queued_request>;
-/** With the list's mutex. */
-std::vector<queued_request> &cancelled_clients = *new std::vector<queued_request>;
+std::vector<queued_request> &backup_req_list QUARN_GUARDED_BY(backup_req_list_mutex) =
+    *new std::vector<queued_request>;
+std::vector<queued_request> &cancelled_clients QUARN_GUARDED_BY(backup_req_list_mutex) =
+    *new std::vector<queued_request>;
 
 /** Microseconds that clients which do not answer may hold up another's request, all together. */
 constexpr std::int64_t kLongestHoldUp = 60000000;
@@ -59,9 +60,9 @@ struct running_manual {
   bool cancelled = false;
   std::string sender;
 };
-running_manual &running = *new running_manual;  // with the list's mutex
+running_manual &running QUARN_GUARDED_BY(backup_req_list_mutex) = *new running_manual;
 
-std::mutex &backup_req_cond_mutex = *new std::mutex;
+Mutex &backup_req_cond_mutex = *new Mutex;
 std::condition_variable &backup_req_cond = *new std::condition_variable;
 
 /** Entries in both lists: what the worker waits for. The two mutexes are never held together. */
@@ -69,8 +70,8 @@ std::atomic<std::size_t> waiting_entries{0};
 /** Requests that were made and are not finished. */
 std::atomic<int> outstanding_requests{0};
 
-/** An automatic backup is queued or runs; with the list's mutex. */
-bool automatic_outstanding = false;
+/** An automatic backup is queued or runs. */
+bool automatic_outstanding QUARN_GUARDED_BY(backup_req_list_mutex) = false;
 
 std::atomic<backup_end_observer> end_observer{nullptr};
 
@@ -80,8 +81,9 @@ void end_request() {
   if (const backup_end_observer observer = end_observer) observer();
 }
 
-/** Under the list's mutex: the client of the oldest request of @p list, none when it is empty. */
-std::optional<ClientPtr> take_oldest(std::vector<queued_request> *list) {
+/** The client of the oldest request of @p list, none when it is empty. */
+std::optional<ClientPtr> take_oldest(std::vector<queued_request> *list)
+    QUARN_REQUIRES(backup_req_list_mutex) {
   if (list->empty()) return std::nullopt;
   ClientPtr client = std::move(list->front().client);
   list->erase(list->begin());
@@ -90,7 +92,7 @@ std::optional<ClientPtr> take_oldest(std::vector<queued_request> *list) {
 }
 
 std::optional<ClientPtr> take_request() {
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  const MutexLock lock(backup_req_list_mutex);
   std::optional<ClientPtr> taken = take_oldest(&backup_req_list);
   if (!taken) return taken;
   const client_cb_data *const record = taken->get();
@@ -99,7 +101,7 @@ std::optional<ClientPtr> take_request() {
 }
 
 void forget_automatic() {
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  const MutexLock lock(backup_req_list_mutex);
   automatic_outstanding = false;
 }
 
@@ -110,13 +112,13 @@ bool others_held_up(const std::string &sender) {
     const bool others = request.client == nullptr || request.client->sender != sender;
     return others && waited - request.waited_before >= kLongestHoldUp;
   };
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  const MutexLock lock(backup_req_list_mutex);
   return std::any_of(backup_req_list.begin(), backup_req_list.end(), held_up) ||
          std::any_of(cancelled_clients.begin(), cancelled_clients.end(), held_up);
 }
 
 std::optional<ClientPtr> take_cancelled_client() {
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  const MutexLock lock(backup_req_list_mutex);
   return take_oldest(&cancelled_clients);
 }
 
@@ -172,14 +174,14 @@ void *backup_req_dispatch_thread(void *) {
       end_request();
       malloc_trim(kKeepNothing);
     }
-    std::unique_lock<std::mutex> lock(backup_req_cond_mutex);
-    backup_req_cond.wait(lock, [] { return waiting_entries != 0; });
+    MutexLock lock(backup_req_cond_mutex);
+    backup_req_cond.wait(lock.waiting(), [] { return waiting_entries != 0; });
   }
 }
 
-/** Under the list's mutex: take the manual requests out that @p meant says. @return how many */
+/** Take the manual requests out that @p meant says. @return how many */
 template <typename Meant>
-std::uint32_t drop_reservations(Meant meant) {
+std::uint32_t drop_reservations(Meant meant) QUARN_REQUIRES(backup_req_list_mutex) {
   const auto dropped = std::stable_partition(
       backup_req_list.begin(), backup_req_list.end(), [&meant](const queued_request &request) {
         return request.client == nullptr || !meant(*request.client);
@@ -201,7 +203,7 @@ void abort_transfers() {
 }
 
 void wake_worker() {
-  const std::lock_guard<std::mutex> lock(backup_req_cond_mutex);
+  const MutexLock lock(backup_req_cond_mutex);
   backup_req_cond.notify_one();
 }
 
@@ -224,7 +226,7 @@ void init_backup_req_dispatch_thread() {
 void request_backup(void *client) {
   ClientPtr record(static_cast<client_cb_data *>(client));
   {
-    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    const MutexLock lock(backup_req_list_mutex);
     if (record == nullptr && std::exchange(automatic_outstanding, true)) {
       LOGI("auto backup is requested already");
       return;
@@ -240,12 +242,12 @@ void request_backup(void *client) {
 void cancel_backup(void *) {
   {
     // Before the transfers end: the run is to know why they did.
-    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    const MutexLock lock(backup_req_list_mutex);
     running.cancelled = running.standing;
   }
   abort_transfers();
   {
-    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    const MutexLock lock(backup_req_list_mutex);
     running.cancelled = running.standing || running.cancelled;  // taken from the queue meanwhile
     drop_reservations([](const client_cb_data &) { return true; });
   }
@@ -256,7 +258,7 @@ std::uint32_t cancel_backups_of(const std::string &sender) {
   std::uint32_t count = 0;
   bool runs = false;
   {
-    const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+    const MutexLock lock(backup_req_list_mutex);
     count = drop_reservations(
         [&sender](const client_cb_data &client) { return client.sender == sender; });
     runs = running.standing && !running.cancelled && running.sender == sender;
@@ -268,12 +270,12 @@ std::uint32_t cancel_backups_of(const std::string &sender) {
 }
 
 bool running_backup_cancelled() {
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  const MutexLock lock(backup_req_list_mutex);
   return running.cancelled;
 }
 
 bool settle_running_backup() {
-  const std::lock_guard<std::mutex> lock(backup_req_list_mutex);
+  const MutexLock lock(backup_req_list_mutex);
   running.standing = false;
   return running.cancelled;
 }

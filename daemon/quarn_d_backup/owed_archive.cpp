@@ -7,7 +7,6 @@
 #include <cerrno>
 #include <cstddef>
 #include <map>
-#include <mutex>
 #include <utility>
 
 #include "files/safe_path.h"
@@ -16,6 +15,7 @@
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -27,11 +27,11 @@ constexpr std::size_t kLongestNote = 256;
 /** So many may come to be owed before a look is taken at which of their packages are there. */
 constexpr std::size_t kOwedBetweenLooks = 256;
 
-std::mutex owed_mutex;
-/** How many the last look left; with the mutex. */
-std::size_t owed_when_looked = 0;
+Mutex owed_mutex;
+/** How many the last look left. */
+std::size_t owed_when_looked QUARN_GUARDED_BY(owed_mutex) = 0;
 /** By serial and package. */
-std::map<std::pair<std::string, std::string>, archive_claim> &owed() {
+std::map<std::pair<std::string, std::string>, archive_claim> &owed() QUARN_REQUIRES(owed_mutex) {
   static auto *all = new std::map<std::pair<std::string, std::string>, archive_claim>;
   return *all;
 }
@@ -69,7 +69,7 @@ bool write_note(const WorkingFiles &files, const std::string &serial, archive_cl
 }
 
 void owe(const std::string &serial, const std::string &package, const std::string &root,
-         archive_claim claim) {
+         archive_claim claim) QUARN_REQUIRES(owed_mutex) {
   owed()[{serial, package}] = claim;
   if (root.empty()) return;
   const WorkingFiles files(package, root);
@@ -85,24 +85,24 @@ void note_owed_archive(const std::string &serial, const std::string &package,
                        const std::string &root) {
   bool many = false;
   {
-    const std::lock_guard<std::mutex> lock(owed_mutex);
+    const MutexLock lock(owed_mutex);
     many = owed().size() >= owed_when_looked + kOwedBetweenLooks;
   }
   // before, for a package that is being installed may not be known yet
   if (many) forget_owed_of_removed_packages();
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   owe(serial, package, root, archive_claim::whole);
 }
 
 void owe_other_versions(const std::string &serial, const std::string &package,
                         const std::string &root) {
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   if (owed().count({serial, package}) != 0) owe(serial, package, root, archive_claim::versions);
 }
 
 void forget_owed_archive(const std::string &serial, const std::string &package,
                          const std::string &root) {
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   owed().erase({serial, package});
   const WorkingFiles files(package, root);
   if (read_note(files.owed(), serial) == archive_claim::none) return;
@@ -115,7 +115,7 @@ void forget_owed_archive(const std::string &serial, const std::string &package,
 
 archive_claim look_for_owed_archive(const std::string &serial, const std::string &package,
                                     const std::string &root) {
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   const auto known = owed().find({serial, package});
   if (known != owed().end()) return known->second;
   const archive_claim claim = read_note(WorkingFiles(package, root).owed(), serial);
@@ -124,13 +124,13 @@ archive_claim look_for_owed_archive(const std::string &serial, const std::string
 }
 
 archive_claim owed_claim(const std::string &serial, const std::string &package) {
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   const auto known = owed().find({serial, package});
   return known == owed().end() ? archive_claim::none : known->second;
 }
 
 std::vector<std::string> owed_packages(const std::string &serial) {
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   std::vector<std::string> packages;
   for (const auto &one : owed()) {
     if (one.first.first == serial) packages.push_back(one.first.second);
@@ -141,14 +141,14 @@ std::vector<std::string> owed_packages(const std::string &serial) {
 void forget_owed_of_removed_packages() {
   std::vector<std::pair<std::string, std::string>> known;
   {
-    const std::lock_guard<std::mutex> lock(owed_mutex);
+    const MutexLock lock(owed_mutex);
     for (const auto &one : owed()) known.push_back(one.first);
   }
   for (const auto &one : known) {
     if (may_be_installed(one.second)) continue;
-    const std::lock_guard<std::mutex> lock(owed_mutex);
+    const MutexLock lock(owed_mutex);
     owed().erase(one);
   }
-  const std::lock_guard<std::mutex> lock(owed_mutex);
+  const MutexLock lock(owed_mutex);
   owed_when_looked = owed().size();
 }

@@ -1,16 +1,16 @@
 #include "quarn_d_backup/single_folders.h"
 
-#include <mutex>
 #include <set>
 
 #include "files/package_files.h"
+#include "thread_annotations.h"
 
 namespace {
 
 struct single_folders {
-  std::mutex mutex;
-  std::set<std::string> folders;
-  bool too_many = false;  // some were not kept
+  Mutex mutex;
+  std::set<std::string> folders QUARN_GUARDED_BY(mutex);
+  bool too_many QUARN_GUARDED_BY(mutex) = false;  // some were not kept
 };
 
 single_folders &all() {
@@ -24,7 +24,7 @@ single_folders &all() {
 void note_single_upload(const std::string &serial, const std::string &pkg_id,
                         const std::string &version) {
   single_folders &noted = all();
-  const std::lock_guard<std::mutex> lock(noted.mutex);
+  const MutexLock lock(noted.mutex);
   for (std::string folder :
        {cloud_package_folder(serial, pkg_id), cloud_version_folder(serial, pkg_id, version)}) {
     if (noted.folders.size() < kMostSingleFolders) {
@@ -37,13 +37,13 @@ void note_single_upload(const std::string &serial, const std::string &pkg_id,
 
 bool uploaded_by_single_request(const std::string &folder) {
   single_folders &noted = all();
-  const std::lock_guard<std::mutex> lock(noted.mutex);
+  const MutexLock lock(noted.mutex);
   return noted.too_many || noted.folders.count(folder) != 0;
 }
 
 void forget_single_uploads() {
   single_folders &noted = all();
-  const std::lock_guard<std::mutex> lock(noted.mutex);
+  const MutexLock lock(noted.mutex);
   noted.folders.clear();
   noted.too_many = false;
 }

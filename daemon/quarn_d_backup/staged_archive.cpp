@@ -7,7 +7,6 @@
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
-#include <mutex>
 #include <unordered_map>
 #include <vector>
 
@@ -19,6 +18,7 @@
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/working_files.h"
 #include "quarn_log.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -33,10 +33,10 @@ struct loop_waiter {
 
 /** Who holds which staged file. */
 struct lease_table {
-  std::mutex mutex;
+  Mutex mutex;
   std::condition_variable released;
-  std::unordered_map<std::string, backup_context *> holders;
-  std::vector<loop_waiter *> waiters;
+  std::unordered_map<std::string, backup_context *> holders QUARN_GUARDED_BY(mutex);
+  std::vector<loop_waiter *> waiters QUARN_GUARDED_BY(mutex);
 };
 
 lease_table &leases() {
@@ -47,7 +47,7 @@ lease_table &leases() {
 
 bool on_main_thread() { return getpid() == gettid(); }
 
-void wake_waiters(lease_table &table) {
+void wake_waiters(lease_table &table) QUARN_REQUIRES(table.mutex) {
   table.released.notify_all();
   for (loop_waiter *waiter : table.waiters) {
     waiter->woken = true;
@@ -56,29 +56,30 @@ void wake_waiters(lease_table &table) {
 }
 
 /** @return false when nobody wants the lease any more */
-bool wait_in_loop(lease_table &table, std::unique_lock<std::mutex> &lock) {
+bool wait_in_loop(lease_table &table, MutexLock &lock) QUARN_REQUIRES(table.mutex) {
   const GMainLoopPtr loop(new_wait_loop());
   loop_waiter waiter{loop.get(), false};
   table.waiters.push_back(&waiter);
-  lock.unlock();
+  lock.waiting().unlock();
   run_nested_loop(loop.get());
-  lock.lock();
+  lock.waiting().lock();
   table.waiters.erase(std::find(table.waiters.begin(), table.waiters.end(), &waiter));
   return waiter.woken;
 }
 
 /** The same for the worker's run. */
-bool wait_in_run(backup_context *ctx, lease_table &table, std::unique_lock<std::mutex> &lock) {
-  table.released.wait_for(lock, kLookInterval);
-  lock.unlock();
+bool wait_in_run(backup_context *ctx, lease_table &table, MutexLock &lock)
+    QUARN_REQUIRES(table.mutex) {
+  table.released.wait_for(lock.waiting(), kLookInterval);
+  lock.waiting().unlock();
   const bool stop = backup_must_stop(ctx);
-  lock.lock();
+  lock.waiting().lock();
   return !stop;
 }
 
 void on_packing_ended() {
   lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
+  const MutexLock lock(table.mutex);
   wake_waiters(table);
 }
 
@@ -92,7 +93,7 @@ bool must_wait_for_packing(const std::string &pkg_id) {
 bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id) {
   lease_table &table = leases();
   set_packing_ended_hook(on_packing_ended);
-  std::unique_lock<std::mutex> lock(table.mutex);
+  MutexLock lock(table.mutex);
   for (;;) {
     const bool held = table.holders.emplace(pkg_id, ctx).first->second == ctx;
     if (held && !must_wait_for_packing(pkg_id)) return true;
@@ -110,7 +111,7 @@ bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id) {
 
 void release_staged_archive(backup_context *ctx, const std::string &pkg_id) {
   lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
+  const MutexLock lock(table.mutex);
   const auto holder = table.holders.find(pkg_id);
   if (holder == table.holders.end() || holder->second != ctx) return;
   table.holders.erase(holder);
@@ -119,14 +120,14 @@ void release_staged_archive(backup_context *ctx, const std::string &pkg_id) {
 
 bool holds_staged_archive(backup_context *ctx, const std::string &pkg_id) {
   lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
+  const MutexLock lock(table.mutex);
   const auto holder = table.holders.find(pkg_id);
   return holder != table.holders.end() && holder->second == ctx;
 }
 
 void release_all_staged_archives(backup_context *ctx) {
   lease_table &table = leases();
-  const std::lock_guard<std::mutex> lock(table.mutex);
+  const MutexLock lock(table.mutex);
   bool any = false;
   for (auto it = table.holders.begin(); it != table.holders.end();) {
     if (it->second == ctx) {
@@ -150,8 +151,8 @@ std::string staged_archive_path(const std::string &root_path, const std::string 
 }
 
 void delete_staged_file(const std::string &path) {
-  static std::mutex deletion_mutex;
-  const std::lock_guard<std::mutex> lock(deletion_mutex);
+  static Mutex deletion_mutex;
+  const MutexLock lock(deletion_mutex);
   struct stat status = {};
   if (safe_lstat(path.c_str(), &status) != 0 || !is_own_file(status)) return;
   if (file_exist(path.c_str()) && delete_file(path.c_str())) forget_working_file(path);
