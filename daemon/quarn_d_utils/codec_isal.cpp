@@ -158,13 +158,8 @@ class IsalCodec : public Codec {
     bool end = false;
     start_output(&state);
     for (;;) {
-      if (state.avail_in == 0 && !end) {
-        const long count = source->read(in_->deflated, kInflateInput, &end);
-        if (count < 0) return CodecResult::kSourceFailed;
-        if (count == 0) end = true;
-        totals->deflated += static_cast<std::uint64_t>(count);
-        state.next_in = in_->deflated;
-        state.avail_in = static_cast<std::uint32_t>(count);
+      if (state.avail_in == 0 && !end && !refill(source, &end, totals)) {
+        return CodecResult::kSourceFailed;
       }
       const std::uint32_t before_in = state.avail_in;
       const std::uint32_t before_out = state.avail_out;
@@ -190,6 +185,16 @@ class IsalCodec : public Codec {
     isal_deflate_reset(&out_->stream);
     out_->stream.level = fixed_code ? kFixedCodeLevel : kLevel;
     if (fixed_code) isal_deflate_set_hufftables(&out_->stream, nullptr, IGZIP_HUFFTABLE_STATIC);
+  }
+  /** What is inflated next. @return false when the source fails */
+  bool refill(ByteSource *source, bool *end, CodecTotals *totals) {
+    const long count = source->read(in_->deflated, kInflateInput, end);
+    if (count < 0) return false;
+    if (count == 0) *end = true;
+    totals->deflated += static_cast<std::uint64_t>(count);
+    in_->state.next_in = in_->deflated;
+    in_->state.avail_in = static_cast<std::uint32_t>(count);
+    return true;
   }
   /** The next chunk, full unless the source ends: its bounds decide what the output is. */
   std::size_t fill(ByteSource *source, bool *end, CodecResult *result) {
