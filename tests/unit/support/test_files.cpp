@@ -5,11 +5,13 @@
 
 #include <filesystem>
 #include <fstream>
-#include <iterator>
+#include <sstream>
 
 std::string read_text(const std::string &path) {
-  std::ifstream file(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()};
+  const std::ifstream file(path, std::ios::binary);
+  std::ostringstream text;
+  text << file.rdbuf();  // what can be read: a file of a thread in /proc goes with it
+  return text.str();
 }
 
 void write_text(const std::string &path, const std::string &content) {
