@@ -3,8 +3,8 @@
 #include <algorithm>
 #include <cstdio>
 
+#include "json_ptr.h"
 #include "json_read.h"
-#include "quarn_handles.h"
 #include "text.h"
 
 namespace quarn_client {

@@ -3,6 +3,7 @@
 #include <cstring>
 #include <utility>
 
+#include "glib_handles.h"
 #include "quarn_common.h"
 
 namespace quarn_client {

@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <utility>
 
-#include "quarn_handles.h"
+#include "glib_handles.h"
 #include "text.h"
 
 namespace quarn_client {

@@ -14,7 +14,7 @@
 #include <optional>
 #include <string>
 
-#include "quarn_handles.h"
+#include "json_ptr.h"
 
 namespace quarn_client {
 

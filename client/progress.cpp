@@ -4,6 +4,7 @@
 #include <cmath>
 #include <utility>
 
+#include "json_ptr.h"
 #include "json_read.h"
 #include "quarn_common.h"
 #include "text.h"

@@ -5,6 +5,8 @@
 #include <cstdlib>
 
 #include "files/package_files.h"
+#include "glib_handles.h"
+#include "json_ptr.h"
 #include "json_read.h"
 #include "platform_package_manager.h"
 #include "quarn_handles.h"

@@ -3,8 +3,8 @@
 #include <algorithm>
 #include <filesystem>
 
+#include "json_ptr.h"
 #include "json_read.h"
-#include "quarn_handles.h"
 #include "rules.h"
 #include "rules_private.h"
 #include "text.h"

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "files/package_files.h"
+#include "json_ptr.h"
 #include "json_read.h"
 #include "session.h"
 #include "status.h"

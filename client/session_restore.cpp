@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+#include "json_ptr.h"
 #include "json_read.h"
 #include "text.h"
 

@@ -21,9 +21,10 @@
 #include "backup_sets.h"
 #include "bus_client.h"
 #include "clean_up.h"
+#include "glib_handles.h"
+#include "json_ptr.h"
 #include "progress.h"
 #include "quarn_common.h"
-#include "quarn_handles.h"
 #include "screen.h"
 
 namespace quarn_client {

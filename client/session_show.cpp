@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "json_ptr.h"
 #include "json_read.h"
 #include "platform_clock.h"
 #include "status.h"

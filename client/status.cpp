@@ -2,8 +2,8 @@
 
 #include <map>
 
+#include "glib_handles.h"
 #include "json_read.h"
-#include "quarn_handles.h"
 #include "text.h"
 
 namespace quarn_client {

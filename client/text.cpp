@@ -4,6 +4,7 @@
 #include <cinttypes>
 #include <cstdio>
 
+#include "glib_handles.h"
 #include "quarn_handles.h"
 
 namespace quarn_client {

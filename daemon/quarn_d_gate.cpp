@@ -13,9 +13,9 @@
 #include <utility>
 #include <vector>
 
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_methods.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
 #include "thread_annotations.h"

@@ -3,11 +3,12 @@
 #include <memory>
 #include <utility>
 
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 
 const char kPackagesIntrospection[] =

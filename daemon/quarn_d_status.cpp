@@ -8,9 +8,10 @@
 #include <utility>
 #include <vector>
 
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_status_properties.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_log.h"
 
 namespace {

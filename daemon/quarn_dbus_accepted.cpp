@@ -3,6 +3,7 @@
 #include <map>
 #include <string>
 
+#include "gio_handles.h"
 #include "quarn_common.h"
 #include "quarn_dbus_callback.h"
 #include "quarn_dbus_client.h"

@@ -8,6 +8,7 @@
 #include <utility>
 #include <vector>
 
+#include "gio_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_dbus_client.h"

@@ -13,6 +13,7 @@
 #include <optional>
 #include <string>
 
+#include "glib_handles.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_dbus_accepted.h"

@@ -7,7 +7,8 @@
 
 #include <gio/gio.h>
 
-#include "quarn_d_utils/handles.h"
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_dbus_client.h"
 
 /** The message that ends the stream of one restore-enable request. */

@@ -4,6 +4,8 @@
 #include <memory>
 #include <utility>
 
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"

@@ -5,6 +5,8 @@
 #include <utility>
 #include <vector>
 
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"

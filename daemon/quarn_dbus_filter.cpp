@@ -10,6 +10,7 @@
 #include <string>
 #include <utility>
 
+#include "gio_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_lifecycle.h"

@@ -2,7 +2,8 @@
 
 #include <memory>
 
-#include "quarn_d_utils/handles.h"
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_dbus_method_call.h"
 

@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "glib_handles.h"
 #include "quarn_log.h"
 
 MethodCall::MethodCall(const char *sender, const char *interface_name, const char *method_name,

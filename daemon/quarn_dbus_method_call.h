@@ -9,8 +9,8 @@
 
 #include <string>
 
+#include "gio_handles.h"
 #include "quarn_d_callers.h"
-#include "quarn_d_utils/handles.h"
 
 class MethodCall {
  public:

@@ -4,11 +4,12 @@
 
 #include <utility>
 
+#include "gio_handles.h"
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_end.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_lifecycle.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_dbus_calls.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_dispatch.h"

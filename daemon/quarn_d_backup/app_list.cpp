@@ -13,6 +13,7 @@
 
 #include "files/package_files.h"
 #include "files/safe_path.h"
+#include "json_ptr.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/backup_context.h"

@@ -15,6 +15,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "json_ptr.h"
 #include "quarn_d_backup/backup_context_ptr.h"
 #include "quarn_d_utils/handles.h"
 

@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "files/package_files.h"
+#include "json_ptr.h"
 #include "log_scope.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/app_list.h"

@@ -3,6 +3,7 @@
 #include <cstring>
 #include <memory>
 
+#include "json_ptr.h"
 #include "quarn_d_utils/handles.h"
 
 namespace {

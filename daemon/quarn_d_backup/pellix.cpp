@@ -12,6 +12,7 @@
 #include "backup_transport.h"
 #include "files/package_files.h"
 #include "files/safe_path.h"
+#include "glib_handles.h"
 #include "platform_package_manager.h"
 #include "platform_smack.h"
 #include "quarn_common.h"

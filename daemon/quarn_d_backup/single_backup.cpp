@@ -2,11 +2,11 @@
 
 #include <glib.h>
 
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_upload.h"
 #include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/package_archive.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 
 single_backup::single_backup(const single_backup_subject &subject) : ctx_(new backup_context) {

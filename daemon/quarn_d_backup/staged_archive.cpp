@@ -11,9 +11,9 @@
 #include <vector>
 
 #include "files/safe_path.h"
+#include "glib_handles.h"
 #include "quarn_d_backup/pipeline.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/working_files.h"

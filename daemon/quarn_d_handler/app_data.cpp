@@ -2,6 +2,7 @@
 #include <utility>
 
 #include "files/package_files.h"
+#include "glib_handles.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/single_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"

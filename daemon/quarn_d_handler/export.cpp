@@ -12,6 +12,7 @@
 
 #include "files/package_files.h"
 #include "files/safe_path.h"
+#include "glib_handles.h"
 #include "platform_smack.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"

@@ -12,7 +12,7 @@
 #include <memory>
 #include <string>
 
-#include "quarn_d_utils/handles.h"
+#include "glib_handles.h"
 
 /** One export's place among all. */
 class ExportTurn {

@@ -5,7 +5,7 @@
 #ifndef QUARN_D_RESTORE_ARCHIVE_TABLE_H
 #define QUARN_D_RESTORE_ARCHIVE_TABLE_H
 
-#include "quarn_d_utils/handles.h"
+#include "json_ptr.h"
 
 struct archive_table {
   bool readable = false; /**< the file could be read to its end, or as far as its bounds go */

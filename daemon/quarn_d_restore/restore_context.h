@@ -12,9 +12,9 @@
 #include <memory>
 #include <string>
 
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_hold.h"
-#include "quarn_d_utils/handles.h"
 
 struct pkg_restore_context {
   int result = QUARN_OK; /**< a #quarn_result; final when pending is back at 0 */

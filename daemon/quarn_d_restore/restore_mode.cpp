@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "files/package_files.h"
+#include "json_ptr.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/own_backup.h"
@@ -17,7 +18,6 @@
 #include "quarn_d_restore/restore_progress.h"
 #include "quarn_d_utils/cloud_session.h"
 #include "quarn_d_utils/fiber.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package.h"

@@ -6,6 +6,7 @@
 
 #include "files/held_folder.h"
 #include "files/safe_path.h"
+#include "json_ptr.h"
 #include "quarn_common.h"
 #include "quarn_d_restore/archive_table.h"
 #include "quarn_d_restore/clearing.h"

@@ -10,6 +10,7 @@
 #include "files/held_folder.h"
 #include "files/safe_path.h"
 #include "files/tree_walk.h"
+#include "json_ptr.h"
 #include "log_scope.h"
 #include "platform_security_server.h"
 #include "platform_smack.h"

@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "backup_transport.h"
-#include "quarn_d_utils/handles.h"
+#include "glib_handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_log.h"
 #include "thread_annotations.h"

@@ -5,7 +5,6 @@
 #include "platform_clock.h"
 #include "platform_system_info.h"
 #include "quarn_d_utils/device_info.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_log.h"
 

@@ -15,6 +15,7 @@
 #include <string>
 
 #include "files/safe_path.h"
+#include "glib_handles.h"
 #include "quarn_d_utils/codec.h"
 #include "quarn_d_utils/file_at.h"
 #include "quarn_d_utils/file_bytes.h"

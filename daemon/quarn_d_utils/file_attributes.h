@@ -14,7 +14,7 @@
 #include <cstddef>
 #include <optional>
 
-#include "quarn_d_utils/handles.h"
+#include "json_ptr.h"
 
 /** The table's member that lists the links: each element of it is a member of its own. */
 inline constexpr char kLinkListKey[] = "quarn_symbolic_info";

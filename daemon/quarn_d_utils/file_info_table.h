@@ -16,7 +16,7 @@
 #include <string>
 #include <tuple>
 
-#include "quarn_d_utils/handles.h"
+#include "json_ptr.h"
 
 /** Table of the modes, owners, labels and links of one archive. */
 struct file_info_table_h {

@@ -5,7 +5,6 @@
 #include <string>
 #include <vector>
 
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/package.h"
 #include "quarn_d_utils/platform_handles.h"

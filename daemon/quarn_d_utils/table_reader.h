@@ -5,6 +5,9 @@
 #ifndef QUARN_D_UTILS_TABLE_READER_H
 #define QUARN_D_UTILS_TABLE_READER_H
 
+#include <json-c/json_tokener.h>
+
+#include "json_ptr.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/table_text.h"
 

@@ -11,6 +11,7 @@
 
 #include "files/safe_path.h"
 #include "files/tree_walk.h"
+#include "glib_handles.h"
 #include "log_scope.h"
 #include "quarn_d_utils/package_identity.h"
 #include "quarn_log.h"

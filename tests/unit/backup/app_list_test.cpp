@@ -14,13 +14,13 @@
 #include <vector>
 
 #include "backup_device.h"
+#include "json_ptr.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/app_list.h"
 #include "quarn_d_backup/backup_context.h"
 #include "quarn_d_backup/list_rebase.h"
 #include "quarn_d_backup/model_entries.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/handles.h"
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;

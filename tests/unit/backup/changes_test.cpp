@@ -14,7 +14,6 @@
 #include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/path_rules.h"
 
 using ::testing::AllOf;

@@ -11,6 +11,7 @@
 
 #include "backup_device.h"
 #include "backup_transport.h"
+#include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/archive_upload.h"
 #include "quarn_d_backup/backup_context.h"
@@ -19,7 +20,6 @@
 #include "quarn_d_backup/package_archive.h"
 #include "quarn_d_backup/single_folders.h"
 #include "quarn_d_backup/staged_archive.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/request_cause.h"
 

@@ -15,7 +15,6 @@
 #include "quarn_d_backup/cancel.h"
 #include "quarn_d_backup/package_archive.h"
 #include "quarn_d_backup/staged_archive.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/power.h"
 

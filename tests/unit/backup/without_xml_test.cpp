@@ -12,7 +12,6 @@
 #include "quarn_d_backup/package_archive.h"
 #include "quarn_d_backup/pellix.h"
 #include "quarn_d_backup/staged_archive.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/path_rules.h"
 #include "rules/rules_file.h"
 

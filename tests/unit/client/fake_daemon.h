@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "glib_handles.h"
 #include "quarn_handles.h"
 #include "run_until.h"
 

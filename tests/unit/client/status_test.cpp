@@ -2,8 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include "glib_handles.h"
+#include "json_ptr.h"
 #include "json_read.h"
-#include "quarn_handles.h"
 #include "text.h"
 
 namespace {

@@ -4,6 +4,7 @@
 
 #include <new>
 
+#include "glib_handles.h"
 #include "log_capture.h"
 #include "private_bus.h"
 #include "quarn_common.h"

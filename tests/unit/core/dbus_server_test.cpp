@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "glib_handles.h"
 #include "log_capture.h"
 #include "private_bus.h"
 #include "quarn_common.h"
@@ -25,7 +26,6 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_turn.h"
 #include "quarn_d_utils/admission.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_d_utils/power.h"

@@ -5,10 +5,10 @@
 #include <string>
 #include <vector>
 
+#include "glib_handles.h"
 #include "log_capture.h"
 #include "private_bus.h"
 #include "quarn_common.h"
-#include "quarn_d_utils/handles.h"
 
 namespace {
 

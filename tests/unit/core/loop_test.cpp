@@ -20,6 +20,7 @@
 #include <thread>
 #include <vector>
 
+#include "glib_handles.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "quarn_handles.h"
+#include "glib_handles.h"
 
 namespace {
 

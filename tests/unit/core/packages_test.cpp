@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "glib_handles.h"
 #include "log_capture.h"
 #include "private_bus.h"
 #include "quarn_d_gate.h"

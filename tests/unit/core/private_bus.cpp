@@ -5,6 +5,8 @@
 #include <chrono>
 #include <cstdlib>
 
+#include "glib_handles.h"
+
 namespace {
 
 constexpr unsigned int kDeadlineSeconds = 10;

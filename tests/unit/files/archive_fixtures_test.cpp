@@ -8,11 +8,11 @@
 #include <filesystem>
 #include <string>
 
+#include "json_ptr.h"
 #include "log_capture.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

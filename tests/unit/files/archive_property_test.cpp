@@ -16,13 +16,13 @@
 #include <string>
 #include <vector>
 
+#include "json_ptr.h"
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/bounds.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

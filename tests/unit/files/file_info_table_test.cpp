@@ -8,11 +8,11 @@
 #include <string>
 
 #include "fault.h"
+#include "json_ptr.h"
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/file_info_table.h"
-#include "quarn_d_utils/handles.h"
 #include "temp_dir.h"
 
 namespace {

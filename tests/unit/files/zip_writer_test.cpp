@@ -18,6 +18,7 @@
 #include "codec_choice.h"
 #include "fault.h"
 #include "files/package_files.h"
+#include "json_ptr.h"
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "quarn_common.h"

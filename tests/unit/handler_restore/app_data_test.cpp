@@ -9,6 +9,7 @@
 #include <future>
 #include <thread>
 
+#include "glib_handles.h"
 #include "handler_fixture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/cancel_own.h"
@@ -16,7 +17,6 @@
 #include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/fiber.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/path_rules.h"

@@ -1,12 +1,12 @@
 #include <cstring>
 
+#include "glib_handles.h"
 #include "handler_fixture.h"
 #include "quarn_d_backup/archive_hold.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/fiber.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package.h"
 #include "quarn_d_utils/power.h"

@@ -9,6 +9,7 @@
 #include <future>
 #include <thread>
 
+#include "glib_handles.h"
 #include "quarn_d_conditions/conditions.h"
 #include "quarn_d_restore/archive_download.h"
 #include "quarn_d_restore/recovery.h"
@@ -18,7 +19,6 @@
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/power.h"

@@ -19,6 +19,7 @@
 #include <utility>
 #include <vector>
 
+#include "json_ptr.h"
 #include "log_capture.h"
 #include "mock_platform.h"
 #include "mock_transport.h"
@@ -26,7 +27,6 @@
 #include "quarn_d_restore/restore_context.h"
 #include "quarn_d_restore/restore_mode.h"
 #include "quarn_d_restore/restore_progress.h"
-#include "quarn_d_utils/handles.h"
 #include "quarn_dbus_client.h"
 #include "temp_dir.h"
 
