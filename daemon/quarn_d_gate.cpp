@@ -2,7 +2,6 @@
 
 #include <grp.h>
 #include <pwd.h>
-#include <unistd.h>
 
 #include <cstdlib>
 #include <deque>
@@ -37,9 +36,12 @@ struct waiting_call {
   PendingWork pending;
 };
 
-/** What is known of one connection, and what waits to know it. */
+// Never destroyed: the process may be left while other threads look.
+Mutex &entries_mutex = *new Mutex;
+
+/** What is known of one connection, and what waits to know it. But for the caller main thread. */
 struct connection_entry {
-  quarn_caller caller;
+  quarn_caller caller QUARN_GUARDED_BY(entries_mutex);
   bool asked = false;
   bool told = false;
   std::deque<waiting_call> waiting;
@@ -49,10 +51,8 @@ struct connection_entry {
 };
 using EntryPtr = std::shared_ptr<connection_entry>;
 
-// The process may be left while other threads look. The main thread alone writes, under the mutex,
-// and reads without it: hence no word of it at the entries.
-Mutex &entries_mutex = *new Mutex;
-std::map<std::string, EntryPtr> &entries = *new std::map<std::string, EntryPtr>;
+std::map<std::string, EntryPtr> &entries QUARN_GUARDED_BY(entries_mutex) =
+    *new std::map<std::string, EntryPtr>;
 std::uint64_t last_age = 0;
 caller_source &source = *new caller_source;
 std::optional<gid_t> given_group;
@@ -101,6 +101,13 @@ void end_refusals(gint64 before) QUARN_REQUIRES(refused.mutex) {
   }
 }
 
+/** Null for a connection that nothing is known of. */
+EntryPtr find_entry(const std::string &sender) {
+  const MutexLock lock(entries_mutex);
+  const auto found = entries.find(sender);
+  return found == entries.end() ? nullptr : found->second;
+}
+
 void drop(const std::string &sender) {
   EntryPtr dropped;
   {
@@ -122,14 +129,15 @@ void on_left(GDBusConnection *, const gchar *, const gchar *, const gchar *, con
   const char *owner = nullptr;
   g_variant_get(parameters, "(&s&s&s)", &name, nullptr, &owner);
   if (*owner != '\0') return;
-  const auto found = entries.find(name);
+  const EntryPtr entry = find_entry(name);
   // Who has left while it is asked for is told of by the answer.
-  if (found != entries.end() && found->second->told) drop(name);
+  if (entry != nullptr && entry->told) drop(name);
 }
 
-/** Room for another: the one that is known longest and has nothing waiting. */
-void make_room() {
-  if (entries.size() < kMostCallersKnown) return;
+/** Of those that have nothing waiting the one that is known longest; none while there is room. */
+std::optional<std::string> dispensable_entry() {
+  const MutexLock lock(entries_mutex);
+  if (entries.size() < kMostCallersKnown) return std::nullopt;
   const std::string *oldest = nullptr;
   std::uint64_t age = 0;
   for (const auto &[name, entry] : entries) {
@@ -139,13 +147,12 @@ void make_room() {
       age = entry->age;
     }
   }
-  if (oldest != nullptr) drop(std::string(*oldest));
+  return oldest == nullptr ? std::nullopt : std::optional(*oldest);
 }
 
 EntryPtr entry_of(GDBusConnection *connection, const std::string &sender) {
-  const auto found = entries.find(sender);
-  if (found != entries.end()) return found->second;
-  make_room();
+  if (EntryPtr known = find_entry(sender)) return known;
+  if (const std::optional<std::string> dispensable = dispensable_entry()) drop(*dispensable);
   auto entry = std::make_shared<connection_entry>();
   entry->age = ++last_age;
   entry->connection = connection;
@@ -155,17 +162,21 @@ EntryPtr entry_of(GDBusConnection *connection, const std::string &sender) {
 }
 
 void drain(const EntryPtr &entry) {
+  quarn_caller caller;
+  {
+    const MutexLock lock(entries_mutex);
+    caller = entry->caller;
+  }
   while (!entry->waiting.empty()) {
     const caller_work work = std::move(entry->waiting.front().work);
     entry->waiting.pop_front();
-    work(entry->caller);
+    work(caller);
   }
 }
 
 /** Hear of a connection's end; after its answers, which nothing is to delay. */
 void watch(const std::string &sender, const EntryPtr &entry) {
-  const auto found = entries.find(sender);
-  if (entry->connection == nullptr || found == entries.end() || found->second != entry) return;
+  if (entry->connection == nullptr || find_entry(sender) != entry) return;
   entry->subscription = g_dbus_connection_signal_subscribe(
       entry->connection, kBusName, kBusName, "NameOwnerChanged", kBusPath, sender.c_str(),
       G_DBUS_SIGNAL_FLAGS_NONE, on_left, nullptr, nullptr);
@@ -267,6 +278,7 @@ void with_caller(GDBusConnection *connection, const std::string &sender, caller_
 }
 
 bool callers_are_asked_for() {
+  const MutexLock lock(entries_mutex);
   for (const auto &[sender, entry] : entries) {
     if (!entry->waiting.empty()) return true;
   }
@@ -371,7 +383,12 @@ void forget_callers() {
     end_refusals(G_MAXINT64);
   }
   asking_callers.clear();
-  while (!entries.empty()) drop(std::string(entries.begin()->first));
+  std::map<std::string, EntryPtr> known;
+  {
+    const MutexLock lock(entries_mutex);
+    known = entries;
+  }
+  for (const auto &[sender, entry] : known) drop(sender);
 }
 
 void set_caller_source(caller_source asked) { source = std::move(asked); }

@@ -89,7 +89,8 @@ inline constexpr gint64 kRequestPeriod = 60'000'000;
 /** Forget everything; for a connection that is left. */
 void forget_callers();
 
-/** Who is asked instead of the bus; the answer may come at any time, on the main thread. */
+/** Who is asked instead of the bus, in tests; the answer may come at any time, on the main thread.
+ */
 using caller_source = std::function<void(const std::string &sender, caller_work answer)>;
 /** @param source null: the bus */
 void set_caller_source(caller_source source);

@@ -24,19 +24,19 @@ namespace {
 using AttemptId = std::uintptr_t;
 constexpr AttemptId kNoAttempt = 0;
 
+// The library is handed the number of an attempt, not a record, so an answer that comes late or
+// never leaves nothing behind.
+Mutex session_mutex;
+
 /** One call of cloud_initialized(); it lives on that caller's stack. */
 struct wait_record {
-  AttemptId attempt = kNoAttempt;
-  GMainLoop *loop = nullptr; /**< main thread only */
-  guint timeout_source = 0;  /**< main thread only */
-  bool answered = false;
-  bool waiting = false; /**< the nested loop runs */
+  AttemptId attempt = kNoAttempt; /**< stays once the record is in the list */
+  GMainLoop *loop QUARN_GUARDED_BY(session_mutex) = nullptr; /**< of the main thread's wait alone */
+  guint timeout_source QUARN_GUARDED_BY(session_mutex) = 0;  /**< the same */
+  bool answered QUARN_GUARDED_BY(session_mutex) = false;
+  bool waiting QUARN_GUARDED_BY(session_mutex) = false; /**< the nested loop runs */
 };
 
-// Guards also the flags of the records in the list. The library
-// is handed the number of an attempt, not a record, so an answer that comes
-// late or never leaves nothing behind.
-Mutex session_mutex;
 std::condition_variable session_answered;
 std::vector<wait_record *> wait_records QUARN_GUARDED_BY(session_mutex);
 AttemptId last_attempt QUARN_GUARDED_BY(session_mutex) = kNoAttempt;
@@ -126,7 +126,9 @@ void wait_in_nested_loop(wait_record *record) {
 void wait_on_condition(wait_record *record) {
   MutexLock lock(session_mutex);
   const auto timeout = std::chrono::seconds(cloud_init_timeout_seconds);
-  if (!session_answered.wait_for(lock.waiting(), timeout, [record] { return record->answered; })) {
+  if (!session_answered.wait_for(lock.waiting(), timeout, [record]() QUARN_REQUIRES(session_mutex) {
+        return record->answered;
+      })) {
     log_timeout();
   }
 }

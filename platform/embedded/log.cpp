@@ -11,12 +11,12 @@
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
-#include <mutex>
 #include <string>
 
 #include "state/clock.h"
 #include "state/printable.h"
 #include "state/state_file.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -73,7 +73,7 @@ class LogFile {
  public:
   void append(const std::string &line) {
     const std::string device = embedded::current_device();
-    const std::lock_guard<std::mutex> lock(mutex_);
+    const MutexLock lock(mutex_);
     if (device != device_) {
       if (fd_ >= 0) close(fd_);
       fd_ = -1;
@@ -87,9 +87,9 @@ class LogFile {
   }
 
  private:
-  std::mutex mutex_;
-  std::string device_;
-  int fd_ = -1;
+  Mutex mutex_;
+  std::string device_ QUARN_GUARDED_BY(mutex_);
+  int fd_ QUARN_GUARDED_BY(mutex_) = -1;
 };
 
 // Never destroyed: threads may log until the process is gone.

@@ -2,9 +2,8 @@
 
 #include <sys/stat.h>
 
-#include <mutex>
-
 #include "state/state_file.h"
+#include "thread_annotations.h"
 
 namespace embedded {
 namespace {
@@ -32,7 +31,7 @@ class Offset {
     struct stat status {};
     if (device.empty() || stat(state_path(device, kClockFile).c_str(), &status) != 0) return 0;
     const Version version{status.st_dev, status.st_ino, status.st_ctim};
-    const std::lock_guard<std::mutex> lock(mutex_);
+    const MutexLock lock(mutex_);
     if (version == version_) return offset_;
     const KeyFilePtr file = read_state(device, kClockFile);
     if (file == nullptr) return 0;
@@ -42,9 +41,9 @@ class Offset {
   }
 
  private:
-  std::mutex mutex_;
-  Version version_;
-  std::int64_t offset_ = 0;
+  Mutex mutex_;
+  Version version_ QUARN_GUARDED_BY(mutex_);
+  std::int64_t offset_ QUARN_GUARDED_BY(mutex_) = 0;
 };
 
 }  // namespace

@@ -10,11 +10,11 @@
 #include <cstdlib>
 #include <filesystem>
 #include <memory>
-#include <mutex>
 #include <system_error>
 #include <thread>
 
 #include "state/clock.h"
+#include "thread_annotations.h"
 
 namespace embedded {
 namespace {
@@ -55,7 +55,7 @@ class Writer {
 
   void start(const std::string &device, const std::string &file, KeyFilePtr content,
              StateLock lock) {
-    const std::lock_guard<std::mutex> guard(mutex_);
+    const MutexLock guard(mutex_);
     join();
     const auto job = std::make_shared<Job>(Job{device, file, std::move(content), std::move(lock)});
     try {
@@ -65,7 +65,7 @@ class Writer {
     }
   }
   void wait() {
-    const std::lock_guard<std::mutex> guard(mutex_);
+    const MutexLock guard(mutex_);
     join();
   }
 
@@ -83,12 +83,12 @@ class Writer {
     }
   };
 
-  void join() {
+  void join() QUARN_REQUIRES(mutex_) {
     if (thread_.joinable()) thread_.join();
   }
 
-  std::mutex mutex_;
-  std::thread thread_;
+  Mutex mutex_;
+  std::thread thread_ QUARN_GUARDED_BY(mutex_);
 };
 
 }  // namespace
