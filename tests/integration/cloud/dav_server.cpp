@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "http/http.h"
+#include "loopback.h"
 
 using namespace harness;
 
@@ -30,14 +31,6 @@ bool prepare_process() {
          mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0;
 }
 const bool prepared = prepare_process();
-
-sockaddr_in loopback(int port) {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  address.sin_port = htons(static_cast<uint16_t>(port));
-  return address;
-}
 
 int free_port() {
   const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);

@@ -1,6 +1,6 @@
 /**
  * @file fake_daemon.h
- * @brief A private bus, a daemon on it that does what a test tells it, and runs of quarnctl.
+ * @brief A daemon on a private bus that does what a test tells it, and runs of quarnctl.
  */
 #ifndef QUARN_TESTS_FAKE_DAEMON_H
 #define QUARN_TESTS_FAKE_DAEMON_H
@@ -15,24 +15,9 @@
 #include <vector>
 
 #include "glib_handles.h"
+#include "private_bus.h"
 #include "quarn_handles.h"
 #include "run_until.h"
-
-/** A dbus-daemon of the test's own. */
-class PrivateBus {
- public:
-  PrivateBus();
-  ~PrivateBus();
-  PrivateBus(const PrivateBus &) = delete;
-  PrivateBus &operator=(const PrivateBus &) = delete;
-
-  std::string address() const;
-  Handle<GDBusConnection, &g_object_unref> connect() const;
-  void stop();
-
- private:
-  GTestDBus *bus_;
-};
 
 /** A method call that quarnctl has made. */
 class IncomingCall {
@@ -95,7 +80,7 @@ class FakeDaemon {
                       const char *interface, const char *method, GVariant *parameters,
                       GDBusMethodInvocation *invocation, gpointer user_data);
 
-  Handle<GDBusConnection, &g_object_unref> connection_;
+  ConnectionHandle connection_;
   guint object_ = 0;
   guint packages_object_ = 0;
   guint status_filter_ = 0;

@@ -11,13 +11,13 @@
 #include <vector>
 
 #include "log_capture.h"
-#include "private_bus.h"
 #include "quarn_common.h"
 #include "quarn_d_utils/admission.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_dbus_client.h"
+#include "scripted_client.h"
 
 namespace {
 

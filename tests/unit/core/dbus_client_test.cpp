@@ -6,8 +6,8 @@
 
 #include "glib_handles.h"
 #include "log_capture.h"
-#include "private_bus.h"
 #include "quarn_common.h"
+#include "scripted_client.h"
 
 namespace {
 

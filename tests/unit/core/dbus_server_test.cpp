@@ -16,7 +16,6 @@
 
 #include "glib_handles.h"
 #include "log_capture.h"
-#include "private_bus.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_end.h"
@@ -33,6 +32,7 @@
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_introspection.h"
 #include "quarn_dbus_limits.h"
+#include "scripted_client.h"
 #include "temp_dir.h"
 
 namespace {

@@ -7,12 +7,12 @@
 
 #include "glib_handles.h"
 #include "log_capture.h"
-#include "private_bus.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/cancel_own.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"
 #include "quarn_dbus_server.h"
+#include "scripted_client.h"
 #include "test_files.h"
 
 namespace {

@@ -5,7 +5,6 @@
 #include <string>
 
 #include "log_capture.h"
-#include "private_bus.h"
 #include "quarn_d_backup/quarn_d_backup.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
@@ -13,6 +12,7 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_server.h"
+#include "scripted_client.h"
 
 namespace {
 

@@ -13,6 +13,7 @@
 
 #include "fault.h"
 #include "log_capture.h"
+#include "loopback.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/path_rules.h"
 #include "rules/path_matcher.h"
@@ -319,9 +320,7 @@ TEST_F(PathRules, ExternalPartsAreNeverRead) {
 
 TEST_F(PathRules, TheNetworkIsNeverAsked) {
   const UniqueFd listener(socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK, 0));
-  sockaddr_in address = {};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  sockaddr_in address = loopback(0);
   socklen_t length = sizeof(address);
   ASSERT_EQ(bind(listener.get(), reinterpret_cast<sockaddr *>(&address), length), 0);
   ASSERT_EQ(listen(listener.get(), 1), 0);

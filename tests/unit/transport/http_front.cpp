@@ -19,6 +19,7 @@
 #include <cstring>
 
 #include "http/http.h"
+#include "loopback.h"
 
 namespace front {
 namespace {
@@ -35,14 +36,6 @@ constexpr int kStallPatienceMs = 5000;
 constexpr char kHeadEnd[] = "\r\n\r\n";
 constexpr char kBadRequest[] = "HTTP/1.1 400 Bad Request\r\nConnection: close\r\n\r\n";
 constexpr char kEcho[] = "{authorization}";
-
-sockaddr_in loopback(int port) {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  address.sin_port = htons(static_cast<uint16_t>(port));
-  return address;
-}
 
 // -1 when the port is taken.
 int bound_socket(int port) {

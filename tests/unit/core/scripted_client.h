@@ -1,9 +1,9 @@
 /**
- * @file private_bus.h
- * @brief A bus of the test's own as the system bus, and a scripted client on it.
+ * @file scripted_client.h
+ * @brief A bus of the program's own as the system bus, and a scripted client on it.
  */
-#ifndef PRIVATE_BUS_H
-#define PRIVATE_BUS_H
+#ifndef SCRIPTED_CLIENT_H
+#define SCRIPTED_CLIENT_H
 
 #include <gio/gio.h>
 
@@ -16,13 +16,11 @@
 #include <thread>
 #include <vector>
 
-#include "quarn_d_utils/handles.h"
+#include "private_bus.h"
 #include "run_until.h"
 
-using ConnectionHandle = Handle<GDBusConnection, &g_object_unref>;
-
 /** Start the bus of this program when it does not run yet. @return its address */
-const std::string &private_bus_address();
+std::string private_bus_address();
 
 /** A connection of one's own to that bus. */
 ConnectionHandle connect_to_private_bus();

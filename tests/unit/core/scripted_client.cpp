@@ -1,9 +1,10 @@
-#include "private_bus.h"
+#include "scripted_client.h"
 
 #include <gtest/gtest.h>
 
 #include <chrono>
 #include <cstdlib>
+#include <optional>
 
 #include "glib_handles.h"
 
@@ -44,31 +45,22 @@ GVariant *parse(const std::string &text) {
 /** The bus ends with the program. */
 class BusOwner : public ::testing::Environment {
  public:
-  void TearDown() override {
-    if (bus_ != nullptr) {
-      g_test_dbus_stop(bus_);
-      g_object_unref(bus_);
-      bus_ = nullptr;
-    }
-  }
-  const std::string &address() {
-    if (bus_ == nullptr) {
-      bus_ = g_test_dbus_new(G_TEST_DBUS_NONE);
-      g_test_dbus_up(bus_);
-      address_ = g_test_dbus_get_bus_address(bus_);
-      setenv("DBUS_SYSTEM_BUS_ADDRESS", address_.c_str(), 1);
+  void TearDown() override { bus_.reset(); }
+  const PrivateBus &bus() {
+    if (!bus_) {
+      bus_.emplace();
+      setenv("DBUS_SYSTEM_BUS_ADDRESS", bus_->address().c_str(), 1);
       // The bus ends before the program; that is no reason to raise SIGTERM.
       const ConnectionHandle shared(g_bus_get_sync(G_BUS_TYPE_SYSTEM, nullptr, nullptr));
       g_dbus_connection_set_exit_on_close(shared.get(), FALSE);
       shared_ = G_DBUS_CONNECTION(g_object_ref(shared.get()));
     }
-    return address_;
+    return *bus_;
   }
 
  private:
-  GTestDBus *bus_ = nullptr;
+  std::optional<PrivateBus> bus_;
   GDBusConnection *shared_ = nullptr; /**< keeps the process' one connection alive */
-  std::string address_;
 };
 
 BusOwner *const bus_owner = [] {
@@ -79,18 +71,9 @@ BusOwner *const bus_owner = [] {
 
 }  // namespace
 
-const std::string &private_bus_address() { return bus_owner->address(); }
+std::string private_bus_address() { return bus_owner->bus().address(); }
 
-ConnectionHandle connect_to_private_bus() {
-  GErrorPtr error;
-  ConnectionHandle connection(g_dbus_connection_new_for_address_sync(
-      private_bus_address().c_str(),
-      static_cast<GDBusConnectionFlags>(G_DBUS_CONNECTION_FLAGS_AUTHENTICATION_CLIENT |
-                                        G_DBUS_CONNECTION_FLAGS_MESSAGE_BUS_CONNECTION),
-      nullptr, nullptr, out(error)));
-  EXPECT_TRUE(connection) << error->message;
-  return connection;
-}
+ConnectionHandle connect_to_private_bus() { return bus_owner->bus().connect(); }
 
 ScriptedClient::ScriptedClient(bool with_object)
     : connection_(connect_to_private_bus()),
