@@ -2,14 +2,16 @@
 
 #include "quarn_d_backup/backup_progress.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_conditions/setting_observer.h"
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_packages.h"
 #include "quarn_d_progress.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_restore/recovery.h"
 #include "quarn_d_status.h"
 #include "quarn_d_utils/boot_cleanup.h"
+#include "quarn_d_utils/package_lock.h"
+#include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 
 namespace {
@@ -24,6 +26,11 @@ void export_objects(GDBusConnection *connection) {
 void wire_floors() {
   // The sweep is the backup worker's; what an interrupted restore has left only restore can mend.
   set_boot_recovery(recover_device);
+  // Whoever waits to pack a package is in the queue for its archive, which packing knows nothing
+  // of.
+  set_packing_ended_hook(note_packing_ended);
+  // How long a client may let others wait depends on who waits in the worker's queue.
+  quarn_dbus_set_patience(others_held_up);
   // The objects stand on a connection that the server has first, but the packages ask the server.
   set_bus_acquired_hook(export_objects);
   // The steps of runs and restores are told on the bus, high above those that make them.

@@ -25,7 +25,7 @@ struct accepted_request {
 
 /** By record, which is compared and never looked into. */
 struct request_table {
-  std::map<const void *, accepted_request> requests QUARN_GUARDED_BY(requests_mutex);
+  std::map<const client_cb_data *, accepted_request> requests QUARN_GUARDED_BY(requests_mutex);
 };
 request_table &accepted = *new request_table;
 
@@ -58,7 +58,7 @@ MessagePtr make_cancelled(const accepted_request &request) {
 
 }  // namespace
 
-bool take_turn(const void *record, bool is_last) {
+bool take_turn(const client_cb_data *record, bool is_last) {
   const auto found = accepted.requests.find(record);
   if (found == accepted.requests.end()) return true;
   const bool may = !found->second.told;
@@ -66,11 +66,11 @@ bool take_turn(const void *record, bool is_last) {
   return may;
 }
 
-void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void *record) {
-  const auto *data = static_cast<const client_cb_data *>(record);
+void quarn_dbus_accept_request(quarn_request kind, const std::string &text,
+                               const client_cb_data *record) {
   const MutexLock lock(requests_mutex);
   // The copy does not count among those that wait.
-  accepted.requests[record] = {kind, text, {data->req_id, data->sender}};
+  accepted.requests[record] = {kind, text, {record->req_id, record->sender}};
 }
 
 void quarn_dbus_end_requests() {

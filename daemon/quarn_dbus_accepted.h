@@ -9,6 +9,8 @@
 
 #include "thread_annotations.h"
 
+struct client_cb_data;
+
 /**
  * Held while a callback is handed to the connection, so that no request has two last ones and
  * none has a first one after it.
@@ -19,6 +21,7 @@ extern Mutex &requests_mutex;
  * Whether the client of @p record may still be called. The record is not looked into.
  * @param is_last with this callback its request ends
  */
-[[nodiscard]] bool take_turn(const void *record, bool is_last) QUARN_REQUIRES(requests_mutex);
+[[nodiscard]] bool take_turn(const client_cb_data *record, bool is_last)
+    QUARN_REQUIRES(requests_mutex);
 
 #endif

@@ -43,7 +43,8 @@ enum class quarn_request { restore_mode, app_list, manual_backup, cancel, app_ba
  * record is read after its last callback.
  * @param text what the last callback carries beside the result: a package id
  */
-void quarn_dbus_accept_request(quarn_request kind, const std::string &text, void *record);
+void quarn_dbus_accept_request(quarn_request kind, const std::string &text,
+                               const client_cb_data *record);
 
 /**
  * The process ends: whoever waits for a client goes on at once, and callbacks

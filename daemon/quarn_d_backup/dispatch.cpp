@@ -1,4 +1,3 @@
-#include <glib.h>
 #include <malloc.h>
 #include <pthread.h>
 
@@ -105,18 +104,6 @@ void forget_automatic() {
   automatic_outstanding = false;
 }
 
-/** Whether somebody else than @p sender has waited for unanswered callbacks for long enough. */
-bool others_held_up(const std::string &sender) {
-  const std::int64_t waited = quarn_dbus_time_waited();
-  const auto held_up = [&](const queued_request &request) {
-    const bool others = request.client == nullptr || request.client->sender != sender;
-    return others && waited - request.waited_before >= kLongestHoldUp;
-  };
-  const MutexLock lock(backup_req_list_mutex);
-  return std::any_of(backup_req_list.begin(), backup_req_list.end(), held_up) ||
-         std::any_of(cancelled_clients.begin(), cancelled_clients.end(), held_up);
-}
-
 std::optional<ClientPtr> take_cancelled_client() {
   const MutexLock lock(backup_req_list_mutex);
   return take_oldest(&cancelled_clients);
@@ -209,11 +196,21 @@ void wake_worker() {
 
 }  // namespace
 
+bool others_held_up(const std::string &sender) {
+  const std::int64_t waited = quarn_dbus_time_waited();
+  const auto held_up = [&](const queued_request &request) {
+    const bool others = request.client == nullptr || request.client->sender != sender;
+    return others && waited - request.waited_before >= kLongestHoldUp;
+  };
+  const MutexLock lock(backup_req_list_mutex);
+  return std::any_of(backup_req_list.begin(), backup_req_list.end(), held_up) ||
+         std::any_of(cancelled_clients.begin(), cancelled_clients.end(), held_up);
+}
+
 void set_backup_end_observer(backup_end_observer observer) { end_observer = observer; }
 
 void init_backup_req_dispatch_thread() {
   LOGI("init_backup_req_dispatch_thread");
-  quarn_dbus_set_patience(others_held_up);
   pthread_t worker = {};
   const int ret = pthread_create(&worker, nullptr, backup_req_dispatch_thread, nullptr);
   if (ret != 0) {

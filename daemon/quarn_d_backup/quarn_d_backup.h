@@ -11,6 +11,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <string>
 
 using backup_end_observer = void (*)();
 /** Follow the ends of requests: called on the worker when nothing of one is left; null ends it. */
@@ -38,6 +39,11 @@ void request_backup(void *client);
  * @param client not used: who cancels is told by its caller
  */
 void cancel_backup(void *client);
+/**
+ * Whether somebody else's request than those of @p sender, a unique bus name, was held up by
+ * clients that do not answer for as long as they may all together: a minute. Any thread.
+ */
+[[nodiscard]] bool others_held_up(const std::string &sender);
 /** True from request_backup() until the worker has finished everything queued. */
 [[nodiscard]] bool backup_request_outstanding();
 
@@ -59,7 +65,7 @@ void init_last_backup_time();
 /** Store the present time. */
 void set_last_backup_time();
 /** The stored time, milliseconds since the Unix epoch, without a log line; false: unreadable. */
-bool read_last_backup_time(std::uint64_t *time);
+[[nodiscard]] bool read_last_backup_time(std::uint64_t *time);
 /** The stored time, milliseconds since the Unix epoch; all ones when it cannot be read. */
 [[nodiscard]] std::uint64_t get_last_backup_time();
 

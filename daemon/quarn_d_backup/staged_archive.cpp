@@ -77,12 +77,6 @@ bool wait_in_run(backup_context *ctx, lease_table &table, MutexLock &lock)
   return !stop;
 }
 
-void on_packing_ended() {
-  lease_table &table = leases();
-  const MutexLock lock(table.mutex);
-  wake_waiters(table);
-}
-
 /** One package is packed at a time, and an export may take as long as it has data. */
 bool must_wait_for_packing(const std::string &pkg_id) {
   return pkg_id != kStagedListLease && any_package_is_packed();
@@ -90,9 +84,14 @@ bool must_wait_for_packing(const std::string &pkg_id) {
 
 }  // namespace
 
+void note_packing_ended() {
+  lease_table &table = leases();
+  const MutexLock lock(table.mutex);
+  wake_waiters(table);
+}
+
 bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id) {
   lease_table &table = leases();
-  set_packing_ended_hook(on_packing_ended);
   MutexLock lock(table.mutex);
   for (;;) {
     const bool held = table.holders.emplace(pkg_id, ctx).first->second == ctx;

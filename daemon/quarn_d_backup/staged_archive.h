@@ -23,6 +23,8 @@ inline constexpr char kStagedListLease[] = "/app_list";
  *         Wi-Fi, which has abandoned it then
  */
 [[nodiscard]] bool acquire_staged_archive(backup_context *ctx, const std::string &pkg_id);
+/** The packing of a package has ended: who waits for that looks again. Any thread. */
+void note_packing_ended();
 /** Give it back; nothing happens when @p ctx does not hold it. Any thread. */
 void release_staged_archive(backup_context *ctx, const std::string &pkg_id);
 /** True when @p ctx holds the right to a package's staged archive. */

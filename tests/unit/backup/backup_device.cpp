@@ -1,7 +1,5 @@
 #include "backup_device.h"
 
-#include "quarn_d_backup/archive_hold.h"
-
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/file.h>
@@ -13,6 +11,10 @@
 #include <fstream>
 #include <set>
 #include <sstream>
+
+#include "quarn_d_backup/archive_hold.h"
+#include "quarn_d_backup/staged_archive.h"
+#include "quarn_d_utils/package_lock.h"
 
 using ::testing::_;
 
@@ -90,8 +92,6 @@ int quarn_dbus_manual_backup_status(int err, int status, void *record) {
 }
 
 std::atomic<std::int64_t> time_waited_for_clients{0};
-callback_patience patience_of_worker = nullptr;
-void quarn_dbus_set_patience(callback_patience exhausted) { patience_of_worker = exhausted; }
 std::int64_t quarn_dbus_time_waited() { return time_waited_for_clients; }
 
 /* ---- cloud ---- */
@@ -277,6 +277,7 @@ BackupDevice::BackupDevice() {
   manual_backup_canceled = false;
   set_status_hook(nullptr);
   clear_sent_statuses();
+  set_packing_ended_hook(note_packing_ended);
   script_packages();
   clear_captured_log();
 }

@@ -125,8 +125,6 @@ std::ostream &operator<<(std::ostream &stream, const SentStatus &status);
 
 /** What the worker has waited for clients that do not answer, microseconds. */
 extern std::atomic<std::int64_t> time_waited_for_clients;
-/** What the worker's callbacks ask while they wait. */
-extern callback_patience patience_of_worker;
 
 /** Every status since the last clear. */
 std::vector<SentStatus> sent_statuses();

@@ -523,19 +523,19 @@ TEST_F(Dispatch, ClientsThatDoNotAnswerHoldUpAnothersRunForAMinuteAllTogether) {
   constexpr std::int64_t kMinute = 60000000;
   time_waited_for_clients = kMinute / 2;
   run_one(1);
-  EXPECT_FALSE(patience_of_worker(":1.9")) << "nobody else waits";
+  EXPECT_FALSE(others_held_up(":1.9")) << "nobody else waits";
   request_backup(new_client(2, ":1.2"));
   time_waited_for_clients = kMinute / 2 + kMinute - 1;
-  EXPECT_FALSE(patience_of_worker(":1.9"));
+  EXPECT_FALSE(others_held_up(":1.9"));
   time_waited_for_clients = kMinute / 2 + kMinute;
-  EXPECT_TRUE(patience_of_worker(":1.9"));
-  EXPECT_TRUE(patience_of_worker(":1.8")) << "the minute is that of all of them together";
-  EXPECT_FALSE(patience_of_worker(":1.2")) << "who is held up by nobody else";
+  EXPECT_TRUE(others_held_up(":1.9"));
+  EXPECT_TRUE(others_held_up(":1.8")) << "the minute is that of all of them together";
+  EXPECT_FALSE(others_held_up(":1.2")) << "who is held up by nobody else";
   // An automatic backup is held up by anybody.
   request_backup(nullptr);
-  EXPECT_FALSE(patience_of_worker(":1.2"));
+  EXPECT_FALSE(others_held_up(":1.2"));
   time_waited_for_clients = kMinute / 2 + 2 * kMinute;
-  EXPECT_TRUE(patience_of_worker(":1.2"));
+  EXPECT_TRUE(others_held_up(":1.2"));
   time_waited_for_clients = 0;
 }
 

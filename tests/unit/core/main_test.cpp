@@ -13,6 +13,7 @@
 
 #include "log_capture.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_backup/staged_archive.h"
 #include "quarn_d_conditions/conditions.h"
 #include "quarn_d_conditions/setting_observer.h"
 #include "quarn_d_end.h"
@@ -31,6 +32,7 @@
 #include "quarn_d_utils/kernel_settings.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_identity.h"
+#include "quarn_d_utils/package_lock.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
@@ -56,6 +58,8 @@ std::vector<int> woken;
 std::vector<void (*)()> observers;
 void (*boot_recovery)() = nullptr;
 void (*bus_acquired_hook)(GDBusConnection *) = nullptr;
+void (*packing_ended_hook)() = nullptr;
+callback_patience patience = nullptr;
 
 void step(const char *name) {
   steps.emplace_back(name);
@@ -160,6 +164,10 @@ void quarnd_dbus_deinit(unsigned int owner_id) {
   step("dbus_deinit");
 }
 void set_bus_acquired_hook(void (*hook)(GDBusConnection *)) { bus_acquired_hook = hook; }
+void note_packing_ended() {}
+void set_packing_ended_hook(void (*hook)()) { packing_ended_hook = hook; }
+bool others_held_up(const std::string &) { return false; }
+void quarn_dbus_set_patience(callback_patience exhausted) { patience = exhausted; }
 void quarnd_status_export(GDBusConnection *) { step("status_export"); }
 void quarnd_status_unexport() { step("status_unexport"); }
 void quarnd_packages_export(GDBusConnection *) { step("packages_export"); }
@@ -221,6 +229,8 @@ class Main : public ::testing::Test {
     manual_backup_canceled = false;
     observers.clear();
     boot_recovery = nullptr;
+    packing_ended_hook = nullptr;
+    patience = nullptr;
     for (const int signo : signals_) signal(signo, SIG_DFL);
     restart();
   }
@@ -479,6 +489,8 @@ TEST_F(Main, LowerFloorsAreGivenTheirHooksFirst) {
   init_quarn();
   ASSERT_NE(boot_recovery, nullptr);
   ASSERT_NE(bus_acquired_hook, nullptr);
+  EXPECT_EQ(packing_ended_hook, note_packing_ended);
+  EXPECT_EQ(patience, others_held_up);
   EXPECT_EQ(observers.size(), 3U);
   for (void (*const observer)() : observers) EXPECT_EQ(observer, quarnd_status_refresh);
   restart();

@@ -126,8 +126,7 @@ void add_to_archive(zipFile zip, const std::string &name, const std::string &con
 
 }  // namespace
 
-void quarn_dbus_accept_request(quarn_request, const std::string &, void *) {}
-void quarn_dbus_set_patience(callback_patience) {}
+void quarn_dbus_accept_request(quarn_request, const std::string &, const client_cb_data *) {}
 std::int64_t quarn_dbus_time_waited() { return 0; }
 int quarn_dbus_restore_enable_cb(int err, const char *msg, void *record) {
   return answer_client("restore_enable_cb", err, msg, record,
