@@ -6,14 +6,14 @@
 #define QUARN_TREE_DEPTH_H
 
 /**
- * Directories in one another, the data directory counted: walks hold a descriptor for each. It
- * holds for whatever takes a tree: what is packed can be copied aside, unpacked and put back.
- * Deletion has no bound, nor have the walks that only look after what one of these has taken: an
- * application may dig deeper meanwhile, and they hold one descriptor.
+ * Directories in one another, the data directory counted: some walks hold a descriptor for each. It
+ * holds for every walk but deletion, and the search for what one has left: what is packed can be
+ * copied aside, unpacked, given its attributes and put back, and no other walk looks at what an
+ * application digs deeper meanwhile.
  */
 inline constexpr int kMaxDirDepth = 400;
 
 /** Whether a directory that is the @p directories'th of those in one another is beyond it. */
-constexpr bool is_too_deep(int directories) { return directories > kMaxDirDepth; }
+[[nodiscard]] constexpr bool is_too_deep(int directories) { return directories > kMaxDirDepth; }
 
 #endif

@@ -2,10 +2,11 @@
  * @file tree_walk.h
  * @brief The way through a directory tree, for whoever has something to do in each of its places.
  *
- * walk_tree() holds one descriptor however deep it goes: it hands a whole folder to its visitor,
+ * walk_tree() holds one descriptor however deep it is: it hands a whole folder to its visitor,
  * and goes then into those of its folders that the visitor names. walk_in_order() hands over one
  * entry after the other and goes into a folder where it meets it, so it holds a descriptor for each
- * directory on its way and goes no deeper than tree_depth.h has it.
+ * directory on its way. Neither goes deeper than tree_depth.h has it, but for a visitor of
+ * walk_tree() that says so.
  *
  * Visitors are called directly: a walk costs what the same loop written out would. Neither follows
  * a link or logs anything by itself; both are one thread's.
@@ -36,12 +37,20 @@ enum class TreeStep {
 struct TreeVisitor {
   /** What it keeps of a folder that is to be entered; name_of() tells the name. */
   using Folder = std::string;
+  /** Directories in one another down to the one where the walk begins: as a rule a package's own.
+   */
+  static constexpr int kTopDepth = 1;
   static const std::string &name_of(const std::string &folder) { return folder; }
 
   /** Go into a folder; the walk's path is the folder's already. */
   template <typename Place>
   TreeStep enter(Place *place, const std::string &name) {
     return place->down(name.c_str()) ? TreeStep::entered : TreeStep::passed;
+  }
+  /** In place of enter(), for a folder that is deeper than any that is backed up. */
+  template <typename Place, typename Folder>
+  TreeStep too_deep(Place * /*place*/, const Folder & /*folder*/) {
+    return TreeStep::passed;
   }
   /** Everything below the walk's path has been visited, which is still where the walk is. */
   void finish() {}
@@ -80,7 +89,8 @@ template <typename Place, typename Visitor>
     pending.back().pop_back();
     const std::size_t length = path->size();
     path->append(1, '/').append(Visitor::name_of(folder));
-    switch (visitor->enter(place, folder)) {
+    const bool deeper = is_too_deep(Visitor::kTopDepth + static_cast<int>(pending.size()));
+    switch (deeper ? visitor->too_deep(place, folder) : visitor->enter(place, folder)) {
       case TreeStep::entered:
         pending.emplace_back();
         if (!visitor->scan(*place, &pending.back())) return false;

@@ -1,6 +1,5 @@
 #include "quarn_d_backup/package_trouble.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 
@@ -8,45 +7,64 @@
 
 #include "files/package_files.h"
 #include "files/safe_path.h"
+#include "files/tree_walk.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/package_directory.h"
 
 namespace {
 
-/** The worse of two findings: what is too deep stays so, whoever looks. */
-backup_outcome worse(backup_outcome one, backup_outcome other) {
-  if (one == backup_outcome::too_deep || other == backup_outcome::none) return one;
-  return other;
-}
+/** Looks for what keeps a backup from the folders of a package; what is too deep ends the search.
+ */
+class TroubleWalk {
+ public:
+  using Entries = EntriesAsTheyCome;
 
-backup_outcome look_below(DIR *dir, int depth) {
-  backup_outcome found = backup_outcome::none;
-  while (const dirent *entry = readdir(dir)) {
-    if (is_dot_entry(entry->d_name)) continue;
-    struct stat status = {};
-    if (fstatat(dirfd(dir), entry->d_name, &status, AT_SYMLINK_NOFOLLOW) != 0 ||
-        !S_ISDIR(status.st_mode)) {
-      continue;
+  backup_outcome found() const { return found_; }
+  bool ended() const { return found_ == backup_outcome::too_deep; }
+
+  void look_through(const std::string &folder) {
+    const DirPtr dir = safe_opendir(folder.c_str());
+    std::string path = folder;
+    if (dir == nullptr) {
+      found_ = backup_outcome::unreadable;
+    } else {
+      static_cast<void>(walk_in_order(dir.get(), &path, this));  // nothing is counted
     }
-    if (depth >= kMaxDirDepth) return backup_outcome::too_deep;
-    const DirPtr child = open_directory_as_package(dirfd(dir), entry->d_name, user_of_package());
-    found = worse(
-        found, child == nullptr ? backup_outcome::unreadable : look_below(child.get(), depth + 1));
-    if (found == backup_outcome::too_deep) return found;
   }
-  return found;
-}
+
+  EntryVisit visit(int dir, const WalkEntry &entry, const std::string & /*path*/) const {
+    struct stat status = {};
+    const bool is_folder =
+        fstatat(dir, entry.name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(status.st_mode);
+    return is_folder ? EntryVisit::folder : EntryVisit::passed;
+  }
+
+  DirPtr open(int parent, const char *name, struct stat *status) const {
+    return open_directory_as_package(parent, name, user_of_package(), status);
+  }
+
+  void missed(const std::string & /*path*/, int depth) {
+    found_ = is_too_deep(depth) ? backup_outcome::too_deep : backup_outcome::unreadable;
+  }
+
+  bool left(int /*fd*/, const struct stat & /*status*/, const std::string & /*path*/,
+            bool counted) const {
+    return counted;
+  }
+
+ private:
+  backup_outcome found_ = backup_outcome::none;
+};
 
 }  // namespace
 
 backup_outcome find_package_trouble(const std::string &root) {
   if (!is_directory(root.c_str())) return backup_outcome::removed;
-  backup_outcome found = backup_outcome::none;
+  TroubleWalk walk;
   for (const char *name : kDataDirs) {
-    const DirPtr dir = safe_opendir((root + "/" + name).c_str());
-    found = worse(found, dir == nullptr ? backup_outcome::unreadable : look_below(dir.get(), 1));
+    if (!walk.ended()) walk.look_through(root + "/" + name);
   }
   // it may have gone meanwhile
-  return is_directory(root.c_str()) ? found : backup_outcome::removed;
+  return is_directory(root.c_str()) ? walk.found() : backup_outcome::removed;
 }

@@ -28,6 +28,9 @@ constexpr mode_t kFolderMode = 0755;
 /** Moves what lies in the snapshot to its place; a name is replaced, so nothing needs space. */
 class MovingBack : public TreeVisitor {
  public:
+  /** The snapshot, of whose folders "shared/data" is the deepest that holds a package's own. */
+  static constexpr int kTopDepth = -1;
+
   MovingBack(const restore_files &files, std::string root, json_object *table)
       : files_(files), root_(std::move(root)), table_(table) {}
 
@@ -67,6 +70,12 @@ class MovingBack : public TreeVisitor {
     if (move_whole(places->source.fd(), places->target.fd(), name.c_str())) return TreeStep::passed;
     if (enter_both(&places->source, &places->target, name.c_str())) return TreeStep::entered;
     failed();
+    return TreeStep::passed;
+  }
+
+  /** Whole it still goes where its place is free; else it stays in the snapshot. */
+  TreeStep too_deep(Places *places, const std::string &name) {
+    if (!move_whole(places->source.fd(), places->target.fd(), name.c_str())) failed();
     return TreeStep::passed;
   }
 
@@ -172,7 +181,7 @@ class MovingBack : public TreeVisitor {
   bool copy_file_back(int from, int to, const char *name) {
     struct stat status = {};
     const UniqueFd source = safe_open_file_at(from, name, &status);
-    unlink_as_package(to, name, 0, user_);
+    static_cast<void>(unlink_as_package(to, name, 0, user_));  // what stays is in the copy's way
     UniqueFd copy = open_as_package(to, name, O_WRONLY | O_CREAT, kCopyMode, user_, nullptr);
     const bool copied = source && copy && copy_bytes(source.get(), copy.get(), status.st_size);
     const std::string key = path_.substr(files_.snapshot.size() + 1);
@@ -181,7 +190,8 @@ class MovingBack : public TreeVisitor {
       put_attributes_back(copy.get(), status, key.c_str(), entry);
     }
     if (copied && close(copy.release()) == 0) return true;
-    if (copy) unlink_as_package(to, name, 0, user_);
+    // A part that stays is replaced when the snapshot is put back again.
+    if (copy) static_cast<void>(unlink_as_package(to, name, 0, user_));
     return false;
   }
 

@@ -97,22 +97,22 @@ class SnapshotCopy : public TreeVisitor {
   }
 
   TreeStep enter(TreePlace *place, const std::string &name) {
-    if (is_beyond_bounds(*place)) return TreeStep::ended;
+    if (table_->names > kMostNames) return refuse("more");
     if (place->down(name.c_str())) return TreeStep::entered;
     LOGE("error : cannot open this path %s", path_.c_str());
     copied_ = false;
     return TreeStep::passed;
   }
 
+  TreeStep too_deep(TreePlace * /*place*/, const std::string & /*name*/) {
+    return refuse("deeper");
+  }
+
  private:
-  /** Whether to go deeper would be more than a backup can hold: its table is in memory whole. */
-  bool is_beyond_bounds(const TreePlace &place) const {
-    // the data directory counts, and so does the one that would be entered
-    const bool deeper = is_too_deep(static_cast<int>(place.depth()) + 2);
-    if (!deeper && table_->names <= kMostNames) return false;
-    LOGE("data at %s is %s than a snapshot can hold", folder_of(path_).c_str(),
-         deeper ? "deeper" : "more");
-    return true;
+  /** To go on would be more than a backup can hold: its table is in memory whole. */
+  TreeStep refuse(const char *how) const {
+    LOGE("data at %s is %s than a snapshot can hold", folder_of(path_).c_str(), how);
+    return TreeStep::ended;
   }
 
   /** The files of the directory at the walk's path. @return the directories in it */

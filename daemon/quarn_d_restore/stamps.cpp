@@ -2,13 +2,11 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <utility>
 
 #include "files/held_folder.h"
 #include "files/safe_path.h"
 #include "files/tree_walk.h"
-#include "quarn_common.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_utils/disk_sync.h"
 #include "quarn_d_utils/package_identity.h"
@@ -68,9 +66,18 @@ class DataWalk : public TreeVisitor {
     }
   }
 
+  /** A folder that is deeper than any that is backed up; empty for none. */
+  const std::string &dug() const { return dug_; }
+
+  TreeStep too_deep(TreePlace * /*place*/, const std::string & /*name*/) {
+    dug_ = path_;
+    return TreeStep::passed;
+  }
+
   bool scan(const TreePlace &place, std::vector<std::string> *folders) {
     std::vector<TreeEntry> entries;
-    list_tree_entries(place.fd(), &entries);
+    // What cannot be read now has no stamp, and counts as the application's once it can.
+    static_cast<void>(list_tree_entries(place.fd(), &entries));
     for (TreeEntry &entry : entries) {
       const std::string path = path_ + "/" + entry.name;
       if (files_.is_skipped(path) || path == files_.table) continue;
@@ -92,6 +99,7 @@ class DataWalk : public TreeVisitor {
   const restore_files &files_;
   Visit visit_;
   std::string path_;
+  std::string dug_;
   bool wanted_ = true;
 };
 
@@ -156,13 +164,17 @@ bool application_has_written(const restore_files &files, std::string *path) {
   const bool unpacked = read_stamps(files.parts.unpacked, &known);
   std::sort(known.begin(), known.end());
   bool written = false;
-  DataWalk(files, [&](const std::string &file, const struct stat &status) {
+  DataWalk walk(files, [&](const std::string &file, const struct stat &status) {
     if (std::binary_search(known.begin(), known.end(), file_stamp(status))) return true;
     // What the unpacking makes nobody opens until all of it is noted.
     if (!unpacked && is_being_unpacked(status)) return true;
     *path = file;
     written = true;
     return false;
-  }).run();
-  return written;
+  });
+  walk.run();
+  if (written || walk.dug().empty()) return written;
+  // Neither the restore nor the rollback goes there: what it holds is the application's.
+  *path = walk.dug();
+  return true;
 }

@@ -18,7 +18,6 @@
 #include "quarn_d_restore/attributes.h"
 #include "quarn_d_restore/restore_files.h"
 #include "quarn_d_restore/restore_step.h"
-#include "quarn_d_restore/settle.h"
 #include "quarn_d_utils/directory.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/handles.h"
@@ -105,6 +104,14 @@ class AttributesWalk : public TreeVisitor {
     }
     judge_folder(folder.lacks_info, folder.lacks_info && !is_empty_folder(path_));
     LOGE("error : cannot open this path %s", path_.c_str());
+    restored_ = false;
+    return TreeStep::passed;
+  }
+
+  /** No archive has anything there: the application has dug, or moved what was unpacked. */
+  TreeStep too_deep(TreePlace * /*place*/, const FoundFolder & /*folder*/) {
+    LOGE("data at %s is deeper than an archive can hold",
+         path_.substr(0, path_.rfind('/')).c_str());
     restored_ = false;
     return TreeStep::passed;
   }

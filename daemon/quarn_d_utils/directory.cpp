@@ -19,7 +19,8 @@
 
 namespace {
 
-/** Looks for a regular file, everywhere, so that all that is odd is told of. */
+/** Looks for a regular file, everywhere, so that all that is odd, or a removal has left, is told
+ * of. */
 class Search : public TreeVisitor {
  public:
   explicit Search(std::string path) : path_(std::move(path)) {}
@@ -34,7 +35,7 @@ class Search : public TreeVisitor {
 
   bool scan(const TreePlace &place, std::vector<std::string> *folders) {
     std::vector<TreeEntry> entries;
-    list_tree_entries(place.fd(), &entries);
+    static_cast<void>(list_tree_entries(place.fd(), &entries));  // unreadable counts as empty
     for (TreeEntry &entry : entries) {
       const std::string below = path_ + "/" + entry.name;
       struct stat status = {};
@@ -57,6 +58,9 @@ class Search : public TreeVisitor {
     LOGE("error : cannot open this path %s", path_.c_str());
     return TreeStep::passed;
   }
+
+  /** As deep as a removal goes. */
+  TreeStep too_deep(TreePlace *place, const std::string &name) { return enter(place, name); }
 
  private:
   std::string path_;

@@ -25,6 +25,7 @@ constexpr std::size_t kThreads = 4;
  * cache, of which two thousand took longer than everything else that a restore does.
  */
 constexpr std::size_t kFew = 64;
+static_assert(kFew < kMaxDirDepth, "the folders on the way are too many before they are too deep");
 
 /** Sync a few objects in threads. @return true when everything is on the disk */
 bool sync_each(const std::vector<UniqueFd> &objects) {

@@ -95,6 +95,9 @@ class Removal : public TreeVisitor {
     return TreeStep::passed;
   }
 
+  /** Whatever lies in an application's folder can be removed. */
+  TreeStep too_deep(TreePlace *place, const std::string &name) { return enter(place, name); }
+
   void left(const TreePlace &place, const char *name) {
     if (!remove_folder(place.fd(), name)) failed_below();
   }

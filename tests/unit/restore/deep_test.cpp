@@ -9,11 +9,15 @@
 #include <functional>
 
 #include "files/safe_path.h"
+#include "files/tree_depth.h"
 #include "quarn_common.h"
+#include "quarn_d_restore/restore_files.h"
+#include "quarn_d_restore/settle.h"
 #include "quarn_d_restore/snapshot.h"
 #include "quarn_d_restore/walk.h"
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/directory.h"
+#include "quarn_printable.h"
 #include "restore_fixture.h"
 
 namespace {
@@ -45,6 +49,15 @@ class DeepTest : public RestoreTest {
     }
     make_file(at_fd, content);
     close(at_fd);
+  }
+  /** Folders alone, one in the other, in the folder @p top. @return the path of the deepest */
+  static std::string dig(const std::string &top, int levels) {
+    std::string deepest = top;
+    for (int level = 0; level < levels; ++level) {
+      deepest += "/d";
+      if (mkdir(deepest.c_str(), 0755) != 0 && errno != EEXIST) ADD_FAILURE() << deepest;
+    }
+    return deepest;
   }
   static void make_file(int dir, const std::string &content) {
     const int file = openat(dir, "file", O_WRONLY | O_CREAT | O_TRUNC, 0640);
@@ -154,15 +167,68 @@ TEST_F(DeepTest, OneFolderBeyondWhatIsPackedIsNotCopiedAsideEither) {
 }
 
 TEST_F(DeepTest, EachFolderOfADeepTreeIsLookedAtOnceForItsAttributes) {
-  // as an application can dig while it is restored
-  constexpr int kLevels = 3000;
-  make_deep(kLevels, "d", "dug");
+  make_deep(kMaxDirDepth - 1, "d", "dug");
   int folders = 0;
   on_folder_read = [&] { ++folders; };
   EXPECT_EQ(parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), nullptr), 0);
   on_folder_read = nullptr;
-  EXPECT_GT(folders, kLevels);
-  EXPECT_LT(folders, 2 * kLevels);
+  EXPECT_GE(folders, kMaxDirDepth);
+  EXPECT_LT(folders, 2 * kMaxDirDepth);
+}
+
+// as an application can dig while it is restored
+TEST_F(DeepTest, WhatIsDugDeeperThanAnArchiveGoesIsNotLookedAtForItsAttributes) {
+  make_deep(3000, "d", "dug");
+  int folders = 0;
+  on_folder_read = [&] { ++folders; };
+  EXPECT_EQ(parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), nullptr), 0);
+  on_folder_read = nullptr;
+  EXPECT_EQ(folders, kMaxDirDepth);
+  std::string last = at("data");
+  for (int level = 1; level < kMaxDirDepth; ++level) last += "/d";
+  expect_error("data at " + quarn_shortened(last, 256) + " is deeper than an archive can hold");
+  EXPECT_TRUE(delete_directory_util(at("data/d").c_str()));
+}
+
+TEST_F(DeepTest, WhatIsDugDeeperThanABackupGoesCountsAsWritten) {
+  ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
+  std::string written;
+  dig(at("data"), kMaxDirDepth - 1);
+  EXPECT_FALSE(application_has_written(restore_files(kPkg, root.c_str()), &written)) << written;
+  const std::string dug = dig(at("data"), kMaxDirDepth);
+  EXPECT_TRUE(application_has_written(restore_files(kPkg, root.c_str()), &written));
+  EXPECT_EQ(written, dug);
+  EXPECT_TRUE(note_unpacked_files(kPkg, root.c_str())) << "which is none of a restore's";
+}
+
+TEST_F(DeepTest, WhatIsDugDeeperThanAnArchiveGoesIsNotSettled) {
+  const std::string top = dig(at("data"), kMaxDirDepth);
+  const std::string above = top.substr(0, top.size() - 2);
+  const std::string moved = unpacked_file(top.substr(root.size() + 1) + "/moved", "new");
+  const std::string left = unpacked_file(above.substr(root.size() + 1) + "/left", "new");
+  settle_unpacked_files(kPkg, root.c_str());
+  struct stat status = {};
+  ASSERT_EQ(stat(left.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & ALLPERMS, 0600U);
+  ASSERT_EQ(stat(moved.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & ALLPERMS, static_cast<mode_t>(S_ISVTX));
+}
+
+// No snapshot is made so deep; one of which somebody says so all the same is not walked further.
+TEST_F(DeepTest, WhatIsTooDeepInASnapshotGoesBackWholeOrNotAtAll) {
+  ASSERT_EQ(mkdir(snapshot().c_str(), 0700), 0);
+  ASSERT_EQ(mkdir((snapshot() + "/data").c_str(), 0755), 0);
+  const std::string deep = dig(snapshot() + "/data", kMaxDirDepth + 1);
+  const std::string file_name = deep.substr(snapshot().size()) + "/file";
+  write_text(snapshot() + file_name, "before");
+  const std::string place_of_it = dig(at("data"), kMaxDirDepth + 1);
+  EXPECT_EQ(parse_dir_for_rollback(snapshot().c_str(), kPkg, root.c_str()), 0);
+  EXPECT_EQ(read_text(snapshot() + file_name), "before");
+  expect_error("fail copy : from " + quarn_shortened(deep, 256) + " to " +
+               quarn_shortened(place_of_it, 256));
+  ASSERT_EQ(rmdir(place_of_it.c_str()), 0);
+  EXPECT_EQ(parse_dir_for_rollback(snapshot().c_str(), kPkg, root.c_str()), 1);
+  EXPECT_EQ(read_text(root + file_name), "before");
 }
 
 }  // namespace

@@ -1,9 +1,11 @@
 #include <linux/capability.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
 
+#include "files/tree_depth.h"
 #include "log_scope.h"
 #include "platform_security_server.h"
 #include "quarn_d_restore/walk.h"
@@ -281,13 +283,20 @@ TEST_F(WalkTest, AFailedWalkLeavesTheLaterDirectoriesUnwalkedAlthoughRelabelled)
 
 TEST_F(WalkTest, ADeepTreeIsRestoredWithFewDescriptors) {
   std::string name = "data";
-  for (int i = 0; i < 1500; ++i) {
+  for (int i = 1; i < kMaxDirDepth; ++i) {
     name += "/d";
     dir(name);
   }
   const std::string path = unpacked(name + "/a");
   set_label(path, kDataLabel);
-  EXPECT_EQ(walk("data", table({{name + "/a", "", 0640}}).get()), 1);
+  const JsonPtr entries = table({{name + "/a", "", 0640}});
+  rlimit before = {};
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit few = {64, before.rlim_max};
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &few), 0);
+  const int restored = walk("data", entries.get());
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(restored, 1);
   EXPECT_EQ(mode_of(path), 0640);
   EXPECT_EQ(owner_of(path), 5000U);
 }
