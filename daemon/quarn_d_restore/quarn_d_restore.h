@@ -20,7 +20,7 @@ struct client_cb_data;
 /** Whether packages are restored as they are installed, and for whom. */
 enum class restore_mode { off, cloud, companion };
 [[nodiscard]] restore_mode current_restore_mode();
-/** Restore mode of the phone-transfer companion is active. */
+/** Restore mode of the phone-transfer companion is active. No part of the daemon calls it. */
 [[nodiscard]] bool pellix_restore_running();
 /** Restore mode was enabled by the cloud client. */
 [[nodiscard]] bool cloud_restore_running();

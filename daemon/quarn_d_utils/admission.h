@@ -39,7 +39,8 @@ struct waiting_parties {
 [[nodiscard]] std::shared_ptr<const void> count_waiting(const std::string &caller,
                                                         const waiting_parties &parties = {});
 
-/** Requests that count. Any thread. */
+/** Requests that count. Any thread. No part of the daemon asks: for tests, and for who adds to it.
+ */
 [[nodiscard]] std::size_t waiting_requests();
 
 /** The fibers, by number, that @p caller's requests were accepted on; some may have ended. */

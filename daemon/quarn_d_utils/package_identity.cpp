@@ -204,8 +204,8 @@ UniqueFd open_looked_at(int dir, const char *name, int flags, const package_user
 
 /** Do what the user was refused once more, without the modes, where that is right. */
 template <typename Call>
-int again_in(int dir, int other, const package_user &user, Call call) {
-  if (!names_may_be_changed(dir, user) || (other != dir && !names_may_be_changed(other, user))) {
+int again_in(int dir, const package_user &user, Call call) {
+  if (!names_may_be_changed(dir, user)) {
     errno = EACCES;
     return -1;
   }
@@ -219,7 +219,7 @@ int again_in(int dir, int other, const package_user &user, Call call) {
 
 /** As the user first; @p call answers -1 for a failure. */
 template <typename Call>
-int as_package(int dir, int other, const package_user &user, Call call) {
+int as_package(int dir, const package_user &user, Call call) {
   const ActAsPackage acting(user);
   if (!acting) {
     errno = EPERM;
@@ -227,7 +227,7 @@ int as_package(int dir, int other, const package_user &user, Call call) {
   }
   const int result = call();
   if (result >= 0 || errno != EACCES) return result;
-  return again_in(dir, other, user, call);
+  return again_in(dir, user, call);
 }
 
 }  // namespace
@@ -252,11 +252,6 @@ FileIdentity::~FileIdentity() {
   errno = error;
 }
 
-bool application_can_fill(int dir, const package_user &user) {
-  struct stat status = {};
-  return fstat(dir, &status) != 0 || can_fill(dir, status, user);
-}
-
 bool names_may_be_changed(int dir, const package_user &user) {
   struct stat status = {};
   if (fstat(dir, &status) != 0) return false;
@@ -270,7 +265,7 @@ UniqueFd open_as_package(int dir, const char *name, int flags, mode_t mode,
   if ((flags & O_CREAT) != 0) flags |= O_EXCL;
   UniqueFd fd;
   if ((flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE) {
-    fd.reset(as_package(dir, dir, user, [&] { return openat(dir, name, flags, mode); }));
+    fd.reset(as_package(dir, user, [&] { return openat(dir, name, flags, mode); }));
   } else {
     const ActAsPackage acting(user);
     if (acting) fd.reset(openat(dir, name, flags));
@@ -328,16 +323,11 @@ bool may_be_changed(int dir, int object, const struct stat &status, const packag
 }
 
 int mkdir_as_package(int dir, const char *name, mode_t mode, const package_user &user) {
-  return as_package(dir, dir, user, [&] { return mkdirat(dir, name, mode); });
+  return as_package(dir, user, [&] { return mkdirat(dir, name, mode); });
 }
 
 int unlink_as_package(int dir, const char *name, int flags, const package_user &user) {
-  return as_package(dir, dir, user, [&] { return unlinkat(dir, name, flags); });
-}
-
-int rename_as_package(int from, const char *old_name, int to, const char *name,
-                      const package_user &user) {
-  return as_package(from, to, user, [&] { return renameat(from, old_name, to, name); });
+  return as_package(dir, user, [&] { return unlinkat(dir, name, flags); });
 }
 
 UniqueFd open_held_as_package(const std::string &path, int flags) {

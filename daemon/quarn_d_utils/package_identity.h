@@ -36,13 +36,13 @@ struct package_user {
 };
 
 /** The user whose applications' data the daemon works on. */
-package_user user_of_package();
+[[nodiscard]] package_user user_of_package();
 
 /**
  * Give up the groups that the process was started with: they would count beside
  * the group of a package's user. Once, at the start. @return false when it failed
  */
-bool drop_other_groups();
+[[nodiscard]] bool drop_other_groups();
 
 /** The thread's file-system identity while one of the two classes below lives. */
 class FileIdentity {
@@ -83,18 +83,12 @@ class ActAsRoot : public FileIdentity {
 };
 
 /**
- * True when the package's user may make and remove names in a directory, or let
- * itself do so: it is its own, or its mode or access list grants it.
- */
-bool application_can_fill(int dir, const package_user &user);
-
-/**
  * True when root may make, replace and remove names in a directory although the
  * package's user may not: it is the user's own; or one that the application
  * cannot fill, and none of those above it, up to one of the application's own,
  * is such that the application may have moved it there with all that it holds.
  */
-bool names_may_be_changed(int dir, const package_user &user);
+[[nodiscard]] bool names_may_be_changed(int dir, const package_user &user);
 
 /**
  * Open @p name of the directory @p dir as the package's user. A new file
@@ -115,18 +109,19 @@ bool names_may_be_changed(int dir, const package_user &user);
  * @param status when not null: that of the descriptor which is returned
  * @return none with errno, EACCES for what is refused
  */
-UniqueFd open_as_package(int dir, const char *name, int flags, mode_t mode,
-                         const package_user &user, struct stat *status);
+[[nodiscard]] UniqueFd open_as_package(int dir, const char *name, int flags, mode_t mode,
+                                       const package_user &user, struct stat *status);
 
 /**
  * The same for a relative path below @p dir, whose folders are entered in the
  * same way. EINVAL for an absolute path and for "..".
  */
-UniqueFd open_below_as_package(int dir, const char *path, int flags, mode_t mode,
-                               const package_user &user, struct stat *status);
+[[nodiscard]] UniqueFd open_below_as_package(int dir, const char *path, int flags, mode_t mode,
+                                             const package_user &user, struct stat *status);
 
 /** lstat() of an entry, also in a folder that its user has closed to itself. @return 0 or -1 */
-int status_as_package(int dir, const char *name, const package_user &user, struct stat *status);
+[[nodiscard]] int status_as_package(int dir, const char *name, const package_user &user,
+                                    struct stat *status);
 
 /**
  * True when root may change owner, mode or label of an open object (O_PATH is
@@ -134,23 +129,23 @@ int status_as_package(int dir, const char *name, const package_user &user, struc
  * else's that open_as_package() would open.
  * @param status of @p object
  */
-bool may_be_changed(int dir, int object, const struct stat &status, const package_user &user);
+[[nodiscard]] bool may_be_changed(int dir, int object, const struct stat &status,
+                                  const package_user &user);
 
 /**
- * mkdirat(), unlinkat() and renameat() as the package's user. On EACCES alone
+ * mkdirat() and unlinkat() as the package's user. On EACCES alone
  * they are done all the same, new folders still being that user's, where
  * names_may_be_changed() allows it.
  * @return 0, or -1 with errno
  */
-int mkdir_as_package(int dir, const char *name, mode_t mode, const package_user &user);
-int unlink_as_package(int dir, const char *name, int flags, const package_user &user);
-int rename_as_package(int from, const char *old_name, int to, const char *name,
-                      const package_user &user);
+[[nodiscard]] int mkdir_as_package(int dir, const char *name, mode_t mode,
+                                   const package_user &user);
+[[nodiscard]] int unlink_as_package(int dir, const char *name, int flags, const package_user &user);
 
 /**
  * Open what lies at an absolute path below a held folder as the package's user,
  * as open_below_as_package() does; outside of one as the daemon.
  */
-UniqueFd open_held_as_package(const std::string &path, int flags);
+[[nodiscard]] UniqueFd open_held_as_package(const std::string &path, int flags);
 
 #endif

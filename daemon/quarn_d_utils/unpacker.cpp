@@ -214,7 +214,9 @@ Extracted Unpacker::write(ByteSource *source, const unz_file_info64 &info, Uniqu
                                              : codec_->inflate(source, &sink, &totals);
   const bool closed = close(file->release()) == 0;
   if (sink.too_long()) {
-    unlink_as_package(parent_.get(), path.c_str() + path.rfind('/') + 1, 0, user_);
+    // What stays nobody may open, and the archive counts as incomplete.
+    static_cast<void>(
+        unlink_as_package(parent_.get(), path.c_str() + path.rfind('/') + 1, 0, user_));
     return refuse(path.c_str(), "it holds more than it announces");
   }
   if (result == CodecResult::kSinkFailed || !closed) {

@@ -214,7 +214,6 @@ TEST_F(PackageIdentity, AnothersFileIsRefusedWhereTheApplicationMayHavePutIt) {
     ASSERT_EQ(chmod((dir_ / "data/theirs").c_str(), folder.mode), 0);
     open_folder("data/theirs");
     EXPECT_EQ(read_as_package("file"), kRefused) << std::oct << folder.mode;
-    EXPECT_TRUE(application_can_fill(folder_.get(), kApp));
   }
 }
 
@@ -376,7 +375,7 @@ TEST_F(PackageIdentity, WhatLiesThereIsTold) {
   EXPECT_EQ(errno, ENOTDIR);
 }
 
-/* ---- what is made, removed and moved ------------------------------------------ */
+/* ---- what is made and removed ------------------------------------------ */
 
 TEST_F(PackageIdentity, WhatIsMadeIsThePackagesAtOnce) {
   for (const mode_t mode : {0755U, 0555U, 0000U}) {
@@ -390,8 +389,7 @@ TEST_F(PackageIdentity, WhatIsMadeIsThePackagesAtOnce) {
     EXPECT_EQ(errno, EEXIST);
     EXPECT_EQ(mkdir_as_package(folder_.get(), "folder", 0755, kApp), 0);
     EXPECT_EQ(status_of("data/folder").st_uid, kApp.uid);
-    EXPECT_EQ(rename_as_package(folder_.get(), "file", folder_.get(), "moved", kApp), 0);
-    EXPECT_EQ(unlink_as_package(folder_.get(), "moved", 0, kApp), 0);
+    EXPECT_EQ(unlink_as_package(folder_.get(), "file", 0, kApp), 0);
     EXPECT_EQ(unlink_as_package(folder_.get(), "folder", AT_REMOVEDIR, kApp), 0);
     EXPECT_EQ(unlink_as_package(folder_.get(), "folder", AT_REMOVEDIR, kApp), -1);
     EXPECT_EQ(errno, ENOENT);
@@ -413,25 +411,11 @@ TEST_F(PackageIdentity, AnothersFolderIsChangedWhereTheApplicationCannotHaveMove
   EXPECT_EQ(errno, EACCES);
 }
 
-TEST_F(PackageIdentity, WhatRootKeepsIsMovedToTheApplicationAndNoFurther) {
-  file("root/kept", 0600, kApp.uid);
-  const UniqueFd root(open((dir_ / "root").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  EXPECT_EQ(rename_as_package(root.get(), "kept", folder_.get(), "back", kApp), 0);
-  EXPECT_EQ(read_text(dir_ / "data/back"), "root/kept");
-  give("data/open", 0772, kOther);
-  open_folder("data/open");
-  file("root/kept", 0600, kApp.uid);
-  EXPECT_EQ(rename_as_package(root.get(), "kept", folder_.get(), "back", kApp), -1);
-  EXPECT_EQ(errno, EACCES);
-  EXPECT_TRUE(exists(dir_ / "root/kept"));
-}
-
 TEST_F(PackageIdentity, ADescriptorThatIsNoneIsAFailure) {
   EXPECT_FALSE(open_as_package(-1, "file", O_RDONLY, 0, kApp, nullptr));
   EXPECT_FALSE(open_below_as_package(-1, "a/file", O_RDONLY, 0, kApp, nullptr));
   EXPECT_EQ(mkdir_as_package(-1, "file", 0755, kApp), -1);
   EXPECT_EQ(unlink_as_package(-1, "file", 0, kApp), -1);
-  EXPECT_TRUE(application_can_fill(-1, kApp));
 }
 
 /* ---- where the daemon is not root ---------------------------------------------- */
