@@ -284,3 +284,5 @@ std::string fd_path(int fd) {
 }
 
 std::string own_fd_path(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
+
+std::string own_place_path(int fd) { return "/proc/thread-self/fd/" + std::to_string(fd); }

@@ -16,40 +16,39 @@
 
 #include <string>
 
-#include "files/tree_depth.h"
 #include "quarn_handles.h"
 
 /**
  * Open an absolute path. The last component is never followed when it is a
  * link (ELOOP, or with O_PATH the link itself). O_CLOEXEC is added.
  */
-UniqueFd safe_open(const char *path, int flags, mode_t mode = 0);
+[[nodiscard]] UniqueFd safe_open(const char *path, int flags, mode_t mode = 0);
 
 /** The parent of @p path, as an O_PATH directory; @p name receives the last component. */
-UniqueFd safe_open_parent(const char *path, std::string *name);
+[[nodiscard]] UniqueFd safe_open_parent(const char *path, std::string *name);
 
 /** lstat() of @p path. @return 0 or -1 */
-int safe_lstat(const char *path, struct stat *status);
+[[nodiscard]] int safe_lstat(const char *path, struct stat *status);
 
 /** Open a directory for reading; null on failure. */
-DirPtr safe_opendir(const char *path);
+[[nodiscard]] DirPtr safe_opendir(const char *path);
 
 /**
  * Open the directory @p name in the directory @p dir; null when it is a link.
- * Walks go deeper with it and stop at kMaxDirDepth: every level holds a
+ * Walks go deeper with it as far as tree_depth.h has it: every level holds a
  * descriptor.
  */
-DirPtr safe_opendir_at(int dir, const char *name);
+[[nodiscard]] DirPtr safe_opendir_at(int dir, const char *name);
 
 /**
  * Open the regular file @p name of the directory @p dir for reading, and tell its status; none
  * when it cannot be opened or is anything else, a link included. Its time of access stays where
  * the process may let it.
  */
-UniqueFd safe_open_file_at(int dir, const char *name, struct stat *status);
+[[nodiscard]] UniqueFd safe_open_file_at(int dir, const char *name, struct stat *status);
 
 /** True for "." and "..". */
-bool is_dot_entry(const char *name);
+[[nodiscard]] bool is_dot_entry(const char *name);
 
 /** A path during a walk: goes down by one name, and back when it goes out of scope. */
 class PathStep {
@@ -68,20 +67,26 @@ class PathStep {
 };
 
 /** Make @p path and its missing ancestors. @return 0 or -1 */
-int safe_mkdir_with_parents(const char *path, mode_t mode);
+[[nodiscard]] int safe_mkdir_with_parents(const char *path, mode_t mode);
 
 /**
  * Open a relative path below the directory @p dir: no link is followed and
  * nothing outside is reached; ".." and absolute names fail with EINVAL.
  */
-UniqueFd safe_open_below(int dir, const char *path, int flags, mode_t mode = 0);
+[[nodiscard]] UniqueFd safe_open_below(int dir, const char *path, int flags, mode_t mode = 0);
 
 /** Make a relative path below @p dir, ancestors too; the directory itself (O_PATH). */
-UniqueFd safe_mkdir_below(int dir, const char *path, mode_t mode);
+[[nodiscard]] UniqueFd safe_mkdir_below(int dir, const char *path, mode_t mode);
 
 /** The name by which this process's services reach what @p fd holds: "/proc/PID/fd/N". */
-std::string fd_path(int fd);
+[[nodiscard]] std::string fd_path(int fd);
 /** The same for this process alone: "/proc/self/fd/N". */
-std::string own_fd_path(int fd);
+[[nodiscard]] std::string own_fd_path(int fd);
+/**
+ * The same for a descriptor of the O_PATH kind: "/proc/thread-self/fd/N", for the calling thread.
+ * Services of this process that spare themselves the walk to a descriptor whose name they know
+ * would ask one of that kind in vain.
+ */
+[[nodiscard]] std::string own_place_path(int fd);
 
 #endif

@@ -139,7 +139,7 @@ int restore_object_info(int fd, const struct stat &status, const char *path, con
     LOGE("error : there isn't smack info of %s", path);
     return 0;
   }
-  const std::string own = own_fd_path(fd);
+  const std::string own = own_place_path(fd);
   CString current;
   int result = smack_getlabel(own.c_str(), out(current), SMACK_LABEL_ACCESS);
   if (result != 0) {

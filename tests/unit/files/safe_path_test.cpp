@@ -265,6 +265,9 @@ TEST_P(SafePath, NamesADescriptor) {
     EXPECT_EQ(fd_path(fd.get()),
               "/proc/" + std::to_string(getpid()) + "/fd/" + std::to_string(fd.get()));
     EXPECT_EQ(read_text(fd_path(fd.get())), "x");
+    const UniqueFd held = safe_open(path.c_str(), O_PATH);
+    EXPECT_EQ(own_place_path(held.get()), "/proc/thread-self/fd/" + std::to_string(held.get()));
+    EXPECT_EQ(read_text(own_place_path(held.get())), "x");
   });
 }
 

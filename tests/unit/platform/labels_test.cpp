@@ -77,6 +77,7 @@ TEST_F(Labels, OfWhatIsOpenAreReadByItsDescriptorsName) {
     // once the first one had a label, what has none is asked differently
     EXPECT_EQ(get(dir_.file("tree/bare", "")), "_");
     EXPECT_EQ(get(own + number), "org.example");
+    EXPECT_EQ(get("/proc/thread-self/fd/" + number), "org.example");
     EXPECT_EQ(get(own), "_");
     for (const std::string &other : {own + number + "x", own + number + "/x", own + "x"}) {
       EXPECT_EQ(get(other), "error") << other;

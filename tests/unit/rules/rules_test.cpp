@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "files/safe_path.h"
+#include "files/tree_depth.h"
 #include "mock_platform.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
