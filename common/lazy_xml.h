@@ -10,6 +10,6 @@
  * to be a document or none, and whoever reads one has to fail. Null when it serves. Static. Loads
  * it. Any thread.
  */
-const char *missing_xml_library();
+[[nodiscard]] const char *missing_xml_library();
 
 #endif

@@ -29,7 +29,7 @@ class LogScope {
   LogScope &operator=(const LogScope &) = delete;
 
   /** Whether a line from there may be written; for the log function. */
-  static bool admits(const quarn_log_place &place);
+  [[nodiscard]] static bool admits(const quarn_log_place &place);
 
  private:
   struct Written {

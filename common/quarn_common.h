@@ -72,12 +72,12 @@ enum quarn_client_kind : int {
 };
 
 /** Words for a result code; static, never null. */
-const char *quarn_result_text(int result);
+[[nodiscard]] const char *quarn_result_text(int result);
 
 /**
  * The object path of a signal: "/" and @p key.
  * @return malloc'd text that the caller frees, null when @p key is null
  */
-char *quarn_utils_parse_key(const char *key);
+[[nodiscard]] char *quarn_utils_parse_key(const char *key);
 
 #endif

@@ -13,12 +13,12 @@
  * `\r` and `\t`, other bytes that are no printable UTF-8 `\x1b`, and characters
  * that are not printed `\u{85}`. Everything else stays as it is. Any thread.
  */
-std::string quarn_printable(std::string_view text);
+[[nodiscard]] std::string quarn_printable(std::string_view text);
 
 /**
  * The first @p size bytes of @p text at the most, whole characters where it is
  * UTF-8. What was cut ends in "...", which is not counted.
  */
-std::string quarn_shortened(std::string_view text, std::size_t size);
+[[nodiscard]] std::string quarn_shortened(std::string_view text, std::size_t size);
 
 #endif

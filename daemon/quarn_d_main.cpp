@@ -6,7 +6,6 @@
 #include <cerrno>
 #include <csignal>
 #include <cstdint>
-#include <cstdio>
 #include <cstring>
 #include <string>
 

@@ -6,7 +6,6 @@
 #include <deque>
 
 #include "json_ptr.h"
-#include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_status.h"
 #include "quarn_dbus_client.h"
 #include "thread_annotations.h"

@@ -4,13 +4,10 @@
 #include <map>
 #include <memory>
 #include <utility>
-#include <variant>
 
 #include "gio_handles.h"
 #include "glib_handles.h"
-#include "quarn_common.h"
 #include "quarn_d_gate.h"
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_limits.h"

@@ -9,7 +9,6 @@
 #include "glib_handles.h"
 #include "quarn_common.h"
 #include "quarn_d_gate.h"
-#include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_turn.h"

@@ -1,7 +1,6 @@
 #include "quarn_dbus_methods.h"
 
 #include <iterator>
-#include <memory>
 #include <utility>
 
 #include "quarn_common.h"

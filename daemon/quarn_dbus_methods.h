@@ -9,7 +9,6 @@
 
 #include <glib.h>
 
-#include <optional>
 #include <string>
 #include <variant>
 

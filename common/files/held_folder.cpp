@@ -1,6 +1,7 @@
 #include "files/held_folder.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <cstring>

@@ -11,8 +11,6 @@
 #ifndef QUARN_HELD_FOLDER_H
 #define QUARN_HELD_FOLDER_H
 
-#include <sys/stat.h>
-
 #include <string>
 #include <utility>
 
@@ -36,16 +34,16 @@ class HeldFolder {
   /** Its descriptor (O_PATH), borrowed; -1 for none. */
   int fd() const { return fd_; }
   /** True while its path still leads to it. */
-  bool is_in_place() const;
+  [[nodiscard]] bool is_in_place() const;
 
   /** The thread's deepest folder that @p path is at or below; null for none. */
-  static const HeldFolder *of(const char *path);
+  [[nodiscard]] static const HeldFolder *of(const char *path);
   /** What of @p path lies below this folder: "." for the folder itself. */
-  const char *below(const char *path) const;
+  [[nodiscard]] const char *below(const char *path) const;
   /** True for its own path. */
-  bool is_at(const char *path) const { return path_ == path; }
+  [[nodiscard]] bool is_at(const char *path) const { return path_ == path; }
   /** Open what is held once more. */
-  UniqueFd reopen(int flags) const;
+  [[nodiscard]] UniqueFd reopen(int flags) const;
 
  protected:
   HeldFolder(std::string path, int flags);

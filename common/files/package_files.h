@@ -16,39 +16,41 @@ inline constexpr std::array<const char *, 3> kDataDirs = {"data", "shared/data",
 inline constexpr char kSharedDataDir[] = "shared/data";
 
 /** True when an id may name a file or folder: not empty, not "." or "..", no "/", no NUL. */
-bool is_safe_path_component(const std::string &text);
+[[nodiscard]] bool is_safe_path_component(const std::string &text);
 
 /** The rules file of a package below its root; static. @param type the package's, as "tpk" */
-const char *rules_file_of(const std::string &type);
+[[nodiscard]] const char *rules_file_of(const std::string &type);
 /** Where the other types have theirs; static. */
-const char *rules_file_of_others(const std::string &type);
+[[nodiscard]] const char *rules_file_of_others(const std::string &type);
 
 /**
  * True for the name of a file that the transport makes beside a download where the file system has
  * no nameless ones, and that the daemon makes so.
  */
-bool is_part_name(const char *name);
+[[nodiscard]] bool is_part_name(const char *name);
 
 /** The table of one package below its root, and as the last entry of its archive. */
-std::string archived_table_name(const std::string &pkg_id);
+[[nodiscard]] std::string archived_table_name(const std::string &pkg_id);
 
 /** The folder of a package in the cloud, and that of one of its versions. */
-std::string cloud_package_folder(const std::string &serial, const std::string &pkg_id);
-std::string cloud_version_folder(const std::string &serial, const std::string &pkg_id,
-                                 const std::string &version);
+[[nodiscard]] std::string cloud_package_folder(const std::string &serial,
+                                               const std::string &pkg_id);
+[[nodiscard]] std::string cloud_version_folder(const std::string &serial, const std::string &pkg_id,
+                                               const std::string &version);
 /** A package's archive in the cloud. */
-std::string cloud_archive(const std::string &serial, const std::string &pkg_id,
-                          const std::string &version);
+[[nodiscard]] std::string cloud_archive(const std::string &serial, const std::string &pkg_id,
+                                        const std::string &version);
 
 /** Where a package's archive is exported to. */
-std::string exported_archive(const std::string &pkg_id);
+[[nodiscard]] std::string exported_archive(const std::string &pkg_id);
 
 /** The companion's folder, where what is for it lies and what comes from it; a slash at its end. */
-std::string companion_folder();
+[[nodiscard]] std::string companion_folder();
 /** A package's archive in that folder. */
-std::string companion_archive_name(const std::string &pkg_id, const std::string &version);
+[[nodiscard]] std::string companion_archive_name(const std::string &pkg_id,
+                                                 const std::string &version);
 /** The list of what the companion has. */
-std::string companion_list();
+[[nodiscard]] std::string companion_list();
 
 /** The paths of one package, id and root together. */
 class package_files {

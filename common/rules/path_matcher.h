@@ -11,7 +11,7 @@
 #include <vector>
 
 /** True when @p parent ends with "/" and @p path begins with it. */
-bool is_child_file(const char *parent, const char *path);
+[[nodiscard]] bool is_child_file(const char *parent, const char *path);
 
 /**
  * The rules of one list by their text: an application may have thousands of
@@ -41,8 +41,8 @@ class RuleIndex {
  * Whether the file or link at @p path is backed up: what is excluded never is, and where anything
  * is included, that alone is.
  */
-inline bool rules_take(RuleIndex *included, RuleIndex *excluded, bool has_includes,
-                       std::string_view path) {
+[[nodiscard]] inline bool rules_take(RuleIndex *included, RuleIndex *excluded, bool has_includes,
+                                     std::string_view path) {
   if (excluded->names(path)) return false;
   return !has_includes || included->names(path);
 }

@@ -28,14 +28,14 @@ enum class rules_state {
 };
 
 /** True when a package whose rules are in this state may be packed. */
-constexpr bool rules_usable(rules_state state) {
+[[nodiscard]] constexpr bool rules_usable(rules_state state) {
   return state == rules_state::none || state == rules_state::loaded ||
          state == rules_state::ignored;
 }
 
 /** Why they cannot be used, as the end of a sentence about the file; static, empty when they can.
  */
-const char *rules_state_text(rules_state state);
+[[nodiscard]] const char *rules_state_text(rules_state state);
 
 /** One element below the root element. */
 struct rules_element {

@@ -25,7 +25,7 @@ void set_timestamp(json_object *backup_info);
 void add_pkg_info_to_app_list(backup_context *ctx, const char *pkg_id, const char *version,
                               int crc);
 /** Write the document and release it. @return true when the file was written */
-bool save_app_list_to_file(backup_context *ctx);
+[[nodiscard]] bool save_app_list_to_file(backup_context *ctx);
 /** Release the document and the cloud's text. */
 void release_json_resource_of_app_list(backup_context *ctx);
 /** The maker is the caller until the object is added to the document. */

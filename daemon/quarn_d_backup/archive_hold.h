@@ -60,7 +60,7 @@ void note_awaited_package_removed(const std::string &package);
 
 /** Ids of the packages that are installed, preloaded ones too. @return false when not all are known
  */
-bool list_installed_packages(std::set<std::string> *installed);
+[[nodiscard]] bool list_installed_packages(std::set<std::string> *installed);
 
 /**
  * The packages whose backups a manual run would leave in the cloud: those that

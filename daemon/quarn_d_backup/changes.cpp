@@ -1,7 +1,5 @@
 #include "quarn_d_backup/changes.h"
 
-#include <string>
-
 #include "files/package_files.h"
 #include "platform_package_manager.h"
 #include "quarn_common.h"
@@ -119,7 +117,7 @@ int make_backup_items(backup_context *ctx) {
     ctx->package_walk_complete = false;
   }
   list_kept_packages(ctx);
-  save_app_list_to_file(ctx);
+  static_cast<void>(save_app_list_to_file(ctx));  // whether it is there stands in the notes
   return notes_of(ctx).list_too_large ? QUARN_FAILED : QUARN_OK;
 }
 
@@ -173,6 +171,6 @@ bool app_info_foreach_cb(package_info_app_component_type_e, const char *app_id, 
   auto *ctx = static_cast<backup_context *>(user_data);
   if (!ctx->cur_backup_enabled || ctx->zip_made) return true;
   ctx->zip_made = true;
-  make_app_data_zip(ctx, app_id);
+  static_cast<void>(make_app_data_zip(ctx, app_id));  // the run goes on, and has its outcome
   return true;
 }

@@ -15,7 +15,6 @@
 #include "quarn_d_backup/package_archive.h"
 #include "quarn_d_backup/run_notes.h"
 #include "quarn_d_utils/file.h"
-#include "quarn_d_utils/package.h"
 #include "quarn_d_utils/platform_handles.h"
 #include "quarn_log.h"
 

@@ -5,7 +5,6 @@
 #include <cstdint>
 #include <cstring>
 #include <limits>
-#include <string>
 #include <utility>
 
 #include "files/package_files.h"
@@ -124,7 +123,8 @@ int rebase_app_list_info(backup_context *ctx, const char *model_name, const char
   bool beyond = false;
   notes_of(ctx).list_understood = false;
   if (!ctx->app_list_root) {
-    parse_whole_json(list.frame, JSON_TOKENER_DEFAULT_DEPTH, &beyond);
+    // Only for the reason.
+    const JsonPtr refused(parse_whole_json(list.frame, JSON_TOKENER_DEFAULT_DEPTH, &beyond));
   } else if (!find_own_entry(list, serial, &own, &beyond)) {
     release_json_resource_of_app_list(ctx);
   }

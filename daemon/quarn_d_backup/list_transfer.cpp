@@ -2,7 +2,6 @@
 
 #include <atomic>
 #include <cassert>
-#include <cstdint>
 #include <memory>
 #include <string>
 

@@ -1,7 +1,6 @@
 #include "quarn_d_backup/model_entries.h"
 
 #include <cstring>
-#include <memory>
 
 #include "json_ptr.h"
 #include "quarn_d_utils/handles.h"

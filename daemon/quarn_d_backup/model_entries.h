@@ -41,7 +41,7 @@ struct list_text {
  *   memory is for; may be null
  * @return null when the text is anything else
  */
-json_object *parse_whole_json(std::string_view text, int depth, bool *beyond);
+[[nodiscard]] json_object *parse_whole_json(std::string_view text, int depth, bool *beyond);
 
 /** A value that is written as @p text, which must be JSON; null when memory is out. */
 [[nodiscard]] json_object *new_json_from_text(std::string_view text);

@@ -22,7 +22,6 @@
 #include "quarn_d_utils/working_files.h"
 #include "quarn_d_utils/zip_archive.h"
 #include "quarn_log.h"
-#include "rules/rules_file.h"
 
 namespace {
 

@@ -16,7 +16,7 @@ struct backup_context;
  * the answer of its upload; when the result is not QUARN_OK it is gone already.
  * @return QUARN_OK, QUARN_UNCHANGED, QUARN_SKIPPED, QUARN_UNREADABLE or QUARN_REFUSED
  */
-int make_app_data_zip(backup_context *ctx, const char *app_id);
+[[nodiscard]] int make_app_data_zip(backup_context *ctx, const char *app_id);
 /**
  * Load the current package's rules and test its data against space and cap.
  * @return QUARN_OK, QUARN_SKIPPED, or QUARN_REFUSED when the rules cannot be used

@@ -1,7 +1,6 @@
 #include "quarn_d_backup/pipeline.h"
 
 #include <cstdint>
-#include <ctime>
 #include <memory>
 #include <utility>
 
@@ -190,7 +189,7 @@ bool stage_claimed(backup_context *ctx, CString text) {
 bool refresh_staged_list(backup_context *ctx) {
   if (ctx->result != QUARN_OK || !claimed_package_is_missing(ctx)) return true;
   CString text;
-  read_data_from_file(kLocalAppListPath, out(text));
+  static_cast<void>(read_data_from_file(kLocalAppListPath, out(text)));  // without a text it fails
   return stage_claimed(ctx, std::move(text));
 }
 

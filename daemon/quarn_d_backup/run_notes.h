@@ -7,7 +7,6 @@
 
 #include <atomic>
 #include <cstdint>
-#include <memory>
 #include <set>
 #include <string>
 
@@ -43,7 +42,7 @@ struct run_notes {
 };
 
 /** The notes of a run; made with its context. */
-run_notes &notes_of(const backup_context *ctx);
+[[nodiscard]] run_notes &notes_of(const backup_context *ctx);
 /** Note what the run fails of, if nothing was noted before. */
 void note_cause(backup_context *ctx, request_cause cause);
 

@@ -16,12 +16,12 @@ extern connection_h g_connection;
 extern char auto_backup_enabled;
 
 /** 1 when on Wi-Fi and the monitor runs. Any thread. */
-int wifi_connected();
+[[nodiscard]] int wifi_connected();
 int start_wifi_monitor();
 /** No part of the daemon calls it. */
 int stop_wifi_monitor();
 /** 1 when the charger is connected, read anew at every call. */
-int charger_connected();
+[[nodiscard]] int charger_connected();
 /** No part of the daemon calls it. */
 int start_charger_monitor();
 /** No part of the daemon calls it. */
@@ -32,7 +32,7 @@ int stop_screen_monitor();
 void start_backup_condition_monitor();
 void stop_backup_condition_monitor();
 /** 1 when charging, on Wi-Fi and the screen is off. */
-int backup_condition_pass();
+[[nodiscard]] int backup_condition_pass();
 /** Arm the condition alarm when the conditions hold, disarm it when not. */
 void check_backup_condition();
 

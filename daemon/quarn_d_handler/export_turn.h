@@ -9,7 +9,6 @@
 #ifndef QUARN_D_HANDLER_EXPORT_TURN_H
 #define QUARN_D_HANDLER_EXPORT_TURN_H
 
-#include <memory>
 #include <string>
 
 #include "glib_handles.h"

@@ -11,7 +11,6 @@
 #include "quarn_common.h"
 #include "quarn_d_conditions/conditions.h"
 #include "quarn_d_restore/restore_context.h"
-#include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/cloud_transfer.h"
 #include "quarn_d_utils/file.h"
 #include "quarn_d_utils/package_identity.h"
@@ -86,7 +85,8 @@ void abort_download_of(const pkg_restore_context *ctx) {
   const auto download =
       std::find_if(transferring.begin(), transferring.end(),
                    [ctx](const archive_download *one) { return one->ctx == ctx; });
-  if (download != transferring.end()) abort_transfer(*download);
+  // One that cannot be ended has its answer, which nobody waits for.
+  if (download != transferring.end()) static_cast<void>(abort_transfer(*download));
 }
 
 void abort_monitored_downloads() {
@@ -94,6 +94,6 @@ void abort_monitored_downloads() {
   for (archive_download *download : all) {
     if (download->ctx->wait_for_result) continue;
     download->withdrawn = true;
-    abort_transfer(download);
+    static_cast<void>(abort_transfer(download));  // else it ends by itself, and is not wanted
   }
 }

@@ -16,13 +16,13 @@ struct archive_table {
  * Read a table, piece by piece: what is in memory is what it says of objects,
  * to be looked up with get_file_info_from_backup(), never its text.
  */
-archive_table read_archive_table(const char *path);
+[[nodiscard]] archive_table read_archive_table(const char *path);
 
 /**
  * The table of a JSON text, the caller's; null when the text is no JSON
  * object. Entries with equal attributes share them: what is read is not to be
  * changed.
  */
-json_object *parse_file_info_table(const char *text);
+[[nodiscard]] json_object *parse_file_info_table(const char *text);
 
 #endif

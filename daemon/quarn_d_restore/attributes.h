@@ -18,26 +18,27 @@ struct json_object;
  * @return #QUARN_OK, #QUARN_NO_FILE_INFO without a table, #QUARN_UNREADABLE when the entry or a
  *         member of it is missing
  */
-int get_file_info_from_backup(json_object *table, const char *pkgid, const char *root,
-                              const char *path, int *mode, unsigned int *uid, unsigned int *gid,
-                              char **label);
+[[nodiscard]] int get_file_info_from_backup(json_object *table, const char *pkgid, const char *root,
+                                            const char *path, int *mode, unsigned int *uid,
+                                            unsigned int *gid, char **label);
 /**
  * Give a directory or regular file its mode, the application owner and its label. The engine itself
  * calls restore_object_info(). @return 1, 0
  * No part of the daemon calls it.
  */
-int restore_file_info(const char *path, const char *pkgid, const char *root, json_object *table);
+[[nodiscard]] int restore_file_info(const char *path, const char *pkgid, const char *root,
+                                    json_object *table);
 /**
- * The same for an object that is open already (O_PATH is enough), so that what
+ * The same for an object that is open already (as a rule by O_PATH), so that what
  * is changed is what was looked at; @p path names it in messages and the table.
  */
-int restore_object_info(int fd, const struct stat &status, const char *path, const char *pkgid,
-                        const char *root, json_object *table);
+[[nodiscard]] int restore_object_info(int fd, const struct stat &status, const char *path,
+                                      const char *pkgid, const char *root, json_object *table);
 /** True for the labels that a restore may write itself. @p path is for messages. */
-int is_known_exception_label(const char *path, const char *label, const char *pkgid);
+[[nodiscard]] int is_known_exception_label(const char *path, const char *label, const char *pkgid);
 /** chmod() of an open object; a link has no mode of its own. @return 0, or -1 with errno */
-int change_object_mode(int fd, const struct stat &status, mode_t mode);
+[[nodiscard]] int change_object_mode(int fd, const struct stat &status, mode_t mode);
 /** chown() of an open object, a link itself included. @return 0, or -1 with errno */
-int change_object_owner(int fd, uid_t uid, gid_t gid);
+[[nodiscard]] int change_object_owner(int fd, uid_t uid, gid_t gid);
 
 #endif

@@ -67,7 +67,8 @@ class Clearing : public TreeVisitor {
   std::vector<std::string> clear_folder(int dir) {
     std::vector<TreeEntry> entries;
     std::vector<std::string> folders;
-    list_tree_entries(dir, &entries);
+    // What could not be read the unpacking could not fill.
+    static_cast<void>(list_tree_entries(dir, &entries));
     for (TreeEntry &entry : entries) {
       const PathStep step(&path_, entry.name.c_str());
       if (files_.is_skipped(path_)) continue;

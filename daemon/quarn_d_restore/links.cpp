@@ -3,7 +3,6 @@
 
 #include <optional>
 #include <string>
-#include <utility>
 
 #include "files/held_folder.h"
 #include "files/safe_path.h"

@@ -14,7 +14,7 @@
 #include <string>
 
 /** What the table has for @p key, a path below the root; null for nothing. The table's. */
-json_object *entry_of(json_object *table, const std::string &key);
+[[nodiscard]] json_object *entry_of(json_object *table, const std::string &key);
 
 /**
  * Make an open object what the snapshot's table says. The table is this

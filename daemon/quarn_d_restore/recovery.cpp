@@ -44,7 +44,7 @@ void recover_package(const char *pkgid, const char *root) {
 void recover_all_of_package(const char *pkgid, const char *root) {
   {
     const PackageDataLock lock(pkgid, PackageUse::kChange);
-    recover_package_data(pkgid, root);
+    static_cast<void>(recover_package_data(pkgid, root));  // the log tells of each
   }
   sweep_working_files(pkgid, root);
   show_hidden_icon(pkgid, root);
@@ -59,7 +59,7 @@ recovery_result recover_snapshot(const char *pkgid, const char *root, const rest
     case snapshot_state::foreign:
       return recovery_result::nothing;
     case snapshot_state::incomplete:
-      remove_snapshot(files);
+      static_cast<void>(remove_snapshot(files));  // what stays is incomplete still
       return recovery_result::nothing;
     case snapshot_state::complete:
       break;

@@ -12,7 +12,7 @@ enum class recovery_result {
   kept      /**< not all could be put back yet: the snapshot still counts */
 };
 /** Mend one package. The caller holds its PackageDataLock. */
-recovery_result recover_package_data(const char *pkgid, const char *root);
+[[nodiscard]] recovery_result recover_package_data(const char *pkgid, const char *root);
 
 /**
  * Undo what a daemon that died in a restore of the package left: a complete

@@ -24,7 +24,7 @@ struct restore_files {
         unpacking(own.unpacking()) {}
 
   /** True for what the walks over the data directories leave alone. */
-  bool is_skipped(const std::string &path) const { return own.contain(path); }
+  [[nodiscard]] bool is_skipped(const std::string &path) const { return own.contain(path); }
 
   const WorkingFiles own;
   const std::array<std::string, kDataDirs.size()> dirs;

@@ -10,7 +10,6 @@
 #include "files/package_files.h"
 #include "json_ptr.h"
 #include "quarn_d_backup/archive_hold.h"
-#include "quarn_d_backup/owed_archive.h"
 #include "quarn_d_backup/own_backup.h"
 #include "quarn_d_restore/archive_download.h"
 #include "quarn_d_restore/install_monitor.h"
@@ -20,7 +19,6 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/icon.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "quarn_d_utils/package.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_log.h"
 
@@ -80,7 +78,7 @@ std::vector<std::string> parse_package_list(const char *text) {
 void await_candidates() {
   std::set<std::string> installed;
   // what is not known to be installed counts as what is to come
-  list_installed_packages(&installed);
+  static_cast<void>(list_installed_packages(&installed));
   await_archives(serial_num_user_select, pkg_list_to_be_restored, installed);
   note_restore_mode_waits(serial_num_user_select);
 }

@@ -33,9 +33,9 @@ extern std::unique_ptr<client_cb_data> g_restore_cb_data;
  * No part of the daemon calls it.
  * @return length of the list
  */
-int init_package_list_to_be_restored(const char *pkg_list_json);
+[[nodiscard]] int init_package_list_to_be_restored(const char *pkg_list_json);
 /** Take a package off the candidate list. @return 1 when it was on it, else 0 */
-int package_to_be_restored(const char *pkgid);
+[[nodiscard]] int package_to_be_restored(const char *pkgid);
 
 /** Keep the record of the client that switched restore mode on, in place of an earlier one. */
 void keep_restore_record(std::unique_ptr<client_cb_data> record);

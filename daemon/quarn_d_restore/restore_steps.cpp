@@ -90,7 +90,7 @@ restore_outcome restore_from_archive(pkg_restore_context *ctx, const HeldFolder 
   if (result != QUARN_OK) {
     LOGE("fail to make backup for (%s) before restore. err : %d", pkgid, result);
     ctx->result = result;
-    discard_snapshot(pkgid, root);
+    static_cast<void>(discard_snapshot(pkgid, root));  // the data was not touched
     return restore_outcome::failed;
   }
   report_restore_step(ctx->pkgid, restore_stage::unpacking, size);

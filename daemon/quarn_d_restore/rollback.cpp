@@ -75,7 +75,7 @@ rollback_result put_snapshot_back(const char *pkgid, const char *root) {
     return rollback_result::kept;
   }
   // Where this fails the data stands all the same, and is looked at again by the next start.
-  discard_snapshot(pkgid, root);
+  static_cast<void>(discard_snapshot(pkgid, root));
   return rollback_result::whole;
 }
 

@@ -40,7 +40,7 @@ class Settling : public TreeVisitor {
 
   bool scan(const TreePlace &place, std::vector<std::string> *folders) {
     std::vector<TreeEntry> entries;
-    list_tree_entries(place.fd(), &entries);
+    static_cast<void>(list_tree_entries(place.fd(), &entries));  // settled is what can be read
     for (TreeEntry &entry : entries) {
       if (files_.is_skipped(path_ + "/" + entry.name)) continue;
       struct stat status = {};

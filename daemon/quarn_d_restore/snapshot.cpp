@@ -77,7 +77,9 @@ void delete_entries(int dir, const std::string &path) {
   for (const TreeEntry &entry : entries) {
     const char *name = entry.name.c_str();
     if (unlinkat(opened.get(), name, 0) == 0) continue;
-    delete_tree_at(opened.get(), name, path + "/" + entry.name, OtherTypes::kRemoved);
+    // What cannot go is logged, and lies where nobody looks for a snapshot.
+    static_cast<void>(
+        delete_tree_at(opened.get(), name, path + "/" + entry.name, OtherTypes::kRemoved));
   }
 }
 
@@ -153,7 +155,8 @@ void put_own_table_back(const restore_files &files) {
     LOGE("fail copy : from %s to %s", aside.c_str(), files.table.c_str());
     return;
   }
-  sync_directory(files.dirs[1]);
+  // Should that be lost with the power, it lies aside still, and comes back with the next start.
+  static_cast<void>(sync_directory(files.dirs[1]));
   if (!remove_own(files.table_aside)) {
     LOGE("fail to delete dir : %s", files.table_aside.c_str());
   }
@@ -185,10 +188,12 @@ bool discard_snapshot(const char *pkgid, const char *root) {
       LOGE("snapshot of (%s) cannot be released, so it is kept", pkgid);
       return false;
     }
-    sync_directory(folder_of(files.parts.table));
+    // Should that be lost with the power, the snapshot is put back: its data is whole as well.
+    static_cast<void>(sync_directory(folder_of(files.parts.table)));
   }
   restore_step("snapshot-released");
-  if (state_of_snapshot(files) != snapshot_state::told) remove_snapshot(files);
+  // What stays counts for nothing, and goes with the next one.
+  if (state_of_snapshot(files) != snapshot_state::told) static_cast<void>(remove_snapshot(files));
   return true;
 }
 
@@ -211,7 +216,7 @@ int take_snapshot(const char *pkgid, const char *root, std::optional<HeldFolder>
                                         {files.snapshot, table.get(), &stamps});
   if (copied < files.dirs.size()) {
     LOGE("fail to temp backup : %s", files.dirs[copied].c_str());
-    remove_snapshot(files);
+    static_cast<void>(remove_snapshot(files));  // what stays is incomplete
     return QUARN_REFUSED;
   }
   restore_step("snapshot-copied");

@@ -30,7 +30,7 @@ enum class snapshot_state {
   complete,   /**< what counts until the restore has ended */
   told        /**< kept for whoever wants it; the present data counts */
 };
-snapshot_state state_of_snapshot(const restore_files &files);
+[[nodiscard]] snapshot_state state_of_snapshot(const restore_files &files);
 
 /**
  * Copy the package's data aside. Its root is held by the caller; @p held is the
@@ -38,7 +38,8 @@ snapshot_state state_of_snapshot(const restore_files &files);
  * does with the name.
  * @return #QUARN_OK, #QUARN_REFUSED, or what writing the table gave
  */
-int take_snapshot(const char *pkgid, const char *root, std::optional<HeldFolder> *held);
+[[nodiscard]] int take_snapshot(const char *pkgid, const char *root,
+                                std::optional<HeldFolder> *held);
 
 enum class rollback_result {
   none,  /**< there was no snapshot to roll back to */
@@ -49,30 +50,30 @@ enum class rollback_result {
  * Put the snapshot back: by moving, so that no step needs space. It may be
  * repeated after an interruption at any point.
  */
-rollback_result put_snapshot_back(const char *pkgid, const char *root);
+[[nodiscard]] rollback_result put_snapshot_back(const char *pkgid, const char *root);
 
 /** Remember what has been unpacked. @return false when it could not be written */
-bool note_unpacked_files(const char *pkgid, const char *root);
+[[nodiscard]] bool note_unpacked_files(const char *pkgid, const char *root);
 /**
  * True when a file has changed that neither the restore nor the rollback wrote;
  * @p path is one. Files are told apart by inode, size and time of change, and
  * times are only ever compared for being the same.
  */
-bool application_has_written(const restore_files &files, std::string *path);
+[[nodiscard]] bool application_has_written(const restore_files &files, std::string *path);
 
 /** Keep a complete snapshot without its being rolled back to ever again. @return false: it failed
  */
-bool keep_told_snapshot(const restore_files &files);
+[[nodiscard]] bool keep_told_snapshot(const restore_files &files);
 /** Remove a told snapshot that made way for a further restore, which has succeeded. */
 void forget_told_snapshot(const restore_files &files);
 /** Remove what is ours in the snapshot's place. @return true when nothing lies there any more */
-bool remove_snapshot(const restore_files &files);
+[[nodiscard]] bool remove_snapshot(const restore_files &files);
 
 /**
  * Take the application's own file out of the way of the table that an archive
  * holds. @return false when it could not be moved
  */
-bool set_own_table_aside(const restore_files &files);
+[[nodiscard]] bool set_own_table_aside(const restore_files &files);
 /** Put it back, in place of a table. May be repeated; nothing when there is none. */
 void put_own_table_back(const restore_files &files);
 
@@ -93,7 +94,7 @@ class OwnTableAside {
 };
 
 /** The fingerprint of a file's present content, as the stamps have it. */
-std::uint64_t file_stamp(const struct stat &status);
+[[nodiscard]] std::uint64_t file_stamp(const struct stat &status);
 
 /** Writes stamps as a file that has its name only when it is whole. */
 class StampWriter {
@@ -101,7 +102,7 @@ class StampWriter {
   explicit StampWriter(std::string path);
   void add(const struct stat &status);
   /** @return true when all of them are on the disk under their name */
-  bool finish();
+  [[nodiscard]] bool finish();
 
  private:
   void flush();
@@ -116,7 +117,7 @@ class StampWriter {
  * Remove the snapshot, its table first: from then on the present data counts.
  * @return false when that data cannot be brought onto the disk; the snapshot is kept then
  */
-bool discard_snapshot(const char *pkgid, const char *root);
+[[nodiscard]] bool discard_snapshot(const char *pkgid, const char *root);
 
 /* ---- single steps, which the engine itself does not call ---- */
 

@@ -10,10 +10,10 @@
 struct json_object;
 
 /** Modes, owners and labels of the whole package from the unpacked table. @return 1, 0 */
-int restore_app_info(const char *pkgid, const char *root);
+[[nodiscard]] int restore_app_info(const char *pkgid, const char *root);
 /** One directory of it and everything below. @return 1 when every entry was restored, else 0 */
-int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
-                              json_object *table);
+[[nodiscard]] int parse_app_dir_for_restore(const char *dir, const char *pkgid, const char *root,
+                                            json_object *table);
 /**
  * Make the links that the table lists. No restore calls it: links are only recorded.
  * No part of the daemon calls it.

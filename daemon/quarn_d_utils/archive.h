@@ -29,7 +29,7 @@ struct unzip_report {
   unsigned int refused = 0;   /**< hostile: nothing of them lies below the destination */
   unsigned int failed = 0;    /**< corrupt, or not to be written; a part may lie there */
   /** True when the destination holds everything that the archive had. */
-  bool complete() const { return refused == 0 && failed == 0; }
+  [[nodiscard]] bool complete() const { return refused == 0 && failed == 0; }
 };
 
 /**
@@ -41,9 +41,9 @@ struct unzip_report {
  * @return 0, 14, or 31 for an archive that cannot be opened, is empty, or
  *         announces more than bounds.h lets it: of such a one nothing is unpacked
  */
-int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
-               unzip_report *report);
-/** The same without a report. */
-int unzip_data(const char *pkg_id, const char *destination, const char *zip_path);
+[[nodiscard]] int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
+                             unzip_report *report);
+/** The same without a report. No part of the daemon calls it. */
+[[nodiscard]] int unzip_data(const char *pkg_id, const char *destination, const char *zip_path);
 
 #endif

@@ -20,7 +20,8 @@ enum class archived_table {
  * @param[out] table what was found, where the archive is within its bounds
  * @return the same, and 19 when the table is not whole
  */
-int unzip_data_with_table(const char *pkg_id, const char *destination, const char *zip_path,
-                          unzip_report *report, archived_table *table);
+[[nodiscard]] int unzip_data_with_table(const char *pkg_id, const char *destination,
+                                        const char *zip_path, unzip_report *report,
+                                        archived_table *table);
 
 #endif

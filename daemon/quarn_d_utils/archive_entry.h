@@ -13,10 +13,10 @@
 #include "quarn_d_utils/file_info_table.h"
 
 /** Walk one directory into the archive. @return true when anything was recorded */
-bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip, const char *dir,
-                           file_info_table_h *table, int *error);
+[[nodiscard]] bool parse_app_dir_for_zip(const char *pkg_id, const char *root, zipFile zip,
+                                         const char *dir, file_info_table_h *table, int *error);
 /** Add one file's bytes as one entry. No part of the daemon calls it. */
-bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error);
+[[nodiscard]] bool add_file_to_zip(const char *root, zipFile zip, const char *file, int *error);
 /** Add the table's text as the last entry. */
 void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const char *pkg_id,
                                    const char *root, int *error);
@@ -24,7 +24,7 @@ void insert_file_info_table_to_zip(file_info_table_h *table, zipFile zip, const 
  * Write the archive's current entry, opened raw, below @p destination.
  * No part of the daemon calls it.
  */
-bool extract_file_from_zip(const char *pkg_id, const char *destination, unzFile archive,
-                           const char *name);
+[[nodiscard]] bool extract_file_from_zip(const char *pkg_id, const char *destination,
+                                         unzFile archive, const char *name);
 
 #endif

@@ -20,11 +20,11 @@ extern unsigned int cloud_init_timeout_seconds;
  * True when the transport is ready; starts it when needed and waits up to 60
  * seconds: the main thread in a nested loop, other threads on a condition.
  */
-bool cloud_initialized();
+[[nodiscard]] bool cloud_initialized();
 /** The transport handle; null before cloud_initialized() was true. Any thread. */
-backup_trans_handle_h cloud_handler();
+[[nodiscard]] backup_trans_handle_h cloud_handler();
 
 /** True when a user is signed in. Main thread. */
-bool server_util_is_account_exist();
+[[nodiscard]] bool server_util_is_account_exist();
 
 #endif

@@ -23,17 +23,18 @@ inline constexpr std::uint64_t kMaxArchiveFileSize =
 
 /** A download on the session. Any thread. @return BACKUP_TRANS_ERROR_NONE: the callback will come
  */
-int download_bounded_async(const char *cloud_path, const char *local_path, void *user_data,
-                           backup_trans_download_cb callback, int options, std::uint64_t max_size);
+[[nodiscard]] int download_bounded_async(const char *cloud_path, const char *local_path,
+                                         void *user_data, backup_trans_download_cb callback,
+                                         int options, std::uint64_t max_size);
 /** The same, waiting for its result: not for the main thread. */
-int download_bounded(const char *cloud_path, const char *local_path, int options,
-                     std::uint64_t max_size);
+[[nodiscard]] int download_bounded(const char *cloud_path, const char *local_path, int options,
+                                   std::uint64_t max_size);
 
 /**
  * End the transfer that was requested with this @p user_data, and no other; its
  * callback follows with #BACKUP_TRANS_ERROR_CANCELLED. Any thread.
  * @return false when it has ended already, or the library cannot end it
  */
-bool abort_transfer(void *user_data);
+[[nodiscard]] bool abort_transfer(void *user_data);
 
 #endif

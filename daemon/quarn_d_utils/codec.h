@@ -24,7 +24,7 @@ class ByteSource {
    * @param[out] end set when nothing follows the bytes returned
    * @return their number, -1 on failure
    */
-  virtual long read(unsigned char *data, std::size_t size, bool *end) = 0;
+  [[nodiscard]] virtual long read(unsigned char *data, std::size_t size, bool *end) = 0;
 };
 
 /** Where its output goes. */
@@ -32,7 +32,7 @@ class ByteSink {
  public:
   virtual ~ByteSink() = default;
   /** @return false to end the entry here */
-  virtual bool write(const unsigned char *data, std::size_t size) = 0;
+  [[nodiscard]] virtual bool write(const unsigned char *data, std::size_t size) = 0;
 };
 
 enum class CodecResult {
@@ -57,31 +57,35 @@ class Codec {
   Codec &operator=(const Codec &) = delete;
 
   /** Compress everything that @p source gives. The same input gives the same output. */
-  virtual CodecResult deflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) = 0;
+  [[nodiscard]] virtual CodecResult deflate(ByteSource *source, ByteSink *sink,
+                                            CodecTotals *totals) = 0;
   /** Decompress one deflate stream; what follows it is not read. */
-  virtual CodecResult inflate(ByteSource *source, ByteSink *sink, CodecTotals *totals) = 0;
+  [[nodiscard]] virtual CodecResult inflate(ByteSource *source, ByteSink *sink,
+                                            CodecTotals *totals) = 0;
 };
 
 /** What the codec is wanted for: each direction has its own state. */
 enum class CodecUse { kDeflate, kInflate };
 
 /** Null when memory is out. */
-std::unique_ptr<Codec> make_isal_codec(CodecUse use);
-std::unique_ptr<Codec> make_zlib_codec(CodecUse use);
+[[nodiscard]] std::unique_ptr<Codec> make_isal_codec(CodecUse use);
+[[nodiscard]] std::unique_ptr<Codec> make_zlib_codec(CodecUse use);
 /** CRC-32 (IEEE 802.3, as zlib counts it) of @p data after bytes with @p crc; 0 to start. */
-std::uint32_t isal_codec_crc32(std::uint32_t crc, const void *data, std::size_t size);
-std::uint32_t zlib_codec_crc32(std::uint32_t crc, const void *data, std::size_t size);
+[[nodiscard]] std::uint32_t isal_codec_crc32(std::uint32_t crc, const void *data, std::size_t size);
+[[nodiscard]] std::uint32_t zlib_codec_crc32(std::uint32_t crc, const void *data, std::size_t size);
 
 /** The codec that this build is configured with; a test may define one of its own. */
-std::unique_ptr<Codec> make_codec(CodecUse use);
+[[nodiscard]] std::unique_ptr<Codec> make_codec(CodecUse use);
 
 #ifdef QUARN_CODEC_ZLIB
-inline std::uint32_t codec_crc32(std::uint32_t crc, const void *data, std::size_t size) {
+[[nodiscard]] inline std::uint32_t codec_crc32(std::uint32_t crc, const void *data,
+                                               std::size_t size) {
   return zlib_codec_crc32(crc, data, size);
 }
 #else
 /** CRC-32 as that codec counts it. */
-inline std::uint32_t codec_crc32(std::uint32_t crc, const void *data, std::size_t size) {
+[[nodiscard]] inline std::uint32_t codec_crc32(std::uint32_t crc, const void *data,
+                                               std::size_t size) {
   return isal_codec_crc32(crc, data, size);
 }
 #endif

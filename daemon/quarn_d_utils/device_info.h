@@ -13,6 +13,6 @@
 /** Model name and serial number (IMEI), malloc'd; null where unknown. */
 void get_device_info(char **model, char **serial);
 /** Milliseconds since the Unix epoch. */
-std::int64_t _get_current_timestamp();
+[[nodiscard]] std::int64_t _get_current_timestamp();
 
 #endif

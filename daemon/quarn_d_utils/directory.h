@@ -9,9 +9,9 @@
 #define QUARN_D_UTILS_DIRECTORY_H
 
 /** True when a regular file lies anywhere below @p dir. */
-bool file_exist_in_directory(const char *dir);
+[[nodiscard]] bool file_exist_in_directory(const char *dir);
 /** The negation of file_exist_in_directory(). */
-bool is_empty_directory(const char *dir);
+[[nodiscard]] bool is_empty_directory(const char *dir);
 /** Remove a directory with everything in it; links are refused and stay. */
 bool delete_directory_util(const char *dir);
 /** Empty a directory, and remove it too when @p remove_directory is set. */

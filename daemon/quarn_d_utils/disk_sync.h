@@ -16,10 +16,10 @@
  * @return false when anything could not be brought there; kernels before 5.8
  * do not tell that of many files
  */
-bool sync_tree(const std::string &dir,
-               const std::function<bool(const std::string &path)> &skipped = nullptr);
+[[nodiscard]] bool sync_tree(const std::string &dir,
+                             const std::function<bool(const std::string &path)> &skipped = nullptr);
 
 /** The same for the directory @p dir alone: which names it has. */
-bool sync_directory(const std::string &dir);
+[[nodiscard]] bool sync_directory(const std::string &dir);
 
 #endif

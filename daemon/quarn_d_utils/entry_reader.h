@@ -56,7 +56,7 @@ inline constexpr int kRawEntry = 1;
 [[nodiscard]] const char *form_refusal(const unz_file_info64 &info);
 
 /** True for an entry whose bytes are those of its file. */
-bool is_stored(const unz_file_info64 &info);
+[[nodiscard]] bool is_stored(const unz_file_info64 &info);
 /** What the codec does with the others: such an entry's bytes as they are. */
 [[nodiscard]] CodecResult copy_stored(ByteSource *source, ByteSink *sink, CodecTotals *totals);
 

@@ -17,8 +17,8 @@
  * @param status of @p fd
  * @param[out] error becomes 36 on failure, else stays
  */
-bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
-                   const struct stat &status, int *error);
+[[nodiscard]] bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
+                                 const struct stat &status, int *error);
 
 /** Give back the memory that the calling thread's entries have shared. */
 void release_entry_codec();

@@ -26,14 +26,14 @@ extern const std::size_t kFiberStackSize;
  */
 void run_on_fiber(std::function<void()> work);
 /** The fiber that runs; null on the thread's own stack. */
-quarn_fiber *current_fiber();
+[[nodiscard]] quarn_fiber *current_fiber();
 /** A number that no other fiber of the process has; 0 for null. */
-std::uint64_t fiber_id(const quarn_fiber *fiber);
+[[nodiscard]] std::uint64_t fiber_id(const quarn_fiber *fiber);
 
 /** Mark a fiber: what it does is not wanted any more. The mark stays. */
 void withdraw_fiber(quarn_fiber *fiber);
 /** Whether a fiber has that mark; false for null. */
-bool fiber_is_withdrawn(const quarn_fiber *fiber);
+[[nodiscard]] bool fiber_is_withdrawn(const quarn_fiber *fiber);
 
 /** Leave the running fiber: whoever started or resumed it goes on. */
 void suspend_fiber();

@@ -13,24 +13,24 @@
 #include <string>
 
 /** True for a regular file; a link is neither file nor directory. */
-bool file_exist(const char *path);
+[[nodiscard]] bool file_exist(const char *path);
 /** True for a directory. */
-bool is_directory(const char *path);
+[[nodiscard]] bool is_directory(const char *path);
 /** Size in bytes, -1 on failure. No part of the daemon calls it. */
-int get_file_size(const char *path);
+[[nodiscard]] int get_file_size(const char *path);
 /** Read a whole file; @p buffer is malloc'd, NUL-terminated and the caller's. */
-bool read_data_from_file(const char *path, char **buffer);
+[[nodiscard]] bool read_data_from_file(const char *path, char **buffer);
 /** CRC-32 (IEEE 802.3) of the content; 0 on failure. No part of the daemon calls it. */
-std::uint32_t get_file_crc(const char *path);
+[[nodiscard]] std::uint32_t get_file_crc(const char *path);
 /** Remove a regular file. */
 bool delete_file(const char *path);
 /** Free bytes of the file system, those reserved for the super-user included; 0 on failure. */
-std::uint64_t get_dir_available_size(const char *path);
+[[nodiscard]] std::uint64_t get_dir_available_size(const char *path);
 /** Make the parent directory of a file, with its ancestors. */
-bool create_directory_of_file(const char *file);
+[[nodiscard]] bool create_directory_of_file(const char *file);
 /** Replace a file's content. @return 0, 1 for empty data or path, 36 when writing failed */
-int write_string_to_file(std::string data, std::string path);
+[[nodiscard]] int write_string_to_file(std::string data, std::string path);
 /** Copy a regular file's content. */
-bool copy_file(const char *src, const char *dst);
+[[nodiscard]] bool copy_file(const char *src, const char *dst);
 
 #endif

@@ -1,7 +1,5 @@
 #include "quarn_d_utils/file_attributes.h"
 
-#include <utility>
-
 namespace {
 
 constexpr char kModeKey[] = "0";

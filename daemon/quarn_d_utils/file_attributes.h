@@ -28,7 +28,7 @@ struct file_attributes {
   std::optional<const char *> label;
 
   /** True when nothing is absent. */
-  bool complete() const { return mode && owner && group && label; }
+  [[nodiscard]] bool complete() const { return mode && owner && group && label; }
 };
 
 /** The attributes that a member of a table has. @param member null, or no object: nothing */

@@ -11,6 +11,6 @@
  * CRC-32 (IEEE 802.3) of everything that @p fd can read, from the beginning of the file;
  * 0 when there is no memory for it. Any thread.
  */
-std::uint32_t get_open_file_crc(int fd);
+[[nodiscard]] std::uint32_t get_open_file_crc(int fd);
 
 #endif

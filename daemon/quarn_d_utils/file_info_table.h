@@ -41,8 +41,9 @@ void release_file_info_table(file_info_table_h *table);
  * @param fd the entry's descriptor, borrowed, when it is open: its label is then the label of what
  *           was opened, found without another walk along the path; else negative
  */
-bool get_file_info_from_file(const char *path, const struct stat &stat, int *permission,
-                             unsigned int *uid, unsigned int *gid, char **label, int fd = -1);
+[[nodiscard]] bool get_file_info_from_file(const char *path, const struct stat &stat,
+                                           int *permission, unsigned int *uid, unsigned int *gid,
+                                           char **label, int fd = -1);
 /**
  * Add a directory or a regular file. *@p error becomes 36 on failure, else stays.
  * @param fd as for get_file_info_from_file()
@@ -57,6 +58,6 @@ void add_to_file_info_table(file_info_table_h *table, const char *root, const ch
 void add_sym_info_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
                                      const struct stat &stat, int *error, int dir = -1);
 /** Write the table's JSON text and release its root. @return as write_string_to_file() */
-int save_file_info_table(file_info_table_h *table, const char *path);
+[[nodiscard]] int save_file_info_table(file_info_table_h *table, const char *path);
 
 #endif

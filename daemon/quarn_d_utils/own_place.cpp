@@ -51,7 +51,7 @@ UniqueFd open_own(int parent, const char *name, struct stat *status) {
 /** Remove what others have put into a directory of ours. */
 void remove_others(int dir, const std::string &path) {
   std::vector<TreeEntry> entries;
-  list_tree_entries(dir, &entries);
+  static_cast<void>(list_tree_entries(dir, &entries));  // nobody else can read it any more either
   for (const TreeEntry &entry : entries) {
     const char *name = entry.name.c_str();
     struct stat status = {};

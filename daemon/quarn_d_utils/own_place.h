@@ -17,7 +17,7 @@
  * is removed.
  * @return false, with errno set, when it cannot be had
  */
-bool make_own_directory(const std::string &path);
+[[nodiscard]] bool make_own_directory(const std::string &path);
 
 /**
  * Give the file @p source, which lies where nobody else can reach it, the name
@@ -25,6 +25,6 @@ bool make_own_directory(const std::string &path);
  * replaced, a directory set aside.
  * @return false, with errno set, when it still has its old name
  */
-bool move_to_own_place(const std::string &source, const std::string &target);
+[[nodiscard]] bool move_to_own_place(const std::string &source, const std::string &target);
 
 #endif

@@ -1,5 +1,4 @@
 #include <cstring>
-#include <mutex>
 #include <string>
 #include <vector>
 

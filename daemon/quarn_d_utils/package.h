@@ -21,22 +21,22 @@ extern std::vector<std::string> install_complete_pkgs QUARN_GUARDED_BY(installed
  * True when the application's API version is at least @p version, compared as bytes.
  * No part of the daemon calls it.
  */
-bool app_support_api_version(const char *appid, const char *version);
+[[nodiscard]] bool app_support_api_version(const char *appid, const char *version);
 /** True when the application takes part in backup. */
-bool backup_enabled_app(const char *appid);
+[[nodiscard]] bool backup_enabled_app(const char *appid);
 /** True when the package is in install_complete_pkgs. */
-bool already_installed_package(const char *pkgid);
+[[nodiscard]] bool already_installed_package(const char *pkgid);
 /** True when the package lies on external storage. */
-bool app_data_storage_is_external(const char *pkgid);
+[[nodiscard]] bool app_data_storage_is_external(const char *pkgid);
 /**
  * Package id and version of an application, malloc'd.
  * No part of the daemon calls it.
  * @return 0 or 42
  */
-int get_pkg_info(const char *appid, char **pkgid, char **version);
+[[nodiscard]] int get_pkg_info(const char *appid, char **pkgid, char **version);
 /** Root path of a package, malloc'd; null on failure. */
-char *get_app_root_path(const char *pkgid);
+[[nodiscard]] char *get_app_root_path(const char *pkgid);
 /** The same into a string. @return 0 or 36 */
-int get_string_app_root_path(const char *pkgid, std::string &root);
+[[nodiscard]] int get_string_app_root_path(const char *pkgid, std::string &root);
 
 #endif

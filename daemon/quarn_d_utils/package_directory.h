@@ -16,8 +16,9 @@
  * @param status when not null: that of the directory which was opened
  * @return null, with errno set, when that is refused or it is none
  */
-inline DirPtr open_directory_as_package(int dir, const char *name, const package_user &user,
-                                        struct stat *status = nullptr) {
+[[nodiscard]] inline DirPtr open_directory_as_package(int dir, const char *name,
+                                                      const package_user &user,
+                                                      struct stat *status = nullptr) {
   UniqueFd fd = open_as_package(dir, name, O_RDONLY | O_DIRECTORY | O_NONBLOCK, 0, user, status);
   if (!fd) return nullptr;
   DirPtr opened(fdopendir(fd.get()));

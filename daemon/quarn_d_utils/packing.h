@@ -33,18 +33,18 @@ class Packing {
   const archive_excess &excess() const { return excess_; }
 
   /** Whether a file of @p size, a link or a directory, with this name, lies within the bounds. */
-  bool admit(const file_info_table_h &table, std::uint64_t size, std::uint64_t name) {
+  [[nodiscard]] bool admit(const file_info_table_h &table, std::uint64_t size, std::uint64_t name) {
     content_ += size;
     return check(archive_bound::content, content_, bounds_.content) &&
            check(archive_bound::members, table.members + 1, bounds_.members) &&
            check(archive_bound::names, table.names + name, bounds_.names);
   }
   /** Whether the table with everything that was added does. */
-  bool admit(const file_info_table_h &table) {
+  [[nodiscard]] bool admit(const file_info_table_h &table) {
     return check(archive_bound::table, table.text, bounds_.table);
   }
   /** Whether a directory at @p depth is too deep for this archive to be of use. */
-  bool refuses_depth(int depth) {
+  [[nodiscard]] bool refuses_depth(int depth) {
     if (bounds_.members == kNoBounds.members) return false;
     return !check(archive_bound::depth, static_cast<std::uint64_t>(depth), kMaxDirDepth);
   }
@@ -67,6 +67,6 @@ class Packing {
 extern thread_local Packing *packing;
 
 /** Whether nothing more is taken. */
-inline bool packing_ended() { return packing != nullptr && packing->ended(); }
+[[nodiscard]] inline bool packing_ended() { return packing != nullptr && packing->ended(); }
 
 #endif

@@ -126,7 +126,9 @@ class PackingWalk {
     add_to_file_info_table(table_, root_.c_str(), path.c_str(), status, error_, fd.get());
     admit_in_table(path);
     if (fd) {
-      add_open_file(zip_, path.c_str(), path.c_str() + root_.size() + 1, fd.get(), status, error_);
+      // A failure is in *error_.
+      static_cast<void>(add_open_file(zip_, path.c_str(), path.c_str() + root_.size() + 1, fd.get(),
+                                      status, error_));
     } else {
       LOGE("fopen() failed, file is NULL");
       *error_ = QUARN_REFUSED;

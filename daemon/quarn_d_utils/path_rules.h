@@ -23,14 +23,15 @@ void reset_backup_path_info();
 /** Load a package's rules file, if it has one, in place of the thread's rules. */
 void parse_backup_path_xml(const char *pkg_id, const char *pkg_type, const char *root);
 /** What the last parse_backup_path_xml() of the calling thread found; none after a reset. */
-rules_state backup_rules_state();
+[[nodiscard]] rules_state backup_rules_state();
 /** rules_usable() of that. */
-bool backup_rules_usable();
+[[nodiscard]] bool backup_rules_usable();
 /** Append @p path when something lies there. */
 void add_to_path_info_list(const char *path, std::vector<std::string> *list);
 /** Whether the thread's rules take the file or link at @p path. */
-bool is_backup_file(const char *path);
+[[nodiscard]] bool is_backup_file(const char *path);
 /** Bytes that an archive would take from @p dir; 26214401 for an unreadable directory. */
-std::uint64_t get_dir_backup_size(const char *dir, const char *pkg_id, const char *root);
+[[nodiscard]] std::uint64_t get_dir_backup_size(const char *dir, const char *pkg_id,
+                                                const char *root);
 
 #endif

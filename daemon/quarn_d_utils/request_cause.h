@@ -34,19 +34,19 @@ enum class request_cause {
 };
 
 /** One word for a cause, static; empty for none. */
-const char *request_cause_word(request_cause cause);
+[[nodiscard]] const char *request_cause_word(request_cause cause);
 
 /**
  * The cause behind the transport's answer @p code.
  * @param local_path the file on this device that it was about
  */
-request_cause cause_of_transfer(int code, const std::string &local_path);
+[[nodiscard]] request_cause cause_of_transfer(int code, const std::string &local_path);
 /** The cause behind a file of ours that could not be written: is there room beside it? */
-request_cause cause_of_local_file(const std::string &local_path);
+[[nodiscard]] request_cause cause_of_local_file(const std::string &local_path);
 
 /** Remember what the request that ended last failed of, none when it was served. */
 void note_request_end(request_cause cause);
 /** What was remembered; none at first. */
-request_cause last_request_cause();
+[[nodiscard]] request_cause last_request_cause();
 
 #endif

@@ -22,7 +22,7 @@ enum class TableUse {
  * A member of a table that was read to be looked up. It is the table's, until
  * the next is looked up.
  */
-json_object *attributes_in_table(json_object *table, json_object *member);
+[[nodiscard]] json_object *attributes_in_table(json_object *table, json_object *member);
 
 /** The JSON values of a table, each made by the library on its own. One thread at a time. */
 class TableReader : public TableSink {
@@ -33,7 +33,7 @@ class TableReader : public TableSink {
   void links() override;
 
   /** The table so far; entries with equal attributes share them. Null when memory is out. */
-  JsonPtr take() { return std::move(table_); }
+  [[nodiscard]] JsonPtr take() { return std::move(table_); }
 
  private:
   /** So many different attributes are remembered. */

@@ -1,6 +1,5 @@
 #include "quarn_d_utils/table_text.h"
 
-#include <algorithm>
 #include <cstring>
 
 #include "quarn_d_utils/bounds.h"

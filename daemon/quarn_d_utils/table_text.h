@@ -79,7 +79,7 @@ class TableText {
   /** The next bytes. @return false when nothing further can make it whole */
   bool take(const char *data, std::size_t size);
   /** What it came to, behind its last bytes. */
-  table_state end() const;
+  [[nodiscard]] table_state end() const;
 
  private:
   bool refuse(table_state why);

@@ -30,13 +30,11 @@ class TreePlace {
 
   explicit operator bool() const { return static_cast<bool>(here_); }
   int fd() const { return here_.get(); }
-  /** Directories between this one and the first. */
-  std::size_t depth() const { return above_.size(); }
 
   /** Go into the directory @p name. @return false, and nothing has changed, when it is none */
-  bool down(const char *name);
+  [[nodiscard]] bool down(const char *name);
   /** Go back. @return false when the directory was moved meanwhile: the walk cannot go on then */
-  bool up();
+  [[nodiscard]] bool up();
 
  private:
   struct Identity {
@@ -56,7 +54,7 @@ struct TreeEntry {
 };
 
 /** The entries of an open directory but "." and "..". @return false when it cannot be read */
-bool list_tree_entries(int dir, std::vector<TreeEntry> *entries);
+[[nodiscard]] bool list_tree_entries(int dir, std::vector<TreeEntry> *entries);
 
 /** What a removal does with what is neither file nor directory. */
 enum class OtherTypes {
@@ -65,7 +63,7 @@ enum class OtherTypes {
 };
 
 /** True where a walk's next step is the directory that was looked at. */
-inline bool is_same_object(const struct stat &a, const struct stat &b) {
+[[nodiscard]] inline bool is_same_object(const struct stat &a, const struct stat &b) {
   return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
 }
 
@@ -75,8 +73,9 @@ inline bool is_same_object(const struct stat &a, const struct stat &b) {
  * @param looked_at when not null: only this very directory is removed
  * @return true when all of it is gone
  */
-bool delete_tree_at(int parent, const char *name, const std::string &path,
-                    OtherTypes others = OtherTypes::kStay, TreeAccess access = TreeAccess::kDaemon,
-                    const struct stat *looked_at = nullptr);
+[[nodiscard]] bool delete_tree_at(int parent, const char *name, const std::string &path,
+                                  OtherTypes others = OtherTypes::kStay,
+                                  TreeAccess access = TreeAccess::kDaemon,
+                                  const struct stat *looked_at = nullptr);
 
 #endif

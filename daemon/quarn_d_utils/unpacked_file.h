@@ -17,7 +17,7 @@
 inline constexpr mode_t kUnpackedMode = S_ISVTX;
 
 /** True for a file of that mode. */
-inline bool is_being_unpacked(const struct stat &status) {
+[[nodiscard]] inline bool is_being_unpacked(const struct stat &status) {
   return S_ISREG(status.st_mode) && (status.st_mode & ALLPERMS) == kUnpackedMode;
 }
 

@@ -22,16 +22,18 @@
  * True for what this daemon, or an earlier one, made: an application may give a file of its own any
  * name, but cannot give it away.
  */
-inline bool is_own_file(const struct stat &status) { return status.st_uid == geteuid(); }
+[[nodiscard]] inline bool is_own_file(const struct stat &status) {
+  return status.st_uid == geteuid();
+}
 
 /**
  * True for what the transport makes beside a download where the file system
  * has no nameless files.
  * @param status of the file, as lstat() tells it
  */
-bool is_own_leftover(const char *name, const struct stat &status);
+[[nodiscard]] bool is_own_leftover(const char *name, const struct stat &status);
 /** The same for whatever lies at @p path; costs nothing for another name. */
-bool is_own_leftover(const std::string &path);
+[[nodiscard]] bool is_own_leftover(const std::string &path);
 
 /** The names of one package's files, and which of them is to be used. */
 class WorkingFiles : public package_files {
@@ -40,15 +42,17 @@ class WorkingFiles : public package_files {
 
   /** Of both places of a download the one that is to be used; empty when the application has both.
    */
-  std::string download_place() const;
+  [[nodiscard]] std::string download_place() const;
   /** The snapshot's place: beside the usual one where that is the application's own. */
-  std::string snapshot_place() const;
+  [[nodiscard]] std::string snapshot_place() const;
 
   /**
    * True for both archives, for every path that begins with the snapshot's,
    * and for the transport's files.
    */
-  bool contain(const std::string &path) const { return names(path) || is_own_leftover(path); }
+  [[nodiscard]] bool contain(const std::string &path) const {
+    return names(path) || is_own_leftover(path);
+  }
 };
 
 /** What claim_working_file() has claimed is deleted, and is not to be remembered any more. */
@@ -66,7 +70,7 @@ void note_working_file(const std::string &path, int fd);
  * which was noted last, if one was.
  * @return none with errno, ESTALE for something else
  */
-UniqueFd open_working_file(const std::string &path);
+[[nodiscard]] UniqueFd open_working_file(const std::string &path);
 
 /**
  * Remove what an ended process has left of a package: archives in transit, a

@@ -72,7 +72,7 @@ int write_text_to_file(std::string_view data, const std::string &path) {
     LOGE("Invalid File Name");
     return QUARN_BAD_ARGUMENT;
   }
-  create_directory_of_file(path.c_str());
+  static_cast<void>(create_directory_of_file(path.c_str()));  // without it nothing can be written
   if (!replace_content(path.c_str(), data)) {
     LOGE("Writing to File %s Failed", path.c_str());
     return QUARN_REFUSED;

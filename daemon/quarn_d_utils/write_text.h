@@ -9,6 +9,6 @@
 #include <string_view>
 
 /** As write_string_to_file(), results and messages too. */
-int write_text_to_file(std::string_view data, const std::string &path);
+[[nodiscard]] int write_text_to_file(std::string_view data, const std::string &path);
 
 #endif

@@ -15,9 +15,10 @@
  * make_zip_data(), with the archive, open for reading and writing; none where none was begun. It is
  * new and root's alone, mode 0600.
  */
-UniqueFd make_archive(const char *pkg_id, const char *root, const char *zip_path, int *error,
-                      const archive_bounds &bounds, archive_excess *excess = nullptr,
-                      const std::atomic<bool> *stop = nullptr);
+[[nodiscard]] UniqueFd make_archive(const char *pkg_id, const char *root, const char *zip_path,
+                                    int *error, const archive_bounds &bounds,
+                                    archive_excess *excess = nullptr,
+                                    const std::atomic<bool> *stop = nullptr);
 
 /** The same into a file of the caller's that is empty, and has no name among the data. */
 void fill_archive(const char *pkg_id, const char *root, UniqueFd *archive, int *error,

@@ -78,7 +78,7 @@ class PackageRoot {
     const std::string path = file;
     const auto slash = path.rfind('/');
     if (path.compare(0, path_.size() + 1, path_ + "/") != 0 || slash <= path_.size()) {
-      create_directory_of_file(file);
+      static_cast<void>(create_directory_of_file(file));  // without it nothing can be opened there
       return;
     }
     const std::string folder = path.substr(path_.size() + 1, slash - path_.size() - 1);
@@ -127,7 +127,8 @@ void pack_all(const char *pkg_id, const char *root, zipFile zip, file_info_table
               int *error) {
   for (const std::string &dir : package_files(pkg_id, root).data_dirs()) {
     if (packing->ended()) break;
-    parse_app_dir_for_zip(pkg_id, root, zip, dir.c_str(), table, error);
+    // What it has recorded is in the table.
+    static_cast<void>(parse_app_dir_for_zip(pkg_id, root, zip, dir.c_str(), table, error));
   }
   if (packing->ended()) {
     *error = QUARN_REFUSED;
@@ -217,5 +218,6 @@ void fill_archive(const char *pkg_id, const char *root, UniqueFd *archive, int *
 void make_zip_data(const char *pkg_id, const char *root, const char *zip_path, int *error,
                    const archive_bounds &bounds, archive_excess *excess,
                    const std::atomic<bool> *stop) {
-  make_archive(pkg_id, root, zip_path, error, bounds, excess, stop);
+  // Its caller goes by the name and by *error.
+  static_cast<void>(make_archive(pkg_id, root, zip_path, error, bounds, excess, stop));
 }

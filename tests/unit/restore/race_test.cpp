@@ -133,7 +133,8 @@ TEST_F(RaceTest, AWalkNeverLeavesTheApplicationThroughASwappedDirectory) {
                                  {"data/swap/file", "", 0777, "wrt::db_origin"}});
   swap_forever(at("data/dir"), at("data/swap"));
   for (int i = 0; i < kRounds; ++i) {
-    parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get());
+    static_cast<void>(
+        parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get()));
     clear_captured_log();
   }
   stop();
@@ -147,7 +148,8 @@ TEST_F(RaceTest, AWalkNeverLeavesTheApplicationThroughASwappedFile) {
       table({{"data/a", "", 0777, "wrt::db_origin"}, {"data/b", "", 0777, "wrt::db_origin"}});
   swap_forever(at("data/a"), at("data/b"));
   for (int i = 0; i < kRounds; ++i) {
-    parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get());
+    static_cast<void>(
+        parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get()));
     clear_captured_log();
   }
   stop();
@@ -180,7 +182,7 @@ TEST_F(RaceTest, ASwappedDataDirectoryIsNotRelabelledElsewhere) {
   swap_forever(at("data"), at("swap"));
   for (int i = 0; i < kRounds / 10; ++i) {
     write_text(perm(), "{}");
-    restore_app_info(kPkg, root.c_str());
+    static_cast<void>(restore_app_info(kPkg, root.c_str()));
     clear_captured_log();
   }
   stop();
@@ -194,8 +196,9 @@ TEST_F(RaceTest, AFileSwappedForALinkToAnothersFileIsNeverChanged) {
   const JsonPtr entries = table({{"data/a", "", 0777, "wrt::db_origin"}});
   link_forever(at("data/a"));
   for (int i = 0; i < kRounds; ++i) {
-    parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get());
-    restore_file_info(at("data/a").c_str(), kPkg, root.c_str(), entries.get());
+    static_cast<void>(
+        parse_app_dir_for_restore(at("data").c_str(), kPkg, root.c_str(), entries.get()));
+    static_cast<void>(restore_file_info(at("data/a").c_str(), kPkg, root.c_str(), entries.get()));
     clear_captured_log();
   }
   stop();

@@ -113,7 +113,7 @@ TEST_F(SnapshotTest, LeavesTheDataAlone) {
   make_old_data();
   const Tree before = tree();
   ASSERT_EQ(take(), 0);
-  discard_snapshot(kPkg, root.c_str());
+  EXPECT_TRUE(discard_snapshot(kPkg, root.c_str()));
   EXPECT_EQ(tree(), before);
 }
 
@@ -275,7 +275,7 @@ TEST_F(SnapshotTest, WhereTheApplicationHasBothNamesNothingIsTouched) {
   file("shared/data/quarn_tmp_rst_dir.snapshot/inner", "its own");
   const Tree before = tree();
   EXPECT_EQ(take(), 36);
-  discard_snapshot(kPkg, root.c_str());
+  EXPECT_TRUE(discard_snapshot(kPkg, root.c_str()));
   recover_interrupted_restore(kPkg, root.c_str());
   EXPECT_EQ(tree(), before);
 }
@@ -732,7 +732,7 @@ TEST_F(WrittenSinceTest, AFileInAnInterruptedRollback) {
   const pid_t child = fork();
   if (child == 0) {
     const AtStep step("rollback-moved", [] { _exit(7); });
-    put_snapshot_back(kPkg, root.c_str());
+    static_cast<void>(put_snapshot_back(kPkg, root.c_str()));
     _exit(0);
   }
   int status = 0;
@@ -842,7 +842,7 @@ TEST_F(SnapshotTest, DiscardingTakesTheTableAwayFirst) {
     table_there = exists(snapshot_table());
     copy_there = exists(snapshot() + "/data/settings.ini");
   });
-  discard_snapshot(kPkg, root.c_str());
+  EXPECT_TRUE(discard_snapshot(kPkg, root.c_str()));
   EXPECT_FALSE(table_there);
   EXPECT_TRUE(copy_there);
   EXPECT_FALSE(exists(snapshot()));
