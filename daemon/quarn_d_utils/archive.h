@@ -15,7 +15,8 @@
  * Pack one package's data. Takes its PackageDataLock. The rules of the calling
  * thread apply. Nothing is made below a root that has gone, and a package that
  * goes meanwhile fails. The first member beyond one of @p bounds ends the work.
- * @param[out] error  set on failure only: 31 archive not opened, 36 any entry failed
+ * @param[out] error  set on failure only: #QUARN_UNREADABLE archive not opened, #QUARN_REFUSED an
+ * entry
  * @param[out] excess when not null: the bound that was met
  * @param stop        when not null: once it is true the work ends with 36; any thread sets it
  */
@@ -38,8 +39,8 @@ struct unzip_report {
  * root's, mode 0600. Takes no PackageDataLock. Entries that
  * are refused or fail are logged and left out; @p report tells how many.
  * Entries that name a folder make it, and cost nothing where that is refused.
- * @return 0, 14, or 31 for an archive that cannot be opened, is empty, or
- *         announces more than bounds.h lets it: of such a one nothing is unpacked
+ * @return #QUARN_OK, #QUARN_OUT_OF_MEMORY, or #QUARN_UNREADABLE for an archive that cannot be
+ * opened, is empty, or announces more than bounds.h lets it: of such a one nothing is unpacked
  */
 [[nodiscard]] int unzip_data(const char *pkg_id, const char *destination, const char *zip_path,
                              unzip_report *report);

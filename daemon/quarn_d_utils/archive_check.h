@@ -18,7 +18,7 @@ enum class archived_table {
  * unzip_data() of archive.h, for an archive whose table is whole; of any
  * other nothing is unpacked.
  * @param[out] table what was found, where the archive is within its bounds
- * @return the same, and 19 when the table is not whole
+ * @return the same, and #QUARN_NO_FILE_INFO when the table is not whole
  */
 [[nodiscard]] int unzip_data_with_table(const char *pkg_id, const char *destination,
                                         const char *zip_path, unzip_report *report,

@@ -15,7 +15,7 @@
  * @param path   for messages
  * @param fd     borrowed, at its beginning
  * @param status of @p fd
- * @param[out] error becomes 36 on failure, else stays
+ * @param[out] error becomes #QUARN_REFUSED on failure, else stays
  */
 [[nodiscard]] bool add_open_file(zipFile zip, const char *path, const char *name, int fd,
                                  const struct stat &status, int *error);

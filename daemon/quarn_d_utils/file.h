@@ -28,7 +28,7 @@ bool delete_file(const char *path);
 [[nodiscard]] std::uint64_t get_dir_available_size(const char *path);
 /** Make the parent directory of a file, with its ancestors. */
 [[nodiscard]] bool create_directory_of_file(const char *file);
-/** Replace a file's content. @return 0, 1 for empty data or path, 36 when writing failed */
+/** Replace a file's content. @return as write_text_to_file() of write_text.h */
 [[nodiscard]] int write_string_to_file(std::string data, std::string path);
 /** Copy a regular file's content. */
 [[nodiscard]] bool copy_file(const char *src, const char *dst);

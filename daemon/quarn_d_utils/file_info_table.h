@@ -45,13 +45,13 @@ void release_file_info_table(file_info_table_h *table);
                                            int *permission, unsigned int *uid, unsigned int *gid,
                                            char **label, int fd = -1);
 /**
- * Add a directory or a regular file. *@p error becomes 36 on failure, else stays.
+ * Add a directory or a regular file. *@p error becomes #QUARN_REFUSED on failure.
  * @param fd as for get_file_info_from_file()
  */
 void add_to_file_info_table(file_info_table_h *table, const char *root, const char *path,
                             const struct stat &stat, int *error, int fd = -1);
 /**
- * Add a symbolic link. *@p error becomes 36 on failure, else stays.
+ * Add a symbolic link. *@p error becomes #QUARN_REFUSED on failure.
  * @param dir the directory that the link is in, borrowed, when it is open: the link is then found
  *            without another walk along the path; else negative
  */

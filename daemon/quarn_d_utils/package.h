@@ -31,12 +31,12 @@ extern std::vector<std::string> install_complete_pkgs QUARN_GUARDED_BY(installed
 /**
  * Package id and version of an application, malloc'd.
  * No part of the daemon calls it.
- * @return 0 or 42
+ * @return #QUARN_OK or #QUARN_FAILED
  */
 [[nodiscard]] int get_pkg_info(const char *appid, char **pkgid, char **version);
 /** Root path of a package, malloc'd; null on failure. */
 [[nodiscard]] char *get_app_root_path(const char *pkgid);
-/** The same into a string. @return 0 or 36 */
+/** The same into a string. @return #QUARN_OK or #QUARN_REFUSED */
 [[nodiscard]] int get_string_app_root_path(const char *pkgid, std::string &root);
 
 #endif

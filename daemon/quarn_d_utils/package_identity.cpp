@@ -14,6 +14,7 @@
 #include <utility>
 
 #include "files/held_folder.h"
+#include "files/package_files.h"
 #include "files/safe_path.h"
 #include "quarn_common.h"
 
@@ -133,11 +134,12 @@ bool is_package_root(int top, const package_user &user) {
  */
 bool is_data_folder(int dir, const struct stat &status, const package_user &user) {
   UniqueFd top(openat(dir, "..", kPlaceFlags | O_DIRECTORY));
-  if (top && lies_at(top.get(), "data", status) && is_package_root(top.get(), user)) return true;
+  if (top && lies_at(top.get(), kDataDirs[0], status) && is_package_root(top.get(), user))
+    return true;
+  // the other two have a folder between them and the root
   top.reset(openat(dir, "../..", kPlaceFlags | O_DIRECTORY));
   return top &&
-         (lies_at(top.get(), "shared/data", status) ||
-          lies_at(top.get(), "shared/trusted", status)) &&
+         (lies_at(top.get(), kDataDirs[1], status) || lies_at(top.get(), kDataDirs[2], status)) &&
          is_package_root(top.get(), user);
 }
 

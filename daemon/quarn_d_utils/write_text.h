@@ -8,7 +8,10 @@
 #include <string>
 #include <string_view>
 
-/** As write_string_to_file(), results and messages too. */
+/**
+ * Replace a file's content; failures are logged.
+ * @return #QUARN_OK, #QUARN_BAD_ARGUMENT for empty data or path, #QUARN_REFUSED when writing failed
+ */
 [[nodiscard]] int write_text_to_file(std::string_view data, const std::string &path);
 
 #endif

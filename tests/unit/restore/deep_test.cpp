@@ -190,6 +190,20 @@ TEST_F(DeepTest, WhatIsDugDeeperThanAnArchiveGoesIsNotLookedAtForItsAttributes) 
   EXPECT_TRUE(delete_directory_util(at("data/d").c_str()));
 }
 
+TEST_F(DeepTest, WhatIsDugDeeperThanAnArchiveGoesWhileItIsRestoredUndoesTheRestore) {
+  file("data/db", "present");
+  const Tree before = tree_of(root);
+  make_archive(base + "/saved.zip", {{"data/db", "saved"}});
+  {
+    const AtStep digging("labels", [this] { dig(at("data"), kMaxDirDepth); });
+    EXPECT_EQ(restore(base + "/saved.zip"), 36);
+  }
+  EXPECT_TRUE(tree_of(root) == before);
+  const AtStep digging("labels", [this] { dig(at("data"), kMaxDirDepth - 1); });
+  EXPECT_EQ(restore(base + "/saved.zip"), 0);
+  EXPECT_EQ(read_text(at("data/db")), "saved");
+}
+
 TEST_F(DeepTest, WhatIsDugDeeperThanABackupGoesCountsAsWritten) {
   ASSERT_EQ(temp_backup_initial_app_data(kPkg, root.c_str()), 0);
   std::string written;
