@@ -14,8 +14,6 @@ const char kClientGroup[] = QUARN_CLIENT_GROUP;
 
 namespace {
 
-constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
-
 /** A label that can be a package's: its id. What the system itself runs with is none. */
 bool is_package_label(const std::string &label) {
   return label.size() > 1 && label != ".." && label.find('/') == std::string::npos;

@@ -45,8 +45,10 @@ struct caller_verdict {
 
 /** The name of the group whose members may do everything. */
 extern const char kClientGroup[];
+/** No group's number. */
+inline constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
 
-/** @param client_group number of the clients' group; -1: the system has none */
+/** @param client_group number of the clients' group; kNoGroup: the system has none */
 [[nodiscard]] caller_kind kind_of_caller(const quarn_caller &caller, gid_t client_group);
 
 /**

@@ -1,9 +1,5 @@
 #include "quarn_d_gate.h"
 
-#include <grp.h>
-#include <pwd.h>
-
-#include <cstdlib>
 #include <deque>
 #include <iterator>
 #include <map>
@@ -14,6 +10,7 @@
 
 #include "glib_handles.h"
 #include "quarn_common.h"
+#include "quarn_d_credentials.h"
 #include "quarn_d_methods.h"
 #include "quarn_d_utils/pending_work.h"
 #include "quarn_log.h"
@@ -25,9 +22,6 @@ constexpr char kBusName[] = "org.freedesktop.DBus";
 constexpr char kBusPath[] = "/org/freedesktop/DBus";
 /** Milliseconds that the bus may take to tell who calls. */
 constexpr int kBusTimeout = 5000;
-constexpr gid_t kNoGroup = static_cast<gid_t>(-1);
-constexpr std::size_t kLookUpRoom = 4096;
-constexpr int kGroupsAtFirst = 32;
 
 /** A call that waits to know who makes it. */
 struct waiting_call {
@@ -55,7 +49,6 @@ std::map<std::string, EntryPtr> &entries QUARN_GUARDED_BY(entries_mutex) =
     *new std::map<std::string, EntryPtr>;
 std::uint64_t last_age = 0;
 caller_source &source = *new caller_source;
-std::optional<gid_t> given_group;
 
 /** What was refused to one caller since a moment. */
 struct refusals {
@@ -225,46 +218,6 @@ void ask(GDBusConnection *connection, const std::string &sender, const EntryPtr 
                          new question{sender, entry});
 }
 
-/** The groups of a user, for a bus that does not tell a process' own. */
-std::vector<gid_t> groups_of_user(uid_t uid) {
-  std::vector<char> room(kLookUpRoom);
-  struct passwd user {};
-  struct passwd *found = nullptr;
-  if (getpwuid_r(uid, &user, room.data(), room.size(), &found) != 0 || found == nullptr) return {};
-  std::vector<gid_t> groups(kGroupsAtFirst);
-  int count = kGroupsAtFirst;
-  if (getgrouplist(user.pw_name, user.pw_gid, groups.data(), &count) < 0) {
-    groups.resize(static_cast<std::size_t>(count));
-    if (getgrouplist(user.pw_name, user.pw_gid, groups.data(), &count) < 0) return {};
-  }
-  groups.resize(static_cast<std::size_t>(count));
-  return groups;
-}
-
-std::string text_of_bytes(GVariant *bytes) {
-  gsize length = 0;
-  const auto *text =
-      static_cast<const char *>(g_variant_get_fixed_array(bytes, &length, sizeof(char)));
-  std::string label(text, text == nullptr ? 0 : length);
-  // The bus ends it with a NUL.
-  if (!label.empty() && label.back() == '\0') label.pop_back();
-  return label.find('\0') == std::string::npos ? label : "";
-}
-
-gid_t look_up_client_group() {
-  char *end = nullptr;
-  constexpr int kDecimal = 10;
-  const unsigned long number = std::strtoul(kClientGroup, &end, kDecimal);
-  if (end != kClientGroup && *end == '\0') return static_cast<gid_t>(number);
-  std::vector<char> room(kLookUpRoom);
-  struct group group {};
-  struct group *found = nullptr;
-  while (getgrnam_r(kClientGroup, &group, room.data(), room.size(), &found) == ERANGE) {
-    room.resize(room.size() * 2);
-  }
-  return found == nullptr ? kNoGroup : found->gr_gid;
-}
-
 }  // namespace
 
 void with_caller(GDBusConnection *connection, const std::string &sender, caller_work work) {
@@ -301,30 +254,6 @@ quarn_caller ask_caller_now(GDBusConnection *connection, const std::string &send
   return reply ? read_credentials(reply.get()) : quarn_caller{};
 }
 
-quarn_caller read_credentials(GVariant *reply) {
-  quarn_caller caller;
-  const GVariantPtr values(g_variant_get_child_value(reply, 0));
-  guint32 uid = 0;
-  if (g_variant_lookup(values.get(), "UnixUserID", "u", &uid) == FALSE) return caller;
-  caller.known = true;
-  caller.uid = uid;
-  if (uid == 0) return caller;
-  const GVariantPtr groups(
-      g_variant_lookup_value(values.get(), "UnixGroupIDs", G_VARIANT_TYPE("au")));
-  if (groups) {
-    gsize count = 0;
-    const auto *ids = static_cast<const guint32 *>(
-        g_variant_get_fixed_array(groups.get(), &count, sizeof(guint32)));
-    caller.groups.assign(ids, ids + count);
-  } else {
-    caller.groups = groups_of_user(uid);
-  }
-  const GVariantPtr label(
-      g_variant_lookup_value(values.get(), "LinuxSecurityLabel", G_VARIANT_TYPE_BYTESTRING));
-  if (label) caller.label = text_of_bytes(label.get());
-  return caller;
-}
-
 quarn_subject subject_of_call(const std::string &interface_name, const std::string &member,
                               GVariant *arguments) {
   quarn_subject subject{interface_name, member, "", -1, false};
@@ -351,8 +280,6 @@ caller_verdict judge_call(const quarn_caller &caller, const std::string &sender,
 std::string refusal_text(const quarn_subject &subject, const caller_verdict &verdict) {
   return subject.member + " is refused: " + verdict.reason;
 }
-
-gid_t client_group() { return given_group ? *given_group : look_up_client_group(); }
 
 bool tells_of_refusal(const quarn_caller &caller) {
   const MutexLock lock(refused.mutex);
@@ -396,5 +323,3 @@ void set_caller_source(caller_source asked) { source = std::move(asked); }
 void set_refusal_clock(gint64 (*clock)()) {
   refusal_clock = clock == nullptr ? g_get_monotonic_time : clock;
 }
-
-void set_client_group(gid_t group) { given_group = group; }

@@ -40,9 +40,6 @@ void with_caller(GDBusConnection *connection, const std::string &sender, caller_
 [[nodiscard]] quarn_caller ask_caller_now(GDBusConnection *connection, const std::string &sender,
                                           int ms);
 
-/** Read a reply of the bus' GetConnectionCredentials, "(a{sv})". Any thread. */
-[[nodiscard]] quarn_caller read_credentials(GVariant *reply);
-
 /** What a call asks for. @param arguments may be null. Any thread. */
 [[nodiscard]] quarn_subject subject_of_call(const std::string &interface_name,
                                             const std::string &member, GVariant *arguments);
@@ -57,9 +54,6 @@ void with_caller(GDBusConnection *connection, const std::string &sender, caller_
 
 /** The error text of a refusal. */
 [[nodiscard]] std::string refusal_text(const quarn_subject &subject, const caller_verdict &verdict);
-
-/** Number of the clients' group, -1 when the system has none. Any thread. */
-[[nodiscard]] gid_t client_group();
 
 /** Refusals of one caller that are told within kRefusalPeriod, each with its line. */
 inline constexpr unsigned int kMostRefusalLines = 60;
@@ -97,7 +91,5 @@ void set_caller_source(caller_source source);
 /** @param clock microseconds that only grow; null: the system's, of refusals and requests. For
  * tests. */
 void set_refusal_clock(gint64 (*clock)());
-/** The group that counts instead of the system's; for tests. */
-void set_client_group(gid_t group);
 
 #endif

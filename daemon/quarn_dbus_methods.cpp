@@ -5,7 +5,7 @@
 
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
-#include "quarn_d_gate.h"
+#include "quarn_d_credentials.h"
 #include "quarn_d_handler/quarn_d_handler.h"
 #include "quarn_d_lifecycle.h"
 #include "quarn_d_turn.h"

@@ -18,6 +18,7 @@
 #include "log_capture.h"
 #include "quarn_common.h"
 #include "quarn_d_backup/quarn_d_backup.h"
+#include "quarn_d_credentials.h"
 #include "quarn_d_end.h"
 #include "quarn_d_gate.h"
 #include "quarn_d_handler/quarn_d_handler.h"

@@ -8,6 +8,7 @@
 #include "glib_handles.h"
 #include "log_capture.h"
 #include "quarn_common.h"
+#include "quarn_d_credentials.h"
 #include "scripted_client.h"
 
 namespace {
