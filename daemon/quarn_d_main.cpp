@@ -1,6 +1,7 @@
 #include "quarn_d_main.h"
 
 #include <glib.h>
+#include <malloc.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -220,6 +221,8 @@ int quarn_recover() {
 }
 
 int main(int argc, char **argv) {
+  // A heap for each thread keeps what the others could use: 3 MB in a run of 4,000 packages.
+  mallopt(M_ARENA_MAX, 1);
   if (!drop_other_groups()) LOGE("fail to leave the groups of the process : %d", errno);
   const bool recovery = argc == 2 && std::strcmp(argv[1], "--recover") == 0;
   const int status = recovery ? quarn_recover() : quarn_run();
