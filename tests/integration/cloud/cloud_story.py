@@ -18,10 +18,11 @@ import urllib.request
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, ".."))
 from quarn_test import (  # noqa: E402
-    TestCase, make_source, read_bytes, read_file, read_text, wait_until)
+    TestCase, free_ports, make_source, read_bytes, read_file, read_text, wait_until)
 
 KIND = sys.argv.pop(1)
-SECRET = "never-to-be-seen-7c1f"
+#: By chance: what other processes of the machine show may hold what is another run's.
+SECRET = "never-to-be-seen-" + os.urandom(4).hex()
 BUCKET = "fleet"
 FIRST = "350000000000001"
 SECOND = "350000000000002"
@@ -68,9 +69,7 @@ class WebdavStore:
             os.chown(os.path.join(self.folder, name), nobody.pw_uid, nobody.pw_gid)
         digest = base64.b64encode(hashlib.sha1(SECRET.encode()).digest()).decode()
         self.write("htpasswd", "%s:{SHA}%s\n" % (self.user, digest))
-        with socket.socket() as listener:
-            listener.bind(("127.0.0.1", 0))
-            self.port = listener.getsockname()[1]
+        self.port, = free_ports(1)
         text = read_file(os.path.join(HERE, "apache.conf"))
         self.write("server.conf",
                    text.replace("@DIR@", self.folder).replace("@PORT@", str(self.port)))

@@ -74,9 +74,11 @@ class Life(TestCase):
         device = self.new_device()
         device.start()
         device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {"data/x": b"x"}))
-        device.exec("sh", "-c", "echo made > /tmp/made && cat /opt/usr/apps/org.example.a/data/x")
-        self.assertEqual(read_file(os.path.join(device.path, "root/tmp/made")), "made\n")
-        self.assertFalse(os.path.exists("/tmp/made"))
+        made = "made-by-%d" % os.getpid()
+        device.exec("sh", "-c", 'echo made > "/tmp/$0" && cat /opt/usr/apps/org.example.a/data/x',
+                    made)
+        self.assertEqual(read_file(os.path.join(device.path, "root/tmp", made)), "made\n")
+        self.assertFalse(os.path.exists("/tmp/" + made))
 
     def test_exec_passes_the_exit_status_on(self):
         device = self.new_device()

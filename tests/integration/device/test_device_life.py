@@ -12,7 +12,7 @@ import unittest
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
 from quarn_test import (  # noqa: E402
     BIN_DIR, DEADLINE, TestCase, make_source, processes_naming, read_bytes, read_file,
-    wait_until)
+    run_contained, wait_until)
 
 BUS = ("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus", "--object-path", "/",
        "--method")
@@ -438,13 +438,9 @@ cat "$one/told"
         one, two = self.new_device("one"), self.new_device("two")
         source = make_source(self.path("src"), "org.example.a", "1.0.0",
                              {"data/x": b"content\n", "data/link": ("->", "x")})
-        # A place of its own for /opt, so that the machine's is not touched.
-        result = subprocess.run(
-            ["unshare", "-m", "sh", "-c",
-             'mount -t tmpfs none /opt && exec setpriv --bounding-set=-sys_admin '
-             '--inh-caps=-sys_admin sh -c "$0" sh "$@"',
-             self.SCRIPT, one.tool, one.path, two.path, source],
-            capture_output=True, text=True)
+        result = run_contained(
+            ["sh", "-c", self.SCRIPT, "sh", one.tool, one.path, two.path, source],
+            self.directory, capture_output=True, text=True)
         self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
         self.assertEqual(
             result.stdout,
