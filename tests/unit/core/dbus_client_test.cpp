@@ -7,6 +7,7 @@
 #include "log_capture.h"
 #include "private_bus.h"
 #include "quarn_common.h"
+#include "run_until.h"
 
 namespace {
 
@@ -382,8 +383,7 @@ class Publish : public ::testing::Test {
         g_dbus_connection_close_sync(connection, nullptr, nullptr);
       }
     }
-    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-    }
+    run_pending();
   }
   static void on_signal(GDBusConnection *, const gchar *, const gchar *path, const gchar *,
                         const gchar *signal, GVariant *parameters, gpointer self) {
