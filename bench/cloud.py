@@ -16,6 +16,9 @@ import trees
 from harness import CEILING_KB, Table, median, peak_pss
 
 HERE = os.path.dirname(os.path.abspath(__file__))
+sys.path.insert(0, os.path.join(HERE, "../tests/integration"))
+from quarn_test import free_ports  # noqa: E402
+
 FIXTURES = os.path.join(HERE, "../tests/integration/cloud")
 USER, PASSWORD = "device", "right"
 #: Quarnd may use this much of the other's wall time.
@@ -40,12 +43,6 @@ def answers(port):
         return False
 
 
-def free_port():
-    with socket.socket() as taken:
-        taken.bind(("127.0.0.1", 0))
-        return taken.getsockname()[1]
-
-
 class Dav:
     """A WebDAV server, its files in the work directory."""
     kind = "WebDAV"
@@ -60,7 +57,7 @@ class Dav:
         for path in (work, os.path.dirname(work), os.path.dirname(os.path.dirname(work))):
             if path != tempfile.gettempdir():
                 os.chmod(path, 0o755)
-        self.port = free_port()
+        self.port, = free_ports(1)
         with open(os.path.join(FIXTURES, "apache.conf")) as file:
             text = file.read().replace("@DIR@", self.dir).replace("@PORT@", str(self.port))
         with open(os.path.join(self.dir, "server.conf"), "w") as file:

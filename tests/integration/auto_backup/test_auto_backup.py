@@ -30,9 +30,7 @@ class AutoBackup(TestCase):
     # ---- what a test does with the device ----
 
     def start_daemon(self):
-        self.device.exec("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus",
-                         "--object-path", "/", "--method",
-                         "org.freedesktop.DBus.StartServiceByName", "org.orvane.Quarn", "0")
+        self.device.activate()
         wait_until(self.device.daemon_pid, "the daemon runs")
         # It has added its first alarm and entered its loop.
         self.device.wait_for_log("== main loop begin ==", self.starts())

@@ -10,7 +10,7 @@ sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."
 sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
 from bus_client import INTERFACE, NAME, Client, integer, request  # noqa: E402
 from gi.repository import GLib  # noqa: E402
-from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import BIN_DIR, TestCase, make_source, read_file, wait_until  # noqa: E402
 
 #: A process under a signal ends within a second; the rest is for a slow machine.
 SIGNAL_SECONDS = 1.0
@@ -165,8 +165,7 @@ class Process(BusTest):
         waits = WAITS[os.uname().machine]
 
         def waits_forever():
-            with open("/proc/%d/syscall" % pid) as file:
-                fields = file.read().split()
+            fields = read_file("/proc/%d/syscall" % pid).split()
             # A process that runs has no system call to show.
             return len(fields) > 3 and fields[3] in waits.get(fields[0], ())
         wait_until(waits_forever, "the main thread waits for nothing but events")

@@ -11,7 +11,7 @@ sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."
 sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
 from bus_client import INTERFACE, NAME, PATH, Client  # noqa: E402
 from gi.repository import Gio, GLib  # noqa: E402
-from quarn_test import BIN_DIR  # noqa: E402
+from quarn_test import BIN_DIR, read_file  # noqa: E402
 
 DATA_DIR = os.path.join(BIN_DIR, "../data")
 #: The client user of the default build; a bus takes only users that the system knows.
@@ -53,8 +53,7 @@ class Policy(unittest.TestCase):
     def setUpClass(cls):
         cls.directory = tempfile.TemporaryDirectory(prefix="quarn-policy-")
         os.chmod(cls.directory.name, 0o755)
-        with open(os.path.join(DATA_DIR, "org.orvane.Quarn.conf")) as file:
-            policy = file.read()
+        policy = read_file(os.path.join(DATA_DIR, "org.orvane.Quarn.conf"))
         user = '<policy user="%d">' % CONFIGURED_USER
         group = '<policy group="%s">' % CONFIGURED_GROUP
         assert user in policy and group in policy
@@ -245,8 +244,7 @@ class Files(unittest.TestCase):
     def ini(self, name):
         parser = configparser.ConfigParser(strict=False, interpolation=None)
         parser.optionxform = str
-        with open(os.path.join(DATA_DIR, name)) as file:
-            text = file.read()
+        text = read_file(os.path.join(DATA_DIR, name))
         self.assertNotRegex(text, "@[A-Z_]+@")
         parser.read_string(text)
         return parser
@@ -256,8 +254,8 @@ class Files(unittest.TestCase):
         self.assertEqual(tree.getroot().tag, "busconfig")
 
     def test_group_is_made_by_the_system(self):
-        with open(os.path.join(DATA_DIR, "quarnd-sysusers.conf")) as file:
-            self.assertEqual(file.read().splitlines()[-1], "g %s -" % CONFIGURED_GROUP)
+        lines = read_file(os.path.join(DATA_DIR, "quarnd-sysusers.conf")).splitlines()
+        self.assertEqual(lines[-1], "g %s -" % CONFIGURED_GROUP)
 
     def test_activation_and_unit_name_one_program_and_one_name(self):
         activation = self.ini("org.orvane.Quarn.service")["D-BUS Service"]

@@ -9,7 +9,7 @@ sys.path.insert(0, os.path.join(HERE, ".."))
 sys.path.insert(0, HERE)
 from bus_client import Client, GLib  # noqa: E402
 from gi.repository import Gio  # noqa: E402
-from quarn_test import TestCase, make_source  # noqa: E402
+from quarn_test import TestCase, make_source, read_file  # noqa: E402
 
 INTERFACE = "org.orvane.Quarn.Status"
 OBJECT = "/org/orvane/Quarn/Status"
@@ -48,8 +48,7 @@ class StatusObject(TestCase):
     def test_the_daemon_introspects_as_the_installed_document(self):
         served = self.device.exec("gdbus", "introspect", "--xml", "--system", "--dest",
                                   "org.orvane.Quarn", "--object-path", OBJECT).stdout
-        with open(DOCUMENT) as file:
-            self.assertEqual(outline(served), outline(file.read()))
+        self.assertEqual(outline(served), outline(read_file(DOCUMENT)))
 
     def test_reading_starts_the_daemon_and_tells_everything(self):
         self.device.set("network", "wifi")

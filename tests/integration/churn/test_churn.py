@@ -20,7 +20,8 @@ import zlib
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path[:0] = [os.path.join(HERE, ".."), os.path.join(HERE, "../bus")]
 from bus_client import NAME, Client, GLib  # noqa: E402
-from quarn_test import TestCase, make_source, read_text, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    TestCase, daemons_of, has_ended, make_source, read_bytes, wait_until)
 
 SERIAL = "350000000000001"
 APPLICATION_USER = 5000
@@ -127,8 +128,7 @@ class Application:
             for folder, folders, names in os.walk(self.root(top)):
                 for name in names:
                     path = os.path.join(folder, name)
-                    with open(path, "rb") as file:
-                        found[os.path.relpath(path, self.root())] = file.read()
+                    found[os.path.relpath(path, self.root())] = read_bytes(path)
         return found
 
 
@@ -278,29 +278,15 @@ class Churn(TestCase):
         self.device.set("clock", "%+d" % self.random.choice((-400, -1, 0, 1, 2)) +
                         self.random.choice(("00000", "0000")))
 
-    def daemon_pids(self):
-        wanted = ("QUARN_DEVICE_DIR=" + self.device.path).encode()
-        found = []
-        for entry in os.listdir("/proc"):
-            if not entry.isdigit() or read_text("/proc/%s/comm" % entry).strip() != "quarnd":
-                continue
-            try:
-                with open("/proc/%s/environ" % entry, "rb") as file:
-                    if wanted in file.read().split(b"\0"):
-                        found.append(int(entry))
-            except OSError:
-                continue
-        return found
-
     def end_daemon(self):
-        for pid in self.daemon_pids()[:1]:
+        for pid in daemons_of(self.device.path)[:1]:
             for request in self.requests:
                 # What is switched on before its record is kept needs no end.
                 request.unsure = request.unsure or not request.call.done
             self.signal(pid, signal.SIGTERM)
 
     def kill_daemon(self):
-        for pid in self.daemon_pids()[:1]:
+        for pid in daemons_of(self.device.path)[:1]:
             name = self.name_of(pid)
             # One that is killed before it has its name takes the calls of the next moment with it.
             if name is None:
@@ -312,9 +298,7 @@ class Churn(TestCase):
             self.signal(pid, signal.SIGKILL)
             self.kills += 1
             # A call that is on its way to it is lost as well: none is sent until the bus knows.
-            self.clients[0].until(lambda: not os.path.exists("/proc/%d" % pid) or
-                                  "\nState:\tZ" in read_text("/proc/%d/status" % pid),
-                                  "the daemon is gone")
+            self.clients[0].until(lambda: has_ended(pid), "the daemon is gone")
             for client in self.clients:
                 client.bus("GetId", None)
             while self.has_owner(name):
@@ -479,7 +463,7 @@ class Churn(TestCase):
         """A new daemon, which finds what the last one left, and one more of everything."""
         def ended():
             self.end_daemon()
-            return not self.daemon_pids()
+            return not daemons_of(self.device.path)
         # One may wait in the queue for the bus name behind another.
         wait_until(ended, "the daemons end")
         # Only what a run uploads is cleaned of its other versions.
@@ -534,9 +518,7 @@ class Churn(TestCase):
 
     def assert_cloud(self):
         """The list, the archives and the applications' data say the same."""
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            document = json.load(file)
-        sets = [one for one in document["model_list"]
+        sets = [one for one in self.device.app_list()["model_list"]
                 if one["backup_info"]["serial_number"] == SERIAL]
         self.assertEqual(len(sets), 1, self.hint)
         listed = {entry["pkg_id"]: entry for entry in sets[0]["pkg_list"]}
@@ -550,8 +532,7 @@ class Churn(TestCase):
                                 package + ".zip")
             archives[path] = package
             self.assert_archive(self.applications[package], path)
-            with open(path, "rb") as file:
-                self.assertEqual(entry["crc"] & 0xffffffff, zlib.crc32(file.read()), self.hint)
+            self.assertEqual(entry["crc"] & 0xffffffff, zlib.crc32(read_bytes(path)), self.hint)
         found = [os.path.join(folder, name)
                  for folder, _, names in os.walk(os.path.join(self.device.cloud, SERIAL))
                  for name in names]

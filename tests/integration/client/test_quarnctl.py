@@ -9,21 +9,13 @@ import sys
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    BIN_DIR, TestCase, label_of, make_source, read_bytes, wait_until)
 
 SERIAL = "350000000000017"
 OTHER = "350000000000025"
 NOTES = "org.example.notes"
 BANK = "org.example.bank"
-
-
-def label_of(path):
-    for name in ("security.SMACK64", "user.quarn.SMACK64"):
-        try:
-            return os.getxattr(path, name).decode()
-        except OSError:
-            continue
-    return None
 
 
 class QuarnctlTest(TestCase):
@@ -63,8 +55,7 @@ class QuarnctlTest(TestCase):
         empty = self.quarnctl("list", status=1)
         self.assertIn("holds no application list yet", empty.stderr)
         self.quarnctl("backup")
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            entry = json.load(file)["model_list"][0]
+        entry = self.device.app_list()["model_list"][0]
         device = self.document("list")["devices"][0]
         self.assertEqual(device["serial"], SERIAL)
         self.assertEqual(device["model"], "Orvane One")
@@ -139,9 +130,8 @@ class QuarnctlTest(TestCase):
 
         def same():
             try:
-                with open(self.device.app_path(NOTES, "data/file"), "rb") as one, \
-                        open(second.app_path(NOTES, "data/file"), "rb") as two:
-                    return one.read() == two.read()
+                return (read_bytes(self.device.app_path(NOTES, "data/file")) ==
+                        read_bytes(second.app_path(NOTES, "data/file")))
             except FileNotFoundError:
                 return False
         wait_until(same, "the second device has the first one's data")
@@ -164,13 +154,11 @@ class QuarnctlTest(TestCase):
         self.install(self.device, BANK, metadata={"backup": "disable"})
         self.quarnctl("app", "backup", NOTES)
         path = self.device.app_path(NOTES, "data/file")
-        with open(path, "rb") as file:
-            before = file.read()
+        before = read_bytes(path)
         with open(path, "wb") as file:
             file.write(b"spoiled")
         self.quarnctl("app", "restore", NOTES)
-        with open(path, "rb") as file:
-            self.assertEqual(file.read(), before)
+        self.assertEqual(read_bytes(path), before)
         self.quarnctl("app", "backup", BANK, status=41)
         self.quarnctl("app", "restore", BANK, status=41)
         self.quarnctl("app", "backup", "org.example.none", status=1)
@@ -199,9 +187,8 @@ class QuarnctlTest(TestCase):
         self.assertEqual(watcher.returncode, 0, out + err)
         self.assertIn("%s: restored\n" % NOTES, out)
         self.assertTrue(out.endswith("restore finished\n"), out)
-        with open(self.device.app_path(NOTES, "data/file"), "rb") as one, \
-                open(second.app_path(NOTES, "data/file"), "rb") as two:
-            self.assertEqual(one.read(), two.read())
+        self.assertEqual(read_bytes(self.device.app_path(NOTES, "data/file")),
+                         read_bytes(second.app_path(NOTES, "data/file")))
         second.wait_for_daemon_end()
         self.assertNotIn("g_dbus_connection_call_sync() Fail", second.log())
 

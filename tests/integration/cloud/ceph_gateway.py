@@ -15,7 +15,9 @@ import sys
 import time
 import uuid
 
-from cloud_process import fork_into, free_ports, read, write
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+from cloud_process import fork_into, write  # noqa: E402
+from quarn_test import free_ports, read_file  # noqa: E402
 
 OSDS = 3
 DIR = os.path.abspath(sys.argv[1])
@@ -115,7 +117,7 @@ class Gateway:
         self.wait_for_gateway()
         admin = ("radosgw-admin", *conf)
         run(*admin, "user", "create", "--uid=device", "--display-name=device",
-            "--access-key=device", "--secret=" + read(f"{DIR}/secret"))
+            "--access-key=device", "--secret=" + read_file(f"{DIR}/secret").strip())
         run(*admin, "subuser", "create", "--uid=device", "--subuser=device:swift",
             "--access=full", "--key-type=swift", "--secret=admin")
         self.tell_ready()

@@ -2,19 +2,8 @@
 import ctypes
 import os
 import signal
-import socket
 
 PR_SET_PDEATHSIG = 1
-
-
-def free_ports(count):
-    taken = [socket.socket() for _ in range(count)]
-    for each in taken:
-        each.bind(("127.0.0.1", 0))
-    ports = [each.getsockname()[1] for each in taken]
-    for each in taken:
-        each.close()
-    return ports
 
 
 def write(path, text):
@@ -22,11 +11,6 @@ def write(path, text):
     with open(path + ".new", "w") as file:
         file.write(text)
     os.rename(path + ".new", path)
-
-
-def read(path):
-    with open(path) as file:
-        return file.read().strip()
 
 
 def fork_into(log, body):

@@ -17,10 +17,12 @@ import urllib.request
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, ".."))
-from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    TestCase, free_ports, make_source, read_bytes, read_file, read_text, wait_until)
 
 KIND = sys.argv.pop(1)
-SECRET = "never-to-be-seen-7c1f"
+#: By chance: what other processes of the machine show may hold what is another run's.
+SECRET = "never-to-be-seen-" + os.urandom(4).hex()
 BUCKET = "fleet"
 FIRST = "350000000000001"
 SECOND = "350000000000002"
@@ -42,8 +44,7 @@ class FileStore:
         for folder, _, names in os.walk(self.root):
             for name in names:
                 path = os.path.join(folder, name)
-                with open(path, "rb") as file:
-                    found[os.path.relpath(path, self.root)] = file.read()
+                found[os.path.relpath(path, self.root)] = read_bytes(path)
         return found
 
     def logs(self):
@@ -68,11 +69,8 @@ class WebdavStore:
             os.chown(os.path.join(self.folder, name), nobody.pw_uid, nobody.pw_gid)
         digest = base64.b64encode(hashlib.sha1(SECRET.encode()).digest()).decode()
         self.write("htpasswd", "%s:{SHA}%s\n" % (self.user, digest))
-        with socket.socket() as listener:
-            listener.bind(("127.0.0.1", 0))
-            self.port = listener.getsockname()[1]
-        with open(os.path.join(HERE, "apache.conf")) as file:
-            text = file.read()
+        self.port, = free_ports(1)
+        text = read_file(os.path.join(HERE, "apache.conf"))
         self.write("server.conf",
                    text.replace("@DIR@", self.folder).replace("@PORT@", str(self.port)))
         self.process = subprocess.Popen(
@@ -96,16 +94,12 @@ class WebdavStore:
             folders[:] = [name for name in folders if name != ".DAV"]
             for name in names:
                 path = os.path.join(folder, name)
-                with open(path, "rb") as file:
-                    found[os.path.relpath(path, self.root)] = file.read()
+                found[os.path.relpath(path, self.root)] = read_bytes(path)
         return found
 
     def logs(self):
-        text = ""
-        for name in ("error.log", "requests.log"):
-            with open(os.path.join(self.folder, "state", name), errors="replace") as file:
-                text += file.read()
-        return text
+        return "".join(read_text(os.path.join(self.folder, "state", name))
+                       for name in ("error.log", "requests.log"))
 
     def close(self):
         os.killpg(self.process.pid, signal.SIGKILL)
@@ -129,8 +123,7 @@ class S3Store:
         ready = os.path.join(self.folder, "ready")
         wait_until(lambda: os.path.exists(ready) or self.process.poll() is not None,
                    "the service is ready", 120)
-        with open(ready) as file:
-            self.port = file.read().split()[0]
+        self.port = read_file(ready).split()[0]
         answer = self.ask("http://127.0.0.1:%s/auth/v1.0" % self.port,
                           {"X-Auth-User": self.admin, "X-Auth-Key": "admin"})
         self.storage = answer.headers["X-Storage-Url"]
@@ -151,11 +144,8 @@ class S3Store:
                 for name in names}
 
     def logs(self):
-        text = ""
-        for name in os.listdir(os.path.join(self.folder, "log")):
-            with open(os.path.join(self.folder, "log", name), errors="replace") as file:
-                text += file.read()
-        return text
+        log = os.path.join(self.folder, "log")
+        return "".join(read_text(os.path.join(log, name)) for name in os.listdir(log))
 
     def close(self):
         self.process.send_signal(signal.SIGTERM)
@@ -192,8 +182,7 @@ class CloudStory(TestCase):
         self.seen += result.stdout + result.stderr + status + device.shown_by_processes()
 
     def read(self, device, package, name):
-        with open(device.app_path(package, "data/" + name), "rb") as file:
-            return file.read()
+        return read_bytes(device.app_path(package, "data/" + name))
 
     def test_backup_change_and_restore_on_another_device(self):
         first = self.device_on_store(FIRST)

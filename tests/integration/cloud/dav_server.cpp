@@ -32,13 +32,24 @@ bool prepare_process() {
 }
 const bool prepared = prepare_process();
 
+// On it a connection has just ended, first from the side of the port: for a minute the system gives
+// it to nobody who asks for any, and a server that names it (SO_REUSEADDR) gets it.
 int free_port() {
-  const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const int listener = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const int client = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  constexpr int kOn = 1;
+  setsockopt(listener, SOL_SOCKET, SO_REUSEADDR, &kOn, sizeof kOn);
   sockaddr_in address = loopback(0);
   socklen_t length = sizeof address;
-  EXPECT_EQ(bind(fd, reinterpret_cast<sockaddr *>(&address), length), 0);
-  EXPECT_EQ(getsockname(fd, reinterpret_cast<sockaddr *>(&address), &length), 0);
-  close(fd);
+  EXPECT_EQ(bind(listener, reinterpret_cast<sockaddr *>(&address), length), 0);
+  EXPECT_EQ(getsockname(listener, reinterpret_cast<sockaddr *>(&address), &length), 0);
+  EXPECT_EQ(listen(listener, 1), 0);
+  EXPECT_EQ(connect(client, reinterpret_cast<sockaddr *>(&address), length), 0);
+  close(accept4(listener, nullptr, nullptr, SOCK_CLOEXEC));
+  char end = 0;
+  EXPECT_EQ(read(client, &end, 1), 0);
+  close(client);
+  close(listener);
   return ntohs(address.sin_port);
 }
 

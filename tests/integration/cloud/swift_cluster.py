@@ -15,7 +15,9 @@ import time
 
 import swift.common.utils as utils
 
-from cloud_process import fork_into, free_ports, read, write
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
+from cloud_process import fork_into, write  # noqa: E402
+from quarn_test import free_ports, read_file  # noqa: E402
 
 NODES = 3
 SERVERS = ("object", "container", "account")
@@ -46,7 +48,7 @@ use = egg:swift#{server}
 
 
 def proxy_config(port, cache_port):
-    secret = read(f"{DIR}/secret")
+    secret = read_file(f"{DIR}/secret").strip()
     settings = {
         "cache": f"memcache_servers = 127.0.0.1:{cache_port}\n",
         "tempauth": f"user_test_admin = admin .admin\nuser_test_device = {secret} .admin\n",

@@ -1,5 +1,4 @@
 """Requests that meet: every one is answered once, and nothing half done stays."""
-import json
 import os
 import subprocess
 import sys
@@ -98,8 +97,7 @@ class ConcurrentRequests(TestCase):
                 self.assertIn(run.wait(), (0, 12))
         for device in (self.device, other):
             device.quarnctl("backup")
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            models = json.load(file)["model_list"]
+        models = self.device.app_list()["model_list"]
         self.assertEqual({model["backup_info"]["serial_number"]: len(model["pkg_list"])
                           for model in models},
                          {"350000000000001": len(PACKAGES), "350000000000002": 1})

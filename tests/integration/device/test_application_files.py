@@ -8,7 +8,7 @@ import unittest
 import zipfile
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import TestCase, make_source, tree  # noqa: E402
+from quarn_test import TestCase, make_source, run_contained, tree  # noqa: E402
 
 PACKAGE = "org.example.notes"
 FOLDERS = ("data", "shared/data", "shared/trusted")
@@ -194,13 +194,9 @@ class Contained(TestCase):
     """The same where neither mount namespaces nor the kernel's own attribute are permitted."""
 
     def test_everything_comes_back_there_too(self):
-        places = ("mount -t tmpfs none /opt && mkdir -p /tmp/quarn && "
-                  "mount -t tmpfs -o mode=0700 none /tmp/quarn && ")
-        result = subprocess.run(
-            ["unshare", "-m", "sh", "-c", places + 'exec setpriv --bounding-set=-sys_admin '
-             '--inh-caps=-sys_admin "$@"', "sh", sys.executable, "-B", os.path.abspath(__file__),
-             "MadeByTheApplication"],
-            env={**os.environ, "TMPDIR": "/opt", "QUARN_TEST_LINKS_LABELLED": "0"},
+        result = run_contained(
+            [sys.executable, "-B", os.path.abspath(__file__), "MadeByTheApplication"],
+            env={**os.environ, "TMPDIR": "/tmp", "QUARN_TEST_LINKS_LABELLED": "0"},
             capture_output=True, text=True)
         self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
 

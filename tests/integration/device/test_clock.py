@@ -8,7 +8,7 @@ import unittest
 from datetime import datetime, timezone
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import TestCase, make_source, read_bytes, read_file, wait_until  # noqa: E402
 
 SETTING = "db/private/quarn/backup_status"
 LAST_TIME = "db/private/quarn/last_time"
@@ -88,8 +88,8 @@ class Following(ClockTest):
         self.jump(10 * 24 * HOUR)
         self.device.quarnctl("backup")
         self.assert_ahead(self.last_backup(), 10 * 24 * HOUR)
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            stamps = re.findall(r'"timestamp":\s*(\d+)', file.read())
+        stamps = re.findall(r'"timestamp":\s*(\d+)',
+                            read_file(os.path.join(self.device.cloud, "app_list/app_list.txt")))
         self.assertTrue(stamps)
         for stamp in stamps:
             self.assert_ahead(int(stamp) / 1000, 10 * 24 * HOUR)
@@ -206,8 +206,7 @@ class Recovery(ClockTest):
             file.write(b"spoilt")
         self.jump(-40 * 365 * 24 * HOUR)
         self.device.quarnctl("app", "restore", PACKAGE)
-        with open(self.device.app_path(PACKAGE, "data/note"), "rb") as file:
-            self.assertEqual(file.read(), b"a note")
+        self.assertEqual(read_bytes(self.device.app_path(PACKAGE, "data/note")), b"a note")
         left = [name for _, _, names in os.walk(self.device.app_path(PACKAGE)) for name in names]
         self.assertEqual(left, ["note"])
 

@@ -8,7 +8,7 @@ import sys
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import AnsweringServer, TestCase, make_source  # noqa: E402
+from quarn_test import AnsweringServer, TestCase, free_ports, make_source  # noqa: E402
 
 # Words of chance: what other processes of the machine show may hold any word that means something.
 PASSWORD = secrets.token_hex(8) + " " + secrets.token_hex(8)
@@ -37,8 +37,7 @@ class CloudCheck(TestCase):
         self.assertEqual(os.listdir(self.device.cloud), [])
 
     def test_a_refused_connection_is_the_network(self):
-        with AnsweringServer(200, "OK") as server:
-            port = server.port
+        port, = free_ports(1)
         self.set_cloud("webdav+http://127.0.0.1:%d/" % port)
         code, out, error = self.check()
         self.assertEqual((code, out), (15, ""))

@@ -9,18 +9,10 @@ import sys
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import BIN_DIR, TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    BIN_DIR, TestCase, label_of, make_source, processes_naming, read_bytes, read_file, wait_until)
 
 TOOL = os.path.join(BIN_DIR, "quarn-device")
-
-
-def label(path, follow=False):
-    for name in ("security.SMACK64", "user.quarn.SMACK64"):
-        try:
-            return os.getxattr(path, name, follow_symlinks=follow).decode()
-        except OSError:
-            continue
-    return "_"
 
 
 class Create(TestCase):
@@ -30,8 +22,7 @@ class Create(TestCase):
             self.assertTrue(os.path.isdir(os.path.join(device.path, folder)), folder)
         config = os.path.join(device.path, "state/cloud.conf")
         self.assertEqual(stat.S_IMODE(os.stat(config).st_mode), 0o600)
-        with open(config) as file:
-            self.assertIn("url=file://%s/cloud" % device.path, file.read())
+        self.assertIn("url=file://%s/cloud" % device.path, read_file(config))
 
     def test_refuses_a_directory_that_is_not_empty(self):
         os.makedirs(self.path("full"))
@@ -77,24 +68,17 @@ class Life(TestCase):
                     "/", "--method", "org.freedesktop.DBus.GetId")
         device.stop()
         device.stop()
-        marker = device.path.encode()
-        for entry in os.listdir("/proc"):
-            if not entry.isdigit() or int(entry) == os.getpid():
-                continue
-            try:
-                with open("/proc/%s/cmdline" % entry, "rb") as file:
-                    self.assertNotIn(marker, file.read())
-            except OSError:
-                continue
+        self.assertEqual(processes_naming(device.path), [])
 
     def test_exec_sees_the_devices_own_apps_and_tmp(self):
         device = self.new_device()
         device.start()
         device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {"data/x": b"x"}))
-        device.exec("sh", "-c", "echo made > /tmp/made && cat /opt/usr/apps/org.example.a/data/x")
-        with open(os.path.join(device.path, "root/tmp/made")) as file:
-            self.assertEqual(file.read(), "made\n")
-        self.assertFalse(os.path.exists("/tmp/made"))
+        made = "made-by-%d" % os.getpid()
+        device.exec("sh", "-c", 'echo made > "/tmp/$0" && cat /opt/usr/apps/org.example.a/data/x',
+                    made)
+        self.assertEqual(read_file(os.path.join(device.path, "root/tmp", made)), "made\n")
+        self.assertFalse(os.path.exists("/tmp/" + made))
 
     def test_exec_passes_the_exit_status_on(self):
         device = self.new_device()
@@ -149,7 +133,7 @@ class Packages(TestCase):
         status = os.stat(path)
         self.assertEqual((status.st_uid, status.st_gid), (5000, 5000))
         self.assertEqual(stat.S_IMODE(status.st_mode), 0o4751)
-        self.assertEqual(label(path), "org.example.a")
+        self.assertEqual(label_of(path), "org.example.a")
         link = device.app_path("org.example.a", "data/link")
         self.assertEqual(os.readlink(link), "/nowhere")
         self.assertEqual(os.lstat(link).st_uid, 5000)
@@ -171,8 +155,7 @@ class Packages(TestCase):
             file.write(b"the user's own")
         device.install(make_source(self.path("v2"), "org.example.a", "2.0.0",
                                    {"data/x": b"two", "data/new": b"new", "res/new": b""}))
-        with open(device.app_path("org.example.a", "data/x"), "rb") as file:
-            self.assertEqual(file.read(), b"the user's own")
+        self.assertEqual(read_bytes(device.app_path("org.example.a", "data/x")), b"the user's own")
         self.assertTrue(os.path.exists(device.app_path("org.example.a", "data/new")))
         self.assertEqual(os.listdir(device.app_path("org.example.a", "res")), ["new"])
         self.assertEqual(device.packages()[0]["version"], "2.0.0")
@@ -207,8 +190,7 @@ class State(TestCase):
                     input="secret word\n")
         path = os.path.join(device.path, "state/cloud.conf")
         self.assertEqual(stat.S_IMODE(os.stat(path).st_mode), 0o600)
-        with open(path) as file:
-            text = file.read()
+        text = read_file(path)
         self.assertIn("user=ada", text)
         self.assertIn("password=secret word", text)
 
@@ -220,8 +202,7 @@ class State(TestCase):
     def test_a_cloud_that_cannot_be_used_is_refused_and_changes_nothing(self):
         device = self.new_device()
         config = os.path.join(device.path, "state/cloud.conf")
-        with open(config) as file:
-            before = file.read()
+        before = read_file(config)
         kinds = ("that is no cloud: use file:///PATH, webdav+https://HOST/PATH or "
                  "s3+https://HOST/BUCKET/PREFIX")
         host = "the url's host is no name or address"
@@ -266,8 +247,7 @@ class State(TestCase):
             self.assertEqual(
                 self.set_cloud(device, "webdav+https://host/dav", *user, "--password-file", path),
                 (1, "", "quarn-device: cannot read %s: %s\n" % (path, problem)))
-        with open(config) as file:
-            self.assertEqual(file.read(), before)
+        self.assertEqual(read_file(config), before)
         # What the library takes for this machine itself is taken.
         for url in ("webdav+http://127.0.0.2/dav", "webdav+http://[::1]:8080/dav"):
             self.assertEqual(self.set_cloud(device, url, *user), (0, "", ""))
@@ -280,8 +260,9 @@ class State(TestCase):
             for end in ("\n", "\r\n", "", "\nsecond line\n"):
                 self.assertEqual(self.set_cloud(device, "webdav+https://host/dav", "--user", "ada",
                                                 input=password + end), (0, "", ""))
-                with open(os.path.join(device.path, "state/cloud.conf")) as file:
-                    value = re.search("^password=(.*)$", file.read(), re.MULTILINE).group(1)
+                value = re.search("^password=(.*)$",
+                                  read_file(os.path.join(device.path, "state/cloud.conf")),
+                                  re.MULTILINE).group(1)
                 self.assertEqual(value.replace("\\s", " ").replace("\\\\", "\\"), password)
 
     def test_whoever_sits_at_a_terminal_is_asked_for_the_password_and_does_not_see_it(self):
@@ -302,8 +283,8 @@ class State(TestCase):
         os.close(terminal)
         self.assertEqual(os.waitstatus_to_exitcode(os.waitpid(process, 0)[1]), 0)
         self.assertEqual(shown, b"Password: \r\n")
-        with open(os.path.join(device.path, "state/cloud.conf")) as file:
-            self.assertIn("password=secret word\n", file.read())
+        self.assertIn("password=secret word\n",
+                      read_file(os.path.join(device.path, "state/cloud.conf")))
 
     def test_create_refuses_a_cloud_that_cannot_be_used_and_makes_nothing(self):
         result = subprocess.run([TOOL, "create", self.path("d"), "--cloud", "s3+https://host"],
@@ -325,8 +306,7 @@ class State(TestCase):
         device.call("set", "cloud", "s3+https://s3.example.org/fleet/one", "--user", "key",
                     "--region", "eu-central-1", "--addressing", "virtual", "--ca-file", "own.pem",
                     input="secret\n", cwd=self.directory)
-        with open(os.path.join(device.path, "state/cloud.conf")) as file:
-            lines = file.read().splitlines()
+        lines = read_file(os.path.join(device.path, "state/cloud.conf")).splitlines()
         for line in ("url=s3+https://s3.example.org/fleet/one", "user=key", "password=secret",
                      "region=eu-central-1", "addressing=virtual",
                      "ca-file=" + os.path.join(self.directory, "own.pem")):

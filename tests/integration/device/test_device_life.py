@@ -10,27 +10,12 @@ import time
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import BIN_DIR, DEADLINE, TestCase, make_source, read_file, wait_until  # noqa: E402
+from quarn_test import (  # noqa: E402
+    BIN_DIR, DEADLINE, TestCase, make_source, processes_naming, read_bytes, read_file,
+    run_contained, wait_until)
 
 BUS = ("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus", "--object-path", "/",
        "--method")
-START = BUS + ("org.freedesktop.DBus.StartServiceByName", "org.orvane.Quarn", "0")
-
-
-def processes_naming(path):
-    """Processes whose command line or environment names `path`."""
-    found = []
-    for entry in os.listdir("/proc"):
-        if not entry.isdigit() or int(entry) == os.getpid():
-            continue
-        try:
-            for name in ("cmdline", "environ"):
-                with open("/proc/%s/%s" % (entry, name), "rb") as file:
-                    if path.encode() in file.read():
-                        found.append(int(entry))
-        except OSError:
-            continue
-    return found
 
 
 def kill_supervisor(device):
@@ -89,7 +74,7 @@ loop.run()
 
     def test_a_daemon_that_asks_for_its_restart_is_started_again(self):
         device = self.device_with(self.NAMED % "os._exit(255 if count < 3 else 0)")
-        device.exec(*START)
+        device.activate()
         wait_until(lambda: self.starts(device) == 3, "the daemon is started again")
         restarts = os.path.join(device.path, "run/restarts")
         wait_until(lambda: not os.path.exists(restarts), "its clean end is noticed")
@@ -97,7 +82,7 @@ loop.run()
 
     def test_restarts_are_bounded(self):
         device = self.device_with(self.NAMED % "os._exit(255)")
-        device.exec(*START)
+        device.activate()
         restarts = os.path.join(device.path, "run/restarts")
         wait_until(lambda: self.starts(device) == 6 and not os.path.exists(restarts),
                    "the device gives the daemon up")
@@ -108,7 +93,7 @@ loop.run()
         # A count that is there goes away with an end that is no failure.
         with open(os.path.join(device.path, "run/restarts"), "w") as file:
             file.write("1\n")
-        device.exec(*START)
+        device.activate()
         wait_until(lambda: not os.path.exists(os.path.join(device.path, "run/restarts"))
                    or self.starts(device) > 1, "its end is noticed")
         self.assertEqual(self.starts(device), 1)
@@ -118,30 +103,30 @@ loop.run()
         device = self.device_with(self.NAMED.replace(
             "loop =", "if count < 4:\n    os.kill(os.getpid(), (15, 1, 15)[count - 1])\nloop =") %
             "os._exit(0)")
-        device.exec(*START)
+        device.activate()
         self.assertEqual(self.starts(device), 4)
 
     def test_a_daemon_that_is_always_told_to_end_is_given_up(self):
         device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nkill -TERM $$\n')
-        result = device.exec(*START, check=False)
+        result = device.activate(check=False)
         self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
         self.assertEqual(self.starts(device), 6)
 
     def test_a_daemon_that_fails_before_it_has_its_name_is_not_started_again(self):
         device = self.device_with('#!/bin/sh\necho x >> "$QUARN_DEVICE_DIR/starts"\nexit 255\n')
-        result = device.exec(*START, check=False)
+        result = device.activate(check=False)
         self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
         self.assertEqual(self.starts(device), 1)
 
     def test_a_daemon_that_ends_without_its_name_fails_its_callers_at_once(self):
         device = self.device_with("#!/bin/sh\nexit 0\n")
-        result = device.exec(*START, check=False)
+        result = device.activate(check=False)
         self.assertIn("org.freedesktop.DBus.Error.Spawn.ChildExited", result.stderr)
 
     def test_a_daemon_that_dies_gives_its_power_lock_back(self):
         device = self.device_with('#!/bin/sh\nprintf "[cpu]\\npid=%d\\n" $$ > '
                                   '"$QUARN_DEVICE_DIR/state/power.ini"\nkill -9 $$\n')
-        device.exec(*START, check=False)
+        device.activate(check=False)
         self.assertNotIn("pid", read_file(os.path.join(device.path, "state/power.ini")))
 
     def test_the_daemon_runs_in_the_device(self):
@@ -149,7 +134,7 @@ loop.run()
                                   '"$QUARN_DEVICE_DIR/seen"\n')
         device.install(make_source(self.path("src"), "org.example.a", "1.0.0", {}))
         device.exec("touch", "/tmp/inside")
-        device.exec(*START, check=False)
+        device.activate(check=False)
         seen = read_file(os.path.join(device.path, "seen"))
         for line in ("QUARN_DEVICE_DIR=" + device.path,
                      "QUARN_CLOUD_CONFIG=%s/state/cloud.conf" % device.path,
@@ -162,7 +147,7 @@ class Daemon(TestCase):
     def test_nobody_waits_for_a_daemon_that_does_not_run_without_an_account(self):
         device = self.new_device(account=None)
         device.start()
-        result = device.exec(*START, check=False)
+        result = device.activate(check=False)
         self.assertIn("ChildExited", result.stderr)
         self.assertIn("no signed-in. Daemon stop", device.log())
 
@@ -204,7 +189,7 @@ class Daemon(TestCase):
         follower = subprocess.Popen([device.tool, "log", device.path, "--follow"],
                                     stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
         try:
-            device.exec(*START)
+            device.activate()
             for line in follower.stdout:
                 if "== main loop begin ==" in line:
                     break
@@ -234,8 +219,7 @@ class Daemon(TestCase):
         self.addCleanup(follower.kill)
         device.quarnctl("backup")
         device.wait_for_log("\\x1b]0;owned\\x07\\x1b[2J\\u{9b}31m\\x7f\\n")
-        with open(log, "rb") as file:
-            logged = file.read().split(b"\n", 1)[1]
+        logged = read_bytes(log).split(b"\n", 1)[1]
         self.assert_speaks_to_no_terminal(logged)
         self.assertIn(b"\\x9b31m", logged)
         shown = device.call("log", text=False).stdout
@@ -311,7 +295,7 @@ class Inside(TestCase):
     def test_a_directory_with_blanks_and_letters_of_the_world_is_a_device(self):
         device = self.new_device(name="my dévice & more")
         device.start()
-        device.exec(*START)
+        device.activate()
         self.assertIn("Quarn Daemon start", device.log())
 
     def test_a_user_without_rights_can_call_the_bus(self):
@@ -360,7 +344,7 @@ class Ends(TestCase):
     def test_stop_cleans_up_after_a_supervisor_that_was_killed(self):
         device = self.new_device()
         device.start()
-        device.exec(*START)
+        device.activate()
         device.exec("true", cwd=self.directory)
         kill_supervisor(device)
         device.stop()
@@ -370,18 +354,18 @@ class Ends(TestCase):
     def test_start_takes_over_after_a_supervisor_that_was_killed(self):
         device = self.new_device()
         device.start()
-        device.exec(*START)
+        device.activate()
         daemon = device.daemon_pid()
         kill_supervisor(device)
         device.start()
-        device.exec(*START)
+        device.activate()
         self.assertNotIn(device.daemon_pid(), (None, daemon))
 
     def test_stop_leaves_no_mount_and_no_socket(self):
         device = self.new_device()
         before = read_file("/proc/self/mounts")
         device.start()
-        device.exec(*START)
+        device.activate()
         self.assertEqual(read_file("/proc/self/mounts"), before)
         device.stop()
         self.assertEqual(read_file("/proc/self/mounts"), before)
@@ -410,9 +394,9 @@ class Ends(TestCase):
         device.tool = self.path("bin", "quarn-device")
         device.start()
         if any(os.path.exists(path) for path in ("/usr/sbin/quarnd", "/usr/local/sbin/quarnd")):
-            device.exec(*START)
+            device.activate()
         else:
-            self.assertIn("ChildExited", device.exec(*START, check=False).stderr)
+            self.assertIn("ChildExited", device.activate(check=False).stderr)
 
 
 class Contained(TestCase):
@@ -454,13 +438,9 @@ cat "$one/told"
         one, two = self.new_device("one"), self.new_device("two")
         source = make_source(self.path("src"), "org.example.a", "1.0.0",
                              {"data/x": b"content\n", "data/link": ("->", "x")})
-        # A place of its own for /opt, so that the machine's is not touched.
-        result = subprocess.run(
-            ["unshare", "-m", "sh", "-c",
-             'mount -t tmpfs none /opt && exec setpriv --bounding-set=-sys_admin '
-             '--inh-caps=-sys_admin sh -c "$0" sh "$@"',
-             self.SCRIPT, one.tool, one.path, two.path, source],
-            capture_output=True, text=True)
+        result = run_contained(
+            ["sh", "-c", self.SCRIPT, "sh", one.tool, one.path, two.path, source],
+            self.directory, capture_output=True, text=True)
         self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
         self.assertEqual(
             result.stdout,

@@ -9,12 +9,10 @@ import time
 import unittest
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import TestCase, has_ended, make_source, wait_until  # noqa: E402
 
 PACKAGE = "org.example.notes"
 FILES = 60
-START = ("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus", "--object-path", "/",
-         "--method", "org.freedesktop.DBus.StartServiceByName", "org.orvane.Quarn", "0")
 
 
 class Races(TestCase):
@@ -123,7 +121,7 @@ class Life(Races):
         for _ in range(3):
             tools = [self.begin("start") for _ in range(5)]
             self.assertEqual([self.outcome(tool) for tool in tools], [(0, "")] * 5)
-            self.device.exec(*START)
+            self.device.activate()
             self.assertEqual(len(self.supervisors()), 1)
             self.device.stop()
             self.assertEqual(self.supervisors(), [])
@@ -133,7 +131,7 @@ class Life(Races):
             tools = [self.begin(self.random.choice(("start", "stop"))) for _ in range(6)]
             self.assertEqual([self.outcome(tool) for tool in tools], [(0, "")] * 6, self.hint)
             self.device.start()
-            self.device.exec(*START)
+            self.device.activate()
         self.device.stop()
         self.assertEqual(self.supervisors(), [])
 
@@ -141,7 +139,7 @@ class Life(Races):
         for _ in range(6):
             self.kill_within(self.begin("start"), 0.1)
             self.device.start()
-            self.device.exec(*START)
+            self.device.activate()
             self.assertEqual(len(self.supervisors()), 1, self.hint)
             self.device.stop()
             self.assertEqual(self.supervisors(), [])
@@ -162,7 +160,7 @@ class Life(Races):
     def test_an_alarm_is_not_lost_to_a_kill_of_the_supervisor_or_the_daemon(self):
         for victim in ("supervisor", "daemon", "both"):
             self.device.start()
-            self.device.exec(*START)
+            self.device.activate()
             wait_until(self.device.alarms, "the alarm of the start")
             before = {alarm["id"] for alarm in self.device.alarms()}
             expired = self.device.log().count("was expired")
@@ -172,7 +170,7 @@ class Life(Races):
                 os.kill(supervisor, signal.SIGKILL)
             if victim != "supervisor":
                 self.kill_daemon()
-            wait_until(lambda: victim == "daemon" or self.gone(supervisor), "it is killed")
+            wait_until(lambda: victim == "daemon" or has_ended(supervisor), "it is killed")
             self.assertLessEqual(before, {alarm["id"] for alarm in self.device.alarms()})
             self.device.set("clock", "+50000")
             self.device.start()
@@ -182,14 +180,6 @@ class Life(Races):
 
     def kill_daemon(self):
         self.device.signal_daemon(signal.SIGKILL)
-
-    @staticmethod
-    def gone(pid):
-        try:
-            with open("/proc/%d/stat" % pid) as file:
-                return file.read().rsplit(")", 1)[1].split()[0] in "ZX"
-        except OSError:
-            return True
 
 
 class State(Races):

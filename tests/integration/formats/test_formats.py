@@ -14,7 +14,7 @@ import zlib
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), "../bus"))
 from bus_client import Client, Gio  # noqa: E402
-from quarn_test import TestCase, make_source, read_text  # noqa: E402
+from quarn_test import TestCase, make_source, read_bytes, read_file, read_text  # noqa: E402
 
 PAGE = os.path.join(os.path.dirname(os.path.abspath(__file__)), "../../../docs/formats.md")
 SERIAL = "350000000000001"
@@ -89,12 +89,10 @@ class Formats(TestCase):
 
     def test_list(self):
         self.device.quarnctl("backup", "--yes")
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            text = file.read()
+        text = read_file(os.path.join(self.device.cloud, "app_list/app_list.txt"))
         made = json.loads(text)
         package = made["model_list"][0]["pkg_list"][0]
-        with open(self.archive, "rb") as file:
-            crc = zlib.crc32(file.read())
+        crc = zlib.crc32(read_bytes(self.archive))
         self.assertEqual(package["crc"] % (1 << 32), crc)
         info = made["model_list"][0]["backup_info"]
         self.assertGreater(info["timestamp"], 1600000000000)
@@ -121,13 +119,11 @@ class Formats(TestCase):
 
     def test_the_same_data_makes_the_same_bytes_whatever_its_times(self):
         self.device.quarnctl("backup", "--yes")
-        with open(self.archive, "rb") as file:
-            first = file.read()
+        first = read_bytes(self.archive)
         os.utime(self.device.app_path(PACKAGE, "data/db/notes.db"), (1, 1))
         os.unlink(self.archive)
         self.device.quarnctl("app", "backup", PACKAGE)
-        with open(self.archive, "rb") as file:
-            self.assertEqual(file.read(), first)
+        self.assertEqual(read_bytes(self.archive), first)
 
     def test_state(self):
         self.device.quarnctl("backup", "--yes")

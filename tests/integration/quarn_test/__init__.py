@@ -6,12 +6,16 @@ shown when the test failed. One module a subject; tests take what they need from
 from .applications import APPLICATION, application, as_application, exchange_names
 from .case import TestCase
 from .devices import Device
-from .files import read_file, read_text, tree
+from .files import label_of, read_bytes, read_file, read_text, tree
+from .places import enter_own_names, run_contained
+from .processes import daemons_of, has_ended, processes_naming
 from .programs import BIN_DIR, is_sanitized
-from .servers import AnsweringServer, silent_server
+from .servers import AnsweringServer, free_ports, silent_server
 from .sources import make_source
 from .waiting import DEADLINE, wait_until
 
 __all__ = ["APPLICATION", "BIN_DIR", "DEADLINE", "AnsweringServer", "Device", "TestCase",
-           "application", "as_application", "exchange_names", "is_sanitized", "make_source",
-           "read_file", "read_text", "silent_server", "tree", "wait_until"]
+           "application", "as_application", "daemons_of", "enter_own_names", "exchange_names",
+           "free_ports", "has_ended", "is_sanitized", "label_of", "make_source", "processes_naming",
+           "read_bytes", "read_file", "read_text", "run_contained", "silent_server", "tree",
+           "wait_until"]

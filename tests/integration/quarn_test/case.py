@@ -5,6 +5,7 @@ import tempfile
 import unittest
 
 from .devices import Device
+from .places import enter_own_mounts
 
 
 class TestCase(unittest.TestCase):
@@ -13,6 +14,7 @@ class TestCase(unittest.TestCase):
     maxDiff = None
 
     def run(self, result=None):
+        enter_own_mounts()
         self.directory = tempfile.mkdtemp(prefix="quarn-it-")
         self.devices = []
         failures = 0 if result is None else len(result.failures) + len(result.errors)

@@ -3,7 +3,8 @@ import json
 import os
 import subprocess
 
-from .files import read_text
+from .files import read_file, read_text
+from .processes import daemons_of
 from .programs import BIN_DIR
 from .waiting import wait_until
 
@@ -63,6 +64,13 @@ class Device:
     def exec(self, *command, check=True, **keywords):
         return self.call("exec", "--", *command, check=check, **keywords)
 
+    def activate(self, check=True):
+        """Have the bus start the daemon, which its first caller does otherwise."""
+        return self.exec("gdbus", "call", "--system", "--dest", "org.freedesktop.DBus",
+                         "--object-path", "/", "--method",
+                         "org.freedesktop.DBus.StartServiceByName", "org.orvane.Quarn", "0",
+                         check=check)
+
     def begin(self, *command, **keywords):
         """A command on the device that runs beside the test; its process."""
         return subprocess.Popen([self.tool, "exec", self.path, "--", *command], **keywords)
@@ -97,25 +105,16 @@ class Device:
         """Where a package's archive lies in the cloud that is a folder of the device."""
         return os.path.join(self.cloud, self.serial, package, version, package + ".zip")
 
+    def app_list(self):
+        """The application list of that cloud."""
+        return json.loads(read_file(os.path.join(self.cloud, "app_list/app_list.txt")))
+
     def bus_address(self):
         return "unix:path=" + os.path.join(self.path, "run/bus")
 
     def daemon_pid(self):
         """The daemon's process, None when it does not run."""
-        wanted = ("QUARN_DEVICE_DIR=" + self.path).encode()
-        for entry in os.listdir("/proc"):
-            if not entry.isdigit():
-                continue
-            try:
-                with open("/proc/%s/comm" % entry) as file:
-                    if file.read().strip() != "quarnd":
-                        continue
-                with open("/proc/%s/environ" % entry, "rb") as file:
-                    if wanted in file.read().split(b"\0"):
-                        return int(entry)
-            except OSError:
-                continue
-        return None
+        return next(iter(daemons_of(self.path)), None)
 
     def daemon_memory_kb(self):
         """Memory that the daemon alone takes, and its share of what others use as well."""

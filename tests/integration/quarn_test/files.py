@@ -9,13 +9,29 @@ def read_file(path):
         return file.read()
 
 
+def read_bytes(path):
+    """The same of one that is no text."""
+    with open(path, "rb") as file:
+        return file.read()
+
+
 def read_text(path):
-    """"" when there is none."""
+    """What can be read as text, "" when there is no file."""
     try:
         with open(path, errors="replace") as file:
             return file.read()
     except OSError:
         return ""
+
+
+def label_of(path):
+    """A file's label, wherever the kernel lets it be kept; None when it has none."""
+    for name in ("security.SMACK64", "user.quarn.SMACK64"):
+        try:
+            return os.getxattr(path, name, follow_symlinks=False).decode()
+        except OSError:
+            continue
+    return None
 
 
 def tree(root, folders=("",), labels=()):
@@ -31,8 +47,7 @@ def tree(root, folders=("",), labels=()):
                 if stat.S_ISLNK(status.st_mode):
                     content = os.readlink(path)
                 elif stat.S_ISREG(status.st_mode):
-                    with open(path, "rb") as file:
-                        content = file.read()
+                    content = read_bytes(path)
                 kept = {key: os.getxattr(path, key, follow_symlinks=False)
                         for key in os.listxattr(path, follow_symlinks=False) if key in labels}
                 found[os.path.relpath(path, root)] = (content, status.st_mode, status.st_uid,

@@ -55,6 +55,20 @@ class AnsweringServer:
         self.server.server_close()
 
 
+def free_ports(count):
+    """Ports for servers that have to be told theirs. On each a connection has just ended, first from
+    the side of the port: for a minute the system gives it to nobody who asks for any, and only a
+    server that names it gets it (SO_REUSEADDR, which servers set, see socket(7))."""
+    ports = []
+    for _ in range(count):
+        with socket.create_server(("127.0.0.1", 0)) as listener:
+            with socket.create_connection(listener.getsockname()) as client:
+                listener.accept()[0].close()
+                client.recv(1)
+            ports.append(listener.getsockname()[1])
+    return ports
+
+
 def silent_server():
     """A socket that takes connections and never answers; to be closed by who asked for it."""
     return socket.create_server(("127.0.0.1", 0), backlog=128)

@@ -7,7 +7,7 @@ import unittest
 import zipfile
 
 sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), ".."))
-from quarn_test import AnsweringServer, TestCase, make_source  # noqa: E402
+from quarn_test import AnsweringServer, TestCase, make_source, read_file  # noqa: E402
 
 
 def objects(device):
@@ -27,13 +27,8 @@ def folders(device):
     return found
 
 
-def app_list(device):
-    with open(os.path.join(device.cloud, "app_list/app_list.txt")) as file:
-        return json.load(file)
-
-
 def entry_of(device, serial):
-    for entry in app_list(device)["model_list"]:
+    for entry in device.app_list()["model_list"]:
         info = entry.get("backup_info") if isinstance(entry, dict) else None
         if isinstance(info, dict) and info.get("serial_number") == serial:
             return entry
@@ -66,7 +61,7 @@ class BackupStory(TestCase):
         self.assertEqual(objects(self.device),
                          {"app_list/app_list.txt", self.archive("org.example.alpha"),
                           self.archive("org.example.beta")})
-        document = app_list(self.device)
+        document = self.device.app_list()
         self.assertEqual(list(document), ["format_ver", "model_list"])
         self.assertEqual(document["format_ver"], 1)
         self.assertEqual(len(document["model_list"]), 1)
@@ -198,8 +193,7 @@ class BackupStory(TestCase):
         with open(os.path.join(self.device.cloud, "app_list/app_list.txt"), "w") as file:
             file.write(text)
         self.backup(expected=12)
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            self.assertEqual(file.read(), text)
+        self.assertEqual(read_file(os.path.join(self.device.cloud, "app_list/app_list.txt")), text)
         self.assertIn("format version in json changed", self.device.log())
 
     def test_hostile_lists_never_crash_the_daemon_nor_lose_an_entry(self):
@@ -217,7 +211,7 @@ class BackupStory(TestCase):
         with open(path, "w") as file:
             json.dump({"format_ver": 1, "model_list": odd + [other]}, file)
         self.backup()
-        models = app_list(self.device)["model_list"]
+        models = self.device.app_list()["model_list"]
         self.assertIn(other, models)
         for entry in odd[:-1]:
             self.assertIn(entry, models)
@@ -331,8 +325,7 @@ class BackupStory(TestCase):
         folder = self.device.app_path("org.example.alpha", "shared/data")
         self.assertEqual(sorted(os.listdir(folder)), sorted(names))
         for name in names:
-            with open(os.path.join(folder, name)) as file:
-                self.assertEqual(file.read(), "own " + name)
+            self.assertEqual(read_file(os.path.join(folder, name)), "own " + name)
 
     def test_symbolic_links_out_of_the_application_are_recorded_but_not_read(self):
         os.symlink("/etc/shadow", self.device.app_path("org.example.alpha", "data/link"))

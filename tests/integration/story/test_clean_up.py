@@ -10,7 +10,7 @@ import unittest
 sys.path[:0] = [os.path.join(os.path.dirname(os.path.abspath(__file__)), folder)
                 for folder in ("..", "../bus")]
 from bus_client import Client, GLib  # noqa: E402
-from quarn_test import TestCase, make_source, wait_until  # noqa: E402
+from quarn_test import TestCase, make_source, read_bytes, read_file, wait_until  # noqa: E402
 
 SERIAL = "350000000000001"
 OTHER = "350000000000002"
@@ -35,11 +35,10 @@ class CleanUp(TestCase):
         name = "src-%s-%d" % (package, len(os.listdir(self.directory)))
         device.install(make_source(self.path(name), package, version, {"data/file": content}))
 
-    def entries(self, cloud=None):
-        with open(os.path.join(cloud or self.device.cloud, "app_list/app_list.txt")) as file:
-            for entry in json.load(file)["model_list"]:
-                if entry["backup_info"]["serial_number"] == SERIAL:
-                    return {package["pkg_id"]: package for package in entry["pkg_list"]}
+    def entries(self):
+        for entry in self.device.app_list()["model_list"]:
+            if entry["backup_info"]["serial_number"] == SERIAL:
+                return {package["pkg_id"]: package for package in entry["pkg_list"]}
         return {}
 
     def archive(self, package, version="1.0"):
@@ -113,8 +112,7 @@ class CleanUp(TestCase):
         path = self.device.app_path(GONE, "data/file")
 
         def is_back():
-            with open(path, "rb") as file:
-                return file.read() == b"of " + GONE.encode()
+            return read_bytes(path) == b"of " + GONE.encode()
         client.until(lambda: self.stops(client) and is_back(), "the data is back")
         self.backup()
         self.assertEqual(set(self.entries()), {HERE, GONE})
@@ -133,8 +131,7 @@ class CleanUp(TestCase):
         self.assert_removed()
 
     def content(self, package):
-        with open(self.device.app_path(package, "data/file"), "rb") as file:
-            return file.read()
+        return read_bytes(self.device.app_path(package, "data/file"))
 
     def set_network(self, network, wifi):
         """Network and packages are told by different services, so that what is told of one may
@@ -239,8 +236,8 @@ class CleanUp(TestCase):
             ends = [(run.communicate(timeout=120)[0], run.returncode) for run in backups]
         self.assertEqual([status for _out, status in ends], [0] * len(backups), ends)
         for package in packages:
-            with open(self.device.app_path(package, "data/file"), "rb") as file:
-                self.assertEqual(file.read(), b"old data of " + package.encode())
+            self.assertEqual(read_bytes(self.device.app_path(package, "data/file")),
+                             b"old data of " + package.encode())
         self.backup()
         self.assertEqual(set(self.entries()), set(packages) | {HERE})
         for package in packages:
@@ -342,8 +339,8 @@ class Causes(TestCase):
         self.assertEqual(failed.stderr, "quarnctl: backup failed: the application list is larger "
                                         "than what devices can read (42)\n")
         self.assertNotIn("uploading", failed.stdout)
-        with open(os.path.join(self.device.cloud, "app_list/app_list.txt")) as file:
-            self.assertEqual(file.read(), before)
+        self.assertEqual(
+            read_file(os.path.join(self.device.cloud, "app_list/app_list.txt")), before)
 
     def test_packages_that_are_not_backed_up_are_told_apart(self):
         deep = self.device.app_path(HERE, "data")

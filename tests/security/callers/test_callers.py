@@ -12,7 +12,7 @@ sys.path.insert(0, os.path.join(HERE, "../../integration/bus"))
 from bus_client import INTERFACE, NAME, PATH, Client, request  # noqa: E402
 from gi.repository import GLib  # noqa: E402
 from quarn_test import (  # noqa: E402
-    APPLICATION, TestCase, is_sanitized, make_source, wait_until)
+    APPLICATION, TestCase, is_sanitized, make_source, read_bytes, wait_until)
 
 STRANGER = 65534
 NOTES = "org.example.notes"
@@ -142,8 +142,7 @@ class Outsiders(Attack):
         self.assertFalse(os.path.exists(os.path.join(self.device.path, "root/tmp",
                                                      NOTES + "_tmp.zip")))
         self.assertEqual(os.listdir(self.device.app_path(COMPANION, "shared/data")), [])
-        with open(self.device.app_path(NOTES, "data/note"), "rb") as file:
-            self.assertEqual(file.read(), b"mine")
+        self.assertEqual(read_bytes(self.device.app_path(NOTES, "data/note")), b"mine")
 
     def test_nor_by_the_name_of_the_daemons_own_connection(self):
         client = self.new_client()

@@ -11,7 +11,7 @@ import unittest
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
 from quarn_test import (  # noqa: E402
-    APPLICATION, TestCase, as_application, exchange_names, make_source, wait_until)
+    APPLICATION, TestCase, as_application, exchange_names, make_source, read_file, wait_until)
 
 PACKAGE = "org.example.notes"
 EXCHANGE = 2
@@ -50,8 +50,7 @@ class Installer(TestCase):
                        "EXCHANGE_OTHER": self.app_path("link"), "EXCHANGE_COUNT": count,
                        "ASAN_OPTIONS": "verify_asan_link_order=0"}
         self.device.call("install", self.path("next"), check=False, env=environment)
-        with open(count) as file:
-            return int(file.read())
+        return int(read_file(count))
 
     def updates_against(self, folder):
         """Updates that add a file to a folder which the application exchanges for a link, each at

@@ -11,7 +11,7 @@ import unittest
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(HERE, "../../integration"))
 from quarn_test import (  # noqa: E402
-    BIN_DIR, TestCase, is_sanitized, make_source, wait_until)
+    BIN_DIR, TestCase, is_sanitized, make_source, read_bytes, read_file, wait_until)
 
 import system_calls  # noqa: E402
 
@@ -23,8 +23,7 @@ BOTH = ("quarnd.service", "quarnd-recover.service")
 
 def table(heading):
     """First cells of the table below a heading of the threat model."""
-    with open(MODEL) as file:
-        text = file.read()
+    text = read_file(MODEL)
     section = text[text.index("\n#### " + heading):].split("\n#", 2)[1]
     rows = [re.split(r"(?<!\\)\|", line)[1].strip() for line in section.splitlines()
             if line.startswith("|")]
@@ -139,8 +138,7 @@ class WithTheUnitsCapabilities(TestCase):
         for path in self.FILES:
             name = self.device.app_path(self.PACKAGE, path)
             status = os.stat(name)
-            with open(name, "rb") as file:
-                found[path] = (file.read(), status.st_mode & 0o7777, status.st_uid, status.st_gid)
+            found[path] = (read_bytes(name), status.st_mode & 0o7777, status.st_uid, status.st_gid)
         return found
 
     def test_backup_export_and_restore(self):
@@ -150,8 +148,7 @@ class WithTheUnitsCapabilities(TestCase):
                          before)
         self.device.quarnctl("backup")
         pid = wait_until(self.device.daemon_pid, "the daemon runs")
-        with open("/proc/%d/status" % pid) as file:
-            status = file.read()
+        status = read_file("/proc/%d/status" % pid)
         effective = re.search(r"CapEff:\s+([0-9a-f]+)", status).group(1)
         # CHOWN, DAC_OVERRIDE, FOWNER, FSETID, SETGID, SETUID, MAC_OVERRIDE, MAC_ADMIN
         self.assertEqual(0x3000000db, int(effective, 16))

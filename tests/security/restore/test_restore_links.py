@@ -11,7 +11,7 @@ sys.path.insert(0, os.path.join(HERE, "../../integration"))
 sys.path.insert(0, os.path.join(HERE, ".."))
 from kernel_settings import kernel_settings  # noqa: E402
 from quarn_test import (  # noqa: E402
-    APPLICATION, TestCase, application, as_application, exchange_names, make_source)
+    APPLICATION, TestCase, application, as_application, exchange_names, make_source, read_bytes)
 
 SERIAL = "350000000000001"
 PACKAGE = "org.example.notes"
@@ -23,8 +23,7 @@ SNAPSHOT = "shared/data/quarn_tmp_rst_dir"
 
 def attributes(path):
     status = os.lstat(path)
-    with open(path, "rb") as file:
-        content = file.read()
+    content = read_bytes(path)
     labels = {key: os.getxattr(path, key) for key in os.listxattr(path)}
     return (content, status.st_mode, status.st_uid, status.st_gid, labels)
 
@@ -92,8 +91,7 @@ class RestoreLinks(TestCase):
                 path = os.path.join(folder, name)
                 if os.path.samefile(path, self.secret) or os.lstat(path).st_uid != APPLICATION:
                     continue
-                with open(path, "rb") as file:
-                    self.assertNotIn(SECRET, file.read(), path)
+                self.assertNotIn(SECRET, read_bytes(path), path)
 
     def restores_against(self, work):
         self.before = attributes(self.secret)

@@ -21,6 +21,7 @@
 #include "mock_transport.h"
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
+#include "run_until.h"
 
 namespace {
 
@@ -111,12 +112,6 @@ class CloudSessionTest : public ::testing::Test {
         },
         new std::function<void()>(std::move(work)),
         [](gpointer data) { delete static_cast<std::function<void()> *>(data); });
-  }
-
-  /** Serve the main loop until @p done. */
-  template <typename Done>
-  static void serve_until(Done done) {
-    while (!done()) g_main_context_iteration(nullptr, FALSE);
   }
 
   NiceMock<MockPlatform> platform;
@@ -257,7 +252,7 @@ TEST_F(CloudSessionTest, ACallFromWithinTheWaitSharesAFailureToo) {
 
 TEST_F(CloudSessionTest, AnotherThreadWaitsOnAConditionWhileTheMainLoopAnswers) {
   auto worker = std::async(std::launch::async, [] { return cloud_initialized(); });
-  serve_until([this] { return request_count() == 1; });
+  ASSERT_TRUE(run_until([this] { return request_count() == 1; }));
   answer(0, BACKUP_TRANS_ERROR_NONE);
   EXPECT_TRUE(worker.get());
   EXPECT_EQ(cloud_handler(), handle);
@@ -268,7 +263,7 @@ TEST_F(CloudSessionTest, AnotherThreadSharesTheMainThreadsAttempt) {
   std::future<bool> worker;
   on_main_loop([this, &worker] {
     worker = std::async(std::launch::async, [] { return cloud_initialized(); });
-    serve_until([] { return count_logged(DLOG_INFO, "try to init cloud") == 2; });
+    ASSERT_TRUE(run_until([] { return count_logged(DLOG_INFO, "try to init cloud") == 2; }));
     on_main_loop([this] { answer(0, BACKUP_TRANS_ERROR_NONE); });
   });
   EXPECT_TRUE(cloud_initialized());
@@ -278,7 +273,7 @@ TEST_F(CloudSessionTest, AnotherThreadSharesTheMainThreadsAttempt) {
 
 TEST_F(CloudSessionTest, TheMainThreadSharesAnotherThreadsAttempt) {
   auto worker = std::async(std::launch::async, [] { return cloud_initialized(); });
-  serve_until([this] { return request_count() == 1; });
+  ASSERT_TRUE(run_until([this] { return request_count() == 1; }));
   on_main_loop([this] { answer(0, BACKUP_TRANS_ERROR_NONE); });
   EXPECT_TRUE(cloud_initialized());
   EXPECT_TRUE(worker.get());
@@ -304,8 +299,8 @@ TEST_F(CloudSessionTest, ManyThreadsShareOneAttempt) {
   for (int i = 0; i < kThreads; ++i) {
     workers.push_back(std::async(std::launch::async, [] { return cloud_initialized(); }));
   }
-  serve_until([] { return count_logged(DLOG_INFO, "try to init cloud") == kThreads; });
-  serve_until([this] { return request_count() == 1; });
+  ASSERT_TRUE(run_until([] { return count_logged(DLOG_INFO, "try to init cloud") == kThreads; }));
+  ASSERT_TRUE(run_until([this] { return request_count() == 1; }));
   answer(0, BACKUP_TRANS_ERROR_NONE);
   for (auto &worker : workers) EXPECT_TRUE(worker.get());
   EXPECT_EQ(request_count(), 1U);
@@ -332,7 +327,7 @@ TEST_F(CloudSessionTest, EveryRequestOnAFiberHasTheAnswer) {
   }
   EXPECT_EQ(ready, 0);
   answer(0, BACKUP_TRANS_ERROR_NONE);
-  serve_until([&ready] { return ready == kRequests; });
+  ASSERT_TRUE(run_until([&ready] { return ready == kRequests; }));
   EXPECT_EQ(request_count(), 1U);
 }
 
@@ -345,11 +340,11 @@ TEST_F(CloudSessionTest, WhoWithdrawsLeavesTheAttemptToTheOthers) {
   });
   run_on_fiber([&] { results.emplace_back(cloud_initialized() ? "second ready" : "second not"); });
   EXPECT_TRUE(withdraw_waits(first));
-  serve_until([&results] { return results.size() == 1; });
+  ASSERT_TRUE(run_until([&results] { return results.size() == 1; }));
   run_on_fiber([&] { results.emplace_back(cloud_initialized() ? "third ready" : "third not"); });
   EXPECT_EQ(request_count(), 1U) << "the third shares it";
   answer(0, BACKUP_TRANS_ERROR_NONE);
-  serve_until([&results] { return results.size() == 3; });
+  ASSERT_TRUE(run_until([&results] { return results.size() == 3; }));
   EXPECT_EQ(results, (std::vector<std::string>{"first not", "second ready", "third ready"}));
   EXPECT_EQ(count_logged(DLOG_ERROR, kTimeOutText), 0);
 }

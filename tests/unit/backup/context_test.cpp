@@ -17,6 +17,7 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/nested_loop.h"
 #include "quarn_d_utils/package_lock.h"
+#include "run_until.h"
 
 namespace {
 
@@ -130,9 +131,7 @@ TEST_F(Context, RequestsOnFibersHaveTheArchiveInTheirOrder) {
   EXPECT_TRUE(order.empty());
   release_staged_archive(holder_.get(), "org.app");
   for (auto &request : requests) {
-    while (!holds_staged_archive(request.get(), "org.app")) {
-      g_main_context_iteration(nullptr, TRUE);
-    }
+    ASSERT_TRUE(run_until([&] { return holds_staged_archive(request.get(), "org.app"); }));
     release_staged_archive(request.get(), "org.app");
   }
   EXPECT_THAT(order, ::testing::ElementsAre("first", "second", "third"));
@@ -150,10 +149,10 @@ TEST_F(Context, ARequestOnAFiberWaitsForAnothersPackingWhileTheLoopGoesOn) {
         return G_SOURCE_REMOVE;
       },
       &served);
-  while (!served) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return served; }));
   EXPECT_FALSE(taken);
   std::thread([&] { export_of_another.reset(); }).join();
-  while (!taken) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return taken; }));
   EXPECT_TRUE(holds_staged_archive(other_.get(), "org.second"));
 }
 
@@ -166,7 +165,7 @@ TEST_F(Context, ARequestThatIsWithdrawnWhileAnotherIsPackedGivesItsPlaceBack) {
     taken = acquire_staged_archive(other_.get(), "org.second");
   });
   EXPECT_TRUE(withdraw_waits(number));
-  while (taken) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return !taken; }));
   EXPECT_FALSE(holds_staged_archive(other_.get(), "org.second"));
 }
 
@@ -178,7 +177,7 @@ TEST_F(Context, AWithdrawnRequestWaitsForNoArchive) {
     taken = acquire_staged_archive(other_.get(), "org.app");
   });
   EXPECT_TRUE(withdraw_waits(number));
-  while (taken) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return !taken; }));
   EXPECT_EQ(count_logged(DLOG_ERROR, "gave up waiting for the archive of (org.app)"), 1);
   EXPECT_TRUE(holds_staged_archive(holder_.get(), "org.app"));
 }

@@ -2,18 +2,14 @@
 #include <libxml/parser.h>
 #include <libxml/tree.h>
 
-#include <fstream>
 #include <string>
+
+#include "test_files.h"
 
 namespace {
 
 bool library_is_loaded() {
-  std::ifstream maps("/proc/self/maps");
-  std::string line;
-  while (std::getline(maps, line)) {
-    if (line.find("/libxml2.so") != std::string::npos) return true;
-  }
-  return false;
+  return read_text("/proc/self/maps").find("/libxml2.so") != std::string::npos;
 }
 
 std::string text(const xmlChar *value) {

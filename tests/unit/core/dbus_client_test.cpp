@@ -7,6 +7,7 @@
 #include "glib_handles.h"
 #include "log_capture.h"
 #include "quarn_common.h"
+#include "run_until.h"
 #include "scripted_client.h"
 
 namespace {
@@ -383,8 +384,7 @@ class Publish : public ::testing::Test {
         g_dbus_connection_close_sync(connection, nullptr, nullptr);
       }
     }
-    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-    }
+    run_pending();
   }
   static void on_signal(GDBusConnection *, const gchar *, const gchar *path, const gchar *,
                         const gchar *signal, GVariant *parameters, gpointer self) {

@@ -33,6 +33,7 @@
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_introspection.h"
 #include "quarn_dbus_limits.h"
+#include "run_until.h"
 #include "scripted_client.h"
 #include "temp_dir.h"
 
@@ -157,8 +158,7 @@ class Server : public ::testing::Test {
     kept_records = nullptr;
     client_.reset();
     quarnd_dbus_deinit(owner_id_);
-    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-    }
+    run_pending();
   }
   /** Steps of a call after the cancelled timer. */
   static Texts after_cancel() {

@@ -12,6 +12,7 @@
 #include "lifecycle_world.h"
 #include "log_capture.h"
 #include "quarn_d_lifecycle.h"
+#include "run_until.h"
 
 namespace {
 
@@ -23,11 +24,6 @@ Texts steps;
 void give_up() { steps.emplace_back("give up"); }
 void take_back() { steps.emplace_back("take back"); }
 
-void run_what_waits() {
-  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-  }
-}
-
 class End : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -37,7 +33,7 @@ class End : public ::testing::Test {
     restart();
   }
   void TearDown() override {
-    run_what_waits();
+    run_pending();
     set_quarn_bus_name({nullptr, nullptr});
   }
   static void restart() {
@@ -46,13 +42,8 @@ class End : public ::testing::Test {
     lifecycle_idle = true;
     clear_captured_log();
   }
-  /** Run the loop until it was quit, at the most for some seconds. */
   static bool is_quit_later() {
-    const gint64 end = g_get_monotonic_time() + 5 * G_USEC_PER_SEC;
-    while (lifecycle_quits == 0 && g_get_monotonic_time() < end) {
-      g_main_context_iteration(nullptr, TRUE);
-    }
-    return lifecycle_quits > 0;
+    return run_until([] { return lifecycle_quits > 0; });
   }
   /** The end is asked for and a call that waits already brings work. */
   static void end_with_work_waiting() {
@@ -65,7 +56,7 @@ class End : public ::testing::Test {
         },
         nullptr, nullptr);
     request_quarn_terminate(0.0, false);
-    run_what_waits();
+    run_pending();
   }
 };
 
@@ -73,7 +64,7 @@ TEST_F(End, GivesTheNameUpBeforeTheLoopIsQuit) {
   request_quarn_terminate(0.0, true);
   EXPECT_EQ(steps, Texts{"give up"});
   EXPECT_EQ(lifecycle_quits, 0);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, Texts{"give up"});
   EXPECT_EQ(lifecycle_quits, 1);
   EXPECT_EQ(quarn_exit_code, -1);
@@ -89,7 +80,7 @@ TEST_F(End, WhatHasArrivedIsDispatchedFirst) {
       },
       &quits_seen, nullptr);
   request_quarn_terminate(0.0, false);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(quits_seen, 0);
   EXPECT_EQ(lifecycle_quits, 1);
 }
@@ -97,11 +88,11 @@ TEST_F(End, WhatHasArrivedIsDispatchedFirst) {
 TEST_F(End, CallThatHasArrivedKeepsTheDaemonAndTheNameIsTakenBack) {
   request_quarn_terminate(0.0, false);
   cancel_quarn_terminate();
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, (Texts{"give up", "take back"}));
   EXPECT_EQ(lifecycle_quits, 0);
   note_quarn_name(true);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(lifecycle_quits, 0);
   EXPECT_EQ(count_logged(DLOG_INFO, "termination cancelled"), 1);
 }
@@ -110,7 +101,7 @@ TEST_F(End, DeactivationThatHasArrivedLetsTheEndGoOn) {
   request_quarn_terminate(0.0, false);
   cancel_quarn_terminate();
   request_quarn_terminate(0.0, false);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, Texts{"give up"});
   EXPECT_EQ(lifecycle_quits, 1);
 }
@@ -126,9 +117,9 @@ TEST_F(End, ProcessThatLeavesMeanwhileDoesNotAskForTheNameAgain) {
   cancel_quarn_terminate();
   lifecycle_idle = false;
   leave_quarn_for_good();
-  run_what_waits();
+  run_pending();
   request_quarn_terminate(0.0, false);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, Texts{"give up"});
   EXPECT_EQ(lifecycle_quits, 0);
 }
@@ -138,7 +129,7 @@ TEST_F(End, WithTheNameBackTheNextEndBeginsAnew) {
   note_quarn_name(true);
   lifecycle_idle = true;
   request_quarn_terminate(0.0, false);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, (Texts{"give up", "take back", "give up"}));
   EXPECT_EQ(lifecycle_quits, 1);
 }
@@ -146,11 +137,11 @@ TEST_F(End, WithTheNameBackTheNextEndBeginsAnew) {
 TEST_F(End, EndAskedForWhileTheNameIsTakenBackFollowsIt) {
   request_quarn_terminate(0.0, false);
   cancel_quarn_terminate();
-  run_what_waits();
+  run_pending();
   begin_quarn_end();
   EXPECT_EQ(lifecycle_quits, 0);
   note_quarn_name(true);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, (Texts{"give up", "take back", "give up"}));
   EXPECT_EQ(lifecycle_quits, 1);
 }
@@ -175,16 +166,16 @@ TEST_F(End, WithoutTheNameTheWorkIsFinishedFirst) {
 
 TEST_F(End, NameThatIsLostWithoutAnEndChangesNothing) {
   note_quarn_name(false);
-  run_what_waits();
+  run_pending();
   request_quarn_terminate(0.0, false);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, Texts{"give up"});
 }
 
 TEST_F(End, TimerThatFindsTheDaemonBusyDoesNotEndIt) {
   lifecycle_idle = false;
   terminate_cb(nullptr);
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, (Texts{"give up", "take back"}));
   EXPECT_EQ(lifecycle_quits, 0);
 }
@@ -192,7 +183,7 @@ TEST_F(End, TimerThatFindsTheDaemonBusyDoesNotEndIt) {
 TEST_F(End, DaemonThatIsToGoGoesAsSoonAsItIsIdle) {
   lifecycle_idle = false;
   end_quarn_when_idle();
-  run_what_waits();
+  run_pending();
   EXPECT_EQ(steps, Texts{});
   lifecycle_idle = true;
   EXPECT_TRUE(is_quit_later());
@@ -220,7 +211,7 @@ TEST_F(End, WorkKeepsADaemonThatIsToGoUntilItIsDone) {
                         lifecycle_idle = true;
                       }});
   end_quarn_when_idle();
-  while (steps.size() < 2) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return steps.size() >= 2; }));
   EXPECT_EQ(lifecycle_quits, 0);
   note_quarn_name(true);
   EXPECT_TRUE(is_quit_later());

@@ -24,7 +24,8 @@
 #include "quarn_d_utils/fiber.h"
 #include "quarn_d_utils/handles.h"
 #include "quarn_d_utils/nested_loop.h"
-#include "resident_memory.h"
+#include "run_until.h"
+#include "this_process.h"
 
 namespace {
 
@@ -378,7 +379,7 @@ TEST_F(Loop, AWithdrawnRequestWaitsNoLongerAndNeverAgain) {
   EXPECT_FALSE(other_over);
   EXPECT_FALSE(waits_are_ended());
   g_main_loop_quit(other.get());
-  while (!other_over) g_main_context_iteration(nullptr, FALSE);
+  ASSERT_TRUE(run_until([&] { return other_over; }));
 }
 
 TEST_F(Loop, WhatIsAnsweredAlreadyIsNotWithdrawn) {

@@ -36,6 +36,7 @@
 #include "quarn_dbus_client.h"
 #include "quarn_dbus_server.h"
 #include "quarn_log.h"
+#include "run_until.h"
 
 namespace {
 
@@ -358,8 +359,7 @@ TEST_F(Main, ServiceManagersAnswerToTheNameGivenUpLeavesTimeForTheWork) {
   answer_to_given_up_name = true;
   EXPECT_EQ(hooks.take(SIGTERM), 80000);
   EXPECT_EQ(steps, Texts{});
-  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-  }
+  run_pending();
   EXPECT_EQ(steps, Texts{"end_when_idle"});
 }
 
@@ -368,8 +368,7 @@ TEST_F(Main, CancelFromTheNextProcessIsCarriedOutOnTheMainThread) {
   restart();
   EXPECT_LT(hooks.take(kCancelSignal), 0);
   EXPECT_FALSE(manual_backup_canceled);
-  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-  }
+  run_pending();
   EXPECT_TRUE(manual_backup_canceled);
   EXPECT_EQ(captured_texts(), (Texts{"cancel from the next process", "cancel_backup"}));
 }
@@ -380,8 +379,7 @@ TEST_F(Main, WithdrawalsFromTheNextProcessAreCarriedOutOnTheMainThread) {
   turn_lines = {":1.5", ":1.7"};
   EXPECT_LT(hooks.take(kWithdrawSignal), 0);
   EXPECT_EQ(steps, Texts{});
-  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-  }
+  run_pending();
   EXPECT_EQ(steps, (Texts{"cancel_own :1.5", "cancel_own :1.7"}));
 }
 
@@ -391,8 +389,7 @@ TEST_F(Main, IdleProcessLeavesForTheRequestsOfTheNext) {
   const auto leave = [] {
     turn_lines = {kLeaveLine};
     hooks.take(kWithdrawSignal);
-    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-    }
+    run_pending();
     return std::exchange(steps, {});
   };
   EXPECT_EQ(leave(), Texts{"terminate"});

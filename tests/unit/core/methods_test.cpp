@@ -2,21 +2,13 @@
 
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
 #include "glib_handles.h"
+#include "test_files.h"
 
 namespace {
-
-std::string documentation() {
-  std::ifstream file(QUARN_DBUS_PAGE);
-  std::stringstream content;
-  content << file.rdbuf();
-  return content.str();
-}
 
 /** A row of the page's table of methods, up to its reply. */
 std::string row_of(const quarn_method &method) {
@@ -47,14 +39,14 @@ std::string rights_of(const quarn_method &method) {
 }
 
 TEST(Documentation, HasEachMethodWithItsArgumentsAndReply) {
-  const std::string page = documentation();
+  const std::string page = read_text(QUARN_DBUS_PAGE);
   for (const quarn_method &method : kQuarnMethods) {
     EXPECT_NE(page.find(row_of(method)), std::string::npos) << row_of(method);
   }
 }
 
 TEST(Documentation, SaysWhoMayCallEachMethod) {
-  const std::string page = documentation();
+  const std::string page = read_text(QUARN_DBUS_PAGE);
   std::istringstream lines(page.substr(page.find("\n## Who may call")));
   std::vector<std::string> rows;
   for (std::string line; std::getline(lines, line);) {

@@ -12,6 +12,7 @@
 #include "quarn_d_restore/quarn_d_restore.h"
 #include "quarn_d_utils/power.h"
 #include "quarn_dbus_server.h"
+#include "run_until.h"
 #include "scripted_client.h"
 
 namespace {
@@ -66,8 +67,7 @@ class Termination : public ::testing::Test {
     client_.reset();
     quarnd_dbus_deinit(owner_id_);
     quarn_loop_shutdown();
-    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-    }
+    run_pending();
   }
 
   /** Run the loop with a pending request and this call. @return whether the daemon stayed */

@@ -17,6 +17,7 @@
 #include <string>
 #include <thread>
 
+#include "run_until.h"
 #include "temp_dir.h"
 
 namespace {
@@ -117,8 +118,7 @@ void take_a_free_turn() {
   struct stat status {};
   check(stat((folder / "lock").c_str(), &status) == 0 && (status.st_mode & 07777) == 0600,
         "the lock is the owner's alone");
-  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-  }
+  run_pending();
   check(!turn_told, "a turn that is there is not told of");
   end_quarn_turn();
   check(access(lock.c_str(), F_OK) != 0, "the lock is removed, and its folder");

@@ -14,6 +14,7 @@
 #include "quarn_d_utils/archive.h"
 #include "quarn_d_utils/bounds.h"
 #include "temp_dir.h"
+#include "this_process.h"
 
 // A sanitizer's own memory is many times what it watches.
 #if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
@@ -24,15 +25,7 @@ using ::testing::NiceMock;
 
 constexpr char kPackage[] = "org.example.notes";
 
-long peak_kilobytes() {
-  std::ifstream status("/proc/self/status");
-  std::string word;
-  long value = 0;
-  while (status >> word) {
-    if (word == "VmHWM:") status >> value;
-  }
-  return value;
-}
+long peak_kilobytes() { return static_cast<long>(peak_resident_bytes() / 1024); }
 
 /** By how much the peak grows with @p work, in a process of its own. Kilobytes. */
 long growth(const std::function<bool()> &work) {

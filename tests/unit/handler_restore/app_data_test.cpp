@@ -21,6 +21,7 @@
 #include "quarn_d_utils/package_lock.h"
 #include "quarn_d_utils/path_rules.h"
 #include "quarn_d_utils/power.h"
+#include "this_process.h"
 
 using ::testing::_;
 using ::testing::Return;
@@ -355,7 +356,7 @@ TEST_F(AppDataTest, ARestoreInTheCompanionsModeLetsOthersBeServedWhileItsPackage
   go.set_value();
   packing.join();
   EXPECT_TRUE(in_time) << "the main loop stood still";
-  while (outside.answers.empty()) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return !outside.answers.empty(); }));
   EXPECT_EQ(outside.answers, restored(31));
 }
 
@@ -365,13 +366,13 @@ TEST_F(AppDataTest, TwoRestoresOfOnePackageAreAnsweredInTheirOrder) {
   run_on_fiber([this] { quarnd_restore_app_data(kPkg, make_record(2)); });
   make_archive(download(), new_data, "not json");
   answer();
-  run_main_context();
+  run_pending();
   ASSERT_EQ(outside.answers.size(), 1U) << "its own event has come";
   EXPECT_EQ(outside.answers[0].req_id, 1U);
   EXPECT_EQ(outside.answers[0].err, 36);
   write_text(download(), "not an archive");
   answer();
-  run_main_context();
+  run_pending();
   ASSERT_EQ(outside.answers.size(), 2U);
   EXPECT_EQ(outside.answers[1].req_id, 2U);
   EXPECT_EQ(outside.answers[1].err, 31);
@@ -420,7 +421,7 @@ class Withdrawn : public BothRequests {
     } else {
       answer_with_archive(newly_installed);
     }
-    run_main_context();
+    run_pending();
   }
   void answer_with_archive(bool newly_installed = true) {
     if (newly_installed) clear_app_dir(kPkg, root.c_str());
@@ -440,7 +441,7 @@ TEST_P(Withdrawn, WhileTheSessionStarts) {
   EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
   EXPECT_EQ(quarnd_cancel_own(kOwn), 0U);
   EXPECT_TRUE(outside.answers.empty()) << "the caller has its reply first";
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, answered(17));
   EXPECT_EQ(replies, std::vector<int>{0});
   expect_no_transfer();
@@ -452,7 +453,7 @@ TEST_P(Withdrawn, WhileItsTransferRuns) {
   start_on_fiber(kOwn, 7);
   ASSERT_TRUE(transfers());
   EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, answered(17));
   EXPECT_EQ(replies, std::vector<int>{0});
   let_it_end(false);
@@ -471,17 +472,17 @@ TEST_P(Withdrawn, ItsTransferEndsAndAnothersGoesOn) {
   ASSERT_TRUE(transfers());
   void *const own = uploads.empty() ? downloads[0].user_data : uploads[0].user_data;
   EXPECT_EQ(quarnd_cancel_own(kOther), 0U);
-  run_main_context();
+  run_pending();
   EXPECT_TRUE(aborted.empty());
   EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(aborted, std::vector<void *>{own});
   if (uploads.empty()) {
     answer(BACKUP_TRANS_ERROR_CANCELLED);
   } else {
     answer_upload(BACKUP_TRANS_ERROR_CANCELLED);
   }
-  run_main_context();
+  run_pending();
   EXPECT_FALSE(transfers()) << "it is not begun again";
   EXPECT_TRUE(is_idle_status());
 }
@@ -490,7 +491,7 @@ TEST_P(Withdrawn, WhileItWaitsForAnothersRequest) {
   start_on_fiber(kOther, 8);
   start_on_fiber(kOwn, 7);
   EXPECT_EQ(quarnd_cancel_own(kOwn), 1U);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, answered(17));
   let_it_end();
   ASSERT_EQ(outside.answers.size(), 2U);
@@ -508,7 +509,7 @@ TEST_P(Withdrawn, WhatHasEndedIsNot) {
     answer_upload();
   }
   EXPECT_EQ(quarnd_cancel_own(kOwn), 0U) << "it is about to be told of its success";
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, answered(0));
 }
 
@@ -516,7 +517,7 @@ TEST_P(Withdrawn, AllOfOneClient) {
   for (unsigned int request = 1; request <= 3; ++request) start_on_fiber(kOwn, request);
   start_on_fiber(kOther, 8);
   EXPECT_EQ(quarnd_cancel_own(kOwn), 3U);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers.size(), 3U);
   for (const auto &told : outside.answers) EXPECT_EQ(told.err, 17);
   while (transfers()) let_it_end();
@@ -764,21 +765,16 @@ TEST_F(ExportTest, ASecondRequestIsServedInsideTheFirst) {
   expect_exported();
 }
 
-std::ptrdiff_t threads_of_process() {
-  return std::distance(std::filesystem::directory_iterator("/proc/self/task"),
-                       std::filesystem::directory_iterator());
-}
-
 TEST_F(ExportTest, AnyNumberOfThemTakesOneThreadAndAllAreAnswered) {
   constexpr std::size_t kMany = 64;
   hold_packing();
   std::vector<int> results;
-  const std::ptrdiff_t before = threads_of_process();
+  const int before = threads_in_use();
   for (std::size_t i = 0; i < kMany; ++i) run_on_fiber([&] { results.push_back(make()); });
-  EXPECT_LE(threads_of_process(), before + 1);
+  EXPECT_LE(threads_in_use(), before + 1);
   EXPECT_FALSE(is_idle_status());
   go = true;
-  while (results.size() < kMany) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return results.size() >= kMany; }));
   EXPECT_EQ(results, std::vector<int>(kMany, 0));
   expect_exported();
   EXPECT_TRUE(is_idle_status());
@@ -797,7 +793,7 @@ TEST_F(ExportTest, WhoAsksAgainAndAgainIsNotServedBeforeWhoAsksOnce) {
   ask(kClient + 1);
   ask(kClient + 2);
   go = true;
-  while (served.size() < 5) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return served.size() >= 5; }));
   EXPECT_EQ(served,
             (std::vector<unsigned int>{kClient, kClient + 1, kClient + 2, kClient, kClient}));
 }
@@ -813,10 +809,10 @@ TEST_F(ExportTest, OneThatWaitsForAnotherIsWithdrawnAtOnce) {
   });
   run_on_fiber([&] { results[2] = make(); });
   EXPECT_TRUE(withdraw_waits(second));
-  while (results[1] == -1) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return results[1] != -1; }));
   EXPECT_EQ(results, (std::vector<int>{-1, 17, -1})) << "nothing of the others' is waited for";
   go = true;
-  while (results[2] == -1) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return results[2] != -1; }));
   EXPECT_EQ(results, (std::vector<int>{0, 17, 0}));
 }
 
@@ -889,7 +885,7 @@ TEST_F(ExportTest, AWithdrawnExportLeavesNothing) {
   });
   EXPECT_TRUE(withdraw_waits(own));
   go = true;
-  while (result == -1) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return result != -1; }));
   EXPECT_EQ(result, 17);
   EXPECT_FALSE(exists(kTarget));
   EXPECT_EQ(staging_directories(), before);

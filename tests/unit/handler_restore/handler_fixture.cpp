@@ -93,7 +93,7 @@ HandlerTest::HandlerTest() {
 HandlerTest::~HandlerTest() {
   quarnd_restore_enable(0, 0, "", "", nullptr);
   while (!uploads.empty()) answer_upload(BACKUP_TRANS_ERROR_CANCELLED);
-  run_main_context();
+  run_pending();
 }
 
 void HandlerTest::later(std::function<void()> action) {

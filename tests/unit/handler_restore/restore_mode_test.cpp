@@ -303,7 +303,7 @@ TEST_F(RestoreModeTest, TheKeptClientIsToldThatTheModeIsOver) {
   EXPECT_EQ(on(0), 0);
   EXPECT_EQ(off(), 0);
   EXPECT_TRUE(outside.answers.empty()) << "not before the reply to the one who switches off";
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(1)});
   EXPECT_EQ(g_restore_cb_data, nullptr);
 }
@@ -311,24 +311,24 @@ TEST_F(RestoreModeTest, TheKeptClientIsToldThatTheModeIsOver) {
 TEST_F(RestoreModeTest, SwitchingOnAgainEndsTheEarlierClientsMessages) {
   EXPECT_EQ(on(0, kSerial, kList, 1), 0);
   EXPECT_EQ(on(0, kSerial, kList, 2), 0);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(1)});
   EXPECT_EQ(off(), 0);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, (Answers{stop(1), stop(2)}));
 }
 
 TEST_F(RestoreModeTest, TheCompanionsModeEndsTheCloudClientsMessages) {
   EXPECT_EQ(on(0, kSerial, kList, 1), 0);
   EXPECT_EQ(on(1, "", kList, 2), 0);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(1)});
 }
 
 TEST_F(RestoreModeTest, ARequestThatIsReplacedWhileItWaitsHasItsEndAsWell) {
   session.meanwhile = [&] { EXPECT_EQ(off(), 0); };
   EXPECT_EQ(on(0, kSerial, kList, 1), 0);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(1)});
 }
 
@@ -339,7 +339,7 @@ TEST_F(RestoreModeTest, ItsClientMayWithdrawTheModeAndNobodyElse) {
   EXPECT_EQ(quarnd_cancel_own(":1.7"), 1U);
   EXPECT_EQ(cloud_restore_running(), 0);
   EXPECT_EQ(quarnd_cancel_own(":1.7"), 0U);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 1}}));
 }
 
@@ -355,7 +355,7 @@ TEST_F(RestoreModeTest, AWithdrawnRequestDoesNotSwitchTheModeOn) {
     };
     reply = on(0, kSerial, kList, 1);
   });
-  run_main_context();
+  run_pending();
   EXPECT_EQ(reply, 17);
   EXPECT_EQ(cloud_restore_running(), 0);
   EXPECT_TRUE(pkg_list_to_be_restored.empty());
@@ -382,7 +382,7 @@ TEST_F(RestoreModeTestWithMark, NorIsOneThatWasWithdrawnWhileTheSessionStarted) 
     };
     EXPECT_EQ(on(0), 17);
   });
-  run_main_context();
+  run_pending();
   expect_unused();
 }
 
@@ -397,13 +397,13 @@ TEST_F(RestoreModeTestWithMark, NorIsOneInWhosePlaceAnotherCame) {
   EXPECT_EQ(on(0, "350000000000002"), 0);
   expect_unused();
   off();
-  run_main_context();
+  run_pending();
 }
 
 TEST_F(RestoreModeTest, AListThatRunsEmptyEndsTheMode) {
   EXPECT_EQ(on(0, kSerial, R"(["org.example.notes"])"), 0);
   EXPECT_EQ(package_to_be_restored(kPkg), 1);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(1)});
   EXPECT_EQ(cloud_restore_running(), 0);
 }

@@ -47,8 +47,7 @@ class DeviceTest : public ::testing::Test {
     ASSERT_TRUE(embedded::write_state_text(device(), "last.ini", "[last]\n", 0644));
     ASSERT_TRUE(run_until([&seen] { return seen; }));
     // Watches are served in the order of their events, but maybe in the same round.
-    while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
-    }
+    run_pending();
   }
 
   TempDir dir_;

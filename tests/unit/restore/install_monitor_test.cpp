@@ -263,7 +263,7 @@ TEST_F(MonitorTest, AnEventOnAnEmptyListSchedulesTheEnd) {
   pkg_list_to_be_restored.clear();
   install();
   EXPECT_EQ(disabled(), 0);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(disabled(), 1);
   expect_info("installation of all restore candidate package was completed!");
 }
@@ -271,7 +271,7 @@ TEST_F(MonitorTest, AnEventOnAnEmptyListSchedulesTheEnd) {
 TEST_F(MonitorTest, TheLastCandidateSchedulesTheEnd) {
   pkg_list_to_be_restored = {kPkg};
   EXPECT_EQ(package_to_be_restored(kPkg), 1);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(disabled(), 1);
 }
 
@@ -279,14 +279,14 @@ TEST_F(MonitorTest, AListThatWasGivenMeanwhileIsNotEnded) {
   pkg_list_to_be_restored = {kPkg};
   EXPECT_EQ(package_to_be_restored(kPkg), 1);
   pkg_list_to_be_restored = {"org.example.next"};
-  run_main_context();
+  run_pending();
   EXPECT_EQ(disabled(), 0);
 }
 
 TEST_F(MonitorTest, AnEndOfAModeThatIsOffIsHarmless) {
   pkg_list_to_be_restored.clear();
   EXPECT_EQ(package_to_be_restored(kPkg), 0);
-  run_main_context();
+  run_pending();
   expect_info("installation of all restore candidate package was completed!");
 }
 
@@ -461,10 +461,10 @@ TEST_F(MonitorTest, RestoresOfTheModeAreFinishedBeforeItsClientIsToldOfTheEnd) {
   keep_restore_record(owned_record(5));
   pkg_list_to_be_restored = {kPkg};
   install();
-  run_main_context();
+  run_pending();
   EXPECT_TRUE(outside.answers.empty());
   answer(BACKUP_TRANS_ERROR_NETWORK);
-  run_main_context();
+  run_pending();
   ASSERT_EQ(outside.answers.size(), 1U);
   EXPECT_EQ(outside.answers[0].msg, "restore_stop");
 }
@@ -474,7 +474,7 @@ TEST_F(MonitorTest, TheClientIsToldOfTheEndBeforeTheDaemonEndsItself) {
   pkg_list_to_be_restored = {kPkg};
   install();
   answer(BACKUP_TRANS_ERROR_NETWORK);  // before the main loop came to the end of the mode
-  while (outside.terminations.empty()) g_main_context_iteration(nullptr, FALSE);
+  ASSERT_TRUE(run_until([&] { return !outside.terminations.empty(); }));
   ASSERT_EQ(outside.answers.size(), 1U);
   EXPECT_EQ(outside.answers[0].msg, "restore_stop");
 }

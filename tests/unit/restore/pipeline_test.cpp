@@ -217,14 +217,14 @@ TEST_F(PipelineTest, TheLastCallbackSchedulesTerminationWhenNoCandidateIsLeft) {
   auto ctx = waiting_context();
   ASSERT_EQ(restore(ctx.get()), 0);
   answer(BACKUP_TRANS_ERROR_NETWORK);
-  run_main_context();
+  run_pending();
   EXPECT_TRUE(outside.terminations.empty());
 
   pkg_list_to_be_restored.clear();
   ASSERT_EQ(restore(ctx.get()), 0);
   answer(BACKUP_TRANS_ERROR_NETWORK);
   EXPECT_TRUE(outside.terminations.empty()) << "from the main loop, not from the callback";
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.terminations, (std::vector<std::pair<double, bool>>{{0.0, false}}));
 }
 
@@ -447,7 +447,7 @@ TEST_F(PipelineTest, TheMainLoopGoesOnWhileThePackageIsPacked) {
   EXPECT_TRUE(downloads.empty()) << "the first uses the files still";
   go.set_value();
   packing.join();
-  while (ctx->pending != 0) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return ctx->pending == 0; }));
   EXPECT_EQ(ctx->result, 0);
   EXPECT_EQ(read_text(at("data/settings.ini")), "new settings");
   answer(BACKUP_TRANS_ERROR_NETWORK);
@@ -463,7 +463,7 @@ TEST_F(PipelineTest, ARestoreThatIsAbandonedWhileItsPackageIsPackedChangesNothin
   auto lock = std::make_unique<PackageDataLock>(kPkg, PackageUse::kPack);
   answer();
   abandon_restore(std::move(ctx));
-  while (!is_idle_status()) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return is_idle_status(); }));
   lock.reset();
   EXPECT_EQ(tree_of(root), before);
 }

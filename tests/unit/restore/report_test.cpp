@@ -14,17 +14,17 @@ TEST_F(ReportTest, TheKeptClientIsToldOfTheEndFromTheMainLoop) {
   keep_restore_record(owned_record(3));
   end_restore_report();
   EXPECT_TRUE(outside.answers.empty());
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(3)});
   EXPECT_EQ(g_restore_cb_data, nullptr);
   end_restore_report();
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers.size(), 1U);
 }
 
 TEST_F(ReportTest, WithoutAKeptClientNobodyIsTold) {
   end_restore_report();
-  run_main_context();
+  run_pending();
   EXPECT_TRUE(outside.answers.empty());
 }
 
@@ -33,12 +33,12 @@ TEST_F(ReportTest, TheEndWaitsForTheRestoresThatAreUnderWay) {
   count_outstanding_restore(1);
   count_outstanding_restore(1);
   end_restore_report();
-  run_main_context();
+  run_pending();
   count_outstanding_restore(-1);
-  run_main_context();
+  run_pending();
   EXPECT_TRUE(outside.answers.empty());
   count_outstanding_restore(-1);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(3)});
 }
 
@@ -47,11 +47,11 @@ TEST_F(ReportTest, AnEarlierRecordHasItsEndWhenALaterOneReplacesIt) {
   keep_restore_record(owned_record(4));
   EXPECT_TRUE(outside.answers.empty()) << "not inside the call";
   EXPECT_TRUE(restore_report_pending());
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(3)});
   EXPECT_FALSE(restore_report_pending());
   end_restore_report();
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, (Answers{stop(3), stop(4)}));
 }
 
@@ -66,7 +66,7 @@ TEST_F(ReportTest, AWithdrawnModeEndsWithItsReason) {
   EXPECT_FALSE(restore_record_is_of(":1.7"));
   keep_restore_record(owned_record(4));
   end_restore_report();
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, (Answers{{"restore_enable_cb", 17, "restore_stop", 3}, stop(4)}))
       << "the reason is of that one alone";
 }
@@ -76,10 +76,10 @@ TEST_F(ReportTest, AClientWhoseModeIsOverGetsItsEndBeforeItIsReplaced) {
   count_outstanding_restore(1);
   end_restore_report();
   keep_restore_record(owned_record(4));
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers, Answers{stop(3)});
   count_outstanding_restore(-1);
-  run_main_context();
+  run_pending();
   EXPECT_EQ(outside.answers.size(), 1U) << "the second client's mode goes on";
 }
 

@@ -159,11 +159,6 @@ std::unique_ptr<client_cb_data> owned_record(unsigned int req_id) {
   return std::unique_ptr<client_cb_data>(static_cast<client_cb_data *>(make_record(req_id)));
 }
 
-void run_main_context() {
-  while (g_main_context_iteration(nullptr, FALSE)) {
-  }
-}
-
 std::string label_of(const std::string &path) {
   char *label = nullptr;
   if (get_label(path.c_str(), &label, false) != 0) return "?";
@@ -350,7 +345,7 @@ RestoreTest::~RestoreTest() {
   set_restore_progress_sink(nullptr);
   while (!downloads.empty()) answer(BACKUP_TRANS_ERROR_CANCELLED);
   end_restore_report();
-  run_main_context();
+  run_pending();
   EXPECT_EQ(transactions, 0) << "a transaction was left open";
 }
 

@@ -28,6 +28,7 @@
 #include "quarn_d_restore/restore_mode.h"
 #include "quarn_d_restore/restore_progress.h"
 #include "quarn_dbus_client.h"
+#include "run_until.h"
 #include "temp_dir.h"
 
 /** The label of what nobody labelled. */
@@ -75,9 +76,6 @@ extern Outside outside;
 void *make_record(unsigned int req_id, const std::string &sender = ":1.7");
 /** The same, for what takes it as its own. */
 std::unique_ptr<client_cb_data> owned_record(unsigned int req_id);
-
-/** Run everything that is ready on the main context. */
-void run_main_context();
 
 class RestoreTest : public ::testing::Test {
  protected:

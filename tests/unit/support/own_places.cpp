@@ -14,7 +14,7 @@
 
 namespace {
 
-constexpr const char *kPlaces[] = {"/tmp", "/opt"};
+constexpr const char *kPlaces[] = {"/tmp", "/opt", "/dev/shm"};
 constexpr char kAlreadyThere[] = "QUARN_TEST_OWN_PLACES";
 constexpr char kLock[] = "/tmp/quarn-unit-tests.lock";
 

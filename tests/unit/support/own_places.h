@@ -1,9 +1,10 @@
 /**
  * @file own_places.h
- * @brief /tmp and /opt that only this process and its children see.
+ * @brief /tmp, /opt and /dev/shm that only this process and its children see.
  *
  * The daemon's staging directory, the archives it exports and the companion's package have fixed
- * names there, so two test programs would meet in them.
+ * names in the first two, so two test programs would meet in them; in the last they would share the
+ * room, and leave what a killed one had there.
  */
 #ifndef OWN_PLACES_H
 #define OWN_PLACES_H

@@ -15,3 +15,8 @@ bool run_until(const std::function<bool()> &done, std::chrono::milliseconds pati
   g_source_remove(ticker);
   return met;
 }
+
+void run_pending() {
+  while (g_main_context_iteration(nullptr, FALSE) != FALSE) {
+  }
+}

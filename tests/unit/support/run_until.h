@@ -1,6 +1,6 @@
 /**
  * @file run_until.h
- * @brief Waiting on the main loop for what a test is about.
+ * @brief Running the main loop: until what a test is about has come, or as long as there is work.
  */
 #ifndef RUN_UNTIL_H
 #define RUN_UNTIL_H
@@ -15,5 +15,9 @@
  */
 bool run_until(const std::function<bool()> &done,
                std::chrono::milliseconds patience = std::chrono::seconds(30));
+
+/** Run what is ready in the default main context, and what becomes ready by that; wait for nothing.
+ */
+void run_pending();
 
 #endif

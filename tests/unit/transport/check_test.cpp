@@ -305,7 +305,7 @@ TEST_F(CheckRequestTest, WhatWasAcceptedBeforeAFailureDoesNotMakeItForgotten) {
   EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_SPACE);
   store->outcomes["list"] = success();
   go_on.set_value();
-  while (answered == 0) g_main_context_iteration(nullptr, TRUE);
+  ASSERT_TRUE(run_until([&] { return answered != 0; }));
   EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_SPACE) << "it began before the failure";
   check();
   EXPECT_EQ(backup_trans_last_cause(), BACKUP_TRANS_CAUSE_NONE);

@@ -6,6 +6,7 @@
 #include "fault_world.h"
 #include "network_kinds.h"
 #include "session/session.h"
+#include "this_process.h"
 
 using namespace harness;
 using front::Fault;
@@ -22,17 +23,6 @@ struct Case {
 };
 
 std::ostream &operator<<(std::ostream &out, const Case &one) { return out << one.name; }
-
-std::size_t peak_bytes() {
-  std::ifstream file("/proc/self/status");
-  for (std::string word; file >> word;) {
-    if (word != "VmHWM:") continue;
-    std::size_t kilobytes = 0;
-    file >> kilobytes;
-    return kilobytes * 1024;
-  }
-  return 0;
-}
 
 class Limits : public ::testing::TestWithParam<Case> {
  protected:
@@ -99,14 +89,14 @@ TEST_P(Limits, ALargerOneIsRefusedOnceAndForAll) {
 
 TEST_P(Limits, ABodyWithoutAnEndIsCutOffAndKeptNowhere) {
   have(10);
-  const std::size_t before = peak_bytes();
+  const std::size_t before = peak_resident_bytes();
   spoil(Spoil::endless, std::numeric_limits<std::size_t>::max(), [](front::Response *response) {
     response->headers["Transfer-Encoding"] = "chunked";
     response->body = "fffffffffffffff\r\nx";
   });
   EXPECT_EQ(get()->message, kTooLarge);
   EXPECT_EQ(read_file(local_), "before");
-  EXPECT_LT(peak_bytes(), before + (8U << 20));
+  EXPECT_LT(peak_resident_bytes(), before + (8U << 20));
 }
 
 TEST_P(Limits, ALengthThatIsToldIsNotWaitedFor) {
