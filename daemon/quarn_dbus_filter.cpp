@@ -4,7 +4,6 @@
 #include <malloc.h>
 
 #include <algorithm>
-#include <atomic>
 #include <iterator>
 #include <memory>
 #include <string>
@@ -23,6 +22,7 @@
 #include "quarn_dbus_forward.h"
 #include "quarn_dbus_limits.h"
 #include "quarn_dbus_method_call.h"
+#include "thread_annotations.h"
 
 namespace {
 
@@ -35,8 +35,9 @@ struct Passed {
   ConnectionPtr connection;
   MessagePtr message;
   quarn_call_form form;
-  std::atomic<bool> complete{false}; /**< hands all of it to the main thread */
 };
+/** Held to write what is passed on and to take it: the lock is what orders the two threads. */
+Mutex passing_mutex;
 using PassedPtr = std::shared_ptr<Passed>;
 
 std::string type_text(const char *signature) { return std::string("(") + signature + ")"; }
@@ -62,8 +63,11 @@ void serve_raw(RawCall &call, const Passed &passed) {
 }
 
 gboolean on_passed(gpointer data) {
-  const PassedPtr passed = *static_cast<const PassedPtr *>(data);
-  if (!passed->complete.load(std::memory_order_acquire)) return G_SOURCE_REMOVE;
+  PassedPtr passed;
+  {
+    const MutexLock lock(passing_mutex);
+    passed = *static_cast<const PassedPtr *>(data);
+  }
   GDBusConnection *const connection = passed->connection.get();
   const char *const sender = g_dbus_message_get_sender(passed->message.get());
   with_caller(connection, sender == nullptr ? "" : sender, [passed](const quarn_caller &caller) {
@@ -77,12 +81,15 @@ void delete_passed(gpointer data) { delete static_cast<PassedPtr *>(data); }
 
 /** Takes @p message. */
 void pass_to_main_thread(GDBusConnection *connection, MessagePtr message, quarn_call_form form) {
-  auto passed = std::make_unique<PassedPtr>(std::make_shared<Passed>());
-  Passed &filled = **passed;
-  filled.connection.reset(G_DBUS_CONNECTION(g_object_ref(connection)));
-  filled.message = std::move(message);
-  filled.form = form;
-  filled.complete.store(true, std::memory_order_release);
+  std::unique_ptr<PassedPtr> passed;
+  {
+    const MutexLock lock(passing_mutex);
+    passed = std::make_unique<PassedPtr>(std::make_shared<Passed>());
+    Passed &filled = **passed;
+    filled.connection.reset(G_DBUS_CONNECTION(g_object_ref(connection)));
+    filled.message = std::move(message);
+    filled.form = form;
+  }
   // The priority of GDBus' own calls, so that all keep the order in which they came.
   g_idle_add_full(G_PRIORITY_DEFAULT, on_passed, passed.release(), delete_passed);
 }
